@@ -1,0 +1,83 @@
+@0xe2d94b8f61a0c704;
+
+# What fileproviderd serves on its control socket, by item: to the command line and the files browser.
+#
+# Everything here goes through the extension. While no extension can be had (zarn is down, nobody is
+# signed in) calls fail with a domain error within a bounded time; none hangs.
+
+using Cxx = import "/capnp/c++.capnp";
+$Cxx.namespace("yomber::protocol");
+using Common = import "common.capnp";
+
+interface Control {
+  item @0 (identifier :Text) -> (result :ItemResult);
+  locate @1 (identifier :Text) -> (result :LocationResult);
+  # The location of an item, aliases resolved.
+  identify @2 (path :Data) -> (result :IdentifierResult);
+
+  list @3 (container :Text, sortOrder :Common.SortOrder) -> (listing :Listing);
+  # The root, a folder, or all folders (the framework's constants).
+
+  watch @4 (container :Text, watcher :Watcher) -> (registration :Watch);
+  # A folder, the root or the working set. The watcher gets the present items first, then each change.
+
+  status @5 () -> (status :Status);
+
+  struct ItemResult {
+    union {
+      item @0 :Common.Item;
+      error @1 :Common.Error;
+    }
+  }
+  struct LocationResult {
+    union {
+      path @0 :Data;
+      error @1 :Common.Error;
+    }
+  }
+  struct IdentifierResult {
+    union {
+      identifier @0 :Text;
+      error @1 :Common.Error;
+    }
+  }
+  struct Status {
+    extensionPid @0 :UInt32;         # 0 while there is none
+    extensionStarts @1 :UInt64;
+    daemonReachable @2 :Bool;
+    watches @3 :UInt32;
+    enumerators @4 :UInt32;
+    residentBytes @5 :UInt64;
+    openDescriptors @6 :UInt32;
+    lastFailure @7 :Common.OptionalError;   # why there is no extension
+  }
+}
+
+interface Listing {
+  # A listing in progress: pages of at most 200 items. Dropping it ends it.
+  next @0 () -> (result :PageResult);
+
+  struct PageResult {
+    union {
+      page :group {
+        items @0 :List(Common.Item);
+        more @1 :Bool;
+      }
+      error @2 :Common.Error;
+    }
+  }
+}
+
+interface Watch {}
+
+interface Watcher {
+  # The host sends one call after the other, each when the last was answered.
+
+  didList @0 (items :List(Common.Item), last :Bool) -> ();
+  # The folder as it is, in pages; `last` on the last one. Sent at the start, and never again.
+  didUpdate @1 (items :List(Common.Item)) -> ();
+  didDelete @2 (identifiers :List(Text)) -> ();
+  didPause @3 (error :Common.Error) -> ();
+  # Changes cannot be seen at the moment; the host goes on trying, and sends what was missed.
+  didResume @4 () -> ();
+}

@@ -1,0 +1,36 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+namespace yomber {
+
+/// The client library's error domain. Code 2 is the one that the framework acts on.
+inline constexpr const char* QSOstrellErrorDomain = "QSOstrellErrorDomain";
+inline constexpr std::int64_t QSOstrellErrorNotEntitled = 1;
+inline constexpr std::int64_t QSOstrellErrorLoggedOut = 2;
+inline constexpr std::int64_t QSOstrellErrorInvalidParameter = 3;
+/// The connection to the daemon was lost; what was registered there is gone.
+inline constexpr std::int64_t QSOstrellErrorConnectionLost = 4;
+/// A watcher left too many changes waiting and was cut off; list again.
+inline constexpr std::int64_t QSOstrellErrorWatcherTooSlow = 5;
+
+/// User-information keys of QSOstrellErrorInvalidParameter.
+inline constexpr const char* QSOstrellErrorParameterKey = "QSOstrellErrorParameter";
+inline constexpr const char* QSOstrellErrorValueKey = "QSOstrellErrorValue";
+
+/// Containers that every drive has. The default container's documents location is the drive's root.
+inline const std::string QSUbiquitousDefaultContainerID = "com.kelvo.YomberDrive";
+inline const std::string QSUbiquitousDocumentsContainerID = "com.kelvo.YomberDrive.Documents";
+inline const std::string QSUbiquitousDesktopContainerID = "com.kelvo.YomberDrive.Desktop";
+
+/// Names of the ordinary folders in the root that those two containers stand for.
+inline const std::string QSUbiquitousDocumentsFolderName = "Documents";
+inline const std::string QSUbiquitousDesktopFolderName = "Desktop";
+
+/// Posted after the account changed; observers ask QSAccount afresh.
+inline const std::string QSAccountTokenDidChangeNotification = "QSAccountTokenDidChangeNotification";
+/// Posted after the list of containers changed.
+inline const std::string QSContainerListDidChangeNotification = "QSContainerListDidChangeNotification";
+
+}  // namespace yomber

@@ -1,0 +1,68 @@
+# Language, warnings, sanitizers and the compiler cache, for every target of the repository.
+
+set(CMAKE_CXX_STANDARD 23)
+set(CMAKE_CXX_STANDARD_REQUIRED ON)
+set(CMAKE_CXX_EXTENSIONS OFF)
+set(CMAKE_POSITION_INDEPENDENT_CODE ON)
+set(CMAKE_RUNTIME_OUTPUT_DIRECTORY "${CMAKE_BINARY_DIR}/bin")
+
+if(NOT CMAKE_BUILD_TYPE)
+  set(CMAKE_BUILD_TYPE RelWithDebInfo CACHE STRING "Build type" FORCE)
+endif()
+
+# Assertions stay on in every build: they are cheap, and Debian's libkj is built with them too.
+set(CMAKE_CXX_FLAGS_RELWITHDEBINFO "-O2 -g1")
+set(CMAKE_C_FLAGS_RELWITHDEBINFO "-O2 -g1")
+set(CMAKE_CXX_FLAGS_DEBUG "-O0 -g -D_GLIBCXX_ASSERTIONS")
+
+set(YOMBER_SANITIZE "" CACHE STRING "Sanitizer: empty, address (with undefined), thread or fuzzer")
+set_property(CACHE YOMBER_SANITIZE PROPERTY STRINGS "" address thread fuzzer)
+
+find_program(YOMBER_CCACHE ccache)
+if(YOMBER_CCACHE)
+  # Precompiled headers are only cacheable with these two liberties.
+  set(launcher "${CMAKE_COMMAND};-E;env;CCACHE_SLOPPINESS=pch_defines,time_macros;${YOMBER_CCACHE}")
+  set(CMAKE_C_COMPILER_LAUNCHER "${launcher}")
+  set(CMAKE_CXX_COMPILER_LAUNCHER "${launcher}")
+  if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    add_compile_options($<$<COMPILE_LANGUAGE:CXX>:-fpch-preprocess>)
+  endif()
+endif()
+
+set(YOMBER_WARNINGS
+  -Wall -Wextra -Wpedantic -Werror
+  -Wshadow -Wconversion -Wold-style-cast -Wcast-qual -Wcast-align
+  -Wnon-virtual-dtor -Woverloaded-virtual -Wextra-semi -Wundef -Wformat=2)
+if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+  # -Wrestrict: gcc 12 reports std::string concatenation in its own headers.
+  list(APPEND YOMBER_WARNINGS -Wduplicated-cond -Wlogical-op -Wno-restrict)
+else()
+  # Clang counts implicit sign changes as conversions where gcc does not.
+  list(APPEND YOMBER_WARNINGS -Wno-sign-conversion -Wno-implicit-int-float-conversion
+    -Wthread-safety -Wno-gnu-zero-variadic-macro-arguments)
+endif()
+
+if(YOMBER_SANITIZE STREQUAL "address")
+  set(sanitizer -fsanitize=address,undefined -fno-sanitize-recover=all)
+elseif(YOMBER_SANITIZE STREQUAL "thread")
+  set(sanitizer -fsanitize=thread)
+elseif(YOMBER_SANITIZE STREQUAL "fuzzer")
+  set(sanitizer -fsanitize=fuzzer-no-link,address,undefined -fno-sanitize-recover=all)
+elseif(YOMBER_SANITIZE)
+  message(FATAL_ERROR "YOMBER_SANITIZE is '${YOMBER_SANITIZE}': use address, thread or fuzzer")
+endif()
+if(YOMBER_SANITIZE)
+  # -O1 keeps the reports readable and the builds short.
+  set(CMAKE_CXX_FLAGS_RELWITHDEBINFO "-O1 -g1 -fno-omit-frame-pointer")
+  add_compile_options(${sanitizer})
+  add_link_options(${sanitizer})
+  # The instrumentation itself makes gcc see uninitialised uses that are not there.
+  if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    list(APPEND YOMBER_WARNINGS -Wno-maybe-uninitialized)
+  endif()
+endif()
+
+# Every first-party target links this; third-party and generated headers come in as SYSTEM.
+add_library(yomber_options INTERFACE)
+target_compile_options(yomber_options INTERFACE $<$<COMPILE_LANGUAGE:CXX>:${YOMBER_WARNINGS}>)
+target_include_directories(yomber_options INTERFACE "${CMAKE_SOURCE_DIR}")

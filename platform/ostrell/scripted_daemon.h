@@ -14,11 +14,11 @@
 
 namespace yomber {
 
-/// A daemon for tests: it speaks the daemon's protocol on the daemon's socket of a temporary home, and
-/// answers what the test tells it to.
+/// A daemon for tests: it speaks the daemon's protocol on the daemon's socket of a temporary home,
+/// and answers what the test tells it to.
 ///
-/// While one lives it is the daemon of this process's default connection; the library starts out with
-/// no connection and empty caches, and does so again when it is destroyed. One at a time.
+/// While one lives it is the daemon of this process's default connection; the library starts out
+/// with no connection and empty caches, and does so again when it is destroyed. One at a time.
 ///
 /// Thread-safety: every operation may be called on any thread but the loop thread, unless it says
 /// otherwise. Those called `wait…` end after ten seconds at the latest and answer false then.
@@ -60,8 +60,8 @@ class ScriptedDaemon {
     std::string iconName;
   };
 
-  /// What is answered. Called on the loop thread: they may not block (see `hold`) and may not call the
-  /// daemon. Those left alone answer from what `addItem` and `addContainer` put in.
+  /// What is answered. Called on the loop thread: they may not block (see `hold`) and may not call
+  /// the daemon. Those left alone answer from what `addItem` and `addContainer` put in.
   struct Answers {
     std::function<Location(const std::string& identifier)> urlForItemIdentifier;
     std::function<Location(const QSFileObjectID& object)> documentLocation;
@@ -69,21 +69,23 @@ class ScriptedDaemon {
     std::function<std::vector<Container>()> containers;
     std::function<Item(const std::string& containerID, bool forceScan)> containerItem;
     /// `folder` is nil for the root.
-    std::function<Page(const QSFileObjectIDRef& folder, std::uint8_t sortOrder, std::uint64_t offset,
-                       std::uint32_t limit)>
+    std::function<Page(const QSFileObjectIDRef& folder, std::uint8_t sortOrder,
+                       std::uint64_t offset, std::uint32_t limit)>
         enumerateItemsInFolder;
-    std::function<Page(std::uint8_t sortOrder, std::uint64_t offset, std::uint32_t limit)> enumerateAllFolders;
+    std::function<Page(std::uint8_t sortOrder, std::uint64_t offset, std::uint32_t limit)>
+        enumerateAllFolders;
     std::function<Rank()> currentNotifRank;
-    std::function<Changes(const std::optional<std::string>& token, std::uint32_t limit)> enumerateWorkingSetChanges;
+    std::function<Changes(const std::optional<std::string>& token, std::uint32_t limit)>
+        enumerateWorkingSetChanges;
     /// The failure of a subscription, nil to grant it.
     std::function<NSErrorRef()> getItemUpdateSender;
     std::function<NSErrorRef(const std::string& path, std::uint32_t options)> watchItem;
     std::function<Account()> account;
   };
 
-  /// A call that arrived: the method as the protocol names it, and its parameters in their order, as
-  /// text ("true", "200", "d:5"; the root folder and an absent token are "").
-  /// Of a sender's calls (boostPriority, watchItem, invalidate), the subscription's number comes first.
+  /// A call that arrived: the method as the protocol names it, and its parameters in their order,
+  /// as text ("true", "200", "d:5"; the root folder and an absent token are ""). Of a sender's
+  /// calls (boostPriority, watchItem, invalidate), the subscription's number comes first.
   struct Call {
     std::string method;
     std::vector<std::string> arguments;
@@ -91,8 +93,8 @@ class ScriptedDaemon {
   };
 
   /// Makes the home with the drive's folders in it, and serves. Somebody is signed in, as "someone"
-  /// with the per-application identifier "someone-here"; the default, Documents and Desktop containers
-  /// exist.
+  /// with the per-application identifier "someone-here"; the default, Documents and Desktop
+  /// containers exist.
   ScriptedDaemon();
   ~ScriptedDaemon();
   ScriptedDaemon(const ScriptedDaemon&) = delete;
@@ -104,8 +106,8 @@ class ScriptedDaemon {
 
   /// Changes the answers; takes effect for the calls that arrive later.
   void script(const std::function<void(Answers& answers)>& change);
-  /// Makes the item known, at that location, to the answers that were left alone. Replaces an item of
-  /// the same identifier. Makes no file.
+  /// Makes the item known, at that location, to the answers that were left alone. Replaces an item
+  /// of the same identifier. Makes no file.
   void addItem(const ItemFields& item, const std::string& path);
   void addContainer(const Container& container);
 
@@ -151,9 +153,11 @@ class ScriptedDaemon {
 };
 
 /// A document or folder for `ScriptedDaemon`, with the identifier that belongs to the raw id.
-[[nodiscard]] ItemFields scriptedDocument(std::uint64_t rawID, const std::string& filename,
-                                          const std::string& parentIdentifier = NSFileProviderRootContainerItemIdentifier);
-[[nodiscard]] ItemFields scriptedFolder(std::uint64_t rawID, const std::string& filename,
-                                        const std::string& parentIdentifier = NSFileProviderRootContainerItemIdentifier);
+[[nodiscard]] ItemFields scriptedDocument(
+    std::uint64_t rawID, const std::string& filename,
+    const std::string& parentIdentifier = NSFileProviderRootContainerItemIdentifier);
+[[nodiscard]] ItemFields scriptedFolder(
+    std::uint64_t rawID, const std::string& filename,
+    const std::string& parentIdentifier = NSFileProviderRootContainerItemIdentifier);
 
 }  // namespace yomber

@@ -1,0 +1,35 @@
+#include "yomber/command.h"
+
+#include <iostream>
+
+#include <nlohmann/json.hpp>
+
+#include "yomber/item_output.h"
+
+namespace yomber {
+
+DrivePaths CommandContext::paths() const {
+  return home.empty() ? DrivePaths::forDefaultHome() : DrivePaths::forHome(home);
+}
+
+void CommandContext::fail(const NSErrorRef& error) {
+  exitCode = exitCodeFor(error);
+  if (json) {
+    std::cerr << nlohmann::ordered_json{{"error", errorJson(error)}}.dump() << std::endl;
+    return;
+  }
+  std::cerr << "yomber: " << error->localizedDescription();
+  if (exitCode == ExitCode::NotSignedIn) std::cerr << " (sign in with 'yomber account sign-in NAME')";
+  std::cerr << std::endl;
+}
+
+void CommandContext::fail(ExitCode code, const std::string& message) {
+  exitCode = code;
+  if (json) {
+    std::cerr << nlohmann::ordered_json{{"error", {{"message", message}}}}.dump() << std::endl;
+  } else {
+    std::cerr << "yomber: " << message << std::endl;
+  }
+}
+
+}  // namespace yomber

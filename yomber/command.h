@@ -1,0 +1,34 @@
+#pragma once
+
+#include <string>
+
+#include <CLI/CLI.hpp>
+
+#include "platform/foundation/drive_paths.h"
+#include "platform/foundation/error.h"
+#include "yomber/exit_codes.h"
+
+namespace yomber {
+
+/// What every command of one run shares: the options given before the command, and the exit code.
+struct CommandContext {
+  std::string home;  ///< as given with --home; empty: the default home
+  bool json = false;
+  ExitCode exitCode = ExitCode::Ok;
+
+  [[nodiscard]] DrivePaths paths() const;
+  /// Prints the failure to standard error (as JSON when that was asked for) and keeps its exit code.
+  void fail(const NSErrorRef& error);
+  void fail(ExitCode code, const std::string& message);
+};
+
+// Each adds its commands to the application. The context outlives the application's run.
+void addDriveCommands(CLI::App& app, CommandContext& context);     // up, down, status
+void addAccountCommands(CLI::App& app, CommandContext& context);   // account …
+void addListingCommands(CLI::App& app, CommandContext& context);   // ls, folders
+void addItemCommands(CLI::App& app, CommandContext& context);      // stat, id, url
+void addWatchCommands(CLI::App& app, CommandContext& context);     // watch, working-set
+void addLogCommand(CLI::App& app, CommandContext& context);        // log
+void addCompletionCommand(CLI::App& app, CommandContext& context); // completion
+
+}  // namespace yomber

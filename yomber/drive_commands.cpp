@@ -1,0 +1,165 @@
+#include <chrono>
+#include <csignal>
+#include <filesystem>
+#include <iostream>
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/pidfd.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <nlohmann/json.hpp>
+
+#include "platform/foundation/log_sinks.h"
+#include "platform/ipc/call.h"
+#include "platform/ipc/error_codec.h"
+#include "yomber/command.h"
+#include "yomber/drive_client.h"
+#include "yomber/drive_status.h"
+#include "yomber/item_output.h"
+#include "yomber/supervisor.h"
+
+namespace yomber {
+
+namespace {
+
+using std::chrono::steady_clock;
+
+/// How long `up` and `down` wait before they say that something is wrong.
+constexpr std::chrono::seconds patience{30};
+
+std::string programPath(const std::string& name) {
+  std::error_code failure;
+  const auto self = std::filesystem::read_symlink("/proc/self/exe", failure);
+  return (self.parent_path() / name).string();
+}
+
+std::string supervisorLock(const DrivePaths& paths) { return paths.home + "/supervisor.lock"; }
+
+/// Waits until the process has ended; false at the deadline.
+bool waitForEnd(int pidDescriptor, steady_clock::time_point deadline) {
+  pollfd waiting{pidDescriptor, POLLIN, 0};
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - steady_clock::now()).count();
+  return poll(&waiting, 1, static_cast<int>(std::max<long long>(left, 0))) == 1;
+}
+
+void closeInheritedDescriptors() {
+  const int null = open("/dev/null", O_RDWR | O_CLOEXEC);
+  for (const int standard : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) dup2(null, standard);
+  close_range(STDERR_FILENO + 1, ~0U, 0);
+}
+
+NSErrorRef superviseHere(const DrivePaths& paths) {
+  Supervisor supervisor(supervisorLock(paths), {
+                                                   {"zarn", {programPath("zarn"), "--home", paths.home}},
+                                                   {"fileproviderd", {programPath("fileproviderd"), "--home", paths.home}},
+                                               });
+  if (NSErrorRef error = supervisor.takeLock()) return error;
+  openLog("supervisor", paths);
+  supervisor.run();
+  return nullptr;
+}
+
+/// Starts the supervisor as a session of its own, which no terminal's end takes down.
+void startSupervisorProcess(const DrivePaths& paths) {
+  const pid_t first = fork();
+  if (first == 0) {
+    setsid();
+    if (fork() != 0) _exit(0);
+    closeInheritedDescriptors();
+    _exit(superviseHere(paths) ? 1 : 0);
+  }
+  waitpid(first, nullptr, 0);
+}
+
+/// Whether zarn and the host answer, and the extension knows the root.
+NSErrorRef askWhetherUp(const DrivePaths& paths) {
+  DriveClient client(paths);
+  NSErrorRef error;
+  if (!client.daemon(&error)) return error;
+  if (!client.control(&error)) return error;
+  std::string root;
+  return client.location(NSFileProviderRootContainerItemIdentifier, root);
+}
+
+NSErrorRef waitUntilUp(const DrivePaths& paths) {
+  const auto deadline = steady_clock::now() + patience;
+  NSErrorRef error = askWhetherUp(paths);
+  while (error && steady_clock::now() < deadline) {
+    poll(nullptr, 0, 20);
+    error = askWhetherUp(paths);
+  }
+  return error;
+}
+
+void runUp(CommandContext& context, bool foreground) {
+  const DrivePaths paths = context.paths();
+  if (NSErrorRef error = paths.create()) {
+    context.fail(error);
+    context.exitCode = ExitCode::CannotCreate;
+    return;
+  }
+  const bool already = Supervisor::runningPid(supervisorLock(paths)).has_value();
+  if (foreground) {
+    if (already) return context.fail(ExitCode::CannotCreate, "the drive is up already; take it down with 'yomber down'");
+    if (NSErrorRef error = superviseHere(paths)) context.fail(error);
+    return;
+  }
+  if (!already) startSupervisorProcess(paths);
+  if (NSErrorRef error = waitUntilUp(paths)) {
+    context.fail(error);
+    std::cerr << "yomber: the drive did not come up; see 'yomber log'" << std::endl;
+    context.exitCode = ExitCode::Unavailable;
+    return;
+  }
+  if (context.json) {
+    std::cout << nlohmann::ordered_json{{"home", paths.home}, {"up", true}, {"was_up", already}}.dump() << std::endl;
+  } else {
+    std::cout << (already ? "The drive is up already: " : "The drive is up: ") << paths.home << std::endl;
+  }
+}
+
+void runDown(CommandContext& context) {
+  const DrivePaths paths = context.paths();
+  const std::optional<pid_t> pid = Supervisor::runningPid(supervisorLock(paths));
+  const int pidDescriptor = pid ? pidfd_open(*pid, 0) : -1;
+  if (pidDescriptor >= 0) {
+    pidfd_send_signal(pidDescriptor, SIGTERM, nullptr, 0);
+    const bool ended = waitForEnd(pidDescriptor, steady_clock::now() + patience);
+    close(pidDescriptor);
+    if (!ended) {
+      return context.fail(ExitCode::Failure, "the drive's supervisor (pid " + std::to_string(*pid) + ") did not end");
+    }
+  }
+  const bool wasUp = pidDescriptor >= 0;
+  if (context.json) {
+    std::cout << nlohmann::ordered_json{{"home", paths.home}, {"up", false}, {"was_up", wasUp}}.dump() << std::endl;
+  } else {
+    std::cout << (wasUp ? "The drive is down." : "The drive was not up.") << std::endl;
+  }
+}
+
+void runStatus(CommandContext& context) {
+  const DrivePaths paths = context.paths();
+  const DriveStatus status = readDriveStatus(paths, Supervisor::runningPid(supervisorLock(paths)));
+  std::cout << (context.json ? statusJson(status).dump() + "\n" : statusText(status)) << std::flush;
+  if (!status.daemon || !status.host) context.exitCode = ExitCode::Unavailable;
+}
+
+}  // namespace
+
+void addDriveCommands(CLI::App& app, CommandContext& context) {
+  CLI::App* up = app.add_subcommand("up", "Start the drive and keep it running");
+  auto* foreground = up->add_flag("--foreground", "Stay, and end the drive when this command ends");
+  up->callback([&context, foreground] { runUp(context, foreground->count() > 0); });
+
+  CLI::App* down = app.add_subcommand("down", "End the drive; its files stay");
+  down->callback([&context] { runDown(context); });
+
+  CLI::App* status = app.add_subcommand("status", "Show what the drive is doing");
+  status->callback([&context] { runStatus(context); });
+}
+
+}  // namespace yomber

@@ -1,0 +1,150 @@
+#include "yomber/drive_status.h"
+
+#include <sstream>
+
+#include <nlohmann/json.hpp>
+
+#include "platform/ipc/call.h"
+#include "platform/ipc/error_codec.h"
+#include "yomber/drive_client.h"
+#include "yomber/item_output.h"
+
+namespace yomber {
+
+namespace {
+
+std::optional<DriveStatus::Daemon> askDaemon(const ipc::Remote<protocol::Daemon>& remote) {
+  DriveStatus::Daemon daemon;
+  NSErrorRef error = ipc::callAndWait(
+      remote, &protocol::Daemon::Client::statusRequest, [](auto) {},
+      [&](auto results) {
+        const auto status = results.getStatus();
+        daemon.items = status.getItems();
+        daemon.folders = status.getFolders();
+        daemon.rank = status.getRank();
+        daemon.scanning = status.getScan() == protocol::Daemon::Status::Scan::RUNNING;
+        daemon.live = status.getObservation() == protocol::Daemon::Status::Observation::LIVE;
+        daemon.advice = status.getObservationAdvice().cStr();
+        daemon.watchedFolders = status.getWatchedFolders();
+        daemon.watchers = status.getWatchers();
+        daemon.residentBytes = status.getResidentBytes();
+        daemon.openDescriptors = status.getOpenDescriptors();
+      });
+  if (error) return std::nullopt;
+  error = ipc::callAndWait(
+      remote, &protocol::Daemon::Client::describeRequest, [](auto) {},
+      [&](auto results) { daemon.pid = results.getPid(); });
+  if (error) return std::nullopt;
+  return daemon;
+}
+
+std::optional<std::string> askAccount(const ipc::Remote<protocol::Daemon>& remote) {
+  std::optional<std::string> name;
+  const NSErrorRef error = ipc::callAndWait(
+      remote, &protocol::Daemon::Client::accountRequest, [](auto) {},
+      [&](auto results) {
+        if (results.getResult().isAccount()) name = results.getResult().getAccount().getName().cStr();
+      });
+  return error ? std::nullopt : name;
+}
+
+std::optional<DriveStatus::Host> askHost(const ipc::Remote<protocol::Control>& remote) {
+  DriveStatus::Host host;
+  const NSErrorRef error = ipc::callAndWait(
+      remote, &protocol::Control::Client::statusRequest, [](auto) {},
+      [&](auto results) {
+        const auto status = results.getStatus();
+        host.extensionPid = status.getExtensionPid();
+        host.extensionStarts = status.getExtensionStarts();
+        host.watches = status.getWatches();
+        host.enumerators = status.getEnumerators();
+        host.residentBytes = status.getResidentBytes();
+        host.openDescriptors = status.getOpenDescriptors();
+        host.lastFailure = ipc::decodeOptional(status.getLastFailure());
+      });
+  if (error) return std::nullopt;
+  return host;
+}
+
+void describeDaemon(std::ostream& out, const DriveStatus::Daemon& daemon) {
+  out << "zarn           running, pid " << daemon.pid << ", " << readableSize(daemon.residentBytes) << "\n"
+      << "items          " << daemon.items << " in " << daemon.folders << " folders"
+      << (daemon.scanning ? ", scanning" : "") << "\n"
+      << "changes        " << (daemon.live ? "seen as they come" : "found by scanning") << ", " << daemon.watchedFolders
+      << " folders observed\n";
+  if (!daemon.advice.empty()) out << "               " << daemon.advice << "\n";
+}
+
+void describeHost(std::ostream& out, const DriveStatus::Host& host) {
+  out << "fileproviderd  running, " << readableSize(host.residentBytes) << ", " << host.watches << " watches\n";
+  if (host.extensionPid != 0) {
+    out << "extension      running, pid " << host.extensionPid << ", started " << host.extensionStarts << " times\n";
+  } else {
+    out << "extension      not running";
+    if (host.lastFailure) out << ": " << host.lastFailure->localizedDescription();
+    out << "\n";
+  }
+}
+
+}  // namespace
+
+DriveStatus readDriveStatus(const DrivePaths& paths, std::optional<pid_t> supervisor) {
+  DriveStatus status;
+  status.home = paths.home;
+  status.supervisor = supervisor;
+  DriveClient client(paths);
+  if (const auto daemon = client.daemon(nullptr)) {
+    status.daemon = askDaemon(daemon);
+    status.account = askAccount(daemon);
+  }
+  if (const auto control = client.control(nullptr)) status.host = askHost(control);
+  return status;
+}
+
+std::string statusText(const DriveStatus& status) {
+  std::ostringstream out;
+  out << "drive          " << status.home << "\n";
+  out << "account        " << status.account.value_or("nobody is signed in") << "\n";
+  if (status.daemon) {
+    describeDaemon(out, *status.daemon);
+  } else {
+    out << "zarn           does not answer\n";
+  }
+  if (status.host) {
+    describeHost(out, *status.host);
+  } else {
+    out << "fileproviderd  does not answer\n";
+  }
+  if (!status.supervisor) out << "Start the drive with 'yomber up'.\n";
+  return out.str();
+}
+
+nlohmann::ordered_json statusJson(const DriveStatus& status) {
+  nlohmann::ordered_json json{{"home", status.home}, {"up", status.daemon && status.host}};
+  if (status.supervisor) json["supervisor"] = {{"pid", *status.supervisor}};
+  if (status.account) json["account"] = *status.account;
+  if (status.daemon) {
+    json["zarn"] = {{"pid", status.daemon->pid},
+                    {"items", status.daemon->items},
+                    {"folders", status.daemon->folders},
+                    {"rank", status.daemon->rank},
+                    {"scanning", status.daemon->scanning},
+                    {"live", status.daemon->live},
+                    {"advice", status.daemon->advice},
+                    {"watched_folders", status.daemon->watchedFolders},
+                    {"watchers", status.daemon->watchers},
+                    {"resident_bytes", status.daemon->residentBytes},
+                    {"open_descriptors", status.daemon->openDescriptors}};
+  }
+  if (status.host) {
+    json["fileproviderd"] = {{"watches", status.host->watches},
+                             {"enumerators", status.host->enumerators},
+                             {"resident_bytes", status.host->residentBytes},
+                             {"open_descriptors", status.host->openDescriptors}};
+    json["extension"] = {{"pid", status.host->extensionPid}, {"starts", status.host->extensionStarts}};
+    if (status.host->lastFailure) json["extension"]["failure"] = errorJson(status.host->lastFailure);
+  }
+  return json;
+}
+
+}  // namespace yomber

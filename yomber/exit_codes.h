@@ -1,0 +1,21 @@
+#pragma once
+
+#include "platform/foundation/error.h"
+
+namespace yomber {
+
+/// What `yomber` answers to the shell. Stable: scripts may test them. The values are those of
+/// sysexits.h where it has one.
+enum class ExitCode : int {
+  Ok = 0,
+  Failure = 1,
+  Usage = 64,        ///< the command line is wrong
+  NoSuchItem = 66,   ///< the item or location is not in the drive
+  Unavailable = 69,  ///< the drive is not up, or does not answer
+  CannotCreate = 73, ///< the drive cannot be started here
+  NotSignedIn = 77,
+};
+
+[[nodiscard]] ExitCode exitCodeFor(const NSErrorRef& error);
+
+}  // namespace yomber

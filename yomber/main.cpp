@@ -1,0 +1,38 @@
+#include <clocale>
+#include <csignal>
+
+#include <CLI/CLI.hpp>
+
+#include "yomber/command.h"
+
+int main(int argc, char** argv) {
+  using namespace yomber;
+  std::setlocale(LC_TIME, "");
+  std::signal(SIGPIPE, SIG_DFL);
+
+  CLI::App app("Yomber Drive: files on demand");
+  app.name("yomber");
+  app.set_help_all_flag("--help-all", "Show the help of every command");
+  app.require_subcommand(1);
+  app.fallthrough();
+
+  CommandContext context;
+  app.add_option("--home", context.home, "The drive's home; YOMBER_HOME or ~/.local/share/yomber by default");
+  app.add_flag("--json", context.json, "Print JSON: one object a line");
+
+  addDriveCommands(app, context);
+  addAccountCommands(app, context);
+  addListingCommands(app, context);
+  addItemCommands(app, context);
+  addWatchCommands(app, context);
+  addLogCommand(app, context);
+  addCompletionCommand(app, context);
+
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& error) {
+    const int answer = app.exit(error);
+    return answer == 0 ? 0 : static_cast<int>(ExitCode::Usage);
+  }
+  return static_cast<int>(context.exitCode);
+}

@@ -22,7 +22,9 @@ constexpr std::array kPatterns = {
     Pattern{"", ".part"},            // partial downloads
     Pattern{"", ".partial"},
     Pattern{"", ".crdownload"},
-    Pattern{"", ".nosync"},  // the user's own wish
+    Pattern{"", ".opdownload"},
+    Pattern{".", ".kate-swp"},  // Kate's swap files
+    Pattern{"", ".nosync"},     // the user's own wish
 };
 
 constexpr std::array<std::string_view, 1> kNames = {".DS_Store"};

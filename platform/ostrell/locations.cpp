@@ -1,5 +1,7 @@
 #include "platform/ostrell/locations.h"
 
+#include <algorithm>
+
 #include "platform/foundation/url.h"
 #include "platform/ostrell/constants.h"
 #include "platform/ostrell/exclusions.h"
@@ -8,6 +10,8 @@ namespace yomber {
 namespace {
 
 constexpr std::string_view kDocuments = "/Documents";
+constexpr std::string_view kTrash = "/.Trash";
+constexpr std::string_view kTrashFiles = "/files";
 
 bool isAtOrBelow(std::string_view path, std::string_view folder) {
   return path == folder || isPathBelow(path, folder);
@@ -46,13 +50,26 @@ bool DriveLocations::isInTrash(std::string_view path) const {
   return isPathBelow(path, trash_) && !climbs(path);
 }
 
+std::optional<std::string_view> DriveLocations::belowPlace(std::string_view path) const {
+  if (!isInTree(path)) return std::nullopt;
+  const std::string_view relative = path.substr(tree_.size());  // "/first/second/…"
+  const auto second = relative.find('/', 1);
+  if (second == std::string_view::npos) return std::nullopt;
+  const std::string_view first = relative.substr(0, second);
+  const bool isDotted = first.size() > 1 && first[1] == '.';
+  const std::string_view place = first == kTrash ? kTrashFiles : kDocuments;
+  if (isDotted && first != kTrash) return std::nullopt;
+  const std::string_view rest = relative.substr(second);
+  if (!isAtOrBelow(rest, place)) return std::nullopt;
+  return rest.substr(place.size());
+}
+
 bool DriveLocations::isPrivate(std::string_view path) const {
-  return isAtOrBelow(path, promises_) || isAtOrBelow(path, private_);
+  return isAtOrBelow(path, private_) || (isAtOrBelow(path, tree_) && !belowPlace(path));
 }
 
 bool DriveLocations::isExcluded(std::string_view path) const {
-  if (!isPathBelow(path, tree_)) return false;
-  std::string_view rest = path.substr(tree_.size());
+  std::string_view rest = belowPlace(path).value_or("");
   while (!rest.empty()) {
     rest.remove_prefix(1);
     const auto end = std::min(rest.find('/'), rest.size());

@@ -33,15 +33,21 @@ class DriveLocations {
 
   [[nodiscard]] bool isInTree(std::string_view path) const;
   [[nodiscard]] bool isInTrash(std::string_view path) const;
-  /// Whether the path is in storage that is never listed (promises, staging), or is its folder.
+  /// Whether the path is in storage that is never listed: staging, and what is in the tree but
+  /// neither in a container's Documents nor in the trash's files (promises, trash information, the
+  /// tree's own folders).
   [[nodiscard]] bool isPrivate(std::string_view path) const;
-  /// Whether its name never syncs, or that of a folder above it in the tree.
+  /// Whether its name never syncs, or that of a folder above it in Documents or in the trash.
   [[nodiscard]] bool isExcluded(std::string_view path) const;
   /// The container whose Documents folder this path would be, whether or not there is such a
   /// container.
   [[nodiscard]] std::optional<std::string> containerOfDocuments(std::string_view path) const;
 
  private:
+  /// What follows the Documents folder or the trash's files that the path is in; nothing when it is
+  /// in neither.
+  [[nodiscard]] std::optional<std::string_view> belowPlace(std::string_view path) const;
+
   const std::string home_;
   const std::string tree_;
   const std::string root_;

@@ -1,9 +1,9 @@
 #pragma once
 
-#include <chrono>
 #include <compare>
 #include <cstdint>
 #include <ctime>
+#include <limits>
 #include <string>
 
 namespace yomber {
@@ -17,6 +17,10 @@ class NSDate {
   static constexpr NSDate fromNanoseconds(std::int64_t sinceEpoch) { return NSDate(sinceEpoch); }
   static NSDate fromTimespec(const std::timespec& time);
   static NSDate now();
+  /// The latest date there is; reads as "never".
+  static constexpr NSDate distantFuture() {
+    return NSDate(std::numeric_limits<std::int64_t>::max());
+  }
 
   /// Nanoseconds since 1970-01-01T00:00:00Z.
   [[nodiscard]] constexpr std::int64_t nanoseconds() const { return nanoseconds_; }

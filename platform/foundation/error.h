@@ -4,6 +4,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <utility>
 #include <variant>
 
 #include "platform/foundation/object.h"
@@ -15,7 +16,7 @@ class NSURL;
 
 /// Errors are immutable and shared; nil means success.
 using NSErrorRef = std::shared_ptr<const NSError>;
-/// What completion handlers that carry only success or failure take.
+/// Not to const: marks change a location in place.
 using NSURLRef = std::shared_ptr<NSURL>;
 
 /// Domains. Codes are only comparable within one domain.
@@ -25,6 +26,7 @@ inline constexpr const char* NSPOSIXErrorDomain = "NSPOSIXErrorDomain";
 /// Cocoa codes that this system makes or tests.
 inline constexpr std::int64_t NSFileNoSuchFileError = 4;
 inline constexpr std::int64_t NSFileReadUnknownError = 256;
+inline constexpr std::int64_t NSFileWriteUnknownError = 512;
 inline constexpr std::int64_t NSFileWriteFileExistsError = 516;
 inline constexpr std::int64_t NSUserCancelledError = 3072;
 inline constexpr std::int64_t NSXPCConnectionInterrupted = 4097;

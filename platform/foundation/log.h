@@ -5,6 +5,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <type_traits>
 
 #include "platform/foundation/log_format.h"
 
@@ -30,17 +31,23 @@ class Log {
 
   Log();
   ~Log();
+  Log(const Log&) = delete;
+  Log& operator=(const Log&) = delete;
 
   [[nodiscard]] bool isEnabled(LogLevel level) const {
-    return static_cast<std::uint8_t>(level) >= level_.load(std::memory_order_relaxed)->load(std::memory_order_relaxed);
+    const auto* const current = level_.load(std::memory_order_relaxed);
+    return static_cast<std::uint8_t>(level) >= current->load(std::memory_order_relaxed);
   }
+  /// Hands `line` to the sink, whatever the level is. Without a sink, errors and faults go to
+  /// standard error.
   void write(LogLevel level, std::string_view line);
 
-  /// Replaces the sink; tests use it to collect lines.
+  /// Replaces the sink; tests use it to collect lines. Null takes it away.
   void setSink(std::shared_ptr<Sink> sink);
-  /// Sets this process's own level (until a shared level page is attached).
+  /// Sets this process's own level, which counts while no shared level is attached.
   void setLevel(LogLevel level);
-  /// From now on reads the level from `level`, which must outlive the log.
+  /// From now on reads the level from `level`, which must outlive the log; null goes back to the
+  /// process's own.
   void attachLevel(const std::atomic<std::uint8_t>* level);
 
  private:
@@ -50,7 +57,7 @@ class Log {
   std::unique_ptr<State> state_;
 };
 
-/// The process's default log.
+/// The process's default log; lives until the process ends.
 Log& defaultLog();
 
 // One function a level. `format` is a literal in the printf manner with `%@` for anything that has a

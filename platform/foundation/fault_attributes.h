@@ -1,0 +1,20 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+
+namespace yomber {
+
+/// The extended attribute that an item without local content carries at its place in the tree.
+inline constexpr const char* kFaultAttribute = "user.yomber.fault";
+/// Holds the boot identifier under which a fault was filled and verified: in that boot the content
+/// is readable although the fault attribute still stands; after another it is a fault again.
+inline constexpr const char* kFilledAttribute = "user.yomber.filled";
+
+/// The identifier of the running system's boot; empty when the system tells none.
+[[nodiscard]] const std::string& bootIdentifier();
+
+/// Whether `path` (a final symbolic link is not followed) is a fault whose content cannot be read.
+[[nodiscard]] bool isFaultAtPath(const std::string& path);
+
+}  // namespace yomber

@@ -1,0 +1,206 @@
+#include "platform/foundation/thread_pool.h"
+
+#include <pthread.h>
+
+#include <algorithm>
+#include <cstdint>
+#include <deque>
+#include <system_error>
+#include <thread>
+#include <utility>
+
+#include "platform/foundation/lock.h"
+#include "platform/foundation/log.h"
+
+namespace yomber {
+
+struct ThreadPool::State {
+  explicit State(Limits givenLimits) : limits(givenLimits) {
+    // Every submitted item must find a thread one day.
+    limits.maximumThreads = std::max<std::size_t>(limits.maximumThreads, 1);
+    limits.promptThreads =
+        std::clamp<std::size_t>(limits.promptThreads, 1, limits.maximumThreads);
+  }
+
+  Limits limits;  // not changed after construction
+
+  mutable Mutex mutex;
+  Condition workArrived;   ///< for idle threads: there is work, or the pool closes
+  Condition stallPossible; ///< for the monitor: work waits, or the pool closes
+  Condition threadEnded;   ///< for the destructor
+  std::deque<std::function<void()>> work GUARDED_BY(mutex);
+  std::size_t threads GUARDED_BY(mutex) = 0;
+  std::size_t idle GUARDED_BY(mutex) = 0;
+  std::uint64_t started GUARDED_BY(mutex) = 0;  ///< items taken from the queue so far
+  bool monitorRuns GUARDED_BY(mutex) = false;
+  bool boundWasLogged GUARDED_BY(mutex) = false;
+  bool closing GUARDED_BY(mutex) = false;
+};
+
+namespace {
+
+using Limits = ThreadPool::Limits;
+
+void nameThread(const char* name) { pthread_setname_np(pthread_self(), name); }
+
+}  // namespace
+
+/// The threads' own code; they share the state, so that it outlives the pool object.
+class PoolThreads {
+ public:
+  using State = ThreadPool::State;
+  using StateRef = std::shared_ptr<State>;
+
+  /// Starts one more thread. False when the system refuses.
+  static bool startThread(const StateRef& state) REQUIRES(state->mutex) {
+    try {
+      std::thread([state] { threadMain(*state); }).detach();
+    } catch (const std::system_error&) {
+      return false;
+    }
+    ++state->threads;
+    return true;
+  }
+
+  static void startMonitorOnce(const StateRef& state) REQUIRES(state->mutex) {
+    if (state->monitorRuns) return;
+    try {
+      std::thread([state] { monitorMain(state); }).detach();
+      state->monitorRuns = true;
+    } catch (const std::system_error&) {
+      return;  // tried again with the next item
+    }
+  }
+
+ private:
+  static void threadMain(State& state) {
+    nameThread("yomber-pool");
+    state.mutex.lock();
+    while (true) {
+      if (!state.work.empty()) {
+        runNext(state);
+      } else if (state.closing || !waitForWork(state)) {
+        break;
+      }
+    }
+    --state.threads;
+    state.threadEnded.notifyAll();
+    state.mutex.unlock();
+  }
+
+  static void runNext(State& state) REQUIRES(state.mutex) {
+    auto work = std::move(state.work.front());
+    state.work.pop_front();
+    ++state.started;
+    if (state.work.empty()) state.boundWasLogged = false;
+    state.mutex.unlock();
+    work();
+    work = nullptr;  // what it holds goes before the thread counts as free
+    state.mutex.lock();
+  }
+
+  /// False when the thread has been idle for so long that it ends.
+  static bool waitForWork(State& state) REQUIRES(state.mutex) {
+    const auto deadline = std::chrono::steady_clock::now() + state.limits.idleTime;
+    ++state.idle;
+    bool timeLeft = true;
+    while (state.work.empty() && !state.closing && timeLeft) {
+      if (state.idle <= state.limits.keptIdleThreads) {
+        state.workArrived.wait(state.mutex);
+      } else {
+        timeLeft = state.workArrived.waitUntil(state.mutex, deadline);
+      }
+    }
+    --state.idle;
+    return timeLeft || !state.work.empty();
+  }
+
+  /// Watches the queue: work that waits although nothing has moved means that every thread is
+  /// blocked, and then more threads are started, twice as many with every further moment.
+  static void monitorMain(const StateRef& held) {
+    State& state = *held;
+    nameThread("yomber-poolwtch");
+    LockGuard guard(state.mutex);
+    std::size_t step = 1;
+    while (true) {
+      while (state.work.empty() && !state.closing) {
+        step = 1;
+        state.stallPossible.wait(state.mutex);
+      }
+      if (state.closing && state.work.empty()) break;
+      const std::uint64_t before = state.started;
+      const auto until = std::chrono::steady_clock::now() + state.limits.stallTime;
+      while (state.stallPossible.waitUntil(state.mutex, until)) {
+      }
+      if (state.work.empty() || state.started != before) {
+        step = 1;
+        continue;
+      }
+      grow(held, step);
+      step = std::min<std::size_t>(step * 2, 32);
+    }
+    state.monitorRuns = false;
+    state.threadEnded.notifyAll();
+  }
+
+  static void grow(const StateRef& state, std::size_t step) REQUIRES(state->mutex) {
+    const std::size_t room = state->limits.maximumThreads - state->threads;
+    const std::size_t wanted = std::min({step, room, state->work.size()});
+    for (std::size_t i = 0; i < wanted; ++i) {
+      if (!startThread(state)) {
+        reportBound(*state);
+        return;
+      }
+    }
+    if (room == 0) reportBound(*state);
+  }
+
+  static void reportBound(State& state) REQUIRES(state.mutex) {
+    if (std::exchange(state.boundWasLogged, true)) return;
+    const std::uint64_t threads = state.threads;
+    const std::uint64_t waiting = state.work.size();
+    state.mutex.unlock();
+    log_fault(defaultLog(),
+              "[CRIT] all %llu threads of the pool are blocked and no more can be started; %llu "
+              "items wait",
+              threads, waiting);
+    state.mutex.lock();
+  }
+};
+
+ThreadPool::ThreadPool(Limits limits) : state_(std::make_shared<State>(limits)) {}
+
+ThreadPool::~ThreadPool() {
+  LockGuard guard(state_->mutex);
+  state_->closing = true;
+  state_->workArrived.notifyAll();
+  state_->stallPossible.notifyAll();
+  while (state_->threads > 0 || state_->monitorRuns) state_->threadEnded.wait(state_->mutex);
+}
+
+ThreadPool& ThreadPool::shared() {
+  static ThreadPool& pool = *new ThreadPool([] {
+    Limits limits;
+    limits.promptThreads =
+        std::max<std::size_t>(limits.promptThreads, 2 * std::thread::hardware_concurrency());
+    return limits;
+  }());
+  return pool;
+}
+
+void ThreadPool::async(std::function<void()> work) {
+  LockGuard guard(state_->mutex);
+  state_->work.push_back(std::move(work));
+  if (state_->idle > 0) state_->workArrived.notifyOne();
+  if (state_->idle >= state_->work.size()) return;
+  if (state_->threads < state_->limits.promptThreads && PoolThreads::startThread(state_)) return;
+  PoolThreads::startMonitorOnce(state_);
+  state_->stallPossible.notifyOne();
+}
+
+std::size_t ThreadPool::threadCount() const {
+  LockGuard guard(state_->mutex);
+  return state_->threads;
+}
+
+}  // namespace yomber

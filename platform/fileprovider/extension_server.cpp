@@ -1,0 +1,306 @@
+#include "platform/fileprovider/extension_server.h"
+
+#include <cerrno>
+#include <atomic>
+#include <optional>
+#include <string>
+#include <utility>
+
+#include "platform/fileprovider/errors.h"
+#include "platform/fileprovider/item_codec.h"
+#include "platform/fileprovider/reply_observers.h"
+#include "platform/foundation/log.h"
+#include "platform/foundation/thread_pool.h"
+#include "platform/ipc/error_codec.h"
+#include "platform/ipc/event_loop.h"
+#include "platform/ipc/remote.h"
+#include "platform/ipc/server_call.h"
+
+namespace yomber {
+namespace {
+
+using ipc::CancelFlag;
+using ipc::EventLoop;
+
+/// A promise of this loop, and the function that keeps it from any thread.
+template <typename T>
+struct LoopReply {
+  kj::Promise<T> promise = nullptr;
+  std::function<void(T)> fulfill;
+
+  static LoopReply make() {
+    auto pair = kj::newPromiseAndFulfiller<T>();
+    using Fulfiller = kj::Own<kj::PromiseFulfiller<T>>;
+    auto slot = std::shared_ptr<Fulfiller>(new Fulfiller(kj::mv(pair.fulfiller)),
+                                           ipc::detail::DeleteOnLoop());
+    LoopReply reply;
+    reply.promise = kj::mv(pair.promise);
+    reply.fulfill = [slot = std::move(slot)](T value) {
+      EventLoop::shared().post(
+          [slot, value = std::move(value)]() mutable { (*slot)->fulfill(std::move(value)); });
+    };
+    return reply;
+  }
+};
+
+/// Runs extension code on the pool; nothing that it throws leaves it.
+template <typename Work>
+void runOnPool(const char* operation, Work work) {
+  ThreadPool::shared().async([operation, work = std::move(work)]() mutable {
+    try {
+      work();
+    } catch (const std::exception& exception) {
+      log_fault(defaultLog(), "[CRIT] %s of the extension threw: %s", operation, exception.what());
+    }
+  });
+}
+
+NSErrorRef tokenTooLong() {
+  return NSError::errorWithDomain(
+      NSPOSIXErrorDomain, EINVAL,
+      {{NSLocalizedDescriptionKey,
+        std::string("a page token or sync anchor is longer than any extension makes them")}});
+}
+
+NSFileProviderPage decodePage(protocol::Enumerator::Page::Reader page) {
+  switch (page.which()) {
+    case protocol::Enumerator::Page::NONE:
+      return nullptr;
+    case protocol::Enumerator::Page::INITIAL_BY_NAME:
+      return NSFileProviderInitialPageSortedByName;
+    case protocol::Enumerator::Page::INITIAL_BY_DATE:
+      return NSFileProviderInitialPageSortedByDate;
+    case protocol::Enumerator::Page::TOKEN:
+      return NSData::dataWithString(stringFromWire(page.getToken()));
+  }
+  return nullptr;
+}
+
+std::uint64_t wordsOf(const NSFileProviderItems& items) {
+  std::uint64_t words = 0;
+  for (const auto& item : items) words += encodedItemWords(item->fields());
+  return words;
+}
+
+capnp::MessageSize sizeHint(std::uint64_t words) { return {words + 64, 0}; }
+
+/// The two replies' encoders; on the loop thread.
+void encodePage(const EnumeratedPage& page,
+                protocol::Enumerator::Server::EnumerateItemsContext context) {
+  auto result = context.getResults(sizeHint(wordsOf(page.items))).initResult();
+  if (page.error != nullptr) {
+    ipc::encodeError(page.error, result.initError());
+    return;
+  }
+  auto out = result.initPage();
+  encodeItems(page.items, out.initItems(static_cast<unsigned>(page.items.size())));
+  if (page.next != nullptr) out.initNext().setValue(wireData(page.next->bytes()));
+}
+
+void encodeChanges(const EnumeratedChanges& changes,
+                   protocol::Enumerator::Server::EnumerateChangesContext context) {
+  auto result = context.getResults(sizeHint(wordsOf(changes.updated))).initResult();
+  if (changes.error != nullptr) {
+    ipc::encodeError(changes.error, result.initError());
+    return;
+  }
+  auto out = result.initChanges();
+  encodeItems(changes.updated, out.initUpdated(static_cast<unsigned>(changes.updated.size())));
+  auto deleted = out.initDeleted(static_cast<unsigned>(changes.deleted.size()));
+  for (unsigned i = 0; i < deleted.size(); ++i) deleted.set(i, wireText(changes.deleted[i]));
+  out.setAnchor(wireData(changes.anchor->bytes()));
+  out.setMoreComing(changes.moreComing);
+}
+
+/// An enumerator and whether it was told to end. Shared with the work on the pool.
+class HeldEnumerator {
+ public:
+  explicit HeldEnumerator(NSFileProviderEnumeratorRef enumerator)
+      : enumerator_(std::move(enumerator)),
+        changes_(std::dynamic_pointer_cast<NSFileProviderChangeEnumerator>(enumerator_)) {}
+
+  [[nodiscard]] NSFileProviderEnumerator& items() const { return *enumerator_; }
+  /// Null when it tells no changes.
+  [[nodiscard]] NSFileProviderChangeEnumerator* changes() const { return changes_.get(); }
+  void invalidateOnce() {
+    if (!invalidated_.exchange(true)) enumerator_->invalidate();
+  }
+
+ private:
+  const NSFileProviderEnumeratorRef enumerator_;
+  const std::shared_ptr<NSFileProviderChangeEnumerator> changes_;
+  std::atomic<bool> invalidated_{false};
+};
+
+class EnumeratorServer final : public protocol::Enumerator::Server {
+ public:
+  explicit EnumeratorServer(NSFileProviderEnumeratorRef enumerator)
+      : held_(std::make_shared<HeldEnumerator>(std::move(enumerator))) {}
+  ~EnumeratorServer() noexcept override {
+    runOnPool("invalidate", [held = held_] { held->invalidateOnce(); });
+  }
+
+ protected:
+  kj::Promise<void> enumerateItems(EnumerateItemsContext context) override {
+    context.allowCancellation();
+    const auto wanted = context.getParams().getPage();
+    if (wanted.isToken() && wanted.getToken().size() > kMaximumTokenLength) {
+      ipc::encodeError(tokenTooLong(), context.getResults().initResult().initError());
+      return kj::READY_NOW;
+    }
+    auto page = decodePage(wanted);
+    context.releaseParams();
+    auto reply = LoopReply<EnumeratedPage>::make();
+    runOnPool("enumerateItemsForObserver",
+              [held = held_, page = std::move(page),
+               observer = std::make_shared<PageObserver>(std::move(reply.fulfill))]() mutable {
+                held->items().enumerateItemsForObserver(std::move(observer), std::move(page));
+              });
+    return reply.promise.then(
+        [context](EnumeratedPage told) mutable { encodePage(told, context); });
+  }
+
+  kj::Promise<void> enumerateChanges(EnumerateChangesContext context) override {
+    context.allowCancellation();
+    const auto given = context.getParams().getAnchor();
+    if (given.size() > kMaximumTokenLength || held_->changes() == nullptr) {
+      const auto error = held_->changes() == nullptr
+                             ? fileProviderErrorForUnsupportedFeature("changes of this container")
+                             : tokenTooLong();
+      ipc::encodeError(error, context.getResults().initResult().initError());
+      return kj::READY_NOW;
+    }
+    auto anchor = NSData::dataWithString(stringFromWire(given));
+    context.releaseParams();
+    auto reply = LoopReply<EnumeratedChanges>::make();
+    runOnPool("enumerateChangesForObserver",
+              [held = held_, anchor = std::move(anchor),
+               observer = std::make_shared<ChangesObserver>(std::move(reply.fulfill))]() mutable {
+                held->changes()->enumerateChangesForObserver(std::move(observer),
+                                                             std::move(anchor));
+              });
+    return reply.promise.then(
+        [context](EnumeratedChanges told) mutable { encodeChanges(told, context); });
+  }
+
+  kj::Promise<void> currentSyncAnchor(CurrentSyncAnchorContext context) override {
+    context.allowCancellation();
+    if (held_->changes() == nullptr) return kj::READY_NOW;
+    auto reply = LoopReply<NSFileProviderSyncAnchor>::make();
+    runOnPool("currentSyncAnchor", [held = held_, fulfill = std::move(reply.fulfill)] {
+      held->changes()->currentSyncAnchorWithCompletionHandler(fulfill);
+    });
+    return reply.promise.then([context](NSFileProviderSyncAnchor anchor) mutable {
+      if (anchor == nullptr) return;
+      auto results = context.getResults();
+      results.setSupported(true);
+      results.setAnchor(wireData(anchor->bytes()));
+    });
+  }
+
+  kj::Promise<void> invalidate(InvalidateContext /*context*/) override {
+    return ipc::onPool([held = held_](const CancelFlag&) { held->invalidateOnce(); });
+  }
+
+ private:
+  const std::shared_ptr<HeldEnumerator> held_;
+};
+
+class ExtensionServer final : public protocol::Extension::Server {
+ public:
+  explicit ExtensionServer(std::shared_ptr<NSFileProviderExtension> extension)
+      : extension_(std::move(extension)) {}
+
+ protected:
+  kj::Promise<void> urlForItem(UrlForItemContext context) override {
+    auto identifier = takeIdentifier(context, context.getParams().getIdentifier());
+    return ipc::onPool([extension = extension_, identifier](const CancelFlag&) {
+             return extension->URLForItemWithPersistentIdentifier(identifier);
+           })
+        .then([context](NSURLRef url) mutable {
+          if (url != nullptr) context.getResults().initPath().setValue(wireData(url->path()));
+        });
+  }
+
+  kj::Promise<void> identifierForPath(IdentifierForPathContext context) override {
+    context.allowCancellation();
+    auto url = NSURL::fileURLWithPath(stringFromWire(context.getParams().getPath()));
+    context.releaseParams();
+    if (url == nullptr) return kj::READY_NOW;
+    return ipc::onPool([extension = extension_, url = std::move(url)](const CancelFlag&) {
+             return extension->persistentIdentifierForItemAtURL(url);
+           })
+        .then([context](std::optional<NSFileProviderItemIdentifier> identifier) mutable {
+          if (!identifier) return;
+          auto results = context.getResults();
+          results.setFound(true);
+          results.setIdentifier(wireText(*identifier));
+        });
+  }
+
+  kj::Promise<void> itemForIdentifier(ItemForIdentifierContext context) override {
+    auto identifier = takeIdentifier(context, context.getParams().getIdentifier());
+    struct Answer {
+      NSFileProviderItemRef item;
+      NSErrorRef error;
+    };
+    return ipc::onPool([extension = extension_, identifier](const CancelFlag&) {
+             Answer answer;
+             answer.item = extension->itemForIdentifier(identifier, &answer.error);
+             if (answer.item == nullptr) answer.error = orNonExistent(answer.error, identifier);
+             return answer;
+           })
+        .then([context](Answer answer) mutable {
+          auto result = context.getResults().initResult();
+          if (answer.item == nullptr) return ipc::encodeError(answer.error, result.initError());
+          encodeItem(answer.item->fields(), result.initItem());
+        });
+  }
+
+  kj::Promise<void> enumerator(EnumeratorContext context) override {
+    auto container = takeIdentifier(context, context.getParams().getContainer());
+    struct Answer {
+      NSFileProviderEnumeratorRef enumerator;
+      NSErrorRef error;
+    };
+    return ipc::onPool([extension = extension_, container](const CancelFlag&) {
+             Answer answer;
+             answer.enumerator =
+                 extension->enumeratorForContainerItemIdentifier(container, &answer.error);
+             if (answer.enumerator == nullptr) {
+               answer.error = orNonExistent(answer.error, container);
+             }
+             return answer;
+           })
+        .then([context](Answer answer) mutable {
+          auto result = context.getResults().initResult();
+          if (answer.enumerator == nullptr) {
+            return ipc::encodeError(answer.error, result.initError());
+          }
+          result.setEnumerator(kj::heap<EnumeratorServer>(std::move(answer.enumerator)));
+        });
+  }
+
+ private:
+  template <typename Context>
+  static std::string takeIdentifier(Context& context, capnp::Text::Reader text) {
+    context.allowCancellation();
+    auto identifier = stringFromWire(text);
+    context.releaseParams();
+    return identifier;
+  }
+
+  static NSErrorRef orNonExistent(const NSErrorRef& error, const std::string& identifier) {
+    return error != nullptr ? error : fileProviderErrorForNonExistentItemWithIdentifier(identifier);
+  }
+
+  const std::shared_ptr<NSFileProviderExtension> extension_;
+};
+
+}  // namespace
+
+protocol::Extension::Client serveExtension(std::shared_ptr<NSFileProviderExtension> extension) {
+  return kj::heap<ExtensionServer>(std::move(extension));
+}
+
+}  // namespace yomber

@@ -12,8 +12,12 @@ function(_yomber_precompiled kind)
   file(CONFIGURE OUTPUT "${source}" CONTENT "namespace yomber {}\n")
   add_library(yomber_pch_${kind} OBJECT EXCLUDE_FROM_ALL "${source}")
   target_precompile_headers(yomber_pch_${kind} PRIVATE ${ARGN})
-  target_link_libraries(yomber_pch_${kind} PRIVATE
-    yomber_options GTest::gmock Threads::Threads CapnProto::capnp-rpc)
+  # The macros must be those of the targets that use it.
+  set(libraries Threads::Threads CapnProto::capnp-rpc)
+  if(kind MATCHES "gtest")
+    list(APPEND libraries GTest::gmock)
+  endif()
+  target_link_libraries(yomber_pch_${kind} PRIVATE yomber_options ${libraries})
 endfunction()
 
 _yomber_precompiled(gtest ${YOMBER_GTEST_HEADERS})

@@ -85,8 +85,8 @@ std::uint64_t wordsOf(const NSFileProviderItems& items) {
 capnp::MessageSize sizeHint(std::uint64_t words) { return {words + 64, 0}; }
 
 /// The two replies' encoders; on the loop thread.
-void encodePage(const EnumeratedPage& page,
-                protocol::Enumerator::Server::EnumerateItemsContext context) {
+template <typename Context>
+void encodePage(const EnumeratedPage& page, Context& context) {
   auto result = context.getResults(sizeHint(wordsOf(page.items))).initResult();
   if (page.error != nullptr) {
     ipc::encodeError(page.error, result.initError());
@@ -97,8 +97,8 @@ void encodePage(const EnumeratedPage& page,
   if (page.next != nullptr) out.initNext().setValue(wireData(page.next->bytes()));
 }
 
-void encodeChanges(const EnumeratedChanges& changes,
-                   protocol::Enumerator::Server::EnumerateChangesContext context) {
+template <typename Context>
+void encodeChanges(const EnumeratedChanges& changes, Context& context) {
   auto result = context.getResults(sizeHint(wordsOf(changes.updated))).initResult();
   if (changes.error != nullptr) {
     ipc::encodeError(changes.error, result.initError());
@@ -136,7 +136,7 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
  public:
   explicit EnumeratorServer(NSFileProviderEnumeratorRef enumerator)
       : held_(std::make_shared<HeldEnumerator>(std::move(enumerator))) {}
-  ~EnumeratorServer() noexcept override {
+  ~EnumeratorServer() noexcept {
     runOnPool("invalidate", [held = held_] { held->invalidateOnce(); });
   }
 

@@ -1,0 +1,267 @@
+#include "platform/foundation/file_manager.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <memory>
+#include <string_view>
+#include <utility>
+
+namespace yomber {
+namespace {
+
+bool fail(NSErrorRef* error, int number, const std::string& path) {
+  if (number == ENOENT) {
+    storeError(error, NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
+                                               {{NSFilePathErrorKey, path},
+                                                {NSUnderlyingErrorKey,
+                                                 NSError::errorWithErrno(number)}}));
+  } else {
+    storeError(error, NSError::errorWithErrno(number, path));
+  }
+  return false;
+}
+
+bool failTaken(NSErrorRef* error, const std::string& path) {
+  storeError(error, NSError::errorWithDomain(
+                        NSCocoaErrorDomain, NSFileWriteFileExistsError,
+                        {{NSFilePathErrorKey, path},
+                         {NSUnderlyingErrorKey, NSError::errorWithErrno(EEXIST)}}));
+  return false;
+}
+
+struct CloseDirectory {
+  void operator()(DIR* directory) const { closedir(directory); }
+};
+using Directory = std::unique_ptr<DIR, CloseDirectory>;
+
+/// Opens the directory `name` of `parent`, never through a symbolic link; nil and errno otherwise.
+Directory openDirectory(int parent, const char* name) {
+  const int descriptor = openat(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (descriptor < 0) return nullptr;
+  Directory directory(fdopendir(descriptor));
+  if (directory == nullptr) close(descriptor);
+  return directory;
+}
+
+/// The next name, or nil at the end (errno 0) and on failure.
+const char* nextName(DIR* directory) {
+  while (true) {
+    errno = 0;
+    const dirent* const entry = readdir(directory);
+    if (entry == nullptr) return nullptr;
+    const std::string_view name(entry->d_name);
+    if (name != "." && name != "..") return entry->d_name;
+  }
+}
+
+/// Removes trees without recursion, so that depth costs no stack; descriptors are one for each
+/// level.
+class TreeRemoval {
+ public:
+  /// False, with `failedPath` and errno, at the first failure.
+  bool run(const std::string& path) {
+    failedPath = path;
+    if (unlink(path.c_str()) == 0) return true;
+    if (errno != EISDIR && errno != EPERM) return false;
+    if (!descend(AT_FDCWD, path)) return false;
+    while (!levels_.empty()) {
+      if (!step()) return false;
+    }
+    failedPath = path;
+    return rmdir(path.c_str()) == 0;
+  }
+
+  std::string failedPath;
+
+ private:
+  struct Level {
+    Directory directory;
+    std::string name;
+    bool mayHoldMore = false;  ///< something was removed since the reading began
+  };
+
+  bool descend(int parent, const std::string& name) {
+    auto directory = openDirectory(parent, name.c_str());
+    if (directory == nullptr) return false;
+    levels_.push_back({std::move(directory), name, false});
+    return true;
+  }
+
+  std::string pathOf(const char* name) const {
+    std::string out;
+    for (const auto& level : levels_) out += level.name + "/";
+    return out + name;
+  }
+
+  bool failAt(const char* name) {
+    const int number = errno;
+    failedPath = pathOf(name);
+    errno = number;
+    return false;
+  }
+
+  bool step() {
+    DIR* const directory = levels_.back().directory.get();
+    const char* const name = nextName(directory);
+    if (name == nullptr && errno != 0) return failAt("");
+    if (name == nullptr) return readAgainOrAscend();
+    levels_.back().mayHoldMore = true;
+    if (unlinkat(dirfd(directory), name, 0) == 0 || errno == ENOENT) return true;
+    if (errno != EISDIR && errno != EPERM) return failAt(name);
+    if (unlinkat(dirfd(directory), name, AT_REMOVEDIR) == 0 || errno == ENOENT) return true;
+    if (errno != ENOTEMPTY && errno != EEXIST) return failAt(name);
+    return descend(dirfd(directory), name) || failAt(name);
+  }
+
+  /// Reading a directory while names go may skip some: it is done when a reading finds none.
+  bool readAgainOrAscend() {
+    if (!std::exchange(levels_.back().mayHoldMore, false)) return ascend();
+    rewinddir(levels_.back().directory.get());
+    return true;
+  }
+
+  bool ascend() {
+    const std::string name = std::move(levels_.back().name);
+    levels_.pop_back();
+    if (levels_.empty()) return true;  // the top is the caller's
+    const int parent = dirfd(levels_.back().directory.get());
+    if (unlinkat(parent, name.c_str(), AT_REMOVEDIR) == 0 || errno == ENOENT) return true;
+    return failAt(name.c_str());
+  }
+
+  std::vector<Level> levels_;
+};
+
+bool makeIntermediates(const std::string& path, unsigned mode) {
+  for (std::size_t slash = path.find('/', 1); slash != std::string::npos;
+       slash = path.find('/', slash + 1)) {
+    const std::string parent = path.substr(0, slash);
+    struct stat status {};
+    if (stat(parent.c_str(), &status) == 0) continue;
+    if (mkdir(parent.c_str(), mode) != 0 && errno != EEXIST) return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+NSFileManager& NSFileManager::defaultManager() {
+  static NSFileManager manager;
+  return manager;
+}
+
+bool NSFileManager::fileExistsAtPath(const std::string& path) const {
+  struct stat status {};
+  return stat(path.c_str(), &status) == 0;
+}
+
+bool NSFileManager::isDirectoryAtPath(const std::string& path) const {
+  struct stat status {};
+  return stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+}
+
+bool NSFileManager::createDirectoryAtPath(const std::string& path, Intermediates intermediates,
+                                          NSErrorRef* error, unsigned mode) const {
+  const bool tolerant = intermediates == Intermediates::Make;
+  if (tolerant && !makeIntermediates(path, mode)) return fail(error, errno, path);
+  if (mkdir(path.c_str(), mode) == 0) return true;
+  const int number = errno;
+  if (number != EEXIST) return fail(error, number, path);
+  if (tolerant && isDirectoryAtPath(path)) return true;
+  return failTaken(error, path);
+}
+
+bool NSFileManager::removeItemAtPath(const std::string& path, NSErrorRef* error) const {
+  TreeRemoval removal;
+  if (removal.run(path)) return true;
+  const int number = errno;
+  return fail(error, number, removal.failedPath);
+}
+
+bool NSFileManager::moveItemAtPath(const std::string& source, const std::string& destination,
+                                   NSErrorRef* error) const {
+  if (renameat2(AT_FDCWD, source.c_str(), AT_FDCWD, destination.c_str(), RENAME_NOREPLACE) == 0) {
+    return true;
+  }
+  const int number = errno;
+  if (number == EEXIST) return failTaken(error, destination);
+  struct stat status {};
+  const bool sourceIsThere = lstat(source.c_str(), &status) == 0;
+  return fail(error, number, number == ENOENT && sourceIsThere ? destination : source);
+}
+
+std::optional<std::vector<std::string>> NSFileManager::contentsOfDirectoryAtPath(
+    const std::string& path, NSErrorRef* error) const {
+  const Directory directory(opendir(path.c_str()));
+  if (directory == nullptr) {
+    fail(error, errno, path);
+    return std::nullopt;
+  }
+  std::vector<std::string> names;
+  while (const char* const name = nextName(directory.get())) names.emplace_back(name);
+  if (errno != 0) {
+    fail(error, errno, path);
+    return std::nullopt;
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+bool NSFileManager::setPermissions(const std::string& path, unsigned mode,
+                                   NSErrorRef* error) const {
+  return chmod(path.c_str(), mode) == 0 || fail(error, errno, path);
+}
+
+bool NSFileManager::setModificationDate(const std::string& path, NSDate date,
+                                        NSErrorRef* error) const {
+  constexpr std::int64_t kSecond = 1'000'000'000;
+  std::timespec time{date.nanoseconds() / kSecond, date.nanoseconds() % kSecond};
+  if (time.tv_nsec < 0) {
+    --time.tv_sec;
+    time.tv_nsec += kSecond;
+  }
+  const std::array<std::timespec, 2> times{std::timespec{0, UTIME_OMIT}, time};
+  return utimensat(AT_FDCWD, path.c_str(), times.data(), AT_SYMLINK_NOFOLLOW) == 0 ||
+         fail(error, errno, path);
+}
+
+std::optional<std::string> NSFileManager::extendedAttribute(const std::string& path,
+                                                            const std::string& name,
+                                                            NSErrorRef* error) const {
+  std::string value(256, '\0');
+  while (true) {
+    const ssize_t length = lgetxattr(path.c_str(), name.c_str(), value.data(), value.size());
+    if (length >= 0) {
+      value.resize(static_cast<std::size_t>(length));
+      return value;
+    }
+    if (errno != ERANGE) break;
+    const ssize_t needed = lgetxattr(path.c_str(), name.c_str(), nullptr, 0);
+    if (needed < 0) break;
+    value.resize(static_cast<std::size_t>(needed) + 1);  // never 0, which would only ask the size
+  }
+  if (errno != ENODATA) fail(error, errno, path);
+  return std::nullopt;
+}
+
+bool NSFileManager::setExtendedAttribute(const std::string& path, const std::string& name,
+                                         const std::string& value, NSErrorRef* error) const {
+  return lsetxattr(path.c_str(), name.c_str(), value.data(), value.size(), 0) == 0 ||
+         fail(error, errno, path);
+}
+
+bool NSFileManager::removeExtendedAttribute(const std::string& path, const std::string& name,
+                                            NSErrorRef* error) const {
+  return lremovexattr(path.c_str(), name.c_str()) == 0 || errno == ENODATA ||
+         fail(error, errno, path);
+}
+
+}  // namespace yomber

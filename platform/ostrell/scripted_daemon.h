@@ -147,8 +147,9 @@ class ScriptedDaemon {
   void postAccountTokenDidChange();
   void postContainerListDidChange();
 
- private:
   struct State;
+
+ private:
   std::shared_ptr<State> state_;
 };
 

@@ -1,0 +1,160 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/foundation/atomic_cell.h"
+#include "platform/foundation/error.h"
+#include "platform/foundation/lock.h"
+#include "platform/foundation/serial_queue.h"
+#include "platform/ipc/call.h"
+#include "platform/ipc/connection.h"
+#include "platform/ostrell/account.h"
+#include "platform/ostrell/change_announcer.h"
+#include "platform/ostrell/container.h"
+#include "platform/ostrell/generation_cache.h"
+#include "platform/ostrell/locations.h"
+#include "protocols/daemon.capnp.h"
+
+namespace yomber {
+
+/// Told when the connection that it was registered with ends.
+class DaemonLossObserver {
+ public:
+  virtual ~DaemonLossObserver() = default;
+  /// On the loop thread; once.
+  virtual void daemonWasLost(const NSErrorRef& reason) = 0;
+};
+
+/// One connection to the daemon that stood.
+///
+/// Ownership: shared by the link and by what was made over it.
+class DaemonSession {
+ public:
+  DaemonSession(ipc::Connection::Ref connection, ipc::Remote<protocol::Daemon> daemon)
+      : connection_(std::move(connection)), daemon_(std::move(daemon)) {}
+
+  [[nodiscard]] const ipc::Remote<protocol::Daemon>& daemon() const { return daemon_; }
+  [[nodiscard]] const ipc::Connection::Ref& connection() const { return connection_; }
+
+  /// Held weakly. Told soon when the session has ended already.
+  void addLossObserver(const std::shared_ptr<DaemonLossObserver>& observer);
+  /// Tells the observers. Loop thread.
+  void end(const NSErrorRef& reason);
+  /// Keeps the standing registration for as long as the session. Loop thread, before it is shared.
+  void keep(ipc::Remote<protocol::Registration> registration) { registration_ = registration; }
+
+ private:
+  const ipc::Connection::Ref connection_;
+  const ipc::Remote<protocol::Daemon> daemon_;
+  ipc::Remote<protocol::Registration> registration_;
+
+  Mutex mutex_;
+  NSErrorRef ended_ GUARDED_BY(mutex_);
+  std::vector<std::weak_ptr<DaemonLossObserver>> observers_ GUARDED_BY(mutex_);
+  std::size_t nextSweep_ GUARDED_BY(mutex_) = 16;
+};
+
+using DaemonSessionRef = std::shared_ptr<DaemonSession>;
+
+/// The library's one way to the daemon of a home: connects when it is needed, and again after a
+/// loss; keeps what the daemon said of account and containers until it says otherwise.
+///
+/// Every connection registers for the daemon's announcements before anything else is asked on it,
+/// so that nothing kept can be stale. Thread-safety: every operation may be called on any thread;
+/// what waits, not on the loop thread.
+class DaemonLink : public std::enable_shared_from_this<DaemonLink> {
+ public:
+  /// The link of the process's default connection.
+  static std::shared_ptr<DaemonLink> current();
+  /// Ends it and puts one to the drive at `home` in its place.
+  static void replaceCurrent(const std::string& home);
+
+  static std::shared_ptr<DaemonLink> create(const std::string& home);
+  DaemonLink(const DaemonLink&) = delete;
+  DaemonLink& operator=(const DaemonLink&) = delete;
+  virtual ~DaemonLink() = default;
+
+  /// Gets the session, or the error that there is none.
+  using SessionHandler = std::function<void(const DaemonSessionRef&, const NSErrorRef&)>;
+  /// Calls `handler` at once when there is a session, else on the loop thread (or a pool thread)
+  /// when the attempt that is under way, or that this starts, has ended. `handler` must not block.
+  /// Handlers run in the order of the calls.
+  void withSession(SessionHandler handler);
+  /// The session, when there is one.
+  [[nodiscard]] DaemonSessionRef session() const { return session_.load(); }
+  /// Waits for the attempt when there is none; nil and an error when it fails.
+  DaemonSessionRef waitForSession(NSErrorRef* error);
+
+  /// Calls the daemon and waits; `decode` runs on the loop thread.
+  template <typename Client, typename Params, typename Results, typename Fill, typename Decode>
+  NSErrorRef callAndWait(ipc::RequestMethod<Client, Params, Results> method, Fill&& fill,
+                         Decode&& decode) {
+    NSErrorRef error;
+    const auto session = waitForSession(&error);
+    if (!session) return error;
+    return ipc::callAndWait(session->daemon(), method, std::forward<Fill>(fill),
+                            std::forward<Decode>(decode), callOptions_);
+  }
+
+  /// From now on connects again by itself, with back-off, when the connection is lost.
+  void keepConnected();
+  /// Ends everything for good; later calls fail.
+  void shutDown();
+
+  [[nodiscard]] const DriveLocations& locations() const { return locations_; }
+  [[nodiscard]] const ipc::CallOptions& callOptions() const { return callOptions_; }
+  /// Replies, notifications and error handlers run here.
+  [[nodiscard]] const std::shared_ptr<SerialQueue>& replyQueue() const { return replyQueue_; }
+
+  using ContainerMap = std::shared_ptr<const std::map<std::string, QSContainerRef>>;
+  [[nodiscard]] GenerationCache<QSAccountRef>& accountCache() { return account_; }
+  [[nodiscard]] GenerationCache<ContainerMap>& containerCache() { return containers_; }
+
+  // What the daemon announces. Loop thread.
+  void accountDidChange();
+  void containersDidChange();
+
+ private:
+  struct Attempt;
+  struct Observer;
+
+  explicit DaemonLink(const std::string& home, std::string socketPath);
+  void attempt();
+  void didConnect(ipc::Connection::Ref connection, const NSErrorRef& error);
+  void checkHome(const DaemonSessionRef& session);
+  void observe(const DaemonSessionRef& session);
+  void didEstablish(const DaemonSessionRef& session);
+  void didFail(const NSErrorRef& error);
+  void didLose(const DaemonSessionRef& session, const NSErrorRef& reason);
+  void tryAgainLater();
+  void emptyCaches();
+
+  const DriveLocations locations_;
+  const std::string socketPath_;
+  const ipc::CallOptions callOptions_;
+  const std::shared_ptr<SerialQueue> replyQueue_;
+  const std::shared_ptr<ChangeAnnouncer> announcer_;
+
+  GenerationCache<QSAccountRef> account_;
+  GenerationCache<ContainerMap> containers_;
+  AtomicCell<DaemonSessionRef> session_;
+
+  Mutex mutex_;
+  std::vector<SessionHandler> waiting_ GUARDED_BY(mutex_);
+  bool isAttempting_ GUARDED_BY(mutex_) = false;
+  bool isShutDown_ GUARDED_BY(mutex_) = false;
+  bool keepsConnected_ GUARDED_BY(mutex_) = false;
+  bool isRetryPlanned_ GUARDED_BY(mutex_) = false;
+  /// Whether observers were left without news for a while.
+  bool owesAnnouncement_ GUARDED_BY(mutex_) = false;
+  std::chrono::milliseconds retryDelay_ GUARDED_BY(mutex_);
+};
+
+}  // namespace yomber

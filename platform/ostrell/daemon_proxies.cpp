@@ -1,0 +1,111 @@
+#include "platform/ostrell/daemon_proxies.h"
+
+#include <optional>
+#include <utility>
+
+#include "platform/ostrell/daemon_calls.h"
+#include "platform/ostrell/error_handler_slot.h"
+
+namespace yomber {
+namespace {
+
+/// Makes calls without waiting: replies and failures come on the link's reply queue.
+class AsyncInvoker {
+ public:
+  AsyncInvoker(std::shared_ptr<DaemonLink> link, std::function<void(NSErrorRef)> errorHandler)
+      : link_(std::move(link)),
+        slot_(std::make_shared<ErrorHandlerSlot>(std::move(errorHandler), link_->replyQueue())) {}
+
+  [[nodiscard]] const std::shared_ptr<DaemonLink>& link() const { return link_; }
+
+  template <typename Client, typename Params, typename Results, typename Fill, typename Decode,
+            typename Reply>
+  void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
+              Reply reply) {
+    link_->withSession(
+        [=, link = link_, slot = slot_](const DaemonSessionRef& session, const NSErrorRef& error) {
+          if (!session) {
+            slot->fail(error);
+            return;
+          }
+          using Reader = typename Results::Reader;
+          auto onReply = [decode, reply, slot, session, queue = link->replyQueue()](
+                             const NSErrorRef& failure, const Reader* results) {
+            if (results == nullptr) {
+              slot->fail(failure);
+              return;
+            }
+            queue->async([reply, value = decode(session, *results)] { reply(value); });
+          };
+          (void)ipc::call(session->daemon(), method, fill, std::move(onReply), link->callOptions());
+        });
+  }
+
+ private:
+  const std::shared_ptr<DaemonLink> link_;
+  const std::shared_ptr<ErrorHandlerSlot> slot_;
+};
+
+/// Makes calls on the calling thread; keeps what the reply stored, or the transport failure.
+class SyncInvoker {
+ public:
+  explicit SyncInvoker(std::shared_ptr<DaemonLink> link) : link_(std::move(link)) {}
+
+  [[nodiscard]] const std::shared_ptr<DaemonLink>& link() const { return link_; }
+
+  template <typename Client, typename Params, typename Results, typename Fill, typename Decode,
+            typename Reply>
+  void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
+              Reply reply) {
+    const auto session = link_->waitForSession(&error);
+    if (!session) return;
+    using Value = decltype(decode(session, std::declval<const typename Results::Reader&>()));
+    std::optional<Value> value;
+    error = ipc::callAndWait(
+        session->daemon(), method, std::move(fill),
+        [&](const typename Results::Reader& results) { value.emplace(decode(session, results)); },
+        link_->callOptions());
+    if (value && !error) reply(*value);
+  }
+
+  NSErrorRef error;
+
+ private:
+  const std::shared_ptr<DaemonLink> link_;
+};
+
+using DaemonProxy = DaemonCalls<QSDaemonProtocol, AsyncInvoker>;
+
+class DaemonSyncProxy final : public DaemonCalls<QSDaemonSyncProxy, SyncInvoker> {
+ public:
+  using DaemonCalls::DaemonCalls;
+
+  void setObjResult(NSObjectRef result, NSErrorRef error) override {
+    result_ = std::move(result);
+    invoker().error = std::move(error);
+  }
+  void setBoolResult(bool result, NSErrorRef error) override {
+    boolResult_ = result;
+    invoker().error = std::move(error);
+  }
+  [[nodiscard]] NSObjectRef result() const override { return result_; }
+  [[nodiscard]] bool boolResult() const override { return boolResult_; }
+  [[nodiscard]] NSErrorRef error() const override { return invoker().error; }
+
+ private:
+  NSObjectRef result_;
+  bool boolResult_ = false;
+};
+
+}  // namespace
+
+QSDaemonProxyRef makeDaemonProxy(std::shared_ptr<DaemonLink> link,
+                                 std::function<void(NSErrorRef)> errorHandler) {
+  return std::make_shared<DaemonProxy>(AsyncInvoker(std::move(link), std::move(errorHandler)));
+}
+
+QSDaemonSyncProxyRef makeDaemonSyncProxy(std::shared_ptr<DaemonLink> link) {
+  return std::make_shared<DaemonSyncProxy>(SyncInvoker(std::move(link)));
+}
+
+}  // namespace yomber

@@ -44,7 +44,8 @@ std::string userDirectory() {
   std::array<char, 4096> buffer{};
   passwd entry{};
   passwd* found = nullptr;
-  if (getpwuid_r(geteuid(), &entry, buffer.data(), buffer.size(), &found) != 0 || !found) return "/";
+  if (getpwuid_r(geteuid(), &entry, buffer.data(), buffer.size(), &found) != 0 || !found)
+    return "/";
   return found->pw_dir;
 }
 
@@ -71,7 +72,7 @@ std::string hashOf(const std::string& text) {
 
 /// Checks what stands at `path` itself; a symbolic link is never followed.
 NSErrorRef checkOwnDirectory(const std::string& path) {
-  struct stat status {};
+  struct stat status{};
   if (lstat(path.c_str(), &status) != 0) return systemFailure(path);
   if (S_ISLNK(status.st_mode)) {
     return failure(ENOTDIR, path, "is a symbolic link; a drive needs a directory there");
@@ -119,7 +120,7 @@ NSErrorRef checkSocketPath(const std::string& path) {
 
 /// $XDG_RUNTIME_DIR must be there: nobody but the session's manager makes it.
 NSErrorRef checkSessionDirectory(const std::string& path) {
-  struct stat status {};
+  struct stat status{};
   if (stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode)) return nullptr;
   return failure(ENOENT, path,
                  "is what XDG_RUNTIME_DIR names, and no such directory exists; unset the variable "

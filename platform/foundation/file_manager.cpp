@@ -19,10 +19,10 @@ namespace {
 
 bool fail(NSErrorRef* error, int number, const std::string& path) {
   if (number == ENOENT) {
-    storeError(error, NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
-                                               {{NSFilePathErrorKey, path},
-                                                {NSUnderlyingErrorKey,
-                                                 NSError::errorWithErrno(number)}}));
+    storeError(error,
+               NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
+                                        {{NSFilePathErrorKey, path},
+                                         {NSUnderlyingErrorKey, NSError::errorWithErrno(number)}}));
   } else {
     storeError(error, NSError::errorWithErrno(number, path));
   }
@@ -30,10 +30,10 @@ bool fail(NSErrorRef* error, int number, const std::string& path) {
 }
 
 bool failTaken(NSErrorRef* error, const std::string& path) {
-  storeError(error, NSError::errorWithDomain(
-                        NSCocoaErrorDomain, NSFileWriteFileExistsError,
-                        {{NSFilePathErrorKey, path},
-                         {NSUnderlyingErrorKey, NSError::errorWithErrno(EEXIST)}}));
+  storeError(error,
+             NSError::errorWithDomain(NSCocoaErrorDomain, NSFileWriteFileExistsError,
+                                      {{NSFilePathErrorKey, path},
+                                       {NSUnderlyingErrorKey, NSError::errorWithErrno(EEXIST)}}));
   return false;
 }
 
@@ -144,7 +144,7 @@ bool makeIntermediates(const std::string& path, unsigned mode) {
   for (std::size_t slash = path.find('/', 1); slash != std::string::npos;
        slash = path.find('/', slash + 1)) {
     const std::string parent = path.substr(0, slash);
-    struct stat status {};
+    struct stat status{};
     if (stat(parent.c_str(), &status) == 0) continue;
     if (mkdir(parent.c_str(), mode) != 0 && errno != EEXIST) return false;
   }
@@ -159,12 +159,12 @@ NSFileManager& NSFileManager::defaultManager() {
 }
 
 bool NSFileManager::fileExistsAtPath(const std::string& path) const {
-  struct stat status {};
+  struct stat status{};
   return stat(path.c_str(), &status) == 0;
 }
 
 bool NSFileManager::isDirectoryAtPath(const std::string& path) const {
-  struct stat status {};
+  struct stat status{};
   return stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
 }
 
@@ -193,7 +193,7 @@ bool NSFileManager::moveItemAtPath(const std::string& source, const std::string&
   }
   const int number = errno;
   if (number == EEXIST) return failTaken(error, destination);
-  struct stat status {};
+  struct stat status{};
   const bool sourceIsThere = lstat(source.c_str(), &status) == 0;
   return fail(error, number, number == ENOENT && sourceIsThere ? destination : source);
 }

@@ -14,8 +14,8 @@ namespace yomber {
 ///
 /// Every operation answers false (or nothing) and stores an error when it fails. Errors are in the
 /// POSIX domain, except for the two that callers tell apart: a missing source is Cocoa error 4, a
-/// taken destination Cocoa error 516. Both name the path. A final symbolic link is itself the object
-/// of an operation unless said otherwise.
+/// taken destination Cocoa error 516. Both name the path. A final symbolic link is itself the
+/// object of an operation unless said otherwise.
 ///
 /// Thread-safety: stateless; every operation may be called on any thread.
 class NSFileManager {

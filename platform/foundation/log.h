@@ -60,8 +60,8 @@ class Log {
 /// The process's default log; lives until the process ends.
 Log& defaultLog();
 
-// One function a level. `format` is a literal in the printf manner with `%@` for anything that has a
-// `description`; it is checked against the arguments at compile time and formatted only when the
+// One function a level. `format` is a literal in the printf manner with `%@` for anything that has
+// a `description`; it is checked against the arguments at compile time and formatted only when the
 // level is on.
 //
 //   log_debug(qsc_default_log(), "[DEBUG] ┏%llx asked url for %@", section, identifier);

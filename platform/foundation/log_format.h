@@ -16,10 +16,10 @@ namespace yomber {
 
 /// One conversion of a format, e.g. "%llx".
 struct LogConversion {
-  char letter = 0;        ///< one of "@sduxf%"
-  bool is64Bit = false;   ///< has a length of l, ll or z
-  int precision = 6;      ///< digits after the point, for 'f'
-  std::size_t length = 0; ///< characters of the conversion, with its '%'
+  char letter = 0;         ///< one of "@sduxf%"
+  bool is64Bit = false;    ///< has a length of l, ll or z
+  int precision = 6;       ///< digits after the point, for 'f'
+  std::size_t length = 0;  ///< characters of the conversion, with its '%'
 };
 
 /// Reads the conversion that `text` begins with; nothing when there is no such conversion.

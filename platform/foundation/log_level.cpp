@@ -50,7 +50,7 @@ constexpr std::size_t kLevelOffset = kMagic.size();
 
 /// Whether the open file is a page that this user alone can have written.
 bool isPage(int descriptor) {
-  struct stat status {};
+  struct stat status{};
   std::array<char, kLevelOffset + 1> head{};
   if (fstat(descriptor, &status) != 0 || !S_ISREG(status.st_mode)) return false;
   if (status.st_uid != geteuid() || (status.st_mode & 077U) != 0) return false;
@@ -77,7 +77,8 @@ bool makePage(const std::string& path, Existing existing) {
   std::array<char, kPageSize> page{};
   std::copy(kMagic.begin(), kMagic.end(), page.begin());
   page[kLevelOffset] = static_cast<char>(LogLevel::Info);
-  const bool written = write(file.get(), page.data(), page.size()) == static_cast<ssize_t>(kPageSize);
+  const bool written =
+      write(file.get(), page.data(), page.size()) == static_cast<ssize_t>(kPageSize);
   if (!written) errno = ENOSPC;
   bool placed = false;
   if (written && existing == Existing::Replace) {

@@ -18,16 +18,15 @@ struct ThreadPool::State {
   explicit State(Limits givenLimits) : limits(givenLimits) {
     // Every submitted item must find a thread one day.
     limits.maximumThreads = std::max<std::size_t>(limits.maximumThreads, 1);
-    limits.promptThreads =
-        std::clamp<std::size_t>(limits.promptThreads, 1, limits.maximumThreads);
+    limits.promptThreads = std::clamp<std::size_t>(limits.promptThreads, 1, limits.maximumThreads);
   }
 
   Limits limits;  // not changed after construction
 
   mutable Mutex mutex;
-  Condition workArrived;   ///< for idle threads: there is work, or the pool closes
-  Condition stallPossible; ///< for the monitor: work waits, or the pool closes
-  Condition threadEnded;   ///< for the destructor
+  Condition workArrived;    ///< for idle threads: there is work, or the pool closes
+  Condition stallPossible;  ///< for the monitor: work waits, or the pool closes
+  Condition threadEnded;    ///< for the destructor
   std::deque<std::function<void()>> work GUARDED_BY(mutex);
   std::size_t threads GUARDED_BY(mutex) = 0;
   std::size_t idle GUARDED_BY(mutex) = 0;
@@ -85,6 +84,7 @@ class PoolThreads {
     }
     --state.threads;
     state.threadEnded.notifyAll();
+    if (state.closing) state.stallPossible.notifyAll();
     state.mutex.unlock();
   }
 
@@ -116,7 +116,7 @@ class PoolThreads {
   }
 
   /// Watches the queue: work that waits although nothing has moved means that every thread is
-  /// blocked, and then more threads are started, twice as many with every further moment.
+  /// blocked, and then more threads are started, twice as many each time while work waits.
   static void monitorMain(const StateRef& held) {
     State& state = *held;
     nameThread("yomber-poolwtch");
@@ -130,12 +130,10 @@ class PoolThreads {
       if (state.closing && state.work.empty()) break;
       const std::uint64_t before = state.started;
       const auto until = std::chrono::steady_clock::now() + state.limits.stallTime;
-      while (state.stallPossible.waitUntil(state.mutex, until)) {
+      while (!(state.closing && state.work.empty()) &&
+             state.stallPossible.waitUntil(state.mutex, until)) {
       }
-      if (state.work.empty() || state.started != before) {
-        step = 1;
-        continue;
-      }
+      if (state.work.empty() || state.started != before) continue;
       grow(held, step);
       step = std::min<std::size_t>(step * 2, 32);
     }

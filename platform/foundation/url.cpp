@@ -79,7 +79,7 @@ bool NSURL::hasMark(Mark mark) const {
 }
 
 std::optional<NSURLResourceValues> NSURL::resourceValues(NSErrorRef* error) const {
-  struct stat status {};
+  struct stat status{};
   if (lstat(path_.c_str(), &status) != 0) {
     storeError(error, NSError::errorWithErrno(errno, path_));
     return std::nullopt;

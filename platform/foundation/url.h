@@ -18,7 +18,7 @@ struct NSURLResourceValues {
   bool isDirectory = false;
   bool isRegularFile = false;
   bool isSymbolicLink = false;
-  std::uint64_t fileSize = 0;  ///< bytes
+  std::uint64_t fileSize = 0;                ///< bytes
   std::uint64_t fileResourceIdentifier = 0;  ///< the disk's inode number
   std::uint64_t volumeIdentifier = 0;        ///< the disk's device number
   NSDate contentModificationDate;
@@ -57,7 +57,8 @@ class NSURL final : public NSObject {
   [[nodiscard]] bool hasMark(Mark mark) const;
 
   /// Reads the values; on failure answers nothing and stores a POSIX-domain error.
-  [[nodiscard]] std::optional<NSURLResourceValues> resourceValues(NSErrorRef* error = nullptr) const;
+  [[nodiscard]] std::optional<NSURLResourceValues> resourceValues(
+      NSErrorRef* error = nullptr) const;
   /// Whether something exists here whose content can be read now.
   [[nodiscard]] bool checkResourceIsReachableAndReturnError(NSErrorRef* error = nullptr) const;
 

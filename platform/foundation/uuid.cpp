@@ -10,7 +10,8 @@
 namespace yomber {
 
 void uuid_generate(UUID& out) {
-  // Reads of up to 256 bytes are never cut short; only a signal before the pool is ready interrupts.
+  // Reads of up to 256 bytes are never cut short; only a signal before the pool is ready
+  // interrupts.
   while (getrandom(out.data(), out.size(), 0) != static_cast<ssize_t>(out.size())) {
     if (errno == EINTR) continue;
     std::fprintf(stderr, "uuid_generate: the system has no random numbers: %s\n",

@@ -72,12 +72,20 @@ interface Watch {}
 
 interface Watcher {
   # The host sends one call after the other, each when the last was answered.
+  #
+  # A watcher that keeps items by identifier, puts those of `didList` and `didUpdate` in and takes those
+  # of `didDelete` out holds what the host knows.
 
   didList @0 (items :List(Common.Item), last :Bool) -> ();
-  # The folder as it is, in pages; `last` on the last one. Sent at the start, and never again.
+  # The container as it is, in pages; `last` on the last one, which may be empty. Sent at the start, and
+  # never again. What changes before the last page is told as it comes: an item may be listed again, or
+  # be deleted.
   didUpdate @1 (items :List(Common.Item)) -> ();
   didDelete @2 (identifiers :List(Text)) -> ();
   didPause @3 (error :Common.Error) -> ();
   # Changes cannot be seen at the moment; the host goes on trying, and sends what was missed.
   didResume @4 () -> ();
+  # What was missed has been sent; from here on changes are seen again.
+  didEnd @5 (error :Common.Error) -> ();
+  # The folder is gone (its items were deleted before), or cannot be watched at all. The last call.
 }

@@ -16,7 +16,9 @@
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/manager.h"
 #include "platform/fileprovider/wire_item.h"
+#include "platform/foundation/drive_paths.h"
 #include "platform/foundation/log.h"
+#include "platform/foundation/log_sinks.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/connection.h"
 #include "platform/ipc/error_codec.h"
@@ -82,6 +84,7 @@ int NSExtensionMain(int argc, char** argv,
   if (socket < 0) return refuse(program);
   (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
   (void)std::signal(SIGPIPE, SIG_IGN);
+  openLog("qs-fileprovider", DrivePaths::forDefaultHome());
   registerItemsInErrors();
 
   const auto extension = makeExtension();

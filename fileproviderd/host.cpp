@@ -1,0 +1,170 @@
+#include "fileproviderd/host.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "fileproviderd/host_errors.h"
+#include "platform/fileprovider/constants.h"
+#include "platform/fileprovider/errors.h"
+#include "platform/foundation/log.h"
+
+namespace yomber {
+namespace {
+
+constexpr int kAttempts = 2;
+
+bool wasLost(const NSErrorRef& error) {
+  return error != nullptr && error->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
+}
+
+}  // namespace
+
+Host::Host(Options options)
+    : options_(std::move(options)),
+      launcher_({.program = options_.extensionProgram,
+                 .home = options_.paths.home,
+                 .callLimit = options_.callLimit}) {}
+
+std::shared_ptr<Host> Host::create(Options options) {
+  std::shared_ptr<Host> host(new Host(std::move(options)));
+  host->wire();
+  return host;
+}
+
+void Host::wire() {
+  const std::weak_ptr<Host> weak = weak_from_this();
+  const auto didSignal = [weak](const std::string& container) {
+    if (const auto self = weak.lock()) self->didSignal(container);
+  };
+  const auto didConnect = [weak] {
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    for (const auto& watch : self->watches()) watch->wake();
+  };
+  const auto didEnd = [weak](const NSErrorRef& reason) {
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    for (const auto& watch : self->watches()) watch->extensionDidEnd(reason);
+  };
+  zarn_ = std::make_shared<ZarnLink>(options_.paths, clock_,
+                                     ZarnLink::Events{didConnect, didSignal}, random_);
+  supervisor_ = std::make_shared<ExtensionSupervisor>(
+      launcher_, *zarn_, clock_, ExtensionSupervisor::Events{didEnd, didSignal}, random_,
+      options_.supervision);
+}
+
+void Host::start() { zarn_->start(); }
+
+void Host::didSignal(const std::string& container) {
+  // The root is signalled when the account changes: whoever waits for a sign-in tries again.
+  const bool mayBeSignIn = container == NSFileProviderRootContainerItemIdentifier;
+  for (const auto& watch : watches()) {
+    if (watch->container() == container) watch->signalled();
+    if (mayBeSignIn && !watch->isLive()) watch->wake();
+  }
+}
+
+std::vector<std::shared_ptr<ContainerWatch>> Host::watches() {
+  std::erase_if(watches_, [](const auto& watch) { return watch.expired(); });
+  std::vector<std::shared_ptr<ContainerWatch>> living;
+  for (const auto& weak : watches_) {
+    if (auto watch = weak.lock()) living.push_back(std::move(watch));
+  }
+  return living;
+}
+
+std::uint32_t Host::watchCount() const {
+  return static_cast<std::uint32_t>(std::count_if(
+      watches_.begin(), watches_.end(), [](const auto& watch) { return !watch.expired(); }));
+}
+
+std::shared_ptr<ContainerWatch> Host::watch(const std::string& container,
+                                            std::shared_ptr<ContainerWatcher> watcher) {
+  if (watches().size() >= options_.maximumWatches) return nullptr;
+  auto watch = std::make_shared<ContainerWatch>(container, *this, clock_, std::move(watcher),
+                                                random_, options_.watching);
+  watches_.push_back(watch);
+  watch->start();
+  return watch;
+}
+
+void Host::enumerator(const std::string& container, EnumeratorHandler handler) {
+  supervisor_->acquire([container, handler = std::move(handler)](
+                           const ExtensionSessionRef& session, const NSErrorRef& error) {
+    if (session == nullptr) return handler(nullptr, error);
+    session->enumerator(container, handler);
+  });
+}
+
+void Host::isGone(const std::string& container, std::function<void(bool)> handler) {
+  zarn_->isGone(container, std::move(handler));
+}
+
+template <typename Answer, typename Ask>
+void Host::ask(Ask ask, std::function<void(std::optional<Answer>, NSErrorRef)> handler,
+               int attempts) {
+  supervisor_->acquire([weak = weak_from_this(), ask, handler = std::move(handler), attempts](
+                           const ExtensionSessionRef& session, const NSErrorRef& error) {
+    if (session == nullptr) return handler(std::nullopt, error);
+    ask(*session, [weak, ask, handler, attempts](std::optional<Answer> answer, NSErrorRef failure) {
+      const auto self = weak.lock();
+      if (self == nullptr) return handler(std::nullopt, failure);
+      if (wasLost(failure) && attempts > 1) return self->ask<Answer>(ask, handler, attempts - 1);
+      if (failure == nullptr) return handler(std::move(answer), nullptr);
+      self->explain(failure, [handler](NSErrorRef explained) {
+        handler(std::nullopt, std::move(explained));
+      });
+    });
+  });
+}
+
+void Host::item(const std::string& identifier, ItemHandler handler) {
+  ask<ItemFields>(
+      [identifier](ExtensionSession& session, ItemHandler answer) {
+        session.item(identifier, std::move(answer));
+      },
+      std::move(handler), kAttempts);
+}
+
+void Host::locate(const std::string& identifier, TextHandler handler) {
+  ask<std::string>(
+      [identifier, limit = options_.callLimit](ExtensionSession& session, TextHandler answer) {
+        session.locate(identifier, limit, [identifier, answer = std::move(answer)](
+                                              std::optional<std::string> path, NSErrorRef error) {
+          if (!path && error == nullptr) {
+            error = fileProviderErrorForNonExistentItemWithIdentifier(identifier);
+          }
+          answer(std::move(path), std::move(error));
+        });
+      },
+      std::move(handler), kAttempts);
+}
+
+void Host::identify(const std::string& path, TextHandler handler) {
+  ask<std::string>(
+      [path](ExtensionSession& session, TextHandler answer) {
+        session.identify(path, [path, answer = std::move(answer)](
+                                   std::optional<std::string> identifier, NSErrorRef error) {
+          if (!identifier && error == nullptr) {
+            error = NSError::errorWithDomain(
+                NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem,
+                {{NSFilePathErrorKey, path},
+                 {NSLocalizedDescriptionKey, "the drive has no item at " + path}});
+          }
+          answer(std::move(identifier), std::move(error));
+        });
+      },
+      std::move(handler), kAttempts);
+}
+
+void Host::explain(const NSErrorRef& error, std::function<void(NSErrorRef)> handler) {
+  // The extension cannot tell a missing item from a missing zarn.
+  if (!isConnectionError(error) && !isNoSuchItemError(error)) return handler(error);
+  zarn_->probe([error, handler = std::move(handler)](const NSErrorRef& missing) {
+    if (missing != nullptr) return handler(zarnNotRunningError(error));
+    if (!wasLost(error)) return handler(error);
+    handler(extensionUnavailableError("ended in the middle of the request", error));
+  });
+}
+
+}  // namespace yomber

@@ -1,0 +1,81 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "fileproviderd/container_watch.h"
+#include "fileproviderd/extension_supervisor.h"
+#include "fileproviderd/host_clock.h"
+#include "fileproviderd/remote_session.h"
+#include "fileproviderd/zarn_link.h"
+#include "platform/foundation/drive_paths.h"
+
+namespace yomber {
+
+/// The host of one drive: the extension, the connection to zarn, and the watches; wired together.
+///
+/// Thread-safety: loop thread only.
+/// Ownership: shared; made with `create`.
+class Host final : public EnumeratorSource, public std::enable_shared_from_this<Host> {
+ public:
+  struct Options {
+    DrivePaths paths;
+    std::string extensionProgram;
+    std::chrono::milliseconds callLimit{30'000};  ///< for one request to the extension
+    ExtensionSupervisor::Limits supervision;
+    ContainerWatch::Limits watching;
+    std::size_t maximumWatches = 4'096;
+  };
+  static std::shared_ptr<Host> create(Options options);
+
+  /// Connects to zarn.
+  void start();
+
+  void enumerator(const std::string& container, EnumeratorHandler handler) override;
+  void isGone(const std::string& container, std::function<void(bool)> handler) override;
+
+  // What clients ask for. Handlers are called once, within a bounded time. A request that was lost
+  // with the extension is made once more.
+  using ItemHandler = std::function<void(std::optional<ItemFields>, NSErrorRef)>;
+  using TextHandler = std::function<void(std::optional<std::string>, NSErrorRef)>;
+  void item(const std::string& identifier, ItemHandler handler);
+  void locate(const std::string& identifier, TextHandler handler);
+  void identify(const std::string& path, TextHandler handler);
+
+  /// Null when there are too many watches already. The watch ends when the caller lets go of it.
+  std::shared_ptr<ContainerWatch> watch(const std::string& container,
+                                        std::shared_ptr<ContainerWatcher> watcher);
+
+  /// Puts an error into words: one that comes from zarn not being there says so.
+  void explain(const NSErrorRef& error, std::function<void(NSErrorRef)> handler);
+
+  [[nodiscard]] ExtensionSupervisor& supervisor() { return *supervisor_; }
+  [[nodiscard]] bool isDaemonReachable() const { return zarn_->isReachable(); }
+  [[nodiscard]] std::uint32_t watchCount() const;
+  [[nodiscard]] std::chrono::milliseconds callLimit() const { return options_.callLimit; }
+
+ private:
+  explicit Host(Options options);
+  void wire();
+  void didSignal(const std::string& container);
+  /// Every watch that lives.
+  [[nodiscard]] std::vector<std::shared_ptr<ContainerWatch>> watches();
+
+  template <typename Answer, typename Ask>
+  void ask(Ask ask, std::function<void(std::optional<Answer>, NSErrorRef)> handler, int attempts);
+
+  const Options options_;
+  LoopClock clock_;
+  const Backoff::Random random_ = Backoff::systemRandom();
+  ProcessLauncher launcher_;
+  std::shared_ptr<ZarnLink> zarn_;
+  std::shared_ptr<ExtensionSupervisor> supervisor_;
+  std::vector<std::weak_ptr<ContainerWatch>> watches_;
+};
+
+}  // namespace yomber

@@ -1,0 +1,223 @@
+#include "fileproviderd/listing.h"
+
+#include <deque>
+#include <memory>
+#include <utility>
+
+#include "fileproviderd/host_errors.h"
+#include "platform/fileprovider/item_codec.h"
+#include "platform/foundation/log.h"
+#include "platform/ipc/error_codec.h"
+#include "platform/ipc/event_loop.h"
+#include "protocols/extension.capnp.h"
+
+namespace yomber {
+namespace {
+
+using protocol::Enumerator;
+using protocol::Listing;
+using PageResponse = capnp::Response<Enumerator::EnumerateItemsResults>;
+
+/// So many calls of `next` may wait for their page.
+constexpr std::size_t kMaximumWaiting = 16;
+
+/// The listing itself; the capability holds it, and answers that come when it is gone are dropped.
+class ListingState : public std::enable_shared_from_this<ListingState> {
+ public:
+  /// Writes a page or an error as the answer of one `next`.
+  using Answer = std::function<void(const PageResponse* page, const NSErrorRef& error)>;
+
+  ListingState(ExtensionSupervisor& supervisor, ErrorExplainer explain, std::string container,
+               protocol::SortOrder order, std::chrono::milliseconds pageLimit)
+      : supervisor_(supervisor),
+        explain_(std::move(explain)),
+        container_(std::move(container)),
+        order_(order),
+        pageLimit_(pageLimit) {}
+
+  void next(Answer answer) {
+    waiting_.push_back(std::move(answer));
+    if (!hasStarted_) open();
+    serve();
+  }
+  [[nodiscard]] bool isFull() const { return waiting_.size() >= kMaximumWaiting; }
+
+ private:
+  void open();
+  void requestPage();
+  void didGetPage(PageResponse&& response);
+  void didNotGetPage(const kj::Exception& exception);
+  void fail(const NSErrorRef& error);
+  void serve();
+
+  ExtensionSupervisor& supervisor_;
+  const ErrorExplainer explain_;
+  const std::string container_;
+  const protocol::SortOrder order_;
+  const std::chrono::milliseconds pageLimit_;
+
+  bool hasStarted_ = false;
+  bool isComplete_ = false;  ///< the last page has been asked for and is here, or was handed out
+  NSErrorRef failure_;
+  std::string token_;  ///< of the next page; empty for the first
+  ipc::Remote<Enumerator> enumerator_;
+  kj::Maybe<PageResponse> ready_;
+  kj::Promise<void> request_ = nullptr;
+  std::deque<Answer> waiting_;
+};
+
+void ListingState::open() {
+  hasStarted_ = true;
+  const std::weak_ptr<ListingState> weak = weak_from_this();
+  supervisor_.acquire([weak](const ExtensionSessionRef& session, const NSErrorRef& error) {
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    if (session == nullptr) return self->fail(error);
+    session->openEnumerator(self->container_,
+                            [weak](ipc::Remote<Enumerator> enumerator, const NSErrorRef& failure) {
+                              const auto opened = weak.lock();
+                              if (opened == nullptr) return;
+                              if (!enumerator) return opened->fail(failure);
+                              opened->enumerator_ = std::move(enumerator);
+                              opened->requestPage();
+                            });
+  });
+}
+
+void ListingState::requestPage() {
+  auto request = enumerator_.client().enumerateItemsRequest();
+  auto page = request.initPage();
+  if (!token_.empty()) {
+    page.setToken(wireData(token_));
+  } else if (order_ == protocol::SortOrder::DATE) {
+    page.setInitialByDate();
+  } else {
+    page.setInitialByName();
+  }
+  auto& timer = ipc::EventLoop::shared().timer();
+  const auto weak = weak_from_this();
+  kj::Promise<PageResponse> response = request.send();
+  request_ = timer.timeoutAfter(pageLimit_.count() * kj::MILLISECONDS, kj::mv(response))
+                 .then(
+                     [weak](PageResponse&& got) {
+                       if (const auto self = weak.lock()) self->didGetPage(kj::mv(got));
+                     },
+                     [weak](kj::Exception&& exception) {
+                       if (const auto self = weak.lock()) self->didNotGetPage(exception);
+                     })
+                 .eagerlyEvaluate(nullptr);
+}
+
+void ListingState::didGetPage(PageResponse&& response) {
+  const auto result = response.getResult();
+  if (result.isError()) return fail(ipc::decodeError(result.getError()));
+  const auto next = result.getPage().getNext();
+  auto token = next.isValue() ? stringFromWire(next.getValue()) : std::string();
+  isComplete_ = token.empty();
+  if (!isComplete_ && token == token_) {
+    return fail(extensionUnavailableError("listed the same page again and again"));
+  }
+  token_ = std::move(token);
+  ready_ = kj::mv(response);
+  serve();
+}
+
+void ListingState::didNotGetPage(const kj::Exception& exception) {
+  if (exception.getType() != kj::Exception::Type::OVERLOADED) {
+    return fail(ipc::connectionError(exception));
+  }
+  supervisor_.suspect();
+  fail(ipc::connectionError(NSXPCConnectionTimedOut, "the extension takes too long for a page"));
+}
+
+void ListingState::fail(const NSErrorRef& error) {
+  explain_(error, [weak = weak_from_this()](NSErrorRef explained) {
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    self->failure_ = std::move(explained);
+    self->enumerator_ = nullptr;
+    self->serve();
+  });
+}
+
+void ListingState::serve() {
+  KJ_IF_MAYBE (page, ready_) {
+    if (waiting_.empty()) return;
+    const auto answer = std::move(waiting_.front());
+    waiting_.pop_front();
+    const PageResponse response = kj::mv(*page);
+    ready_ = nullptr;
+    if (isComplete_) {
+      enumerator_ = nullptr;
+    } else {
+      // Before this page is copied: zarn is at work on the next one meanwhile. Not from within the
+      // request's own continuation, which may not replace itself.
+      ipc::EventLoop::shared().post([weak = weak_from_this()] {
+        if (const auto self = weak.lock()) self->requestPage();
+      });
+    }
+    answer(&response, nullptr);
+    if (!isComplete_) return;
+  }
+  if (failure_ == nullptr && !(isComplete_ && ready_ == nullptr)) return;
+  for (const auto& answer : std::exchange(waiting_, {})) answer(nullptr, failure_);
+}
+
+class ListingServer final : public Listing::Server {
+ public:
+  explicit ListingServer(std::shared_ptr<ListingState> state) : state_(std::move(state)) {}
+
+ protected:
+  kj::Promise<void> next(NextContext context) override {
+    context.allowCancellation();
+    if (state_->isFull()) {
+      const auto error = invalidRequestError("too many pages were asked for at a time");
+      ipc::encodeError(error, context.getResults().initResult().initError());
+      return kj::READY_NOW;
+    }
+    auto pair = kj::newPromiseAndFulfiller<void>();
+    struct Pending {
+      NextContext context;
+      kj::Own<kj::PromiseFulfiller<void>> fulfiller;
+    };
+    auto pending = std::make_shared<Pending>(Pending{context, kj::mv(pair.fulfiller)});
+    state_->next([pending](const PageResponse* page, const NSErrorRef& error) {
+      // The context lives only while somebody waits for the answer.
+      if (!pending->fulfiller->isWaiting()) return;
+      write(page, error, pending->context);
+      pending->fulfiller->fulfill();
+    });
+    return kj::mv(pair.promise);
+  }
+
+ private:
+  static void write(const PageResponse* page, const NSErrorRef& error, NextContext& context) {
+    if (error != nullptr) {
+      return ipc::encodeError(error, context.getResults().initResult().initError());
+    }
+    if (page == nullptr) {
+      context.getResults().initResult().initPage();
+      return;
+    }
+    const auto from = page->getResult().getPage();
+    constexpr std::uint64_t kSlack = 32;
+    const auto size = page->totalSize();
+    auto to = context.getResults(capnp::MessageSize{size.wordCount + kSlack, 0});
+    auto out = to.initResult().initPage();
+    out.setItems(from.getItems());
+    out.setMore(from.getNext().isValue());
+  }
+
+  const std::shared_ptr<ListingState> state_;
+};
+
+}  // namespace
+
+protocol::Listing::Client makeListing(ExtensionSupervisor& supervisor, ErrorExplainer explain,
+                                      std::string container, protocol::SortOrder order,
+                                      std::chrono::milliseconds pageLimit) {
+  return kj::heap<ListingServer>(std::make_shared<ListingState>(
+      supervisor, std::move(explain), std::move(container), order, pageLimit));
+}
+
+}  // namespace yomber

@@ -152,8 +152,9 @@ void runStatus(CommandContext& context) {
 
 void addDriveCommands(CLI::App& app, CommandContext& context) {
   CLI::App* up = app.add_subcommand("up", "Start the drive and keep it running");
-  auto* foreground = up->add_flag("--foreground", "Stay, and end the drive when this command ends");
-  up->callback([&context, foreground] { runUp(context, foreground->count() > 0); });
+  auto foreground = std::make_shared<bool>(false);
+  up->add_flag("--foreground", *foreground, "Stay, and end the drive when this command ends");
+  up->callback([&context, foreground] { runUp(context, *foreground); });
 
   CLI::App* down = app.add_subcommand("down", "End the drive; its files stay");
   down->callback([&context] { runDown(context); });

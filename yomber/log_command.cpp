@@ -6,6 +6,7 @@
 #include <vector>
 
 #include <sys/inotify.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include "platform/foundation/log_level.h"

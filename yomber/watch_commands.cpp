@@ -22,7 +22,6 @@ namespace yomber {
 namespace {
 
 struct WatchOptions {
-  std::string where;
   bool listFirst = false;  ///< print what is there at the start as well
   bool once = false;       ///< end after the first listing
 };
@@ -30,7 +29,7 @@ struct WatchOptions {
 /// Prints each change as it comes. Lives on the loop thread, as all of its calls do.
 class ChangePrinter {
  public:
-  ChangePrinter(bool json, WatchOptions options) : json_(json), options_(std::move(options)) {}
+  ChangePrinter(bool json, WatchOptions options) : json_(json), options_(options) {}
 
   void listed(const std::vector<ItemFields>& items, bool last) {
     for (const ItemFields& item : items) {
@@ -167,8 +166,8 @@ NSErrorRef startWatch(const ipc::Remote<protocol::Control>& control, const NSFil
 }
 
 /// Watches until the host is lost or the user interrupts; the signal's default action ends us.
-void watchContainer(CommandContext& context, DriveClient& client, const NSFileProviderItemIdentifier& container,
-                    const WatchOptions& options) {
+void watchContainer(CommandContext& context, const NSFileProviderItemIdentifier& container, const WatchOptions& options) {
+  DriveClient client(context.paths());
   NSErrorRef error;
   const auto control = client.control(&error);
   if (error) return context.fail(error);
@@ -180,36 +179,29 @@ void watchContainer(CommandContext& context, DriveClient& client, const NSFilePr
   if (error) context.fail(error);
 }
 
-void runWatch(CommandContext& context, const WatchOptions& options) {
+void runWatch(CommandContext& context, const std::string& where, bool listFirst) {
   DriveClient client(context.paths());
   NSFileProviderItemIdentifier container;
-  if (NSErrorRef error = client.identifierFor(options.where, container)) return context.fail(error);
-  watchContainer(context, client, container, options);
-}
-
-void runWorkingSet(CommandContext& context, WatchOptions options) {
-  DriveClient client(context.paths());
-  options.listFirst = true;
-  watchContainer(context, client, NSFileProviderWorkingSetContainerItemIdentifier, options);
+  if (NSErrorRef error = client.identifierFor(where, container)) return context.fail(error);
+  watchContainer(context, container, {.listFirst = listFirst});
 }
 
 }  // namespace
 
 void addWatchCommands(CLI::App& app, CommandContext& context) {
   CLI::App* watch = app.add_subcommand("watch", "Print each change of a folder as it comes");
-  auto options = std::make_shared<WatchOptions>();
-  watch->add_option("item", options->where, "The folder; the drive's root when none is given");
-  watch->add_flag("--list", options->listFirst, "Print what is there first");
-  watch->callback([&context, options] { runWatch(context, *options); });
+  auto where = std::make_shared<std::string>();
+  auto listFirst = std::make_shared<bool>(false);
+  watch->add_option("item", *where, "The folder; the drive's root when none is given");
+  watch->add_flag("--list", *listFirst, "Print what is there first");
+  watch->callback([&context, where, listFirst] { runWatch(context, *where, *listFirst); });
 
   CLI::App* workingSet =
       app.add_subcommand("working-set", "Print the items that matter: favourite, tagged, shared, recently used");
-  auto workingSetOptions = std::make_shared<WatchOptions>();
-  workingSetOptions->once = true;
-  auto* follow = workingSet->add_flag("--follow", "Stay, and print each change as it comes");
-  workingSet->callback([&context, workingSetOptions, follow] {
-    workingSetOptions->once = follow->count() == 0;
-    runWorkingSet(context, *workingSetOptions);
+  auto follow = std::make_shared<bool>(false);
+  workingSet->add_flag("--follow", *follow, "Stay, and print each change as it comes");
+  workingSet->callback([&context, follow] {
+    watchContainer(context, NSFileProviderWorkingSetContainerItemIdentifier, {.listFirst = true, .once = !*follow});
   });
 }
 

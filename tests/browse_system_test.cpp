@@ -1,0 +1,149 @@
+#include <algorithm>
+#include <filesystem>
+#include <set>
+
+#include <sys/stat.h>
+#include <sys/xattr.h>
+
+#include <gtest/gtest.h>
+
+#include "tests/harness/test_drive.h"
+
+namespace yomber::testing {
+namespace {
+
+namespace fs = std::filesystem;
+
+class Browse : public ::testing::Test {
+ protected:
+  TestDrive drive_;
+};
+
+TEST_F(Browse, AnEmptyDriveListsNothing) {
+  drive_.up();
+  EXPECT_TRUE(drive_.names().empty());
+}
+
+TEST_F(Browse, NamesComeInNaturalOrderWithNumbersAsNumbers) {
+  for (const char* name : {"file 10", "file 9", "File 1", "apple", "Übung", "zebra"}) drive_.write(name);
+  drive_.up();
+  const std::vector<std::string> expected{"apple", "File 1", "file 9", "file 10", "Übung", "zebra"};
+  EXPECT_EQ(drive_.names(), expected);
+}
+
+TEST_F(Browse, ByDateTheNewestComesFirst) {
+  int age = 0;
+  for (const char* name : {"newest", "newer", "old"}) {
+    drive_.write(name);
+    fs::last_write_time(drive_.root() + "/" + name, fs::file_time_type::clock::now() - std::chrono::hours(age++));
+  }
+  drive_.up();
+  EXPECT_EQ(drive_.names("/", "date"), (std::vector<std::string>{"newest", "newer", "old"}));
+}
+
+TEST_F(Browse, AListingOfManyPagesHoldsEveryNameOnce) {
+  std::set<std::string> expected;
+  for (int number = 0; number < 1001; ++number) {
+    expected.insert("n" + std::to_string(number));
+    drive_.write("n" + std::to_string(number));
+  }
+  drive_.up();
+  for (const char* order : {"name", "date"}) {
+    const std::vector<std::string> names = drive_.names("/", order);
+    EXPECT_EQ(names.size(), expected.size()) << order;
+    EXPECT_EQ(std::set<std::string>(names.begin(), names.end()), expected) << order;
+  }
+}
+
+TEST_F(Browse, AnItemIsFoundBothWays) {
+  drive_.makeFolder("Plans");
+  drive_.write("Plans/house.txt", "four walls");
+  drive_.up();
+  const nlohmann::json found = drive_.json({"id", "Plans/house.txt"}).at(0);
+  const std::string identifier = found["id"];
+  EXPECT_TRUE(identifier.starts_with("d:"));
+  EXPECT_EQ(drive_.json({"url", identifier}).at(0)["location"], drive_.root() + "/Plans/house.txt");
+  const nlohmann::json item = drive_.json({"stat", identifier}).at(0);
+  EXPECT_EQ(item["name"], "house.txt");
+  EXPECT_EQ(item["size"], 10);
+  EXPECT_EQ(item["parent"], drive_.json({"id", "Plans"}).at(0)["id"]);
+}
+
+TEST_F(Browse, ABookmarkLeadsToItsTarget) {
+  drive_.makeFolder("Plans");
+  drive_.write("Plans/house.txt", "four walls");
+  fs::create_symlink("Plans/house.txt", drive_.root() + "/bookmark");
+  drive_.up();
+  EXPECT_EQ(drive_.json({"url", "bookmark"}).at(0)["location"], drive_.root() + "/Plans/house.txt");
+}
+
+TEST_F(Browse, SymbolicLinkLoopsAreListedAndFollowedByNobody) {
+  fs::create_symlink("b", drive_.root() + "/a");
+  fs::create_symlink("a", drive_.root() + "/b");
+  fs::create_directory_symlink(".", drive_.root() + "/self");
+  drive_.up();
+  EXPECT_EQ(drive_.names(), (std::vector<std::string>{"a", "b", "self"}));
+}
+
+TEST_F(Browse, EveryFolderOfTheDriveIsInTheListOfFolders) {
+  drive_.makeFolder("one/two/three");
+  drive_.up();
+  std::set<std::string> names;
+  for (const nlohmann::json& folder : drive_.json({"folders"})) names.insert(folder.at("name"));
+  for (const char* name : {"one", "two", "three"}) EXPECT_TRUE(names.contains(name)) << name;
+}
+
+TEST_F(Browse, AnUnknownItemIsSaidToBeUnknown) {
+  drive_.up();
+  EXPECT_EQ(drive_.yomber({"stat", "d:424242"}).exitCode, 66);
+  EXPECT_EQ(drive_.yomber({"stat", "no/such/file"}).exitCode, 66);
+  EXPECT_EQ(drive_.yomber({"ls", "i:424242"}).exitCode, 66);
+}
+
+TEST_F(Browse, LocationsOutsideTheDriveHaveNoItem) {
+  drive_.up();
+  EXPECT_NE(drive_.yomber({"id", "../../../../etc/passwd"}).exitCode, 0);
+}
+
+TEST_F(Browse, SignedOutNothingIsListedAndSigningInGoesOn) {
+  drive_.write("kept");
+  drive_.up();
+  ASSERT_EQ(drive_.yomber({"account", "sign-out"}).exitCode, 0);
+  const ProcessResult refused = drive_.yomber({"ls"});
+  EXPECT_EQ(refused.exitCode, 77) << refused.output << refused.errors;
+  EXPECT_TRUE(fs::exists(drive_.root() + "/kept"));
+  drive_.signIn();
+  EXPECT_EQ(drive_.names(), (std::vector<std::string>{"kept"}));
+}
+
+TEST_F(Browse, IdentifiersSurviveARestart) {
+  drive_.write("kept");
+  drive_.up();
+  const std::string before = drive_.json({"id", "kept"}).at(0)["id"];
+  drive_.down();
+  fs::rename(drive_.root() + "/kept", drive_.root() + "/renamed while down");
+  drive_.up();
+  EXPECT_EQ(drive_.json({"id", "renamed while down"}).at(0)["id"], before);
+}
+
+TEST_F(Browse, ATaggedItemIsInTheWorkingSet) {
+  drive_.write("plain");
+  drive_.write("tagged");
+  ASSERT_EQ(setxattr((drive_.root() + "/tagged").c_str(), "user.xdg.tags", "red", 3, 0), 0);
+  drive_.up();
+  const auto members = drive_.json({"working-set"});
+  ASSERT_EQ(members.size(), 1U);
+  EXPECT_EQ(members[0]["item"]["name"], "tagged");
+}
+
+TEST_F(Browse, TheDriveCanBeTakenDownTwiceAndUpTwice) {
+  drive_.up();
+  EXPECT_EQ(drive_.yomber({"up"}).exitCode, 0);
+  EXPECT_EQ(drive_.yomber({"down"}).exitCode, 0);
+  EXPECT_EQ(drive_.yomber({"down"}).exitCode, 0);
+  EXPECT_EQ(drive_.yomber({"ls"}).exitCode, 69);
+  drive_.up();
+}
+
+}  // namespace
+}  // namespace yomber::testing

@@ -1,0 +1,150 @@
+#include "tests/harness/test_drive.h"
+
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "platform/ostrell/constants.h"
+
+namespace yomber::testing {
+
+namespace fs = std::filesystem;
+
+std::string programPath(const std::string& name) {
+  if (const char* build = std::getenv("YOMBER_BUILD_DIR")) return std::string(build) + "/bin/" + name;
+  return (fs::read_symlink("/proc/self/exe").parent_path() / name).string();
+}
+
+namespace {
+
+/// The pid of the child of `parent` whose program has that name.
+std::optional<pid_t> childNamed(pid_t parent, const std::string& program) {
+  std::error_code failure;
+  for (const auto& task : fs::directory_iterator("/proc/" + std::to_string(parent) + "/task", failure)) {
+    std::ifstream children(task.path() / "children");
+    for (pid_t child = 0; children >> child;) {
+      const fs::path executable = fs::read_symlink("/proc/" + std::to_string(child) + "/exe", failure);
+      if (!failure && executable.filename() == program) return child;
+    }
+  }
+  return std::nullopt;
+}
+
+}  // namespace
+
+TestDrive::TestDrive() {
+  std::string pattern = (fs::temp_directory_path() / "yomber.XXXXXX").string();
+  directory_ = mkdtemp(pattern.data());
+  home_ = directory_ + "/home";
+  root_ = home_ + "/tree/" + QSUbiquitousDefaultContainerID + "/Documents";
+  for (const std::string& place : {home_, home_ + "/tree", home_ + "/tree/" + QSUbiquitousDefaultContainerID, root_}) {
+    fs::create_directory(place);
+    fs::permissions(place, fs::perms::owner_all);
+  }
+  fs::create_directories(directory_ + "/data/applications");
+  // Nothing of the machine's own: sockets, applications and settings are the test's.
+  environment_ = {{"YOMBER_HOME", home_},
+                  {"XDG_RUNTIME_DIR", ""},
+                  {"XDG_DATA_HOME", directory_ + "/data"},
+                  {"XDG_DATA_DIRS", directory_ + "/data"},
+                  {"HOME", directory_}};
+}
+
+TestDrive::~TestDrive() {
+  if (up_) down();
+  if (::testing::Test::HasFailure()) {
+    const ProcessResult log = yomber({"log", "--lines", "60"});
+    std::cerr << "--- the drive's log\n" << log.output << log.errors;
+  }
+  std::error_code failure;
+  fs::remove_all(directory_, failure);
+}
+
+void TestDrive::up() {
+  up_ = true;
+  const ProcessResult started = yomber({"up"});
+  ASSERT_EQ(started.exitCode, 0) << started.errors;
+  signIn();
+}
+
+void TestDrive::signIn() {
+  const ProcessResult signedIn = yomber({"account", "sign-in", "ada"});
+  ASSERT_EQ(signedIn.exitCode, 0) << signedIn.errors;
+}
+
+void TestDrive::down() {
+  up_ = false;
+  const ProcessResult ended = yomber({"down"});
+  EXPECT_EQ(ended.exitCode, 0) << ended.errors;
+}
+
+std::vector<std::string> TestDrive::commandLine(const std::vector<std::string>& arguments) const {
+  std::vector<std::string> words{programPath("yomber")};
+  words.insert(words.end(), arguments.begin(), arguments.end());
+  return words;
+}
+
+ProcessResult TestDrive::yomber(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const {
+  return runProcess(commandLine(arguments), environment_, limit);
+}
+
+std::vector<nlohmann::json> TestDrive::json(const std::vector<std::string>& arguments) const {
+  std::vector<std::string> words{"--json"};
+  words.insert(words.end(), arguments.begin(), arguments.end());
+  const ProcessResult result = yomber(words);
+  EXPECT_EQ(result.exitCode, 0) << result.errors;
+  std::vector<nlohmann::json> lines;
+  std::istringstream output(result.output);
+  for (std::string line; std::getline(output, line);) lines.push_back(nlohmann::json::parse(line));
+  return lines;
+}
+
+std::vector<std::string> TestDrive::names(const std::string& folder, const std::string& sort) const {
+  std::vector<std::string> names;
+  for (const nlohmann::json& item : json({"ls", folder, "--sort", sort})) names.push_back(item.at("name"));
+  return names;
+}
+
+nlohmann::json TestDrive::status() const {
+  const ProcessResult result = yomber({"--json", "status"});
+  return nlohmann::json::parse(result.output, nullptr, false);
+}
+
+pid_t TestDrive::pidOf(Process process) const {
+  std::optional<pid_t> found;
+  eventually([&] {
+    const nlohmann::json now = status();
+    if (!now.is_object() || !now.contains("supervisor")) return false;
+    const pid_t supervisor = now["supervisor"]["pid"];
+    if (process == Process::Zarn) {
+      found = childNamed(supervisor, "zarn");
+    } else {
+      const auto host = childNamed(supervisor, "fileproviderd");
+      found = process == Process::Host || !host ? host : childNamed(*host, "qs-fileprovider");
+    }
+    return found.has_value();
+  });
+  EXPECT_TRUE(found.has_value()) << "the process is not there";
+  return found.value_or(-1);
+}
+
+void TestDrive::kill(Process process) const {
+  const pid_t pid = pidOf(process);
+  if (pid > 0) ::kill(pid, SIGKILL);
+}
+
+void TestDrive::write(const std::string& relativePath, const std::string& content) const {
+  std::ofstream file(root_ + "/" + relativePath, std::ios::binary | std::ios::trunc);
+  file << content;
+  ASSERT_TRUE(file.good()) << relativePath;
+}
+
+void TestDrive::makeFolder(const std::string& relativePath) const { fs::create_directories(root_ + "/" + relativePath); }
+
+}  // namespace yomber::testing

@@ -1,0 +1,362 @@
+#include "zarn/tree_observer.h"
+
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <thread>
+#include <utility>
+
+#include "platform/foundation/fault_points.h"
+#include "platform/foundation/lock.h"
+#include "platform/foundation/log.h"
+#include "platform/ipc/unix_socket.h"
+#include "zarn/dirty_folders.h"
+#include "zarn/watch_table.h"
+
+namespace yomber {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+constexpr unsigned kMaximumRetryFactor = 64;
+constexpr std::size_t kUnwatchedSlice = 128;
+
+}  // namespace
+
+class TreeObserver::State {
+ public:
+  explicit State(Options options)
+      : options_(options),
+        wakeReader_(eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)),
+        watches_(options.watchLimit),
+        queueDescriptor_(watches_.descriptor()),
+        dirty_(options.modifyInterval) {}
+
+  void start(ObservedTree tree) {
+    tree_ = std::move(tree);
+    reader_ = std::thread([this] { readEvents(); });
+    scanner_ = std::thread([this] { scanWhenDue(); });
+  }
+
+  void stop() {
+    {
+      LockGuard guard(mutex_);
+      stopping_ = true;
+      changed_.notifyAll();
+    }
+    const std::uint64_t one = 1;
+    (void)!write(wakeReader_.get(), &one, sizeof one);
+    if (reader_.joinable()) reader_.join();
+    if (scanner_.joinable()) scanner_.join();
+  }
+
+  void requestFullScan() {
+    LockGuard guard(mutex_);
+    fullScanDue_ = true;
+    changed_.notifyAll();
+  }
+
+  Status status() const {
+    LockGuard guard(mutex_);
+    return {.watchedFolders = watches_.watched(),
+            .unwatchedFolders = watches_.unwatched().size(),
+            .advice = watches_.advice(),
+            .scanning = fullScanDue_ || fullScanRunning_,
+            .lastFailure = lastFailure_};
+  }
+
+  void willReadFolder(std::uint64_t visit, int descriptor) {
+    LockGuard guard(mutex_);
+    watches_.willRead(visit, descriptor);
+  }
+
+  void didIdentifyFolder(std::uint64_t visit, std::uint64_t id) {
+    LockGuard guard(mutex_);
+    if (watches_.didIdentify(visit, id)) {
+      dirty_.noteWhole(id);
+      changed_.notifyAll();
+    }
+    if (!fullScanRunning_) sayAdvice();
+  }
+
+  void committed(const std::vector<ItemChange>& changes) {
+    LockGuard guard(mutex_);
+    for (const auto& change : changes) {
+      if (!change.isDead() || !change.row.isFolder()) continue;
+      watches_.forget(change.row.id);
+      dirty_.forget(change.row.id);
+    }
+    if (watches_.unwatched().empty()) saidAdvice_ = false;
+  }
+
+ private:
+  // --- The reading thread.
+
+  void readEvents() {
+    const ipc::UniqueFd poll(epoll_create1(EPOLL_CLOEXEC));
+    for (const int descriptor : {wakeReader_.get(), queueDescriptor_}) {
+      epoll_event interest{.events = EPOLLIN, .data = {.fd = descriptor}};
+      if (descriptor >= 0) epoll_ctl(poll.get(), EPOLL_CTL_ADD, descriptor, &interest);
+    }
+    while (!isStopping()) {
+      epoll_event ready{};
+      if (epoll_wait(poll.get(), &ready, 1, -1) != 1 || ready.data.fd != queueDescriptor_) continue;
+      static FaultPoint beforeRead("zarn.observer.before-read");
+      (void)beforeRead.hit();
+      drainQueue();
+    }
+  }
+
+  void drainQueue() {
+    alignas(inotify_event) std::array<char, 65536> buffer;
+    for (;;) {
+      const ssize_t length = read(queueDescriptor_, buffer.data(), buffer.size());
+      if (length <= 0) return;
+      const auto now = Clock::now();
+      LockGuard guard(mutex_);
+      for (std::size_t at = 0; at < static_cast<std::size_t>(length);) {
+        inotify_event event;
+        std::memcpy(&event, buffer.data() + at, sizeof event);
+        handle(event, buffer.data() + at + sizeof event, now);
+        at += sizeof event + event.len;
+      }
+      changed_.notifyAll();
+    }
+  }
+
+  void handle(const inotify_event& event, const char* name, Clock::time_point now)
+      REQUIRES(mutex_) {
+    if ((event.mask & IN_Q_OVERFLOW) != 0) return handleOverflow();
+    const auto folder = watches_.folderOfEvent(event.wd);
+    if ((event.mask & IN_IGNORED) != 0) return watches_.didDrop(event.wd);
+    if ((event.mask & IN_UNMOUNT) != 0) {
+      log_error(defaultLog(), "[ERROR] the drive's file system was unmounted");
+      return;
+    }
+    if (!folder) return;
+    if (event.len == 0) return handleFolderItself(event, *folder);
+    handleEntry(event, *folder, std::string_view(name), now);
+  }
+
+  void handleOverflow() REQUIRES(mutex_) {
+    log_default(defaultLog(), "[NOTICE] changes came faster than they could be read, scanning all");
+    fullScanDue_ = true;
+    dirty_.clear();
+  }
+
+  /// The deletion of a folder shows in its parent; but the drive's own roots have none.
+  void handleFolderItself(const inotify_event& event, std::uint64_t folder) REQUIRES(mutex_) {
+    if (folder < kFirstIssuedID && (event.mask & IN_DELETE_SELF) != 0) fullScanDue_ = true;
+  }
+
+  void handleEntry(const inotify_event& event, std::uint64_t folder, std::string_view name,
+                   Clock::time_point now) REQUIRES(mutex_) {
+    if ((event.mask & ~std::uint32_t{IN_ISDIR}) == IN_MODIFY) {
+      return dirty_.noteModify(folder, name, now);
+    }
+    if ((event.mask & IN_MOVED_FROM) != 0) dirty_.noteMovedFrom(event.cookie, now);
+    if ((event.mask & IN_MOVED_TO) != 0) dirty_.noteMovedTo(event.cookie);
+    dirty_.noteName(folder, name);
+  }
+
+  /// While the whole tree is scanned it is not known yet how many watches are missing.
+  void sayAdvice() REQUIRES(mutex_) {
+    if (watches_.unwatched().empty() || std::exchange(saidAdvice_, true)) return;
+    log_error(defaultLog(), "[ERROR] %@", watches_.advice());
+    changed_.notifyAll();
+  }
+
+  bool isStopping() const {
+    LockGuard guard(mutex_);
+    return stopping_;
+  }
+
+  // --- The scanning thread.
+
+  struct Task {
+    enum class Kind { Stop, All, Dirty, Unwatched };
+    Kind kind = Kind::Stop;
+    std::vector<DirtyFolder> dirty;
+  };
+
+  void scanWhenDue() {
+    for (;;) {
+      Task task = nextTask();
+      switch (task.kind) {
+        case Task::Kind::Stop:
+          return;
+        case Task::Kind::All:
+          scanAll();
+          break;
+        case Task::Kind::Dirty:
+          scanDirty(task.dirty);
+          break;
+        case Task::Kind::Unwatched:
+          scanUnwatched(task.dirty);
+          break;
+      }
+    }
+  }
+
+  Task nextTask() {
+    LockGuard guard(mutex_);
+    for (;;) {
+      if (stopping_) return {};
+      const auto now = Clock::now();
+      const auto fullScan = fullScanDue_ ? notBefore_ : Clock::time_point::max();
+      const auto dirty = fullScanDue_ ? Clock::time_point::max() : dirtyTime();
+      const auto unwatched =
+          fullScanDue_ || watches_.unwatched().empty() ? Clock::time_point::max() : nextUnwatched_;
+      if (fullScan <= now) return fullScanTask();
+      if (dirty <= now) return {.kind = Task::Kind::Dirty, .dirty = dirty_.take(now)};
+      if (unwatched <= now) return unwatchedTask();
+      const auto next = std::min({fullScan, dirty, unwatched});
+      if (next == Clock::time_point::max()) {
+        changed_.wait(mutex_);
+      } else {
+        changed_.waitUntil(mutex_, next);
+      }
+    }
+  }
+
+  Clock::time_point dirtyTime() const REQUIRES(mutex_) {
+    const auto due = dirty_.dueTime();
+    return due ? std::max(*due, notBefore_) : Clock::time_point::max();
+  }
+
+  Task fullScanTask() REQUIRES(mutex_) {
+    fullScanDue_ = false;
+    fullScanRunning_ = true;
+    dirty_.clear();
+    return {.kind = Task::Kind::All, .dirty = {}};
+  }
+
+  /// A slice of a round over the folders without a watch, so that live changes need not wait for
+  /// all of it.
+  Task unwatchedTask() REQUIRES(mutex_) {
+    if (unwatchedRound_.empty()) {
+      unwatchedRound_.assign(watches_.unwatched().begin(), watches_.unwatched().end());
+      unwatchedCost_ = {};
+    }
+    Task task{.kind = Task::Kind::Unwatched, .dirty = {}};
+    while (!unwatchedRound_.empty() && task.dirty.size() < kUnwatchedSlice) {
+      task.dirty.push_back({.id = unwatchedRound_.back(), .isWhole = true, .names = {}});
+      unwatchedRound_.pop_back();
+    }
+    return task;
+  }
+
+  void scanAll() {
+    NSErrorRef error = tree_.scanAll();
+    const bool failed = error != nullptr;
+    noteOutcome(std::move(error), "the scan of the tree");
+    {
+      LockGuard guard(mutex_);
+      fullScanRunning_ = false;
+      if (failed) fullScanDue_ = true;
+      sayAdvice();
+      nextUnwatched_ = Clock::now() + options_.unwatchedInterval;
+    }
+    if (!failed && !std::exchange(finishedFirstScan_, true) && tree_.didFinishFirstScan) {
+      tree_.didFinishFirstScan();
+    }
+  }
+
+  void scanDirty(const std::vector<DirtyFolder>& dirty) {
+    if (dirty.empty()) return;
+    NSErrorRef error = tree_.scanDirty(dirty);
+    const bool failed = error != nullptr;
+    noteOutcome(std::move(error), "the scan of changed folders");
+    if (!failed) return;
+    LockGuard guard(mutex_);
+    for (const auto& folder : dirty) putBack(folder);
+  }
+
+  void putBack(const DirtyFolder& folder) REQUIRES(mutex_) {
+    if (folder.isWhole) dirty_.noteWhole(folder.id);
+    for (const auto& name : folder.names) dirty_.noteName(folder.id, name);
+  }
+
+  /// The more a round costs, the rarer it comes.
+  void scanUnwatched(const std::vector<DirtyFolder>& folders) {
+    const auto before = Clock::now();
+    noteOutcome(tree_.scanDirty(folders), "the scan of folders without a watch");
+    const auto after = Clock::now();
+    LockGuard guard(mutex_);
+    unwatchedCost_ += after - before;
+    if (unwatchedRound_.empty()) {
+      nextUnwatched_ = after + std::max<Clock::duration>(
+                                   options_.unwatchedInterval,
+                                   unwatchedCost_ * options_.unwatchedCostFactor);
+    }
+    if (watches_.unwatched().empty() && std::exchange(saidAdvice_, false)) {
+      log_default(defaultLog(), "[NOTICE] every folder is watched again");
+    }
+  }
+
+  /// Decides when the next scan may start; a failure is logged when it is not the last one again.
+  void noteOutcome(NSErrorRef error, const char* what) {
+    LockGuard guard(mutex_);
+    if (!error) {
+      retryFactor_ = 1;
+      lastFailure_ = nullptr;
+      notBefore_ = Clock::now() + options_.batchInterval;
+      return;
+    }
+    const bool isSame = lastFailure_ && lastFailure_->is(error->domain(), error->code());
+    if (!isSame) {
+      log_error(defaultLog(), "[ERROR] %s failed, trying again: %@", what, error);
+    }
+    notBefore_ = Clock::now() + options_.retryInterval * retryFactor_;
+    retryFactor_ = std::min(retryFactor_ * 2, kMaximumRetryFactor);
+    lastFailure_ = std::move(error);
+  }
+
+  const Options options_;
+  ObservedTree tree_;  // constant once started
+  const ipc::UniqueFd wakeReader_;
+
+  mutable Mutex mutex_;
+  Condition changed_;
+  WatchTable watches_ GUARDED_BY(mutex_);
+  const int queueDescriptor_;
+  DirtyFolders dirty_ GUARDED_BY(mutex_);
+  bool stopping_ GUARDED_BY(mutex_) = false;
+  bool fullScanDue_ GUARDED_BY(mutex_) = true;
+  bool fullScanRunning_ GUARDED_BY(mutex_) = false;
+  bool saidAdvice_ GUARDED_BY(mutex_) = false;
+  NSErrorRef lastFailure_ GUARDED_BY(mutex_);
+  unsigned retryFactor_ GUARDED_BY(mutex_) = 1;
+  Clock::time_point notBefore_ GUARDED_BY(mutex_) = Clock::time_point::min();
+  Clock::time_point nextUnwatched_ GUARDED_BY(mutex_) = Clock::time_point::min();
+  std::vector<std::uint64_t> unwatchedRound_ GUARDED_BY(mutex_);  // still to be scanned
+  Clock::duration unwatchedCost_ GUARDED_BY(mutex_){};            // of the round so far
+
+  bool finishedFirstScan_ = false;  // scanning thread only
+  std::thread reader_;
+  std::thread scanner_;
+};
+
+TreeObserver::TreeObserver(Options options) : state_(std::make_unique<State>(options)) {}
+TreeObserver::~TreeObserver() { stop(); }
+void TreeObserver::start(ObservedTree tree) { state_->start(std::move(tree)); }
+void TreeObserver::stop() { state_->stop(); }
+void TreeObserver::requestFullScan() { state_->requestFullScan(); }
+TreeObserver::Status TreeObserver::status() const { return state_->status(); }
+
+void TreeObserver::willReadFolder(std::uint64_t visit, int descriptor) {
+  state_->willReadFolder(visit, descriptor);
+}
+void TreeObserver::didIdentifyFolder(std::uint64_t visit, std::uint64_t id) {
+  state_->didIdentifyFolder(visit, id);
+}
+void TreeObserver::committed(const std::vector<ItemChange>& changes) {
+  state_->committed(changes);
+}
+
+}  // namespace yomber

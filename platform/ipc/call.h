@@ -31,8 +31,9 @@ using RequestMethod =
 /// Calls `method` of `remote`.
 ///
 /// `fill` writes the parameters. `onReply(transportError, results)` is called exactly once: with nil
-/// and the results, which are valid during the call only, or with an error and null. It is never
-/// called before `call` returns, except when `call` itself runs on the loop thread.
+/// and the results, which are valid during the call only, or with an error and null. When `call` runs
+/// on the loop thread, that is after it has returned. Calls that one thread makes on one remote
+/// arrive in order.
 template <typename Interface, typename Client, typename Params, typename Results, typename Fill,
           typename OnReply>
 CallHandle call(const Remote<Interface>& remote, RequestMethod<Client, Params, Results> method,
@@ -51,6 +52,7 @@ NSErrorRef callAndWait(const Remote<Interface>& remote,
                        RequestMethod<Client, Params, Results> method, Fill&& fill, Decode&& decode,
                        CallOptions options = {}) {
   EventLoop::shared().assertElsewhere("callAndWait");
+  if (!remote) return detail::noConnectionError();
   Gate done;
   NSErrorRef failure;
   using Reader = typename Results::Reader;

@@ -71,10 +71,9 @@ class Connection {
 
  private:
   struct Link;
-  enum class Handshake : std::uint8_t { None, Credentials };
 
-  Connection();
-  static Ref open(UniqueFd socket, Handshake handshake, Bootstrap bootstrap);
+  explicit Connection(std::shared_ptr<Link> link);
+  static Ref open(UniqueFd socket, bool proveUser, Bootstrap bootstrap);
   static capnp::Capability::Client peerBootstrap(Link& link);
 
   std::shared_ptr<Link> link_;

@@ -13,12 +13,16 @@ namespace yomber::ipc {
 /// Many deadlines behind one timer. Calls nearly always end long before theirs, so adding and
 /// removing one touches no timer: the timer looks again when the earliest it knew of has come.
 ///
-/// Loop thread only.
+/// Loop thread only. Its entries must be gone before it is.
 class Deadlines {
  public:
   using Clock = std::chrono::steady_clock;
-  using Map = std::multimap<Clock::time_point, std::function<void()>>;
 
+ private:
+  struct Pending;
+  using Map = std::multimap<Clock::time_point, Pending>;
+
+ public:
   /// One deadline; removed with its owner.
   class Entry {
    public:
@@ -34,20 +38,27 @@ class Deadlines {
     Map::iterator position_;
   };
 
-  explicit Deadlines(kj::Timer& timer) : timer_(timer) {}
+  explicit Deadlines(kj::Timer& timer);
 
   /// Calls `onExpiry` on the loop thread when `delay` has passed, unless `entry` is cleared first.
   void set(Entry& entry, std::chrono::milliseconds delay, std::function<void()> onExpiry);
 
  private:
-  void arm();
-  void expire();
+  struct Pending {
+    Entry* entry;
+    std::function<void()> onExpiry;
+  };
+
+  kj::Promise<void> watch();
+  void expireDue();
 
   kj::Timer& timer_;
   Map entries_;
-  /// When the timer that runs fires; nothing when none runs.
-  std::optional<Clock::time_point> armedFor_;
-  kj::Promise<void> wait_ = nullptr;
+  /// When `watch` looks again; nothing when it waits for a first entry.
+  std::optional<Clock::time_point> watchedFor_;
+  /// Makes `watch` look again now.
+  kj::Own<kj::PromiseFulfiller<void>> lookAgain_;
+  kj::Promise<void> task_;
 };
 
 }  // namespace yomber::ipc

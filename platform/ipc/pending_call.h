@@ -25,6 +25,8 @@ namespace detail {
 class PendingCall;
 /// What the exception that is being handled says about a reply or a request.
 NSErrorRef currentReplyError();
+/// What a call on nil gets.
+NSErrorRef noConnectionError();
 }  // namespace detail
 
 /// Names a call that was made, so that it can be given up. Copies name the same call; keeping one
@@ -49,7 +51,7 @@ namespace detail {
 /// A call on its way. Loop thread only once started; it keeps itself alive until it is over.
 class PendingCall : public std::enable_shared_from_this<PendingCall> {
  public:
-  static CallHandle start(const std::shared_ptr<PendingCall>& call);
+  static CallHandle start(std::shared_ptr<PendingCall> call);
   /// Ends the call with `error` unless it is over.
   void giveUp(NSErrorRef error);
 
@@ -99,7 +101,7 @@ class MethodCall final : public PendingCall {
 
  private:
   kj::Promise<void> send() override {
-    if (!remote_) throw connectionError(NSXPCConnectionInvalid, "There is no connection.");
+    if (!remote_) throw noConnectionError();
     typename Interface::Client& client = remote_.client();
     auto request = (client.*method_)(nullptr);
     (*fill_)(static_cast<typename Params::Builder&>(request));

@@ -2,6 +2,7 @@
 
 #include <sys/types.h>
 
+#include <optional>
 #include <string>
 #include <utility>
 
@@ -30,6 +31,13 @@ class UniqueFd {
   int fd_ = -1;
 };
 
+/// Who is at the other end, as the kernel says.
+struct PeerCredentials {
+  pid_t pid = 0;
+  uid_t uid = 0;
+  gid_t gid = 0;
+};
+
 /// Another descriptor of the same open file, closed on exec. Empty with an error when there is none
 /// left.
 UniqueFd duplicateDescriptor(int fd, NSErrorRef* error = nullptr);
@@ -39,11 +47,19 @@ UniqueFd duplicateDescriptor(int fd, NSErrorRef* error = nullptr);
 /// (Connection::adopt) on either side.
 bool makeSocketPair(UniqueFd& first, UniqueFd& second, NSErrorRef* error = nullptr);
 
-/// Who is at the other end, as the kernel says.
-struct PeerCredentials {
-  pid_t pid = 0;
-  uid_t uid = 0;
-  gid_t gid = 0;
-};
+/// Who made the connection's other end. Nothing when `fd` is no connected Unix socket.
+std::optional<PeerCredentials> peerCredentials(int fd);
+/// Whether descriptors, of which there are none left, are what `number` says.
+[[nodiscard]] bool isDescriptorShortage(int number);
+
+/// A blocking stream socket, closed on exec, connected to the listener at `path`. Waits at most
+/// `kConnectSeconds` for a place in its queue. Empty with an error that names the path.
+UniqueFd connectUnixSocket(const std::string& path, NSErrorRef* error);
+inline constexpr int kConnectSeconds = 5;
+
+/// A non-blocking listening socket at `path`, mode 0600. A socket there on which nobody answers is
+/// replaced; one on which somebody does, and anything that is no socket, is left alone. Empty with
+/// an error that names the path.
+UniqueFd listenUnixSocket(const std::string& path, NSErrorRef* error);
 
 }  // namespace yomber::ipc

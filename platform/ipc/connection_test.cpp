@@ -1,0 +1,288 @@
+#include "platform/ipc/connection.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include "platform/ipc/call.h"
+#include "platform/ipc/listener.h"
+#include "platform/ipc/message_stream.h"
+#include "platform/ipc/test_echo_server.h"
+
+namespace yomber::ipc {
+namespace {
+
+using test::Echo;
+using test::EchoPair;
+
+constexpr uid_t kNobody = 65534;
+
+/// The reason that a connection ends for.
+class EndWatch {
+ public:
+  explicit EndWatch(const Connection::Ref& connection) {
+    connection->onDisconnect([this](NSErrorRef error) {
+      reason_ = std::move(error);
+      ends_.add();
+    });
+  }
+  NSErrorRef reason() {
+    EXPECT_TRUE(ends_.waitFor(1)) << "the connection did not end";
+    return reason_;
+  }
+  [[nodiscard]] std::uint64_t count() const { return ends_.value(); }
+
+ private:
+  test::Tally ends_;
+  NSErrorRef reason_;
+};
+
+Connection::Bootstrap echoes(const test::EchoStateRef& state) {
+  return [state] { return test::makeEcho(state); };
+}
+
+TEST(Connection, ConnectingToNothingNamesThePathAndSaysWhatToDo) {
+  test::TemporaryDirectory directory;
+  for (const std::string& path : {directory.file("nothing"), directory.file("no/directory")}) {
+    NSErrorRef error;
+    EXPECT_EQ(Connection::connect(path, &error), nullptr);
+    ASSERT_NE(error, nullptr);
+    EXPECT_NE(error->localizedDescription().find(path), std::string::npos);
+    EXPECT_NE(error->localizedDescription().find("yomber up"), std::string::npos);
+  }
+}
+
+TEST(Connection, ConnectAsyncAnswersOnAnotherThread) {
+  test::TemporaryDirectory directory;
+  const auto state = std::make_shared<test::EchoState>();
+  const auto listener = Listener::listen(
+      directory.file("s"), [&](const PeerCredentials&) { return test::makeEcho(state); });
+  ASSERT_NE(listener, nullptr);
+  for (const bool good : {true, false}) {
+    Gate done;
+    Connection::Ref connection;
+    NSErrorRef error;
+    Connection::connectAsync(directory.file(good ? "s" : "t"), [&](auto made, auto failure) {
+      connection = std::move(made);
+      error = std::move(failure);
+      done.open();
+    });
+    done.wait();
+    EXPECT_EQ(connection != nullptr, good);
+    EXPECT_EQ(error == nullptr, good);
+    if (good) {
+      EXPECT_TRUE(test::echoes(connection->bootstrap<Echo>(), 1));
+    }
+  }
+}
+
+TEST(Connection, BothEndsOfAPairMayExport) {
+  const auto left = std::make_shared<test::EchoState>();
+  const auto right = std::make_shared<test::EchoState>();
+  UniqueFd first;
+  UniqueFd second;
+  ASSERT_TRUE(makeSocketPair(first, second));
+  const auto one = Connection::adopt(first.release(), echoes(left));
+  const auto two = Connection::adopt(second.release(), echoes(right));
+  ASSERT_NE(one, nullptr);
+  ASSERT_NE(two, nullptr);
+  std::thread other([&] {
+    for (std::uint64_t i = 0; i < 50; ++i) EXPECT_TRUE(test::echoes(two->bootstrap<Echo>(), i));
+  });
+  for (std::uint64_t i = 0; i < 50; ++i) EXPECT_TRUE(test::echoes(one->bootstrap<Echo>(), i));
+  other.join();
+}
+
+TEST(Connection, AnEndThatExportsNothingFailsCallsOnly) {
+  EchoPair pair;
+  EXPECT_NE(test::echoOnce(pair.server->bootstrap<Echo>()), nullptr);
+  EXPECT_TRUE(test::echoes(pair.echo, 1));
+}
+
+TEST(Connection, AdoptTakesOnlyUnixSockets) {
+  UniqueFd pipe = test::pipeHolding("");
+  NSErrorRef error;
+  EXPECT_EQ(Connection::adopt(pipe.release(), {}, &error), nullptr);
+  EXPECT_NE(error, nullptr);
+}
+
+TEST(Connection, AdoptingAnAbandonedEndIsAnError) {
+  UniqueFd first;
+  UniqueFd second;
+  ASSERT_TRUE(makeSocketPair(first, second));
+  second.reset();
+  NSErrorRef error;
+  EXPECT_EQ(Connection::adopt(first.release(), {}, &error), nullptr);
+  EXPECT_TRUE(test::isCocoaError(error, NSXPCConnectionInterrupted));
+}
+
+TEST(Connection, TheEndIsToldOnceAndToLateComersToo) {
+  EchoPair pair;
+  EndWatch early(pair.client);
+  ASSERT_TRUE(test::echoes(pair.echo, 1));
+  pair.server = nullptr;
+  EXPECT_TRUE(test::isCocoaError(early.reason(), NSXPCConnectionInterrupted));
+  EXPECT_FALSE(pair.client->isConnected());
+  EndWatch late(pair.client);
+  EXPECT_EQ(late.reason(), early.reason());
+  EXPECT_EQ(early.count(), 1U);
+}
+
+TEST(Connection, ClosingHereIsInvalidation) {
+  EchoPair pair;
+  EndWatch watch(pair.client);
+  EXPECT_TRUE(pair.client->isConnected());
+  pair.client->close();
+  EXPECT_FALSE(pair.client->isConnected());
+  EXPECT_TRUE(test::isCocoaError(watch.reason(), NSXPCConnectionInvalid));
+  pair.client->close();
+  EXPECT_TRUE(test::isCocoaError(test::echoOnce(pair.echo), NSXPCConnectionInterrupted));
+}
+
+TEST(Connection, WhatWasAnsweredBeforeClosingStillArrives) {
+  for (int round = 0; round < 20; ++round) {
+    EchoPair pair;
+    test::Tally replies;
+    bool answered = false;
+    EventLoop::shared().runAndWait([&] {
+      call(pair.echo, &Echo::Client::echoRequest, [](auto) {},
+           [&](const NSErrorRef& error, const Echo::EchoResults::Reader*) {
+             answered = error == nullptr;
+             replies.add();
+           });
+    });
+    ASSERT_TRUE(replies.waitFor(1));
+    pair.server->close();
+    EXPECT_TRUE(answered);
+  }
+}
+
+/// Runs `child` in a process of another user; answers what it exits with.
+template <typename Child>
+int asNobody(Child child) {
+  const pid_t pid = ::fork();
+  if (pid == 0) {
+    if (::setgid(kNobody) != 0 || ::setuid(kNobody) != 0) ::_exit(99);
+    ::_exit(child());
+  }
+  int status = 0;
+  ::waitpid(pid, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+TEST(Connection, AnotherUsersEndIsRefusedBeforeAnythingIsParsed) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to become another user";
+  UniqueFd ours;
+  UniqueFd theirs;
+  ASSERT_TRUE(makeSocketPair(ours, theirs));
+  const auto state = std::make_shared<test::EchoState>();
+  const auto connection = Connection::adopt(ours.release(), echoes(state));
+  ASSERT_NE(connection, nullptr);
+  EndWatch watch(connection);
+  const auto echo = connection->bootstrap<Echo>();
+  test::Tally replies;
+  NSErrorRef callError;
+  call(echo, &Echo::Client::echoRequest, [](auto) {},
+       [&](NSErrorRef error, const Echo::EchoResults::Reader*) {
+         callError = std::move(error);
+         replies.add();
+       });
+  EXPECT_EQ(asNobody([&] {
+              if (MessageStream::sendCredentials(theirs.get()) != 0) return 1;
+              // Our half of the handshake is all that it may ever read.
+              char bytes[64];
+              ssize_t total = 0;
+              for (ssize_t n = 0; (n = ::read(theirs.get(), bytes, sizeof bytes)) > 0;) total += n;
+              return total == 1 ? 0 : 2;
+            }),
+            0);
+  const NSErrorRef reason = watch.reason();
+  EXPECT_TRUE(test::isCocoaError(reason, NSXPCConnectionInvalid));
+  EXPECT_NE(reason->localizedDescription().find("65534"), std::string::npos);
+  ASSERT_TRUE(replies.waitFor(1));
+  EXPECT_TRUE(test::isCocoaError(callError, NSXPCConnectionInterrupted));
+}
+
+TEST(Connection, APeerThatProvesNothingIsRefused) {
+  UniqueFd ours;
+  UniqueFd theirs;
+  ASSERT_TRUE(makeSocketPair(ours, theirs));
+  // Written before our end asks for credentials, so that the kernel adds none.
+  ASSERT_EQ(::write(theirs.get(), "Y", 1), 1);
+  const auto connection = Connection::adopt(ours.release());
+  ASSERT_NE(connection, nullptr);
+  EndWatch watch(connection);
+  EXPECT_TRUE(test::isCocoaError(watch.reason(), NSXPCConnectionInvalid));
+}
+
+TEST(Connection, NothingIsSentBeforeThePeerProvedItsUser) {
+  UniqueFd ours;
+  UniqueFd theirs;
+  ASSERT_TRUE(makeSocketPair(ours, theirs));
+  const auto connection = Connection::adopt(ours.release());
+  ASSERT_NE(connection, nullptr);
+  const auto echo = connection->bootstrap<Echo>();
+  test::Tally replies;
+  call(echo, &Echo::Client::echoRequest, [](auto) {},
+       [&](const NSErrorRef&, const Echo::EchoResults::Reader*) { replies.add(); });
+  for (int i = 0; i < 3; ++i) EventLoop::shared().runAndWait([] {});
+  char bytes[64];
+  EXPECT_EQ(::recv(theirs.get(), bytes, sizeof bytes, MSG_DONTWAIT), 1);
+  EXPECT_EQ(::recv(theirs.get(), bytes, sizeof bytes, MSG_DONTWAIT), -1);
+  ASSERT_EQ(MessageStream::sendCredentials(theirs.get()), 0);
+  EXPECT_GT(::recv(theirs.get(), bytes, sizeof bytes, 0), 1) << "now the call comes";
+  theirs.reset();
+  EXPECT_TRUE(replies.waitFor(1));
+}
+
+TEST(Connection, AnotherUsersListenerIsRefused) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to become another user";
+  test::TemporaryDirectory directory;
+  ASSERT_EQ(::chmod(directory.path().c_str(), 0777), 0);
+  const std::string path = directory.file("theirs");
+  UniqueFd release;
+  UniqueFd held;
+  ASSERT_TRUE(makeSocketPair(release, held));
+  std::thread server([&] {
+    EXPECT_EQ(asNobody([&] {
+                NSErrorRef error;
+                const UniqueFd socket = listenUnixSocket(path, &error);
+                char byte = 'l';
+                (void)!::write(held.get(), &byte, 1);
+                return ::read(held.get(), &byte, 1) == 1 && socket ? 0 : 1;
+              }),
+              0);
+  });
+  char byte = 0;
+  ASSERT_EQ(::read(release.get(), &byte, 1), 1);
+  NSErrorRef error;
+  EXPECT_EQ(Connection::connect(path, &error), nullptr);
+  ASSERT_NE(error, nullptr);
+  EXPECT_NE(error->localizedDescription().find("another user"), std::string::npos);
+  ASSERT_EQ(::write(release.get(), "x", 1), 1);
+  server.join();
+}
+
+TEST(Connection, PathsOfAnyLengthWork) {
+  test::TemporaryDirectory directory;
+  const std::string deep = directory.file(std::string(120, 'd'));
+  ASSERT_EQ(::mkdir(deep.c_str(), 0700), 0);
+  const std::string path = deep + "/socket";
+  const auto state = std::make_shared<test::EchoState>();
+  NSErrorRef error;
+  const auto listener = Listener::listen(
+      path, [&](const PeerCredentials&) { return test::makeEcho(state); }, &error);
+  ASSERT_NE(listener, nullptr) << error->description();
+  const auto connection = Connection::connect(path, &error);
+  ASSERT_NE(connection, nullptr) << error->description();
+  EXPECT_TRUE(test::echoes(connection->bootstrap<Echo>(), 1));
+}
+
+}  // namespace
+}  // namespace yomber::ipc

@@ -1,0 +1,141 @@
+#pragma once
+
+#include <capnp/serialize-async.h>
+#include <kj/async-unix.h>
+#include <sys/socket.h>
+#include <sys/uio.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <optional>
+#include <span>
+#include <vector>
+
+#include "platform/foundation/error.h"
+#include "platform/ipc/unix_socket.h"
+
+namespace yomber::ipc {
+
+/// What one message may hold, its framing included: 64 MiB.
+inline constexpr std::uint64_t kMaximumMessageWords = 8 * 1024 * 1024;
+/// What the parameters of a call may hold, so that the message around them fits too.
+inline constexpr std::uint64_t kMaximumPayloadWords = kMaximumMessageWords - 1024;
+/// Descriptors that one message may bring; more are closed unseen.
+inline constexpr unsigned kMaximumDescriptors = 16;
+
+/// Cap'n Proto messages with descriptors over a Unix stream socket.
+///
+/// Made for many small messages: one system call takes in all that has arrived, and what is written
+/// during one turn of the loop goes out in one call at its end. A message with descriptors is sent by
+/// a call of its own, so that the receiver can tell whose they are: they belong to the last message
+/// that begins in what one receive brought.
+///
+/// Bounds: at most kMaximumMessageWords and 512 segments; memory for a message grows only with what
+/// arrives of it. A reply beyond the bound is replaced by an exception for its caller.
+///
+/// Loop thread only.
+class MessageStream final : public capnp::MessageStream {
+ public:
+  enum class Handshake : std::uint8_t { None, Credentials };
+  /// Called once, when the peer is gone, was refused, or broke the protocol, or a write failed.
+  using OnEnd = std::function<void(NSErrorRef reason)>;
+
+  /// With Handshake::Credentials, nothing is sent and nothing parsed until the peer's first byte
+  /// came with credentials of our own user; see `sendCredentials`.
+  MessageStream(kj::UnixEventPort& port, UniqueFd socket, Handshake handshake, OnEnd onEnd);
+  ~MessageStream();
+
+  /// Sends this process's half of the handshake. 0 or an errno value.
+  static int sendCredentials(int socket);
+
+  /// Sends what is queued as far as the socket takes it at once.
+  void flushNow();
+
+  kj::Promise<kj::Maybe<capnp::MessageReaderAndFds>> tryReadMessage(
+      kj::ArrayPtr<kj::AutoCloseFd> fdSpace, capnp::ReaderOptions options,
+      kj::ArrayPtr<capnp::word> scratchSpace) override;
+  kj::Promise<void> writeMessage(
+      kj::ArrayPtr<const int> fds,
+      kj::ArrayPtr<const kj::ArrayPtr<const capnp::word>> segments) override;
+  kj::Promise<void> writeMessages(
+      kj::ArrayPtr<kj::ArrayPtr<const kj::ArrayPtr<const capnp::word>>> messages) override;
+  kj::Maybe<int> getSendBufferSize() override;
+  kj::Promise<void> end() override;
+
+ private:
+  using Segments = kj::ArrayPtr<const kj::ArrayPtr<const capnp::word>>;
+  enum class Received : std::uint8_t { Some, Nothing, EndOfStream };
+
+  /// Descriptors that came with the bytes up to `endOffset` of the stream.
+  struct DescriptorBatch {
+    std::uint64_t endOffset;
+    std::vector<kj::AutoCloseFd> descriptors;
+  };
+  /// A message too large for the buffer, read into its final place.
+  struct LargeMessage {
+    kj::Array<capnp::word> words;
+    std::size_t filled;  ///< bytes
+  };
+  /// A message that is written from its own memory: it is large, or has descriptors.
+  struct DirectWrite {
+    std::vector<std::uint32_t> header;
+    std::vector<iovec> pieces;
+    std::size_t nextPiece = 0;
+    kj::ArrayPtr<const int> descriptors;
+  };
+
+  // Receiving.
+  void verifyPeer();
+  kj::Maybe<kj::Array<capnp::word>> takeMessage();
+  kj::ArrayPtr<kj::AutoCloseFd> takeDescriptors(std::uint64_t endOffset,
+                                                kj::ArrayPtr<kj::AutoCloseFd> space);
+  Received receive();
+  void keepDescriptors(msghdr& message);
+  void advanceReceived(std::size_t count);
+  [[nodiscard]] std::span<const std::byte> buffered() const;
+  void makeRoom();
+  [[noreturn]] void refusePeer(std::string text);
+
+  // Sending.
+  kj::Promise<void> refuseLargeMessage(Segments segments);
+  void append(Segments segments);
+  void scheduleFlush();
+  /// Writes until all is out or the socket is full; false in the second case.
+  bool flush();
+  bool sendQueued();
+  bool sendDirect();
+  void flushOrWait();
+  kj::Promise<void> waitAndFlush();
+  void failWriting(int number);
+
+  void reportEnd(std::int64_t code, std::string text);
+
+  UniqueFd socket_;
+  OnEnd onEnd_;
+  kj::UnixEventPort::FdObserver observer_;
+  bool verified_;
+
+  std::vector<std::byte> buffer_;
+  std::size_t begin_ = 0;
+  std::size_t end_ = 0;
+  std::optional<LargeMessage> large_;
+  std::uint64_t consumedOffset_ = 0;  ///< of the stream: where the next message begins
+  std::uint64_t receivedOffset_ = 0;
+  std::deque<DescriptorBatch> batches_;
+  /// Set while an edge of readability is awaited; armed before each receive, so that none is lost.
+  kj::Maybe<kj::Promise<void>> readable_;
+
+  std::vector<std::byte> queued_;
+  std::size_t queuedSent_ = 0;
+  std::optional<DirectWrite> direct_;
+  kj::Maybe<kj::Own<kj::PromiseFulfiller<void>>> writeDone_;
+  bool writingFailed_ = false;
+  bool flushScheduled_ = false;
+  bool waitingForRoom_ = false;
+  kj::Promise<void> flushTask_ = nullptr;
+  kj::Promise<void> roomTask_ = nullptr;
+};
+
+}  // namespace yomber::ipc

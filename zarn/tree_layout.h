@@ -6,11 +6,9 @@
 
 namespace yomber {
 
-/// The container whose Documents folder is the drive's root folder.
-inline constexpr const char* kDefaultContainerID = "com.kelvo.YomberDrive";
-
 /// Where things are below a drive's home, and which names the drive leaves alone.
 ///
+/// The root folder is the Documents of the default container (QSUbiquitousDefaultContainerID).
 /// All paths are absolute, normalised byte strings without a trailing slash.
 /// Thread-safety: immutable.
 class TreeLayout {

@@ -1,0 +1,18 @@
+#pragma once
+
+#include <functional>
+#include <string>
+#include <string_view>
+
+namespace yomber {
+
+/// The longest name that the drive has, in bytes.
+inline constexpr std::size_t kMaximumNameLength = 255;
+
+/// "report.pdf" becomes "report 2.pdf", "report 3.pdf" and so on, until `isTaken` says no. The stem
+/// is cut, at a character's boundary, where the result would be too long. Answers the name itself
+/// when it is free.
+[[nodiscard]] std::string bouncedName(std::string_view name,
+                                      const std::function<bool(const std::string&)>& isTaken);
+
+}  // namespace yomber

@@ -1,0 +1,40 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "zarn/item_row.h"
+
+namespace yomber {
+
+/// The extended attributes in which files carry what the drive knows about them.
+inline constexpr const char* kIDAttribute = "user.yomber.id";            ///< decimal raw id
+inline constexpr const char* kFavoriteAttribute = "user.yomber.favorite";  ///< decimal rank
+inline constexpr const char* kLastUsedAttribute = "user.yomber.lastused";  ///< decimal ns
+inline constexpr const char* kSharedAttribute = "user.yomber.shared";      ///< by its presence
+inline constexpr const char* kTagsAttribute = "user.xdg.tags";  ///< separated by commas
+
+/// What a file's attributes say.
+struct ItemAttributes {
+  std::optional<std::uint64_t> id;
+  bool isShared = false;
+  bool isFault = false;  ///< its content is not here
+  ItemExtra extra;       ///< without the container
+};
+
+/// Reads them; none where the file is gone or has none. Values that make no sense count as absent.
+/// `path` may be relative to the thread's working directory; a final symbolic link is not followed.
+[[nodiscard]] ItemAttributes readItemAttributes(const char* path);
+
+/// Writes an id to the file `name` in the folder open as `folder`, provided that it still has that
+/// inode. Answers whether it is there now.
+bool stampItem(int folder, const std::string& name, std::uint64_t inode, std::uint64_t id);
+
+/// A path by which `name` in the folder open as `folder` can be given to calls that take none but
+/// paths, however deep the folder lies.
+[[nodiscard]] std::string pathThroughDescriptor(int folder, std::string_view name);
+
+}  // namespace yomber

@@ -1,0 +1,144 @@
+#include "zarn/item_store.h"
+
+#include <SQLiteCpp/Exception.h>
+
+#include "platform/ostrell/constants.h"
+#include "zarn/connection.h"
+#include "zarn/row_queries.h"
+
+namespace yomber {
+namespace {
+
+/// Runs a query on a reading connection; what it answers, or nothing when the database fails.
+template <typename Query>
+auto query(const Database& database, NSErrorRef* error, const Query& job)
+    -> decltype(job(std::declval<Connection&>())) {
+  decltype(job(std::declval<Connection&>())) result{};
+  const NSErrorRef failure =
+      database.read([&](Connection& connection) { result = job(connection); });
+  if (failure) {
+    storeError(error, failure);
+    return {};
+  }
+  return result;
+}
+
+std::uint64_t placeID(Connection& connection, const TreeLayout::Place& place, bool& isKnown) {
+  isKnown = true;
+  if (place.kind == TreeLayout::Place::Kind::Trash) return kTrashID;
+  if (place.containerID == QSUbiquitousDefaultContainerID) return kRootID;
+  const auto row = findByContainer(connection, place.containerID);
+  isKnown = row.has_value();
+  return row ? row->id : kRootID;
+}
+
+std::optional<ItemRow> findBelow(Connection& connection, std::uint64_t place,
+                                 std::string_view relative) {
+  std::optional<ItemRow> row = findByID(connection, place);
+  while (row && !relative.empty()) {
+    const std::size_t slash = relative.find('/');
+    const std::string_view name = relative.substr(0, slash);
+    const std::uint64_t parent = row->id;
+    row = findByName(connection, parent, name);
+    // A container's folder has its place elsewhere: through the root's location it is not there.
+    if (row && row->isContainerFolder()) row.reset();
+    if (!row) row = findByDiskName(connection, parent, name);
+    relative.remove_prefix(slash == std::string_view::npos ? relative.size() : slash + 1);
+  }
+  return row;
+}
+
+std::string pathOfChain(const TreeLayout& layout, const ItemChain& chain, bool physical) {
+  std::string path = chain.place == kTrashID ? layout.trashFiles() : layout.root();
+  for (auto row = chain.rows.rbegin(); row != chain.rows.rend(); ++row) {
+    if (row->isContainerFolder()) {
+      path = layout.documents(row->extra->containerID);
+      continue;
+    }
+    path += '/';
+    path += physical ? row->nameOnDisk() : row->name;
+  }
+  return path;
+}
+
+}  // namespace
+
+ItemStore::ItemStore(std::shared_ptr<Database> database, TreeLayout layout)
+    : database_(std::move(database)), layout_(std::move(layout)) {}
+
+std::optional<ItemRow> ItemStore::itemByID(std::uint64_t id, NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) { return findByID(c, id); });
+}
+
+std::optional<ItemRow> ItemStore::itemByName(std::uint64_t parent, std::string_view name,
+                                             NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) { return findByName(c, parent, name); });
+}
+
+std::optional<ItemRow> ItemStore::itemAtPath(std::string_view path, NSErrorRef* error) const {
+  const auto place = layout_.placeOf(path);
+  if (!place) return std::nullopt;
+  return query(*database_, error, [&](Connection& c) -> std::optional<ItemRow> {
+    bool isKnown = false;
+    const std::uint64_t id = placeID(c, *place, isKnown);
+    if (!isKnown) return std::nullopt;
+    return findBelow(c, id, place->relative);
+  });
+}
+
+std::optional<ItemRow> ItemStore::itemForContainer(std::string_view containerID,
+                                                   NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) {
+    if (containerID == QSUbiquitousDefaultContainerID) return findByID(c, kRootID);
+    return findByContainer(c, containerID);
+  });
+}
+
+std::vector<ItemRow> ItemStore::children(std::uint64_t folder, NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) { return findChildren(c, folder); });
+}
+
+std::vector<std::uint64_t> ItemStore::ancestors(std::uint64_t id, NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) {
+    std::vector<std::uint64_t> result;
+    const auto chain = findChain(c, id);
+    if (!chain) return result;
+    for (const ItemRow& row : chain->rows) result.push_back(row.parent);
+    return result;
+  });
+}
+
+std::optional<std::string> ItemStore::logicalPath(std::uint64_t id, NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) -> std::optional<std::string> {
+    const auto chain = findChain(c, id);
+    if (!chain) return std::nullopt;
+    return pathOfChain(layout_, *chain, false);
+  });
+}
+
+std::optional<std::string> ItemStore::physicalPath(std::uint64_t id, NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) -> std::optional<std::string> {
+    const auto chain = findChain(c, id);
+    if (!chain) return std::nullopt;
+    return pathOfChain(layout_, *chain, true);
+  });
+}
+
+ItemStore::Counts ItemStore::counts(NSErrorRef* error) const {
+  return query(*database_, error, [](Connection& c) {
+    // The root and the trash are no items.
+    StatementUse all(c.prepared("SELECT COUNT(*) FROM item"));
+    all->step();
+    StatementUse places(c.prepared("SELECT COUNT(*) FROM item WHERE id IN (0,1)"));
+    places->step();
+    StatementUse folders(
+        c.prepared("SELECT COUNT(*) FROM item WHERE kind=1 AND (flags & 2)=0 AND parent>=0"));
+    folders->step();
+    Counts counts;
+    counts.items = all->id(0) - places->id(0);
+    counts.folders = folders->id(0);
+    return counts;
+  });
+}
+
+}  // namespace yomber

@@ -1,0 +1,115 @@
+// Reconciler: which row an entry without one gets, and which rows go.
+#include <algorithm>
+
+#include "zarn/reconciler.h"
+#include "zarn/row_queries.h"
+
+namespace yomber {
+
+std::optional<ItemRow> Reconciler::findOwnRow(WriteTransaction& transaction,
+                                              const Candidate& candidate) {
+  const auto rows = findByInode(transaction.connection(), candidate.entry.inode);
+  const auto isOwn = [&](const ItemRow& row) {
+    return !row.isContainerFolder() && row.id >= kFirstIssuedID &&
+           isSameFile(row, candidate.entry, candidate.attributes);
+  };
+  const auto isOwnAndGone = [&](const ItemRow& row) { return isOwn(row) && gone_.contains(row.id); };
+  // Of several rows (a file with several names), one whose name is gone has moved.
+  auto row = std::find_if(rows.begin(), rows.end(), isOwnAndGone);
+  const bool hasOneName = candidate.entry.type != EntryType::File || candidate.entry.links == 1;
+  if (row == rows.end() && hasOneName) row = std::find_if(rows.begin(), rows.end(), isOwn);
+  if (row == rows.end()) return std::nullopt;
+  return *row;
+}
+
+bool Reconciler::isElsewhere(const ItemRow& row) const {
+  return openInodes_.contains(row.inode) &&
+         std::any_of(open_.begin(), open_.end(), [&](const Candidate& candidate) {
+           return isSameFile(row, candidate.entry, candidate.attributes);
+         });
+}
+
+bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidate) {
+  const auto place = gone_.find(candidate.replaced);
+  if (place == gone_.end() || candidate.entry.type != EntryType::File) return false;
+  const ItemRow replaced = place->second;
+  if (!isSameType(replaced, candidate.entry) || isElsewhere(replaced)) return false;
+  const auto own = findOwnRow(transaction, candidate);
+  if (own && (own->flags & row_flag::kUploaded) != 0) return false;
+  // A file that nobody else knows yet, saved over a document: the document goes on.
+  if (own) {
+    gone_.erase(own->id);
+    transaction.remove(*own);
+  }
+  gone_.erase(replaced.id);
+  candidate.attributes.id.reset();
+  storeChanged(transaction, candidate, replaced);
+  return true;
+}
+
+void Reconciler::decide(WriteTransaction& transaction, Candidate& candidate) {
+  if (const auto own = findOwnRow(transaction, candidate)) {
+    if (!isNewer(own->rank, candidate.rankBefore)) move(transaction, candidate, *own);
+    return;
+  }
+  const auto& id = candidate.attributes.id;
+  // A twin that a copy has brought: the file that is known keeps the id.
+  if (id && (!candidate.entry.carriesID() || findByID(transaction.connection(), *id))) {
+    candidate.attributes.id.reset();
+  }
+  add(transaction, candidate);
+}
+
+void Reconciler::move(WriteTransaction& transaction, const Candidate& candidate,
+                      const ItemRow& row) {
+  gone_.erase(row.id);
+  storeChanged(transaction, candidate, row);
+  if (candidate.entry.type == EntryType::Folder && candidate.snapshot != nullptr) {
+    noteFolder(*candidate.snapshot, candidate.entry, row.id, false);
+  }
+}
+
+void Reconciler::add(WriteTransaction& transaction, const Candidate& candidate) {
+  // Somebody else's scan may have been faster.
+  const auto present = findByDiskName(transaction.connection(), candidate.parent, candidate.name);
+  if (present && !gone_.contains(present->id)) return;
+  ItemRow row;
+  describe(candidate, row);
+  row.id = candidate.attributes.id ? *candidate.attributes.id : transaction.issueID();
+  row.parent = candidate.parent;
+  choosePlace(transaction, candidate, row);
+  stamp(candidate, row);
+  transaction.insert(row);
+  if (candidate.entry.type == EntryType::Folder && candidate.snapshot != nullptr) {
+    noteFolder(*candidate.snapshot, candidate.entry, row.id, true);
+  }
+}
+
+void Reconciler::finish(WriteTransaction& transaction) {
+  const OwnRanks ownRanks(*this, transaction);
+  for (const Candidate& candidate : open_) openInodes_.insert(candidate.entry.inode);
+  // First those that took a vanished file's place: what they leave open are moves and newcomers.
+  std::vector<Candidate> rest;
+  std::vector<bool> isDone(open_.size());
+  for (std::size_t i = 0; i < open_.size(); ++i) {
+    isDone[i] = open_[i].replaced != 0 && takeReplaced(transaction, open_[i]);
+  }
+  for (std::size_t i = 0; i < open_.size(); ++i) {
+    if (!isDone[i]) rest.push_back(std::move(open_[i]));
+  }
+  open_.clear();
+  openInodes_.clear();
+  for (Candidate& candidate : rest) decide(transaction, candidate);
+  removeGone(transaction);
+}
+
+void Reconciler::removeGone(WriteTransaction& transaction) {
+  for (const auto& [id, row] : gone_) {
+    const auto current = findByID(transaction.connection(), id);
+    // Its folder may have taken it along, and somebody else's scan may know better.
+    if (current && current->rank == row.rank) transaction.remove(*current);
+  }
+  gone_.clear();
+}
+
+}  // namespace yomber

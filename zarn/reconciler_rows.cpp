@@ -1,0 +1,103 @@
+// Reconciler: rows from entries.
+#include "zarn/bounced_name.h"
+#include "zarn/reconciler.h"
+#include "zarn/row_queries.h"
+
+namespace yomber {
+namespace {
+
+constexpr std::uint32_t kFromDisk =
+    row_flag::kShared | row_flag::kDownloaded | row_flag::kHasExtra | row_flag::kStamped;
+
+bool isShownDifferently(const ItemRow& left, const ItemRow& right) {
+  constexpr std::uint32_t kUnseen = row_flag::kStamped | row_flag::kHasExtra;
+  const bool hasSameExtra = left.extra == right.extra ||
+                            (left.extra && right.extra && *left.extra == *right.extra);
+  return left.parent != right.parent || left.name != right.name ||
+         left.diskName != right.diskName || left.kind != right.kind ||
+         (left.flags & ~kUnseen) != (right.flags & ~kUnseen) || left.mode != right.mode ||
+         left.size != right.size || left.mtime != right.mtime || left.btime != right.btime ||
+         !hasSameExtra;
+}
+
+}  // namespace
+
+void Reconciler::describe(const Candidate& candidate, ItemRow& row) const {
+  const FolderEntry& entry = candidate.entry;
+  switch (entry.type) {
+    case EntryType::File:
+      row.kind = ItemKind::Document;
+      break;
+    case EntryType::Folder:
+      row.kind = ItemKind::Folder;
+      break;
+    case EntryType::Symlink:
+      row.kind = links_.isBookmark(candidate.folder->get(), candidate.name) ? ItemKind::Bookmark
+                                                                            : ItemKind::Symlink;
+      break;
+  }
+  row.mode = entry.mode;
+  row.size = entry.size;
+  row.mtime = entry.mtime;
+  row.btime = entry.btime;
+  row.ctime = entry.ctime;
+  row.inode = entry.inode;
+
+  const ItemAttributes& attributes = candidate.attributes;
+  ItemExtra extra = attributes.extra;
+  if (row.extra) extra.containerID = row.extra->containerID;
+  row.extra = extra.isEmpty() ? nullptr : std::make_shared<const ItemExtra>(std::move(extra));
+  row.flags &= ~kFromDisk;
+  if (attributes.isShared) row.flags |= row_flag::kShared;
+  if (!attributes.isFault) row.flags |= row_flag::kDownloaded;
+  if (row.extra) row.flags |= row_flag::kHasExtra;
+}
+
+void Reconciler::choosePlace(WriteTransaction& transaction, const Candidate& candidate,
+                             ItemRow& row) {
+  row.parent = candidate.parent;
+  const auto isGone = [&](const ItemRow& other) { return gone_.contains(other.id); };
+  row.name = bouncedName(candidate.name, [&](const std::string& name) {
+    return transaction.isNameTaken(row.parent, name, row.id, isGone);
+  });
+  row.diskName = row.name == candidate.name ? std::string() : candidate.name;
+  const auto occupant = findByName(transaction.connection(), row.parent, row.name);
+  if (occupant && occupant->id != row.id) transaction.park(occupant->id);
+}
+
+void Reconciler::stamp(const Candidate& candidate, ItemRow& row) const {
+  if (!candidate.entry.carriesID() || row.id < kFirstIssuedID) return;
+  if (candidate.attributes.id == row.id) {
+    row.flags |= row_flag::kStamped;
+    return;
+  }
+  const int folder = candidate.folder->get();
+  const std::string name = candidate.isOpenedFolder ? "." : candidate.name;
+  if (!stampItem(folder, name, row.inode, row.id)) return;
+  row.flags |= row_flag::kStamped;
+  FolderEntry now;
+  const bool isStill = lookAtEntry(folder, name.c_str(), now) && now.inode == row.inode &&
+                       now.mtime == row.mtime && now.size == row.size;
+  // Otherwise the older time makes the next scan look again.
+  if (isStill) row.ctime = now.ctime;
+}
+
+void Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& candidate,
+                              const ItemRow& before) {
+  ItemRow after = before;
+  describe(candidate, after);
+  const bool isPlace = before.parent == kNoParent || before.isContainerFolder();
+  const bool isElsewhereNow =
+      before.parent != candidate.parent || before.nameOnDisk() != candidate.name;
+  if (!isPlace && isElsewhereNow) choosePlace(transaction, candidate, after);
+  stamp(candidate, after);
+  if (isShownDifferently(before, after)) {
+    // A folder that would come to lie below itself has moved on meanwhile; its next scan tells.
+    if (!transaction.update(before, after)) return;
+  } else if (before.ctime != after.ctime || before.inode != after.inode ||
+             before.flags != after.flags) {
+    transaction.updateQuietly(after);
+  }
+}
+
+}  // namespace yomber

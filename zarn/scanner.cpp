@@ -1,0 +1,214 @@
+#include "zarn/scanner.h"
+
+#include <fcntl.h>
+
+#include <cerrno>
+#include <cstring>
+#include <functional>
+#include <thread>
+
+#include "platform/foundation/log.h"
+#include "platform/ostrell/constants.h"
+#include "zarn/connection.h"
+#include "zarn/first_scan.h"
+#include "zarn/location_scan.h"
+#include "zarn/reconciler.h"
+#include "zarn/row_queries.h"
+#include "zarn/scan_session.h"
+#include "zarn/snapshot_queue.h"
+#include "zarn/stamper.h"
+#include "zarn/tree_walker.h"
+
+namespace yomber {
+namespace {
+
+constexpr std::size_t kWaitingFolders = 128;
+constexpr std::size_t kWaitingEntries = 50'000;
+
+/// Walks places on a thread of its own; the snapshots come out of the queue.
+template <typename T>
+class WalkingThread {
+ public:
+  using Prepare = std::function<T(std::unique_ptr<FolderSnapshot>)>;
+  WalkingThread(TreeWalker::Options options, std::vector<ScanPlace> places, Prepare prepare)
+      : queue_(kWaitingFolders, kWaitingEntries),
+        thread_([this, walker = TreeWalker(std::move(options)), places = std::move(places),
+                 prepare = std::move(prepare)]() mutable {
+          for (ScanPlace& place : places) {
+            const bool goesOn =
+                walker.walk(std::move(place.folder), place.visit,
+                            [&](std::unique_ptr<FolderSnapshot> snapshot) {
+                              const std::size_t entries = snapshot->entries.size();
+                              return queue_.push(prepare(std::move(snapshot)), entries);
+                            });
+            if (!goesOn) break;
+          }
+          queue_.finish();
+        }) {}
+  ~WalkingThread() {
+    queue_.abandon();
+    thread_.join();
+  }
+  WalkingThread(const WalkingThread&) = delete;
+  WalkingThread& operator=(const WalkingThread&) = delete;
+
+  std::vector<T> take() { return queue_.take(); }
+
+ private:
+  SnapshotQueue<T> queue_;
+  std::thread thread_;
+};
+
+/// The row of the root or the trash, for an empty database.
+ItemRow rowOfPlace(const ScanPlace& place) {
+  ItemRow row;
+  row.id = place.id;
+  row.parent = kNoParent;
+  row.kind = ItemKind::Folder;
+  row.flags = row_flag::kDownloaded;
+  if (place.id == kTrashID) row.flags |= row_flag::kTrashed;
+  // Siblings need different names; nobody is shown these.
+  row.name = place.id == kTrashID ? ".Trash" : "";
+  FolderEntry entry;
+  if (!lookAtEntry(place.folder->get(), "", entry)) return row;
+  row.mode = entry.mode;
+  row.inode = entry.inode;
+  row.mtime = entry.mtime;
+  row.btime = entry.btime;
+  row.ctime = entry.ctime;
+  return row;
+}
+
+}  // namespace
+
+class Scanner::State {
+ public:
+  State(std::shared_ptr<ItemStore> itemStore, std::weak_ptr<FolderVisitor> folderVisitor)
+      : store(std::move(itemStore)),
+        visitor(std::move(folderVisitor)),
+        links(store->layout()),
+        stamper(store) {}
+
+  [[nodiscard]] TreeWalker::Options walkerOptions(bool readsAttributes) const {
+    return {visitor, [database = store->database()] { return database->currentRank(); },
+            readsAttributes};
+  }
+  NSErrorRef findPlaces(std::vector<ScanPlace>& places) const;
+  NSErrorRef firstScan(ScanReport& report);
+  NSErrorRef reconcile(ScanReport& report);
+
+  const std::shared_ptr<ItemStore> store;
+  const std::weak_ptr<FolderVisitor> visitor;
+  const LinkResolver links;
+  Stamper stamper;
+};
+
+NSErrorRef Scanner::State::findPlaces(std::vector<ScanPlace>& places) const {
+  const TreeLayout& layout = store->layout();
+  const auto addPlace = [&](const std::string& path, ItemRow row) -> NSErrorRef {
+    auto folder = openFolder(path);
+    if (!folder) return NSError::errorWithErrno(errno, path);
+    const std::uint64_t id = row.id;
+    places.push_back({id, TreeWalker::nextVisit(), std::move(folder), std::move(row)});
+    return nullptr;
+  };
+  for (const auto& [path, id] :
+       {std::pair(layout.root(), kRootID), std::pair(layout.trashFiles(), kTrashID)}) {
+    ItemRow row;
+    row.id = id;
+    if (NSErrorRef error = addPlace(path, std::move(row))) return error;
+  }
+  std::vector<ItemRow> containers;
+  const NSErrorRef failure = store->database()->read(
+      [&](Connection& connection) { containers = findContainerFolders(connection); });
+  if (failure) return failure;
+  for (ItemRow& row : containers) {
+    const std::string path = layout.documents(row.extra->containerID);
+    if (NSErrorRef error = addPlace(path, std::move(row))) {
+      log_error(defaultLog(), "[ERROR] a container's folder cannot be read: %@", error);
+    }
+  }
+  return nullptr;
+}
+
+NSErrorRef Scanner::State::firstScan(ScanReport& report) {
+  std::vector<ScanPlace> places;
+  if (NSErrorRef error = findPlaces(places)) return error;
+  return store->database()->rebuild([&](BulkLoad& load) -> NSErrorRef {
+    FirstScan scan(load, links, visitor);
+    for (ScanPlace& place : places) {
+      const bool isContainer = place.row.isContainerFolder();
+      scan.addPlace(isContainer ? std::move(place.row) : rowOfPlace(place), place.visit);
+    }
+    WalkingThread<std::unique_ptr<SortedSnapshot>> walk(
+        walkerOptions(true), places, [](std::unique_ptr<FolderSnapshot> snapshot) {
+          return std::make_unique<SortedSnapshot>(std::move(snapshot));
+        });
+    for (auto taken = walk.take(); !taken.empty(); taken = walk.take()) {
+      for (const auto& sorted : taken) {
+        countSnapshot(*sorted->snapshot, report);
+        scan.addFolder(*sorted);
+      }
+    }
+    report.changes = load.count();
+    return nullptr;
+  });
+}
+
+NSErrorRef Scanner::State::reconcile(ScanReport& report) {
+  std::vector<ScanPlace> places;
+  if (NSErrorRef error = findPlaces(places)) return error;
+  ScanSession session(store->database(), links, visitor);
+  session.setComparesEverything();
+  for (const ScanPlace& place : places) session.setFolderOfVisit(place.visit, place.id);
+  {
+    WalkingThread<std::unique_ptr<FolderSnapshot>> walk(
+        walkerOptions(false), places,
+        [](std::unique_ptr<FolderSnapshot> snapshot) { return snapshot; });
+    for (auto taken = walk.take(); !taken.empty(); taken = walk.take()) {
+      for (const auto& snapshot : taken) countSnapshot(*snapshot, report);
+      if (NSErrorRef error = session.compare(taken)) return error;
+    }
+  }
+  const NSErrorRef error = session.finish();
+  report.changes = session.changes();
+  return error;
+}
+
+Scanner::Scanner(std::shared_ptr<ItemStore> store, std::weak_ptr<FolderVisitor> visitor)
+    : state_(std::make_unique<State>(std::move(store), std::move(visitor))) {}
+
+Scanner::~Scanner() = default;
+
+NSErrorRef Scanner::scanAll(ScanReport* report) {
+  ScanReport own;
+  ScanReport& out = report != nullptr ? *report : own;
+  out = {};
+  if (state_->store->database()->needsFirstScan()) return state_->firstScan(out);
+  return state_->reconcile(out);
+}
+
+NSErrorRef Scanner::scanFolders(const std::vector<std::uint64_t>& folders, ScanReport* report) {
+  ScanReport own;
+  ScanReport& out = report != nullptr ? *report : own;
+  out = {};
+  FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
+  return scan.run(folders, FolderScan::Depth::NewOnly, out);
+}
+
+NSErrorRef Scanner::scanSubtree(std::uint64_t folder, ScanReport* report) {
+  ScanReport own;
+  ScanReport& out = report != nullptr ? *report : own;
+  out = {};
+  FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
+  return scan.run({folder}, FolderScan::Depth::Everything, out);
+}
+
+std::optional<ItemRow> Scanner::scanLocation(std::string_view path, NSErrorRef* error) {
+  LocationScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
+  return scan.run(path, error);
+}
+
+std::uint32_t Scanner::stampSome(std::uint32_t limit) { return state_->stamper.stampSome(limit); }
+
+}  // namespace yomber

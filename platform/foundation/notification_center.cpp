@@ -1,8 +1,7 @@
 #include "platform/foundation/notification_center.h"
 
-#include <algorithm>
-#include <iterator>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "platform/foundation/lock.h"
@@ -28,11 +27,12 @@ struct NSNotificationCenter::State {
     const auto found = byName.find(name);
     if (found == byName.end()) return;
     auto& list = found->second;
-    const auto kept = std::stable_partition(list.begin(), list.end(), [&](const auto& entry) {
-      return entry.address != observer && !entry.observer.expired();
-    });
-    std::move(kept, list.end(), std::back_inserter(out));
-    list.erase(kept, list.end());
+    std::vector<Registration> kept;
+    for (auto& entry : list) {
+      const bool goes = entry.address == observer || entry.observer.expired();
+      (goes ? out : kept).push_back(std::move(entry));
+    }
+    list = std::move(kept);
     if (list.empty()) byName.erase(found);
   }
 };

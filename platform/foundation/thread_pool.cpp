@@ -14,7 +14,7 @@
 
 namespace yomber {
 
-struct ThreadPool::State {
+struct ThreadPool::State : std::enable_shared_from_this<ThreadPool::State> {
   explicit State(Limits givenLimits) : limits(givenLimits) {
     // Every submitted item must find a thread one day.
     limits.maximumThreads = std::max<std::size_t>(limits.maximumThreads, 1);
@@ -48,24 +48,23 @@ void nameThread(const char* name) { pthread_setname_np(pthread_self(), name); }
 class PoolThreads {
  public:
   using State = ThreadPool::State;
-  using StateRef = std::shared_ptr<State>;
 
   /// Starts one more thread. False when the system refuses.
-  static bool startThread(const StateRef& state) REQUIRES(state->mutex) {
+  static bool startThread(State& state) REQUIRES(state.mutex) {
     try {
-      std::thread([state] { threadMain(*state); }).detach();
+      std::thread([held = state.shared_from_this()] { threadMain(*held); }).detach();
     } catch (const std::system_error&) {
       return false;
     }
-    ++state->threads;
+    ++state.threads;
     return true;
   }
 
-  static void startMonitorOnce(const StateRef& state) REQUIRES(state->mutex) {
-    if (state->monitorRuns) return;
+  static void startMonitorOnce(State& state) REQUIRES(state.mutex) {
+    if (state.monitorRuns) return;
     try {
-      std::thread([state] { monitorMain(state); }).detach();
-      state->monitorRuns = true;
+      std::thread([held = state.shared_from_this()] { monitorMain(*held); }).detach();
+      state.monitorRuns = true;
     } catch (const std::system_error&) {
       return;  // tried again with the next item
     }
@@ -117,8 +116,7 @@ class PoolThreads {
 
   /// Watches the queue: work that waits although nothing has moved means that every thread is
   /// blocked, and then more threads are started, twice as many each time while work waits.
-  static void monitorMain(const StateRef& held) {
-    State& state = *held;
+  static void monitorMain(State& state) {
     nameThread("yomber-poolwtch");
     LockGuard guard(state.mutex);
     std::size_t step = 1;
@@ -134,23 +132,23 @@ class PoolThreads {
              state.stallPossible.waitUntil(state.mutex, until)) {
       }
       if (state.work.empty() || state.started != before) continue;
-      grow(held, step);
+      grow(state, step);
       step = std::min<std::size_t>(step * 2, 32);
     }
     state.monitorRuns = false;
     state.threadEnded.notifyAll();
   }
 
-  static void grow(const StateRef& state, std::size_t step) REQUIRES(state->mutex) {
-    const std::size_t room = state->limits.maximumThreads - state->threads;
-    const std::size_t wanted = std::min({step, room, state->work.size()});
+  static void grow(State& state, std::size_t step) REQUIRES(state.mutex) {
+    const std::size_t room = state.limits.maximumThreads - state.threads;
+    const std::size_t wanted = std::min({step, room, state.work.size()});
     for (std::size_t i = 0; i < wanted; ++i) {
       if (!startThread(state)) {
-        reportBound(*state);
+        reportBound(state);
         return;
       }
     }
-    if (room == 0) reportBound(*state);
+    if (room == 0) reportBound(state);
   }
 
   static void reportBound(State& state) REQUIRES(state.mutex) {
@@ -191,8 +189,8 @@ void ThreadPool::async(std::function<void()> work) {
   state_->work.push_back(std::move(work));
   if (state_->idle > 0) state_->workArrived.notifyOne();
   if (state_->idle >= state_->work.size()) return;
-  if (state_->threads < state_->limits.promptThreads && PoolThreads::startThread(state_)) return;
-  PoolThreads::startMonitorOnce(state_);
+  if (state_->threads < state_->limits.promptThreads && PoolThreads::startThread(*state_)) return;
+  PoolThreads::startMonitorOnce(*state_);
   state_->stallPossible.notifyOne();
 }
 

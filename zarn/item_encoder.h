@@ -1,0 +1,23 @@
+#pragma once
+
+#include <cstdint>
+#include <vector>
+
+#include "protocols/common.capnp.h"
+#include "zarn/item_row.h"
+
+namespace yomber {
+
+// Rows on the wire, straight from the engine's form: listings are made of millions of them.
+
+/// Writes every field. `builder` must be fresh.
+void encodeRow(const ItemRow& row, protocol::Item::Builder builder);
+/// Writes a deletion: identifier, kind, raw id and the dead flag.
+void encodeDeadItem(std::uint64_t id, ItemKind kind, protocol::Item::Builder builder);
+
+/// How many words a row takes at most in a message, its place in a list included, so that a page is
+/// built in one piece.
+[[nodiscard]] std::uint64_t encodedRowWords(const ItemRow& row);
+[[nodiscard]] std::uint64_t encodedRowWords(const std::vector<ItemRow>& rows);
+
+}  // namespace yomber

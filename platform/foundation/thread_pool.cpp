@@ -30,6 +30,7 @@ struct ThreadPool::State : std::enable_shared_from_this<ThreadPool::State> {
   std::deque<std::function<void()>> work GUARDED_BY(mutex);
   std::size_t threads GUARDED_BY(mutex) = 0;
   std::size_t idle GUARDED_BY(mutex) = 0;
+  std::size_t arriving GUARDED_BY(mutex) = 0;  ///< started, and not yet at the queue
   std::uint64_t started GUARDED_BY(mutex) = 0;  ///< items taken from the queue so far
   bool monitorRuns GUARDED_BY(mutex) = false;
   bool boundWasLogged GUARDED_BY(mutex) = false;
@@ -57,6 +58,7 @@ class PoolThreads {
       return false;
     }
     ++state.threads;
+    ++state.arriving;
     return true;
   }
 
@@ -74,6 +76,7 @@ class PoolThreads {
   static void threadMain(State& state) {
     nameThread("yomber-pool");
     state.mutex.lock();
+    --state.arriving;
     while (true) {
       if (!state.work.empty()) {
         runNext(state);
@@ -131,7 +134,7 @@ class PoolThreads {
       while (!(state.closing && state.work.empty()) &&
              state.stallPossible.waitUntil(state.mutex, until)) {
       }
-      if (state.work.empty() || state.started != before) continue;
+      if (state.work.size() <= state.arriving || state.started != before) continue;
       grow(state, step);
       step = std::min<std::size_t>(step * 2, 32);
     }
@@ -141,7 +144,7 @@ class PoolThreads {
 
   static void grow(State& state, std::size_t step) REQUIRES(state.mutex) {
     const std::size_t room = state.limits.maximumThreads - state.threads;
-    const std::size_t wanted = std::min({step, room, state.work.size()});
+    const std::size_t wanted = std::min({step, room, state.work.size() - state.arriving});
     for (std::size_t i = 0; i < wanted; ++i) {
       if (!startThread(state)) {
         reportBound(state);
@@ -188,7 +191,7 @@ void ThreadPool::async(std::function<void()> work) {
   LockGuard guard(state_->mutex);
   state_->work.push_back(std::move(work));
   if (state_->idle > 0) state_->workArrived.notifyOne();
-  if (state_->idle >= state_->work.size()) return;
+  if (state_->idle + state_->arriving >= state_->work.size()) return;
   if (state_->threads < state_->limits.promptThreads && PoolThreads::startThread(*state_)) return;
   PoolThreads::startMonitorOnce(*state_);
   state_->stallPossible.notifyOne();

@@ -106,15 +106,12 @@ ItemFields scriptedItem(std::uint64_t rawID, const std::string& filename,
 ScriptedDaemon::State::State(const std::string& home)
     : paths(DrivePaths::forHome(home)), locations(paths.home) {}
 
-void ScriptedDaemon::State::record(const std::string& method, std::vector<std::string> arguments) {
-  LockGuard guard(mutex);
-  calls.push_back({method, std::move(arguments)});
-  didHappen();
-}
-
-kj::Promise<void> ScriptedDaemon::State::whenReleased(const std::string& method) {
+kj::Promise<void> ScriptedDaemon::State::answered(const std::string& method,
+                                                  std::vector<std::string> arguments) {
   {
     LockGuard guard(mutex);
+    calls.push_back({method, std::move(arguments)});
+    didHappen();
     if (!held.contains(method) && !held.contains("*")) return kj::READY_NOW;
   }
   auto pair = kj::newPromiseAndFulfiller<void>();
@@ -204,7 +201,8 @@ ScriptedDaemon::~ScriptedDaemon() {
   stop();
   ipc::EventLoop::shared().runAndWait([this] {
     state_->waiting.clear();
-    state_->receivers.clear();
+    // Senders that outlive this still name their receiver by its number.
+    for (auto& receiver : state_->receivers) receiver = nullptr;
     state_->observers.clear();
   });
   std::error_code ignored;

@@ -30,7 +30,7 @@ struct ThreadPool::State : std::enable_shared_from_this<ThreadPool::State> {
   std::deque<std::function<void()>> work GUARDED_BY(mutex);
   std::size_t threads GUARDED_BY(mutex) = 0;
   std::size_t idle GUARDED_BY(mutex) = 0;
-  std::size_t arriving GUARDED_BY(mutex) = 0;  ///< started, and not yet at the queue
+  std::size_t arriving GUARDED_BY(mutex) = 0;   ///< started, and not yet at the queue
   std::uint64_t started GUARDED_BY(mutex) = 0;  ///< items taken from the queue so far
   bool monitorRuns GUARDED_BY(mutex) = false;
   bool boundWasLogged GUARDED_BY(mutex) = false;

@@ -1,7 +1,5 @@
 #include "platform/ipc/message_stream.h"
 
-#include <capnp/message.h>
-#include <capnp/rpc.capnp.h>
 #include <capnp/serialize.h>
 #include <kj/debug.h>
 #include <sys/socket.h>
@@ -314,7 +312,7 @@ kj::Promise<void> MessageStream::writeMessage(kj::ArrayPtr<const int> fds, Segme
   if (writingFailed_) return kj::READY_NOW;
   std::size_t words = headerWords(segments.size());
   for (const auto& segment : segments) words += segment.size();
-  if (words > kMaximumMessageWords) return refuseLargeMessage(segments);
+  KJ_REQUIRE(words <= kMaximumMessageWords, "The message is too large.", words);
 
   if (fds.size() == 0 && words * sizeof(word) <= kCopiedBytes && !direct_) {
     append(segments);
@@ -344,23 +342,6 @@ kj::Promise<void> MessageStream::writeMessages(
   return writeMessage({}, messages[0]).then([this, messages]() mutable {
     return writeMessages(messages.slice(1, messages.size()));
   });
-}
-
-kj::Promise<void> MessageStream::refuseLargeMessage(Segments segments) {
-  capnp::SegmentArrayMessageReader reader(segments, {.traversalLimitInWords = ~0ULL});
-  const auto large = reader.getRoot<capnp::rpc::Message>();
-  KJ_REQUIRE(large.isReturn(), "A message is larger than 64 MiB.");
-  // Only its caller needs to know; the connection lives on.
-  capnp::MallocMessageBuilder small;
-  auto reply = small.initRoot<capnp::rpc::Message>().initReturn();
-  reply.setAnswerId(large.getReturn().getAnswerId());
-  reply.setReleaseParamCaps(large.getReturn().getReleaseParamCaps());
-  auto exception = reply.initException();
-  exception.setReason("The reply is larger than 64 MiB; ask for it in parts.");
-  exception.setType(capnp::rpc::Exception::Type::FAILED);
-  append(small.getSegmentsForOutput());
-  scheduleFlush();
-  return kj::READY_NOW;
 }
 
 void MessageStream::append(Segments segments) {

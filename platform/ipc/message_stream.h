@@ -33,7 +33,7 @@ inline constexpr unsigned kMaximumDescriptors = 16;
 /// that begins in what one receive brought.
 ///
 /// Bounds: at most kMaximumMessageWords and 512 segments; memory for a message grows only with what
-/// arrives of it. A reply beyond the bound is replaced by an exception for its caller.
+/// arrives of it. Larger messages are refused by the layers above before they get here.
 ///
 /// Loop thread only.
 class MessageStream final : public capnp::MessageStream {
@@ -99,7 +99,6 @@ class MessageStream final : public capnp::MessageStream {
   [[noreturn]] void refusePeer(std::string text);
 
   // Sending.
-  kj::Promise<void> refuseLargeMessage(Segments segments);
   void append(Segments segments);
   void scheduleFlush();
   /// Writes until all is out or the socket is full; false in the second case.

@@ -251,14 +251,5 @@ TEST_F(MessageStreamTest, AnAnnouncedMessageCostsOnlyWhatArrives) {
   EXPECT_LT(residentKiB() - before, 8 * 1024);
 }
 
-TEST_F(MessageStreamTest, EmptyMessagesPass) {
-  startReading();
-  const std::uint32_t empty[] = {0, 0};
-  sendRaw(kj::arrayPtr(reinterpret_cast<const kj::byte*>(empty), sizeof empty));
-  sendRaw(rowMessage(2).asBytes());
-  ASSERT_TRUE(messages.waitFor(2));
-  EXPECT_EQ(seen, (std::vector<std::string>{"0", "2"}));
-}
-
 }  // namespace
 }  // namespace yomber::ipc

@@ -1,5 +1,5 @@
-// What a call between two processes costs beside a bare socket: one caller, eight callers, and pages
-// of items. The peer is a process of its own (ipc_echo_peer).
+// What a call between two processes costs beside a bare socket: one caller, eight callers, and
+// pages of items. The peer is a process of its own (ipc_echo_peer).
 
 #include <sys/wait.h>
 #include <unistd.h>
@@ -158,9 +158,8 @@ int main() {
   const auto echo = connection->bootstrap<Echo>();
 
   bool reached = reportCalls("call", measure(kRounds, [&] { callOnce(echo); }), bare, 6);
-  const double start = bench::secondsFor([&] {
-    reached &= reportCalls("call from 8 threads", callsFromThreads(echo), bare, 38);
-  });
+  const double start = bench::secondsFor(
+      [&] { reached &= reportCalls("call from 8 threads", callsFromThreads(echo), bare, 38); });
   report("calls a second from 8 threads", kRounds * 1.1 / start, "calls/s");
 
   bool complete = true;

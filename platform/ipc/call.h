@@ -30,17 +30,17 @@ using RequestMethod =
 
 /// Calls `method` of `remote`.
 ///
-/// `fill` writes the parameters. `onReply(transportError, results)` is called exactly once: with nil
-/// and the results, which are valid during the call only, or with an error and null. When `call` runs
-/// on the loop thread, that is after it has returned. Calls that one thread makes on one remote
-/// arrive in order.
+/// `fill` writes the parameters. `onReply(transportError, results)` is called exactly once: with
+/// nil and the results, which are valid during the call only, or with an error and null. When
+/// `call` runs on the loop thread, that is after it has returned. Calls that one thread makes on
+/// one remote arrive in order.
 template <typename Interface, typename Client, typename Params, typename Results, typename Fill,
           typename OnReply>
 CallHandle call(const Remote<Interface>& remote, RequestMethod<Client, Params, Results> method,
                 Fill fill, OnReply onReply, CallOptions options = {}) {
   using Call = detail::MethodCall<Interface, Client, Params, Results, Fill, OnReply>;
-  return detail::PendingCall::start(std::make_shared<Call>(
-      remote, method, std::move(fill), std::move(onReply), options));
+  return detail::PendingCall::start(
+      std::make_shared<Call>(remote, method, std::move(fill), std::move(onReply), options));
 }
 
 /// Calls `method` of `remote` and waits for the reply on the calling thread, which must not be the

@@ -178,11 +178,10 @@ TEST(Call, ACancelledCallEndsOnceAndThePeerIsTold) {
 TEST(Call, CancellingAnAnsweredCallDoesNothing) {
   EchoPair pair;
   Outcome outcome;
-  const CallHandle handle =
-      call(pair.echo, &Echo::Client::echoRequest, kNothing,
-           [&](NSErrorRef error, const Echo::EchoResults::Reader* results) {
-             outcome.set(std::move(error), results);
-           });
+  const CallHandle handle = call(pair.echo, &Echo::Client::echoRequest, kNothing,
+                                 [&](NSErrorRef error, const Echo::EchoResults::Reader* results) {
+                                   outcome.set(std::move(error), results);
+                                 });
   ASSERT_TRUE(outcome.replies.waitFor(1));
   handle.cancel();
   CallHandle().cancel();

@@ -30,8 +30,8 @@ capnp::ReaderOptions readerOptions() {
 /// What runs over a socket. Both ends are servers: that side listens at once, and which side an end
 /// is shows nowhere in the messages.
 struct Wire {
-  Wire(UniqueFd socket, MessageStream::Handshake handshake, kj::Maybe<capnp::Capability::Client> own,
-       MessageStream::OnEnd onEnd)
+  Wire(UniqueFd socket, MessageStream::Handshake handshake,
+       kj::Maybe<capnp::Capability::Client> own, MessageStream::OnEnd onEnd)
       : stream(EventLoop::shared().port(), std::move(socket), handshake, std::move(onEnd)),
         network(stream, kMaximumDescriptors, Side::SERVER, readerOptions()),
         rpc(network, kj::mv(own)) {
@@ -188,8 +188,8 @@ void Connection::onDisconnect(std::function<void(NSErrorRef)> handler) {
 void Connection::close() {
   link_->connected = false;
   EventLoop::shared().post([link = link_] {
-    EventLoop::shared().detach(kj::evalLast(
-        [link] { EventLoop::shared().post([link] { link->end(closedHere()); }); }));
+    EventLoop::shared().detach(
+        kj::evalLast([link] { EventLoop::shared().post([link] { link->end(closedHere()); }); }));
   });
 }
 

@@ -31,9 +31,9 @@ class Connection {
   /// be empty: then the peer's calls on it fail.
   using Bootstrap = std::function<capnp::Capability::Client()>;
 
-  /// Connects to the listener at `socketPath`, which must be of our own user. Nil with an error that
-  /// names the path and says what to do when that fails. Not on the loop thread: it may wait a few
-  /// seconds for a peer that is too busy to accept.
+  /// Connects to the listener at `socketPath`, which must be of our own user. Nil with an error
+  /// that names the path and says what to do when that fails. Not on the loop thread: it may wait a
+  /// few seconds for a peer that is too busy to accept.
   static Ref connect(const std::string& socketPath, NSErrorRef* error = nullptr,
                      Bootstrap bootstrap = {});
   /// The same without waiting; `handler` is called once, on a pool thread.
@@ -48,8 +48,8 @@ class Connection {
   Connection& operator=(const Connection&) = delete;
   ~Connection();
 
-  /// The capability that the peer exports. Keeps neither the connection open nor itself alive in it:
-  /// once the connection is gone, its calls fail.
+  /// The capability that the peer exports. Keeps neither the connection open nor itself alive in
+  /// it: once the connection is gone, its calls fail.
   template <typename Interface>
   [[nodiscard]] Remote<Interface> bootstrap() const {
     return Remote<Interface>([link = link_]() -> typename Interface::Client {
@@ -58,8 +58,8 @@ class Connection {
   }
 
   /// Calls `handler` with the reason when the connection ends, or soon when it has ended. Called
-  /// once, on the loop thread. The reason is never nil: interrupted when the peer went away, invalid
-  /// when it was closed here, refused, or broke the protocol.
+  /// once, on the loop thread. The reason is never nil: interrupted when the peer went away,
+  /// invalid when it was closed here, refused, or broke the protocol.
   void onDisconnect(std::function<void(NSErrorRef)> handler);
   /// Ends the connection. Replies that were complete before are still sent as far as the socket
   /// takes them at once.

@@ -151,11 +151,12 @@ TEST(Connection, WhatWasAnsweredBeforeClosingStillArrives) {
     test::Tally replies;
     bool answered = false;
     EventLoop::shared().runAndWait([&] {
-      call(pair.echo, &Echo::Client::echoRequest, [](auto) {},
-           [&](const NSErrorRef& error, const Echo::EchoResults::Reader*) {
-             answered = error == nullptr;
-             replies.add();
-           });
+      call(
+          pair.echo, &Echo::Client::echoRequest, [](auto) {},
+          [&](const NSErrorRef& error, const Echo::EchoResults::Reader*) {
+            answered = error == nullptr;
+            replies.add();
+          });
     });
     ASSERT_TRUE(replies.waitFor(1));
     pair.server->close();
@@ -188,11 +189,12 @@ TEST(Connection, AnotherUsersEndIsRefusedBeforeAnythingIsParsed) {
   const auto echo = connection->bootstrap<Echo>();
   test::Tally replies;
   NSErrorRef callError;
-  call(echo, &Echo::Client::echoRequest, [](auto) {},
-       [&](NSErrorRef error, const Echo::EchoResults::Reader*) {
-         callError = std::move(error);
-         replies.add();
-       });
+  call(
+      echo, &Echo::Client::echoRequest, [](auto) {},
+      [&](NSErrorRef error, const Echo::EchoResults::Reader*) {
+        callError = std::move(error);
+        replies.add();
+      });
   EXPECT_EQ(asNobody([&] {
               if (MessageStream::sendCredentials(theirs.get()) != 0) return 1;
               // Our half of the handshake is all that it may ever read.
@@ -229,8 +231,9 @@ TEST(Connection, NothingIsSentBeforeThePeerProvedItsUser) {
   ASSERT_NE(connection, nullptr);
   const auto echo = connection->bootstrap<Echo>();
   test::Tally replies;
-  call(echo, &Echo::Client::echoRequest, [](auto) {},
-       [&](const NSErrorRef&, const Echo::EchoResults::Reader*) { replies.add(); });
+  call(
+      echo, &Echo::Client::echoRequest, [](auto) {},
+      [&](const NSErrorRef&, const Echo::EchoResults::Reader*) { replies.add(); });
   for (int i = 0; i < 3; ++i) EventLoop::shared().runAndWait([] {});
   char bytes[64];
   EXPECT_EQ(::recv(theirs.get(), bytes, sizeof bytes, MSG_DONTWAIT), 1);
@@ -276,8 +279,8 @@ TEST(Connection, PathsOfAnyLengthWork) {
   const std::string path = deep + "/socket";
   const auto state = std::make_shared<test::EchoState>();
   NSErrorRef error;
-  const auto listener = Listener::listen(
-      path, [&](const PeerCredentials&) { return test::makeEcho(state); }, &error);
+  const auto listener =
+      Listener::listen(path, [&](const PeerCredentials&) { return test::makeEcho(state); }, &error);
   ASSERT_NE(listener, nullptr) << error->description();
   const auto connection = Connection::connect(path, &error);
   ASSERT_NE(connection, nullptr) << error->description();

@@ -13,8 +13,7 @@ Deadlines::Deadlines(kj::Timer& timer) : timer_(timer), task_(nullptr) {
   task_ = watch().eagerlyEvaluate(nullptr);
 }
 
-void Deadlines::set(Entry& entry, std::chrono::milliseconds delay,
-                    std::function<void()> onExpiry) {
+void Deadlines::set(Entry& entry, std::chrono::milliseconds delay, std::function<void()> onExpiry) {
   entry.clear();
   const Clock::time_point when = Clock::now() + delay;
   // Most deadlines are equally far away, so the new one nearly always belongs at the end.

@@ -34,8 +34,9 @@ struct ObjectCodec {
 void registerObjectCodec(ObjectCodec codec);
 
 /// What a transport failure is for a caller: a lost peer is NSXPCConnectionInterrupted, a call that
-/// ran out of time NSXPCConnectionTimedOut, one that the peer does not know or a message that cannot
-/// be read NSXPCConnectionReplyInvalid; all in the Cocoa domain with the text as description.
+/// ran out of time NSXPCConnectionTimedOut, one that the peer does not know or a message that
+/// cannot be read NSXPCConnectionReplyInvalid; all in the Cocoa domain with the text as
+/// description.
 [[nodiscard]] NSErrorRef connectionError(const kj::Exception& exception);
 /// A Cocoa-domain error of `code` that says `text`.
 [[nodiscard]] NSErrorRef connectionError(std::int64_t code, std::string text);

@@ -22,10 +22,13 @@ TEST(ErrorCodec, NilStaysNil) { EXPECT_EQ(throughTheWire(nullptr), nullptr); }
 TEST(ErrorCodec, EveryKindOfValueTravels) {
   const auto inner = NSError::errorWithDomain("inner", -3);
   const std::string bytes("no \xff UTF-8", 10);
-  const auto error = NSError::errorWithDomain(
-      "domain", -1005,
-      {{"text", bytes}, {"integer", std::int64_t{-7}}, {"real", 2.5}, {"boolean", true},
-       {NSUnderlyingErrorKey, inner}, {"path", NSURL::fileURLWithPath("/a/b \xfe")}});
+  const auto error = NSError::errorWithDomain("domain", -1005,
+                                              {{"text", bytes},
+                                               {"integer", std::int64_t{-7}},
+                                               {"real", 2.5},
+                                               {"boolean", true},
+                                               {NSUnderlyingErrorKey, inner},
+                                               {"path", NSURL::fileURLWithPath("/a/b \xfe")}});
   const auto copy = throughTheWire(error);
   ASSERT_NE(copy, nullptr);
   EXPECT_TRUE(copy->is("domain", -1005));
@@ -85,17 +88,19 @@ struct Named final : NSObject {
 TEST(ErrorCodec, ObjectsTravelByTheirCodecOrAsDescription) {
   const auto named = std::make_shared<const Named>("report.txt");
   const auto error = NSError::errorWithDomain(
-      "d", 1, {{"item", NSObjectRef(named)}, {"other", NSObjectRef(std::make_shared<Described>())}});
+      "d", 1,
+      {{"item", NSObjectRef(named)}, {"other", NSObjectRef(std::make_shared<Described>())}});
   auto copy = throughTheWire(error);
   EXPECT_EQ(std::get<std::string>(copy->userInfo().at("item")), "report.txt");
 
   registerObjectCodec({
-      .encode = [](const NSObjectRef& object, protocol::Item::Builder builder) {
-        const auto* item = dynamic_cast<const Named*>(object.get());
-        if (item == nullptr) return false;
-        builder.setIdentifier(item->name.c_str());
-        return true;
-      },
+      .encode =
+          [](const NSObjectRef& object, protocol::Item::Builder builder) {
+            const auto* item = dynamic_cast<const Named*>(object.get());
+            if (item == nullptr) return false;
+            builder.setIdentifier(item->name.c_str());
+            return true;
+          },
       .decode = [](protocol::Item::Reader reader) -> NSObjectRef {
         return std::make_shared<const Named>(reader.getIdentifier().cStr());
       },
@@ -115,8 +120,8 @@ TEST(ErrorCodec, TransportFailuresBecomeConnectionErrors) {
   EXPECT_EQ(codeFor(kj::Exception::Type::DISCONNECTED), NSXPCConnectionInterrupted);
   EXPECT_EQ(codeFor(kj::Exception::Type::FAILED), NSXPCConnectionReplyInvalid);
   EXPECT_EQ(codeFor(kj::Exception::Type::UNIMPLEMENTED), NSXPCConnectionReplyInvalid);
-  const auto error = connectionError(
-      kj::Exception(kj::Exception::Type::FAILED, "f", 1, kj::heapString("why")));
+  const auto error =
+      connectionError(kj::Exception(kj::Exception::Type::FAILED, "f", 1, kj::heapString("why")));
   EXPECT_EQ(error->domain(), NSCocoaErrorDomain);
   EXPECT_EQ(error->localizedDescription(), "why");
 }

@@ -22,6 +22,7 @@ class Deadlines;
 /// an eventfd that the loop observes. Closures run in the order in which they were posted.
 ///
 /// Nothing that runs on the loop thread may block: work that may goes to a pool (server_call.h).
+/// The thread takes no signals, and what it forks would take none either: start programs elsewhere.
 ///
 /// Thread-safety: `post`, `isCurrent`, `assertElsewhere` and `runAndWait` on any thread; everything
 /// else on the loop thread only.

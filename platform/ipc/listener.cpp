@@ -45,11 +45,10 @@ struct Listener::State final : std::enable_shared_from_this<State> {
   bool inShortage = false;
 
   void start() {
-    observer = kj::heap<kj::UnixEventPort::FdObserver>(
-        EventLoop::shared().port(), socket.get(), kj::UnixEventPort::FdObserver::OBSERVE_READ);
+    observer = kj::heap<kj::UnixEventPort::FdObserver>(EventLoop::shared().port(), socket.get(),
+                                                       kj::UnixEventPort::FdObserver::OBSERVE_READ);
     task = acceptLoop().eagerlyEvaluate([this](kj::Exception&& exception) {
-      log_fault(defaultLog(), "Listening at %@ ended: %s", path,
-                exception.getDescription().cStr());
+      log_fault(defaultLog(), "Listening at %@ ended: %s", path, exception.getDescription().cStr());
     });
   }
 
@@ -113,7 +112,8 @@ struct Listener::State final : std::enable_shared_from_this<State> {
                 credentials->pid, path, options.maximumConnections);
       return;
     }
-    KJ_IF_MAYBE (exception, kj::runCatchingExceptions([&] { serve(std::move(peer), *credentials); })) {
+    KJ_IF_MAYBE (exception,
+                 kj::runCatchingExceptions([&] { serve(std::move(peer), *credentials); })) {
       log_error(defaultLog(), "Serving process %d at %@ failed: %s", credentials->pid, path,
                 exception->getDescription().cStr());
     }

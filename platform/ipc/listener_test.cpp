@@ -82,7 +82,9 @@ TEST_F(ListenerTest, ALiveOneIsLeftAlone) {
 }
 
 TEST_F(ListenerTest, WhatIsNoSocketIsLeftAlone) {
-  { const UniqueFd file(::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600)); }
+  {
+    const UniqueFd file(::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600));
+  }
   EXPECT_EQ(listen(), nullptr);
   ASSERT_NE(error, nullptr);
   EXPECT_NE(error->localizedDescription().find("no socket"), std::string::npos);

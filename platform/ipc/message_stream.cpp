@@ -151,7 +151,8 @@ void MessageStream::verifyPeer() {
   if (peer.pid == 0 || byte != kPreamble) refusePeer("The peer did not prove its user.");
   if (peer.uid != ::geteuid()) {
     refusePeer("The peer, process " + std::to_string(peer.pid) + ", belongs to user " +
-               std::to_string(peer.uid) + " and was refused: only the user's own processes may "
+               std::to_string(peer.uid) +
+               " and was refused: only the user's own processes may "
                "connect.");
   }
   const int off = 0;
@@ -178,8 +179,8 @@ kj::Promise<kj::Maybe<capnp::MessageReaderAndFds>> MessageStream::tryReadMessage
       return Result(nullptr);
     }
     if (received == Received::Some) continue;
-    kj::Promise<void> ready = kj::mv(KJ_ASSERT_NONNULL(readable_));
-    readable_ = nullptr;
+    kj::Promise<void> ready = kj::mv(*readable_);
+    readable_.reset();
     return ready.then([this, fdSpace, options, scratchSpace] {
       return tryReadMessage(fdSpace, options, scratchSpace);
     });
@@ -219,8 +220,8 @@ kj::Maybe<kj::Array<word>> MessageStream::takeMessage() {
   return words;
 }
 
-kj::ArrayPtr<kj::AutoCloseFd> MessageStream::takeDescriptors(
-    std::uint64_t endOffset, kj::ArrayPtr<kj::AutoCloseFd> space) {
+kj::ArrayPtr<kj::AutoCloseFd> MessageStream::takeDescriptors(std::uint64_t endOffset,
+                                                             kj::ArrayPtr<kj::AutoCloseFd> space) {
   std::size_t count = 0;
   while (!batches_.empty() && batches_.front().endOffset <= endOffset) {
     for (auto& descriptor : batches_.front().descriptors) {
@@ -234,19 +235,14 @@ kj::ArrayPtr<kj::AutoCloseFd> MessageStream::takeDescriptors(
 void MessageStream::makeRoom() {
   if (begin_ == end_) {
     begin_ = end_ = 0;
-  } else if (begin_ > kBufferBytes / 2) {
-    std::memmove(buffer_.data(), buffer_.data() + begin_, end_ - begin_);
-    end_ -= std::exchange(begin_, 0);
-  } else if (end_ == kBufferBytes) {
+  } else if (begin_ > kBufferBytes / 2 || end_ == kBufferBytes) {
     std::memmove(buffer_.data(), buffer_.data() + begin_, end_ - begin_);
     end_ -= std::exchange(begin_, 0);
   }
 }
 
 MessageStream::Received MessageStream::receive() {
-  if (readable_ == nullptr) {
-    readable_ = observer_.whenBecomesReadable();
-  }
+  if (!readable_) readable_.emplace(observer_.whenBecomesReadable());
   if (!verified_) {
     verifyPeer();
     if (!verified_) return Received::Nothing;
@@ -265,8 +261,7 @@ MessageStream::Received MessageStream::receive() {
   message.msg_iovlen = count;
   message.msg_control = control.data();
   message.msg_controllen = control.size();
-  const ssize_t received =
-      ::recvmsg(socket_.get(), &message, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
+  const ssize_t received = ::recvmsg(socket_.get(), &message, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
   if (received > 0) {
     receivedOffset_ += static_cast<std::uint64_t>(received);
     if (message.msg_controllen > 0) keepDescriptors(message);
@@ -320,10 +315,10 @@ kj::Promise<void> MessageStream::writeMessage(kj::ArrayPtr<const int> fds, Segme
     if (queued_.size() - queuedSent_ <= kQueuedBytes) return kj::READY_NOW;
   } else {
     KJ_REQUIRE(!direct_, "One message is written after the other.");
-    DirectWrite& write = direct_.emplace();
-    write.header = makeHeader(segments);
-    write.descriptors = fds;
-    write.pieces.push_back(pieceOf(write.header.data(), write.header.size() * sizeof(std::uint32_t)));
+    direct_.emplace(DirectWrite{fds, makeHeader(segments), {}, 0});
+    DirectWrite& write = *direct_;
+    write.pieces.push_back(
+        pieceOf(write.header.data(), write.header.size() * sizeof(std::uint32_t)));
     for (const auto& segment : segments) {
       if (segment.size() > 0) {
         write.pieces.push_back(pieceOf(segment.begin(), segment.size() * sizeof(word)));

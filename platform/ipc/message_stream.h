@@ -28,9 +28,9 @@ inline constexpr unsigned kMaximumDescriptors = 16;
 /// Cap'n Proto messages with descriptors over a Unix stream socket.
 ///
 /// Made for many small messages: one system call takes in all that has arrived, and what is written
-/// during one turn of the loop goes out in one call at its end. A message with descriptors is sent by
-/// a call of its own, so that the receiver can tell whose they are: they belong to the last message
-/// that begins in what one receive brought.
+/// during one turn of the loop goes out in one call at its end. A message with descriptors is sent
+/// by a call of its own, so that the receiver can tell whose they are: they belong to the last
+/// message that begins in what one receive brought.
 ///
 /// Bounds: at most kMaximumMessageWords and 512 segments; memory for a message grows only with what
 /// arrives of it. Larger messages are refused by the layers above before they get here.
@@ -80,10 +80,10 @@ class MessageStream final : public capnp::MessageStream {
   };
   /// A message that is written from its own memory: it is large, or has descriptors.
   struct DirectWrite {
+    kj::ArrayPtr<const int> descriptors;
     std::vector<std::uint32_t> header;
     std::vector<iovec> pieces;
-    std::size_t nextPiece = 0;
-    kj::ArrayPtr<const int> descriptors;
+    std::size_t nextPiece;
   };
 
   // Receiving.
@@ -124,7 +124,7 @@ class MessageStream final : public capnp::MessageStream {
   std::uint64_t receivedOffset_ = 0;
   std::deque<DescriptorBatch> batches_;
   /// Set while an edge of readability is awaited; armed before each receive, so that none is lost.
-  kj::Maybe<kj::Promise<void>> readable_;
+  std::optional<kj::Promise<void>> readable_;
 
   std::vector<std::byte> queued_;
   std::size_t queuedSent_ = 0;

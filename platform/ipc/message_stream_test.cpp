@@ -27,14 +27,16 @@ class MessageStreamTest : public ::testing::Test {
     UniqueFd inner;
     EXPECT_TRUE(makeSocketPair(inner, raw));
     EventLoop::shared().runAndWait([&] {
-      stream = std::make_unique<MessageStream>(
-          EventLoop::shared().port(), std::move(inner), MessageStream::Handshake::None,
-          [this](NSErrorRef reason) {
-            endReason = std::move(reason);
-            ended.add();
-          });
+      stream = std::make_unique<MessageStream>(EventLoop::shared().port(), std::move(inner),
+                                               MessageStream::Handshake::None,
+                                               [this](NSErrorRef reason) {
+                                                 endReason = std::move(reason);
+                                                 ended.add();
+                                               });
     });
   }
+  ~MessageStreamTest() noexcept override = default;
+
   void TearDown() override {
     EventLoop::shared().runAndWait([&] {
       reading.reset();

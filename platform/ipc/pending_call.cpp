@@ -69,7 +69,8 @@ void PendingCall::run() {
 
 void PendingCall::finish(NSErrorRef error) {
   if (!settle(std::move(error))) return;
-  // The task is what runs now, so it must not go yet; and the results' goodbye can wait for company.
+  // The task is what runs now, so it must not go yet; and the results' goodbye can wait for
+  // company.
   EventLoop::shared().retire(std::exchange(self_, nullptr));
 }
 
@@ -94,8 +95,7 @@ void PendingCall::checkSize(capnp::MessageSize size) {
   throw connectionError(NSXPCConnectionReplyInvalid,
                         "The request of " + std::to_string(size.wordCount * 8) +
                             " bytes is larger than the limit of " +
-                            std::to_string(kMaximumPayloadWords * 8) +
-                            " bytes; send it in parts.");
+                            std::to_string(kMaximumPayloadWords * 8) + " bytes; send it in parts.");
 }
 
 }  // namespace detail

@@ -44,8 +44,8 @@ class CancelFlag {
 //   }
 //
 // With `allowCancellation` the call context is destroyed as soon as the client cancels or leaves:
-// work on the pool must touch neither it nor its parameters and results, only what it owns. What the
-// work refers to (the server object too) it must keep alive itself.
+// work on the pool must touch neither it nor its parameters and results, only what it owns. What
+// the work refers to (the server object too) it must keep alive itself.
 
 namespace detail {
 
@@ -115,8 +115,8 @@ auto onPool(Work work) {
 /// The same on `queue`, in order with what else is submitted there.
 template <typename Work>
 auto onQueue(const std::shared_ptr<SerialQueue>& queue, Work work) {
-  return detail::runElsewhere(
-      [&queue](std::function<void()> job) { queue->async(std::move(job)); }, std::move(work));
+  return detail::runElsewhere([&queue](std::function<void()> job) { queue->async(std::move(job)); },
+                              std::move(work));
 }
 
 }  // namespace yomber::ipc

@@ -162,10 +162,10 @@ TEST(ServerCall, AMethodAnswersFromThePool) {
 TEST(ServerCall, TheClientsCancellationReachesThePool) {
   test::EchoPair pair;
   test::Tally replies;
-  const CallHandle handle =
-      call(pair.echo, &Echo::Client::workRequest,
-           [](Echo::WorkParams::Builder params) { params.setHold(true); },
-           [&](const NSErrorRef&, const Echo::WorkResults::Reader*) { replies.add(); });
+  const CallHandle handle = call(
+      pair.echo, &Echo::Client::workRequest,
+      [](Echo::WorkParams::Builder params) { params.setHold(true); },
+      [&](const NSErrorRef&, const Echo::WorkResults::Reader*) { replies.add(); });
   ASSERT_TRUE(pair.state->works.waitFor(1));
   handle.cancel();
   EXPECT_TRUE(pair.state->cancelledWorks.waitFor(1));
@@ -174,9 +174,10 @@ TEST(ServerCall, TheClientsCancellationReachesThePool) {
 
 TEST(ServerCall, ADisconnectReachesThePool) {
   test::EchoPair pair;
-  call(pair.echo, &Echo::Client::workRequest,
-       [](Echo::WorkParams::Builder params) { params.setHold(true); },
-       [](const NSErrorRef&, const Echo::WorkResults::Reader*) {});
+  call(
+      pair.echo, &Echo::Client::workRequest,
+      [](Echo::WorkParams::Builder params) { params.setHold(true); },
+      [](const NSErrorRef&, const Echo::WorkResults::Reader*) {});
   ASSERT_TRUE(pair.state->works.waitFor(1));
   pair.client = nullptr;
   EXPECT_TRUE(pair.state->cancelledWorks.waitFor(1));

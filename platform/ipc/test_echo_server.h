@@ -33,13 +33,13 @@ class Tally {
 
 /// What a test sees and commands of the servers it made.
 struct EchoState {
-  Tally hangs;            ///< calls of `hang` that came in
-  Tally cancelled;        ///< calls of `hang` that were cancelled
-  Tally works;            ///< held `work` calls that the pool runs
-  Tally cancelledWorks;   ///< held `work` calls that saw their flag
-  Tally releaseWorks;     ///< raised to let held calls go
-  Tally destroyed;        ///< servers destroyed
-  Tally destroyedOffLoop; ///< of these, on any other thread
+  Tally hangs;             ///< calls of `hang` that came in
+  Tally cancelled;         ///< calls of `hang` that were cancelled
+  Tally works;             ///< held `work` calls that the pool runs
+  Tally cancelledWorks;    ///< held `work` calls that saw their flag
+  Tally releaseWorks;      ///< raised to let held calls go
+  Tally destroyed;         ///< servers destroyed
+  Tally destroyedOffLoop;  ///< of these, on any other thread
 };
 using EchoStateRef = std::shared_ptr<EchoState>;
 

@@ -26,9 +26,9 @@ NSErrorRef socketError(int number, const std::string& path, std::string text) {
 }
 
 NSErrorRef directoryError(int number, const std::string& directory) {
-  return socketError(number, directory,
-                     "The socket directory " + directory +
-                         " cannot be used: " + std::strerror(number) + ".");
+  return socketError(
+      number, directory,
+      "The socket directory " + directory + " cannot be used: " + std::strerror(number) + ".");
 }
 
 /// The address of a path of any length: a socket address holds 107 bytes, so that a path is named
@@ -102,9 +102,9 @@ NSErrorRef connectError(int number, const std::string& path) {
   switch (number) {
     case ENOENT:
     case ECONNREFUSED:
-      return socketError(number, path,
-                         "Nothing is listening" + at +
-                             ". Start the drive with `yomber up` and try again.");
+      return socketError(
+          number, path,
+          "Nothing is listening" + at + ". Start the drive with `yomber up` and try again.");
     case EAGAIN:
       return socketError(number, path,
                          "The process listening" + at +
@@ -112,13 +112,13 @@ NSErrorRef connectError(int number, const std::string& path) {
                              "or restart it.");
     case EACCES:
     case EPERM:
-      return socketError(number, path,
-                         "The socket" + at +
-                             " belongs to another user. Use a drive home of your own.");
+      return socketError(
+          number, path,
+          "The socket" + at + " belongs to another user. Use a drive home of your own.");
     default:
-      return socketError(number, path,
-                         "Connecting to the socket" + at + " failed: " + std::strerror(number) +
-                             ".");
+      return socketError(
+          number, path,
+          "Connecting to the socket" + at + " failed: " + std::strerror(number) + ".");
   }
 }
 

@@ -6,9 +6,9 @@
 
 #include "fileproviderd/host_errors.h"
 #include "fileproviderd/listing.h"
-#include "fileproviderd/process_usage.h"
 #include "fileproviderd/remote_watcher.h"
 #include "platform/fileprovider/item_codec.h"
+#include "platform/foundation/process_usage.h"
 #include "platform/ipc/error_codec.h"
 
 namespace yomber {

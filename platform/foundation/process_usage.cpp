@@ -1,4 +1,4 @@
-#include "fileproviderd/process_usage.h"
+#include "platform/foundation/process_usage.h"
 
 #include <unistd.h>
 

@@ -4,12 +4,9 @@ include(GoogleTest)
 set(YOMBER_TEST_TIMEOUT 120 CACHE STRING "Seconds a single test may take")
 define_property(GLOBAL PROPERTY YOMBER_BENCHES BRIEF_DOCS "Every benchmark program")
 
-# The thread sanitizer needs its shadow memory at fixed places, which a kernel with many bits of
-# address-space randomness takes away: its programs run with the randomness off.
 set(YOMBER_TEST_LAUNCHER "")
 if(YOMBER_SANITIZE STREQUAL "thread")
-  find_program(YOMBER_SETARCH setarch REQUIRED)
-  set(YOMBER_TEST_LAUNCHER ${YOMBER_SETARCH};-R)
+  set(YOMBER_TEST_LAUNCHER "${CMAKE_SOURCE_DIR}/tests/sanitizers/fixed-addresses")
 endif()
 
 # What the sanitizers are told at run time, for ctest and for scripts.

@@ -3,7 +3,7 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <spawn.h>
-#include <sys/pidfd.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -21,6 +21,12 @@ namespace yomber {
 namespace {
 
 constexpr int kChildSocket = 3;
+
+// glibc 2.36 declares these two without C linkage.
+int openProcess(pid_t pid) { return static_cast<int>(syscall(SYS_pidfd_open, pid, 0)); }
+void signalProcess(int process, int signal) {
+  (void)syscall(SYS_pidfd_send_signal, process, signal, nullptr, 0);
+}
 
 /// What posix_spawn is told, with the memory that it points to.
 class SpawnPlan {
@@ -107,7 +113,7 @@ struct ExtensionProcess::Child {
   bool isReaped = false;
 
   void end() const {
-    if (!isReaped) (void)pidfd_send_signal(descriptor.get(), SIGKILL, nullptr, 0);
+    if (!isReaped) signalProcess(descriptor.get(), SIGKILL);
   }
 
   void reap() {
@@ -141,7 +147,7 @@ std::shared_ptr<ExtensionProcess> ExtensionProcess::start(
     return nullptr;
   }
   child->didExit = std::move(didExit);
-  child->descriptor.reset(pidfd_open(child->pid, 0));
+  child->descriptor.reset(openProcess(child->pid));
   if (!child->descriptor) {
     const int number = errno;
     (void)kill(child->pid, SIGKILL);

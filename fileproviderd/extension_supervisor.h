@@ -35,7 +35,7 @@ class ExtensionSupervisor : public std::enable_shared_from_this<ExtensionSupervi
     std::chrono::milliseconds acquire{8'000};   ///< the longest that `acquire` takes
     std::chrono::milliseconds answer{10'000};   ///< for the root's location, after the start and later
     std::chrono::milliseconds pingEvery{15'000};
-    std::chrono::milliseconds stable{10'000};   ///< up for so long: the back-off begins anew
+    std::chrono::milliseconds stable{2'000};    ///< up for so long: the back-off begins anew
   };
   struct Events {
     std::function<void(const NSErrorRef& reason)> didEnd;  ///< an extension that was in use

@@ -1,0 +1,274 @@
+#include "zarn/database.h"
+
+#include <SQLiteCpp/Database.h>
+#include <sys/wait.h>
+
+#include <atomic>
+#include <future>
+#include <thread>
+
+#include "platform/foundation/fault_points.h"
+#include "zarn/bulk_load.h"
+#include "zarn/row_queries.h"
+#include "zarn/test_drive.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+ItemRow document(const std::string& name, std::uint64_t parent = kRootID) {
+  ItemRow row;
+  row.parent = parent;
+  row.name = name;
+  return row;
+}
+
+class DatabaseTest : public TestDrive {
+ protected:
+  ~DatabaseTest() override { FaultPoint::disarmAll(); }
+
+  NSErrorRef insert(const std::string& name) {
+    return database->write([&](WriteTransaction& transaction) -> NSErrorRef {
+      ItemRow row = document(name);
+      row.id = transaction.issueID();
+      transaction.insert(row);
+      return nullptr;
+    });
+  }
+  std::vector<std::string> damagedFiles() const {
+    std::vector<std::string> result;
+    for (const auto& entry : std::filesystem::directory_iterator(layout.home())) {
+      const std::string name = entry.path().filename();
+      if (name.starts_with("zarn.db.damaged-") && !name.ends_with("-wal") && !name.ends_with("-shm")) {
+        result.push_back(name);
+      }
+    }
+    return result;
+  }
+};
+
+TEST_F(DatabaseTest, RanksGrowOverRestarts) {
+  const std::uint64_t start = database->currentRank();
+  ASSERT_EQ(insert("a"), nullptr);
+  ASSERT_EQ(insert("b"), nullptr);
+  EXPECT_EQ(database->currentRank(), start + 2);
+  const std::uint64_t identity = database->identity();
+  reopen();
+  EXPECT_EQ(database->currentRank(), start + 2);
+  EXPECT_EQ(database->identity(), identity);
+  ASSERT_EQ(insert("c"), nullptr);
+  EXPECT_EQ(store->itemByName(kRootID, "c")->rank, start + 3);
+}
+
+TEST_F(DatabaseTest, SinksAreToldOfEveryChangeInOrder) {
+  ASSERT_EQ(insert("a"), nullptr);
+  const auto before = store->itemByName(kRootID, "a");
+  ASSERT_EQ(database->write([&](WriteTransaction& transaction) -> NSErrorRef {
+    ItemRow after = *before;
+    after.name = "b";
+    transaction.update(*before, after);
+    transaction.remove(after);
+    return nullptr;
+  }), nullptr);
+  const auto changes = sink->take();
+  ASSERT_EQ(changes.size(), 3U);
+  EXPECT_TRUE(changes[0].isNew);
+  EXPECT_EQ(changes[1].nameBefore, "a");
+  EXPECT_EQ(changes[1].row.name, "b");
+  EXPECT_TRUE(changes[2].isDead());
+  EXPECT_LT(changes[1].row.rank, changes[2].row.rank);
+  EXPECT_FALSE(store->itemByName(kRootID, "b"));
+}
+
+TEST_F(DatabaseTest, AFailingJobUndoesOnlyItself) {
+  // Both wait behind a job that is held, so that they share a transaction.
+  std::promise<void> gate;
+  auto open = gate.get_future().share();
+  database->writeLater([open](WriteTransaction&) -> NSErrorRef { open.wait(); return nullptr; }, {});
+  std::promise<NSErrorRef> first;
+  std::promise<NSErrorRef> second;
+  const auto job = [](const char* name, bool fails) {
+    return [name, fails](WriteTransaction& transaction) -> NSErrorRef {
+      ItemRow row = document(name);
+      row.id = transaction.issueID();
+      transaction.insert(row);
+      if (fails) return NSError::errorWithErrno(EIO);
+      return nullptr;
+    };
+  };
+  database->writeLater(job("bad", true), [&](NSErrorRef error) { first.set_value(error); });
+  database->writeLater(job("good", false), [&](NSErrorRef error) { second.set_value(error); });
+  gate.set_value();
+  EXPECT_NE(first.get_future().get(), nullptr);
+  EXPECT_EQ(second.get_future().get(), nullptr);
+  EXPECT_FALSE(store->itemByName(kRootID, "bad"));
+  EXPECT_TRUE(store->itemByName(kRootID, "good"));
+  const auto changes = sink->take();
+  ASSERT_EQ(changes.size(), 1U);
+  EXPECT_EQ(changes[0].row.name, "good");
+  EXPECT_EQ(changes[0].row.rank, database->currentRank());
+}
+
+TEST_F(DatabaseTest, AFailedCommitIsAnErrorAndChangesNothing) {
+  const std::uint64_t rank = database->currentRank();
+  ASSERT_EQ(FaultPoint::arm("zarn.database.before-commit=error"), nullptr);
+  const NSErrorRef error = insert("a");
+  FaultPoint::disarmAll();
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(error->domain(), kDatabaseErrorDomain);
+  EXPECT_EQ(database->currentRank(), rank);
+  EXPECT_FALSE(store->itemByName(kRootID, "a"));
+  EXPECT_EQ(insert("a"), nullptr);
+}
+
+TEST_F(DatabaseTest, AKillBeforeTheCommitLosesTheJobAndAfterItNothing) {
+  close();
+  for (const auto& [point, survives] :
+       {std::pair("zarn.database.before-commit", false), std::pair("zarn.database.after-commit", true)}) {
+    const std::string name = survives ? "after" : "before";
+    const pid_t child = fork();
+    if (child == 0) {
+      open();
+      if (FaultPoint::arm(std::string(point) + "=abort")) _exit(3);
+      (void)insert(name);
+      _exit(4);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(status)) << status;
+    open();
+    EXPECT_EQ(store->itemByName(kRootID, name).has_value(), survives) << point;
+    close();
+  }
+}
+
+TEST_F(DatabaseTest, SetsADamagedFileAside) {
+  ASSERT_EQ(insert("a"), nullptr);
+  const std::uint64_t rank = database->currentRank();
+  const std::uint64_t identity = database->identity();
+  close();
+  std::ofstream(layout.databasePath(), std::ios::binary) << std::string(8192, 'x');
+  open();
+  EXPECT_TRUE(database->needsFirstScan());
+  EXPECT_GT(database->currentRank(), rank);
+  EXPECT_NE(database->identity(), identity);
+  EXPECT_EQ(damagedFiles().size(), 1U);
+  EXPECT_EQ(insert("b"), nullptr);
+}
+
+TEST_F(DatabaseTest, ChecksAFileThatWasFoundDamagedWhileInUse) {
+  for (int i = 0; i < 200; ++i) ASSERT_EQ(insert("item " + std::to_string(i)), nullptr);
+  close();
+  // Pages behind the first few are overwritten: the file opens, but its content is broken.
+  const auto size = std::filesystem::file_size(layout.databasePath());
+  std::fstream file(layout.databasePath(), std::ios::in | std::ios::out | std::ios::binary);
+  file.seekp(8192);
+  file << std::string(size - 8192, '\x5a');
+  file.close();
+  NSErrorRef error;
+  database = Database::open(layout.databasePath(), &error);
+  if (database) {
+    // What was damaged is only met on use.
+    store = std::make_shared<ItemStore>(database, layout);
+    NSErrorRef failure;
+    (void)store->itemByName(kRootID, "item 7", &failure);
+    EXPECT_NE(failure, nullptr);
+    close();
+  }
+  open();
+  EXPECT_EQ(damagedFiles().size(), 1U);
+  EXPECT_EQ(insert("b"), nullptr);
+}
+
+TEST_F(DatabaseTest, RefusesAFileOfANewerProgramAndLeavesIt) {
+  ASSERT_EQ(insert("a"), nullptr);
+  close();
+  SQLite::Database(layout.databasePath(), SQLite::OPEN_READWRITE).exec("PRAGMA user_version=99");
+  NSErrorRef error;
+  EXPECT_EQ(Database::open(layout.databasePath(), &error), nullptr);
+  ASSERT_NE(error, nullptr);
+  EXPECT_TRUE(error->is(kDatabaseErrorDomain, kDatabaseTooNew));
+  EXPECT_TRUE(damagedFiles().empty());
+  SQLite::Database(layout.databasePath(), SQLite::OPEN_READWRITE).exec("PRAGMA user_version=1");
+  open();
+  EXPECT_TRUE(store->itemByName(kRootID, "a"));
+}
+
+TEST_F(DatabaseTest, SaysWhyItCannotOpen) {
+  NSErrorRef error;
+  EXPECT_EQ(Database::open(layout.home() + "/no/such/folder/zarn.db", &error), nullptr);
+  ASSERT_NE(error, nullptr);
+  EXPECT_TRUE(error->is(kDatabaseErrorDomain, kDatabaseFailure));
+}
+
+TEST_F(DatabaseTest, ARebuildThatFailsLeavesEverythingAsItWas) {
+  ASSERT_EQ(insert("a"), nullptr);
+  EXPECT_NE(database->rebuild([](BulkLoad&) { return NSError::errorWithErrno(EIO); }), nullptr);
+  EXPECT_TRUE(store->itemByName(kRootID, "a"));
+  ASSERT_EQ(FaultPoint::arm("zarn.database.before-swap=error"), nullptr);
+  EXPECT_NE(database->rebuild([](BulkLoad&) -> NSErrorRef { return nullptr; }), nullptr);
+  FaultPoint::disarmAll();
+  EXPECT_TRUE(store->itemByName(kRootID, "a"));
+  EXPECT_TRUE(database->needsFirstScan());
+  EXPECT_FALSE(std::filesystem::exists(layout.databasePath() + ".new"));
+}
+
+TEST_F(DatabaseTest, ARebuildTakesPlaceUnderReaders) {
+  std::atomic<bool> isDone = false;
+  std::thread reader([&] {
+    while (!isDone) (void)store->itemByID(kRootID);
+  });
+  const std::uint64_t rank = database->currentRank();
+  const NSErrorRef error = database->rebuild([](BulkLoad& load) -> NSErrorRef {
+    ItemRow row = document("a");
+    row.id = 5000;
+    load.add(row, "key");
+    return nullptr;
+  });
+  isDone = true;
+  reader.join();
+  ASSERT_EQ(error, nullptr);
+  EXPECT_TRUE(store->itemByID(5000));
+  EXPECT_FALSE(database->needsFirstScan());
+  EXPECT_GT(database->currentRank(), rank);
+}
+
+TEST_F(DatabaseTest, SortKeysAreMadeAnewForAnotherCollation) {
+  ASSERT_EQ(insert("b"), nullptr);
+  close();
+  {
+    SQLite::Database raw(layout.databasePath(), SQLite::OPEN_READWRITE);
+    raw.exec("UPDATE item SET name_key=x'00'; UPDATE meta SET value='0/older' WHERE key='collation'");
+  }
+  open();
+  EXPECT_TRUE(store->itemByName(kRootID, "b"));
+}
+
+TEST_F(DatabaseTest, PrunesTombstonesBeyondTheBound) {
+  ASSERT_EQ(database->write([](WriteTransaction& transaction) -> NSErrorRef {
+    StatementUse statement(transaction.connection().prepared(
+        "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i+1 FROM n WHERE i<?1) "
+        "INSERT INTO working(id,rank,kind,member) SELECT i+100000,i,0,0 FROM n"));
+    statement->bindInteger(1, kMaximumTombstones);
+    statement->step();
+    return nullptr;
+  }), nullptr);
+  EXPECT_EQ(database->oldestAnswerableRank(), 0U);
+  // Removing members adds departures, and removing enough items brings the pruning about.
+  ASSERT_EQ(database->write([](WriteTransaction& transaction) -> NSErrorRef {
+    for (int i = 0; i < 1100; ++i) {
+      ItemRow row = document("item " + std::to_string(i));
+      row.id = transaction.issueID();
+      row.flags = row_flag::kShared;
+      transaction.insert(row);
+      transaction.remove(row);
+    }
+    return nullptr;
+  }), nullptr);
+  EXPECT_EQ(database->oldestAnswerableRank(), 1100U);
+  reopen();
+  EXPECT_EQ(database->oldestAnswerableRank(), 1100U);
+}
+
+}  // namespace
+}  // namespace yomber

@@ -1,0 +1,129 @@
+#include <atomic>
+#include <thread>
+
+#include "zarn/scanner.h"
+#include "zarn/test_drive.h"
+
+namespace yomber {
+namespace {
+
+class LocationScanTest : public TestDrive {
+ protected:
+  LocationScanTest() {
+    makeFolder("folder");
+    write("folder/a.txt");
+    scan();
+  }
+  std::optional<ItemRow> look(const std::string& path) {
+    error = nullptr;
+    return scanner->scanLocation(at(path), &error);
+  }
+  void expectNoSuchItem(const std::string& path) {
+    EXPECT_FALSE(look(path));
+    ASSERT_NE(error, nullptr);
+    EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSFileNoSuchFileError)) << error->description();
+  }
+  NSErrorRef error;
+};
+
+TEST_F(LocationScanTest, AnswersTheRowAsItIsNow) {
+  write("folder/a.txt", "longer text");
+  setAttribute("folder/a.txt", kTagsAttribute, "blue");
+  const auto found = look("folder/a.txt");
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->size, 11U);
+  EXPECT_EQ(found->extra->tags, std::vector<std::string>{"blue"});
+  EXPECT_EQ(look("")->id, kRootID);
+}
+
+TEST_F(LocationScanTest, AnUnchangedLocationCostsNoWrite) {
+  const std::uint64_t rank = database->currentRank();
+  ASSERT_TRUE(look("folder/a.txt"));
+  EXPECT_EQ(database->currentRank(), rank);
+}
+
+TEST_F(LocationScanTest, FindsNewAncestorsWithAllTheyHold) {
+  makeFolder("x");
+  makeFolder("x/y");
+  write("x/y/z");
+  write("x/beside");
+  const auto found = look("x/y/z");
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->parent, id("x/y"));
+  EXPECT_NE(id("x/beside"), 0U);
+}
+
+TEST_F(LocationScanTest, ARenamedItemKeepsItsId) {
+  const auto a = id("folder/a.txt");
+  rename("folder/a.txt", "b.txt");
+  EXPECT_EQ(look("b.txt")->id, a);
+  EXPECT_FALSE(row("folder/a.txt"));
+  const auto folder = id("folder");
+  rename("folder", "renamed");
+  EXPECT_EQ(look("renamed")->id, folder);
+}
+
+TEST_F(LocationScanTest, WhatIsGoneLosesItsRowAndComesBackUnderItsId) {
+  const auto a = id("folder/a.txt");
+  while (scanner->stampSome(100) != 0) {
+  }
+  rename("folder/a.txt", "b.txt");
+  expectNoSuchItem("folder/a.txt");
+  EXPECT_FALSE(store->itemByID(a));
+  EXPECT_EQ(look("b.txt")->id, a);
+}
+
+TEST_F(LocationScanTest, ReplacedTypesAreOtherItems) {
+  const auto a = id("folder/a.txt");
+  remove("folder/a.txt");
+  makeFolder("folder/a.txt");
+  const auto found = look("folder/a.txt");
+  ASSERT_TRUE(found);
+  EXPECT_TRUE(found->isFolder());
+  EXPECT_NE(found->id, a);
+}
+
+TEST_F(LocationScanTest, RefusesLocationsOutsideEveryPlace) {
+  write("a.part");
+  expectNoSuchItem("a.part");
+  expectNoSuchItem("missing/below");
+  expectNoSuchItem("folder/a.txt/below");
+  expectNoSuchItem("folder/../folder");
+  expectNoSuchItem(std::string(300, 'n'));
+  for (const std::string& path : {layout.privateArea(), layout.promises() + "/5", layout.tree(),
+                                  std::string("/etc/passwd"), std::string(), std::string("x")}) {
+    EXPECT_FALSE(scanner->scanLocation(path, &error)) << path;
+    EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSFileNoSuchFileError));
+  }
+}
+
+TEST_F(LocationScanTest, SymbolicLinksOnTheWayAreNotFollowed) {
+  ASSERT_EQ(symlink("folder", at("link").c_str()), 0);
+  EXPECT_EQ(look("link")->kind, ItemKind::Bookmark);
+  expectNoSuchItem("link/a.txt");
+}
+
+TEST_F(LocationScanTest, AScanThatLookedEarlierUndoesNothing) {
+  std::atomic<bool> isDone = false;
+  std::thread reconciling([&] {
+    while (!isDone) EXPECT_EQ(scanner->scanAll(), nullptr);
+  });
+  for (int i = 0; i < 300; ++i) {
+    const std::string name = "file " + std::to_string(i);
+    write(name);
+    const auto found = look(name);
+    ASSERT_TRUE(found) << name;
+    rename(name, "folder/" + name);
+    const auto moved = look("folder/" + name);
+    ASSERT_TRUE(moved);
+    EXPECT_EQ(moved->id, found->id);
+    EXPECT_TRUE(store->itemByID(found->id));
+  }
+  isDone = true;
+  reconciling.join();
+  scan();
+  EXPECT_EQ(names(id("folder")).size(), 301U);
+}
+
+}  // namespace
+}  // namespace yomber

@@ -9,6 +9,7 @@
 #include "platform/fileprovider/wire_item.h"
 #include "platform/foundation/drive_paths.h"
 #include "platform/ipc/gate.h"
+#include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
 
 namespace yomber {
@@ -175,17 +176,19 @@ void DaemonLink::didConnect(ipc::Connection::Ref connection, const NSErrorRef& e
 
 void DaemonLink::checkHome(const DaemonSessionRef& session) {
   using Results = protocol::Daemon::DescribeResults;
-  auto onReply = [self = shared_from_this(), session](const NSErrorRef& error,
+  auto onReply = [self = shared_from_this(), session](NSErrorRef error,
                                                       const Results::Reader* results) {
+    std::string home;
+    if (results != nullptr) {
+      error = whatIsWrongWith([&] { home = stringFromWire(results->getHome()); });
+    }
+    if (!error && home != self->locations_.home()) {
+      error = wrongHome(self->socketPath_, home, self->locations_.home());
+    }
     if (error) {
       self->didFail(error);
-      return;
-    }
-    const std::string home = stringFromWire(results->getHome());
-    if (home == self->locations_.home()) {
-      self->observe(session);
     } else {
-      self->didFail(wrongHome(self->socketPath_, home, self->locations_.home()));
+      self->observe(session);
     }
   };
   (void)ipc::call(
@@ -196,14 +199,17 @@ void DaemonLink::checkHome(const DaemonSessionRef& session) {
 void DaemonLink::observe(const DaemonSessionRef& session) {
   using Results = protocol::Daemon::ObserveResults;
   using Params = protocol::Daemon::ObserveParams;
-  auto onReply = [self = shared_from_this(), session](const NSErrorRef& error,
+  auto onReply = [self = shared_from_this(), session](NSErrorRef error,
                                                       const Results::Reader* results) {
+    if (results != nullptr) {
+      error = whatIsWrongWith(
+          [&] { session->keep(ipc::Remote<protocol::Registration>(results->getRegistration())); });
+    }
     if (error) {
       self->didFail(error);
-      return;
+    } else {
+      self->didEstablish(session);
     }
-    session->keep(ipc::Remote<protocol::Registration>(results->getRegistration()));
-    self->didEstablish(session);
   };
   (void)ipc::call(
       session->daemon(), &protocol::Daemon::Client::observeRequest,
@@ -266,6 +272,7 @@ void DaemonLink::didFail(const NSErrorRef& error) {
 }
 
 void DaemonLink::didLose(const DaemonSessionRef& session, const NSErrorRef& reason) {
+  if (!session->markLost()) return;
   {
     LockGuard guard(mutex_);
     if (session_.load() == session) session_.store(nullptr);
@@ -273,6 +280,7 @@ void DaemonLink::didLose(const DaemonSessionRef& session, const NSErrorRef& reas
   }
   emptyCaches();
   session->end(reason);
+  session->connection()->close();
   tryAgainLater();
 }
 

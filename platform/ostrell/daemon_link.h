@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -28,7 +29,7 @@ namespace yomber {
 class DaemonLossObserver {
  public:
   virtual ~DaemonLossObserver() = default;
-  /// On the loop thread; once.
+  /// Called once, on any thread; must not block.
   virtual void daemonWasLost(const NSErrorRef& reason) = 0;
 };
 
@@ -45,7 +46,9 @@ class DaemonSession {
 
   /// Held weakly. Told soon when the session has ended already.
   void addLossObserver(const std::shared_ptr<DaemonLossObserver>& observer);
-  /// Tells the observers. Loop thread.
+  /// False when it was said before.
+  bool markLost() { return !isLost_.exchange(true); }
+  /// Tells the observers.
   void end(const NSErrorRef& reason);
   /// Keeps the standing registration for as long as the session. Loop thread, before it is shared.
   void keep(ipc::Remote<protocol::Registration> registration) { registration_ = registration; }
@@ -54,6 +57,7 @@ class DaemonSession {
   const ipc::Connection::Ref connection_;
   const ipc::Remote<protocol::Daemon> daemon_;
   ipc::Remote<protocol::Registration> registration_;
+  std::atomic<bool> isLost_ = false;
 
   Mutex mutex_;
   NSErrorRef ended_ GUARDED_BY(mutex_);
@@ -99,8 +103,15 @@ class DaemonLink : public std::enable_shared_from_this<DaemonLink> {
     NSErrorRef error;
     const auto session = waitForSession(&error);
     if (!session) return error;
-    return ipc::callAndWait(session->daemon(), method, std::forward<Fill>(fill),
-                            std::forward<Decode>(decode), callOptions_);
+    error = ipc::callAndWait(session->daemon(), method, std::forward<Fill>(fill),
+                             std::forward<Decode>(decode), callOptions_);
+    if (error) noteFailure(session, error);
+    return error;
+  }
+  /// To be told of a call that failed, before its caller is: so the caller's next call never meets
+  /// the connection that has just been lost.
+  void noteFailure(const DaemonSessionRef& session, const NSErrorRef& error) {
+    if (error->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted)) didLose(session, error);
   }
 
   /// From now on connects again by itself, with back-off, when the connection is lost.

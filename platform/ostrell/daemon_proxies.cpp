@@ -22,23 +22,25 @@ class AsyncInvoker {
             typename Reply>
   void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
               Reply reply) {
-    link_->withSession(
-        [=, link = link_, slot = slot_](const DaemonSessionRef& session, const NSErrorRef& error) {
-          if (!session) {
-            slot->fail(error);
-            return;
-          }
-          using Reader = typename Results::Reader;
-          auto onReply = [decode, reply, slot, session, queue = link->replyQueue()](
-                             const NSErrorRef& failure, const Reader* results) {
-            if (results == nullptr) {
-              slot->fail(failure);
-              return;
-            }
-            queue->async([reply, value = decode(session, *results)] { reply(value); });
-          };
-          (void)ipc::call(session->daemon(), method, fill, std::move(onReply), link->callOptions());
-        });
+    link_->withSession([=, link = link_, slot = slot_](const DaemonSessionRef& session,
+                                                       const NSErrorRef& error) {
+      if (!session) {
+        slot->fail(error);
+        return;
+      }
+      using Reader = typename Results::Reader;
+      auto onReply = [decode, reply, slot, session, link](NSErrorRef failure,
+                                                          const Reader* results) {
+        const auto take = [&] {
+          link->replyQueue()->async([reply, value = decode(session, *results)] { reply(value); });
+        };
+        if (results != nullptr) failure = whatIsWrongWith(take);
+        if (!failure) return;
+        link->noteFailure(session, failure);
+        slot->fail(failure);
+      };
+      (void)ipc::call(session->daemon(), method, fill, std::move(onReply), link->callOptions());
+    });
   }
 
  private:
@@ -65,7 +67,11 @@ class SyncInvoker {
         session->daemon(), method, std::move(fill),
         [&](const typename Results::Reader& results) { value.emplace(decode(session, results)); },
         link_->callOptions());
-    if (value && !error) reply(*value);
+    if (error) {
+      link_->noteFailure(session, error);
+    } else if (value) {
+      reply(*value);
+    }
   }
 
   NSErrorRef error;

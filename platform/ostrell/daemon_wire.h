@@ -1,7 +1,10 @@
 #pragma once
 
+#include <exception>
+
 #include "platform/foundation/error.h"
 #include "platform/foundation/url.h"
+#include "platform/ipc/error_codec.h"
 #include "platform/ostrell/file_object_id.h"
 #include "platform/ostrell/query_item.h"
 #include "protocols/daemon.capnp.h"
@@ -24,6 +27,20 @@ void encodeObjectID(const QSFileObjectID& object, protocol::Daemon::ObjectID::Bu
                                       NSErrorRef* error);
 [[nodiscard]] QSQueryItemRef decodeItemResult(protocol::Daemon::ItemResult::Reader reader,
                                               NSErrorRef* error);
+
+/// Runs `read`, which reads a message: answers nil, or the error for a message that cannot be read.
+/// Whoever waits for the message hears of it then.
+template <typename Read>
+[[nodiscard]] NSErrorRef whatIsWrongWith(const Read& read) {
+  try {
+    read();
+    return nullptr;
+  } catch (const kj::Exception& exception) {
+    return ipc::connectionError(exception);
+  } catch (const std::exception& exception) {
+    return ipc::connectionError(NSXPCConnectionReplyInvalid, exception.what());
+  }
+}
 
 /// What is said of a reply that makes no sense.
 [[nodiscard]] NSErrorRef unintelligibleReply(const char* what);

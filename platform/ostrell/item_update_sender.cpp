@@ -63,13 +63,10 @@ void ItemUpdateSender::call(
     return;
   }
   using Reader = typename Results::Reader;
-  auto onReply = [slot = slot_, deliver = std::move(deliver)](const NSErrorRef& failure,
+  auto onReply = [slot = slot_, deliver = std::move(deliver)](NSErrorRef failure,
                                                               const Reader* results) {
-    if (results != nullptr) {
-      deliver(*results);
-    } else if (slot) {
-      slot->fail(connectionLost(failure));
-    }
+    if (results != nullptr) failure = whatIsWrongWith([&] { deliver(*results); });
+    if (failure && slot) slot->fail(connectionLost(failure));
   };
   (void)ipc::call(remote, method, std::move(fill), std::move(onReply),
                   subscription_->callOptions());

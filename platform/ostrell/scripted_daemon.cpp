@@ -55,14 +55,16 @@ int listenAt(const std::string& path) {
 void serve(const std::shared_ptr<ScriptedDaemon::State>& state, ipc::UniqueFd socket) {
   auto connection =
       ipc::Connection::accepted(std::move(socket), [state] { return makeScriptedServer(state); });
+  std::uint64_t number = 0;
   {
     LockGuard guard(state->mutex);
-    state->connections.push_back(connection);
+    number = state->nextConnection++;
+    state->connections.emplace(number, connection);
     state->didHappen();
   }
-  connection->onDisconnect([state, raw = connection.get()](const NSErrorRef&) {
+  connection->onDisconnect([state, number](const NSErrorRef&) {
     LockGuard guard(state->mutex);
-    std::erase_if(state->connections, [raw](const auto& each) { return each.get() == raw; });
+    state->connections.erase(number);
     state->didHappen();
   });
 }
@@ -285,13 +287,13 @@ void ScriptedDaemon::release(const std::string& method) {
 void ScriptedDaemon::dropConnections() {
   // Also those that were accepted a moment ago: they were posted before.
   ipc::EventLoop::shared().runAndWait([this] {
-    std::vector<ipc::Connection::Ref> connections;
+    std::map<std::uint64_t, ipc::Connection::Ref> connections;
     {
       LockGuard guard(state_->mutex);
       connections.swap(state_->connections);
       state_->didHappen();
     }
-    for (const auto& each : connections) each->close();
+    for (const auto& [number, each] : connections) each->close();
   });
 }
 

@@ -83,9 +83,10 @@ class ScriptedDaemon {
     std::function<Account()> account;
   };
 
-  /// A call that arrived: the method as the protocol names it, and its parameters in their order,
-  /// as text ("true", "200", "d:5"; the root folder and an absent token are ""). Of a sender's
-  /// calls (boostPriority, watchItem, invalidate), the subscription's number comes first.
+  /// A call that arrived and whose answer was made: the method as the protocol names it, and its
+  /// parameters in their order, as text ("true", "200", "d:5"; the root folder and an absent token
+  /// are ""). Of a sender's calls (boostPriority, watchItem, invalidate), the subscription's number
+  /// comes first.
   struct Call {
     std::string method;
     std::vector<std::string> arguments;

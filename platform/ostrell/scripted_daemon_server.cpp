@@ -84,25 +84,22 @@ class SenderServer final : public protocol::ItemSender::Server {
 
   kj::Promise<void> boostPriority(BoostPriorityContext context) override {
     context.allowCancellation();
-    state_->record("boostPriority", {std::to_string(number_)});
-    return state_->whenReleased("boostPriority");
+    return state_->answered("boostPriority", {std::to_string(number_)});
   }
   kj::Promise<void> watchItem(WatchItemContext context) override {
     context.allowCancellation();
     const auto params = context.getParams();
     const std::string path = stringFromWire(params.getPath());
     const auto options = params.getOptions();
-    state_->record("watchItem", {std::to_string(number_), path, std::to_string(options)});
     const auto answer = state_->currentAnswers().watchItem;
     ipc::encodeOptional(answer ? answer(path, options) : nullptr,
                         context.getResults().initFailure());
-    return state_->whenReleased("watchItem");
+    return state_->answered("watchItem", {std::to_string(number_), path, std::to_string(options)});
   }
   kj::Promise<void> invalidate(InvalidateContext context) override {
     context.allowCancellation();
     state_->receivers[number_] = nullptr;
-    state_->record("invalidate", {std::to_string(number_)});
-    return state_->whenReleased("invalidate");
+    return state_->answered("invalidate", {std::to_string(number_)});
   }
 
  private:
@@ -154,49 +151,44 @@ class DaemonServer final : public Wire::Server {
 
 kj::Promise<void> DaemonServer::describe(DescribeContext context) {
   context.allowCancellation();
-  state_->record("describe", {});
   auto results = context.getResults();
   results.setHome(wireData(state_->paths.home));
   results.setRoot(wireData(state_->locations.root()));
   results.setProgram("scripted");
-  return state_->whenReleased("describe");
+  return state_->answered("describe", {});
 }
 
 kj::Promise<void> DaemonServer::urlForItemIdentifier(UrlForItemIdentifierContext context) {
   context.allowCancellation();
   const std::string identifier = stringFromWire(context.getParams().getIdentifier());
-  state_->record("urlForItemIdentifier", {identifier});
   const auto answer = state_->currentAnswers().urlForItemIdentifier;
   encodeLocation(answer ? answer(identifier) : state_->locationOf(identifier),
                  context.getResults().initResult());
-  return state_->whenReleased("urlForItemIdentifier");
+  return state_->answered("urlForItemIdentifier", {identifier});
 }
 
 kj::Promise<void> DaemonServer::documentLocation(DocumentLocationContext context) {
   context.allowCancellation();
   const auto object = decodeObjectID(context.getParams().getObject());
   KJ_REQUIRE(object != nullptr, "no such object can be");
-  state_->record("documentLocation", {object->asString()});
   const auto answer = state_->currentAnswers().documentLocation;
   encodeLocation(answer ? answer(*object) : state_->locationOf(object->asString()),
                  context.getResults().initResult());
-  return state_->whenReleased("documentLocation");
+  return state_->answered("documentLocation", {object->asString()});
 }
 
 kj::Promise<void> DaemonServer::itemAtLocation(ItemAtLocationContext context) {
   context.allowCancellation();
   const std::string path = stringFromWire(context.getParams().getPath());
   const bool fakeFSEvent = context.getParams().getFakeFSEvent();
-  state_->record("itemAtLocation", {path, textOf(fakeFSEvent)});
   const auto answer = state_->currentAnswers().itemAtLocation;
   encodeItemAnswer(answer ? answer(path, fakeFSEvent) : state_->itemAt(path),
                    context.getResults().initResult());
-  return state_->whenReleased("itemAtLocation");
+  return state_->answered("itemAtLocation", {path, textOf(fakeFSEvent)});
 }
 
 kj::Promise<void> DaemonServer::containers(ContainersContext context) {
   context.allowCancellation();
-  state_->record("containers", {});
   const auto answer = state_->currentAnswers().containers;
   std::vector<ScriptedDaemon::Container> list;
   if (answer) {
@@ -213,18 +205,17 @@ kj::Promise<void> DaemonServer::containers(ContainersContext context) {
     builder[i].setApplicationID(wireText(list[i].applicationID));
     builder[i].setIconName(wireText(list[i].iconName));
   }
-  return state_->whenReleased("containers");
+  return state_->answered("containers", {});
 }
 
 kj::Promise<void> DaemonServer::containerItem(ContainerItemContext context) {
   context.allowCancellation();
   const std::string containerID = stringFromWire(context.getParams().getContainerID());
   const bool forceScan = context.getParams().getForceScan();
-  state_->record("containerItem", {containerID, textOf(forceScan)});
   const auto answer = state_->currentAnswers().containerItem;
   encodeItemAnswer(answer ? answer(containerID, forceScan) : state_->containerItem(containerID),
                    context.getResults().initResult());
-  return state_->whenReleased("containerItem");
+  return state_->answered("containerItem", {containerID, textOf(forceScan)});
 }
 
 kj::Promise<void> DaemonServer::enumerateItemsInFolder(EnumerateItemsInFolderContext context) {
@@ -235,9 +226,6 @@ kj::Promise<void> DaemonServer::enumerateItemsInFolder(EnumerateItemsInFolderCon
   const auto sortOrder = static_cast<std::uint8_t>(params.getSortOrder());
   const auto offset = params.getOffset();
   const auto limit = params.getLimit();
-  state_->record("enumerateItemsInFolder",
-                 {folder ? folder->asString() : "", std::to_string(sortOrder),
-                  std::to_string(offset), std::to_string(limit)});
   const auto answer = state_->currentAnswers().enumerateItemsInFolder;
   const std::string parent =
       folder ? folder->asString() : NSFileProviderRootContainerItemIdentifier;
@@ -245,7 +233,9 @@ kj::Promise<void> DaemonServer::enumerateItemsInFolder(EnumerateItemsInFolderCon
   encodePage(answer ? answer(folder, sortOrder, offset, limit)
                     : state_->page(belongs, sortOrder, offset, limit),
              context.getResults().initResult());
-  return state_->whenReleased("enumerateItemsInFolder");
+  return state_->answered("enumerateItemsInFolder",
+                          {folder ? folder->asString() : "", std::to_string(sortOrder),
+                           std::to_string(offset), std::to_string(limit)});
 }
 
 kj::Promise<void> DaemonServer::enumerateAllFolders(EnumerateAllFoldersContext context) {
@@ -254,24 +244,22 @@ kj::Promise<void> DaemonServer::enumerateAllFolders(EnumerateAllFoldersContext c
   const auto sortOrder = static_cast<std::uint8_t>(params.getSortOrder());
   const auto offset = params.getOffset();
   const auto limit = params.getLimit();
-  state_->record("enumerateAllFolders",
-                 {std::to_string(sortOrder), std::to_string(offset), std::to_string(limit)});
   const auto answer = state_->currentAnswers().enumerateAllFolders;
   const auto belongs = [](const ItemFields& item) { return item.kind == ItemKind::Folder; };
   encodePage(
       answer ? answer(sortOrder, offset, limit) : state_->page(belongs, sortOrder, offset, limit),
       context.getResults().initResult());
-  return state_->whenReleased("enumerateAllFolders");
+  return state_->answered("enumerateAllFolders", {std::to_string(sortOrder), std::to_string(offset),
+                                                  std::to_string(limit)});
 }
 
 kj::Promise<void> DaemonServer::currentNotifRank(CurrentNotifRankContext context) {
   context.allowCancellation();
-  state_->record("currentNotifRank", {});
   const auto answer = state_->currentAnswers().currentNotifRank;
   const auto rank = answer ? answer() : ScriptedDaemon::Rank{1, nullptr};
   context.getResults().setRank(rank.rank);
   ipc::encodeOptional(rank.error, context.getResults().initFailure());
-  return state_->whenReleased("currentNotifRank");
+  return state_->answered("currentNotifRank", {});
 }
 
 kj::Promise<void> DaemonServer::enumerateWorkingSetChanges(
@@ -281,17 +269,16 @@ kj::Promise<void> DaemonServer::enumerateWorkingSetChanges(
   const auto token = given.isValue() ? std::optional(stringFromWire(given.getValue()))
                                      : std::optional<std::string>();
   const auto limit = context.getParams().getLimit();
-  state_->record("enumerateWorkingSetChanges", {token.value_or(""), std::to_string(limit)});
   const auto answer = state_->currentAnswers().enumerateWorkingSetChanges;
   encodeChanges(answer ? answer(token, limit)
                        : ScriptedDaemon::Changes{{}, {}, token.value_or("scripted"), nullptr},
                 context.getResults().initResult());
-  return state_->whenReleased("enumerateWorkingSetChanges");
+  return state_->answered("enumerateWorkingSetChanges",
+                          {token.value_or(""), std::to_string(limit)});
 }
 
 kj::Promise<void> DaemonServer::getItemUpdateSender(GetItemUpdateSenderContext context) {
   context.allowCancellation();
-  state_->record("getItemUpdateSender", {});
   const auto answer = state_->currentAnswers().getItemUpdateSender;
   auto result = context.getResults().initResult();
   if (const auto refusal = answer ? answer() : nullptr) {
@@ -306,24 +293,22 @@ kj::Promise<void> DaemonServer::getItemUpdateSender(GetItemUpdateSenderContext c
     }
     result.setSender(kj::heap<SenderServer>(state_, number));
   }
-  return state_->whenReleased("getItemUpdateSender");
+  return state_->answered("getItemUpdateSender", {});
 }
 
 kj::Promise<void> DaemonServer::account(AccountContext context) {
   context.allowCancellation();
-  state_->record("account", {});
   const auto answer = state_->currentAnswers().account;
   encodeAccount(answer ? answer() : ScriptedDaemon::Account{"someone", "someone-here", nullptr},
                 context.getResults().initResult());
-  return state_->whenReleased("account");
+  return state_->answered("account", {});
 }
 
 kj::Promise<void> DaemonServer::observe(ObserveContext context) {
   context.allowCancellation();
-  state_->record("observe", {});
   context.getResults().setRegistration(
       kj::heap<RegistrationServer>(state_, context.getParams().getObserver()));
-  return state_->whenReleased("observe");
+  return state_->answered("observe", {});
 }
 
 }  // namespace

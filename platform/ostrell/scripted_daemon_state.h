@@ -37,7 +37,8 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
   std::vector<Container> containers GUARDED_BY(mutex);
   std::vector<bool> isSubscribed GUARDED_BY(mutex);
   std::size_t observerCount GUARDED_BY(mutex) = 0;
-  std::vector<ipc::Connection::Ref> connections GUARDED_BY(mutex);
+  std::map<std::uint64_t, ipc::Connection::Ref> connections GUARDED_BY(mutex);
+  std::uint64_t nextConnection GUARDED_BY(mutex) = 0;
   int listener GUARDED_BY(mutex) = -1;
 
   // Loop thread only.
@@ -53,9 +54,8 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
     ++events;
     condition.notifyAll();
   }
-  void record(const std::string& method, std::vector<std::string> arguments);
-  /// Done when answers to `method` may be sent. Loop thread.
-  kj::Promise<void> whenReleased(const std::string& method);
+  /// Records a call whose answer is made; done when the answer may be sent. Loop thread.
+  kj::Promise<void> answered(const std::string& method, std::vector<std::string> arguments);
   [[nodiscard]] Answers currentAnswers();
 
   // What is answered where the test gave no answer.

@@ -47,7 +47,8 @@ if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
 else()
   # Clang counts implicit sign changes as conversions where gcc does not.
   list(APPEND YOMBER_WARNINGS -Wno-sign-conversion -Wno-implicit-int-float-conversion
-    -Wthread-safety -Wno-gnu-zero-variadic-macro-arguments)
+    -Wthread-safety -Wzero-as-null-pointer-constant
+    -Winconsistent-missing-override -Wunused-macros -Wno-format-nonliteral -Wno-gnu-zero-variadic-macro-arguments)
 endif()
 
 if(YOMBER_SANITIZE STREQUAL "address")

@@ -175,7 +175,7 @@ class Containers::State {
   NSErrorRef start(Hooks hooks) {
     hooks_ = std::move(hooks);
     watchDirectories();
-    NSErrorRef error = refresh(Tell::Nobody);
+    NSErrorRef error = refresh();
     thread_ = std::thread([this] { follow(); });
     return error;
   }
@@ -227,7 +227,7 @@ class Containers::State {
       if (ready < 0) continue;
       if (ready > 0 && !waitForQuiet()) return;
       const bool areAllWatched = watchDirectories();
-      isSettled = refresh(Tell::Everybody) == nullptr && areAllWatched;
+      isSettled = refresh() == nullptr && areAllWatched;
     }
   }
 
@@ -245,9 +245,7 @@ class Containers::State {
     }
   }
 
-  enum class Tell { Nobody, Everybody };
-
-  NSErrorRef refresh(Tell tell) {
+  NSErrorRef refresh() {
     auto next = std::make_shared<ContainerList>();
     next->containers = readContainers(directories_, layout_);
     const auto current = list_.load();
@@ -266,7 +264,7 @@ class Containers::State {
     }
     next->generation = current->generation + 1;
     list_.store(std::move(next));
-    if (tell == Tell::Everybody && isChanged && hooks_.didChange) hooks_.didChange();
+    if (isChanged && hooks_.didChange) hooks_.didChange();
     return nullptr;
   }
 

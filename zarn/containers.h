@@ -50,7 +50,7 @@ class Containers {
     /// Makes the store's containers be these (without the drive's own), before the list shows them.
     /// On an error the list stays and it is tried again at the next change, or after a while.
     std::function<NSErrorRef(const std::vector<ContainerFolder>&)> apply;
-    /// The list has changed. Not called for the list that `start` reads.
+    /// The list has changed, from within `start` too.
     std::function<void()> didChange;
   };
 

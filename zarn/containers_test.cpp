@@ -147,11 +147,11 @@ TEST_F(FollowedContainersTest, FollowsWhatIsInstalledAndRemoved) {
   const auto first = containers.list();
   EXPECT_EQ(first->containers.size(), 4U);
   install("system/b.desktop", "Name=B\nX-Yomber-Container=org.b\n");
-  ASSERT_TRUE(waitForChanges(1));
+  ASSERT_TRUE(waitForChanges(2));
   EXPECT_EQ(containers.list()->containers.size(), 5U);
   EXPECT_GT(containers.list()->generation, first->generation);
   std::filesystem::remove(base_ + "/user/a.desktop");
-  ASSERT_TRUE(waitForChanges(2));
+  ASSERT_TRUE(waitForChanges(3));
   EXPECT_EQ(containers.list()->containers.size(), 4U);
   LockGuard guard(mutex_);
   EXPECT_THAT(applied_, ElementsAre(1U, 2U, 1U));

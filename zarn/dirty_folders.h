@@ -19,6 +19,7 @@ struct DirtyFolder {
   std::uint64_t id = 0;
   bool isWhole = false;            ///< any entry; `names` is empty then
   std::vector<std::string> names;  ///< names on this disk, each once, in byte order
+  unsigned attempts = 0;           ///< how often it was not found where it was thought to be
 };
 
 /// Collects what has to be looked at again, until a scan takes it.

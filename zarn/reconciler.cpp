@@ -103,16 +103,34 @@ void Reconciler::compareFolder(WriteTransaction& transaction, const FolderSnapsh
 void Reconciler::compareName(WriteTransaction& transaction, std::uint64_t folder,
                              const std::string& name, const FolderSnapshot& snapshot) {
   const OwnRanks ownRanks(*this, transaction);
-  auto row = findByDiskName(transaction.connection(), folder, name);
-  if (snapshot.entries.empty()) {
-    if (row) noteGone(std::move(*row), snapshot);
-    return;
+  compareEntry(transaction, folder, name, snapshot,
+               snapshot.entries.empty() ? nullptr : &snapshot.entries.front());
+}
+
+void Reconciler::compareNames(WriteTransaction& transaction, std::uint64_t folder,
+                              const std::vector<std::string>& names,
+                              const FolderSnapshot& snapshot) {
+  const OwnRanks ownRanks(*this, transaction);
+  if (!refreshFolder(transaction, folder, snapshot)) return;
+  const EntryTable table(snapshot);
+  for (const std::string& name : names) {
+    const auto index = table.find(name);
+    compareEntry(transaction, folder, name, snapshot,
+                 index ? &snapshot.entries[*index] : nullptr);
   }
-  const FolderEntry& entry = snapshot.entries.front();
-  if (!row) {
-    addCandidate(transaction, folder, snapshot, entry, 0);
-  } else if (row->inode != entry.inode || row->ctime != entry.ctime) {
-    settleKnown(transaction, snapshot, std::move(*row), entry);
+}
+
+/// `entry` is null when nothing has that name.
+void Reconciler::compareEntry(WriteTransaction& transaction, std::uint64_t folder,
+                              const std::string& name, const FolderSnapshot& snapshot,
+                              const FolderEntry* entry) {
+  auto row = findByDiskName(transaction.connection(), folder, name);
+  if (entry == nullptr) {
+    if (row) noteGone(std::move(*row), snapshot);
+  } else if (!row) {
+    addCandidate(transaction, folder, snapshot, *entry, 0);
+  } else if (row->inode != entry->inode || row->ctime != entry->ctime) {
+    settleKnown(transaction, snapshot, std::move(*row), *entry);
   }
 }
 

@@ -44,6 +44,9 @@ class Reconciler {
   /// Compares one name in a folder: `snapshot` holds it alone, or no entry when it is gone.
   void compareName(WriteTransaction& transaction, std::uint64_t folder, const std::string& name,
                    const FolderSnapshot& snapshot);
+  /// Compares a folder itself and some names in it: `snapshot` holds those that exist.
+  void compareNames(WriteTransaction& transaction, std::uint64_t folder,
+                    const std::vector<std::string>& names, const FolderSnapshot& snapshot);
   /// Decides what was left open, and removes the rows of what is gone.
   void finish(WriteTransaction& transaction);
 
@@ -95,6 +98,8 @@ class Reconciler {
   // Telling (reconciler.cpp).
   Differences findDifferences(WriteTransaction& transaction, std::uint64_t folder,
                               const FolderSnapshot& snapshot);
+  void compareEntry(WriteTransaction& transaction, std::uint64_t folder, const std::string& name,
+                    const FolderSnapshot& snapshot, const FolderEntry* entry);
   bool refreshFolder(WriteTransaction& transaction, std::uint64_t folder,
                      const FolderSnapshot& snapshot);
   void settleKnown(WriteTransaction& transaction, const FolderSnapshot& snapshot, ItemRow row,

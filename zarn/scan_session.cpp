@@ -4,11 +4,13 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <unordered_map>
 #include <unordered_set>
 
 #include "platform/foundation/log.h"
 #include "zarn/connection.h"
 #include "zarn/row_queries.h"
+#include "zarn/tree_layout.h"
 
 namespace yomber {
 
@@ -106,6 +108,19 @@ NSErrorRef ScanSession::compareNameAndFinish(std::uint64_t folder, const std::st
       walker, report);
 }
 
+NSErrorRef ScanSession::compareNamesAndFinish(const std::vector<NamesInFolder>& names,
+                                              const Snapshots& folders, TreeWalker& walker,
+                                              ScanReport& report) {
+  return runAndFinish(
+      [&](WriteTransaction& transaction) {
+        for (const auto& each : names) {
+          reconciler_.compareNames(transaction, each.folder, each.names, *each.snapshot);
+        }
+        for (const auto& snapshot : folders) reconciler_.compareFolder(transaction, *snapshot);
+      },
+      walker, report);
+}
+
 std::shared_ptr<const FileDescriptor> openFolderOfItem(const ItemStore& store,
                                                        std::uint64_t folder) {
   const auto path = store.physicalPath(folder);
@@ -147,6 +162,76 @@ NSErrorRef FolderScan::run(const std::vector<std::uint64_t>& folders, Depth dept
     countSnapshot(*snapshots.back(), report);
   }
   return session_.compareAndFinish(snapshots, walker_, report);
+}
+
+/// Null when there is nothing to do for it now. `folder` is then what was opened: the dirty one, or
+/// one above it.
+std::shared_ptr<const FileDescriptor> FolderScan::openDirty(const DirtyFolder& dirty,
+                                                            std::uint64_t& folder,
+                                                            std::vector<DirtyFolder>& notFound) {
+  const auto row = store_.itemByID(folder);
+  if (!row) return nullptr;
+  if (dirty.attempts >= Scanner::kMaximumAttempts) return open(folder);
+  auto opened = openFolderOfItem(store_, folder);
+  FolderEntry self;
+  const bool isIt =
+      opened && lookAtEntry(opened->get(), "", self) && self.inode == row->inode;
+  if (isIt) return opened;
+  notFound.push_back(dirty);
+  return nullptr;
+}
+
+NSErrorRef FolderScan::run(const std::vector<DirtyFolder>& folders,
+                           std::vector<DirtyFolder>& notFound, ScanReport& report) {
+  std::vector<ScanSession::NamesInFolder> names;
+  std::unordered_map<std::uint64_t, std::shared_ptr<const FileDescriptor>> whole;
+  for (const DirtyFolder& dirty : folders) {
+    std::uint64_t folder = dirty.id;
+    auto opened = openDirty(dirty, folder, notFound);
+    if (!opened) continue;
+    if (dirty.isWhole || folder != dirty.id) {
+      whole.emplace(folder, std::move(opened));
+      continue;
+    }
+    ScanSession::NamesInFolder some{.folder = folder, .names = dirty.names, .snapshot = nullptr};
+    some.snapshot = readNames(std::move(opened), some.names, report);
+    if (some.snapshot) names.push_back(std::move(some));
+  }
+  ScanSession::Snapshots snapshots;
+  for (auto& [folder, opened] : whole) {
+    const std::uint64_t visit = TreeWalker::nextVisit();
+    session_.setFolderOfVisit(visit, folder);
+    snapshots.push_back(walker_.read(std::move(opened), visit));
+    countSnapshot(*snapshots.back(), report);
+  }
+  if (names.empty() && snapshots.empty()) return nullptr;
+  return session_.compareNamesAndFinish(names, snapshots, walker_, report);
+}
+
+/// Takes out the names of which nothing can be said. Null when the folder itself is gone.
+std::unique_ptr<FolderSnapshot> FolderScan::readNames(std::shared_ptr<const FileDescriptor> folder,
+                                                      std::vector<std::string>& names,
+                                                      ScanReport& report) {
+  auto snapshot = std::make_unique<FolderSnapshot>();
+  snapshot->rankBefore = store_.database()->currentRank();
+  snapshot->isReadable = true;
+  if (!lookAtEntry(folder->get(), "", snapshot->self)) return nullptr;
+  std::erase_if(names, [&](const std::string& name) {
+    if (isExcludedName(name)) return true;
+    FolderEntry entry;
+    if (!lookAtEntry(folder->get(), name.c_str(), entry)) {
+      return errno != ENOENT && errno != EINVAL;
+    }
+    entry.nameOffset = static_cast<std::uint32_t>(snapshot->names.size());
+    entry.nameLength = static_cast<std::uint16_t>(name.size());
+    if (entry.type == EntryType::Folder) entry.visit = TreeWalker::nextVisit();
+    snapshot->names += name;
+    snapshot->entries.push_back(entry);
+    return false;
+  });
+  snapshot->folder = std::move(folder);
+  report.entries += names.size();
+  return snapshot;
 }
 
 NSErrorRef FolderScan::readSubtree(std::shared_ptr<const FileDescriptor> folder,

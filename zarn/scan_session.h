@@ -43,6 +43,16 @@ class ScanSession {
   [[nodiscard]] NSErrorRef compareNameAndFinish(std::uint64_t folder, const std::string& name,
                                                 const FolderSnapshot& snapshot, TreeWalker& walker,
                                                 ScanReport& report);
+  /// Some names in a folder.
+  struct NamesInFolder {
+    std::uint64_t folder = 0;
+    std::vector<std::string> names;
+    std::unique_ptr<FolderSnapshot> snapshot;  ///< of those that exist
+  };
+  /// The same for names in some folders and all of others, as one change.
+  [[nodiscard]] NSErrorRef compareNamesAndFinish(const std::vector<NamesInFolder>& names,
+                                                 const Snapshots& folders, TreeWalker& walker,
+                                                 ScanReport& report);
   [[nodiscard]] NSErrorRef finish();
 
   [[nodiscard]] std::uint64_t changes() const { return changes_; }
@@ -69,9 +79,16 @@ class FolderScan {
         walker_(std::move(options)) {}
   [[nodiscard]] NSErrorRef run(const std::vector<std::uint64_t>& folders, Depth depth,
                                ScanReport& report);
+  /// Folders that are not where their rows say go into `notFound`.
+  [[nodiscard]] NSErrorRef run(const std::vector<DirtyFolder>& folders,
+                               std::vector<DirtyFolder>& notFound, ScanReport& report);
 
  private:
   std::shared_ptr<const FileDescriptor> open(std::uint64_t& folder);
+  std::shared_ptr<const FileDescriptor> openDirty(const DirtyFolder& dirty, std::uint64_t& folder,
+                                                  std::vector<DirtyFolder>& notFound);
+  std::unique_ptr<FolderSnapshot> readNames(std::shared_ptr<const FileDescriptor> folder,
+                                            std::vector<std::string>& names, ScanReport& report);
   NSErrorRef readSubtree(std::shared_ptr<const FileDescriptor> folder, std::uint64_t visit,
                          ScanReport& report);
 

@@ -22,7 +22,7 @@
 namespace yomber {
 namespace {
 
-constexpr std::size_t kWaitingFolders = 128;
+constexpr std::size_t kWaitingFolders = 64;
 constexpr std::size_t kWaitingEntries = 50'000;
 
 /// Walks places on a thread of its own; the snapshots come out of the queue.
@@ -101,6 +101,7 @@ class Scanner::State {
   const std::weak_ptr<FolderVisitor> visitor;
   const LinkResolver links;
   Stamper stamper;
+  Mutex wholeScan;  ///< held by a scan of the whole tree: two first scans would issue two ids each
 };
 
 NSErrorRef Scanner::State::findPlaces(std::vector<ScanPlace>& places) const {
@@ -184,6 +185,7 @@ NSErrorRef Scanner::scanAll(ScanReport* report) {
   ScanReport own;
   ScanReport& out = report != nullptr ? *report : own;
   out = {};
+  LockGuard guard(state_->wholeScan);
   if (state_->store->database()->needsFirstScan()) return state_->firstScan(out);
   return state_->reconcile(out);
 }
@@ -194,6 +196,25 @@ NSErrorRef Scanner::scanFolders(const std::vector<std::uint64_t>& folders, ScanR
   out = {};
   FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
   return scan.run(folders, FolderScan::Depth::NewOnly, out);
+}
+
+NSErrorRef Scanner::scanDirty(const std::vector<DirtyFolder>& folders,
+                              std::vector<DirtyFolder>& notFound, ScanReport* report) {
+  ScanReport own;
+  ScanReport& out = report != nullptr ? *report : own;
+  out = {};
+  const auto run = [&](const std::vector<DirtyFolder>& some, std::vector<DirtyFolder>& missing) {
+    FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
+    return scan.run(some, missing, out);
+  };
+  std::vector<DirtyFolder> missing;
+  notFound.clear();
+  if (NSErrorRef error = run(folders, missing)) return error;
+  if (missing.empty()) return nullptr;
+  // The others may have told where they are now.
+  if (NSErrorRef error = run(missing, notFound)) return error;
+  for (DirtyFolder& folder : notFound) ++folder.attempts;
+  return nullptr;
 }
 
 NSErrorRef Scanner::scanSubtree(std::uint64_t folder, ScanReport* report) {

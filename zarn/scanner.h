@@ -9,6 +9,7 @@
 
 #include "platform/foundation/error.h"
 #include "zarn/database.h"
+#include "zarn/dirty_folders.h"
 #include "zarn/item_row.h"
 #include "zarn/item_store.h"
 #include "zarn/tree_layout.h"
@@ -58,6 +59,14 @@ class Scanner {
   /// reported once. Folders that are new in them are scanned with all that they hold.
   [[nodiscard]] NSErrorRef scanFolders(const std::vector<std::uint64_t>& folders,
                                        ScanReport* report = nullptr);
+  /// The same for single names in folders; what it costs does not depend on how many entries they
+  /// have. Folders that are not where their rows say are moving: they are answered in `notFound`,
+  /// to be tried again when more of the move has been seen. After `kMaximumAttempts` of that, the
+  /// folder above is scanned instead.
+  [[nodiscard]] NSErrorRef scanDirty(const std::vector<DirtyFolder>& folders,
+                                     std::vector<DirtyFolder>& notFound,
+                                     ScanReport* report = nullptr);
+  static constexpr unsigned kMaximumAttempts = 4;
   /// A folder with everything below it.
   [[nodiscard]] NSErrorRef scanSubtree(std::uint64_t folder, ScanReport* report = nullptr);
 

@@ -8,6 +8,7 @@
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <iterator>
 #include <thread>
 #include <utility>
 
@@ -25,6 +26,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 constexpr unsigned kMaximumRetryFactor = 64;
 constexpr std::size_t kUnwatchedSlice = 128;
+constexpr std::chrono::milliseconds kNotFoundPause{20};
 
 }  // namespace
 
@@ -213,7 +215,7 @@ class TreeObserver::State {
       const auto unwatched =
           fullScanDue_ || watches_.unwatched().empty() ? Clock::time_point::max() : nextUnwatched_;
       if (fullScan <= now) return fullScanTask();
-      if (dirty <= now) return {.kind = Task::Kind::Dirty, .dirty = dirty_.take(now)};
+      if (dirty <= now) return dirtyTask(now);
       if (unwatched <= now) return unwatchedTask();
       const auto next = std::min({fullScan, dirty, unwatched});
       if (next == Clock::time_point::max()) {
@@ -225,14 +227,23 @@ class TreeObserver::State {
   }
 
   Clock::time_point dirtyTime() const REQUIRES(mutex_) {
-    const auto due = dirty_.dueTime();
-    return due ? std::max(*due, notBefore_) : Clock::time_point::max();
+    auto due = dirty_.dueTime().value_or(Clock::time_point::max());
+    if (!notFound_.empty()) due = std::min(due, notFoundDue_);
+    return std::max(due, notBefore_);
+  }
+
+  Task dirtyTask(Clock::time_point now) REQUIRES(mutex_) {
+    Task task{.kind = Task::Kind::Dirty, .dirty = dirty_.take(now)};
+    std::ranges::move(notFound_, std::back_inserter(task.dirty));
+    notFound_.clear();
+    return task;
   }
 
   Task fullScanTask() REQUIRES(mutex_) {
     fullScanDue_ = false;
     fullScanRunning_ = true;
     dirty_.clear();
+    notFound_.clear();
     return {.kind = Task::Kind::All, .dirty = {}};
   }
 
@@ -269,12 +280,17 @@ class TreeObserver::State {
 
   void scanDirty(const std::vector<DirtyFolder>& dirty) {
     if (dirty.empty()) return;
-    NSErrorRef error = tree_.scanDirty(dirty);
+    std::vector<DirtyFolder> notFound;
+    NSErrorRef error = tree_.scanDirty(dirty, notFound);
     const bool failed = error != nullptr;
     noteOutcome(std::move(error), "the scan of changed folders");
-    if (!failed) return;
     LockGuard guard(mutex_);
-    for (const auto& folder : dirty) putBack(folder);
+    if (failed) {
+      for (const auto& folder : dirty) putBack(folder);
+    } else if (!notFound.empty()) {
+      notFound_ = std::move(notFound);
+      notFoundDue_ = Clock::now() + kNotFoundPause;
+    }
   }
 
   void putBack(const DirtyFolder& folder) REQUIRES(mutex_) {
@@ -285,7 +301,8 @@ class TreeObserver::State {
   /// The more a round costs, the rarer it comes.
   void scanUnwatched(const std::vector<DirtyFolder>& folders) {
     const auto before = Clock::now();
-    noteOutcome(tree_.scanDirty(folders), "the scan of folders without a watch");
+    std::vector<DirtyFolder> notFound;  // their turn comes again anyway
+    noteOutcome(tree_.scanDirty(folders, notFound), "the scan of folders without a watch");
     const auto after = Clock::now();
     LockGuard guard(mutex_);
     unwatchedCost_ += after - before;
@@ -334,6 +351,8 @@ class TreeObserver::State {
   unsigned retryFactor_ GUARDED_BY(mutex_) = 1;
   Clock::time_point notBefore_ GUARDED_BY(mutex_) = Clock::time_point::min();
   Clock::time_point nextUnwatched_ GUARDED_BY(mutex_) = Clock::time_point::min();
+  std::vector<DirtyFolder> notFound_ GUARDED_BY(mutex_);  // moving; tried again a moment later
+  Clock::time_point notFoundDue_ GUARDED_BY(mutex_) = Clock::time_point::min();
   std::vector<std::uint64_t> unwatchedRound_ GUARDED_BY(mutex_);  // still to be scanned
   Clock::duration unwatchedCost_ GUARDED_BY(mutex_){};            // of the round so far
 

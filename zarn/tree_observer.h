@@ -20,7 +20,9 @@ namespace yomber {
 /// thread, one at a time, and may block.
 struct ObservedTree {
   std::function<NSErrorRef()> scanAll;
-  std::function<NSErrorRef(const std::vector<DirtyFolder>&)> scanDirty;
+  /// What is put into `notFound` is scanned again a moment later.
+  std::function<NSErrorRef(const std::vector<DirtyFolder>&, std::vector<DirtyFolder>& notFound)>
+      scanDirty;
   /// Told once, after the first `scanAll` has succeeded. May be empty.
   std::function<void()> didFinishFirstScan;
 };

@@ -43,7 +43,7 @@ class TreeObserverTest : public testing::Test {
   void start(TreeObserver::Options options = {}) {
     observer_ = std::make_shared<TreeObserver>(options);
     observer_->start({.scanAll = [this] { return scanAll(); },
-                      .scanDirty = [this](const auto& dirty) { return scanDirty(dirty); },
+                      .scanDirty = [this](const auto& dirty, auto&) { return scanDirty(dirty); },
                       .didFinishFirstScan = {}});
     ASSERT_TRUE(waitUntil([this] { return !observer_->status().scanning; }));
     ASSERT_TRUE(waitUntilPictureIsRight());

@@ -1,0 +1,208 @@
+#include "zarn/drive.h"
+
+#include <cerrno>
+#include <chrono>
+#include <thread>
+#include <utility>
+
+#include "platform/foundation/date.h"
+#include "platform/foundation/fault_points.h"
+#include "platform/foundation/lock.h"
+#include "platform/foundation/log.h"
+#include "platform/ostrell/constants.h"
+
+namespace yomber {
+
+namespace {
+
+NSErrorRef loggedOutError() {
+  return NSError::errorWithDomain(
+      QSOstrellErrorDomain, QSOstrellErrorLoggedOut,
+      {{NSLocalizedDescriptionKey,
+        std::string("nobody is signed in to the drive: yomber account sign-in NAME")}});
+}
+
+NSErrorRef folderError(int number, const TreeLayout& layout) {
+  const auto cause = NSError::errorWithErrno(number, layout.tree());
+  return NSError::errorWithDomain(
+      NSPOSIXErrorDomain, number,
+      {{NSFilePathErrorKey, layout.tree()},
+       {NSLocalizedDescriptionKey, "the drive's folders cannot be made in " + layout.home() + ": " +
+                                       cause->localizedDescription()}});
+}
+
+}  // namespace
+
+/// What has to be done now and then: marks for files that the first scan left unmarked, and items
+/// that leave the working set as time goes by.
+class Drive::Housekeeping {
+ public:
+  Housekeeping(std::shared_ptr<Scanner> scanner, std::shared_ptr<WorkingSetSignals> signals)
+      : scanner_(std::move(scanner)), signals_(std::move(signals)), thread_([this] { run(); }) {}
+  ~Housekeeping() {
+    {
+      LockGuard guard(mutex_);
+      isStopping_ = true;
+      changed_.notifyAll();
+    }
+    thread_.join();
+  }
+
+ private:
+  static constexpr std::uint32_t kStamps = 100;
+  static constexpr std::chrono::milliseconds kStampPause{50};
+  static constexpr std::chrono::minutes kPause{15};
+
+  /// False when it is time to stop.
+  bool pause(std::chrono::milliseconds length) {
+    const auto until = std::chrono::steady_clock::now() + length;
+    LockGuard guard(mutex_);
+    while (!isStopping_) {
+      if (!changed_.waitUntil(mutex_, until)) break;
+    }
+    return !isStopping_;
+  }
+
+  void run() {
+    while (true) {
+      signals_->expire(NSDate::now().nanoseconds());
+      while (scanner_->stampSome(kStamps) != 0) {
+        if (!pause(kStampPause)) return;
+      }
+      if (!pause(kPause)) return;
+    }
+  }
+
+  const std::shared_ptr<Scanner> scanner_;
+  const std::shared_ptr<WorkingSetSignals> signals_;
+  Mutex mutex_;
+  Condition changed_;
+  bool isStopping_ GUARDED_BY(mutex_) = false;
+  std::thread thread_;
+};
+
+std::shared_ptr<Drive> Drive::open(const DrivePaths& paths, Options options, NSErrorRef* error) {
+  NSErrorRef failure = paths.create();
+  if (!failure) {
+    const TreeLayout layout(paths.home);
+    if (const int number = layout.createFolders()) failure = folderError(number, layout);
+  }
+  std::shared_ptr<Database> database;
+  if (!failure) database = Database::open(paths.database, &failure);
+  std::shared_ptr<Account> account;
+  if (database) account = Account::open(paths.home + "/account", &failure);
+  if (!account) {
+    storeError(error, std::move(failure));
+    return nullptr;
+  }
+  std::shared_ptr<Drive> drive(
+      new Drive(paths, std::move(options), std::move(database), std::move(account)));
+  drive->account->onChange([drive = drive.get()] { drive->accountDidChange(); });
+  return drive;
+}
+
+Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Database> opened,
+             std::shared_ptr<Account> openedAccount)
+    : paths(drivePaths),
+      layout(drivePaths.home),
+      database(std::move(opened)),
+      store(std::make_shared<ItemStore>(database, layout)),
+      listing(std::make_shared<Listing>(database)),
+      feed(std::make_shared<ChangeFeed>(database)),
+      observer(std::make_shared<TreeObserver>(options.observer)),
+      scanner(std::make_shared<Scanner>(store, observer)),
+      watchers(Watchers::create([itemStore = store](std::uint64_t id) {
+        return itemStore->ancestors(id);
+      }, options.watchers)),
+      registrations(std::make_shared<Registrations>()),
+      firstScan(std::make_shared<FirstScanGate>()),
+      account(std::move(openedAccount)),
+      containers(std::make_shared<Containers>(std::move(options.applications), layout)),
+      workingSetSignals_(std::make_shared<WorkingSetSignals>(
+          feed, [weak = std::weak_ptr(registrations)] {
+            if (const auto strong = weak.lock()) strong->workingSetDidChange();
+          })) {
+  database->addSink(observer);
+  database->addSink(watchers);
+  database->addSink(workingSetSignals_);
+}
+
+Drive::~Drive() { stop(); }
+
+void Drive::start() {
+  if (!database->needsFirstScan()) {
+    firstScan->open();
+    workingSetSignals_->start();
+  }
+  // Before the scan, so that it looks into the containers' folders too.
+  (void)containers->start(
+      {.apply = [this](const auto& folders) { return applyContainers(folders); },
+       .didChange = [this] { registrations->containerListDidChange(); }});
+  observer->start({.scanAll = [this] { return scanAll(); },
+                   .scanDirty =
+                       [this](const auto& dirty, auto& notFound) {
+                         return scanner->scanDirty(dirty, notFound);
+                       },
+                   .didFinishFirstScan =
+                       [this] {
+                         housekeeping_ =
+                             std::make_unique<Housekeeping>(scanner, workingSetSignals_);
+                       }});
+}
+
+void Drive::stop() {
+  containers->stop();
+  observer->stop();
+  housekeeping_.reset();
+}
+
+NSErrorRef Drive::scanAll() {
+  firstScan->retry();
+  hasBegunScanning_.store(true);
+  const bool isFirst = database->needsFirstScan();
+  const auto begin = std::chrono::steady_clock::now();
+  ScanReport report;
+  static FaultPoint beforeScan("zarn.drive.before-scan");
+  NSErrorRef error = beforeScan.hit() ? NSError::errorWithErrno(EIO, layout.tree())
+                                      : scanner->scanAll(&report);
+  if (error) {
+    if (isFirst) firstScan->fail(error);
+    return error;
+  }
+  const auto duration = std::chrono::steady_clock::now() - begin;
+  log_default(defaultLog(),
+              "[NOTICE] scanned %llu folders with %llu entries in %.3f s, %llu changes",
+              report.folders, report.entries, std::chrono::duration<double>(duration).count(),
+              report.changes);
+  if (report.unreadable != 0) {
+    log_error(defaultLog(), "[ERROR] %llu folders cannot be read; what was known of them stays",
+              report.unreadable);
+  }
+  if (isFirst) {
+    workingSetSignals_->start();
+    firstScan->open();
+  }
+  return nullptr;
+}
+
+NSErrorRef Drive::applyContainers(const std::vector<ContainerFolder>& folders) {
+  if (NSErrorRef error = store->setContainers(folders)) return error;
+  if (!hasBegunScanning_.load()) return nullptr;  // the scan will look into them
+  for (const auto& folder : folders) {
+    const auto row = store->itemForContainer(folder.containerID);
+    if (!row) continue;
+    if (NSErrorRef error = scanner->scanSubtree(row->id)) return error;
+  }
+  return nullptr;
+}
+
+void Drive::accountDidChange() {
+  if (auto error = accountError()) watchers->failAll(error);
+  registrations->accountTokenDidChange();
+}
+
+NSErrorRef Drive::accountError() const {
+  return account->current() ? nullptr : loggedOutError();
+}
+
+}  // namespace yomber

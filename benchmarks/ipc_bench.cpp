@@ -12,7 +12,7 @@
 #include <thread>
 #include <vector>
 
-#include "bench/figure.h"
+#include "benchmarks/figure.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/connection.h"
 #include "platform/ipc/test_echo_server.h"

@@ -1,4 +1,4 @@
-#include "bench/figure.h"
+#include "benchmarks/figure.h"
 
 #include <algorithm>
 #include <chrono>

@@ -4,8 +4,8 @@
 #include <iostream>
 #include <numeric>
 
-#include "bench/figure.h"
-#include "bench/many_files.h"
+#include "benchmarks/figure.h"
+#include "benchmarks/many_files.h"
 #include "platform/fileprovider/constants.h"
 #include "tests/harness/test_drive.h"
 #include "yomber/drive_client.h"

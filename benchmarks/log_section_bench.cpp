@@ -2,7 +2,7 @@
 
 #include <mutex>
 
-#include "bench/figure.h"
+#include "benchmarks/figure.h"
 #include "provider/extension/log_sections.h"
 
 int main() {

@@ -1,6 +1,6 @@
 // A folder enumerator takes 5,000 records from the daemon and hands them out.
 
-#include "bench/figure.h"
+#include "benchmarks/figure.h"
 #include "platform/fileprovider/manager.h"
 #include "provider/enumeration/file_enumerator.h"
 

@@ -1,4 +1,4 @@
-#include "bench/many_files.h"
+#include "benchmarks/many_files.h"
 
 #include <array>
 #include <cstdio>
@@ -7,7 +7,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
-#include "bench/figure.h"
+#include "benchmarks/figure.h"
 #include "tests/harness/child_process.h"
 
 namespace yomber::bench {

@@ -9,7 +9,7 @@
 #include <thread>
 #include <unordered_map>
 
-#include "bench/figure.h"
+#include "benchmarks/figure.h"
 #include "tests/harness/test_drive.h"
 
 namespace {

@@ -4,8 +4,8 @@
 #include <filesystem>
 #include <iostream>
 
-#include "bench/figure.h"
-#include "bench/many_files.h"
+#include "benchmarks/figure.h"
+#include "benchmarks/many_files.h"
 #include "platform/ipc/call.h"
 #include "tests/harness/test_drive.h"
 #include "yomber/drive_client.h"

@@ -25,6 +25,8 @@ const char* kindName(ItemKind kind) {
   return "unknown";
 }
 
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wconversion"  // within ICU's macro
 /// The code point at `index`, which moves past it; negative when the bytes are no UTF-8.
 UChar32 nextCodePoint(const std::string& bytes, std::int32_t& index) {
   UChar32 point = 0;
@@ -32,6 +34,7 @@ UChar32 nextCodePoint(const std::string& bytes, std::int32_t& index) {
   U8_NEXT(bytes.data(), index, length, point);
   return point;
 }
+#pragma GCC diagnostic pop
 
 bool isUtf8(const std::string& bytes) {
   for (std::int32_t index = 0; index < static_cast<std::int32_t>(bytes.size());) {

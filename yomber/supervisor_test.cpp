@@ -7,10 +7,13 @@
 #include <fstream>
 
 #include <poll.h>
-#include <sys/pidfd.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+extern "C" {
+#include <sys/pidfd.h>  // Debian 12's does not say extern "C" itself
+}
 
 #include <gtest/gtest.h>
 

@@ -7,10 +7,13 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <spawn.h>
-#include <sys/pidfd.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+extern "C" {
+#include <sys/pidfd.h>  // Debian 12's does not say extern "C" itself
+}
 
 extern char** environ;
 

@@ -29,8 +29,10 @@ inline const std::string QSUbiquitousDocumentsFolderName = "Documents";
 inline const std::string QSUbiquitousDesktopFolderName = "Desktop";
 
 /// Posted after the account changed; observers ask QSAccount afresh.
-inline const std::string QSAccountTokenDidChangeNotification = "QSAccountTokenDidChangeNotification";
+inline const std::string QSAccountTokenDidChangeNotification =
+    "QSAccountTokenDidChangeNotification";
 /// Posted after the list of containers changed.
-inline const std::string QSContainerListDidChangeNotification = "QSContainerListDidChangeNotification";
+inline const std::string QSContainerListDidChangeNotification =
+    "QSContainerListDidChangeNotification";
 
 }  // namespace yomber

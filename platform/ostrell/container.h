@@ -14,8 +14,8 @@ using QSContainerRef = std::shared_ptr<const QSContainer>;
 
 /// An application's part of the drive.
 ///
-/// Ownership: shared, immutable; the list is a snapshot that the library keeps until the daemon says
-/// that it changed (QSContainerListDidChangeNotification) or the connection is lost.
+/// Ownership: shared, immutable; the list is a snapshot that the library keeps until the daemon
+/// says that it changed (QSContainerListDidChangeNotification) or the connection is lost.
 /// Thread-safety: every operation may be called on any thread; the class operations may block for a
 /// synchronous daemon reply when there is no snapshot.
 class QSContainer {

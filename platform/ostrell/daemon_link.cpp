@@ -123,7 +123,7 @@ DaemonLink::DaemonLink(const std::string& home, std::string socketPath)
       announcer_(std::make_shared<ChangeAnnouncer>()),
       retryDelay_(kFirstRetryDelay) {}
 
-void DaemonLink::withSession(SessionHandler handler) {
+void DaemonLink::withSession(const SessionHandler& handler) {
   DaemonSessionRef session = session_.load();
   NSErrorRef error;
   bool isFirst = false;
@@ -133,7 +133,7 @@ void DaemonLink::withSession(SessionHandler handler) {
     if (isShutDown_) {
       error = ipc::connectionError(NSXPCConnectionInvalid, "The daemon's connection was ended.");
     } else if (!session) {
-      waiting_.push_back(std::move(handler));
+      waiting_.push_back(handler);
       isFirst = !std::exchange(isAttempting_, true);
     }
   }

@@ -90,7 +90,7 @@ class DaemonLink : public std::enable_shared_from_this<DaemonLink> {
   /// Calls `handler` at once when there is a session, else on the loop thread (or a pool thread)
   /// when the attempt that is under way, or that this starts, has ended. `handler` must not block.
   /// Handlers run in the order of the calls.
-  void withSession(SessionHandler handler);
+  void withSession(const SessionHandler& handler);
   /// The session, when there is one.
   [[nodiscard]] DaemonSessionRef session() const { return session_.load(); }
   /// Waits for the attempt when there is none; nil and an error when it fails.

@@ -12,7 +12,8 @@ namespace yomber {
 /// Nobody is signed in: QSOstrellErrorDomain 2.
 [[nodiscard]] NSErrorRef qsc_errorLoggedOut();
 /// QSOstrellErrorDomain 3, naming the parameter and its value.
-[[nodiscard]] NSErrorRef qsc_errorInvalidParameter(const std::string& parameter, const std::optional<std::string>& value);
+[[nodiscard]] NSErrorRef qsc_errorInvalidParameter(const std::string& parameter,
+                                                   const std::optional<std::string>& value);
 
 /// The log of the client library and of the extension.
 [[nodiscard]] Log& qsc_default_log();

@@ -43,8 +43,9 @@ QSFileObjectIDRef QSFileObjectID::fileObjectIDWithString(std::string_view string
   // A leading zero is either zero or a form that is never printed.
   if (!kind || digits[0] < '1' || digits[0] > '9') return nullptr;
   std::uint64_t rawID = 0;
-  const char* const end = digits.data() + digits.size();
-  const auto [parsed, failure] = std::from_chars(digits.data(), end, rawID);
+  const char* const begin = &digits.front();
+  const char* const end = begin + digits.size();
+  const auto [parsed, failure] = std::from_chars(begin, end, rawID);
   if (failure != std::errc() || parsed != end || rawID > kLargestRawID) return nullptr;
   return std::make_shared<QSFileObjectID>(*kind, rawID);
 }

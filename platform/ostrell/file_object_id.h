@@ -24,8 +24,8 @@ class QSFileObjectID final : public NSObject {
 
   QSFileObjectID(Kind kind, std::uint64_t rawID) : kind_(kind), rawID_(rawID) {}
 
-  /// Nil for anything that `asString` could not have printed: another letter, a sign, leading zeros,
-  /// zero, more than 63 bits, trailing bytes.
+  /// Nil for anything that `asString` could not have printed: another letter, a sign, leading
+  /// zeros, zero, more than 63 bits, trailing bytes.
   static QSFileObjectIDRef fileObjectIDWithString(std::string_view string);
 
   [[nodiscard]] Kind kind() const { return kind_; }
@@ -45,10 +45,14 @@ class QSFileObjectID final : public NSObject {
 
 /// For maps keyed by id.
 struct QSFileObjectIDHash {
-  std::size_t operator()(const QSFileObjectIDRef& id) const { return std::hash<std::uint64_t>()(id->rawID()); }
+  std::size_t operator()(const QSFileObjectIDRef& id) const {
+    return std::hash<std::uint64_t>()(id->rawID());
+  }
 };
 struct QSFileObjectIDEqual {
-  bool operator()(const QSFileObjectIDRef& left, const QSFileObjectIDRef& right) const { return left->isEqual(*right); }
+  bool operator()(const QSFileObjectIDRef& left, const QSFileObjectIDRef& right) const {
+    return left->isEqual(*right);
+  }
 };
 
 }  // namespace yomber

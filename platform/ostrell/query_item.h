@@ -34,9 +34,11 @@ class QSQueryItem final : public NSFileProviderItem {
 
   /// The item that describes a container's folder, or nil. A synchronous daemon call; failures are
   /// logged and answered as nil.
-  static QSQueryItemRef containerItemForContainer(const std::shared_ptr<const QSContainer>& container, ForceScan forceScan);
+  static QSQueryItemRef containerItemForContainer(
+      const std::shared_ptr<const QSContainer>& container, ForceScan forceScan);
   /// The item at a location. A synchronous daemon call.
-  static QSQueryItemRef askDaemonQueryItemForURL(const NSURLRef& url, ForceScan andFakeFSEvent, NSErrorRef* error);
+  static QSQueryItemRef askDaemonQueryItemForURL(const NSURLRef& url, ForceScan andFakeFSEvent,
+                                                 NSErrorRef* error);
 
  private:
   const ItemFields fields_;

@@ -1,3 +1,5 @@
+#include <kj/debug.h>
+
 #include <utility>
 
 #include "platform/fileprovider/item_codec.h"

@@ -280,17 +280,17 @@ TEST_F(ChangeHistoryTest, TheLockMayBeTakenAgainByTheObserverThatIsCalledUnderIt
   EXPECT_THAT(changesFrom(first)->updated(), ElementsAre("d:5"));
 }
 
-TEST_F(ChangeHistoryTest, ASignalIsSentAfterTheLockWasReleased) {
-  // The reply follows the signal, and neither may be under the lock.
+TEST_F(ChangeHistoryTest, ABatchIsSignalledAndAnsweredAfterTheLockWasReleased) {
+  Gate finished;
+  std::thread other;
   enumerator->receiveUpdates({}, {}, {}, [&] {
-    Gate answered;
-    std::thread other([&] {
+    other = std::thread([&] {
       (void)changesFrom(first);
-      answered.open();
+      finished.open();
     });
-    EXPECT_TRUE(answered.wait());
-    other.join();
+    EXPECT_TRUE(finished.wait());
   });
+  other.join();
 }
 
 TEST_F(ChangeHistoryTest, ReceivingHandingOutAndDroppingRunConcurrently) {

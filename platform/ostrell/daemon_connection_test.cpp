@@ -389,11 +389,11 @@ TEST_F(StuckDaemonTest, ConnectingToOneThatNeverAnswersFailsEveryCallerAndIsTrie
   EXPECT_FALSE(askForLocation());
 }
 
-using DaemonConnectionDeathTest = DaemonConnectionTest;
-
-TEST_F(DaemonConnectionDeathTest, WaitingOnTheLoopThreadIsABug) {
+TEST(DaemonConnectionDeathTest, WaitingOnTheLoopThreadIsABug) {
   testing::GTEST_FLAG(death_test_style) = "threadsafe";
-  EXPECT_DEATH(ipc::EventLoop::shared().runAndWait([] { (void)askForLocation(); }), "");
+  QSDaemonConnection::setDefaultHome("/nonexistent");
+  EXPECT_DEATH(ipc::EventLoop::shared().runAndWait([] { (void)askForLocation(); }),
+               "waiting for the daemon");
 }
 
 }  // namespace

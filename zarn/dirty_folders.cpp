@@ -31,6 +31,11 @@ void DirtyFolders::noteWhole(std::uint64_t folder) {
   entry.names.clear();
 }
 
+void DirtyFolders::noteDeep(std::uint64_t folder) {
+  noteWhole(folder);
+  folders_[folder].isDeep = true;
+}
+
 void DirtyFolders::noteModify(std::uint64_t folder, std::string_view name, Clock::time_point now) {
   if (modified_.size() >= kMaximumModified) return noteName(folder, name);
   const auto [at, isNew] = modified_.try_emplace(Place(folder, name), now + modifyInterval_);
@@ -82,7 +87,7 @@ std::vector<DirtyFolder> DirtyFolders::take(Clock::time_point now) {
   std::vector<DirtyFolder> result;
   result.reserve(folders_.size());
   for (auto& [id, entry] : folders_) {
-    DirtyFolder folder{.id = id, .isWhole = entry.isWhole, .names = {}};
+    DirtyFolder folder{.id = id, .isWhole = entry.isWhole, .isDeep = entry.isDeep, .names = {}};
     folder.names.reserve(entry.names.size());
     while (!entry.names.empty()) {
       folder.names.push_back(std::move(entry.names.extract(entry.names.begin()).value()));

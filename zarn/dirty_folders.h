@@ -18,6 +18,7 @@ namespace yomber {
 struct DirtyFolder {
   std::uint64_t id = 0;
   bool isWhole = false;            ///< any entry; `names` is empty then
+  bool isDeep = false;             ///< and everything below
   std::vector<std::string> names;  ///< names on this disk, each once, in byte order
   unsigned attempts = 0;           ///< how often it was not found where it was thought to be
 };
@@ -37,6 +38,7 @@ class DirtyFolders {
 
   void noteName(std::uint64_t folder, std::string_view name);
   void noteWhole(std::uint64_t folder);
+  void noteDeep(std::uint64_t folder);
   /// The file's content is changing.
   void noteModify(std::uint64_t folder, std::string_view name, Clock::time_point now);
   void noteMovedFrom(std::uint32_t cookie, Clock::time_point now);
@@ -53,6 +55,7 @@ class DirtyFolders {
  private:
   struct Entry {
     bool isWhole = false;
+    bool isDeep = false;
     std::set<std::string, std::less<>> names;
   };
   struct OpenMove {

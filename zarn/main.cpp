@@ -62,9 +62,14 @@ std::optional<Arguments> parse(const std::vector<std::string>& given) {
 }
 
 int fail(int code, const std::string& text) {
-  log_error(defaultLog(), "[ERROR] %@", text);
   (void)std::fprintf(stderr, "zarn: %s\n", text.c_str());
   return code;
+}
+
+/// The same once the log is open.
+int failLogged(int code, const NSErrorRef& error) {
+  log_error(defaultLog(), "[ERROR] cannot start: %@", error);
+  return fail(code, error->localizedDescription());
 }
 
 /// Blocks the signals that end the process, in every thread that is started from now on.
@@ -127,7 +132,7 @@ int serve(const std::shared_ptr<Drive>& drive, const sigset_t& endingSignals) {
         return kj::heap<DaemonServer>(drive);
       },
       &error);
-  if (!listener) return fail(kCannotStart, error->localizedDescription());
+  if (!listener) return failLogged(kCannotStart, error);
   drive->start();
   log_default(defaultLog(), "[NOTICE] serving %@", drive->paths.daemonSocket);
   int signal = 0;
@@ -155,7 +160,7 @@ int run(const std::vector<std::string>& given) {
   openLog("zarn", paths);
   NSErrorRef error;
   const auto drive = Drive::open(paths, arguments->drive, &error);
-  if (!drive) return fail(kCannotStart, error->localizedDescription());
+  if (!drive) return failLogged(kCannotStart, error);
   return serve(drive, endingSignals);
 }
 

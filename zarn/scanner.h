@@ -27,6 +27,9 @@ class FolderVisitor {
   /// On any thread, later: the folder of that visit has this id. Not called when the folder turned
   /// out to be gone.
   virtual void didIdentifyFolder(std::uint64_t visit, std::uint64_t id) = 0;
+  /// On any thread: the folder has a row, but when its turn came to be read it was not to be found,
+  /// or not readable. It has to be scanned again, with everything below it.
+  virtual void didNotReadFolder(std::uint64_t id) = 0;
 };
 
 struct ScanReport {

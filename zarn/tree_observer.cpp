@@ -10,6 +10,7 @@
 #include <cstring>
 #include <iterator>
 #include <thread>
+#include <unordered_map>
 #include <utility>
 
 #include "platform/foundation/fault_points.h"
@@ -27,6 +28,8 @@ using Clock = std::chrono::steady_clock;
 constexpr unsigned kMaximumRetryFactor = 64;
 constexpr std::size_t kUnwatchedSlice = 128;
 constexpr std::chrono::milliseconds kNotFoundPause{20};
+constexpr std::chrono::milliseconds kUnreadPause{10};  // doubling
+constexpr unsigned kMaximumReadings = 8;
 
 }  // namespace
 
@@ -79,6 +82,7 @@ class TreeObserver::State {
 
   void didIdentifyFolder(std::uint64_t visit, std::uint64_t id) {
     LockGuard guard(mutex_);
+    unread_.erase(id);
     if (watches_.didIdentify(visit, id)) {
       dirty_.noteWhole(id);
       changed_.notifyAll();
@@ -86,10 +90,21 @@ class TreeObserver::State {
     if (!fullScanRunning_) sayAdvice();
   }
 
+  /// Tried again at growing distances; then it is left to the next scan of the tree.
+  void didNotReadFolder(std::uint64_t id) {
+    LockGuard guard(mutex_);
+    Unread& unread = unread_[id];
+    if (unread.attempts >= kMaximumReadings) return;
+    unread.due = Clock::now() + kUnreadPause * (1U << unread.attempts++);
+    unread.isDue = true;
+    changed_.notifyAll();
+  }
+
   void committed(const std::vector<ItemChange>& changes) {
     LockGuard guard(mutex_);
     for (const auto& change : changes) {
       if (!change.isDead() || !change.row.isFolder()) continue;
+      unread_.erase(change.row.id);
       watches_.forget(change.row.id);
       dirty_.forget(change.row.id);
     }
@@ -97,6 +112,13 @@ class TreeObserver::State {
   }
 
  private:
+  /// A folder that has a row but was not read.
+  struct Unread {
+    unsigned attempts = 0;
+    bool isDue = false;
+    Clock::time_point due;
+  };
+
   // --- The reading thread.
 
   void readEvents() {
@@ -229,10 +251,18 @@ class TreeObserver::State {
   Clock::time_point dirtyTime() const REQUIRES(mutex_) {
     auto due = dirty_.dueTime().value_or(Clock::time_point::max());
     if (!notFound_.empty()) due = std::min(due, notFoundDue_);
+    for (const auto& [id, unread] : unread_) {
+      if (unread.isDue) due = std::min(due, unread.due);
+    }
     return std::max(due, notBefore_);
   }
 
   Task dirtyTask(Clock::time_point now) REQUIRES(mutex_) {
+    for (auto& [id, unread] : unread_) {
+      if (!unread.isDue || unread.due > now) continue;
+      unread.isDue = false;
+      dirty_.noteDeep(id);
+    }
     Task task{.kind = Task::Kind::Dirty, .dirty = dirty_.take(now)};
     std::ranges::move(notFound_, std::back_inserter(task.dirty));
     notFound_.clear();
@@ -244,6 +274,7 @@ class TreeObserver::State {
     fullScanRunning_ = true;
     dirty_.clear();
     notFound_.clear();
+    unread_.clear();
     return {.kind = Task::Kind::All, .dirty = {}};
   }
 
@@ -295,6 +326,7 @@ class TreeObserver::State {
 
   void putBack(const DirtyFolder& folder) REQUIRES(mutex_) {
     if (folder.isWhole) dirty_.noteWhole(folder.id);
+    if (folder.isDeep) dirty_.noteDeep(folder.id);
     for (const auto& name : folder.names) dirty_.noteName(folder.id, name);
   }
 
@@ -351,6 +383,7 @@ class TreeObserver::State {
   unsigned retryFactor_ GUARDED_BY(mutex_) = 1;
   Clock::time_point notBefore_ GUARDED_BY(mutex_) = Clock::time_point::min();
   Clock::time_point nextUnwatched_ GUARDED_BY(mutex_) = Clock::time_point::min();
+  std::unordered_map<std::uint64_t, Unread> unread_ GUARDED_BY(mutex_);
   std::vector<DirtyFolder> notFound_ GUARDED_BY(mutex_);  // moving; tried again a moment later
   Clock::time_point notFoundDue_ GUARDED_BY(mutex_) = Clock::time_point::min();
   std::vector<std::uint64_t> unwatchedRound_ GUARDED_BY(mutex_);  // still to be scanned
@@ -374,6 +407,7 @@ void TreeObserver::willReadFolder(std::uint64_t visit, int descriptor) {
 void TreeObserver::didIdentifyFolder(std::uint64_t visit, std::uint64_t id) {
   state_->didIdentifyFolder(visit, id);
 }
+void TreeObserver::didNotReadFolder(std::uint64_t id) { state_->didNotReadFolder(id); }
 void TreeObserver::committed(const std::vector<ItemChange>& changes) {
   state_->committed(changes);
 }

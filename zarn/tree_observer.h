@@ -81,6 +81,7 @@ class TreeObserver final : public FolderVisitor, public ChangeSink {
 
   void willReadFolder(std::uint64_t visit, int descriptor) override;
   void didIdentifyFolder(std::uint64_t visit, std::uint64_t id) override;
+  void didNotReadFolder(std::uint64_t id) override;
   void committed(const std::vector<ItemChange>& changes) override;
 
  private:

@@ -18,7 +18,8 @@ class TreeWalkerTest : public TestDrive {
   }
   static std::size_t openDescriptors() {
     std::size_t count = 0;
-    for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+    for ([[maybe_unused]] const auto& entry :
+         std::filesystem::directory_iterator("/proc/self/fd")) {
       ++count;
     }
     return count;
@@ -125,7 +126,7 @@ class NotingVisitor : public FolderVisitor {
  public:
   void willReadFolder(std::uint64_t visit, int descriptor) override {
     LockGuard guard(mutex_);
-    struct stat status {};
+    struct stat status{};
     EXPECT_EQ(fstat(descriptor, &status), 0);
     inodes_[visit] = status.st_ino;
   }
@@ -134,6 +135,7 @@ class NotingVisitor : public FolderVisitor {
     EXPECT_TRUE(inodes_.contains(visit));
     inodeOfID_[id] = inodes_[visit];
   }
+  void didNotReadFolder(std::uint64_t) override {}
   std::map<std::uint64_t, std::uint64_t> takeInodes() {
     LockGuard guard(mutex_);
     return std::exchange(inodeOfID_, {});
@@ -154,7 +156,7 @@ TEST_F(TreeWalkerTest, VisitorsLearnWhichFolderEachVisitRead) {
     const auto inodes = visitor->takeInodes();
     std::set<std::uint64_t> ids;
     for (const std::string& path : paths) {
-      struct stat status {};
+      struct stat status{};
       ASSERT_EQ(stat(at(path).c_str(), &status), 0);
       const auto found = inodes.find(id(path));
       ASSERT_NE(found, inodes.end()) << path;

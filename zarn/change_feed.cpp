@@ -99,8 +99,8 @@ bool isWorkingSetMember(const ItemRow& row, std::int64_t now) {
 
 ChangeFeed::ChangeFeed(std::shared_ptr<Database> database) : database_(std::move(database)) {}
 
-NSErrorRef ChangeFeed::workingSetChanges(std::optional<std::string_view> token,
-                                         std::uint32_t limit, WorkingSetChanges& out) {
+NSErrorRef ChangeFeed::workingSetChanges(std::optional<std::string_view> token, std::uint32_t limit,
+                                         WorkingSetChanges& out) {
   out = {};
   const std::uint32_t count = std::clamp<std::uint32_t>(limit, 1, kMaximumLimit);
   std::optional<Token> from;
@@ -132,9 +132,9 @@ bool ChangeFeed::expireRecentlyUsed(std::int64_t now) {
     Connection& connection = transaction.connection();
     std::vector<std::uint64_t> expiredIDs;
     {
-      StatementUse statement(connection.prepared(
-          "SELECT w.id FROM working w JOIN extra e ON e.id=w.id "
-          "WHERE w.member=1 AND e.last_used IS NOT NULL AND e.last_used<=?1"));
+      StatementUse statement(
+          connection.prepared("SELECT w.id FROM working w JOIN extra e ON e.id=w.id "
+                              "WHERE w.member=1 AND e.last_used IS NOT NULL AND e.last_used<=?1"));
       statement->bindInteger(1, now - kRecentlyUsed);
       while (statement->step()) expiredIDs.push_back(statement->id(0));
     }

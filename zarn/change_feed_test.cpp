@@ -13,12 +13,14 @@ class ChangeFeedTest : public TestDrive {
  protected:
   ChangeFeedTest() : feed(database) {
     scan();
-    for (const char* name : {"plain", "tagged", "favorite", "shared", "recent", "stale"}) write(name);
+    for (const char* name : {"plain", "tagged", "favorite", "shared", "recent", "stale"})
+      write(name);
     setAttribute("tagged", kTagsAttribute, "red, work,,red");
     setAttribute("favorite", kFavoriteAttribute, "7");
     setAttribute("shared", kSharedAttribute, "");
     setAttribute("recent", kLastUsedAttribute, std::to_string(now()));
-    setAttribute("stale", kLastUsedAttribute, std::to_string(now() - ChangeFeed::kRecentlyUsed - 1));
+    setAttribute("stale", kLastUsedAttribute,
+                 std::to_string(now() - ChangeFeed::kRecentlyUsed - 1));
     EXPECT_EQ(scanner->scanFolders({kRootID}), nullptr);
   }
   static std::int64_t now() { return NSDate::now().nanoseconds(); }
@@ -167,7 +169,8 @@ TEST_F(ChangeFeedTest, RefusesATokenFromBeforeThePruning) {
       transaction.remove(row);
     }
     return nullptr;
-  }), nullptr);
+  }),
+            nullptr);
   WorkingSetChanges result;
   const NSErrorRef error = feed.workingSetChanges(token, 100, result);
   ASSERT_NE(error, nullptr);

@@ -26,7 +26,7 @@ std::int64_t nanoseconds(const struct statx_timestamp& time) {
 
 /// The row of a container's folder as the disk has it; the name comes later.
 NSErrorRef describe(const std::string& documents, const std::string& containerID, ItemRow& row) {
-  struct statx status {};
+  struct statx status{};
   if (statx(AT_FDCWD, documents.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME,
             &status) != 0) {
     return NSError::errorWithErrno(errno, documents);
@@ -89,8 +89,8 @@ bool isOfItsOwn(const std::string& containerID) {
 
 bool isSafeID(const std::string& containerID) {
   return !containerID.empty() && containerID.front() != '.' &&
-         containerID.size() <= kMaximumNameLength &&
-         containerID.find('/') == std::string::npos && containerID.find('\0') == std::string::npos;
+         containerID.size() <= kMaximumNameLength && containerID.find('/') == std::string::npos &&
+         containerID.find('\0') == std::string::npos;
 }
 
 }  // namespace

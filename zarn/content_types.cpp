@@ -18,9 +18,8 @@ constexpr const char* kSystemGlobs = "/usr/share/mime/globs2";
 
 std::string lowered(std::string_view text) {
   std::string result(text);
-  std::transform(result.begin(), result.end(), result.begin(), [](unsigned char c) {
-    return static_cast<char>(c < 0x80 ? std::tolower(c) : c);
-  });
+  std::transform(result.begin(), result.end(), result.begin(),
+                 [](unsigned char c) { return static_cast<char>(c < 0x80 ? std::tolower(c) : c); });
   return result;
 }
 
@@ -42,7 +41,8 @@ std::optional<GlobLine> parseGlobLine(std::string_view line) {
   if (failure != std::errc() || end != line.data() + first) return std::nullopt;
   result.type = line.substr(first + 1, second - first - 1);
   const std::size_t third = line.find(':', second + 1);
-  result.pattern = line.substr(second + 1, third == std::string_view::npos ? third : third - second - 1);
+  result.pattern =
+      line.substr(second + 1, third == std::string_view::npos ? third : third - second - 1);
   result.isCaseSensitive =
       third != std::string_view::npos && line.substr(third).find("cs") != std::string_view::npos;
   if (result.pattern.empty() || result.type.empty()) return std::nullopt;
@@ -78,8 +78,8 @@ struct ContentTypes::Table {
 
   void add(GlobLine line) {
     if (!line.isCaseSensitive) line.pattern = lowered(line.pattern);
-    const bool isSuffix = line.pattern.starts_with("*.") &&
-                          !hasWildcard(std::string_view(line.pattern).substr(1));
+    const bool isSuffix =
+        line.pattern.starts_with("*.") && !hasWildcard(std::string_view(line.pattern).substr(1));
     if (isSuffix) {
       exactSuffixes[line.isCaseSensitive].try_emplace(line.pattern.substr(1), line);
     } else if (!hasWildcard(line.pattern)) {
@@ -103,7 +103,8 @@ struct ContentTypes::Table {
     Match best;
     look(exactNames[true], name, best);
     look(exactNames[false], lower, best);
-    for (std::size_t dot = name.find('.'); dot != std::string::npos; dot = name.find('.', dot + 1)) {
+    for (std::size_t dot = name.find('.'); dot != std::string::npos;
+         dot = name.find('.', dot + 1)) {
       look(exactSuffixes[true], name.substr(dot), best);
       look(exactSuffixes[false], lower.substr(dot), best);
     }

@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <chrono>
 #include <cstdio>
 #include <ctime>
@@ -68,9 +69,10 @@ void setAside(const std::string& path, const std::string& reason) {
   for (const char* suffix : {"", "-wal", "-shm"}) {
     std::rename((path + suffix).c_str(), (aside + suffix).c_str());
   }
-  log_error(defaultLog(),
-            "[ERROR] the database cannot be read (%@); it is kept as %@ and built anew from the tree",
-            reason, aside);
+  log_error(
+      defaultLog(),
+      "[ERROR] the database cannot be read (%@); it is kept as %@ and built anew from the tree",
+      reason, aside);
 }
 
 void syncFolderOf(const std::string& path) {
@@ -139,7 +141,7 @@ struct Database::State {
   [[nodiscard]] NSErrorRef failure(const std::exception& exception);
   std::unique_ptr<Connection> takeReader();
   void returnReader(std::unique_ptr<Connection> reader);
-  void swapIn(const std::string& aside);
+  NSErrorRef swapIn(const std::string& aside);
 };
 
 void Database::State::openWriter() {
@@ -198,6 +200,12 @@ void Database::State::runAlone(Task& task) {
 }
 
 void Database::State::runBatch(std::vector<Task>& batch) {
+  if (!writer) {
+    const NSErrorRef error =
+        databaseError(kDatabaseClosed, "The database could not be opened again; restart zarn.");
+    for (Task& task : batch) task.result = error;
+    return;
+  }
   WriteTransaction transaction(*writer, rank, nowNanoseconds());
   try {
     writer->execute("BEGIN");
@@ -293,22 +301,27 @@ void Database::State::returnReader(std::unique_ptr<Connection> reader) {
   readerReturned.notifyAll();
 }
 
-void Database::State::swapIn(const std::string& aside) {
+NSErrorRef Database::State::swapIn(const std::string& aside) {
   {
     LockGuard guard(readersMutex);
     isSwapping = true;
     while (busyReaders != 0) readerReturned.wait(readersMutex);
     idleReaders.clear();
   }
-  writer.reset();
-  removeWithCompanions(path);
-  const bool isRenamed = std::rename(aside.c_str(), path.c_str()) == 0;
-  syncFolderOf(path);
-  openWriter();
+  NSErrorRef error;
+  try {
+    writer.reset();
+    removeWithCompanions(path);
+    if (std::rename(aside.c_str(), path.c_str()) != 0) error = NSError::errorWithErrno(errno, path);
+    syncFolderOf(path);
+    openWriter();
+  } catch (const std::exception& exception) {
+    error = failure(exception);
+  }
   LockGuard guard(readersMutex);
   isSwapping = false;
   readerReturned.notifyAll();
-  if (!isRenamed) throw std::runtime_error("the new database could not be put in place");
+  return error;
 }
 
 Database::Database(std::unique_ptr<State> state) : state_(std::move(state)) {
@@ -349,12 +362,13 @@ std::shared_ptr<Database> Database::open(const std::string& path, NSErrorRef* er
       state->openWriter();
       return std::shared_ptr<Database>(new Database(std::move(state)));
     } catch (const SchemaTooNew& newer) {
-      storeError(error, databaseError(kDatabaseTooNew,
-                                      "The database " + path + " has version " +
-                                          std::to_string(newer.version) + ", this program reads up to " +
-                                          std::to_string(kSchemaVersion) +
-                                          ". Use the newer program, or move the file away to have it "
-                                          "built anew from the files."));
+      storeError(
+          error,
+          databaseError(kDatabaseTooNew,
+                        "The database " + path + " has version " + std::to_string(newer.version) +
+                            ", this program reads up to " + std::to_string(kSchemaVersion) +
+                            ". Use the newer program, or move the file away to have it "
+                            "built anew from the files."));
       return nullptr;
     } catch (const SQLite::Exception& exception) {
       state.reset();
@@ -418,8 +432,7 @@ NSErrorRef Database::rebuild(const std::function<NSErrorRef(BulkLoad&)>& load) {
     }
     syncFile(aside);
     if (beforeSwap.hit()) return databaseError(kDatabaseFailure, "the disk is full");
-    state.swapIn(aside);
-    return nullptr;
+    return state.swapIn(aside);
   };
   const NSErrorRef error =
       state.submitAndWait({.job = {}, .alone = build, .done = {}, .result = nullptr});

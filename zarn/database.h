@@ -27,8 +27,8 @@ class ChangeSink {
 
 /// Errors of this domain are about the database file itself.
 inline constexpr const char* kDatabaseErrorDomain = "ZarnDatabaseErrorDomain";
-inline constexpr std::int64_t kDatabaseTooNew = 1;    ///< made by a newer version of this program
-inline constexpr std::int64_t kDatabaseFailure = 2;   ///< SQLite's message is in the description
+inline constexpr std::int64_t kDatabaseTooNew = 1;   ///< made by a newer version of this program
+inline constexpr std::int64_t kDatabaseFailure = 2;  ///< SQLite's message is in the description
 inline constexpr std::int64_t kDatabaseClosed = 3;
 
 /// The drive's SQLite file: one writer thread, readers with connections of their own.
@@ -37,9 +37,9 @@ inline constexpr std::int64_t kDatabaseClosed = 3;
 /// called on the writer thread. Ownership: shared; closes when the last reference goes.
 class Database {
  public:
-  /// Opens or creates the file. An unreadable file is set aside next to itself under a name with the
-  /// date (logged), and an empty one takes its place: `needsFirstScan` is then true. A file of a
-  /// newer schema is refused with kDatabaseTooNew and left as it is.
+  /// Opens or creates the file. An unreadable file is set aside next to itself under a name with
+  /// the date (logged), and an empty one takes its place: `needsFirstScan` is then true. A file of
+  /// a newer schema is refused with kDatabaseTooNew and left as it is.
   static std::shared_ptr<Database> open(const std::string& path, NSErrorRef* error = nullptr);
   ~Database();
   Database(const Database&) = delete;

@@ -39,7 +39,8 @@ class DatabaseTest : public TestDrive {
     std::vector<std::string> result;
     for (const auto& entry : std::filesystem::directory_iterator(layout.home())) {
       const std::string name = entry.path().filename();
-      if (name.starts_with("zarn.db.damaged-") && !name.ends_with("-wal") && !name.ends_with("-shm")) {
+      if (name.starts_with("zarn.db.damaged-") && !name.ends_with("-wal") &&
+          !name.ends_with("-shm")) {
         result.push_back(name);
       }
     }
@@ -69,7 +70,8 @@ TEST_F(DatabaseTest, SinksAreToldOfEveryChangeInOrder) {
     transaction.update(*before, after);
     transaction.remove(after);
     return nullptr;
-  }), nullptr);
+  }),
+            nullptr);
   const auto changes = sink->take();
   ASSERT_EQ(changes.size(), 3U);
   EXPECT_TRUE(changes[0].isNew);
@@ -84,7 +86,12 @@ TEST_F(DatabaseTest, AFailingJobUndoesOnlyItself) {
   // Both wait behind a job that is held, so that they share a transaction.
   std::promise<void> gate;
   auto open = gate.get_future().share();
-  database->writeLater([open](WriteTransaction&) -> NSErrorRef { open.wait(); return nullptr; }, {});
+  database->writeLater(
+      [open](WriteTransaction&) -> NSErrorRef {
+        open.wait();
+        return nullptr;
+      },
+      {});
   std::promise<NSErrorRef> first;
   std::promise<NSErrorRef> second;
   const auto job = [](const char* name, bool fails) {
@@ -123,8 +130,8 @@ TEST_F(DatabaseTest, AFailedCommitIsAnErrorAndChangesNothing) {
 
 TEST_F(DatabaseTest, AKillBeforeTheCommitLosesTheJobAndAfterItNothing) {
   close();
-  for (const auto& [point, survives] :
-       {std::pair("zarn.database.before-commit", false), std::pair("zarn.database.after-commit", true)}) {
+  for (const auto& [point, survives] : {std::pair("zarn.database.before-commit", false),
+                                        std::pair("zarn.database.after-commit", true)}) {
     const std::string name = survives ? "after" : "before";
     const pid_t child = fork();
     if (child == 0) {
@@ -238,7 +245,8 @@ TEST_F(DatabaseTest, SortKeysAreMadeAnewForAnotherCollation) {
   close();
   {
     SQLite::Database raw(layout.databasePath(), SQLite::OPEN_READWRITE);
-    raw.exec("UPDATE item SET name_key=x'00'; UPDATE meta SET value='0/older' WHERE key='collation'");
+    raw.exec(
+        "UPDATE item SET name_key=x'00'; UPDATE meta SET value='0/older' WHERE key='collation'");
   }
   open();
   EXPECT_TRUE(store->itemByName(kRootID, "b"));
@@ -252,7 +260,8 @@ TEST_F(DatabaseTest, PrunesTombstonesBeyondTheBound) {
     statement->bindInteger(1, kMaximumTombstones);
     statement->step();
     return nullptr;
-  }), nullptr);
+  }),
+            nullptr);
   EXPECT_EQ(database->oldestAnswerableRank(), 0U);
   // Removing members adds departures, and removing enough items brings the pruning about.
   ASSERT_EQ(database->write([](WriteTransaction& transaction) -> NSErrorRef {
@@ -264,7 +273,8 @@ TEST_F(DatabaseTest, PrunesTombstonesBeyondTheBound) {
       transaction.remove(row);
     }
     return nullptr;
-  }), nullptr);
+  }),
+            nullptr);
   EXPECT_EQ(database->oldestAnswerableRank(), 1100U);
   reopen();
   EXPECT_EQ(database->oldestAnswerableRank(), 1100U);

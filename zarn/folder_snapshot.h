@@ -25,7 +25,7 @@ struct FolderEntry {
   std::uint64_t size = 0;
   std::int64_t mtime = 0;  // times in ns since the epoch
   std::int64_t ctime = 0;
-  std::int64_t btime = 0;  ///< the modification time where the disk keeps none
+  std::int64_t btime = 0;   ///< the modification time where the disk keeps none
   std::uint64_t visit = 0;  ///< of a folder: which visit will read it
 
   /// Whether its id is kept in an attribute; else in the database only.
@@ -45,7 +45,8 @@ struct FolderSnapshot {
   std::shared_ptr<const FileDescriptor> folder;  ///< open on the folder
   std::string names;
   std::vector<FolderEntry> entries;
-  std::vector<ItemAttributes> attributes;  ///< beside `entries` when they were asked for, else empty
+  std::vector<ItemAttributes>
+      attributes;  ///< beside `entries` when they were asked for, else empty
 
   [[nodiscard]] std::string_view nameOf(const FolderEntry& entry) const {
     return std::string_view(names).substr(entry.nameOffset, entry.nameLength);
@@ -53,7 +54,8 @@ struct FolderSnapshot {
 };
 
 /// Looks at `name` in the open folder, or with an empty name at the folder itself. False when it is
-/// gone, cannot be looked at, or is of no kind that the drive holds; errno says which (EINVAL: kind).
+/// gone, cannot be looked at, or is of no kind that the drive holds; errno says which (EINVAL:
+/// kind).
 [[nodiscard]] bool lookAtEntry(int folder, const char* name, FolderEntry& out);
 
 /// Reads all entries of the open folder. Answers errno, 0 when all were read. What is

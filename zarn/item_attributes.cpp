@@ -83,7 +83,7 @@ ItemAttributes readItemAttributes(const char* path) {
 
 bool stampItem(int folder, const std::string& name, std::uint64_t inode, std::uint64_t id) {
   const FileDescriptor file(openat(folder, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-  struct stat status {};
+  struct stat status{};
   if (!file || fstat(file.get(), &status) != 0) return false;
   if (status.st_ino != inode || S_ISLNK(status.st_mode)) return false;
   const std::string path = "/proc/self/fd/" + std::to_string(file.get());

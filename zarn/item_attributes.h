@@ -11,11 +11,11 @@
 namespace yomber {
 
 /// The extended attributes in which files carry what the drive knows about them.
-inline constexpr const char* kIDAttribute = "user.yomber.id";            ///< decimal raw id
+inline constexpr const char* kIDAttribute = "user.yomber.id";              ///< decimal raw id
 inline constexpr const char* kFavoriteAttribute = "user.yomber.favorite";  ///< decimal rank
 inline constexpr const char* kLastUsedAttribute = "user.yomber.lastused";  ///< decimal ns
 inline constexpr const char* kSharedAttribute = "user.yomber.shared";      ///< by its presence
-inline constexpr const char* kTagsAttribute = "user.xdg.tags";  ///< separated by commas
+inline constexpr const char* kTagsAttribute = "user.xdg.tags";             ///< separated by commas
 
 /// What a file's attributes say.
 struct ItemAttributes {

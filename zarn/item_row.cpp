@@ -56,9 +56,10 @@ std::optional<std::uint64_t> rawIDFromIdentifier(std::string_view identifier) {
 std::uint32_t itemCapabilities(const ItemRow& row) {
   constexpr std::uint32_t kReading = NSFileProviderItemCapabilitiesAllowsReading;
   constexpr std::uint32_t kWriting = NSFileProviderItemCapabilitiesAllowsWriting;
-  constexpr std::uint32_t kArranging =
-      NSFileProviderItemCapabilitiesAllowsReparenting | NSFileProviderItemCapabilitiesAllowsRenaming |
-      NSFileProviderItemCapabilitiesAllowsTrashing | NSFileProviderItemCapabilitiesAllowsDeleting;
+  constexpr std::uint32_t kArranging = NSFileProviderItemCapabilitiesAllowsReparenting |
+                                       NSFileProviderItemCapabilitiesAllowsRenaming |
+                                       NSFileProviderItemCapabilitiesAllowsTrashing |
+                                       NSFileProviderItemCapabilitiesAllowsDeleting;
   if (row.id == kTrashID) return kReading;
   const bool isPlace = row.id == kRootID || row.isContainerFolder();
   // A symbolic link's own mode says nothing; what the target allows is the target's.

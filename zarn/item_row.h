@@ -12,8 +12,8 @@
 namespace yomber {
 
 /// Raw ids that stand for places rather than for items that were issued one.
-inline constexpr std::uint64_t kRootID = 0;   ///< the root folder
-inline constexpr std::uint64_t kTrashID = 1;  ///< the trash's files folder
+inline constexpr std::uint64_t kRootID = 0;                    ///< the root folder
+inline constexpr std::uint64_t kTrashID = 1;                   ///< the trash's files folder
 inline constexpr std::uint64_t kNoParent = ~std::uint64_t{0};  ///< parent of those two
 /// Smaller raw ids are never issued to items.
 inline constexpr std::uint64_t kFirstIssuedID = 1024;
@@ -50,13 +50,14 @@ struct ItemRow {
   std::string diskName;  ///< the name on this disk where it differs from `name`, else empty
   ItemKind kind = ItemKind::Document;
   std::uint32_t flags = 0;
-  std::uint32_t mode = 0;    ///< st_mode
-  std::uint64_t size = 0;    ///< bytes; 0 for folders
-  std::int64_t mtime = 0;    ///< ns since the epoch
-  std::int64_t btime = 0;    ///< ns; the creation date (the modification date where the disk has none)
-  std::int64_t ctime = 0;    ///< ns; not filled in by listings
+  std::uint32_t mode = 0;  ///< st_mode
+  std::uint64_t size = 0;  ///< bytes; 0 for folders
+  std::int64_t mtime = 0;  ///< ns since the epoch
+  std::int64_t btime =
+      0;  ///< ns; the creation date (the modification date where the disk has none)
+  std::int64_t ctime = 0;  ///< ns; not filled in by listings
   std::uint64_t inode = 0;
-  std::uint64_t rank = 0;    ///< of the last change
+  std::uint64_t rank = 0;  ///< of the last change
   std::shared_ptr<const ItemExtra> extra;
 
   [[nodiscard]] bool isFolder() const { return kind == ItemKind::Folder; }
@@ -71,7 +72,8 @@ struct ItemRow {
 [[nodiscard]] char identifierLetter(ItemKind kind);
 /// "d:123", or the framework's constants for the root and the trash.
 [[nodiscard]] std::string itemIdentifier(std::uint64_t id, ItemKind kind);
-/// The raw id in an identifier; nothing when it is malformed. Does not look whether the item exists.
+/// The raw id in an identifier; nothing when it is malformed. Does not look whether the item
+/// exists.
 [[nodiscard]] std::optional<std::uint64_t> rawIDFromIdentifier(std::string_view identifier);
 
 /// NSFileProviderItemCapabilities bits.

@@ -19,8 +19,9 @@ TEST(ItemRow, IdentifiersGoThereAndBack) {
 }
 
 TEST(ItemRow, RefusesMalformedIdentifiers) {
-  for (const char* text : {"", "d", "d:", "x:5000", "d:-5000", "d: 5000", "d:5000 ", "d:05000", "d:0",
-                           "d:1", "d:9223372036854775808", "d:99999999999999999999", "5000"}) {
+  for (const char* text :
+       {"", "d", "d:", "x:5000", "d:-5000", "d: 5000", "d:5000 ", "d:05000", "d:0", "d:1",
+        "d:9223372036854775808", "d:99999999999999999999", "5000"}) {
     EXPECT_FALSE(rawIDFromIdentifier(text)) << text;
   }
 }

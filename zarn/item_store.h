@@ -23,13 +23,14 @@ struct ContainerFolder {
 
 /// Items by id, by name and by location.
 ///
-/// Reads answer nothing both when there is no such item and when the database fails; the latter also
-/// stores an error. Thread-safety: every operation may be called on any thread.
+/// Reads answer nothing both when there is no such item and when the database fails; the latter
+/// also stores an error. Thread-safety: every operation may be called on any thread.
 class ItemStore {
  public:
   ItemStore(std::shared_ptr<Database> database, TreeLayout layout);
 
-  [[nodiscard]] std::optional<ItemRow> itemByID(std::uint64_t id, NSErrorRef* error = nullptr) const;
+  [[nodiscard]] std::optional<ItemRow> itemByID(std::uint64_t id,
+                                                NSErrorRef* error = nullptr) const;
   [[nodiscard]] std::optional<ItemRow> itemByName(std::uint64_t parent, std::string_view name,
                                                   NSErrorRef* error = nullptr) const;
   /// The item at a location, logical names first, then names on disk. Does not look at the disk.
@@ -39,13 +40,17 @@ class ItemStore {
   [[nodiscard]] std::optional<ItemRow> itemForContainer(std::string_view containerID,
                                                         NSErrorRef* error = nullptr) const;
   /// Every child, in no particular order. For folders of bounded size; listings page instead.
-  [[nodiscard]] std::vector<ItemRow> children(std::uint64_t folder, NSErrorRef* error = nullptr) const;
+  [[nodiscard]] std::vector<ItemRow> children(std::uint64_t folder,
+                                              NSErrorRef* error = nullptr) const;
   /// The folders above an item, nearest first, up to the root or the trash, which is the last.
-  [[nodiscard]] std::vector<std::uint64_t> ancestors(std::uint64_t id, NSErrorRef* error = nullptr) const;
+  [[nodiscard]] std::vector<std::uint64_t> ancestors(std::uint64_t id,
+                                                     NSErrorRef* error = nullptr) const;
 
   /// Where an item is: with the names that the drive has, and with the names on this disk.
-  [[nodiscard]] std::optional<std::string> logicalPath(std::uint64_t id, NSErrorRef* error = nullptr) const;
-  [[nodiscard]] std::optional<std::string> physicalPath(std::uint64_t id, NSErrorRef* error = nullptr) const;
+  [[nodiscard]] std::optional<std::string> logicalPath(std::uint64_t id,
+                                                       NSErrorRef* error = nullptr) const;
+  [[nodiscard]] std::optional<std::string> physicalPath(std::uint64_t id,
+                                                        NSErrorRef* error = nullptr) const;
 
   struct Counts {
     std::uint64_t items = 0;  ///< folders included; neither the root nor the trash

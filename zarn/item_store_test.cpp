@@ -64,7 +64,8 @@ TEST_F(ItemStoreTest, ContainersAreScannedAndSurviveScansAndRestarts) {
   scan();
   EXPECT_EQ(scan().changes, 0U);
   EXPECT_EQ(store->itemForContainer("org.example.Notes")->id, notes->id);
-  EXPECT_EQ(scanner->scanLocation(layout.documents("org.example.Notes") + "/page.md")->id, page->id);
+  EXPECT_EQ(scanner->scanLocation(layout.documents("org.example.Notes") + "/page.md")->id,
+            page->id);
   ASSERT_EQ(scanner->scanFolders({kRootID, notes->id}), nullptr);
   EXPECT_EQ(store->itemForContainer("org.example.Notes")->id, notes->id);
 }

@@ -19,10 +19,9 @@ constexpr int kNameKeyColumn = kRowColumnCount;
 
 // Each query takes up right after a point and runs along its index; the order of the parameters is
 // that of `bindPoint`.
-constexpr const char* kPageByName =
-    "SELECT " YOMBER_ROW_COLUMNS
-    ",name_key FROM item INDEXED BY item_name "
-    "WHERE parent=?1 AND name_key>?3 ORDER BY name_key LIMIT ?5";
+constexpr const char* kPageByName = "SELECT " YOMBER_ROW_COLUMNS
+                                    ",name_key FROM item INDEXED BY item_name "
+                                    "WHERE parent=?1 AND name_key>?3 ORDER BY name_key LIMIT ?5";
 constexpr const char* kPageByDate =
     "SELECT " YOMBER_ROW_COLUMNS
     ",name_key FROM item INDEXED BY item_date "
@@ -100,8 +99,8 @@ std::shared_ptr<const ListingFences> readFences(Connection& connection, const Li
   if (!scope.isAllFolders()) statement->bindID(1, scope.folder);
   for (std::uint64_t index = 1; statement->step(); ++index) {
     if (index % ListingFences::kDistance != 0) continue;
-    fences->points.push_back({statement->integer(0), std::string(statement->bytes(1)),
-                              statement->id(2)});
+    fences->points.push_back(
+        {statement->integer(0), std::string(statement->bytes(1)), statement->id(2)});
   }
   return fences;
 }
@@ -181,7 +180,8 @@ Listing::State::Start Listing::State::findStart(Connection& reader, std::uint64_
   {
     LockGuard guard(mutex_);
     forgetOtherDatabase();
-    if (auto point = cursors_.find({connection, scope, offset})) return {std::move(*point), 0, false};
+    if (auto point = cursors_.find({connection, scope, offset}))
+      return {std::move(*point), 0, false};
   }
   if (offset < ListingFences::kDistance) return {{}, offset, false};
   const auto fences = fencesOf(reader, scope);
@@ -214,8 +214,7 @@ NSErrorRef Listing::State::page(std::uint64_t connection, const ListingScope& sc
   });
 }
 
-Listing::Listing(std::shared_ptr<Database> database)
-    : state_(std::make_shared<State>(database)) {
+Listing::Listing(std::shared_ptr<Database> database) : state_(std::make_shared<State>(database)) {
   database->addSink(state_);
 }
 

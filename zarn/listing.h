@@ -23,8 +23,8 @@ struct ListingPage {
 /// Pages of a folder, or of all folders of the drive.
 ///
 /// A page costs the same at any offset: where the previous page ended is remembered by (connection,
-/// folder, order, offset), and otherwise found through fences every 200 entries. A page that follows
-/// another goes on after that one's last entry, whatever changed in between.
+/// folder, order, offset), and otherwise found through fences every 200 entries. A page that
+/// follows another goes on after that one's last entry, whatever changed in between.
 ///
 /// Thread-safety: every operation may be called on any thread. Memory: bounded.
 class Listing {

@@ -29,7 +29,8 @@ class ListingTest : public TestDrive {
     ASSERT_EQ(database->write([&](WriteTransaction& transaction) -> NSErrorRef {
       work(transaction);
       return nullptr;
-    }), nullptr);
+    }),
+              nullptr);
   }
   static void add(WriteTransaction& transaction, const std::string& name, std::int64_t mtime,
                   ItemKind kind = ItemKind::Document, std::uint64_t parent = kFolder) {

@@ -16,6 +16,12 @@ NSErrorRef noSuchItem(std::string_view path) {
                                   {{NSFilePathErrorKey, std::string(path)}});
 }
 
+/// Why a folder could not be opened: mostly it is not there, or is none.
+NSErrorRef whyNotOpened(int number, std::string_view path) {
+  const bool isGone = number == ENOENT || number == ENOTDIR || number == ELOOP;
+  return isGone ? noSuchItem(path) : NSError::errorWithErrno(number, std::string(path));
+}
+
 /// The name on this disk of what the drive calls `name`.
 std::string diskNameOf(const ItemStore& store, std::uint64_t folder, const std::string& name) {
   const auto row = store.itemByName(folder, name);
@@ -50,7 +56,7 @@ std::optional<ItemRow> LocationScan::run(std::string_view path, NSErrorRef* erro
     const std::string name(rest.substr(0, slash));
     rest.remove_prefix(slash == std::string_view::npos ? rest.size() : slash + 1);
     const std::uint64_t folder = row->id;
-    failure = noSuchItem(path);
+    failure = opened ? noSuchItem(path) : whyNotOpened(errno, path);
     row.reset();
     if (!opened) break;
     row = scanName(folder, opened, name, failure);

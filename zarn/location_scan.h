@@ -18,7 +18,8 @@ class LocationScan {
   [[nodiscard]] std::optional<ItemRow> run(std::string_view path, NSErrorRef* error);
 
  private:
-  /// The row of `name` in an open folder, right as of now; nothing with an error when there is none.
+  /// The row of `name` in an open folder, right as of now; nothing with an error when there is
+  /// none.
   std::optional<ItemRow> scanName(std::uint64_t folder,
                                   const std::shared_ptr<const FileDescriptor>& opened,
                                   const std::string& name, NSErrorRef& error);

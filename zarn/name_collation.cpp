@@ -38,9 +38,8 @@ class Utf16 {
   explicit Utf16(std::string_view name) {
     if (name.size() > buffer_.size()) heap_.resize(name.size());
     UChar* const out = heap_.empty() ? buffer_.data() : heap_.data();
-    const bool isAscii = std::all_of(name.begin(), name.end(), [](char c) {
-      return static_cast<unsigned char>(c) < 0x80;
-    });
+    const bool isAscii = std::all_of(name.begin(), name.end(),
+                                     [](char c) { return static_cast<unsigned char>(c) < 0x80; });
     if (isAscii) {
       std::transform(name.begin(), name.end(), out, [](char c) { return static_cast<UChar>(c); });
       length_ = static_cast<std::int32_t>(name.size());
@@ -70,9 +69,8 @@ std::optional<std::u16string> normalized(std::string_view name) {
   UErrorCode status = U_ZERO_ERROR;
   const UNormalizer2* const nfc = unorm2_getNFCInstance(&status);
   std::u16string result(static_cast<std::size_t>(text.length()) * 3 + 8, u'\0');
-  const std::int32_t length =
-      unorm2_normalize(nfc, text.data(), text.length(), result.data(),
-                       static_cast<std::int32_t>(result.size()), &status);
+  const std::int32_t length = unorm2_normalize(nfc, text.data(), text.length(), result.data(),
+                                               static_cast<std::int32_t>(result.size()), &status);
   if (U_FAILURE(status)) return std::nullopt;
   result.resize(static_cast<std::size_t>(length));
   return result;

@@ -8,8 +8,8 @@ namespace yomber {
 /// The order of names in listings, by ICU's root collation with numbers by value.
 ///
 /// A sort key is the collation key, a zero byte (which the key itself never holds), and the name's
-/// bytes: comparing keys as bytes orders by collation first and by bytes second, and equal keys mean
-/// equal names. Bytes that are not UTF-8 sort as U+FFFD.
+/// bytes: comparing keys as bytes orders by collation first and by bytes second, and equal keys
+/// mean equal names. Bytes that are not UTF-8 sort as U+FFFD.
 ///
 /// Thread-safety: every function may be called on any thread.
 [[nodiscard]] std::string nameSortKey(std::string_view name);

@@ -27,7 +27,8 @@ TEST(NameCollation, BreaksTiesByBytes) {
   // Equal under the collation: a control character is ignored by it.
   const std::string plain = "a";
   const std::string controlled = "a\x01";
-  EXPECT_EQ(sortKeyCollationPart(nameSortKey(plain)), sortKeyCollationPart(nameSortKey(controlled)));
+  EXPECT_EQ(sortKeyCollationPart(nameSortKey(plain)),
+            sortKeyCollationPart(nameSortKey(controlled)));
   EXPECT_LT(nameSortKey(plain), nameSortKey(controlled));
 }
 

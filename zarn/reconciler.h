@@ -116,6 +116,7 @@ class Reconciler {
                                                   const Candidate& candidate);
   [[nodiscard]] bool isElsewhere(const ItemRow& row) const;
   void decide(WriteTransaction& transaction, Candidate& candidate);
+  void decideOpen(WriteTransaction& transaction);
   bool takeReplaced(WriteTransaction& transaction, Candidate& candidate);
   void move(WriteTransaction& transaction, const Candidate& candidate, const ItemRow& row);
   void add(WriteTransaction& transaction, const Candidate& candidate);
@@ -134,6 +135,7 @@ class Reconciler {
   std::unordered_map<std::uint64_t, std::uint64_t> visits_;
   std::unordered_map<std::uint64_t, ItemRow> gone_;
   std::vector<Candidate> open_;
+  std::size_t openFolders_ = 0;  ///< how many descriptors those hold
   std::unordered_set<std::uint64_t> openInodes_;
   std::vector<NewFolder> newFolders_;
   std::vector<std::pair<std::uint64_t, std::uint64_t>> ownRanks_;  ///< rising; first < rank <= second

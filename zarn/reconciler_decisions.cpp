@@ -13,7 +13,9 @@ std::optional<ItemRow> Reconciler::findOwnRow(WriteTransaction& transaction,
     return !row.isContainerFolder() && row.id >= kFirstIssuedID &&
            isSameFile(row, candidate.entry, candidate.attributes);
   };
-  const auto isOwnAndGone = [&](const ItemRow& row) { return isOwn(row) && gone_.contains(row.id); };
+  const auto isOwnAndGone = [&](const ItemRow& row) {
+    return isOwn(row) && gone_.contains(row.id);
+  };
   // Of several rows (a file with several names), one whose name is gone has moved.
   auto row = std::find_if(rows.begin(), rows.end(), isOwnAndGone);
   const bool hasOneName = candidate.entry.type != EntryType::File || candidate.entry.links == 1;
@@ -85,8 +87,7 @@ void Reconciler::add(WriteTransaction& transaction, const Candidate& candidate) 
   }
 }
 
-void Reconciler::finish(WriteTransaction& transaction) {
-  const OwnRanks ownRanks(*this, transaction);
+void Reconciler::decideOpen(WriteTransaction& transaction) {
   for (const Candidate& candidate : open_) openInodes_.insert(candidate.entry.inode);
   // First those that took a vanished file's place: what they leave open are moves and newcomers.
   std::vector<Candidate> rest;
@@ -98,8 +99,14 @@ void Reconciler::finish(WriteTransaction& transaction) {
     if (!isDone[i]) rest.push_back(std::move(open_[i]));
   }
   open_.clear();
+  openFolders_ = 0;
   openInodes_.clear();
   for (Candidate& candidate : rest) decide(transaction, candidate);
+}
+
+void Reconciler::finish(WriteTransaction& transaction) {
+  const OwnRanks ownRanks(*this, transaction);
+  decideOpen(transaction);
   removeGone(transaction);
 }
 

@@ -11,8 +11,8 @@ constexpr std::uint32_t kFromDisk =
 
 bool isShownDifferently(const ItemRow& left, const ItemRow& right) {
   constexpr std::uint32_t kUnseen = row_flag::kStamped | row_flag::kHasExtra;
-  const bool hasSameExtra = left.extra == right.extra ||
-                            (left.extra && right.extra && *left.extra == *right.extra);
+  const bool hasSameExtra =
+      left.extra == right.extra || (left.extra && right.extra && *left.extra == *right.extra);
   return left.parent != right.parent || left.name != right.name ||
          left.diskName != right.diskName || left.kind != right.kind ||
          (left.flags & ~kUnseen) != (right.flags & ~kUnseen) || left.mode != right.mode ||

@@ -63,8 +63,8 @@ void readRow(const Statement& statement, ItemRow& out) {
 
 void loadExtra(Connection& connection, ItemRow& row) {
   if ((row.flags & row_flag::kHasExtra) == 0) return;
-  StatementUse statement(connection.prepared(
-      "SELECT tags,favorite,last_used,container_id FROM extra WHERE id=?1"));
+  StatementUse statement(
+      connection.prepared("SELECT tags,favorite,last_used,container_id FROM extra WHERE id=?1"));
   statement->bindID(1, row.id);
   if (!statement->step()) return;
   ItemExtra extra;
@@ -129,8 +129,8 @@ std::optional<ItemRow> findByID(Connection& connection, std::uint64_t id) {
 std::optional<ItemRow> findByName(Connection& connection, std::uint64_t parent,
                                   std::string_view name) {
   const std::string key = nameSortKey(name);
-  StatementUse statement(connection.prepared(
-      "SELECT " YOMBER_ROW_COLUMNS " FROM item WHERE parent=?1 AND name_key=?2"));
+  StatementUse statement(connection.prepared("SELECT " YOMBER_ROW_COLUMNS
+                                             " FROM item WHERE parent=?1 AND name_key=?2"));
   statement->bindID(1, parent);
   statement->bindBytes(2, key);
   return firstRow(connection, *statement);
@@ -139,8 +139,8 @@ std::optional<ItemRow> findByName(Connection& connection, std::uint64_t parent,
 std::optional<ItemRow> findByDiskName(Connection& connection, std::uint64_t parent,
                                       std::string_view diskName) {
   {
-    StatementUse statement(connection.prepared(
-        "SELECT " YOMBER_ROW_COLUMNS " FROM item WHERE parent=?1 AND disk_name=?2"));
+    StatementUse statement(connection.prepared("SELECT " YOMBER_ROW_COLUMNS
+                                               " FROM item WHERE parent=?1 AND disk_name=?2"));
     statement->bindID(1, parent);
     statement->bindBytes(2, diskName);
     if (auto row = firstRow(connection, *statement)) return row;
@@ -187,9 +187,8 @@ std::vector<ItemRow> findSameCollation(Connection& connection, std::uint64_t par
   const std::string begin(sortKeyCollationPart(nameKey));
   std::string end = begin;
   if (!end.empty()) end.back() = '\1';
-  StatementUse statement(
-      connection.prepared("SELECT " YOMBER_ROW_COLUMNS
-                          " FROM item WHERE parent=?1 AND name_key>=?2 AND name_key<?3"));
+  StatementUse statement(connection.prepared(
+      "SELECT " YOMBER_ROW_COLUMNS " FROM item WHERE parent=?1 AND name_key>=?2 AND name_key<?3"));
   statement->bindID(1, parent);
   statement->bindBytes(2, begin);
   statement->bindBytes(3, end);

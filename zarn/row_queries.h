@@ -24,7 +24,8 @@ void readRow(const Statement& statement, ItemRow& out);
 /// Fills in `extra` where the row has one.
 void loadExtra(Connection& connection, ItemRow& row);
 
-/// Binds parameters 1 to 14: the columns above, then the sort key. What is bound must outlive the step.
+/// Binds parameters 1 to 14: the columns above, then the sort key. What is bound must outlive the
+/// step.
 void bindRow(Statement& statement, const ItemRow& row, std::string_view nameKey);
 inline constexpr const char* kInsertRow =
     "INSERT INTO item(" YOMBER_ROW_COLUMNS

@@ -28,7 +28,8 @@ class ScannerNames : public TestDrive, public testing::WithParamInterface<bool> 
 TEST_P(ScannerNames, KeepsBytesThatAreNoUtf8AndNewlines) {
   begin();
   const std::vector<std::string> odd{"bad\xff\xfe", "bad\xff", "line\nbreak", std::string(255, 'x'),
-                                     " ", "-", "\xc3", "tab\t", "\x01"};
+                                     " ",           "-",       "\xc3",        "tab\t",
+                                     "\x01"};
   for (const std::string& name : odd) write(name);
   scanAtLast();
   const auto found = names();
@@ -58,7 +59,8 @@ TEST_P(ScannerNames, OneOfTwoNormalizationTwinsGetsAnotherNameInTheDrive) {
     EXPECT_EQ(store->itemAtPath(at(child.name))->id, child.id);
   }
   EXPECT_EQ(diskNames, (std::set<std::string>{kComposed, kDecomposed}));
-  const bool isBounced = driveNames.contains("caf\u00e9 2.txt") || driveNames.contains("cafe\u0301 2.txt");
+  const bool isBounced =
+      driveNames.contains("caf\u00e9 2.txt") || driveNames.contains("cafe\u0301 2.txt");
   EXPECT_TRUE(isBounced);
   EXPECT_EQ(scan().changes, 0U);
   EXPECT_EQ(scanner->scanFolders({kRootID}), nullptr);

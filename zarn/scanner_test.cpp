@@ -191,14 +191,15 @@ TEST_F(ScannerTest, AFolderOnAReusedInodeIsAnother) {
   // The row is made to say what it would if the disk had used the number again at once.
   remove("old");
   makeFolder("old");
-  struct stat status {};
+  struct stat status{};
   ASSERT_EQ(stat(at("old").c_str(), &status), 0);
   ASSERT_EQ(database->write([&](WriteTransaction& transaction) -> NSErrorRef {
     ItemRow reused = *oldRow;
     reused.inode = status.st_ino;
     transaction.updateQuietly(reused);
     return nullptr;
-  }), nullptr);
+  }),
+            nullptr);
   scan();
   EXPECT_NE(id("old"), oldRow->id);
   EXPECT_NE(id("old"), 0U);
@@ -234,8 +235,10 @@ TEST_F(ScannerTest, AHomeCopiedToAnotherDiskKeepsItsIds) {
   close();
   // Every inode and every date of change is another.
   const std::string aside = layout.home() + "/moved";
-  ASSERT_EQ(std::system(("cp -a '" + layout.tree() + "' '" + aside + "' && rm -r '" + layout.tree() +
-                         "' && mv '" + aside + "' '" + layout.tree() + "'").c_str()), 0);
+  ASSERT_EQ(std::system(("cp -a '" + layout.tree() + "' '" + aside + "' && rm -r '" +
+                         layout.tree() + "' && mv '" + aside + "' '" + layout.tree() + "'")
+                            .c_str()),
+            0);
   open();
   scan();
   EXPECT_EQ(id("folder"), folder);
@@ -316,7 +319,8 @@ TEST_F(ScannerTest, ScansFoldersAsOneChange) {
   const auto a = id("folder/a.txt");
   (void)sink->take();
   rename("folder/a.txt", "folder/inner/b.txt");
-  // The folder that it came to is compared first, then the one that it left, and the other way round.
+  // The folder that it came to is compared first, then the one that it left, and the other way
+  // round.
   ASSERT_EQ(scanFolders({"folder/inner", "folder"}), nullptr);
   EXPECT_EQ(id("folder/inner/b.txt"), a);
   rename("folder/inner/b.txt", "folder/a.txt");
@@ -382,6 +386,44 @@ TEST_F(ScannerTest, TrashedItemsKeepTheirIdsAndAreMarked) {
   EXPECT_EQ(id("back"), folder);
   EXPECT_EQ(id("back/inner/deep.txt"), deep);
   EXPECT_FALSE(store->itemByID(deep)->isTrashed());
+}
+
+TEST_F(ScannerTest, LeavesAloneWhatItMayNotRead) {
+  populate();
+  makeFolder("listed");
+  write("listed/b.txt");
+  scan();
+  const auto deep = id("folder/inner/deep.txt");
+  const auto listed = id("listed/b.txt");
+  close();
+  // The superuser may read everything, so another user looks: one folder cannot be opened, of the
+  // other only the names can be read.
+  constexpr uid_t kNobody = 65534;
+  const pid_t child = fork();
+  if (child == 0) {
+    const std::string home = std::filesystem::path(layout.home()).parent_path();
+    const bool isRoot = geteuid() == 0;
+    if (isRoot && std::system(("chown -R 65534:65534 '" + home + "'").c_str()) != 0) _exit(3);
+    if (isRoot &&
+        (setresgid(kNobody, kNobody, kNobody) != 0 || setresuid(kNobody, kNobody, kNobody) != 0)) {
+      _exit(4);
+    }
+    if (chmod(at("folder/inner").c_str(), 0) != 0 || chmod(at("listed").c_str(), 0400) != 0)
+      _exit(5);
+    open();
+    EXPECT_EQ(scan().unreadable, 1U);
+    EXPECT_TRUE(store->itemByID(deep));
+    EXPECT_TRUE(store->itemByID(listed));
+    EXPECT_EQ(scanner->scanFolders({id("folder"), id("listed")}), nullptr);
+    EXPECT_TRUE(store->itemByID(deep));
+    EXPECT_TRUE(store->itemByID(listed));
+    close();
+    chmod(at("folder/inner").c_str(), 0700);
+    _exit(HasFailure() ? 1 : 0);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
 }
 
 TEST_F(ScannerTest, AKillDuringTheFirstScanStartsItAfresh) {

@@ -15,8 +15,8 @@ namespace {
 constexpr std::int64_t kApplicationID = 0x7a61726e;  // "zarn"
 
 // Rows of a folder that come in one scan are stored in name order, so that a page by name reads
-// neighbouring rows. `age` is the modification time negated: both orders then run forwards. Names are
-// blobs: they need not be UTF-8.
+// neighbouring rows. `age` is the modification time negated: both orders then run forwards. Names
+// are blobs: they need not be UTF-8.
 constexpr const char* kTables = R"sql(
   CREATE TABLE meta(key TEXT PRIMARY KEY, value) WITHOUT ROWID;
   CREATE TABLE item(

@@ -24,8 +24,8 @@ inline constexpr const char* kIsComplete = "isComplete";    ///< 1 once a whole 
 inline constexpr const char* kStampedUpTo = "stampedUpTo";  ///< see Scanner::stampSome
 }  // namespace meta
 
-/// Makes the tables in an empty file; brings those of an older version up to date; makes sort keys of
-/// another collation version anew. Throws SQLite::Exception or SchemaTooNew.
+/// Makes the tables in an empty file; brings those of an older version up to date; makes sort keys
+/// of another collation version anew. Throws SQLite::Exception or SchemaTooNew.
 void prepareSchema(Connection& connection);
 
 /// The tables without the items' indexes, for a bulk load, and then the indexes.
@@ -35,8 +35,8 @@ void createIndexes(Connection& connection);
 [[nodiscard]] std::int64_t metaInteger(Connection& connection, const char* key);
 void setMetaInteger(Connection& connection, const char* key, std::int64_t value);
 
-/// A rank that no earlier database of this drive has reached: ranks start at the time of creation in
-/// microseconds, and changes come slower than that.
+/// A rank that no earlier database of this drive has reached: ranks start at the time of creation
+/// in microseconds, and changes come slower than that.
 [[nodiscard]] std::uint64_t initialRank();
 
 }  // namespace yomber

@@ -2,13 +2,12 @@
 
 #include <fcntl.h>
 
-#include <unordered_map>
 #include <vector>
 
 #include "zarn/connection.h"
+#include "zarn/folder_opener.h"
 #include "zarn/folder_snapshot.h"
 #include "zarn/row_queries.h"
-#include "zarn/scan_session.h"
 #include "zarn/schema.h"
 #include "zarn/write_transaction.h"
 
@@ -81,18 +80,18 @@ std::uint32_t Stamper::stampSome(std::uint32_t limit) {
   std::vector<Stamped> stamped;
   std::uint64_t folder = kNoParent;
   std::shared_ptr<const FileDescriptor> opened;
+  FolderOpener folders(*store_);
   for (const ItemRow& row : batch.rows) {
     if (!isToBeStamped(row) || row.parent == kNoParent) continue;
     if (row.parent != folder) {
       folder = row.parent;
-      opened = openFolderOfItem(*store_, folder);
+      opened = folders.open(folder);
     }
     Stamped item;
     if (opened && stampRow(opened->get(), row.nameOnDisk(), row, item)) stamped.push_back(item);
   }
-  const NSErrorRef error = store_->database()->write([&](WriteTransaction& transaction) {
-    return store(transaction, stamped, batch.end);
-  });
+  const NSErrorRef error = store_->database()->write(
+      [&](WriteTransaction& transaction) { return store(transaction, stamped, batch.end); });
   return error ? 0 : static_cast<std::uint32_t>(batch.rows.size());
 }
 

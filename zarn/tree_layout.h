@@ -16,8 +16,8 @@ class TreeLayout {
   explicit TreeLayout(std::string home);
 
   [[nodiscard]] const std::string& home() const { return home_; }
-  [[nodiscard]] const std::string& tree() const { return tree_; }            ///< <home>/tree
-  [[nodiscard]] const std::string& root() const { return root_; }            ///< default Documents
+  [[nodiscard]] const std::string& tree() const { return tree_; }  ///< <home>/tree
+  [[nodiscard]] const std::string& root() const { return root_; }  ///< default Documents
   [[nodiscard]] const std::string& trashFiles() const { return trashFiles_; }
   [[nodiscard]] const std::string& trashInfo() const { return trashInfo_; }
   [[nodiscard]] const std::string& promises() const { return promises_; }    ///< tree/.Promises
@@ -28,7 +28,8 @@ class TreeLayout {
   [[nodiscard]] std::string containerFolder(std::string_view containerID) const;
   [[nodiscard]] std::string documents(std::string_view containerID) const;
 
-  /// Makes the folders that a drive needs, private to the user; answers errno, 0 when all are there.
+  /// Makes the folders that a drive needs, private to the user; answers errno, 0 when all are
+  /// there.
   [[nodiscard]] int createFolders() const;
 
   /// A location inside the tree, split into the place it belongs to and the path below the place.

@@ -28,10 +28,10 @@ TEST(TreeLayout, FindsThePlaceOfALocation) {
 }
 
 TEST(TreeLayout, KeepsOutOfWhatIsNoPlace) {
-  for (const char* path :
-       {"/h/tree", "/h/tree/", "/h/treetop/x", "/h/private/x", "/h/tree/.Promises/5",
-        "/h/tree/.Trash/info/x", "/h/tree/.Trash", "/h/tree/c", "/h/tree/c/Other/x",
-        "/h/tree/c/Documents/../x", "/h/tree/c/Documents//x", "/h/tree/c/Documents/.", "", "h/tree"}) {
+  for (const char* path : {"/h/tree", "/h/tree/", "/h/treetop/x", "/h/private/x",
+                           "/h/tree/.Promises/5", "/h/tree/.Trash/info/x", "/h/tree/.Trash",
+                           "/h/tree/c", "/h/tree/c/Other/x", "/h/tree/c/Documents/../x",
+                           "/h/tree/c/Documents//x", "/h/tree/c/Documents/.", "", "h/tree"}) {
     EXPECT_FALSE(kLayout.placeOf(path)) << path;
   }
 }
@@ -52,7 +52,7 @@ TEST(TreeLayout, MakesItsFoldersPrivate) {
   ASSERT_EQ(layout.createFolders(), 0);
   ASSERT_EQ(layout.createFolders(), 0);
   for (const std::string& path : {layout.root(), layout.trashFiles(), layout.privateArea()}) {
-    struct stat status {};
+    struct stat status{};
     ASSERT_EQ(stat(path.c_str(), &status), 0) << path;
     EXPECT_EQ(status.st_mode & 0777U, 0700U) << path;
   }

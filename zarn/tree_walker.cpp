@@ -79,7 +79,8 @@ std::unique_ptr<FolderSnapshot> TreeWalker::read(std::shared_ptr<const FileDescr
   const int descriptor = snapshot->folder->get();
   if (!lookAtEntry(descriptor, "", snapshot->self)) return snapshot;
   if (const int failure = readFolderEntries(descriptor, *snapshot); failure != 0) {
-    log_error(defaultLog(), "[ERROR] a folder cannot be read (inode %llu): %s; its items stay as known",
+    log_error(defaultLog(),
+              "[ERROR] a folder cannot be read (inode %llu): %s; its items stay as known",
               snapshot->self.inode, std::strerror(failure));
     return snapshot;
   }
@@ -117,7 +118,7 @@ TreeWalker::Level TreeWalker::levelOf(const FolderSnapshot& snapshot) {
 void TreeWalker::reopen(Level& level, const FileDescriptor& child) {
   if (level.folder) return;
   auto parent = shared(openat(child.get(), "..", kOpenFolderFlags));
-  struct stat status {};
+  struct stat status{};
   const bool isTheSame =
       parent && fstat(parent->get(), &status) == 0 && status.st_ino == level.inode;
   if (isTheSame) level.folder = std::move(parent);
@@ -143,8 +144,9 @@ bool TreeWalker::walk(std::shared_ptr<const FileDescriptor> folder, std::uint64_
     level.children.pop_back();
     if (levels.size() > kOpenLevels) levels[levels.size() - kOpenLevels - 1].folder.reset();
     // A folder that has gone, or has been moved away while it was closed, is read as unreadable.
-    auto next = level.folder ? shared(openat(level.folder->get(), child.name.c_str(), kOpenFolderFlags))
-                             : nullptr;
+    auto next = level.folder
+                    ? shared(openat(level.folder->get(), child.name.c_str(), kOpenFolderFlags))
+                    : nullptr;
     if (!next && level.folder && errno != ENOENT) {
       log_error(defaultLog(), "[ERROR] the folder %@ cannot be opened: %s; its items stay as known",
                 child.name, std::strerror(errno));

@@ -131,8 +131,7 @@ void WriteTransaction::removeOne(const ItemRow& row) {
   dead.extra = nullptr;
   if (row.extra) writeExtra(connection_, dead);
   dead.extra = row.extra;
-  changes_.push_back(
-      {.row = std::move(dead), .parentBefore = row.parent, .nameBefore = row.name});
+  changes_.push_back({.row = std::move(dead), .parentBefore = row.parent, .nameBefore = row.name});
 }
 
 void WriteTransaction::markBelow(std::uint64_t folder, bool isTrashed) {

@@ -88,6 +88,7 @@ void callOnce(const Remote<Echo>& echo) {
 std::vector<double> callsFromThreads(const Remote<Echo>& echo) {
   std::vector<std::vector<double>> times(kThreads);
   std::vector<std::thread> threads;
+  threads.reserve(times.size());
   for (auto& own : times) {
     threads.emplace_back(
         [&own, &echo] { own = measure(kRounds / kThreads, [&] { callOnce(echo); }); });

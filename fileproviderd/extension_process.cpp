@@ -51,6 +51,7 @@ class SpawnPlan {
   int run(pid_t* pid) {
     char* const arguments[] = {program_.data(), nullptr};
     std::vector<char*> environment;
+    environment.reserve(environment_.size() + 1);
     for (auto& entry : environment_) environment.push_back(entry.data());
     environment.push_back(nullptr);
     return posix_spawn(pid, program_.c_str(), &actions_, &attributes_, arguments,

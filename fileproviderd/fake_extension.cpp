@@ -172,7 +172,7 @@ class FakeExtension final : public NSFileProviderExtension {
 
   std::optional<NSFileProviderItemIdentifier> persistentIdentifierForItemAtURL(
       const NSURLRef& url) override {
-    const auto name = url->lastPathComponent();
+    auto name = url->lastPathComponent();
     if (!readItems().contains(name)) return std::nullopt;
     return name;
   }

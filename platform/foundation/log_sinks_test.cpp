@@ -82,7 +82,7 @@ TEST_F(FileSinkTest, KeepsThreeFilesOfBoundedSize) {
 }
 
 TEST_F(FileSinkTest, SaysWhyAFileCannotBeOpened) {
-  std::ofstream(directory_ / "file");
+  const std::ofstream file(directory_ / "file");
   NSErrorRef error;
   EXPECT_EQ(makeLogSink({.program = "zarn", .directory = directory_ / "file"}, &error), nullptr);
   ASSERT_NE(error, nullptr);

@@ -37,8 +37,12 @@ NSErrorRef folderError(int number, const TreeLayout& layout) {
 /// that leave the working set as time goes by.
 class Drive::Housekeeping {
  public:
-  Housekeeping(std::shared_ptr<Scanner> scanner, std::shared_ptr<WorkingSetSignals> signals)
-      : scanner_(std::move(scanner)), signals_(std::move(signals)), thread_([this] { run(); }) {}
+  Housekeeping(std::shared_ptr<Database> database, std::shared_ptr<Scanner> scanner,
+               std::shared_ptr<WorkingSetSignals> signals)
+      : database_(std::move(database)),
+        scanner_(std::move(scanner)),
+        signals_(std::move(signals)),
+        thread_([this] { run(); }) {}
   ~Housekeeping() {
     {
       LockGuard guard(mutex_);
@@ -51,6 +55,7 @@ class Drive::Housekeeping {
  private:
   static constexpr std::uint32_t kStamps = 100;
   static constexpr std::chrono::milliseconds kStampPause{50};
+  static constexpr std::chrono::milliseconds kBusyPause{1000};  // while other things change
   static constexpr std::chrono::minutes kPause{15};
 
   /// False when it is time to stop.
@@ -67,14 +72,18 @@ class Drive::Housekeeping {
     while (true) {
       signals_->expire(NSDate::now().nanoseconds());
       while (scanner_->stampSome(kStamps) != 0) {
-        if (!pause(kStampPause)) return;
+        const std::uint64_t rank = database_->currentRank();
+        const bool isBusy = std::exchange(lastRank_, rank) != rank;
+        if (!pause(isBusy ? kBusyPause : kStampPause)) return;
       }
       if (!pause(kPause)) return;
     }
   }
 
+  const std::shared_ptr<Database> database_;
   const std::shared_ptr<Scanner> scanner_;
   const std::shared_ptr<WorkingSetSignals> signals_;
+  std::uint64_t lastRank_ = 0;  // own thread
   Mutex mutex_;
   Condition changed_;
   bool isStopping_ GUARDED_BY(mutex_) = false;
@@ -146,7 +155,7 @@ void Drive::start() {
                    .didFinishFirstScan =
                        [this] {
                          housekeeping_ =
-                             std::make_unique<Housekeeping>(scanner, workingSetSignals_);
+                             std::make_unique<Housekeeping>(database, scanner, workingSetSignals_);
                        }});
 }
 

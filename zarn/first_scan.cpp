@@ -29,12 +29,11 @@ SortedSnapshot::SortedSnapshot(std::unique_ptr<FolderSnapshot> folder)
   for (std::size_t i = 0; i < entries.size(); ++i) {
     const std::size_t begin = keys.size();
     appendNameSortKey(keys, snapshot->nameOf(entries[i]));
-    order.push_back({static_cast<std::uint32_t>(i), static_cast<std::uint32_t>(keys.size() - begin),
-                     begin});
+    order.push_back(
+        {static_cast<std::uint32_t>(i), static_cast<std::uint32_t>(keys.size() - begin), begin});
   }
-  std::sort(order.begin(), order.end(), [this](const Place& left, const Place& right) {
-    return keyOf(left) < keyOf(right);
-  });
+  std::sort(order.begin(), order.end(),
+            [this](const Place& left, const Place& right) { return keyOf(left) < keyOf(right); });
 }
 
 std::uint64_t FirstScan::idFor(const FolderEntry& entry, const ItemAttributes& attributes) {
@@ -55,8 +54,8 @@ void FirstScan::fillRow(const FolderSnapshot& snapshot, const FolderEntry& entry
   row.btime = entry.btime;
   row.ctime = entry.ctime;
   row.inode = entry.inode;
-  row.extra = attributes.extra.isEmpty() ? nullptr
-                                         : std::make_shared<const ItemExtra>(attributes.extra);
+  row.extra =
+      attributes.extra.isEmpty() ? nullptr : std::make_shared<const ItemExtra>(attributes.extra);
   row.flags = attributes.isFault ? 0 : row_flag::kDownloaded;
   if (attributes.isShared) row.flags |= row_flag::kShared;
 }
@@ -87,9 +86,8 @@ bool FirstScan::isTaken(const SortedSnapshot& sorted, std::size_t end,
 
 bool FirstScan::chooseOtherName(const SortedSnapshot& sorted, std::size_t index, ItemRow& row) {
   // Nearly always the name sorts apart from the one before it, and nothing else is given.
-  const bool isAlone =
-      index == 0 || sortKeyCollationPart(sorted.keyOf(sorted.order[index - 1])) !=
-                        sortKeyCollationPart(sorted.keyOf(sorted.order[index]));
+  const bool isAlone = index == 0 || sortKeyCollationPart(sorted.keyOf(sorted.order[index - 1])) !=
+                                         sortKeyCollationPart(sorted.keyOf(sorted.order[index]));
   if ((isAlone && given_.empty()) || !isTaken(sorted, index, row.name)) return false;
   row.diskName = row.name;
   const std::string own = row.name;
@@ -106,8 +104,12 @@ void FirstScan::addFolder(const SortedSnapshot& sorted) {
   if (visit == visits_.end()) return;
   const Parent parent = visit->second;
   visits_.erase(visit);
-  if (!snapshot.isReadable) return;
-  if (const auto visitor = visitor_.lock()) visitor->didIdentifyFolder(snapshot.visit, parent.id);
+  const auto visitor = visitor_.lock();
+  if (!snapshot.isReadable) {
+    if (visitor) visitor->didNotReadFolder(parent.id);
+    return;
+  }
+  if (visitor) visitor->didIdentifyFolder(snapshot.visit, parent.id);
   given_ = parent.id == kRootID ? reserved_ : std::vector<std::string>();
 
   ItemRow row;

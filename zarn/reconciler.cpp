@@ -8,6 +8,9 @@
 namespace yomber {
 namespace {
 
+/// How many folders the entries that wait for a decision may keep open.
+constexpr std::size_t kMaximumOpenFolders = 64;
+
 constexpr const char* kCompared =
     "SELECT id,inode,ctime,rank,kind,coalesce(disk_name,name) FROM item WHERE parent=?1";
 
@@ -83,8 +86,12 @@ void Reconciler::compareFolder(WriteTransaction& transaction, const FolderSnapsh
   if (visit == visits_.end()) return;
   const std::uint64_t folder = visit->second;
   visits_.erase(visit);
-  if (!snapshot.isReadable || !refreshFolder(transaction, folder, snapshot)) return;
-  if (const auto visitor = visitor_.lock()) visitor->didIdentifyFolder(snapshot.visit, folder);
+  const auto visitor = visitor_.lock();
+  if (!snapshot.isReadable || !refreshFolder(transaction, folder, snapshot)) {
+    if (visitor) visitor->didNotReadFolder(folder);
+    return;
+  }
+  if (visitor) visitor->didIdentifyFolder(snapshot.visit, folder);
 
   const Differences differences = findDifferences(transaction, folder, snapshot);
   for (const std::uint64_t id : differences.gone) {
@@ -98,6 +105,8 @@ void Reconciler::compareFolder(WriteTransaction& transaction, const FolderSnapsh
     if (differences.isKnown[i]) continue;
     addCandidate(transaction, folder, snapshot, snapshot.entries[i], 0);
   }
+  // With what is known so far, rather than without descriptors.
+  if (openFolders_ > kMaximumOpenFolders) decideOpen(transaction);
 }
 
 void Reconciler::compareName(WriteTransaction& transaction, std::uint64_t folder,
@@ -213,6 +222,7 @@ void Reconciler::addCandidate(WriteTransaction& transaction, std::uint64_t folde
     return;
   }
   candidate.snapshot = nullptr;  // gone by the time it is decided
+  if (open_.empty() || open_.back().folder != candidate.folder) ++openFolders_;
   open_.push_back(std::move(candidate));
 }
 

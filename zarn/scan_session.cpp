@@ -7,6 +7,7 @@
 #include <unordered_map>
 #include <unordered_set>
 
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "zarn/connection.h"
 #include "zarn/row_queries.h"
@@ -56,6 +57,8 @@ NSErrorRef ScanSession::readNewFolders(TreeWalker& walker, ScanReport& report) {
     entries = 0;
     return !failure;
   };
+  static FaultPoint beforeReading("zarn.scan.before-new-folders");
+  (void)beforeReading.hit();
   for (const Reconciler::NewFolder& folder : std::exchange(newFolders_, {})) {
     auto opened = openFolderBelow(folder.parent->get(), folder.name);
     const bool goesOn =
@@ -169,26 +172,30 @@ NSErrorRef FolderScan::run(const std::vector<std::uint64_t>& folders, Depth dept
 std::shared_ptr<const FileDescriptor> FolderScan::openDirty(const DirtyFolder& dirty,
                                                             std::uint64_t& folder,
                                                             std::vector<DirtyFolder>& notFound) {
+  // Without a row it is gone, or was identified in a moment whose commit is still to come.
   const auto row = store_.itemByID(folder);
-  if (!row) return nullptr;
-  if (dirty.attempts >= Scanner::kMaximumAttempts) return open(folder);
-  auto opened = openFolderOfItem(store_, folder);
+  if (dirty.attempts >= Scanner::kMaximumAttempts) return row ? open(folder) : nullptr;
+  auto opened = row ? openFolderOfItem(store_, folder) : nullptr;
   FolderEntry self;
-  const bool isIt =
-      opened && lookAtEntry(opened->get(), "", self) && self.inode == row->inode;
+  const bool isIt = opened && lookAtEntry(opened->get(), "", self) && self.inode == row->inode;
   if (isIt) return opened;
   notFound.push_back(dirty);
   return nullptr;
 }
 
 NSErrorRef FolderScan::run(const std::vector<DirtyFolder>& folders,
-                           std::vector<DirtyFolder>& notFound, ScanReport& report) {
+                           std::vector<DirtyFolder>& notFound, std::vector<std::uint64_t>& deep,
+                           ScanReport& report) {
   std::vector<ScanSession::NamesInFolder> names;
   std::unordered_map<std::uint64_t, std::shared_ptr<const FileDescriptor>> whole;
   for (const DirtyFolder& dirty : folders) {
     std::uint64_t folder = dirty.id;
     auto opened = openDirty(dirty, folder, notFound);
     if (!opened) continue;
+    if (dirty.isDeep && folder == dirty.id) {
+      deep.push_back(folder);
+      continue;
+    }
     if (dirty.isWhole || folder != dirty.id) {
       whole.emplace(folder, std::move(opened));
       continue;

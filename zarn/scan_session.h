@@ -79,9 +79,11 @@ class FolderScan {
         walker_(std::move(options)) {}
   [[nodiscard]] NSErrorRef run(const std::vector<std::uint64_t>& folders, Depth depth,
                                ScanReport& report);
-  /// Folders that are not where their rows say go into `notFound`.
+  /// Folders that are not where their rows say go into `notFound`; those that are to be scanned with
+  /// everything below them, into `deep`.
   [[nodiscard]] NSErrorRef run(const std::vector<DirtyFolder>& folders,
-                               std::vector<DirtyFolder>& notFound, ScanReport& report);
+                               std::vector<DirtyFolder>& notFound, std::vector<std::uint64_t>& deep,
+                               ScanReport& report);
 
  private:
   std::shared_ptr<const FileDescriptor> open(std::uint64_t& folder);

@@ -186,8 +186,13 @@ NSErrorRef Scanner::scanAll(ScanReport* report) {
   ScanReport& out = report != nullptr ? *report : own;
   out = {};
   LockGuard guard(state_->wholeScan);
-  if (state_->store->database()->needsFirstScan()) return state_->firstScan(out);
-  return state_->reconcile(out);
+  try {
+    if (state_->store->database()->needsFirstScan()) return state_->firstScan(out);
+    return state_->reconcile(out);
+  } catch (const std::exception& exception) {
+    return NSError::errorWithDomain(kDatabaseErrorDomain, kDatabaseFailure,
+                                    {{NSLocalizedDescriptionKey, std::string(exception.what())}});
+  }
 }
 
 NSErrorRef Scanner::scanFolders(const std::vector<std::uint64_t>& folders, ScanReport* report) {
@@ -203,9 +208,17 @@ NSErrorRef Scanner::scanDirty(const std::vector<DirtyFolder>& folders,
   ScanReport own;
   ScanReport& out = report != nullptr ? *report : own;
   out = {};
-  const auto run = [&](const std::vector<DirtyFolder>& some, std::vector<DirtyFolder>& missing) {
+  const auto run = [&](const std::vector<DirtyFolder>& some,
+                       std::vector<DirtyFolder>& missing) -> NSErrorRef {
+    std::vector<std::uint64_t> deep;
     FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
-    return scan.run(some, missing, out);
+    if (NSErrorRef error = scan.run(some, missing, deep, out)) return error;
+    for (const std::uint64_t folder : deep) {
+      FolderScan below(*state_->store, state_->links, state_->visitor,
+                       state_->walkerOptions(false));
+      if (NSErrorRef error = below.run({folder}, FolderScan::Depth::Everything, out)) return error;
+    }
+    return nullptr;
   };
   std::vector<DirtyFolder> missing;
   notFound.clear();

@@ -23,7 +23,15 @@ capnp::Data::Reader dataOf(const std::string& bytes) {
 /// Connects once, and again when the peer has been started afresh meanwhile.
 std::shared_ptr<ipc::Connection> connected(std::shared_ptr<ipc::Connection>& connection, const std::string& socket,
                                            NSErrorRef* error) {
-  if (!connection || !connection->isConnected()) connection = ipc::Connection::connect(socket, error);
+  if (connection && connection->isConnected()) return connection;
+  NSErrorRef failure;
+  connection = ipc::Connection::connect(socket, &failure);
+  if (!connection) {
+    // Whatever the system's reason is, to the caller the drive is not there.
+    storeError(error, NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionInvalid,
+                                               {{NSLocalizedDescriptionKey, failure->localizedDescription()},
+                                                {NSUnderlyingErrorKey, failure}}));
+  }
   return connection;
 }
 

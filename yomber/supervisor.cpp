@@ -69,6 +69,8 @@ Supervisor::Supervisor(std::string lockPath, std::vector<SupervisedProgram> prog
 }
 
 NSErrorRef Supervisor::takeLock() {
+  const sigset_t signals = handledSignals();
+  sigprocmask(SIG_BLOCK, &signals, nullptr);
   lockDescriptor_ = open(lockPath_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
   if (lockDescriptor_ < 0) return NSError::errorWithErrno(errno, lockPath_);
   flock lock = wholeFile(F_WRLCK);
@@ -88,7 +90,6 @@ std::optional<pid_t> Supervisor::runningPid(const std::string& lockPath) {
 
 void Supervisor::run() {
   const sigset_t signals = handledSignals();
-  sigprocmask(SIG_BLOCK, &signals, nullptr);
   const int signalDescriptor = signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK);
   bool ending = false;
   while (!ending) {

@@ -21,7 +21,8 @@ struct SupervisedProgram {
 /// it is told to end. The programs are tied to it: should it be killed, they end too, so that nothing
 /// of a drive is ever left without a keeper.
 ///
-/// A single-threaded process of its own; `run` takes over its signals.
+/// A process of its own, whose signals it takes over: threads may be started only after `takeLock`, which
+/// blocks them, so that no thread takes a signal from `run`.
 class Supervisor {
  public:
   /// `lockPath` names the file whose record lock says that a drive is up, and whose pid it is.

@@ -1,8 +1,8 @@
 #include "benchmarks/many_files.h"
 
 #include <array>
-#include <cstdio>
 #include <stdexcept>
+#include <utility>
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -15,13 +15,15 @@ namespace yomber::bench {
 void makeFiles(const std::string& folder, std::size_t count) {
   const int directory = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   if (directory < 0) throw std::runtime_error("cannot open " + folder);
-  constexpr std::array<const char*, 4> kinds{"report %zu.pdf", "IMG_%06zu.jpg", "Notes of day %zu.txt", "draft-%zu.odt"};
+  constexpr std::array<std::pair<const char*, const char*>, 4> kinds{
+      {{"report ", ".pdf"}, {"IMG_", ".jpg"}, {"Notes of day ", ".txt"}, {"draft-", ".odt"}}};
   for (std::size_t number = 0; number < count; ++number) {
-    std::array<char, 64> name{};
-    std::snprintf(name.data(), name.size(), kinds[number % kinds.size()], number);
-    const int file = openat(directory, name.data(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    const auto& [before, after] = kinds[number % kinds.size()];
+    const std::string name = before + std::to_string(number) + after;
+    const int file = openat(directory, name.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
     if (file < 0) throw std::runtime_error("cannot make a file in " + folder);
-    if (number % 16 == 0 && ::write(file, "content", 7) != 7) throw std::runtime_error("cannot write in " + folder);
+    if (number % 16 == 0 && ::write(file, "content", 7) != 7)
+      throw std::runtime_error("cannot write in " + folder);
     close(file);
   }
   close(directory);
@@ -29,8 +31,9 @@ void makeFiles(const std::string& folder, std::size_t count) {
 
 double warmFindSeconds(const std::string& directory) {
   const auto find = [&] {
-    const auto result = testing::runProcess({"/bin/sh", "-c", "exec find \"$0\" -printf '%p %s %T@\\n' >/dev/null", directory}, {},
-                                            std::chrono::minutes(5));
+    const auto result = testing::runProcess(
+        {"/bin/sh", "-c", "exec find \"$0\" -printf '%p %s %T@\\n' >/dev/null", directory}, {},
+        std::chrono::minutes(5));
     if (result.exitCode != 0) throw std::runtime_error("find failed: " + result.errors);
   };
   find();

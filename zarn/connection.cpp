@@ -22,7 +22,7 @@ const char* pragmas(Connection::Mode mode) {
     case Connection::Mode::Write:
       return "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA mmap_size=2147418112;"
              "PRAGMA cache_size=-32768; PRAGMA temp_store=MEMORY; PRAGMA secure_delete=0;"
-             "PRAGMA wal_autocheckpoint=4000; PRAGMA journal_size_limit=67108864;";
+             "PRAGMA wal_autocheckpoint=0; PRAGMA journal_size_limit=67108864;";
     case Connection::Mode::Bulk:
       // The file counts for nothing until it is complete, so nothing needs a journal.
       return "PRAGMA journal_mode=OFF; PRAGMA synchronous=OFF; PRAGMA locking_mode=EXCLUSIVE;"

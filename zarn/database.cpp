@@ -30,6 +30,14 @@ namespace {
 constexpr std::size_t kMaximumBatch = 256;
 constexpr std::size_t kIdleReaders = 8;
 constexpr std::uint64_t kRemovalsBetweenPrunings = 1000;
+/// The log is written back to the database once it has so many pages, beside the writer: it waits for
+/// the disk, and commits must not.
+constexpr int kCheckpointPages = 4000;
+/// While commits go on, the log is never written back to its end. From so many pages on the writer
+/// does the little that is left itself, so that the log begins anew.
+constexpr int kLongLogPages = 20'000;
+/// Then it does all of it, so that the log does not grow without bound.
+constexpr int kMaximumLogPages = 100'000;
 constexpr const char* kAsideSuffix = ".new";
 constexpr const char* kSuspectSuffix = ".suspect";
 
@@ -111,6 +119,13 @@ struct Database::State {
   // The writer thread's own.
   std::unique_ptr<Connection> writer;
   std::uint64_t removals = 0;
+  int logPages = 0;
+
+  std::atomic<bool> isNearlyWrittenBack{false};
+  Mutex checkpointMutex;
+  Condition checkpointChanged;
+  bool isCheckpointDue GUARDED_BY(checkpointMutex) = false;
+  bool isCheckpointerEnding GUARDED_BY(checkpointMutex) = false;
 
   Mutex queueMutex;
   Condition queueChanged;
@@ -127,8 +142,12 @@ struct Database::State {
   std::vector<std::weak_ptr<ChangeSink>> sinks GUARDED_BY(sinksMutex);
 
   std::thread thread;
+  std::thread checkpointer;
 
   void openWriter();
+  void runCheckpoints();
+  void requestCheckpoint();
+  void endCheckpoints();
   void run();
   bool takeBatch(std::vector<Task>& batch);
   void runAlone(Task& task);
@@ -146,6 +165,11 @@ struct Database::State {
 
 void Database::State::openWriter() {
   writer = std::make_unique<Connection>(path, Connection::Mode::Write);
+  const auto noteLog = [](void* state, sqlite3*, const char*, int pages) {
+    static_cast<State*>(state)->logPages = pages;
+    return SQLITE_OK;
+  };
+  sqlite3_wal_hook(writer->database().getHandle(), noteLog, this);
   prepareSchema(*writer);
   identity = static_cast<std::uint64_t>(metaInteger(*writer, meta::kIdentity));
   rank = std::max(rank.load(), static_cast<std::uint64_t>(metaInteger(*writer, meta::kRank)));
@@ -227,6 +251,51 @@ void Database::State::runBatch(std::vector<Task>& batch) {
   }
   (void)afterCommit.hit();
   publish(transaction);
+  requestCheckpoint();
+}
+
+/// On the writer thread, after a commit.
+void Database::State::requestCheckpoint() {
+  if (logPages < kCheckpointPages) return;
+  const bool isLittleLeft = logPages > kLongLogPages && isNearlyWrittenBack.exchange(false);
+  if (isLittleLeft || logPages > kMaximumLogPages) {
+    (void)sqlite3_wal_checkpoint_v2(writer->database().getHandle(), nullptr,
+                                    SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+    return;
+  }
+  LockGuard guard(checkpointMutex);
+  isCheckpointDue = true;
+  checkpointChanged.notifyOne();
+}
+
+void Database::State::runCheckpoints() {
+  for (;;) {
+    {
+      LockGuard guard(checkpointMutex);
+      while (!isCheckpointDue && !isCheckpointerEnding) checkpointChanged.wait(checkpointMutex);
+      if (isCheckpointerEnding) return;
+      isCheckpointDue = false;
+    }
+    try {
+      auto reader = takeReader();
+      (void)sqlite3_wal_checkpoint_v2(reader->database().getHandle(), nullptr,
+                                      SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+      returnReader(std::move(reader));
+      isNearlyWrittenBack = true;
+    } catch (const std::exception& exception) {
+      log_error(defaultLog(), "[ERROR] the database's log could not be written back: %@",
+                exception.what());
+    }
+  }
+}
+
+void Database::State::endCheckpoints() {
+  {
+    LockGuard guard(checkpointMutex);
+    isCheckpointerEnding = true;
+    checkpointChanged.notifyOne();
+  }
+  checkpointer.join();
 }
 
 void Database::State::runTask(Task& task, WriteTransaction& transaction) {
@@ -327,6 +396,7 @@ NSErrorRef Database::State::swapIn(const std::string& aside) {
 Database::Database(std::unique_ptr<State> state) : state_(std::move(state)) {
   State* const running = state_.get();
   running->thread = std::thread([running] { running->run(); });
+  running->checkpointer = std::thread([running] { running->runCheckpoints(); });
 }
 
 Database::~Database() {
@@ -336,6 +406,7 @@ Database::~Database() {
     state_->queueChanged.notifyAll();
   }
   state_->thread.join();
+  state_->endCheckpoints();
 }
 
 namespace {

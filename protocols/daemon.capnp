@@ -9,6 +9,11 @@
 # strings by the message size.
 #
 # While nobody is signed in, account-bound calls (marked [account]) fail with QSOstrellErrorDomain 2.
+#
+# zarn serves as soon as it runs. Over an empty database, calls that need items wait for the first scan
+# of the tree, in their order, and fail with what stopped it (a full disk, an unreadable tree) while it
+# cannot be made; zarn goes on trying. Over an existing one they are answered at once, and what the
+# scan finds changed comes as change notifications.
 
 using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
@@ -33,6 +38,7 @@ interface Daemon {
   # after its row is right.
 
   containers @4 () -> (containers :List(Container), generation :UInt64);
+  # The drive's own first. `generation` grows with every change of the list.
   containerItem @5 (containerID :Text, forceScan :Bool) -> (result :ItemResult);
 
   # --- Listing. `offset` counts entries already delivered; `nextOffset` is 0 when nothing is left.
@@ -58,6 +64,9 @@ interface Daemon {
 
   account @11 () -> (result :AccountResult);
   signIn @12 (name :Text) -> (failure :Common.OptionalError);
+  # Does nothing when that account is signed in; fails with QSOstrellErrorDomain 3 when another one is,
+  # or when the name is not 1 to 255 bytes of text. An account keeps its identifier from one time that
+  # it is signed in to the next.
   signOut @13 () -> (failure :Common.OptionalError);
 
   # --- Standing registrations; each ends with the connection, or when its returned capability is
@@ -179,8 +188,13 @@ interface ItemSender {
 
   boostPriority @0 ();
   watchItem @1 (path :Data, options :UInt32) -> (failure :Common.OptionalError);
-  # Watches the folder at a location. Active when the call arrives; the reply brings no items. Options:
-  # 1 updates, 2 deletions, 4 the whole subtree, 16 the folder's direct children.
+  # [account] Watches the folder at a location. Active when the call arrives; the reply brings no items.
+  # Options: 1 updates, 2 deletions, 4 the whole subtree, 16 the folder's direct children (part of 4).
+  #
+  # An item that moves out of what is watched is a deletion there; so is the watched folder's own end.
+  # For the root's subtree, so is what goes to the trash. A folder with content that moves into a
+  # watched subtree cuts the watcher off, as if it had been too slow: it has to list again.
+  # Fails with NSCocoaErrorDomain 4 when nothing is there, NSPOSIXErrorDomain ENOTDIR when it is no folder.
 
   invalidate @2 ();
 }
@@ -190,10 +204,12 @@ interface ItemReceiver {
   # that leaves more than 100,000 changes waiting is cut off: its sender fails with QSOstrellErrorDomain
   # 5, and it comes back for a fresh listing.
 
+  # A batch has each item at most once, in its latest state; deletions are items with the dead flag.
   receiveUpdates @0 (items :List(Common.Item), logicalExtensions :List(Text), physicalExtensions :List(Text)) -> ();
   receiveProgressUpdates @1 (identifiers :List(Text)) -> ();
   # Never answered, by design; the sender drops the call at once.
 
   senderDidFail @2 (error :Common.Error) -> ();
-  # The watch has ended; the library hands the error to the sender's proxies.
+  # The watch has ended: it was too slow (5), did not take a batch (4), or nobody is signed in any more
+  # (2). The library hands the error to the sender's proxies.
 }

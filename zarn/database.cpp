@@ -30,8 +30,8 @@ namespace {
 constexpr std::size_t kMaximumBatch = 256;
 constexpr std::size_t kIdleReaders = 8;
 constexpr std::uint64_t kRemovalsBetweenPrunings = 1000;
-/// The log is written back to the database once it has so many pages, beside the writer: it waits for
-/// the disk, and commits must not.
+/// The log is written back to the database once it has so many pages, beside the writer: it waits
+/// for the disk, and commits must not.
 constexpr int kCheckpointPages = 4000;
 /// While commits go on, the log is never written back to its end. From so many pages on the writer
 /// does the little that is left itself, so that the log begins anew.
@@ -146,6 +146,7 @@ struct Database::State {
 
   void openWriter();
   void runCheckpoints();
+  NSErrorRef writeBack();
   void requestCheckpoint();
   void endCheckpoints();
   void run();
@@ -276,17 +277,30 @@ void Database::State::runCheckpoints() {
       if (isCheckpointerEnding) return;
       isCheckpointDue = false;
     }
-    try {
-      auto reader = takeReader();
-      (void)sqlite3_wal_checkpoint_v2(reader->database().getHandle(), nullptr,
-                                      SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
-      returnReader(std::move(reader));
+    if (const NSErrorRef error = writeBack()) {
+      log_error(defaultLog(), "[ERROR] the database's log could not be written back: %@", error);
+    } else {
       isNearlyWrittenBack = true;
-    } catch (const std::exception& exception) {
-      log_error(defaultLog(), "[ERROR] the database's log could not be written back: %@",
-                exception.what());
     }
   }
+}
+
+NSErrorRef Database::State::writeBack() {
+  std::unique_ptr<Connection> reader;
+  NSErrorRef error;
+  try {
+    // Keeps the file from being swapped. Itself it cannot write.
+    reader = takeReader();
+    Connection connection(path, Connection::Mode::Write);
+    sqlite3* const handle = connection.database().getHandle();
+    const int result =
+        sqlite3_wal_checkpoint_v2(handle, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+    if (result != SQLITE_OK && result != SQLITE_BUSY) throw SQLite::Exception(handle, result);
+  } catch (const std::exception& exception) {
+    error = failure(exception);
+  }
+  if (reader) returnReader(std::move(reader));
+  return error;
 }
 
 void Database::State::endCheckpoints() {

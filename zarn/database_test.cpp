@@ -4,6 +4,7 @@
 #include <sys/wait.h>
 
 #include <atomic>
+#include <chrono>
 #include <future>
 #include <thread>
 
@@ -250,6 +251,32 @@ TEST_F(DatabaseTest, SortKeysAreMadeAnewForAnotherCollation) {
   }
   open();
   EXPECT_TRUE(store->itemByName(kRootID, "b"));
+}
+
+TEST_F(DatabaseTest, TheLogIsWrittenBackWhileCommitsGoOn) {
+  const auto sizeOfFile = [&] { return std::filesystem::file_size(layout.databasePath()); };
+  const auto before = sizeOfFile();
+  int number = 0;
+  const auto insertMany = [&](int count) {
+    ASSERT_EQ(database->write([&](WriteTransaction& transaction) -> NSErrorRef {
+      for (int i = 0; i < count; ++i) {
+        ItemRow row = document("item " + std::to_string(++number));
+        row.id = transaction.issueID();
+        transaction.insert(row);
+      }
+      return nullptr;
+    }),
+              nullptr);
+  };
+  // Well beyond the pages that bring it about, well below those that make the writer do it.
+  for (int i = 0; i < 50; ++i) insertMany(400);
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+  while (sizeOfFile() < before + 1'000'000 && std::chrono::steady_clock::now() < deadline) {
+    insertMany(1);
+  }
+  EXPECT_GT(sizeOfFile(), before + 1'000'000);
+  EXPECT_LT(std::filesystem::file_size(layout.databasePath() + "-wal"), 20'000U * 4096U);
+  EXPECT_EQ(store->counts().items, static_cast<std::uint64_t>(number));
 }
 
 TEST_F(DatabaseTest, PrunesTombstonesBeyondTheBound) {

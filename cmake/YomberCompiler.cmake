@@ -46,8 +46,9 @@ if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
   list(APPEND YOMBER_WARNINGS -Wduplicated-cond -Wlogical-op -Wno-restrict -Wno-array-bounds
     -Wno-maybe-uninitialized -Wno-stringop-overflow)
 else()
-  # Clang counts implicit sign changes as conversions where gcc does not.
-  list(APPEND YOMBER_WARNINGS -Wno-sign-conversion -Wno-implicit-int-float-conversion
+  # Clang counts implicit sign changes as conversions where gcc does not, and reports what the
+  # standard library itself uses of its own old parts; gcc reports our own uses.
+  list(APPEND YOMBER_WARNINGS -Wno-sign-conversion -Wno-deprecated-declarations -Wno-implicit-int-float-conversion
     -Wthread-safety -Wzero-as-null-pointer-constant
     -Winconsistent-missing-override -Wunused-macros -Wno-format-nonliteral -Wno-gnu-zero-variadic-macro-arguments)
 endif()

@@ -114,7 +114,7 @@ NSErrorRef ChangeFeed::workingSetChanges(std::optional<std::string_view> token, 
   } else {
     from = Token{database_->identity(), 0, database_->currentRank()};
   }
-  const NSErrorRef error = database_->read([&](Connection& reader) {
+  NSErrorRef error = database_->read([&](Connection& reader) {
     // One snapshot for the changes and their rows.
     SQLite::Transaction snapshot(reader.database());
     readChanges(reader, *from, count, out);

@@ -120,7 +120,7 @@ NSErrorRef Scanner::State::findPlaces(std::vector<ScanPlace>& places) const {
     if (NSErrorRef error = addPlace(path, std::move(row))) return error;
   }
   std::vector<ItemRow> containers;
-  const NSErrorRef failure = store->database()->read(
+  NSErrorRef failure = store->database()->read(
       [&](Connection& connection) { containers = findContainerFolders(connection); });
   if (failure) return failure;
   for (ItemRow& row : containers) {

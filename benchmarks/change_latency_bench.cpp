@@ -27,7 +27,8 @@ struct Changes {
 void makeSteadily(const std::string& folder, Changes& changes, std::size_t perSecond) {
   const auto start = Clock::now();
   for (std::size_t number = 0; number < changes.madeAt.size(); ++number) {
-    std::this_thread::sleep_until(start + std::chrono::microseconds(number * 1'000'000 / perSecond));
+    std::this_thread::sleep_until(start +
+                                  std::chrono::microseconds(number * 1'000'000 / perSecond));
     const std::string path = folder + "/change " + std::to_string(number);
     changes.madeAt[number] = Clock::now();
     std::ofstream(path).put('x');
@@ -43,7 +44,9 @@ int main() {
   drive.up();
   testing::LineProcess watch(drive.commandLine({"--json", "watch", "--list"}), drive.environment());
   drive.write("first");
-  if (!watch.readUntil([](const std::string& line) { return line.find("\"first\"") != std::string::npos; })) return 1;
+  if (!watch.readUntil(
+          [](const std::string& line) { return line.find("\"first\"") != std::string::npos; }))
+    return 1;
 
   Changes changes(count);
   std::jthread maker([&] { makeSteadily(drive.root(), changes, perSecond); });
@@ -59,12 +62,14 @@ int main() {
     const std::string name = json["item"]["name"];
     if (!held.insert(name).second) continue;
     const std::size_t number = std::stoull(name.substr(std::string("change ").size()));
-    milliseconds.push_back(std::chrono::duration<double, std::milli>(now - changes.madeAt[number]).count());
+    milliseconds.push_back(
+        std::chrono::duration<double, std::milli>(now - changes.madeAt[number]).count());
   }
   maker.join();
 
   std::set<std::string> onDisk;
-  for (const auto& entry : std::filesystem::directory_iterator(drive.root())) onDisk.insert(entry.path().filename());
+  for (const auto& entry : std::filesystem::directory_iterator(drive.root()))
+    onDisk.insert(entry.path().filename());
   bench::Figure latency;
   latency.name = "change until watch printed it, 99th percentile";
   latency.value = bench::percentile(milliseconds, 0.99);
@@ -76,7 +81,8 @@ int main() {
   latency.value = bench::percentile(milliseconds, 0.5);
   latency.goal.clear();
   bench::print(latency);
-  bench::print(bench::compared("items that the watcher holds after all changes", static_cast<double>(held.size()), "items",
-                               "items on disk", static_cast<double>(onDisk.size()), "the same items",
+  bench::print(bench::compared("items that the watcher holds after all changes",
+                               static_cast<double>(held.size()), "items", "items on disk",
+                               static_cast<double>(onDisk.size()), "the same items",
                                [&](double) { return held == onDisk; }));
 }

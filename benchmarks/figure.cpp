@@ -11,8 +11,9 @@
 
 namespace yomber::bench {
 
-Figure compared(std::string name, double value, std::string unit, std::string yardstick, double yardstickValue,
-                std::string goal, const std::function<bool(double ratio)>& isReached) {
+Figure compared(std::string name, double value, std::string unit, std::string yardstick,
+                double yardstickValue, std::string goal,
+                const std::function<bool(double ratio)>& isReached) {
   Figure figure;
   figure.name = std::move(name);
   figure.value = value;
@@ -27,7 +28,8 @@ Figure compared(std::string name, double value, std::string unit, std::string ya
 
 void print(const Figure& figure) {
   if (std::getenv("YOMBER_BENCH_JSON") != nullptr) {
-    nlohmann::ordered_json json{{"name", figure.name}, {"value", figure.value}, {"unit", figure.unit}};
+    nlohmann::ordered_json json{
+        {"name", figure.name}, {"value", figure.value}, {"unit", figure.unit}};
     json["yardstick"] = nullptr;
     json["ratio"] = nullptr;
     json["goal"] = nullptr;
@@ -44,9 +46,12 @@ void print(const Figure& figure) {
   }
   std::printf("%-46s %14.6g %-10s", figure.name.c_str(), figure.value, figure.unit.c_str());
   if (!figure.yardstick.empty()) {
-    std::printf("  %s: %.6g, ratio %.3g", figure.yardstick.c_str(), figure.yardstickValue, figure.ratio);
+    std::printf("  %s: %.6g, ratio %.3g", figure.yardstick.c_str(), figure.yardstickValue,
+                figure.ratio);
   }
-  if (!figure.goal.empty()) std::printf("  (goal: %s: %s)", figure.goal.c_str(), figure.reached ? "reached" : "NOT REACHED");
+  if (!figure.goal.empty())
+    std::printf("  (goal: %s: %s)", figure.goal.c_str(),
+                figure.reached ? "reached" : "NOT REACHED");
   std::printf("\n");
   std::fflush(stdout);
 }

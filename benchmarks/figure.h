@@ -11,16 +11,17 @@ struct Figure {
   std::string name;
   double value = 0;
   std::string unit;
-  std::string yardstick;       ///< what it is compared with; empty: nothing
-  double yardstickValue = 0;   ///< in the same unit
-  double ratio = 0;            ///< value / yardstickValue
-  std::string goal;            ///< what the ratio or value should reach; empty: reported only
+  std::string yardstick;      ///< what it is compared with; empty: nothing
+  double yardstickValue = 0;  ///< in the same unit
+  double ratio = 0;           ///< value / yardstickValue
+  std::string goal;           ///< what the ratio or value should reach; empty: reported only
   bool reached = true;
 };
 
 /// A figure compared with a yardstick: `reached` says whether the ratio is what it should be.
-[[nodiscard]] Figure compared(std::string name, double value, std::string unit, std::string yardstick, double yardstickValue,
-                              std::string goal, const std::function<bool(double ratio)>& isReached);
+[[nodiscard]] Figure compared(std::string name, double value, std::string unit,
+                              std::string yardstick, double yardstickValue, std::string goal,
+                              const std::function<bool(double ratio)>& isReached);
 
 /// Prints the figure: one JSON object a line when YOMBER_BENCH_JSON is set, else a line for people.
 void print(const Figure& figure);

@@ -38,13 +38,14 @@ Listed list(DriveClient& client, protocol::SortOrder order) {
   auto pageStart = std::chrono::steady_clock::now();
   NSErrorRef error;
   listed.seconds = bench::secondsFor([&] {
-    error = client.list(NSFileProviderRootContainerItemIdentifier, order, [&](const std::vector<ItemFields>& page) {
-      const auto now = std::chrono::steady_clock::now();
-      listed.pageSeconds.push_back(std::chrono::duration<double>(now - pageStart).count());
-      pageStart = now;
-      listed.items += page.size();
-      return true;
-    });
+    error = client.list(
+        NSFileProviderRootContainerItemIdentifier, order, [&](const std::vector<ItemFields>& page) {
+          const auto now = std::chrono::steady_clock::now();
+          listed.pageSeconds.push_back(std::chrono::duration<double>(now - pageStart).count());
+          pageStart = now;
+          listed.items += page.size();
+          return true;
+        });
   });
   if (error) throw std::runtime_error(error->description());
   return listed;
@@ -53,13 +54,16 @@ Listed list(DriveClient& client, protocol::SortOrder order) {
 void report(const char* order, const Listed& listed, double findRate) {
   const std::string name = std::string("listing by ") + order;
   const double rate = static_cast<double>(listed.items) / listed.seconds;
-  bench::print(bench::compared(name, rate, "items/s", "warm find -printf", findRate, "at least 0.5 of it",
-                               [](double ratio) { return ratio >= 0.5; }));
+  bench::print(bench::compared(name, rate, "items/s", "warm find -printf", findRate,
+                               "at least 0.5 of it", [](double ratio) { return ratio >= 0.5; }));
   const std::size_t pages = std::min<std::size_t>(100, listed.pageSeconds.size() / 2);
-  const auto cost = [&](auto from) { return std::accumulate(from, from + static_cast<std::ptrdiff_t>(pages), 0.0) * 1e3; };
-  bench::print(bench::compared(name + ", its last hundred pages", cost(listed.pageSeconds.end() - static_cast<std::ptrdiff_t>(pages)),
-                               "ms", "its first hundred pages", cost(listed.pageSeconds.begin()), "at most 1.2 times",
-                               [](double ratio) { return ratio <= 1.2; }));
+  const auto cost = [&](auto from) {
+    return std::accumulate(from, from + static_cast<std::ptrdiff_t>(pages), 0.0) * 1e3;
+  };
+  bench::print(bench::compared(name + ", its last hundred pages",
+                               cost(listed.pageSeconds.end() - static_cast<std::ptrdiff_t>(pages)),
+                               "ms", "its first hundred pages", cost(listed.pageSeconds.begin()),
+                               "at most 1.2 times", [](double ratio) { return ratio <= 1.2; }));
 }
 
 }  // namespace
@@ -69,15 +73,18 @@ int main() {
   testing::TestDrive drive;
   bench::makeFiles(drive.root(), count);
   drive.up();
-  testing::eventually([&] { return drive.status()["zarn"]["scanning"] == false; }, std::chrono::minutes(5));
+  testing::eventually([&] { return drive.status()["zarn"]["scanning"] == false; },
+                      std::chrono::minutes(5));
 
   const double findRate = static_cast<double>(count) / bench::warmFindSeconds(drive.root());
   DriveClient client(DrivePaths::forHome(drive.home()));
   const pid_t extension = drive.pidOf(testing::TestDrive::Process::Extension);
   const double before = peakMegabytes(extension);
-  for (const auto& [name, order] : {std::pair{"name", protocol::SortOrder::NAME}, std::pair{"date", protocol::SortOrder::DATE}}) {
+  for (const auto& [name, order] : {std::pair{"name", protocol::SortOrder::NAME},
+                                    std::pair{"date", protocol::SortOrder::DATE}}) {
     const Listed listed = list(client, order);
-    if (listed.items != count) throw std::runtime_error("listed " + std::to_string(listed.items) + " items");
+    if (listed.items != count)
+      throw std::runtime_error("listed " + std::to_string(listed.items) + " items");
     report(name, listed, findRate);
   }
   bench::Figure growth;

@@ -23,7 +23,7 @@ int main() {
       asm volatile("" ::: "memory");
     }
   });
-  bench::print(bench::compared("log section, allocate and close, debug off", section / rounds * 1e9, "ns",
-                               "uncontended lock and unlock", lock / rounds * 1e9, "at most 5 times",
-                               [](double ratio) { return ratio <= 5; }));
+  bench::print(bench::compared("log section, allocate and close, debug off", section / rounds * 1e9,
+                               "ns", "uncontended lock and unlock", lock / rounds * 1e9,
+                               "at most 5 times", [](double ratio) { return ratio <= 5; }));
 }

@@ -15,7 +15,8 @@ constexpr int rounds = 20;
 /// A host that takes every signal and does nothing.
 class SilentHost final : public NSFileProviderManager::Transport {
  public:
-  void signalEnumerator(const NSFileProviderItemIdentifier&, std::function<void(NSErrorRef)> completionHandler) override {
+  void signalEnumerator(const NSFileProviderItemIdentifier&,
+                        std::function<void(NSErrorRef)> completionHandler) override {
     completionHandler(nullptr);
   }
 };
@@ -23,10 +24,13 @@ class SilentHost final : public NSFileProviderManager::Transport {
 class CountingObserver final : public NSFileProviderChangeObserver {
  public:
   void didUpdateItems(const NSFileProviderItems& items) override { count += items.size(); }
-  void didDeleteItemsWithIdentifiers(const std::vector<NSFileProviderItemIdentifier>& identifiers) override {
+  void didDeleteItemsWithIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers) override {
     count += identifiers.size();
   }
-  void finishEnumeratingChangesUpToSyncAnchor(NSFileProviderSyncAnchor newAnchor, bool) override { anchor = std::move(newAnchor); }
+  void finishEnumeratingChangesUpToSyncAnchor(NSFileProviderSyncAnchor newAnchor, bool) override {
+    anchor = std::move(newAnchor);
+  }
   void finishEnumeratingWithError(NSErrorRef) override {}
 
   std::size_t count = 0;
@@ -50,9 +54,11 @@ std::vector<QSQueryItems> batches() {
 
 int main() {
   NSFileProviderManager::defaultManager().setTransport(std::make_shared<SilentHost>());
-  const auto enumerator = QSFileEnumerator::initWithFileObjectID(nullptr, NSURL::fileURLWithPath("/drive"), "i:1", Recursive::No);
+  const auto enumerator = QSFileEnumerator::initWithFileObjectID(
+      nullptr, NSURL::fileURLWithPath("/drive"), "i:1", Recursive::No);
   NSFileProviderSyncAnchor anchor;
-  enumerator->currentSyncAnchorWithCompletionHandler([&](NSFileProviderSyncAnchor first) { anchor = std::move(first); });
+  enumerator->currentSyncAnchorWithCompletionHandler(
+      [&](NSFileProviderSyncAnchor first) { anchor = std::move(first); });
 
   const std::vector<QSQueryItems> all = batches();
   const auto observer = std::make_shared<CountingObserver>();

@@ -16,13 +16,16 @@ namespace {
 using namespace yomber;
 
 /// Seconds from the daemon's start until its scan is done; it is left running.
-double secondsUntilScanned(testing::TestDrive& drive, std::unique_ptr<testing::LineProcess>& daemon) {
+double secondsUntilScanned(testing::TestDrive& drive,
+                           std::unique_ptr<testing::LineProcess>& daemon) {
   return bench::secondsFor([&] {
     daemon = std::make_unique<testing::LineProcess>(
-        std::vector<std::string>{testing::programPath("zarn"), "--home", drive.home()}, drive.environment());
+        std::vector<std::string>{testing::programPath("zarn"), "--home", drive.home()},
+        drive.environment());
     const bool done = testing::eventually(
         [&] {
-          const DriveStatus status = readDriveStatus(DrivePaths::forHome(drive.home()), std::nullopt);
+          const DriveStatus status =
+              readDriveStatus(DrivePaths::forHome(drive.home()), std::nullopt);
           return status.daemon && !status.daemon->scanning;
         },
         std::chrono::minutes(10));
@@ -52,11 +55,13 @@ int main() {
 
   std::unique_ptr<testing::LineProcess> daemon;
   const double first = secondsUntilScanned(drive, daemon);
-  bench::print(bench::compared("first scan of " + std::to_string(count) + " files", first, "s", "warm find -printf", find,
-                               "at most 4 times", [](double ratio) { return ratio <= 4; }));
+  bench::print(bench::compared("first scan of " + std::to_string(count) + " files", first, "s",
+                               "warm find -printf", find, "at most 4 times",
+                               [](double ratio) { return ratio <= 4; }));
   end(daemon);
   const double again = secondsUntilScanned(drive, daemon);
-  bench::print(bench::compared("restart with nothing changed", again, "s", "warm find -printf", find, "at most 1.5 times",
+  bench::print(bench::compared("restart with nothing changed", again, "s", "warm find -printf",
+                               find, "at most 1.5 times",
                                [](double ratio) { return ratio <= 1.5; }));
   end(daemon);
 }

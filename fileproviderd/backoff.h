@@ -7,8 +7,9 @@
 
 namespace yomber {
 
-/// How long to wait before the next attempt: doubling from `first` to `longest`, each time shortened
-/// by a random quarter at most, so that those who failed together do not come back together.
+/// How long to wait before the next attempt: doubling from `first` to `longest`, each time
+/// shortened by a random quarter at most, so that those who failed together do not come back
+/// together.
 class Backoff {
  public:
   /// Answers numbers from 0 (inclusive) to 1 (exclusive).

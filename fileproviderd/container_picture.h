@@ -10,8 +10,8 @@
 
 namespace yomber {
 
-/// What a watcher has been told of a container: which items, and in which state; just enough to tell
-/// it only the difference after the container was listed again.
+/// What a watcher has been told of a container: which items, and in which state; just enough to
+/// tell it only the difference after the container was listed again.
 ///
 /// Thread-safety: none of its own.
 class ContainerPicture {

@@ -297,10 +297,10 @@ void ContainerWatch::tellItems(std::vector<ItemFields> items) {
 
 void ContainerWatch::tellDeletions(std::vector<std::string> identifiers) {
   inPieces(std::move(identifiers), limits_.itemsPerCall, [this](std::vector<std::string> piece) {
-    outbox_->send([piece = std::move(piece)](ContainerWatcher& watcher,
-                                             ContainerWatcher::Answered answered) {
-      watcher.didDelete(piece, std::move(answered));
-    });
+    outbox_->send(
+        [piece = std::move(piece)](ContainerWatcher& watcher, ContainerWatcher::Answered answered) {
+          watcher.didDelete(piece, std::move(answered));
+        });
   });
 }
 

@@ -18,18 +18,19 @@
 
 namespace yomber {
 
-/// Keeps one watcher's picture of one container right, whatever happens to the extension and to zarn.
+/// Keeps one watcher's picture of one container right, whatever happens to the extension and to
+/// zarn.
 ///
 /// A pass takes the anchor, lists page by page, drains the changes that are signalled meanwhile and
 /// applies them when the listing is complete. From then on the watch is live: a signal makes it ask
 /// for the changes since the anchor that it was given last; one request is in flight, one more is
-/// remembered. It never asks for the current anchor again without listing again. On an expired anchor,
-/// and after any failure, it makes another pass and tells the watcher only what differs from what it
-/// was told before.
+/// remembered. It never asks for the current anchor again without listing again. On an expired
+/// anchor, and after any failure, it makes another pass and tells the watcher only what differs
+/// from what it was told before.
 ///
-/// A watcher gets one call after the other. While it has not answered, no changes are asked for: they
-/// wait in the extension, merged and bounded, and expire when there are too many. So nothing is
-/// buffered here for a slow watcher.
+/// A watcher gets one call after the other. While it has not answered, no changes are asked for:
+/// they wait in the extension, merged and bounded, and expire when there are too many. So nothing
+/// is buffered here for a slow watcher.
 ///
 /// Thread-safety: loop thread only.
 /// Ownership: shared; destroying it ends the watch and invalidates its enumerator.
@@ -66,9 +67,9 @@ class ContainerWatch : public std::enable_shared_from_this<ContainerWatch> {
 
  private:
   enum class Stage : std::uint8_t {
-    Opening,     ///< gets an enumerator, then its anchor
+    Opening,  ///< gets an enumerator, then its anchor
     Listing,
-    Settling,    ///< all pages are there; gets the changes made meanwhile
+    Settling,  ///< all pages are there; gets the changes made meanwhile
     Live,
     Waiting,     ///< for the next attempt
     Confirming,  ///< asks whether the folder is really gone
@@ -117,9 +118,9 @@ class ContainerWatch : public std::enable_shared_from_this<ContainerWatch> {
   std::uint64_t epoch_ = 0;  ///< answers to what was asked in an earlier one are dropped
   HostedEnumeratorRef enumerator_;
   NSDataRef anchor_;
-  bool isAsking_ = false;           ///< a request for changes is in flight
-  bool isSignalled_ = false;        ///< the container has changed since the last request
-  bool hasMore_ = false;            ///< the last answer was not the whole
+  bool isAsking_ = false;     ///< a request for changes is in flight
+  bool isSignalled_ = false;  ///< the container has changed since the last request
+  bool hasMore_ = false;      ///< the last answer was not the whole
   bool hasAskedInSettling_ = false;
   Drained drained_;
   bool hasOverflowed_ = false;

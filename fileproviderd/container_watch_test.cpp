@@ -26,8 +26,8 @@ class ContainerWatchTest : public testing::Test {
   }
 
   void start(const std::string& name = "i:1") {
-    watch = std::make_shared<ContainerWatch>(name, container, clock, watcher, [] { return 0.0; },
-                                             limits);
+    watch = std::make_shared<ContainerWatch>(
+        name, container, clock, watcher, [] { return 0.0; }, limits);
     container.watches.push_back(watch);
     watch->start();
   }
@@ -104,7 +104,8 @@ TEST_F(ContainerWatchTest, DrainingKeepsAHistoryFromOverflowing) {
   container.historyLimit = 10;
   int round = 0;
   container.beforeEachPage = [&] {
-    for (int i = 0; i < 8; ++i) container.put("z" + std::to_string(i), static_cast<std::uint64_t>(++round));
+    for (int i = 0; i < 8; ++i)
+      container.put("z" + std::to_string(i), static_cast<std::uint64_t>(++round));
   };
   start();
   run();
@@ -243,8 +244,7 @@ TEST_F(ContainerWatchTest, AFolderThatIsGoneEndsTheWatch) {
   container.signalAll();
   run();
   pass(1s);
-  EXPECT_THAT(watcher->calls,
-              ElementsAre(testing::StartsWith("delete "), "end -1005"));
+  EXPECT_THAT(watcher->calls, ElementsAre(testing::StartsWith("delete "), "end -1005"));
   EXPECT_TRUE(watcher->items.empty());
   EXPECT_TRUE(watch->hasEnded());
   EXPECT_EQ(container.liveEnumerators(), 0U);
@@ -363,7 +363,8 @@ TEST_F(ContainerWatchTest, BigBatchesComeInPieces) {
   startAndRun();
   for (int i = 0; i < 5; ++i) container.put("p" + std::to_string(i));
   run();
-  for (const auto& call : watcher->calls) EXPECT_LE(call.size(), std::string("update p0 p1").size());
+  for (const auto& call : watcher->calls)
+    EXPECT_LE(call.size(), std::string("update p0 p1").size());
   EXPECT_EQ(watcher->items, container.items);
 }
 
@@ -410,8 +411,10 @@ TEST_P(ContainerWatchRandomly, EndsWithTheRightPicture) {
         container.pageError = pick(6) == 0 ? kLost : nullptr;
         break;
       case 8:
-        if (pick(4) == 0) watcher->holds = true;
-        else watcher->release();
+        if (pick(4) == 0)
+          watcher->holds = true;
+        else
+          watcher->release();
         break;
       case 9:
         clock.advance(std::chrono::milliseconds(pick(200)));

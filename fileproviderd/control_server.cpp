@@ -56,9 +56,8 @@ class ControlServer final : public Control::Server {
     context.allowCancellation();
     const auto given = context.getParams().getIdentifier();
     if (given.size() > kMaximumIdentifierLength) return refuse(context, "the identifier");
-    return outcomeOf<ItemFields>([&](auto handler) {
-             host_->item(stringFromWire(given), std::move(handler));
-           })
+    return outcomeOf<ItemFields>(
+               [&](auto handler) { host_->item(stringFromWire(given), std::move(handler)); })
         .then([context](Outcome<ItemFields> outcome) mutable {
           auto result = context.getResults().initResult();
           if (!outcome.value) return ipc::encodeError(outcome.error, result.initError());
@@ -70,9 +69,8 @@ class ControlServer final : public Control::Server {
     context.allowCancellation();
     const auto given = context.getParams().getIdentifier();
     if (given.size() > kMaximumIdentifierLength) return refuse(context, "the identifier");
-    return outcomeOf<std::string>([&](auto handler) {
-             host_->locate(stringFromWire(given), std::move(handler));
-           })
+    return outcomeOf<std::string>(
+               [&](auto handler) { host_->locate(stringFromWire(given), std::move(handler)); })
         .then([context](Outcome<std::string> outcome) mutable {
           auto result = context.getResults().initResult();
           if (!outcome.value) return ipc::encodeError(outcome.error, result.initError());
@@ -84,9 +82,8 @@ class ControlServer final : public Control::Server {
     context.allowCancellation();
     const auto given = context.getParams().getPath();
     if (given.size() > PATH_MAX) return refuse(context, "the path");
-    return outcomeOf<std::string>([&](auto handler) {
-             host_->identify(stringFromWire(given), std::move(handler));
-           })
+    return outcomeOf<std::string>(
+               [&](auto handler) { host_->identify(stringFromWire(given), std::move(handler)); })
         .then([context](Outcome<std::string> outcome) mutable {
           auto result = context.getResults().initResult();
           if (!outcome.value) return ipc::encodeError(outcome.error, result.initError());

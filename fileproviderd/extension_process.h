@@ -19,9 +19,9 @@ namespace yomber {
 /// process).
 class ExtensionProcess {
  public:
-  /// Starts `program` for the drive at `home`. `socket` is the child's end; this process's copy of it
-  /// is closed. `didExit` is called once, with a text like "was ended by signal 9". Null and an error
-  /// that names the program when it cannot be started.
+  /// Starts `program` for the drive at `home`. `socket` is the child's end; this process's copy of
+  /// it is closed. `didExit` is called once, with a text like "was ended by signal 9". Null and an
+  /// error that names the program when it cannot be started.
   static std::shared_ptr<ExtensionProcess> start(const std::string& program,
                                                  const std::string& home, ipc::UniqueFd socket,
                                                  std::function<void(const std::string&)> didExit,

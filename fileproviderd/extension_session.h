@@ -16,8 +16,8 @@
 
 namespace yomber {
 
-/// One life of the extension: its process and everything that was got from it. When it ends, all its
-/// enumerators end with it.
+/// One life of the extension: its process and everything that was got from it. When it ends, all
+/// its enumerators end with it.
 ///
 /// Handlers are called once each. The error they are given is a connection error when the extension
 /// could not be asked, else its own.

@@ -75,12 +75,13 @@ void ExtensionSupervisor::launch() {
   }
   ++startCount_;
   state_ = State::Starting;
-  starting_->locate(NSFileProviderRootContainerItemIdentifier, limits_.answer,
-                    [weak, life](const std::optional<std::string>& root, const NSErrorRef& failure) {
-                      const auto self = weak.lock();
-                      if (self == nullptr || self->life_ != life) return;
-                      self->didLocateRoot(root.has_value(), failure);
-                    });
+  starting_->locate(
+      NSFileProviderRootContainerItemIdentifier, limits_.answer,
+      [weak, life](const std::optional<std::string>& root, const NSErrorRef& failure) {
+        const auto self = weak.lock();
+        if (self == nullptr || self->life_ != life) return;
+        self->didLocateRoot(root.has_value(), failure);
+      });
 }
 
 void ExtensionSupervisor::didLocateRoot(bool isKnown, const NSErrorRef& error) {
@@ -108,8 +109,8 @@ void ExtensionSupervisor::didEnd(const NSErrorRef& reason) {
   log_error(defaultLog(), "[ERROR] %@", reason);
   const bool wasRunning = state_ == State::Running;
   // Dropped last: whatever its destruction sets off finds the new state.
-  const auto session = wasRunning ? std::exchange(running_, nullptr)
-                                  : std::exchange(starting_, nullptr);
+  const auto session =
+      wasRunning ? std::exchange(running_, nullptr) : std::exchange(starting_, nullptr);
   pingTimer_.reset();
   isPinging_ = false;
   if (wasRunning && clock_.now() - runningSince_ >= limits_.stable) backoff_.reset();

@@ -24,18 +24,19 @@ class DaemonProbe {
 /// Has the extension running whenever somebody needs it.
 ///
 /// It is started on demand, and only when zarn answers. After the start it is asked for the root's
-/// location once; as the extension computes that once and for all, one that does not know it is ended
-/// and another one is started. Starts follow each other with back-off, which begins anew once an
-/// extension has stayed up for a while. An extension that does not answer is ended.
+/// location once; as the extension computes that once and for all, one that does not know it is
+/// ended and another one is started. Starts follow each other with back-off, which begins anew once
+/// an extension has stayed up for a while. An extension that does not answer is ended.
 ///
 /// Thread-safety: loop thread only.
 class ExtensionSupervisor : public std::enable_shared_from_this<ExtensionSupervisor> {
  public:
   struct Limits {
-    std::chrono::milliseconds acquire{8'000};   ///< the longest that `acquire` takes
-    std::chrono::milliseconds answer{10'000};   ///< for the root's location, after the start and later
+    std::chrono::milliseconds acquire{8'000};  ///< the longest that `acquire` takes
+    std::chrono::milliseconds answer{
+        10'000};  ///< for the root's location, after the start and later
     std::chrono::milliseconds pingEvery{15'000};
-    std::chrono::milliseconds stable{2'000};    ///< up for so long: the back-off begins anew
+    std::chrono::milliseconds stable{2'000};  ///< up for so long: the back-off begins anew
   };
   struct Events {
     std::function<void(const NSErrorRef& reason)> didEnd;  ///< an extension that was in use
@@ -69,7 +70,7 @@ class ExtensionSupervisor : public std::enable_shared_from_this<ExtensionSupervi
     Probing,   ///< asks whether zarn answers
     Starting,  ///< the process is there, its root is not known yet
     Running,
-    Resting,   ///< until the next start
+    Resting,  ///< until the next start
   };
   struct Waiter {
     SessionHandler handler;

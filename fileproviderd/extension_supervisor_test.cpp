@@ -34,8 +34,8 @@ class FakeSession final : public ExtensionSession {
     ++rootsAsked;
     executor_.post([handler = std::move(handler), script = script_] {
       if (!script.answers) {
-        return handler(std::nullopt, NSError::errorWithDomain(NSCocoaErrorDomain,
-                                                              NSXPCConnectionTimedOut));
+        return handler(std::nullopt,
+                       NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionTimedOut));
       }
       handler(script.knowsRoot ? std::optional<std::string>("/root") : std::nullopt, nullptr);
     });
@@ -45,9 +45,9 @@ class FakeSession final : public ExtensionSession {
   void item(const std::string&,
             std::function<void(std::optional<ItemFields>, NSErrorRef)>) override {}
   void enumerator(const std::string&, EnumeratorHandler) override {}
-  void openEnumerator(
-      const std::string&,
-      std::function<void(ipc::Remote<protocol::Enumerator>, NSErrorRef)>) override {}
+  void openEnumerator(const std::string&,
+                      std::function<void(ipc::Remote<protocol::Enumerator>, NSErrorRef)>) override {
+  }
 
   const ExtensionEvents events;
   bool hasEnded = false;
@@ -68,8 +68,8 @@ class FakeLauncher final : public ExtensionLauncher {
       storeError(error, script.launchError);
       return nullptr;
     }
-    launched.push_back(std::make_shared<FakeSession>(
-        executor_, script, std::move(events), static_cast<pid_t>(launched.size() + 1)));
+    launched.push_back(std::make_shared<FakeSession>(executor_, script, std::move(events),
+                                                     static_cast<pid_t>(launched.size() + 1)));
     return launched.back();
   }
   Script script;
@@ -86,9 +86,8 @@ class FakeProbe final : public DaemonProbe {
   void probe(std::function<void(NSErrorRef)> handler) override {
     ++asked;
     if (isStuck) return kept_.push_back(std::move(handler));
-    executor_.post([this, handler = std::move(handler)] {
-      handler(isUp ? nullptr : zarnNotRunningError());
-    });
+    executor_.post(
+        [this, handler = std::move(handler)] { handler(isUp ? nullptr : zarnNotRunningError()); });
   }
   bool isUp = true;
   bool isStuck = false;

@@ -28,13 +28,13 @@ class FakeContainer final : public EnumeratorSource {
   std::map<std::string, ItemFields> items;
   std::size_t pageSize = 3;
   std::size_t historyLimit = 5'000;
-  NSErrorRef openError;      ///< what `enumerator` fails with
+  NSErrorRef openError;  ///< what `enumerator` fails with
   NSErrorRef pageError;
   NSErrorRef changesError;
   bool tellsChanges = true;
   bool tellsDeletionsAsDead = false;  ///< as updates with the flag of the dead
   bool isReallyGone = false;
-  bool isWorkingSet = false;  ///< lists nothing and replays everything as changes
+  bool isWorkingSet = false;         ///< lists nothing and replays everything as changes
   std::size_t changesPerAnswer = 0;  ///< of a working set; 0: all
   std::function<void()> beforeEachPage;
   std::vector<std::weak_ptr<ContainerWatch>> watches;
@@ -103,12 +103,12 @@ class FakeContainer final : public EnumeratorSource {
       container_.mostChangesInFlight =
           std::max(container_.mostChangesInFlight, ++container_.changesInFlight);
       auto& container = container_;
-      container_.executor_.post([this, &container, alive = std::weak_ptr(alive_), anchor,
-                                 handler = std::move(handler)] {
-        --container.changesInFlight;
-        if (alive.expired()) return handler(lost<ChangesAnswer>());
-        handler(container.isWorkingSet ? replay(anchor) : handOut(anchor));
-      });
+      container_.executor_.post(
+          [this, &container, alive = std::weak_ptr(alive_), anchor, handler = std::move(handler)] {
+            --container.changesInFlight;
+            if (alive.expired()) return handler(lost<ChangesAnswer>());
+            handler(container.isWorkingSet ? replay(anchor) : handOut(anchor));
+          });
     }
     void currentAnchor(std::function<void(AnchorAnswer)> handler) override {
       ++container_.anchorsAsked;

@@ -89,8 +89,8 @@ std::shared_ptr<ContainerWatch> Host::watch(const std::string& container,
 }
 
 void Host::enumerator(const std::string& container, EnumeratorHandler handler) {
-  supervisor_->acquire([container, handler = std::move(handler)](
-                           const ExtensionSessionRef& session, const NSErrorRef& error) {
+  supervisor_->acquire([container, handler = std::move(handler)](const ExtensionSessionRef& session,
+                                                                 const NSErrorRef& error) {
     if (session == nullptr) return handler(nullptr, error);
     session->enumerator(container, handler);
   });
@@ -119,23 +119,22 @@ void Host::ask(Ask ask, std::function<void(std::optional<Answer>, NSErrorRef)> h
 }
 
 void Host::item(const std::string& identifier, ItemHandler handler) {
-  ask<ItemFields>(
-      [identifier](ExtensionSession& session, ItemHandler answer) {
-        session.item(identifier, std::move(answer));
-      },
-      std::move(handler), kAttempts);
+  ask<ItemFields>([identifier](ExtensionSession& session,
+                               ItemHandler answer) { session.item(identifier, std::move(answer)); },
+                  std::move(handler), kAttempts);
 }
 
 void Host::locate(const std::string& identifier, TextHandler handler) {
   ask<std::string>(
       [identifier, limit = options_.callLimit](ExtensionSession& session, TextHandler answer) {
-        session.locate(identifier, limit, [identifier, answer = std::move(answer)](
-                                              std::optional<std::string> path, NSErrorRef error) {
-          if (!path && error == nullptr) {
-            error = fileProviderErrorForNonExistentItemWithIdentifier(identifier);
-          }
-          answer(std::move(path), std::move(error));
-        });
+        session.locate(identifier, limit,
+                       [identifier, answer = std::move(answer)](std::optional<std::string> path,
+                                                                NSErrorRef error) {
+                         if (!path && error == nullptr) {
+                           error = fileProviderErrorForNonExistentItemWithIdentifier(identifier);
+                         }
+                         answer(std::move(path), std::move(error));
+                       });
       },
       std::move(handler), kAttempts);
 }

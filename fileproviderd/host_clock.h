@@ -30,7 +30,8 @@ class HostClock {
 class LoopClock final : public HostClock {
  public:
   [[nodiscard]] TimePoint now() const override { return std::chrono::steady_clock::now(); }
-  [[nodiscard]] TimerRef after(std::chrono::milliseconds delay, std::function<void()> work) override;
+  [[nodiscard]] TimerRef after(std::chrono::milliseconds delay,
+                               std::function<void()> work) override;
 };
 
 }  // namespace yomber

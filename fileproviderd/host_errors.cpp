@@ -22,8 +22,10 @@ NSErrorRef zarnNotRunningError(const NSErrorRef& underlying) {
 }
 
 NSErrorRef extensionUnavailableError(const std::string& reason, const NSErrorRef& underlying) {
-  return unreachable("the drive's extension " + reason + "; it is started again by itself, and "
-                     "'yomber log' tells more", underlying);
+  return unreachable("the drive's extension " + reason +
+                         "; it is started again by itself, and "
+                         "'yomber log' tells more",
+                     underlying);
 }
 
 NSErrorRef invalidRequestError(const std::string& what) {
@@ -37,10 +39,9 @@ bool isConnectionError(const NSErrorRef& error) {
 }
 
 bool isNoSuchItemError(const NSErrorRef& error) {
-  return error != nullptr &&
-         (error->is(NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem) ||
-          error->is(NSCocoaErrorDomain, NSFileNoSuchFileError) ||
-          error->is(NSPOSIXErrorDomain, ENOENT));
+  return error != nullptr && (error->is(NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem) ||
+                              error->is(NSCocoaErrorDomain, NSFileNoSuchFileError) ||
+                              error->is(NSPOSIXErrorDomain, ENOENT));
 }
 
 }  // namespace yomber

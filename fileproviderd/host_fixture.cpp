@@ -234,8 +234,7 @@ void HostTest::signalFromExtension(const std::string& container) const {
 NSErrorRef HostTest::item(const std::string& identifier, ItemFields* found) const {
   NSErrorRef domain;
   const auto transport = ipc::callAndWait(
-      remote, &Control::Client::itemRequest,
-      [&](auto params) { params.setIdentifier(identifier); },
+      remote, &Control::Client::itemRequest, [&](auto params) { params.setIdentifier(identifier); },
       [&](auto results) {
         const auto result = results.getResult();
         if (result.isError()) {
@@ -284,12 +283,11 @@ NSErrorRef HostTest::identify(const std::string& path, std::string* identifier) 
 
 ipc::Remote<Listing> HostTest::list(const std::string& container) const {
   ipc::Remote<Listing> listing;
-  EXPECT_EQ(nullptr, ipc::callAndWait(
-                         remote, &Control::Client::listRequest,
-                         [&](auto params) { params.setContainer(container); },
-                         [&](auto results) {
-                           listing = ipc::Remote<Listing>(results.getListing());
-                         }));
+  EXPECT_EQ(nullptr,
+            ipc::callAndWait(
+                remote, &Control::Client::listRequest,
+                [&](auto params) { params.setContainer(container); },
+                [&](auto results) { listing = ipc::Remote<Listing>(results.getListing()); }));
   return listing;
 }
 
@@ -335,8 +333,7 @@ std::shared_ptr<WatchedPicture> HostTest::watch(const std::string& container,
                            params.setWatcher(kj::heap<WatcherServer>(picture));
                          },
                          [&](auto results) {
-                           *registration =
-                               ipc::Remote<protocol::Watch>(results.getRegistration());
+                           *registration = ipc::Remote<protocol::Watch>(results.getRegistration());
                          }));
   return picture;
 }

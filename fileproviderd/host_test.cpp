@@ -52,10 +52,9 @@ TEST_F(HostTest, TellsMissingItemsFromMissingDaemons) {
   ASSERT_TRUE(waitForStatus([](const Status& status) { return !status.daemonReachable; }));
   const auto error = item("nothing");
   ASSERT_NE(error, nullptr);
-  EXPECT_EQ(error->localizedDescription(),
-            "zarn is not running: start the drive with 'yomber up'");
-  EXPECT_TRUE(error->underlyingError()->is(NSFileProviderErrorDomain,
-                                           NSFileProviderErrorNoSuchItem));
+  EXPECT_EQ(error->localizedDescription(), "zarn is not running: start the drive with 'yomber up'");
+  EXPECT_TRUE(
+      error->underlyingError()->is(NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem));
 }
 
 TEST_F(HostTest, RefusesWhatIsTooLong) {
@@ -109,8 +108,7 @@ TEST_F(HostTest, StartsNothingUntilItIsNeeded) {
 TEST_F(HostTest, WithoutZarnEveryCallSaysWhatToDo) {
   startHost();
   std::vector<std::string> none;
-  for (const auto& error :
-       {item("a"), locate("a"), identify("/root/a"), listAll("i:1", &none)}) {
+  for (const auto& error : {item("a"), locate("a"), identify("/root/a"), listAll("i:1", &none)}) {
     ASSERT_NE(error, nullptr);
     EXPECT_EQ(error->localizedDescription(),
               "zarn is not running: start the drive with 'yomber up'");
@@ -209,8 +207,8 @@ TEST_F(HostTest, AWatchFollowsSignalsOfTheExtension) {
   EXPECT_EQ(status().watches, 1U);
   EXPECT_EQ(status().enumerators, 1U);
   registration = nullptr;
-  EXPECT_TRUE(waitForStatus(
-      [](const Status& now) { return now.watches == 0 && now.enumerators == 0; }));
+  EXPECT_TRUE(
+      waitForStatus([](const Status& now) { return now.watches == 0 && now.enumerators == 0; }));
 }
 
 TEST_F(HostTest, AWatchFollowsSignalsThatZarnRaisesItself) {
@@ -241,7 +239,8 @@ TEST_F(HostTest, AWatchSurvivesTheExtensionAgainAndAgain) {
     ASSERT_TRUE(waitForStatus([](const Status& now) { return now.enumerators == 1; }));
     if (round == 3) descriptors = status().descriptors;
   }
-  EXPECT_TRUE(picture->waitFor([](const WatchedPicture& now) { return now.resumes == now.pauses; }));
+  EXPECT_TRUE(
+      picture->waitFor([](const WatchedPicture& now) { return now.resumes == now.pauses; }));
   EXPECT_TRUE(waitForStatus([&](const Status& now) { return now.descriptors <= descriptors; }))
       << "descriptors leak: " << descriptors << " grew to " << status().descriptors;
 }
@@ -285,7 +284,8 @@ TEST_F(HostTest, SigningOutPausesAWatchAndSigningInResumesIt) {
   ASSERT_TRUE(picture->waitFor([](const WatchedPicture& now) { return now.pauses == 1; }));
   setItems({{"a", 9}});
   countermand("signed-out");
-  ASSERT_TRUE(waitForStatus([this](const Status& now) { return now.extension > 0 || item("a") == nullptr; }));
+  ASSERT_TRUE(waitForStatus(
+      [this](const Status& now) { return now.extension > 0 || item("a") == nullptr; }));
   signalFromExtension(NSFileProviderRootContainerItemIdentifier);
   EXPECT_TRUE(picture->waitFor(holds({{"a", 9}})));
 }
@@ -314,16 +314,15 @@ TEST_F(HostTest, AClientThatLeavesTakesItsWatchesAlong) {
   startZarn();
   startHost();
   ipc::Remote<protocol::Watch> registration;
-  ASSERT_TRUE(watch("i:1", &registration)->waitFor([](const WatchedPicture& now) {
-    return now.isListed;
-  }));
+  ASSERT_TRUE(
+      watch("i:1", &registration)->waitFor([](const WatchedPicture& now) { return now.isListed; }));
   client->close();
   NSErrorRef error;
   client = ipc::Connection::connect(paths.controlSocket, &error);
   ASSERT_NE(client, nullptr);
   remote = client->bootstrap<protocol::Control>();
-  EXPECT_TRUE(waitForStatus(
-      [](const Status& now) { return now.watches == 0 && now.enumerators == 0; }));
+  EXPECT_TRUE(
+      waitForStatus([](const Status& now) { return now.watches == 0 && now.enumerators == 0; }));
 }
 
 TEST_F(HostTest, AMissingProgramIsNamed) {

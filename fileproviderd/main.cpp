@@ -94,8 +94,8 @@ int serve(const DrivePaths& paths, const std::string& extension, const sigset_t&
   });
   NSErrorRef error;
   auto listener = ipc::Listener::listen(
-      paths.controlSocket,
-      [host](const ipc::PeerCredentials&) { return makeControlServer(host); }, &error);
+      paths.controlSocket, [host](const ipc::PeerCredentials&) { return makeControlServer(host); },
+      &error);
   if (listener != nullptr) {
     log_info(defaultLog(), "[INFO] serving %s", paths.controlSocket.c_str());
     int signal = 0;
@@ -132,6 +132,4 @@ int run(const std::vector<std::string>& given) {
 }  // namespace
 }  // namespace yomber
 
-int main(int argc, char** argv) {
-  return yomber::run(std::vector<std::string>(argv, argv + argc));
-}
+int main(int argc, char** argv) { return yomber::run(std::vector<std::string>(argv, argv + argc)); }

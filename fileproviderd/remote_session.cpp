@@ -93,13 +93,12 @@ bool RemoteSession::start(const ProcessLauncher::Options& options, NSErrorRef* e
   const auto didExit = [weak](const std::string& how) {
     if (const auto self = weak.lock()) self->didEnd(how, nullptr);
   };
-  process_ = ExtensionProcess::start(options.program, options.home, std::move(theirs), didExit, error);
+  process_ =
+      ExtensionProcess::start(options.program, options.home, std::move(theirs), didExit, error);
   if (process_ == nullptr) return false;
   connection_ = ipc::Connection::adopt(
       ours.release(),
-      [events = events_]() -> capnp::Capability::Client {
-        return kj::heap<HostServer>(events);
-      },
+      [events = events_]() -> capnp::Capability::Client { return kj::heap<HostServer>(events); },
       error);
   if (connection_ == nullptr) return false;
   connection_->onDisconnect([weak](const NSErrorRef& reason) {
@@ -138,7 +137,9 @@ void RemoteSession::identify(const std::string& path,
                              std::function<void(std::optional<std::string>, NSErrorRef)> handler) {
   (void)ipc::call(
       extension_, &Extension::Client::identifierForPathRequest,
-      [path](Extension::IdentifierForPathParams::Builder params) { params.setPath(wireData(path)); },
+      [path](Extension::IdentifierForPathParams::Builder params) {
+        params.setPath(wireData(path));
+      },
       [handler = std::move(handler), watchdog = watchdog()](
           NSErrorRef error, const Extension::IdentifierForPathResults::Reader* results) {
         watchdog(error);

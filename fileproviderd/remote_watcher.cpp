@@ -61,8 +61,8 @@ class RemoteWatcher final : public ContainerWatcher {
   template <typename Request>
   static void send(Request&& request, Answered answered) {
     auto done = std::make_shared<Answered>(std::move(answered));
-    ipc::EventLoop::shared().detach(request.send().then(
-        [done](auto&&) { (*done)(); }, [done](kj::Exception&&) { (*done)(); }));
+    ipc::EventLoop::shared().detach(
+        request.send().then([done](auto&&) { (*done)(); }, [done](kj::Exception&&) { (*done)(); }));
   }
 
   const ipc::Remote<Watcher> remote_;

@@ -7,9 +7,8 @@
 
 namespace yomber {
 
-/// A watcher in a client's process. What fails there counts as answered: when the client is gone, its
-/// watch goes with its connection. Loop thread only.
-[[nodiscard]] std::shared_ptr<ContainerWatcher> makeRemoteWatcher(
-    protocol::Watcher::Client client);
+/// A watcher in a client's process. What fails there counts as answered: when the client is gone,
+/// its watch goes with its connection. Loop thread only.
+[[nodiscard]] std::shared_ptr<ContainerWatcher> makeRemoteWatcher(protocol::Watcher::Client client);
 
 }  // namespace yomber

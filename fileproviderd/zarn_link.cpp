@@ -19,9 +19,9 @@ constexpr std::chrono::milliseconds kFirstRetry{50};
 NSErrorRef otherHomeError(const std::string& home) {
   return NSError::errorWithDomain(
       NSCocoaErrorDomain, NSXPCConnectionInvalid,
-      {{NSLocalizedDescriptionKey,
-        "the zarn that answers here serves another drive, at " + home + ": run 'yomber down' there, "
-        "or use that home"}});
+      {{NSLocalizedDescriptionKey, "the zarn that answers here serves another drive, at " + home +
+                                       ": run 'yomber down' there, "
+                                       "or use that home"}});
 }
 
 /// What zarn calls.
@@ -90,26 +90,26 @@ void ZarnLink::connect() {
   state_ = State::Connecting;
   timer_.reset();
   ++attempt_;
-  ipc::Connection::connectAsync(
-      socket_, [weak = weak_from_this(), attempt = attempt_](ipc::Connection::Ref connection,
-                                                             NSErrorRef error) {
-        ipc::EventLoop::shared().post(
-            [weak, attempt, connection = std::move(connection), error = std::move(error)]() mutable {
-              const auto self = weak.lock();
-              if (self == nullptr || self->attempt_ != attempt) return;
-              self->didOpen(std::move(connection), error);
-            });
-      });
+  ipc::Connection::connectAsync(socket_, [weak = weak_from_this(), attempt = attempt_](
+                                             ipc::Connection::Ref connection, NSErrorRef error) {
+    ipc::EventLoop::shared().post(
+        [weak, attempt, connection = std::move(connection), error = std::move(error)]() mutable {
+          const auto self = weak.lock();
+          if (self == nullptr || self->attempt_ != attempt) return;
+          self->didOpen(std::move(connection), error);
+        });
+  });
 }
 
 void ZarnLink::didOpen(ipc::Connection::Ref connection, const NSErrorRef& error) {
   if (connection == nullptr) return lose(zarnNotRunningError(error));
   connection_ = std::move(connection);
   daemon_ = connection_->bootstrap<Daemon>();
-  connection_->onDisconnect([weak = weak_from_this(), attempt = attempt_](const NSErrorRef& reason) {
-    const auto self = weak.lock();
-    if (self != nullptr && self->attempt_ == attempt) self->lose(zarnNotRunningError(reason));
-  });
+  connection_->onDisconnect(
+      [weak = weak_from_this(), attempt = attempt_](const NSErrorRef& reason) {
+        const auto self = weak.lock();
+        if (self != nullptr && self->attempt_ == attempt) self->lose(zarnNotRunningError(reason));
+      });
   checkHome();
 }
 

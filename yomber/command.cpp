@@ -19,7 +19,8 @@ void CommandContext::fail(const NSErrorRef& error) {
     return;
   }
   std::cerr << "yomber: " << error->localizedDescription();
-  if (exitCode == ExitCode::NotSignedIn) std::cerr << " (sign in with 'yomber account sign-in NAME')";
+  if (exitCode == ExitCode::NotSignedIn)
+    std::cerr << " (sign in with 'yomber account sign-in NAME')";
   std::cerr << std::endl;
 }
 

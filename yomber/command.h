@@ -17,18 +17,19 @@ struct CommandContext {
   ExitCode exitCode = ExitCode::Ok;
 
   [[nodiscard]] DrivePaths paths() const;
-  /// Prints the failure to standard error (as JSON when that was asked for) and keeps its exit code.
+  /// Prints the failure to standard error (as JSON when that was asked for) and keeps its exit
+  /// code.
   void fail(const NSErrorRef& error);
   void fail(ExitCode code, const std::string& message);
 };
 
 // Each adds its commands to the application. The context outlives the application's run.
-void addDriveCommands(CLI::App& app, CommandContext& context);     // up, down, status
-void addAccountCommands(CLI::App& app, CommandContext& context);   // account …
-void addListingCommands(CLI::App& app, CommandContext& context);   // ls, folders
-void addItemCommands(CLI::App& app, CommandContext& context);      // stat, id, url
-void addWatchCommands(CLI::App& app, CommandContext& context);     // watch, working-set
-void addLogCommand(CLI::App& app, CommandContext& context);        // log
-void addCompletionCommand(CLI::App& app, CommandContext& context); // completion
+void addDriveCommands(CLI::App& app, CommandContext& context);      // up, down, status
+void addAccountCommands(CLI::App& app, CommandContext& context);    // account …
+void addListingCommands(CLI::App& app, CommandContext& context);    // ls, folders
+void addItemCommands(CLI::App& app, CommandContext& context);       // stat, id, url
+void addWatchCommands(CLI::App& app, CommandContext& context);      // watch, working-set
+void addLogCommand(CLI::App& app, CommandContext& context);         // log
+void addCompletionCommand(CLI::App& app, CommandContext& context);  // completion
 
 }  // namespace yomber

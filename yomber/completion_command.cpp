@@ -24,7 +24,8 @@ std::string wordsAfter(const CLI::App& command) {
 /// One `case` branch for each command, nested commands as "outer inner".
 void writeCases(std::ostream& out, const CLI::App& command, const std::string& path) {
   for (const CLI::App* subcommand : command.get_subcommands([](const CLI::App*) { return true; })) {
-    const std::string name = path.empty() ? subcommand->get_name() : path + " " + subcommand->get_name();
+    const std::string name =
+        path.empty() ? subcommand->get_name() : path + " " + subcommand->get_name();
     out << "    \"" << name << "\") words=\"" << wordsAfter(*subcommand) << "\" ;;\n";
     writeCases(out, *subcommand, name);
   }
@@ -32,7 +33,8 @@ void writeCases(std::ostream& out, const CLI::App& command, const std::string& p
 
 std::string bashScript(const CLI::App& app) {
   std::ostringstream out;
-  out << "# Completion of yomber for bash, and for zsh after: autoload -U bashcompinit; bashcompinit.\n"
+  out << "# Completion of yomber for bash, and for zsh after: autoload -U bashcompinit; "
+         "bashcompinit.\n"
          "_yomber() {\n"
          "  local current=${COMP_WORDS[COMP_CWORD]} command=\"\" words=\"\" word\n"
          "  for word in \"${COMP_WORDS[@]:1:COMP_CWORD-1}\"; do\n"
@@ -53,11 +55,12 @@ std::string fishScript(const CLI::App& app) {
   std::ostringstream out;
   out << "# Completion of yomber for fish.\n";
   for (const CLI::App* command : app.get_subcommands([](const CLI::App*) { return true; })) {
-    out << "complete -c yomber -n __fish_use_subcommand -a " << command->get_name() << " -d '" << command->get_description()
-        << "'\n";
+    out << "complete -c yomber -n __fish_use_subcommand -a " << command->get_name() << " -d '"
+        << command->get_description() << "'\n";
     for (const CLI::Option* option : command->get_options()) {
       for (const std::string& name : option->get_lnames()) {
-        out << "complete -c yomber -n '__fish_seen_subcommand_from " << command->get_name() << "' -l " << name << "\n";
+        out << "complete -c yomber -n '__fish_seen_subcommand_from " << command->get_name()
+            << "' -l " << name << "\n";
       }
     }
   }
@@ -67,9 +70,12 @@ std::string fishScript(const CLI::App& app) {
 }  // namespace
 
 void addCompletionCommand(CLI::App& app, CommandContext& context) {
-  CLI::App* completion = app.add_subcommand("completion", "Print a completion script for your shell");
+  CLI::App* completion =
+      app.add_subcommand("completion", "Print a completion script for your shell");
   auto shell = std::make_shared<std::string>("bash");
-  completion->add_option("shell", *shell, "The shell")->check(CLI::IsMember({"bash", "zsh", "fish"}))->capture_default_str();
+  completion->add_option("shell", *shell, "The shell")
+      ->check(CLI::IsMember({"bash", "zsh", "fish"}))
+      ->capture_default_str();
   completion->callback([&app, &context, shell] {
     std::cout << (*shell == "fish" ? fishScript(app) : bashScript(app)) << std::flush;
     if (!std::cout) context.fail(ExitCode::Failure, "the script could not be written");

@@ -21,16 +21,17 @@ capnp::Data::Reader dataOf(const std::string& bytes) {
 }
 
 /// Connects once, and again when the peer has been started afresh meanwhile.
-std::shared_ptr<ipc::Connection> connected(std::shared_ptr<ipc::Connection>& connection, const std::string& socket,
-                                           NSErrorRef* error) {
+std::shared_ptr<ipc::Connection> connected(std::shared_ptr<ipc::Connection>& connection,
+                                           const std::string& socket, NSErrorRef* error) {
   if (connection && connection->isConnected()) return connection;
   NSErrorRef failure;
   connection = ipc::Connection::connect(socket, &failure);
   if (!connection) {
     // Whatever the system's reason is, to the caller the drive is not there.
-    storeError(error, NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionInvalid,
-                                               {{NSLocalizedDescriptionKey, failure->localizedDescription()},
-                                                {NSUnderlyingErrorKey, failure}}));
+    storeError(error, NSError::errorWithDomain(
+                          NSCocoaErrorDomain, NSXPCConnectionInvalid,
+                          {{NSLocalizedDescriptionKey, failure->localizedDescription()},
+                           {NSUnderlyingErrorKey, failure}}));
   }
   return connection;
 }
@@ -64,22 +65,32 @@ NSErrorRef DriveClient::ask(Method method, const Fill& fill, const Take& take) {
 }
 
 NSErrorRef DriveClient::item(const NSFileProviderItemIdentifier& identifier, ItemFields& item) {
-  return ask(&protocol::Control::Client::itemRequest, [&](auto params) { params.setIdentifier(identifier); },
-             [&](auto result) { item = decodeItem(result.getItem()); });
+  return ask(
+      &protocol::Control::Client::itemRequest,
+      [&](auto params) { params.setIdentifier(identifier); },
+      [&](auto result) { item = decodeItem(result.getItem()); });
 }
 
-NSErrorRef DriveClient::location(const NSFileProviderItemIdentifier& identifier, std::string& path) {
-  return ask(&protocol::Control::Client::locateRequest, [&](auto params) { params.setIdentifier(identifier); },
-             [&](auto result) { path = stringOf(result.getPath()); });
+NSErrorRef DriveClient::location(const NSFileProviderItemIdentifier& identifier,
+                                 std::string& path) {
+  return ask(
+      &protocol::Control::Client::locateRequest,
+      [&](auto params) { params.setIdentifier(identifier); },
+      [&](auto result) { path = stringOf(result.getPath()); });
 }
 
-NSErrorRef DriveClient::identifierAt(const std::string& path, NSFileProviderItemIdentifier& identifier) {
-  return ask(&protocol::Control::Client::identifyRequest, [&](auto params) { params.setPath(dataOf(path)); },
-             [&](auto result) { identifier = result.getIdentifier().cStr(); });
+NSErrorRef DriveClient::identifierAt(const std::string& path,
+                                     NSFileProviderItemIdentifier& identifier) {
+  return ask(
+      &protocol::Control::Client::identifyRequest,
+      [&](auto params) { params.setPath(dataOf(path)); },
+      [&](auto result) { identifier = result.getIdentifier().cStr(); });
 }
 
-NSErrorRef DriveClient::identifierFor(const std::string& argument, NSFileProviderItemIdentifier& identifier) {
-  if (argument.empty() || argument == "/" || argument == NSFileProviderRootContainerItemIdentifier) {
+NSErrorRef DriveClient::identifierFor(const std::string& argument,
+                                      NSFileProviderItemIdentifier& identifier) {
+  if (argument.empty() || argument == "/" ||
+      argument == NSFileProviderRootContainerItemIdentifier) {
     identifier = NSFileProviderRootContainerItemIdentifier;
     return nullptr;
   }
@@ -88,7 +99,8 @@ NSErrorRef DriveClient::identifierFor(const std::string& argument, NSFileProvide
     return nullptr;
   }
   const NSURLRef absolute = NSURL::fileURLWithPath(argument);
-  if (absolute && isPathBelow(absolute->path(), paths_.tree)) return identifierAt(absolute->path(), identifier);
+  if (absolute && isPathBelow(absolute->path(), paths_.tree))
+    return identifierAt(absolute->path(), identifier);
 
   std::string root;
   if (NSErrorRef error = location(NSFileProviderRootContainerItemIdentifier, root)) return error;
@@ -101,8 +113,9 @@ NSErrorRef DriveClient::identifierFor(const std::string& argument, NSFileProvide
   return identifierAt(fromRoot->path(), identifier);
 }
 
-NSErrorRef DriveClient::list(const NSFileProviderItemIdentifier& container, protocol::SortOrder order,
-                             const std::function<bool(const std::vector<ItemFields>& page)>& onPage) {
+NSErrorRef DriveClient::list(
+    const NSFileProviderItemIdentifier& container, protocol::SortOrder order,
+    const std::function<bool(const std::vector<ItemFields>& page)>& onPage) {
   NSErrorRef failure;
   const auto remote = control(&failure);
   if (failure) return failure;

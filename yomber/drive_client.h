@@ -29,7 +29,9 @@ class DriveClient {
   ipc::Remote<protocol::Daemon> daemon(NSErrorRef* error);
 
   /// The connection under `control`; nil before its first use.
-  [[nodiscard]] const std::shared_ptr<ipc::Connection>& controlConnection() const { return controlConnection_; }
+  [[nodiscard]] const std::shared_ptr<ipc::Connection>& controlConnection() const {
+    return controlConnection_;
+  }
 
   /// What a command was given for an item: nothing or "/" (the root), an identifier ("i:42"), a
   /// location inside the drive's tree, or a path from the drive's root ("Documents/Plans").

@@ -44,7 +44,8 @@ std::string supervisorLock(const DrivePaths& paths) { return paths.home + "/supe
 /// Waits until the process has ended; false at the deadline.
 bool waitForEnd(int pidDescriptor, steady_clock::time_point deadline) {
   pollfd waiting{pidDescriptor, POLLIN, 0};
-  const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - steady_clock::now()).count();
+  const auto left =
+      std::chrono::ceil<std::chrono::milliseconds>(deadline - steady_clock::now()).count();
   return poll(&waiting, 1, static_cast<int>(std::max<long long>(left, 0))) == 1;
 }
 
@@ -55,10 +56,11 @@ void closeInheritedDescriptors() {
 }
 
 NSErrorRef superviseHere(const DrivePaths& paths) {
-  Supervisor supervisor(supervisorLock(paths), {
-                                                   {"zarn", {programPath("zarn"), "--home", paths.home}},
-                                                   {"fileproviderd", {programPath("fileproviderd"), "--home", paths.home}},
-                                               });
+  Supervisor supervisor(supervisorLock(paths),
+                        {
+                            {"zarn", {programPath("zarn"), "--home", paths.home}},
+                            {"fileproviderd", {programPath("fileproviderd"), "--home", paths.home}},
+                        });
   if (NSErrorRef error = supervisor.takeLock()) return error;
   openLog("supervisor", paths);
   supervisor.run();
@@ -106,7 +108,9 @@ void runUp(CommandContext& context, bool foreground) {
   }
   const bool already = Supervisor::runningPid(supervisorLock(paths)).has_value();
   if (foreground) {
-    if (already) return context.fail(ExitCode::CannotCreate, "the drive is up already; take it down with 'yomber down'");
+    if (already)
+      return context.fail(ExitCode::CannotCreate,
+                          "the drive is up already; take it down with 'yomber down'");
     if (NSErrorRef error = superviseHere(paths)) context.fail(error);
     return;
   }
@@ -118,9 +122,12 @@ void runUp(CommandContext& context, bool foreground) {
     return;
   }
   if (context.json) {
-    std::cout << nlohmann::ordered_json{{"home", paths.home}, {"up", true}, {"was_up", already}}.dump() << std::endl;
+    std::cout
+        << nlohmann::ordered_json{{"home", paths.home}, {"up", true}, {"was_up", already}}.dump()
+        << std::endl;
   } else {
-    std::cout << (already ? "The drive is up already: " : "The drive is up: ") << paths.home << std::endl;
+    std::cout << (already ? "The drive is up already: " : "The drive is up: ") << paths.home
+              << std::endl;
   }
 }
 
@@ -133,12 +140,15 @@ void runDown(CommandContext& context) {
     const bool ended = waitForEnd(pidDescriptor, steady_clock::now() + patience);
     close(pidDescriptor);
     if (!ended) {
-      return context.fail(ExitCode::Failure, "the drive's supervisor (pid " + std::to_string(*pid) + ") did not end");
+      return context.fail(ExitCode::Failure,
+                          "the drive's supervisor (pid " + std::to_string(*pid) + ") did not end");
     }
   }
   const bool wasUp = pidDescriptor >= 0;
   if (context.json) {
-    std::cout << nlohmann::ordered_json{{"home", paths.home}, {"up", false}, {"was_up", wasUp}}.dump() << std::endl;
+    std::cout
+        << nlohmann::ordered_json{{"home", paths.home}, {"up", false}, {"was_up", wasUp}}.dump()
+        << std::endl;
   } else {
     std::cout << (wasUp ? "The drive is down." : "The drive was not up.") << std::endl;
   }

@@ -43,7 +43,8 @@ std::optional<std::string> askAccount(const ipc::Remote<protocol::Daemon>& remot
   const NSErrorRef error = ipc::callAndWait(
       remote, &protocol::Daemon::Client::accountRequest, [](auto) {},
       [&](auto results) {
-        if (results.getResult().isAccount()) name = results.getResult().getAccount().getName().cStr();
+        if (results.getResult().isAccount())
+          name = results.getResult().getAccount().getName().cStr();
       });
   return error ? std::nullopt : name;
 }
@@ -67,18 +68,21 @@ std::optional<DriveStatus::Host> askHost(const ipc::Remote<protocol::Control>& r
 }
 
 void describeDaemon(std::ostream& out, const DriveStatus::Daemon& daemon) {
-  out << "zarn           running, pid " << daemon.pid << ", " << readableSize(daemon.residentBytes) << "\n"
+  out << "zarn           running, pid " << daemon.pid << ", " << readableSize(daemon.residentBytes)
+      << "\n"
       << "items          " << daemon.items << " in " << daemon.folders << " folders"
       << (daemon.scanning ? ", scanning" : "") << "\n"
-      << "changes        " << (daemon.live ? "seen as they come" : "found by scanning") << ", " << daemon.watchedFolders
-      << " folders observed\n";
+      << "changes        " << (daemon.live ? "seen as they come" : "found by scanning") << ", "
+      << daemon.watchedFolders << " folders observed\n";
   if (!daemon.advice.empty()) out << "               " << daemon.advice << "\n";
 }
 
 void describeHost(std::ostream& out, const DriveStatus::Host& host) {
-  out << "fileproviderd  running, " << readableSize(host.residentBytes) << ", " << host.watches << " watches\n";
+  out << "fileproviderd  running, " << readableSize(host.residentBytes) << ", " << host.watches
+      << " watches\n";
   if (host.extensionPid != 0) {
-    out << "extension      running, pid " << host.extensionPid << ", started " << host.extensionStarts << " times\n";
+    out << "extension      running, pid " << host.extensionPid << ", started "
+        << host.extensionStarts << " times\n";
   } else {
     out << "extension      not running";
     if (host.lastFailure) out << ": " << host.lastFailure->localizedDescription();
@@ -141,8 +145,10 @@ nlohmann::ordered_json statusJson(const DriveStatus& status) {
                              {"enumerators", status.host->enumerators},
                              {"resident_bytes", status.host->residentBytes},
                              {"open_descriptors", status.host->openDescriptors}};
-    json["extension"] = {{"pid", status.host->extensionPid}, {"starts", status.host->extensionStarts}};
-    if (status.host->lastFailure) json["extension"]["failure"] = errorJson(status.host->lastFailure);
+    json["extension"] = {{"pid", status.host->extensionPid},
+                         {"starts", status.host->extensionStarts}};
+    if (status.host->lastFailure)
+      json["extension"]["failure"] = errorJson(status.host->lastFailure);
   }
   return json;
 }

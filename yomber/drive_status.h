@@ -13,7 +13,8 @@
 
 namespace yomber {
 
-/// What the drive's processes say of themselves; a part is missing when its process does not answer.
+/// What the drive's processes say of themselves; a part is missing when its process does not
+/// answer.
 struct DriveStatus {
   struct Daemon {
     std::uint32_t pid = 0;

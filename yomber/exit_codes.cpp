@@ -25,7 +25,8 @@ ExitCode exitCodeFor(const NSErrorRef& error) {
     return ExitCode::NotSignedIn;
   }
   if (error->is(NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem) ||
-      error->is(NSCocoaErrorDomain, NSFileNoSuchFileError) || error->is(NSPOSIXErrorDomain, ENOENT)) {
+      error->is(NSCocoaErrorDomain, NSFileNoSuchFileError) ||
+      error->is(NSPOSIXErrorDomain, ENOENT)) {
     return ExitCode::NoSuchItem;
   }
   if (error->is(QSOstrellErrorDomain, QSOstrellErrorInvalidParameter)) return ExitCode::Usage;

@@ -9,10 +9,10 @@ namespace yomber {
 enum class ExitCode : int {
   Ok = 0,
   Failure = 1,
-  Usage = 64,        ///< the command line is wrong
-  NoSuchItem = 66,   ///< the item or location is not in the drive
-  Unavailable = 69,  ///< the drive is not up, or does not answer
-  CannotCreate = 73, ///< the drive cannot be started here
+  Usage = 64,         ///< the command line is wrong
+  NoSuchItem = 66,    ///< the item or location is not in the drive
+  Unavailable = 69,   ///< the drive is not up, or does not answer
+  CannotCreate = 73,  ///< the drive cannot be started here
   NotSignedIn = 77,
 };
 

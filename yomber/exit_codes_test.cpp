@@ -10,12 +10,15 @@
 namespace yomber {
 namespace {
 
-ExitCode codeOf(const char* domain, std::int64_t code) { return exitCodeFor(NSError::errorWithDomain(domain, code)); }
+ExitCode codeOf(const char* domain, std::int64_t code) {
+  return exitCodeFor(NSError::errorWithDomain(domain, code));
+}
 
 TEST(ExitCodes, SuccessIsZero) { EXPECT_EQ(exitCodeFor(nullptr), ExitCode::Ok); }
 
 TEST(ExitCodes, NobodySignedInIsSaidApartFromOtherFailuresInBothDomains) {
-  EXPECT_EQ(codeOf(NSFileProviderErrorDomain, NSFileProviderErrorNotAuthenticated), ExitCode::NotSignedIn);
+  EXPECT_EQ(codeOf(NSFileProviderErrorDomain, NSFileProviderErrorNotAuthenticated),
+            ExitCode::NotSignedIn);
   EXPECT_EQ(codeOf(QSOstrellErrorDomain, QSOstrellErrorLoggedOut), ExitCode::NotSignedIn);
 }
 

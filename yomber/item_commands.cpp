@@ -12,7 +12,8 @@ namespace {
 
 void printAnswer(const CommandContext& context, const char* key, const std::string& answer) {
   if (context.json) {
-    std::cout << nlohmann::ordered_json{{key, answer}}.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+    std::cout << nlohmann::ordered_json{{key, answer}}.dump(
+        -1, ' ', false, nlohmann::json::error_handler_t::replace);
   } else {
     std::cout << answer;
   }
@@ -33,7 +34,8 @@ void runStat(CommandContext& context, const std::string& argument) {
   const auto json = itemJson(item);
   for (const auto& [key, value] : json.items()) {
     std::cout << key << std::string(key.size() < 14 ? 14 - key.size() : 1, ' ')
-              << (value.is_string() ? printableName(value.get<std::string>()) : value.dump()) << "\n";
+              << (value.is_string() ? printableName(value.get<std::string>()) : value.dump())
+              << "\n";
   }
   std::cout << std::flush;
 }
@@ -60,7 +62,9 @@ void addItemCommand(CLI::App& app, CommandContext& context, const char* name, co
                     void (*run)(CommandContext&, const std::string&)) {
   CLI::App* command = app.add_subcommand(name, what);
   auto argument = std::make_shared<std::string>();
-  command->add_option("item", *argument, "A path from the drive's root, a location in its tree, or an identifier")
+  command
+      ->add_option("item", *argument,
+                   "A path from the drive's root, a location in its tree, or an identifier")
       ->required();
   command->callback([&context, argument, run] { run(context, *argument); });
 }
@@ -70,7 +74,8 @@ void addItemCommand(CLI::App& app, CommandContext& context, const char* name, co
 void addItemCommands(CLI::App& app, CommandContext& context) {
   addItemCommand(app, context, "stat", "Show everything about an item", runStat);
   addItemCommand(app, context, "id", "Print an item's identifier", runIdentifier);
-  addItemCommand(app, context, "url", "Print where an item is on disk; a bookmark's target for a bookmark", runLocation);
+  addItemCommand(app, context, "url",
+                 "Print where an item is on disk; a bookmark's target for a bookmark", runLocation);
 }
 
 }  // namespace yomber

@@ -4,9 +4,9 @@
 #include <cstdio>
 #include <ctime>
 
-#include <nlohmann/json.hpp>
 #include <openssl/evp.h>
 #include <unicode/utf8.h>
+#include <nlohmann/json.hpp>
 
 #include "protocols/common.capnp.h"
 
@@ -16,11 +16,16 @@ namespace {
 
 const char* kindName(ItemKind kind) {
   switch (kind) {
-    case ItemKind::Document: return "document";
-    case ItemKind::Folder: return "folder";
-    case ItemKind::Alias: return "alias";
-    case ItemKind::Bookmark: return "bookmark";
-    case ItemKind::Symlink: return "symlink";
+    case ItemKind::Document:
+      return "document";
+    case ItemKind::Folder:
+      return "folder";
+    case ItemKind::Alias:
+      return "alias";
+    case ItemKind::Bookmark:
+      return "bookmark";
+    case ItemKind::Symlink:
+      return "symlink";
   }
   return "unknown";
 }
@@ -46,7 +51,8 @@ bool isUtf8(const std::string& bytes) {
 std::string base64(const std::string& bytes) {
   std::string encoded(4 * ((bytes.size() + 2) / 3) + 1, '\0');
   const int length = EVP_EncodeBlock(reinterpret_cast<unsigned char*>(encoded.data()),
-                                     reinterpret_cast<const unsigned char*>(bytes.data()), static_cast<int>(bytes.size()));
+                                     reinterpret_cast<const unsigned char*>(bytes.data()),
+                                     static_cast<int>(bytes.size()));
   encoded.resize(static_cast<std::size_t>(length));
   return encoded;
 }
@@ -108,7 +114,8 @@ std::string readableSize(std::uint64_t bytes) {
     ++unit;
   }
   std::array<char, 32> text{};
-  std::snprintf(text.data(), text.size(), unit == 0 || value >= 9.95 ? "%.0f %s" : "%.1f %s", value, units[unit]);
+  std::snprintf(text.data(), text.size(), unit == 0 || value >= 9.95 ? "%.0f %s" : "%.1f %s", value,
+                units[unit]);
   return text.data();
 }
 
@@ -147,9 +154,12 @@ nlohmann::ordered_json errorJson(const NSErrorRef& error) {
 
 std::string itemLine(const ItemFields& item, OutputForm form) {
   switch (form) {
-    case OutputForm::Short: return printableName(item.filename) + (item.kind == ItemKind::Folder ? "/" : "");
-    case OutputForm::Long: return longLine(item);
-    case OutputForm::Json: return itemJson(item).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+    case OutputForm::Short:
+      return printableName(item.filename) + (item.kind == ItemKind::Folder ? "/" : "");
+    case OutputForm::Long:
+      return longLine(item);
+    case OutputForm::Json:
+      return itemJson(item).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
   }
   return {};
 }

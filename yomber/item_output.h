@@ -12,9 +12,11 @@ namespace yomber {
 /// How a command prints.
 enum class OutputForm { Short, Long, Json };
 
-/// One line for one item, without the line's end: the name; or kind, size, date, identifier and name;
-/// or a JSON object. Bytes of a name that a terminal would act on, or that are not UTF-8, are shown as
-/// "\xNN" in the first two forms; in JSON a name that is not UTF-8 comes as "name_base64" instead of "name".
+/// One line for one item, without the line's end: the name; or kind, size, date, identifier and
+/// name; or a JSON object. Bytes of a name that a terminal would act on, or that are not UTF-8, are
+/// shown as
+/// "\xNN" in the first two forms; in JSON a name that is not UTF-8 comes as "name_base64" instead
+/// of "name".
 [[nodiscard]] std::string itemLine(const ItemFields& item, OutputForm form);
 
 [[nodiscard]] nlohmann::ordered_json itemJson(const ItemFields& item);

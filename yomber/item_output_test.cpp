@@ -16,7 +16,9 @@ ItemFields document(std::string name) {
   return item;
 }
 
-TEST(PrintableName, LeavesUtf8AsItIs) { EXPECT_EQ(printableName("Übersicht ┏ 日本"), "Übersicht ┏ 日本"); }
+TEST(PrintableName, LeavesUtf8AsItIs) {
+  EXPECT_EQ(printableName("Übersicht ┏ 日本"), "Übersicht ┏ 日本");
+}
 
 TEST(PrintableName, ShowsWhatATerminalWouldActOn) {
   EXPECT_EQ(printableName("two\nlines"), "two\\x0alines");
@@ -24,7 +26,9 @@ TEST(PrintableName, ShowsWhatATerminalWouldActOn) {
   EXPECT_EQ(printableName("csi \xc2\x9b"), "csi \\xc2\\x9b");
 }
 
-TEST(PrintableName, ShowsBytesThatAreNoUtf8) { EXPECT_EQ(printableName("a\xff\xfe z"), "a\\xff\\xfe z"); }
+TEST(PrintableName, ShowsBytesThatAreNoUtf8) {
+  EXPECT_EQ(printableName("a\xff\xfe z"), "a\\xff\\xfe z");
+}
 
 TEST(ReadableSize, KeepsSmallNumbersExactAndLargeOnesShort) {
   EXPECT_EQ(readableSize(0), "0 B");

@@ -16,9 +16,11 @@ struct ListingOptions {
   bool detailed = false;
 };
 
-void printListing(CommandContext& context, DriveClient& client, const NSFileProviderItemIdentifier& container,
-                  const ListingOptions& options) {
-  const OutputForm form = context.json ? OutputForm::Json : options.detailed ? OutputForm::Long : OutputForm::Short;
+void printListing(CommandContext& context, DriveClient& client,
+                  const NSFileProviderItemIdentifier& container, const ListingOptions& options) {
+  const OutputForm form = context.json       ? OutputForm::Json
+                          : options.detailed ? OutputForm::Long
+                                             : OutputForm::Short;
   const auto order = options.sort == "date" ? protocol::SortOrder::DATE : protocol::SortOrder::NAME;
   const NSErrorRef error = client.list(container, order, [&](const std::vector<ItemFields>& page) {
     std::string lines;
@@ -53,7 +55,8 @@ void addListingOptions(CLI::App& command, const std::shared_ptr<ListingOptions>&
 void addListingCommands(CLI::App& app, CommandContext& context) {
   CLI::App* list = app.add_subcommand("ls", "List a folder of the drive");
   auto listOptions = std::make_shared<ListingOptions>();
-  list->add_option("item", listOptions->where, "A path from the drive's root, a location in its tree, or an identifier");
+  list->add_option("item", listOptions->where,
+                   "A path from the drive's root, a location in its tree, or an identifier");
   addListingOptions(*list, listOptions);
   list->callback([&context, listOptions] { runList(context, *listOptions); });
 

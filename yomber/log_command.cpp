@@ -49,7 +49,7 @@ class LogFiles {
   };
 
   void readNew(const fs::path& path, std::vector<std::string>& lines) {
-    struct stat now {};
+    struct stat now{};
     if (stat(path.c_str(), &now) != 0) return;
     Position& position = positions_[path.string()];
     const bool rotated = position.file != now.st_ino || position.offset > now.st_size;
@@ -80,13 +80,15 @@ bool waitForChange(int notifier) {
 
 void showFiles(CommandContext& context, const DrivePaths& paths, const LogOptions& options) {
   const int notifier = inotify_init1(IN_CLOEXEC);
-  if (options.follow && inotify_add_watch(notifier, paths.log.c_str(), IN_MODIFY | IN_CREATE | IN_MOVED_TO) < 0) {
+  if (options.follow &&
+      inotify_add_watch(notifier, paths.log.c_str(), IN_MODIFY | IN_CREATE | IN_MOVED_TO) < 0) {
     close(notifier);
     return context.fail(NSError::errorWithErrno(errno, paths.log));
   }
   LogFiles files(paths.log);
   print(files.newLines(), options.lines);
-  while (options.follow && std::cout && waitForChange(notifier)) print(files.newLines(), static_cast<std::size_t>(-1));
+  while (options.follow && std::cout && waitForChange(notifier))
+    print(files.newLines(), static_cast<std::size_t>(-1));
   close(notifier);
 }
 
@@ -111,7 +113,8 @@ void runLog(CommandContext& context, const LogOptions& options) {
     const std::optional<LogLevel> level = logLevelNamed(options.level);
     if (NSErrorRef error = setSharedLogLevel(paths, *level)) return context.fail(error);
     if (!options.follow) {
-      std::cout << "Every process of the drive now logs from level " << options.level << " on." << std::endl;
+      std::cout << "Every process of the drive now logs from level " << options.level << " on."
+                << std::endl;
       return;
     }
   }
@@ -122,12 +125,14 @@ void runLog(CommandContext& context, const LogOptions& options) {
 }  // namespace
 
 void addLogCommand(CLI::App& app, CommandContext& context) {
-  CLI::App* log = app.add_subcommand("log", "Show what the drive's processes log, or set how much they do");
+  CLI::App* log =
+      app.add_subcommand("log", "Show what the drive's processes log, or set how much they do");
   auto options = std::make_shared<LogOptions>();
   log->add_flag("-f,--follow", options->follow, "Go on printing what comes");
   log->add_option("--level", options->level, "From now on, log this level and all above it")
       ->check(CLI::IsMember({"debug", "info", "default", "error", "fault"}));
-  log->add_option("--lines", options->lines, "How many of the last lines to print")->capture_default_str();
+  log->add_option("--lines", options->lines, "How many of the last lines to print")
+      ->capture_default_str();
   log->callback([&context, options] { runLog(context, *options); });
 }
 

@@ -17,7 +17,8 @@ int main(int argc, char** argv) {
   app.fallthrough();
 
   CommandContext context;
-  app.add_option("--home", context.home, "The drive's home; YOMBER_HOME or ~/.local/share/yomber by default");
+  app.add_option("--home", context.home,
+                 "The drive's home; YOMBER_HOME or ~/.local/share/yomber by default");
   app.add_flag("--json", context.json, "Print JSON: one object a line");
 
   addDriveCommands(app, context);

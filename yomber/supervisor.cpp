@@ -52,7 +52,8 @@ sigset_t handledSignals() {
   }();
   sigprocmask(SIG_SETMASK, &none, nullptr);
   std::vector<char*> arguments;
-  for (const std::string& argument : program.arguments) arguments.push_back(const_cast<char*>(argument.c_str()));
+  for (const std::string& argument : program.arguments)
+    arguments.push_back(const_cast<char*>(argument.c_str()));
   arguments.push_back(nullptr);
   execv(arguments[0], arguments.data());
   _exit(127);
@@ -60,7 +61,8 @@ sigset_t handledSignals() {
 
 }  // namespace
 
-Supervisor::Supervisor(std::string lockPath, std::vector<SupervisedProgram> programs) : lockPath_(std::move(lockPath)) {
+Supervisor::Supervisor(std::string lockPath, std::vector<SupervisedProgram> programs)
+    : lockPath_(std::move(lockPath)) {
   for (SupervisedProgram& program : programs) {
     Child child;
     child.program = std::move(program);
@@ -74,7 +76,8 @@ NSErrorRef Supervisor::takeLock() {
   lockDescriptor_ = open(lockPath_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
   if (lockDescriptor_ < 0) return NSError::errorWithErrno(errno, lockPath_);
   flock lock = wholeFile(F_WRLCK);
-  if (fcntl(lockDescriptor_, F_SETLK, &lock) != 0) return NSError::errorWithErrno(EWOULDBLOCK, lockPath_);
+  if (fcntl(lockDescriptor_, F_SETLK, &lock) != 0)
+    return NSError::errorWithErrno(EWOULDBLOCK, lockPath_);
   return nullptr;
 }
 
@@ -122,11 +125,12 @@ void Supervisor::start(Child& child) {
 void Supervisor::scheduleRestart(Child& child, int status) {
   const auto now = steady_clock::now();
   const bool settled = child.pid != 0 && now - child.startedAt >= settledAfter;
-  child.backOff = settled ? milliseconds(0) : std::min(std::max(child.backOff * 2, firstBackOff), lastBackOff);
+  child.backOff =
+      settled ? milliseconds(0) : std::min(std::max(child.backOff * 2, firstBackOff), lastBackOff);
   child.startAgainAt = now + child.backOff;
   child.pid = 0;
-  log_error(defaultLog(), "[ERROR] %s ended (status %d); starting it again in %lld ms", child.program.name, status,
-            static_cast<long long>(child.backOff.count()));
+  log_error(defaultLog(), "[ERROR] %s ended (status %d); starting it again in %lld ms",
+            child.program.name, status, static_cast<long long>(child.backOff.count()));
 }
 
 void Supervisor::startDue() {

@@ -17,12 +17,12 @@ struct SupervisedProgram {
   std::vector<std::string> arguments;  ///< the first is the executable's path
 };
 
-/// Keeps a drive's programs running: starts them, starts again whichever ends, and ends them all when
-/// it is told to end. The programs are tied to it: should it be killed, they end too, so that nothing
-/// of a drive is ever left without a keeper.
+/// Keeps a drive's programs running: starts them, starts again whichever ends, and ends them all
+/// when it is told to end. The programs are tied to it: should it be killed, they end too, so that
+/// nothing of a drive is ever left without a keeper.
 ///
-/// A process of its own, whose signals it takes over: threads may be started only after `takeLock`, which
-/// blocks them, so that no thread takes a signal from `run`.
+/// A process of its own, whose signals it takes over: threads may be started only after `takeLock`,
+/// which blocks them, so that no thread takes a signal from `run`.
 class Supervisor {
  public:
   /// `lockPath` names the file whose record lock says that a drive is up, and whose pid it is.
@@ -30,8 +30,8 @@ class Supervisor {
 
   /// Takes the lock; fails with EWOULDBLOCK when another supervisor holds it.
   [[nodiscard]] NSErrorRef takeLock();
-  /// Returns after SIGTERM or SIGINT, when every program has ended. REQUIRES: `takeLock` succeeded in
-  /// this very process (record locks are not inherited).
+  /// Returns after SIGTERM or SIGINT, when every program has ended. REQUIRES: `takeLock` succeeded
+  /// in this very process (record locks are not inherited).
   void run();
 
   /// The pid of the supervisor that holds the lock.

@@ -50,7 +50,9 @@ class SupervisorTest : public testing::Test {
   }
 
   /// The script of a program that says its pid and stays.
-  [[nodiscard]] std::string stays() const { return "echo $$ > " + pids_ + "; exec tail -f /dev/null"; }
+  [[nodiscard]] std::string stays() const {
+    return "echo $$ > " + pids_ + "; exec tail -f /dev/null";
+  }
 
   /// Blocks until a program has said its pid.
   pid_t nextPid() {

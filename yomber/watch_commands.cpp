@@ -36,7 +36,8 @@ class ChangePrinter {
       names_[item.identifier] = item.filename;
       if (options_.listFirst) printItem("present", item);
     }
-    if (last && !options_.listFirst && !json_) std::cerr << "watching " << names_.size() << " items" << std::endl;
+    if (last && !options_.listFirst && !json_)
+      std::cerr << "watching " << names_.size() << " items" << std::endl;
     std::cout << std::flush;
     if (last && options_.once) finish(nullptr);
   }
@@ -60,7 +61,8 @@ class ChangePrinter {
 
   void paused(const NSErrorRef& error) {
     if (json_) {
-      std::cout << nlohmann::ordered_json{{"event", "paused"}, {"error", errorJson(error)}}.dump() << std::endl;
+      std::cout << nlohmann::ordered_json{{"event", "paused"}, {"error", errorJson(error)}}.dump()
+                << std::endl;
     } else {
       std::cerr << "waiting: " << error->localizedDescription() << std::endl;
     }
@@ -93,7 +95,8 @@ class ChangePrinter {
       const nlohmann::ordered_json line{{"event", event}, {"item", itemJson(item)}};
       std::cout << line.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace) << "\n";
     } else {
-      std::cout << event << std::string(9 - std::string(event).size(), ' ') << itemLine(item, OutputForm::Short) << "\n";
+      std::cout << event << std::string(9 - std::string(event).size(), ' ')
+                << itemLine(item, OutputForm::Short) << "\n";
     }
   }
 
@@ -130,7 +133,8 @@ class WatcherServer final : public protocol::Watcher::Server {
   }
   kj::Promise<void> didDelete(DidDeleteContext context) override {
     std::vector<std::string> identifiers;
-    for (const auto identifier : context.getParams().getIdentifiers()) identifiers.emplace_back(identifier.cStr());
+    for (const auto identifier : context.getParams().getIdentifiers())
+      identifiers.emplace_back(identifier.cStr());
     printer_->deleted(identifiers);
     return kj::READY_NOW;
   }
@@ -154,25 +158,31 @@ class WatcherServer final : public protocol::Watcher::Server {
   const std::shared_ptr<ChangePrinter> printer_;
 };
 
-NSErrorRef startWatch(const ipc::Remote<protocol::Control>& control, const NSFileProviderItemIdentifier& container,
-                      const std::shared_ptr<ChangePrinter>& printer, ipc::Remote<protocol::Watch>& registration) {
+NSErrorRef startWatch(const ipc::Remote<protocol::Control>& control,
+                      const NSFileProviderItemIdentifier& container,
+                      const std::shared_ptr<ChangePrinter>& printer,
+                      ipc::Remote<protocol::Watch>& registration) {
   return ipc::callAndWait(
       control, &protocol::Control::Client::watchRequest,
       [&](auto params) {
         params.setContainer(container);
         params.setWatcher(kj::heap<WatcherServer>(printer));
       },
-      [&](auto results) { registration = ipc::Remote<protocol::Watch>(results.getRegistration()); });
+      [&](auto results) {
+        registration = ipc::Remote<protocol::Watch>(results.getRegistration());
+      });
 }
 
 /// Watches until the host is lost or the user interrupts; the signal's default action ends us.
-void watchContainer(CommandContext& context, const NSFileProviderItemIdentifier& container, const WatchOptions& options) {
+void watchContainer(CommandContext& context, const NSFileProviderItemIdentifier& container,
+                    const WatchOptions& options) {
   DriveClient client(context.paths());
   NSErrorRef error;
   const auto control = client.control(&error);
   if (error) return context.fail(error);
   auto printer = std::make_shared<ChangePrinter>(context.json, options);
-  client.controlConnection()->onDisconnect([printer](NSErrorRef failure) { printer->finish(std::move(failure)); });
+  client.controlConnection()->onDisconnect(
+      [printer](NSErrorRef failure) { printer->finish(std::move(failure)); });
   ipc::Remote<protocol::Watch> registration;
   error = startWatch(control, container, printer, registration);
   if (!error) error = printer->waitUntilFinished();
@@ -196,12 +206,13 @@ void addWatchCommands(CLI::App& app, CommandContext& context) {
   watch->add_flag("--list", *listFirst, "Print what is there first");
   watch->callback([&context, where, listFirst] { runWatch(context, *where, *listFirst); });
 
-  CLI::App* workingSet =
-      app.add_subcommand("working-set", "Print the items that matter: favourite, tagged, shared, recently used");
+  CLI::App* workingSet = app.add_subcommand(
+      "working-set", "Print the items that matter: favourite, tagged, shared, recently used");
   auto follow = std::make_shared<bool>(false);
   workingSet->add_flag("--follow", *follow, "Stay, and print each change as it comes");
   workingSet->callback([&context, follow] {
-    watchContainer(context, NSFileProviderWorkingSetContainerItemIdentifier, {.listFirst = true, .once = !*follow});
+    watchContainer(context, NSFileProviderWorkingSetContainerItemIdentifier,
+                   {.listFirst = true, .once = !*follow});
   });
 }
 

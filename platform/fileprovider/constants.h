@@ -50,7 +50,8 @@ enum NSFileProviderItemCapabilities : std::uint32_t {
   NSFileProviderItemCapabilitiesAllowsTrashing = 1U << 4U,
   NSFileProviderItemCapabilitiesAllowsDeleting = 1U << 5U,
   NSFileProviderItemCapabilitiesAllowsAddingSubItems = NSFileProviderItemCapabilitiesAllowsWriting,
-  NSFileProviderItemCapabilitiesAllowsContentEnumerating = NSFileProviderItemCapabilitiesAllowsReading,
+  NSFileProviderItemCapabilitiesAllowsContentEnumerating =
+      NSFileProviderItemCapabilitiesAllowsReading,
 };
 
 }  // namespace yomber

@@ -26,8 +26,10 @@ class NSFileProviderChangeObserver {
  public:
   virtual ~NSFileProviderChangeObserver() = default;
   virtual void didUpdateItems(const NSFileProviderItems& items) = 0;
-  virtual void didDeleteItemsWithIdentifiers(const std::vector<NSFileProviderItemIdentifier>& identifiers) = 0;
-  virtual void finishEnumeratingChangesUpToSyncAnchor(NSFileProviderSyncAnchor anchor, bool moreComing) = 0;
+  virtual void didDeleteItemsWithIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers) = 0;
+  virtual void finishEnumeratingChangesUpToSyncAnchor(NSFileProviderSyncAnchor anchor,
+                                                      bool moreComing) = 0;
   virtual void finishEnumeratingWithError(NSErrorRef error) = 0;
 };
 
@@ -39,7 +41,8 @@ class NSFileProviderEnumerator {
  public:
   virtual ~NSFileProviderEnumerator() = default;
   /// `page` is an initial page, a page this enumerator gave, or nil (the beginning, by name).
-  virtual void enumerateItemsForObserver(NSFileProviderEnumerationObserverRef observer, NSFileProviderPage page) = 0;
+  virtual void enumerateItemsForObserver(NSFileProviderEnumerationObserverRef observer,
+                                         NSFileProviderPage page) = 0;
   virtual void invalidate() = 0;
 };
 
@@ -47,8 +50,10 @@ class NSFileProviderEnumerator {
 /// whether an enumerator is one.
 class NSFileProviderChangeEnumerator : public NSFileProviderEnumerator {
  public:
-  virtual void enumerateChangesForObserver(NSFileProviderChangeObserverRef observer, NSFileProviderSyncAnchor anchor) = 0;
-  virtual void currentSyncAnchorWithCompletionHandler(std::function<void(NSFileProviderSyncAnchor)> completionHandler) = 0;
+  virtual void enumerateChangesForObserver(NSFileProviderChangeObserverRef observer,
+                                           NSFileProviderSyncAnchor anchor) = 0;
+  virtual void currentSyncAnchorWithCompletionHandler(
+      std::function<void(NSFileProviderSyncAnchor)> completionHandler) = 0;
 };
 
 using NSFileProviderEnumeratorRef = std::shared_ptr<NSFileProviderEnumerator>;

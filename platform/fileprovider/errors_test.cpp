@@ -11,9 +11,9 @@ namespace {
 TEST(FileProviderErrors, MissingItemCarriesItsIdentifier) {
   const auto error = fileProviderErrorForNonExistentItemWithIdentifier("d:5");
   EXPECT_TRUE(error->is(NSFileProviderErrorDomain, -1005));
-  EXPECT_EQ(std::get<std::string>(
-                error->userInfo().at(NSFileProviderErrorNonExistentItemIdentifierKey)),
-            "d:5");
+  EXPECT_EQ(
+      std::get<std::string>(error->userInfo().at(NSFileProviderErrorNonExistentItemIdentifierKey)),
+      "d:5");
 }
 
 TEST(FileProviderErrors, CollisionCarriesTheVeryItem) {
@@ -27,8 +27,8 @@ TEST(FileProviderErrors, CollisionCarriesTheVeryItem) {
 }
 
 TEST(InitialPages, AreToldApart) {
-  EXPECT_FALSE(NSFileProviderInitialPageSortedByDate->isEqualToData(
-      NSFileProviderInitialPageSortedByName));
+  EXPECT_FALSE(
+      NSFileProviderInitialPageSortedByDate->isEqualToData(NSFileProviderInitialPageSortedByName));
 }
 
 TEST(FileProviderExtension, AnswersWhatNobodyOverrides) {

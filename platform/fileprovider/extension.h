@@ -33,11 +33,14 @@ class NSFileProviderExtension {
   NSFileProviderExtension& operator=(const NSFileProviderExtension&) = delete;
 
   // Lookups and enumeration.
-  virtual NSURLRef URLForItemWithPersistentIdentifier(const NSFileProviderItemIdentifier& identifier);
-  virtual std::optional<NSFileProviderItemIdentifier> persistentIdentifierForItemAtURL(const NSURLRef& url);
-  virtual NSFileProviderItemRef itemForIdentifier(const NSFileProviderItemIdentifier& identifier, NSErrorRef* error = nullptr);
-  virtual NSFileProviderEnumeratorRef enumeratorForContainerItemIdentifier(const NSFileProviderItemIdentifier& identifier,
-                                                                           NSErrorRef* error = nullptr);
+  virtual NSURLRef URLForItemWithPersistentIdentifier(
+      const NSFileProviderItemIdentifier& identifier);
+  virtual std::optional<NSFileProviderItemIdentifier> persistentIdentifierForItemAtURL(
+      const NSURLRef& url);
+  virtual NSFileProviderItemRef itemForIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                                  NSErrorRef* error = nullptr);
+  virtual NSFileProviderEnumeratorRef enumeratorForContainerItemIdentifier(
+      const NSFileProviderItemIdentifier& identifier, NSErrorRef* error = nullptr);
 
   // Content.
   virtual void providePlaceholderAtURL(const NSURLRef& url, ErrorHandler completionHandler);

@@ -77,8 +77,9 @@ int refuse(const char* program) {
 
 }  // namespace
 
-int NSExtensionMain(int argc, char** argv,
-                    const std::function<std::shared_ptr<NSFileProviderExtension>()>& makeExtension) {
+int NSExtensionMain(
+    int argc, char** argv,
+    const std::function<std::shared_ptr<NSFileProviderExtension>()>& makeExtension) {
   const char* const program = argc > 0 ? argv[0] : "extension";
   const int socket = takeInheritedSocket();
   if (socket < 0) return refuse(program);
@@ -89,8 +90,8 @@ int NSExtensionMain(int argc, char** argv,
 
   const auto extension = makeExtension();
   NSErrorRef error;
-  const auto connection = ipc::Connection::adopt(
-      socket, [extension] { return serveExtension(extension); }, &error);
+  const auto connection =
+      ipc::Connection::adopt(socket, [extension] { return serveExtension(extension); }, &error);
   if (connection == nullptr) {
     log_error(defaultLog(), "[ERROR] no connection to the host: %@", error);
     return refuse(program);

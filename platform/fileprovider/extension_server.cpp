@@ -1,7 +1,7 @@
 #include "platform/fileprovider/extension_server.h"
 
-#include <cerrno>
 #include <atomic>
+#include <cerrno>
 #include <optional>
 #include <string>
 #include <utility>

@@ -139,7 +139,8 @@ class ExtensionServer : public testing::Test {
                            [&](auto params) { params.setContainer(container); },
                            [&](auto results) {
                              if (results.getResult().isEnumerator()) {
-                               opened = ipc::Remote<Enumerator>(results.getResult().getEnumerator());
+                               opened =
+                                   ipc::Remote<Enumerator>(results.getResult().getEnumerator());
                              } else {
                                storeError(error, ipc::decodeError(results.getResult().getError()));
                              }
@@ -192,13 +193,13 @@ TEST_F(ExtensionServer, AnswersLookups) {
 
   const auto identify = [&](const std::string& path) {
     std::string identifier = "nil";
-    EXPECT_EQ(nullptr,
-              ipc::callAndWait(
-                  remote, &Extension::Client::identifierForPathRequest,
-                  [&](auto params) { params.setPath(wireData(path)); },
-                  [&](auto results) {
-                    if (results.getFound()) identifier = stringFromWire(results.getIdentifier());
-                  }));
+    EXPECT_EQ(nullptr, ipc::callAndWait(
+                           remote, &Extension::Client::identifierForPathRequest,
+                           [&](auto params) { params.setPath(wireData(path)); },
+                           [&](auto results) {
+                             if (results.getFound())
+                               identifier = stringFromWire(results.getIdentifier());
+                           }));
     return identifier;
   };
   EXPECT_EQ(identify("/tree/d:9"), "d:9");
@@ -237,7 +238,9 @@ TEST_F(ExtensionServer, ARequestThatBlocksHoldsUpNoOther) {
   (void)ipc::call(
       remote, &Extension::Client::urlForItemRequest,
       [](auto params) { params.setIdentifier("blocked"); },
-      [&](const NSErrorRef&, const Extension::UrlForItemResults::Reader*) { answered.set_value(); });
+      [&](const NSErrorRef&, const Extension::UrlForItemResults::Reader*) {
+        answered.set_value();
+      });
   NSErrorRef error;
   EXPECT_EQ(page(open("i:1"), ""), "a,b,more");
   extension->gate.set_value();
@@ -282,7 +285,8 @@ TEST_F(ExtensionServer, PassesChangesAndAnchors) {
                              }
                              const auto got = result.getChanges();
                              told = stringFromWire(got.getUpdated()[0].getIdentifier());
-                             for (const auto gone : got.getDeleted()) told += "-" + stringFromWire(gone);
+                             for (const auto gone : got.getDeleted())
+                               told += "-" + stringFromWire(gone);
                              told += "@" + stringFromWire(got.getAnchor());
                              told += got.getMoreComing() ? "+" : ".";
                            }));
@@ -335,9 +339,9 @@ TEST_F(ExtensionServer, AMissingContainerHasNoEnumerator) {
 
 TEST_F(ExtensionServer, InvalidatesAnEnumeratorOnceWhenItIsDropped) {
   auto enumerator = open("i:1");
-  EXPECT_EQ(nullptr, ipc::callAndWait(
-                         enumerator, &Enumerator::Client::invalidateRequest, [](auto) {},
-                         [](auto) {}));
+  EXPECT_EQ(nullptr,
+            ipc::callAndWait(
+                enumerator, &Enumerator::Client::invalidateRequest, [](auto) {}, [](auto) {}));
   EXPECT_EQ(extension->enumerator->invalidations, 1);
   enumerator = nullptr;
   auto second = open("i:1");
@@ -403,9 +407,8 @@ TEST(ExtensionMain, ServesUntilTheHostGoes) {
   });
   const auto signalled = std::make_shared<std::promise<std::string>>();
   const auto host = ipc::Connection::adopt(
-      ours.release(), [signalled]() -> capnp::Capability::Client {
-        return kj::heap<SignalledHost>(signalled);
-      });
+      ours.release(),
+      [signalled]() -> capnp::Capability::Client { return kj::heap<SignalledHost>(signalled); });
   std::string path;
   EXPECT_EQ(nullptr,
             ipc::callAndWait(

@@ -45,14 +45,16 @@ struct ItemFields {
   friend bool operator==(const ItemFields&, const ItemFields&) = default;
 };
 
-/// An item as the framework sees it. The client library's item class conforms to it and is handed to
-/// the framework unchanged.
+/// An item as the framework sees it. The client library's item class conforms to it and is handed
+/// to the framework unchanged.
 ///
 /// Ownership: shared, immutable.
 class NSFileProviderItem : public NSObject {
  public:
   [[nodiscard]] virtual const ItemFields& fields() const = 0;
-  [[nodiscard]] const NSFileProviderItemIdentifier& itemIdentifier() const { return fields().identifier; }
+  [[nodiscard]] const NSFileProviderItemIdentifier& itemIdentifier() const {
+    return fields().identifier;
+  }
   [[nodiscard]] const std::string& filename() const { return fields().filename; }
 };
 

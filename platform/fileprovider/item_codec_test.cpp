@@ -74,8 +74,7 @@ TEST(ItemCodec, PromisesEnoughRoomForAPage) {
 
 TEST(WireItem, TravelsInsideACollisionError) {
   registerItemsInErrors();
-  const auto error =
-      fileProviderErrorForCollisionWithItem(std::make_shared<WireItem>(fullItem()));
+  const auto error = fileProviderErrorForCollisionWithItem(std::make_shared<WireItem>(fullItem()));
   capnp::MallocMessageBuilder message;
   ipc::encodeError(error, message.initRoot<protocol::Error>());
   const auto decoded = ipc::decodeError(message.getRoot<protocol::Error>().asReader());

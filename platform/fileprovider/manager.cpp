@@ -24,7 +24,8 @@ NSFileProviderManager& NSFileProviderManager::defaultManager() {
 void NSFileProviderManager::signalEnumeratorForContainerItemIdentifier(
     const NSFileProviderItemIdentifier& container,
     std::function<void(NSErrorRef)> completionHandler) {
-  auto answer = [replies = state_->replies, handler = std::move(completionHandler)](NSErrorRef error) {
+  auto answer = [replies = state_->replies,
+                 handler = std::move(completionHandler)](NSErrorRef error) {
     if (!handler) return;
     replies->async([handler, error = std::move(error)] { handler(error); });
   };

@@ -10,8 +10,8 @@ namespace yomber {
 
 /// The extension's way to speak to the host unasked.
 ///
-/// Thread-safety: every operation may be called on any thread; handlers run on the framework's reply
-/// queue.
+/// Thread-safety: every operation may be called on any thread; handlers run on the framework's
+/// reply queue.
 class NSFileProviderManager {
  public:
   /// How signals reach the host. `NSExtensionMain` installs the connection to it; a process that
@@ -26,8 +26,9 @@ class NSFileProviderManager {
   static NSFileProviderManager& defaultManager();
 
   /// Tells the host that a container has changes; the host will ask for them. Never blocks.
-  void signalEnumeratorForContainerItemIdentifier(const NSFileProviderItemIdentifier& container,
-                                                  std::function<void(NSErrorRef)> completionHandler);
+  void signalEnumeratorForContainerItemIdentifier(
+      const NSFileProviderItemIdentifier& container,
+      std::function<void(NSErrorRef)> completionHandler);
 
   void setTransport(std::shared_ptr<Transport> transport);
 

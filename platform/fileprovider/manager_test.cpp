@@ -45,7 +45,8 @@ TEST(FileProviderManager, AnswersInvalidWithoutAHost) {
   const auto answer = signal(manager, "d:1");
   ASSERT_NE(answer.error, nullptr);
   EXPECT_TRUE(answer.error->is(NSCocoaErrorDomain, NSXPCConnectionInvalid));
-  EXPECT_NE(answer.thread, std::this_thread::get_id()) << "handlers never run on the caller's stack";
+  EXPECT_NE(answer.thread, std::this_thread::get_id())
+      << "handlers never run on the caller's stack";
 }
 
 TEST(FileProviderManager, HandsSignalsToTheTransport) {

@@ -66,8 +66,8 @@ void PageObserver::finishEnumeratingWithError(NSErrorRef error) {
     handler = std::exchange(handler_, nullptr);
     page_.items.clear();
   }
-  handler(EnumeratedPage{
-      .items = {}, .next = nullptr, .error = orUnnamedFailure(std::move(error))});
+  handler(
+      EnumeratedPage{.items = {}, .next = nullptr, .error = orUnnamedFailure(std::move(error))});
 }
 
 ChangesObserver::ChangesObserver(Handler handler) : handler_(std::move(handler)) {}

@@ -32,8 +32,8 @@ struct EnumeratedChanges {
 /// and change nothing. An observer that is let go unfinished hands over an error, so that whoever
 /// waits learns of it. Nil items are left out.
 ///
-/// Thread-safety: as the observer protocols ask; calls that race are safe too. The handler is called
-/// on the finishing thread.
+/// Thread-safety: as the observer protocols ask; calls that race are safe too. The handler is
+/// called on the finishing thread.
 class PageObserver final : public NSFileProviderEnumerationObserver {
  public:
   using Handler = std::function<void(EnumeratedPage)>;

@@ -14,9 +14,10 @@ template <typename Protocol>
 class NSXPCProxyCreating {
  public:
   virtual ~NSXPCProxyCreating() = default;
-  /// A new proxy of the same remote object. `errorHandler` is called at most once, on the connection's
-  /// reply queue.
-  virtual std::shared_ptr<Protocol> remoteObjectProxyWithErrorHandler(std::function<void(NSErrorRef)> errorHandler) = 0;
+  /// A new proxy of the same remote object. `errorHandler` is called at most once, on the
+  /// connection's reply queue.
+  virtual std::shared_ptr<Protocol> remoteObjectProxyWithErrorHandler(
+      std::function<void(NSErrorRef)> errorHandler) = 0;
 };
 
 }  // namespace yomber

@@ -46,7 +46,8 @@ std::vector<char*> pointersTo(std::vector<std::string>& strings) {
   return pointers;
 }
 
-/// Starts a program with its standard output, and error where it is given, on the given descriptors.
+/// Starts a program with its standard output, and error where it is given, on the given
+/// descriptors.
 pid_t spawn(std::vector<std::string> arguments, const Environment& extra, int output, int errors) {
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
@@ -55,8 +56,8 @@ pid_t spawn(std::vector<std::string> arguments, const Environment& extra, int ou
   if (errors >= 0) posix_spawn_file_actions_adddup2(&actions, errors, STDERR_FILENO);
   std::vector<std::string> environment = environmentWith(extra);
   pid_t pid = -1;
-  const int failure =
-      posix_spawn(&pid, arguments[0].c_str(), &actions, nullptr, pointersTo(arguments).data(), pointersTo(environment).data());
+  const int failure = posix_spawn(&pid, arguments[0].c_str(), &actions, nullptr,
+                                  pointersTo(arguments).data(), pointersTo(environment).data());
   posix_spawn_file_actions_destroy(&actions);
   return failure == 0 ? pid : -1;
 }
@@ -73,7 +74,8 @@ int exitCodeOf(int status) { return WIFEXITED(status) ? WEXITSTATUS(status) : -W
 
 }  // namespace
 
-ProcessResult runProcess(const std::vector<std::string>& arguments, const Environment& extra, milliseconds limit) {
+ProcessResult runProcess(const std::vector<std::string>& arguments, const Environment& extra,
+                         milliseconds limit) {
   std::array<int, 2> output{};
   std::array<int, 2> errors{};
   ProcessResult result;
@@ -129,7 +131,8 @@ std::optional<std::string> LineProcess::nextLine(steady_clock::time_point deadli
   }
 }
 
-bool LineProcess::readUntil(const std::function<bool(const std::string&)>& wanted, milliseconds limit) {
+bool LineProcess::readUntil(const std::function<bool(const std::string&)>& wanted,
+                            milliseconds limit) {
   const auto deadline = steady_clock::now() + limit;
   while (const auto line = nextLine(deadline)) {
     if (wanted(*line)) return true;

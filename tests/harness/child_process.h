@@ -15,8 +15,8 @@ namespace yomber::testing {
 inline constexpr std::chrono::seconds patience{60};
 
 struct ProcessResult {
-  int exitCode = -1;     ///< negative: ended by that signal
-  bool timedOut = false; ///< it was killed, since it did not end in time
+  int exitCode = -1;      ///< negative: ended by that signal
+  bool timedOut = false;  ///< it was killed, since it did not end in time
   std::string output;
   std::string errors;
 };
@@ -39,7 +39,8 @@ class LineProcess {
   /// The next line of standard output; nothing at the deadline or when the program has ended.
   std::optional<std::string> nextLine(std::chrono::steady_clock::time_point deadline);
   /// Reads lines until one for which `wanted` holds; false at the deadline or at the end.
-  bool readUntil(const std::function<bool(const std::string& line)>& wanted, std::chrono::milliseconds limit = patience);
+  bool readUntil(const std::function<bool(const std::string& line)>& wanted,
+                 std::chrono::milliseconds limit = patience);
   /// Waits for the end; nothing at the deadline.
   std::optional<int> waitForEnd(std::chrono::milliseconds limit = patience);
 

@@ -17,7 +17,8 @@ namespace yomber::testing {
 namespace fs = std::filesystem;
 
 std::string programPath(const std::string& name) {
-  if (const char* build = std::getenv("YOMBER_BUILD_DIR")) return std::string(build) + "/bin/" + name;
+  if (const char* build = std::getenv("YOMBER_BUILD_DIR"))
+    return std::string(build) + "/bin/" + name;
   return (fs::read_symlink("/proc/self/exe").parent_path() / name).string();
 }
 
@@ -26,10 +27,12 @@ namespace {
 /// The pid of the child of `parent` whose program has that name.
 std::optional<pid_t> childNamed(pid_t parent, const std::string& program) {
   std::error_code failure;
-  for (const auto& task : fs::directory_iterator("/proc/" + std::to_string(parent) + "/task", failure)) {
+  for (const auto& task :
+       fs::directory_iterator("/proc/" + std::to_string(parent) + "/task", failure)) {
     std::ifstream children(task.path() / "children");
     for (pid_t child = 0; children >> child;) {
-      const fs::path executable = fs::read_symlink("/proc/" + std::to_string(child) + "/exe", failure);
+      const fs::path executable =
+          fs::read_symlink("/proc/" + std::to_string(child) + "/exe", failure);
       if (!failure && executable.filename() == program) return child;
     }
   }
@@ -43,7 +46,8 @@ TestDrive::TestDrive() {
   directory_ = mkdtemp(pattern.data());
   home_ = directory_ + "/home";
   root_ = home_ + "/tree/" + QSUbiquitousDefaultContainerID + "/Documents";
-  for (const std::string& place : {home_, home_ + "/tree", home_ + "/tree/" + QSUbiquitousDefaultContainerID, root_}) {
+  for (const std::string& place :
+       {home_, home_ + "/tree", home_ + "/tree/" + QSUbiquitousDefaultContainerID, root_}) {
     fs::create_directory(place);
     fs::permissions(place, fs::perms::owner_all);
   }
@@ -90,7 +94,8 @@ std::vector<std::string> TestDrive::commandLine(const std::vector<std::string>& 
   return words;
 }
 
-ProcessResult TestDrive::yomber(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const {
+ProcessResult TestDrive::yomber(const std::vector<std::string>& arguments,
+                                std::chrono::milliseconds limit) const {
   return runProcess(commandLine(arguments), environment_, limit);
 }
 
@@ -105,9 +110,11 @@ std::vector<nlohmann::json> TestDrive::json(const std::vector<std::string>& argu
   return lines;
 }
 
-std::vector<std::string> TestDrive::names(const std::string& folder, const std::string& sort) const {
+std::vector<std::string> TestDrive::names(const std::string& folder,
+                                          const std::string& sort) const {
   std::vector<std::string> names;
-  for (const nlohmann::json& item : json({"ls", folder, "--sort", sort})) names.push_back(item.at("name"));
+  for (const nlohmann::json& item : json({"ls", folder, "--sort", sort}))
+    names.push_back(item.at("name"));
   return names;
 }
 
@@ -145,6 +152,8 @@ void TestDrive::write(const std::string& relativePath, const std::string& conten
   ASSERT_TRUE(file.good()) << relativePath;
 }
 
-void TestDrive::makeFolder(const std::string& relativePath) const { fs::create_directories(root_ + "/" + relativePath); }
+void TestDrive::makeFolder(const std::string& relativePath) const {
+  fs::create_directories(root_ + "/" + relativePath);
+}
 
 }  // namespace yomber::testing

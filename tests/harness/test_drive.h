@@ -10,8 +10,8 @@
 
 namespace yomber::testing {
 
-/// A whole drive of its own: a temporary home, the real processes, the real command line. Taken down
-/// and removed when the object goes.
+/// A whole drive of its own: a temporary home, the real processes, the real command line. Taken
+/// down and removed when the object goes.
 class TestDrive {
  public:
   TestDrive();
@@ -31,13 +31,16 @@ class TestDrive {
   Environment& environment() { return environment_; }
 
   /// Runs `yomber` with these arguments.
-  ProcessResult yomber(const std::vector<std::string>& arguments, std::chrono::milliseconds limit = patience) const;
+  ProcessResult yomber(const std::vector<std::string>& arguments,
+                       std::chrono::milliseconds limit = patience) const;
   /// The lines that `yomber --json …` printed; fails the test when it failed.
   std::vector<nlohmann::json> json(const std::vector<std::string>& arguments) const;
-  [[nodiscard]] std::vector<std::string> commandLine(const std::vector<std::string>& arguments) const;
+  [[nodiscard]] std::vector<std::string> commandLine(
+      const std::vector<std::string>& arguments) const;
 
   /// The names that `yomber ls` shows of a folder, in its order.
-  std::vector<std::string> names(const std::string& folder = "/", const std::string& sort = "name") const;
+  std::vector<std::string> names(const std::string& folder = "/",
+                                 const std::string& sort = "name") const;
   [[nodiscard]] nlohmann::json status() const;
 
   enum class Process { Zarn, Host, Extension };

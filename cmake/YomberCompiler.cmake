@@ -48,9 +48,10 @@ if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
 else()
   # Clang counts implicit sign changes as conversions where gcc does not, and reports what the
   # standard library itself uses of its own old parts; gcc reports our own uses.
-  list(APPEND YOMBER_WARNINGS -Wno-sign-conversion -Wno-deprecated-declarations -Wno-implicit-int-float-conversion
-    -Wthread-safety -Wzero-as-null-pointer-constant
-    -Winconsistent-missing-override -Wunused-macros -Wno-format-nonliteral -Wno-gnu-zero-variadic-macro-arguments)
+  list(APPEND YOMBER_WARNINGS -Wno-sign-conversion -Wno-deprecated-declarations
+    -Wno-implicit-int-float-conversion -Wno-format-nonliteral
+    -Wno-gnu-zero-variadic-macro-arguments
+    -Wthread-safety -Wzero-as-null-pointer-constant -Winconsistent-missing-override -Wunused-macros)
 endif()
 
 if(YOMBER_SANITIZE STREQUAL "address")

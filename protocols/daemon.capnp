@@ -204,8 +204,9 @@ interface ItemReceiver {
   # that leaves more than 100,000 changes waiting is cut off: its sender fails with QSOstrellErrorDomain
   # 5, and it comes back for a fresh listing.
 
-  # A batch has each item at most once, in its latest state; deletions are items with the dead flag.
   receiveUpdates @0 (items :List(Common.Item), logicalExtensions :List(Text), physicalExtensions :List(Text)) -> ();
+  # A batch has each item at most once, in its latest state; deletions are items with the dead flag.
+
   receiveProgressUpdates @1 (identifiers :List(Text)) -> ();
   # Never answered, by design; the sender drops the call at once.
 

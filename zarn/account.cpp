@@ -20,8 +20,8 @@ namespace yomber {
 
 namespace {
 
-// The file: a line that names the form, then a line an account, "+" before the one that is signed in
-// and "-" before the others, its identifier, a space, and its name.
+// The file: a line that names the form, then a line an account, "+" before the one that is signed
+// in and "-" before the others, its identifier, a space, and its name.
 constexpr std::string_view kFirstLine = "yomber-accounts 1\n";
 constexpr std::size_t kMaximumNameLength = 255;
 constexpr std::size_t kIdentifierLength = 36;
@@ -34,7 +34,8 @@ struct Known {
 using Accounts = std::vector<Known>;
 
 std::optional<Known> parseLine(std::string_view line) {
-  if (line.size() < kIdentifierLength + 3 || (line[0] != '+' && line[0] != '-')) return std::nullopt;
+  if (line.size() < kIdentifierLength + 3 || (line[0] != '+' && line[0] != '-'))
+    return std::nullopt;
   if (line[1 + kIdentifierLength] != ' ') return std::nullopt;
   Known known;
   known.isSignedIn = line[0] == '+';
@@ -149,8 +150,9 @@ class Account::State {
 
   NSErrorRef signIn(const std::string& name) {
     if (!isValidAccountName(name)) {
-      return refusal("an account's name has 1 to 255 bytes of UTF-8, no control characters, and no "
-                     "space at either end");
+      return refusal(
+          "an account's name has 1 to 255 bytes of UTF-8, no control characters, and no "
+          "space at either end");
     }
     return change([&name](Accounts& accounts) -> NSErrorRef {
       Known* account = nullptr;
@@ -218,15 +220,14 @@ std::unique_ptr<Account> Account::open(const std::string& path, NSErrorRef* erro
   }
   auto accounts = parse(text);
   if (!accounts) {
-    storeError(error, NSError::errorWithDomain(
-                          NSPOSIXErrorDomain, EINVAL,
-                          {{NSFilePathErrorKey, path},
-                           {NSLocalizedDescriptionKey,
-                            path + " is damaged: move it away and sign in again"}}));
+    storeError(error,
+               NSError::errorWithDomain(NSPOSIXErrorDomain, EINVAL,
+                                        {{NSFilePathErrorKey, path},
+                                         {NSLocalizedDescriptionKey,
+                                          path + " is damaged: move it away and sign in again"}}));
     return nullptr;
   }
-  return std::unique_ptr<Account>(
-      new Account(std::make_unique<State>(path, std::move(*accounts))));
+  return std::unique_ptr<Account>(new Account(std::make_unique<State>(path, std::move(*accounts))));
 }
 
 Account::Account(std::unique_ptr<State> state) : state_(std::move(state)) {}

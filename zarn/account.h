@@ -16,12 +16,12 @@ struct AccountRecord {
   friend bool operator==(const AccountRecord&, const AccountRecord&) = default;
 };
 
-/// Who is signed in to the drive; kept in a file of its own, so that a database that has to be built
-/// anew signs nobody out.
+/// Who is signed in to the drive; kept in a file of its own, so that a database that has to be
+/// built anew signs nobody out.
 ///
 /// Accounts that were signed in once are remembered by name and keep their identifier.
-/// Thread-safety: every operation may be called on any thread; those that change something block for
-/// the disk.
+/// Thread-safety: every operation may be called on any thread; those that change something block
+/// for the disk.
 class Account {
  public:
   /// Reads the file; a missing one means that nobody is signed in. One that cannot be read is an

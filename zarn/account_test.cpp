@@ -83,8 +83,8 @@ TEST_F(AccountTest, RefusesNamesThatAreNotText) {
 }
 
 TEST_F(AccountTest, ADamagedFileIsAnErrorAndStays) {
-  for (const std::string text : {"", "nonsense", "yomber-accounts 1\n+short\n",
-                                 "yomber-accounts 1\n+0123"}) {
+  for (const std::string text :
+       {"", "nonsense", "yomber-accounts 1\n+short\n", "yomber-accounts 1\n+0123"}) {
     std::ofstream(path_) << text;
     NSErrorRef error;
     EXPECT_EQ(Account::open(path_, &error), nullptr);
@@ -103,7 +103,7 @@ TEST_F(AccountTest, AFailedWriteChangesNothing) {
 
 TEST_F(AccountTest, TheFileIsTheUsersOwn) {
   ASSERT_EQ(open()->signIn("ada"), nullptr);
-  struct stat status {};
+  struct stat status{};
   ASSERT_EQ(stat(path_.c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777U, 0600U);
 }

@@ -39,8 +39,8 @@ std::string environmentOr(const char* name, const std::string& otherwise) {
   return value != nullptr && *value != '\0' ? value : otherwise;
 }
 
-/// Every `.desktop` file below a directory, by its desktop file id: subdirectories are joined to the
-/// name with '-'.
+/// Every `.desktop` file below a directory, by its desktop file id: subdirectories are joined to
+/// the name with '-'.
 void collectEntries(const std::string& directory, const std::string& prefix, int depth,
                     std::map<std::string, std::string>& pathsByID) {
   constexpr int kMaximumDepth = 4;
@@ -62,7 +62,7 @@ void collectEntries(const std::string& directory, const std::string& prefix, int
 std::string readFile(const std::string& path) {
   // Non-blocking: what is called .desktop may be a pipe.
   const ipc::UniqueFd file(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  struct stat status {};
+  struct stat status{};
   if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return {};
   std::string text;
   std::array<char, 16384> buffer;
@@ -272,8 +272,8 @@ class Containers::State {
   const TreeLayout layout_;
   const ipc::UniqueFd wake_;
   AtomicCell<ContainerListRef> list_;
-  Hooks hooks_;           // constant once started
-  ipc::UniqueFd queue_;   // `start`, then the thread
+  Hooks hooks_;             // constant once started
+  ipc::UniqueFd queue_;     // `start`, then the thread
   bool isApplied_ = false;  // `start`, then the thread
   std::thread thread_;
 };

@@ -53,8 +53,9 @@ TEST_F(ContainersTest, TheDrivesOwnComeFirst) {
 }
 
 TEST_F(ContainersTest, AnApplicationsContainerHasItsNameIconAndFolder) {
-  install("system/sub/org.notes.desktop",
-          "Name=Notes\nIcon=notes\nX-Yomber-Container=org.notes\nX-Yomber-Container-Name=My/Notes\n");
+  install(
+      "system/sub/org.notes.desktop",
+      "Name=Notes\nIcon=notes\nX-Yomber-Container=org.notes\nX-Yomber-Container-Name=My/Notes\n");
   EXPECT_THAT(read(), ElementsAre(ContainerRecord{.containerID = "org.notes",
                                                   .displayName = "My-Notes",
                                                   .documents = layout().documents("org.notes"),

@@ -18,7 +18,8 @@ NSErrorRef noSuchLocationError(const std::string& path) {
   const std::string text = shortened(path);
   return NSError::errorWithDomain(
       NSCocoaErrorDomain, NSFileNoSuchFileError,
-      {{NSFilePathErrorKey, text}, {NSLocalizedDescriptionKey, "the drive has no item at " + text}});
+      {{NSFilePathErrorKey, text},
+       {NSLocalizedDescriptionKey, "the drive has no item at " + text}});
 }
 
 NSErrorRef noSuchItemError(const std::string& identifier) {

@@ -7,13 +7,13 @@
 
 #include "platform/fileprovider/item_codec.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/process_usage.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/server_call.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/daemon_errors.h"
 #include "zarn/item_encoder.h"
 #include "zarn/item_sender_server.h"
-#include "platform/foundation/process_usage.h"
 
 namespace yomber {
 
@@ -260,13 +260,13 @@ kj::Promise<void> DaemonServer::enumerateItemsInFolder(EnumerateItemsInFolderCon
         failure = noSuchItemError(yomber::describe(folder.getObject()));
       }
     }
-    return answerPage(context, [drive = drive_, failure, connection = connection_, id,
-                                order = listingOrder(params.getSortOrder()),
-                                offset = params.getOffset(),
-                                limit = params.getLimit()](ListingPage& page) {
-      if (failure) return failure;
-      return drive->listing->page(connection, id, order, offset, limit, page);
-    });
+    return answerPage(context,
+                      [drive = drive_, failure, connection = connection_, id,
+                       order = listingOrder(params.getSortOrder()), offset = params.getOffset(),
+                       limit = params.getLimit()](ListingPage& page) {
+                        if (failure) return failure;
+                        return drive->listing->page(connection, id, order, offset, limit, page);
+                      });
   });
 }
 
@@ -277,13 +277,13 @@ kj::Promise<void> DaemonServer::enumerateAllFolders(EnumerateAllFoldersContext c
     if (!failure && params.getLimit() > Listing::kMaximumLimit) {
       failure = invalidParameterError("limit", std::to_string(params.getLimit()));
     }
-    return answerPage(context, [drive = drive_, failure, connection = connection_,
-                                order = listingOrder(params.getSortOrder()),
-                                offset = params.getOffset(),
-                                limit = params.getLimit()](ListingPage& page) {
-      if (failure) return failure;
-      return drive->listing->foldersPage(connection, order, offset, limit, page);
-    });
+    return answerPage(context,
+                      [drive = drive_, failure, connection = connection_,
+                       order = listingOrder(params.getSortOrder()), offset = params.getOffset(),
+                       limit = params.getLimit()](ListingPage& page) {
+                        if (failure) return failure;
+                        return drive->listing->foldersPage(connection, order, offset, limit, page);
+                      });
   });
 }
 
@@ -316,12 +316,13 @@ kj::Promise<void> DaemonServer::enumerateWorkingSetChanges(
       NSErrorRef error;
     };
     context.allowCancellation();
-    return ipc::onPool([drive = drive_, failure, token, limit = params.getLimit()](
-                           const ipc::CancelFlag&) {
-             Found found{.changes = {}, .error = failure};
-             if (!failure) found.error = drive->feed->workingSetChanges(token, limit, found.changes);
-             return found;
-           })
+    return ipc::onPool(
+               [drive = drive_, failure, token, limit = params.getLimit()](const ipc::CancelFlag&) {
+                 Found found{.changes = {}, .error = failure};
+                 if (!failure)
+                   found.error = drive->feed->workingSetChanges(token, limit, found.changes);
+                 return found;
+               })
         .then([context](Found found) mutable {
           auto result = context.getResults().initResult();
           if (found.error) return ipc::encodeError(found.error, result.initError());
@@ -363,9 +364,8 @@ kj::Promise<void> DaemonServer::observe(ObserveContext context) {
 }
 
 kj::Promise<void> DaemonServer::registerHost(RegisterHostContext context) {
-  context.getResults().setRegistration(
-      kj::heap<RegistrationServer>(drive_->registrations->addHost(
-          ipc::Remote<protocol::HostReceiver>(context.getParams().getHost()))));
+  context.getResults().setRegistration(kj::heap<RegistrationServer>(drive_->registrations->addHost(
+      ipc::Remote<protocol::HostReceiver>(context.getParams().getHost()))));
   return kj::READY_NOW;
 }
 

@@ -13,7 +13,7 @@ struct DesktopEntry {
   std::string iconName;       ///< Icon=
   std::string containerName;  ///< X-Yomber-Container-Name=; empty: the application's name
   std::vector<std::string> containerIDs;  ///< valid ones, each once, in order
-  bool isHidden = false;      ///< Hidden=true: as if the application were not installed
+  bool isHidden = false;                  ///< Hidden=true: as if the application were not installed
 };
 
 /// Reads the group "[Desktop Entry]". Nothing when there is none. Container ids that are not valid
@@ -21,8 +21,8 @@ struct DesktopEntry {
 [[nodiscard]] std::optional<DesktopEntry> parseDesktopEntry(
     std::string_view text, std::vector<std::string>* invalidIDs = nullptr);
 
-/// Reverse-DNS form: letters, digits, '-', '_' and single dots between parts, at least two parts, at
-/// most 255 bytes. Such an id is safe as the name of a folder.
+/// Reverse-DNS form: letters, digits, '-', '_' and single dots between parts, at least two parts,
+/// at most 255 bytes. Such an id is safe as the name of a folder.
 [[nodiscard]] bool isValidContainerID(std::string_view containerID);
 
 }  // namespace yomber

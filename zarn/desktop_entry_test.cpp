@@ -44,8 +44,8 @@ TEST(DesktopEntryTest, AFileWithoutTheGroupIsNone) {
 TEST(DesktopEntryTest, ContainerIDsAreSafeAsFolderNames) {
   EXPECT_TRUE(isValidContainerID("org.example.App-1_b"));
   EXPECT_TRUE(isValidContainerID("a." + std::string(253, 'b')));
-  for (const std::string bad : {"", "a", ".", "..", ".a.b", "a.b.", "a..b", "a/b.c", "a.b c", "a.\xff",
-                                "a.b;c"}) {
+  for (const std::string bad :
+       {"", "a", ".", "..", ".a.b", "a.b.", "a..b", "a/b.c", "a.b c", "a.\xff", "a.b;c"}) {
     EXPECT_FALSE(isValidContainerID(bad)) << bad;
   }
   EXPECT_FALSE(isValidContainerID(std::string("a.\0b", 4)));

@@ -62,8 +62,8 @@ void DirtyFolders::clear() {
 std::optional<DirtyFolders::Clock::time_point> DirtyFolders::dueTime() const {
   std::optional<Clock::time_point> due;
   if (!folders_.empty()) {
-    // Moves whose other end is outside the tree never get it: only the newest wait counts, and moves
-    // that follow each other closely do not put it off for good.
+    // Moves whose other end is outside the tree never get it: only the newest wait counts, and
+    // moves that follow each other closely do not put it off for good.
     due = openMoves_.empty() ? Clock::time_point::min() : openMoves_.front().waitsUntil;
   }
   if (!modifiedByTime_.empty()) {

@@ -26,8 +26,8 @@ struct DirtyFolder {
 /// Collects what has to be looked at again, until a scan takes it.
 ///
 /// What is noted is due at once, with two exceptions: while one end of a move has been seen and the
-/// other has not, everything waits a moment for it, so that both are taken together; and a file that
-/// is being written waits longer, so that it is not scanned with every block.
+/// other has not, everything waits a moment for it, so that both are taken together; and a file
+/// that is being written waits longer, so that it is not scanned with every block.
 ///
 /// Thread-safety: none; the owner guards it.
 class DirtyFolders {

@@ -120,15 +120,15 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
       feed(std::make_shared<ChangeFeed>(database)),
       observer(std::make_shared<TreeObserver>(options.observer)),
       scanner(std::make_shared<Scanner>(store, observer)),
-      watchers(Watchers::create([itemStore = store](std::uint64_t id) {
-        return itemStore->ancestors(id);
-      }, options.watchers)),
+      watchers(Watchers::create(
+          [itemStore = store](std::uint64_t id) { return itemStore->ancestors(id); },
+          options.watchers)),
       registrations(std::make_shared<Registrations>()),
       firstScan(std::make_shared<FirstScanGate>()),
       account(std::move(openedAccount)),
       containers(std::make_shared<Containers>(std::move(options.applications), layout)),
-      workingSetSignals_(std::make_shared<WorkingSetSignals>(
-          feed, [weak = std::weak_ptr(registrations)] {
+      workingSetSignals_(
+          std::make_shared<WorkingSetSignals>(feed, [weak = std::weak_ptr(registrations)] {
             if (const auto strong = weak.lock()) strong->workingSetDidChange();
           })) {
   database->addSink(observer);
@@ -147,16 +147,14 @@ void Drive::start() {
   (void)containers->start(
       {.apply = [this](const auto& folders) { return applyContainers(folders); },
        .didChange = [this] { registrations->containerListDidChange(); }});
-  observer->start({.scanAll = [this] { return scanAll(); },
-                   .scanDirty =
-                       [this](const auto& dirty, auto& notFound) {
-                         return scanner->scanDirty(dirty, notFound);
-                       },
-                   .didFinishFirstScan =
-                       [this] {
-                         housekeeping_ =
-                             std::make_unique<Housekeeping>(database, scanner, workingSetSignals_);
-                       }});
+  observer->start(
+      {.scanAll = [this] { return scanAll(); },
+       .scanDirty = [this](const auto& dirty,
+                           auto& notFound) { return scanner->scanDirty(dirty, notFound); },
+       .didFinishFirstScan =
+           [this] {
+             housekeeping_ = std::make_unique<Housekeeping>(database, scanner, workingSetSignals_);
+           }});
 }
 
 void Drive::stop() {
@@ -172,8 +170,8 @@ NSErrorRef Drive::scanAll() {
   const auto begin = std::chrono::steady_clock::now();
   ScanReport report;
   static FaultPoint beforeScan("zarn.drive.before-scan");
-  NSErrorRef error = beforeScan.hit() ? NSError::errorWithErrno(EIO, layout.tree())
-                                      : scanner->scanAll(&report);
+  NSErrorRef error =
+      beforeScan.hit() ? NSError::errorWithErrno(EIO, layout.tree()) : scanner->scanAll(&report);
   if (error) {
     if (isFirst) firstScan->fail(error);
     return error;
@@ -210,8 +208,6 @@ void Drive::accountDidChange() {
   registrations->accountTokenDidChange();
 }
 
-NSErrorRef Drive::accountError() const {
-  return account->current() ? nullptr : loggedOutError();
-}
+NSErrorRef Drive::accountError() const { return account->current() ? nullptr : loggedOutError(); }
 
 }  // namespace yomber

@@ -27,8 +27,8 @@ namespace yomber {
 /// connections, then stopped.
 ///
 /// Ownership: shared by the server's connections and the work that they have going.
-/// Thread-safety: `start` and `stop` once each, on one thread, which is not the loop thread; the parts
-/// are constant and may be used on any thread, as each of them says.
+/// Thread-safety: `start` and `stop` once each, on one thread, which is not the loop thread; the
+/// parts are constant and may be used on any thread, as each of them says.
 class Drive : public std::enable_shared_from_this<Drive> {
  public:
   struct Options {
@@ -45,8 +45,8 @@ class Drive : public std::enable_shared_from_this<Drive> {
   Drive(const Drive&) = delete;
   Drive& operator=(const Drive&) = delete;
 
-  /// Begins to observe and to scan; the first scan of an empty database has `firstScan` open when it
-  /// is done, an old database's rows are served at once.
+  /// Begins to observe and to scan; the first scan of an empty database has `firstScan` open when
+  /// it is done, an old database's rows are served at once.
   void start();
   /// Ends the threads; waits for what they are doing.
   void stop();

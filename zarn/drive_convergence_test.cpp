@@ -105,7 +105,9 @@ class DriveConvergenceTest : public testing::Test {
   unsigned pick(std::size_t count) {
     return std::uniform_int_distribution<unsigned>(0, static_cast<unsigned>(count) - 1)(random_);
   }
-  std::string somePlace() { return folders_[pick(folders_.size())] + "/" + names_[pick(names_.size())]; }
+  std::string somePlace() {
+    return folders_[pick(folders_.size())] + "/" + names_[pick(names_.size())];
+  }
 
   /// One of the things that programs do; whether it succeeds depends on what is there.
   void changeSomething() {
@@ -176,7 +178,8 @@ class DriveConvergenceTest : public testing::Test {
     (void)waitUntil([&] { return picture_->locations() == disk; });
     EXPECT_EQ(difference(picture_->locations(), disk), "") << "seed " << seed_;
   }
-  static std::string difference(const std::set<std::string>& held, const std::set<std::string>& disk) {
+  static std::string difference(const std::set<std::string>& held,
+                                const std::set<std::string>& disk) {
     std::string result;
     for (const auto& each : held) {
       if (!disk.contains(each)) result += " not on disk: " + each;

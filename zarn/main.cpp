@@ -5,12 +5,14 @@
 
 #include <array>
 #include <charconv>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
 #include "platform/foundation/drive_paths.h"
@@ -112,8 +114,8 @@ Claim claimDrive(const DrivePaths& paths) {
     claim.failure = NSError::errorWithErrno(errno, path)->localizedDescription() + ": " + path;
   } else if (flock(file.get(), LOCK_EX | LOCK_NB) != 0) {
     claim.code = kAlreadyRunning;
-    claim.failure = "the drive at " + paths.home + " is kept by process " + readOwner(file.get()) +
-                    " already";
+    claim.failure =
+        "the drive at " + paths.home + " is kept by process " + readOwner(file.get()) + " already";
   } else {
     const std::string owner = std::to_string(getpid()) + "\n";
     (void)!ftruncate(file.get(), 0);
@@ -121,6 +123,17 @@ Claim claimDrive(const DrivePaths& paths) {
     claim.lock = std::move(file);
   }
   return claim;
+}
+
+/// A scan of a large tree cannot be stopped half way, and need not be: what is stored is right at
+/// any instant, also when the process just ends.
+void endSoonAnyway() {
+  constexpr std::chrono::seconds kPatience{3};
+  std::thread([kPatience] {
+    std::this_thread::sleep_for(kPatience);
+    log_default(defaultLog(), "[NOTICE] ending in the middle of a scan");
+    _exit(0);
+  }).detach();
 }
 
 int serve(const std::shared_ptr<Drive>& drive, const sigset_t& endingSignals) {
@@ -140,6 +153,7 @@ int serve(const std::shared_ptr<Drive>& drive, const sigset_t& endingSignals) {
   }
   log_default(defaultLog(), "[NOTICE] ending on signal %d", signal);
   listener.reset();
+  endSoonAnyway();
   drive->stop();
   return 0;
 }
@@ -167,6 +181,4 @@ int run(const std::vector<std::string>& given) {
 }  // namespace
 }  // namespace yomber
 
-int main(int argc, char** argv) {
-  return yomber::run(std::vector<std::string>(argv, argv + argc));
-}
+int main(int argc, char** argv) { return yomber::run(std::vector<std::string>(argv, argv + argc)); }

@@ -46,8 +46,9 @@ bool isSameFile(const ItemRow& row, const FolderEntry& entry, const ItemAttribut
 
 bool Reconciler::isNewer(std::uint64_t rank, std::uint64_t rankBefore) const {
   if (rank <= rankBefore) return false;
-  const auto own = std::lower_bound(ownRanks_.begin(), ownRanks_.end(), rank,
-                                    [](const auto& range, std::uint64_t r) { return range.second < r; });
+  const auto own =
+      std::lower_bound(ownRanks_.begin(), ownRanks_.end(), rank,
+                       [](const auto& range, std::uint64_t r) { return range.second < r; });
   return own == ownRanks_.end() || rank <= own->first;
 }
 
@@ -124,8 +125,7 @@ void Reconciler::compareNames(WriteTransaction& transaction, std::uint64_t folde
   const EntryTable table(snapshot);
   for (const std::string& name : names) {
     const auto index = table.find(name);
-    compareEntry(transaction, folder, name, snapshot,
-                 index ? &snapshot.entries[*index] : nullptr);
+    compareEntry(transaction, folder, name, snapshot, index ? &snapshot.entries[*index] : nullptr);
   }
 }
 
@@ -155,7 +155,8 @@ bool Reconciler::refreshFolder(WriteTransaction& transaction, std::uint64_t fold
   candidate.entry = self;
   candidate.folder = snapshot.folder;
   candidate.isOpenedFolder = true;
-  candidate.attributes = readItemAttributes(pathThroughDescriptor(snapshot.folder->get(), ".").c_str());
+  candidate.attributes =
+      readItemAttributes(pathThroughDescriptor(snapshot.folder->get(), ".").c_str());
   const bool isPlace = folder == kRootID || folder == kTrashID || row->isContainerFolder();
   // Another folder has come to this place since its entry was compared: its own turn will come.
   if (!isPlace && !isSameFile(*row, self, candidate.attributes)) return false;

@@ -34,8 +34,8 @@ class Reconciler {
   Reconciler(const LinkResolver& links, std::weak_ptr<FolderVisitor> visitor)
       : links_(links), visitor_(std::move(visitor)) {}
 
-  /// Says which folder a visit reads. For other folders than those where a scan begins this is found
-  /// out when their parent is compared, if `comparesEverything` is on, or if they are new.
+  /// Says which folder a visit reads. For other folders than those where a scan begins this is
+  /// found out when their parent is compared, if `comparesEverything` is on, or if they are new.
   void setFolderOfVisit(std::uint64_t visit, std::uint64_t folder) { visits_[visit] = folder; }
   void setComparesEverything(bool on) { comparesEverything_ = on; }
 
@@ -63,7 +63,7 @@ class Reconciler {
     ItemAttributes attributes;
     std::shared_ptr<const FileDescriptor> folder;
     std::uint64_t rankBefore = 0;
-    std::uint64_t replaced = 0;  ///< the row that has its place; 0: none
+    std::uint64_t replaced = 0;   ///< the row that has its place; 0: none
     bool isOpenedFolder = false;  ///< `folder` is open on it, rather than on its parent
   };
   struct Differing {
@@ -84,7 +84,8 @@ class Reconciler {
     OwnRanks(Reconciler& reconciler, const WriteTransaction& transaction)
         : reconciler_(reconciler), transaction_(transaction), first_(transaction.rank()) {}
     ~OwnRanks() {
-      if (transaction_.rank() != first_) reconciler_.ownRanks_.emplace_back(first_, transaction_.rank());
+      if (transaction_.rank() != first_)
+        reconciler_.ownRanks_.emplace_back(first_, transaction_.rank());
     }
     OwnRanks(const OwnRanks&) = delete;
     OwnRanks& operator=(const OwnRanks&) = delete;
@@ -138,7 +139,8 @@ class Reconciler {
   std::size_t openFolders_ = 0;  ///< how many descriptors those hold
   std::unordered_set<std::uint64_t> openInodes_;
   std::vector<NewFolder> newFolders_;
-  std::vector<std::pair<std::uint64_t, std::uint64_t>> ownRanks_;  ///< rising; first < rank <= second
+  std::vector<std::pair<std::uint64_t, std::uint64_t>>
+      ownRanks_;  ///< rising; first < rank <= second
 };
 
 /// Whether a row and an entry are of the same type.

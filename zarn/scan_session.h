@@ -73,14 +73,15 @@ class ScanSession {
 class FolderScan {
  public:
   enum class Depth { NewOnly, Everything };
-  FolderScan(const ItemStore& store, const LinkResolver& links, std::weak_ptr<FolderVisitor> visitor,
-             TreeWalker::Options options)
-      : store_(store), session_(store.database(), links, std::move(visitor)),
+  FolderScan(const ItemStore& store, const LinkResolver& links,
+             std::weak_ptr<FolderVisitor> visitor, TreeWalker::Options options)
+      : store_(store),
+        session_(store.database(), links, std::move(visitor)),
         walker_(std::move(options)) {}
   [[nodiscard]] NSErrorRef run(const std::vector<std::uint64_t>& folders, Depth depth,
                                ScanReport& report);
-  /// Folders that are not where their rows say go into `notFound`; those that are to be scanned with
-  /// everything below them, into `deep`.
+  /// Folders that are not where their rows say go into `notFound`; those that are to be scanned
+  /// with everything below them, into `deep`.
   [[nodiscard]] NSErrorRef run(const std::vector<DirtyFolder>& folders,
                                std::vector<DirtyFolder>& notFound, std::vector<std::uint64_t>& deep,
                                ScanReport& report);

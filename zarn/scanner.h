@@ -16,8 +16,8 @@
 
 namespace yomber {
 
-/// Told of every folder that a scan reads, so that it can be observed without a gap: a watch that is
-/// set in `willReadFolder` sees whatever happens after the scan has read the folder.
+/// Told of every folder that a scan reads, so that it can be observed without a gap: a watch that
+/// is set in `willReadFolder` sees whatever happens after the scan has read the folder.
 class FolderVisitor {
  public:
   virtual ~FolderVisitor() = default;
@@ -33,21 +33,21 @@ class FolderVisitor {
 };
 
 struct ScanReport {
-  std::uint64_t folders = 0;   ///< read
-  std::uint64_t entries = 0;   ///< seen
-  std::uint64_t changes = 0;   ///< rows added, changed or removed
+  std::uint64_t folders = 0;     ///< read
+  std::uint64_t entries = 0;     ///< seen
+  std::uint64_t changes = 0;     ///< rows added, changed or removed
   std::uint64_t unreadable = 0;  ///< folders that could not be read; their rows were left alone
 };
 
 /// Brings the database in line with the tree: the tree decides names and content, the database
 /// decides ids.
 ///
-/// Never follows symbolic links, never leaves the tree's file system, skips what is neither file nor
-/// folder nor symbolic link, and leaves alone what it cannot read.
+/// Never follows symbolic links, never leaves the tree's file system, skips what is neither file
+/// nor folder nor symbolic link, and leaves alone what it cannot read.
 ///
 /// Thread-safety: every operation may be called on any thread, also at the same time; a change that
-/// was committed after a scan has looked is never undone by that scan. Each blocks until the rows are
-/// right; none may be called on the writer thread.
+/// was committed after a scan has looked is never undone by that scan. Each blocks until the rows
+/// are right; none may be called on the writer thread.
 class Scanner {
  public:
   Scanner(std::shared_ptr<ItemStore> store, std::weak_ptr<FolderVisitor> visitor);
@@ -73,14 +73,16 @@ class Scanner {
   /// A folder with everything below it.
   [[nodiscard]] NSErrorRef scanSubtree(std::uint64_t folder, ScanReport* report = nullptr);
 
-  /// One location, together with those ancestors of it that are not known yet. Answers the row as it
-  /// is then; nothing with NSCocoaErrorDomain 4 when the location has no item (its row, if there was
-  /// one, is gone).
-  [[nodiscard]] std::optional<ItemRow> scanLocation(std::string_view path, NSErrorRef* error = nullptr);
+  /// One location, together with those ancestors of it that are not known yet. Answers the row as
+  /// it is then; nothing with NSCocoaErrorDomain 4 when the location has no item (its row, if there
+  /// was one, is gone).
+  [[nodiscard]] std::optional<ItemRow> scanLocation(std::string_view path,
+                                                    NSErrorRef* error = nullptr);
 
   /// Writes the ids of up to `limit` items that the first scan left unmarked into their files'
   /// attributes, so that a lost database can be rebuilt with the same ids. Each write shows as an
-  /// attribute change to observers, so pace it. Answers how many were looked at; 0 when all is done.
+  /// attribute change to observers, so pace it. Answers how many were looked at; 0 when all is
+  /// done.
   [[nodiscard]] std::uint32_t stampSome(std::uint32_t limit);
 
  private:

@@ -339,9 +339,9 @@ class TreeObserver::State {
     LockGuard guard(mutex_);
     unwatchedCost_ += after - before;
     if (unwatchedRound_.empty()) {
-      nextUnwatched_ = after + std::max<Clock::duration>(
-                                   options_.unwatchedInterval,
-                                   unwatchedCost_ * options_.unwatchedCostFactor);
+      nextUnwatched_ =
+          after + std::max<Clock::duration>(options_.unwatchedInterval,
+                                            unwatchedCost_ * options_.unwatchedCostFactor);
     }
     if (watches_.unwatched().empty() && std::exchange(saidAdvice_, false)) {
       log_default(defaultLog(), "[NOTICE] every folder is watched again");
@@ -408,8 +408,6 @@ void TreeObserver::didIdentifyFolder(std::uint64_t visit, std::uint64_t id) {
   state_->didIdentifyFolder(visit, id);
 }
 void TreeObserver::didNotReadFolder(std::uint64_t id) { state_->didNotReadFolder(id); }
-void TreeObserver::committed(const std::vector<ItemChange>& changes) {
-  state_->committed(changes);
-}
+void TreeObserver::committed(const std::vector<ItemChange>& changes) { state_->committed(changes); }
 
 }  // namespace yomber

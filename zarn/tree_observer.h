@@ -29,10 +29,10 @@ struct ObservedTree {
 
 /// Sees what happens in the tree behind the daemon's back, and has it scanned.
 ///
-/// Every folder that a scan reads is watched before it is read, so nothing slips through between the
-/// two. Events become dirty names in dirty folders; the first one is acted on at once, those that
-/// come while a scan runs are taken together by the next one. Both ends of a move are kept together.
-/// An overflow of the system's event queue leads to a scan of the whole tree.
+/// Every folder that a scan reads is watched before it is read, so nothing slips through between
+/// the two. Events become dirty names in dirty folders; the first one is acted on at once, those
+/// that come while a scan runs are taken together by the next one. Both ends of a move are kept
+/// together. An overflow of the system's event queue leads to a scan of the whole tree.
 ///
 /// Where the system has no watches left, the folders without one are scanned again and again, the
 /// more rarely the more that costs; `advice` says what to raise.
@@ -49,8 +49,8 @@ class TreeObserver final : public FolderVisitor, public ChangeSink {
     std::chrono::milliseconds batchInterval{3};
     /// How long a file that is being written waits for its next scan.
     std::chrono::milliseconds modifyInterval{300};
-    /// Between two scans of the folders without a watch: at least so long, and so many times as long
-    /// as the last such scan took.
+    /// Between two scans of the folders without a watch: at least so long, and so many times as
+    /// long as the last such scan took.
     std::chrono::milliseconds unwatchedInterval{2000};
     unsigned unwatchedCostFactor = 20;
     /// After a scan that failed, doubling up to sixty times as long.
@@ -60,8 +60,8 @@ class TreeObserver final : public FolderVisitor, public ChangeSink {
   struct Status {
     std::size_t watchedFolders = 0;
     std::size_t unwatchedFolders = 0;
-    std::string advice;  ///< empty while every folder is watched
-    bool scanning = true;  ///< a scan of the whole tree is running or due
+    std::string advice;      ///< empty while every folder is watched
+    bool scanning = true;    ///< a scan of the whole tree is running or due
     NSErrorRef lastFailure;  ///< of the last scan; nil when it succeeded
   };
 

@@ -113,7 +113,7 @@ class TreeObserverTest : public testing::Test {
   }
 
   void look(const std::string& path) REQUIRES(mutex_) {
-    struct stat status {};
+    struct stat status{};
     forgetBelow(path);
     picture_.erase(path);
     if (lstat(path.c_str(), &status) != 0) return;
@@ -143,14 +143,14 @@ class TreeObserverTest : public testing::Test {
   }
 
   std::uint64_t idOf(int descriptor) REQUIRES(mutex_) {
-    struct stat status {};
+    struct stat status{};
     fstat(descriptor, &status);
     const auto [at, isNew] = idsByInode_.try_emplace(status.st_ino, nextID_);
     if (isNew) ++nextID_;
     return at->second;
   }
   static ino_t inodeOf(const std::string& path) {
-    struct stat status {};
+    struct stat status{};
     stat(path.c_str(), &status);
     return status.st_ino;
   }

@@ -28,8 +28,7 @@ std::uint64_t systemLimit(const char* name) {
 }
 
 std::string raiseAdvice(const char* setting, std::uint64_t value) {
-  const std::string assignment =
-      std::string("fs.inotify.") + setting + "=" + std::to_string(value);
+  const std::string assignment = std::string("fs.inotify.") + setting + "=" + std::to_string(value);
   return "raise fs.inotify." + std::string(setting) + " to at least " + std::to_string(value) +
          " (sudo sysctl " + assignment + ")";
 }

@@ -17,8 +17,8 @@ namespace yomber {
 
 /// The system's watches on folders, and which folder each belongs to.
 ///
-/// A folder is watched when it is about to be read, before its id is known; events that come until it
-/// is identified are remembered. Folders that get no watch are kept by id.
+/// A folder is watched when it is about to be read, before its id is known; events that come until
+/// it is identified are remembered. Folders that get no watch are kept by id.
 ///
 /// Thread-safety: none; the owner guards it. `descriptor` may be read on another thread.
 class WatchTable {

@@ -248,9 +248,9 @@ class Watchers::Member final : public Subscription {
     }
     if (taken) return sendNext();
     // The receiver has lost changes: only a fresh listing helps.
-    fail(NSError::errorWithDomain(QSOstrellErrorDomain, QSOstrellErrorConnectionLost,
-                                  {{NSLocalizedDescriptionKey,
-                                    std::string("the receiver did not take its changes")}}));
+    fail(NSError::errorWithDomain(
+        QSOstrellErrorDomain, QSOstrellErrorConnectionLost,
+        {{NSLocalizedDescriptionKey, std::string("the receiver did not take its changes")}}));
   }
 
   const Options options_;

@@ -56,8 +56,8 @@ class Subscription : public std::enable_shared_from_this<Subscription> {
 
 /// Tells watchers what was committed.
 ///
-/// Each subscription keeps the latest state of every item that waits to be told, has one batch on its
-/// way at a time, and is cut off (QSOstrellErrorDomain 5) when too much waits.
+/// Each subscription keeps the latest state of every item that waits to be told, has one batch on
+/// its way at a time, and is cut off (QSOstrellErrorDomain 5) when too much waits.
 ///
 /// Thread-safety: every operation may be called on any thread. Ownership: shared; given to the
 /// database as a sink, which holds it weakly.

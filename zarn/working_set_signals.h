@@ -14,9 +14,9 @@ namespace yomber {
 
 /// Notices when the working set has changed, whatever changed it, and says so.
 ///
-/// Commits are many and few of them touch the set: after each burst the feed is asked once whether it
-/// has anything new.
-/// Ownership: shared; given to the database as a sink. Thread-safety: any thread.
+/// Commits are many and few of them touch the set: after each burst the feed is asked once whether
+/// it has anything new. Ownership: shared; given to the database as a sink. Thread-safety: any
+/// thread.
 class WorkingSetSignals final : public ChangeSink {
  public:
   /// `signal` is called on a pool thread, one call at a time.

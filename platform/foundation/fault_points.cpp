@@ -147,7 +147,8 @@ NSErrorRef FaultPoint::arm(std::string_view faults) {
         NSPOSIXErrorDomain, EINVAL,
         {{NSLocalizedDescriptionKey,
           "faults are written name=abort, name=error or name=pause-until-file:PATH, with commas "
-          "between them: " + std::string(faults)}});
+          "between them: " +
+              std::string(faults)}});
   }
   FaultPointRegistry::shared().arm(std::move(*parsed));
   return nullptr;

@@ -19,8 +19,8 @@ namespace yomber {
 ///   YOMBER_FAULTS="zarn.store.before-commit=abort,zarn.scan.folder=pause-until-file:/tmp/x/go"
 ///
 /// Actions: `abort` ends the process as a crash would; `error` makes `hit` answer true; with
-/// `pause-until-file:PATH` the thread makes PATH.reached and waits until PATH exists. Commas cannot be
-/// part of a path here.
+/// `pause-until-file:PATH` the thread makes PATH.reached and waits until PATH exists. Commas cannot
+/// be part of a path here.
 ///
 /// Costs one relaxed load while nothing is armed.
 /// Thread-safety: every operation may be called on any thread.
@@ -33,7 +33,8 @@ class FaultPoint {
 
   /// Does what the point was armed for. True: behave as if the operation here had failed.
   [[nodiscard]] bool hit() {
-    if (!armed_.load(std::memory_order_relaxed)) [[likely]] return false;
+    if (!armed_.load(std::memory_order_relaxed)) [[likely]]
+      return false;
     return act();
   }
 

@@ -34,8 +34,8 @@ TEST_F(FaultPointsTest, ArmsPointsThatExistAndThoseThatComeLater) {
 
 TEST_F(FaultPointsTest, RefusesMalformedTextAndArmsNothing) {
   FaultPoint point("test.a");
-  for (const char* bad : {"test.a", "=error", "test.a=error,test.b", "test.a=explode",
-                          "test.a=pause-until-file:"}) {
+  for (const char* bad :
+       {"test.a", "=error", "test.a=error,test.b", "test.a=explode", "test.a=pause-until-file:"}) {
     EXPECT_NE(FaultPoint::arm(bad), nullptr) << bad;
     EXPECT_FALSE(point.hit()) << bad;
   }

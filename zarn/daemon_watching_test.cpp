@@ -1,0 +1,119 @@
+#include "zarn/daemon_server.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "platform/ostrell/constants.h"
+#include "zarn/test_daemon.h"
+
+namespace yomber::test {
+namespace {
+
+using testing::ElementsAre;
+
+class DaemonWatchingTest : public DaemonTest {};
+
+TEST_F(DaemonWatchingTest, AWatcherSeesWhatHappensOnDisk) {
+  write("stays");
+  write("goes");
+  upSignedIn();
+  const auto subscribed = subscribe();
+  ASSERT_EQ(watch(subscribed, root_), nullptr);
+  for (const auto& item : page({}, 0, 100).items) subscribed.watcher->add(item);
+  EXPECT_TRUE(subscribed.watcher->waitForNames({"stays", "goes"}));
+  write("comes");
+  fs::remove(root_ + "/goes");
+  EXPECT_TRUE(subscribed.watcher->waitForNames({"stays", "comes"}));
+  const auto identifier = subscribed.watcher->identifierOf("comes");
+  fs::rename(root_ + "/comes", root_ + "/renamed");
+  EXPECT_TRUE(subscribed.watcher->waitForNames({"stays", "renamed"}));
+  EXPECT_EQ(subscribed.watcher->identifierOf("renamed"), identifier);
+}
+
+TEST_F(DaemonWatchingTest, AMoveBetweenWatchedFoldersKeepsTheIdentity) {
+  write("from/x");
+  write("to/y");
+  upSignedIn();
+  const auto from = subscribe();
+  const auto to = subscribe();
+  ASSERT_EQ(watch(from, root_ + "/from"), nullptr);
+  ASSERT_EQ(watch(to, root_ + "/to"), nullptr);
+  const auto item = itemAt(root_ + "/from/x", false);
+  ASSERT_TRUE(item);
+  from.watcher->add(*item);
+  fs::rename(root_ + "/from/x", root_ + "/to/x");
+  EXPECT_TRUE(from.watcher->waitForNames({}));
+  EXPECT_TRUE(to.watcher->waitForNames({"x"}));
+  EXPECT_EQ(to.watcher->identifierOf("x"), item->identifier);
+  EXPECT_EQ(locationOf(item->identifier), root_ + "/to/x");
+}
+
+TEST_F(DaemonWatchingTest, ARecursiveWatcherHoldsWhatIsOnDisk) {
+  upSignedIn();
+  const auto subscribed = subscribe();
+  ASSERT_EQ(watch(subscribed, root_, 23), nullptr);
+  std::set<std::string> expected;
+  for (int i = 0; i < 20; ++i) {
+    const std::string folder = "folder" + std::to_string(i);
+    write(folder + "/deep/file" + std::to_string(i));
+    if (i % 3 == 0) {
+      fs::remove_all(root_ + "/" + folder);
+      continue;
+    }
+    expected.insert({folder, "deep", "file" + std::to_string(i)});
+  }
+  EXPECT_TRUE(subscribed.watcher->waitForNames(expected));
+}
+
+TEST_F(DaemonWatchingTest, OnlyFoldersThatExistCanBeWatched) {
+  write("file");
+  upSignedIn();
+  const auto subscribed = subscribe();
+  EXPECT_TRUE(watch(subscribed, root_ + "/nothing")->is(NSCocoaErrorDomain, NSFileNoSuchFileError));
+  EXPECT_TRUE(watch(subscribed, root_ + "/file")->is(NSPOSIXErrorDomain, ENOTDIR));
+  EXPECT_TRUE(
+      watch(subscribed, root_, 0)->is(QSOstrellErrorDomain, QSOstrellErrorInvalidParameter));
+  fs::create_directory(root_ + "/just-made");
+  EXPECT_EQ(watch(subscribed, root_ + "/just-made"), nullptr);
+}
+
+TEST_F(DaemonWatchingTest, DroppingTheSenderEndsItsWatch) {
+  upSignedIn();
+  auto subscribed = subscribe();
+  ASSERT_EQ(watch(subscribed, root_), nullptr);
+  EXPECT_EQ(drive_->watchers->count(), 1U);
+  subscribed.sender = nullptr;
+  const auto deadline = steady_clock::now() + std::chrono::seconds(10);
+  while (drive_->watchers->count() != 0 && steady_clock::now() < deadline) {
+    call(&Wire::Client::describeRequest, [](auto) {}, [](auto) {});
+  }
+  EXPECT_EQ(drive_->watchers->count(), 0U);
+}
+
+TEST_F(DaemonWatchingTest, WithoutEnoughWatchesItSaysWhatToRaiseAndStillSeesChanges) {
+  write("a/x");
+  write("b/x");
+  Drive::Options options;
+  options.observer.watchLimit = 2;
+  options.observer.unwatchedInterval = std::chrono::milliseconds(10);
+  options.observer.unwatchedCostFactor = 1;
+  upSignedIn(options);
+  const auto a = subscribe();
+  const auto b = subscribe();
+  ASSERT_EQ(watch(a, root_ + "/a"), nullptr);
+  ASSERT_EQ(watch(b, root_ + "/b"), nullptr);
+  write("a/new");
+  write("b/new");
+  EXPECT_TRUE(a.watcher->waitForNames({"new"}));
+  EXPECT_TRUE(b.watcher->waitForNames({"new"}));
+  call(
+      &Wire::Client::statusRequest, [](auto) {},
+      [](auto results) {
+        EXPECT_EQ(results.getStatus().getObservation(), Wire::Status::Observation::SCANNING);
+        EXPECT_THAT(stringFromWire(results.getStatus().getObservationAdvice()),
+                    testing::HasSubstr("--watch-limit"));
+      });
+}
+
+}  // namespace
+}  // namespace yomber::test

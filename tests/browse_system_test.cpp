@@ -25,7 +25,8 @@ TEST_F(Browse, AnEmptyDriveListsNothing) {
 }
 
 TEST_F(Browse, NamesComeInNaturalOrderWithNumbersAsNumbers) {
-  for (const char* name : {"file 10", "file 9", "File 1", "apple", "Übung", "zebra"}) drive_.write(name);
+  for (const char* name : {"file 10", "file 9", "File 1", "apple", "Übung", "zebra"})
+    drive_.write(name);
   drive_.up();
   const std::vector<std::string> expected{"apple", "File 1", "file 9", "file 10", "Übung", "zebra"};
   EXPECT_EQ(drive_.names(), expected);
@@ -35,7 +36,8 @@ TEST_F(Browse, ByDateTheNewestComesFirst) {
   int age = 0;
   for (const char* name : {"newest", "newer", "old"}) {
     drive_.write(name);
-    fs::last_write_time(drive_.root() + "/" + name, fs::file_time_type::clock::now() - std::chrono::hours(age++));
+    fs::last_write_time(drive_.root() + "/" + name,
+                        fs::file_time_type::clock::now() - std::chrono::hours(age++));
   }
   drive_.up();
   EXPECT_EQ(drive_.names("/", "date"), (std::vector<std::string>{"newest", "newer", "old"}));

@@ -53,7 +53,11 @@ pid_t spawn(std::vector<std::string> arguments, const Environment& extra, int ou
   posix_spawn_file_actions_init(&actions);
   posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
   posix_spawn_file_actions_adddup2(&actions, output, STDOUT_FILENO);
-  if (errors >= 0) posix_spawn_file_actions_adddup2(&actions, errors, STDERR_FILENO);
+  if (errors >= 0) {
+    posix_spawn_file_actions_adddup2(&actions, errors, STDERR_FILENO);
+  } else {
+    posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
+  }
   std::vector<std::string> environment = environmentWith(extra);
   pid_t pid = -1;
   const int failure = posix_spawn(&pid, arguments[0].c_str(), &actions, nullptr,

@@ -1,0 +1,207 @@
+// Writes what well-behaved clients send, as inputs for the socket targets, and well-formed messages
+// for wire_items: make_seeds DIRECTORY makes DIRECTORY/<target>/<name>.
+
+#include <capnp/message.h>
+#include <capnp/serialize.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <span>
+#include <string>
+#include <vector>
+
+#include "platform/fileprovider/item_codec.h"
+#include "platform/fileprovider/wire_item.h"
+#include "platform/ipc/error_codec.h"
+#include "protocols/control.capnp.h"
+#include "protocols/daemon.capnp.h"
+#include "protocols/extension.capnp.h"
+#include "tests/fuzz/expect.h"
+#include "tests/fuzz/fixed_home.h"
+#include "tests/fuzz/hostile_input.h"
+#include "tests/fuzz/rpc_script.h"
+
+namespace yomber::fuzz {
+namespace {
+
+using capnp::Schema;
+using protocol::Control;
+using protocol::Daemon;
+using protocol::Extension;
+
+struct Call {
+  const char* method;
+  std::string parameters;
+};
+
+class Corpus {
+ public:
+  Corpus(const std::string& directory, const char* target) : folder_(directory + "/" + target) {
+    std::filesystem::create_directories(folder_);
+  }
+
+  void add(const std::string& name, std::span<const std::uint8_t> bytes) const {
+    std::ofstream file(folder_ + "/" + name, std::ios::binary | std::ios::trunc);
+    file.write(reinterpret_cast<const char*>(bytes.data()),
+               static_cast<std::streamsize>(bytes.size()));
+    expect(file.good(), "a seed was written");
+  }
+  void add(const std::string& name, const RpcScript& script) const {
+    add(name, script.input(kPatient));
+    add(name + "-framed", script.input(kFramed | kPatient));
+  }
+  /// One input for each call, and one with all of them.
+  void addCalls(capnp::InterfaceSchema interface, const std::vector<Call>& calls) const {
+    RpcScript all;
+    const auto server = all.bootstrap();
+    for (const Call& call : calls) {
+      RpcScript one;
+      one.call(one.bootstrap(), interface, call.method, call.parameters.c_str());
+      add(call.method, one);
+      all.call(server, interface, call.method, call.parameters.c_str());
+    }
+    add("everything", all);
+  }
+
+ private:
+  const std::string folder_;
+};
+
+void addDaemonSeeds(const Corpus& corpus) {
+  const auto daemon = Schema::from<Daemon>();
+  const std::string root = kDaemonRoot;
+  corpus.addCalls(daemon,
+                  {{"describe", "()"},
+                   {"urlForItemIdentifier", "(identifier = \"i:3000\")"},
+                   {"documentLocation", "(object = (kind = document, rawID = 2001))"},
+                   {"itemAtLocation", "(path = \"" + root + "/item 1\", fakeFSEvent = true)"},
+                   {"containers", "()"},
+                   {"containerItem", "(containerID = \"com.kelvo.YomberDrive\", forceScan = true)"},
+                   {"enumerateItemsInFolder",
+                    "(folder = (object = (kind = folder, rawID = 3000)), sortOrder = date, offset "
+                    "= 3, limit = 5)"},
+                   {"enumerateAllFolders", "(sortOrder = name, offset = 0, limit = 1000)"},
+                   {"currentNotifRank", "()"},
+                   {"enumerateWorkingSetChanges", "(token = (none = void), limit = 2)"},
+                   {"account", "()"},
+                   {"signIn", "(name = \"grace\")"},
+                   {"signOut", "()"},
+                   {"observe", "()"},
+                   {"registerHost", "()"},
+                   {"status", "()"}});
+  RpcScript watching;
+  auto sender = watching.call(watching.bootstrap(), daemon, "getItemUpdateSender");
+  sender.pointers = {0, 0};
+  const auto interface = Schema::from<protocol::ItemSender>();
+  const std::string watched = "(path = \"" + root + "\", options = 23)";
+  watching.call(sender, interface, "boostPriority");
+  watching.call(sender, interface, "watchItem", watched.c_str());
+  watching.call(sender, interface, "invalidate");
+  watching.finish(sender);
+  corpus.add("watching", watching);
+}
+
+void addControlSeeds(const Corpus& corpus) {
+  const auto control = Schema::from<Control>();
+  const std::string root = "NSFileProviderRootContainerItemIdentifier";
+  corpus.addCalls(control, {{"item", "(identifier = \"item7\")"},
+                            {"locate", "(identifier = \"item7\")"},
+                            {"identify", "(path = \"/root/item7\")"},
+                            {"list", "(container = \"" + root + "\", sortOrder = date)"},
+                            {"watch", "(container = \"" + root + "\")"},
+                            {"status", "()"}});
+  RpcScript listing;
+  auto pages = listing.call(listing.bootstrap(), control, "list", "(container = \"folder\")");
+  pages.pointers = {0};
+  for (int page = 0; page < 3; ++page)
+    listing.call(pages, Schema::from<protocol::Listing>(), "next");
+  listing.finish(pages);
+  corpus.add("listing", listing);
+}
+
+void addExtensionSeeds(const Corpus& corpus) {
+  const auto extension = Schema::from<Extension>();
+  const auto interface = Schema::from<protocol::Enumerator>();
+  corpus.addCalls(extension, {{"urlForItem", "(identifier = \"d:2001\")"},
+                              {"identifierForPath", "(path = \"/tmp/item\")"},
+                              {"itemForIdentifier", "(identifier = \"i:3000\")"},
+                              {"enumerator", "(container = \"i:3000\")"}});
+  for (const char* const container : {"i:3000", "NSFileProviderRootContainerItemIdentifier",
+                                      "NSFileProviderWorkingSetContainerItemIdentifier"}) {
+    RpcScript listing;
+    const std::string parameters = std::string("(container = \"") + container + "\")";
+    auto enumerator =
+        listing.call(listing.bootstrap(), extension, "enumerator", parameters.c_str());
+    enumerator.pointers = {0, 0};
+    listing.call(enumerator, interface, "currentSyncAnchor");
+    listing.call(enumerator, interface, "enumerateItems", "(page = (initialByName = void))");
+    listing.call(enumerator, interface, "enumerateItems",
+                 "(page = (token = \"\\xc8\\0\\0\\0\\0\\0\\0\\0\\0\\0\\0\\0\\0\\0\\0\\0\"))");
+    listing.call(enumerator, interface, "enumerateChanges",
+                 "(anchor = \"123456789012345678901234\")");
+    listing.call(enumerator, interface, "invalidate");
+    listing.finish(enumerator);
+    corpus.add(std::string("listing-") + container, listing);
+  }
+}
+
+template <typename Root, typename Fill>
+void addMessage(const Corpus& corpus, const char* name, Fill fill) {
+  capnp::MallocMessageBuilder message;
+  fill(message.initRoot<Root>());
+  const auto words = capnp::messageToFlatArray(message);
+  const auto bytes = words.asBytes();
+  corpus.add(name, {bytes.begin(), bytes.size()});
+}
+
+ItemFields fullItem() {
+  ItemFields item;
+  item.identifier = "d:2001";
+  item.parentIdentifier = "i:3000";
+  item.filename = "a name.txt";
+  item.contentType = "text/plain";
+  item.tags = {"red", "green"};
+  item.favoriteRank = 5;
+  item.containerID = "com.example.app";
+  return item;
+}
+
+void addMessageSeeds(const Corpus& corpus) {
+  registerItemsInErrors();
+  addMessage<protocol::Item>(corpus, "item", [](auto builder) { encodeItem(fullItem(), builder); });
+  NSErrorRef error = NSError::errorWithDomain("Innermost", 1);
+  for (int depth = 0; depth < ipc::kMaximumErrorDepth; ++depth) {
+    error =
+        NSError::errorWithDomain("Domain", depth,
+                                 {{NSUnderlyingErrorKey, error},
+                                  {"text", std::string("words")},
+                                  {"number", std::int64_t{7}},
+                                  {"url", NSURL::fileURLWithPath("/tmp/x")},
+                                  {"item", NSObjectRef(std::make_shared<WireItem>(fullItem()))}});
+  }
+  addMessage<protocol::Error>(corpus, "error",
+                              [&](auto builder) { ipc::encodeError(error, builder); });
+  addMessage<protocol::Daemon::PageResult>(corpus, "page", [](auto builder) {
+    auto items = builder.initPage().initItems(3);
+    for (auto item : items) encodeItem(fullItem(), item);
+  });
+}
+
+}  // namespace
+}  // namespace yomber::fuzz
+
+int main(int argc, char** argv) {
+  using namespace yomber::fuzz;
+  if (argc != 2) {
+    (void)std::fprintf(stderr, "usage: make_seeds DIRECTORY\n");
+    return 64;
+  }
+  const std::string directory = argv[1];
+  addDaemonSeeds(Corpus(directory, "daemon_socket"));
+  addControlSeeds(Corpus(directory, "control_socket"));
+  addExtensionSeeds(Corpus(directory, "extension_socket"));
+  addMessageSeeds(Corpus(directory, "wire_items"));
+  return 0;
+}

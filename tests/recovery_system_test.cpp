@@ -1,0 +1,277 @@
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <random>
+#include <set>
+#include <thread>
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include "tests/harness/test_drive.h"
+
+namespace yomber::testing {
+namespace {
+
+namespace fs = std::filesystem;
+using Process = TestDrive::Process;
+
+std::set<std::string> namesOnDisk(const std::string& folder) {
+  std::set<std::string> names;
+  for (const auto& entry : fs::directory_iterator(folder)) names.insert(entry.path().filename());
+  return names;
+}
+
+/// What a `yomber watch` holds, kept up to date from the lines it prints.
+class Watch {
+ public:
+  explicit Watch(TestDrive& drive, const std::string& folder = "/")
+      : process_(drive.commandLine({"--json", "watch", "--list", folder}), drive.environment()) {}
+
+  /// Reads until what the watch holds is what is on disk.
+  bool converges(const std::set<std::string>& expected) {
+    return held() == expected || process_.readUntil([&](const std::string& line) {
+      take(nlohmann::json::parse(line));
+      return held() == expected;
+    });
+  }
+
+  bool shows(const std::string& name) {
+    return process_.readUntil([&](const std::string& line) {
+      take(nlohmann::json::parse(line));
+      return held().contains(name);
+    });
+  }
+
+ private:
+  void take(const nlohmann::json& change) {
+    const std::string event = change["event"];
+    if (event == "removed") {
+      const auto known = names_.find(change["id"]);
+      if (known == names_.end()) return;
+      held_.erase(known->second);
+      names_.erase(known);
+    } else if (change.contains("item")) {
+      const std::string id = change["item"]["id"];
+      const auto known = names_.find(id);
+      if (known != names_.end()) held_.erase(known->second);
+      names_[id] = change["item"]["name"];
+      held_.insert(names_[id]);
+    }
+  }
+  const std::set<std::string>& held() const { return held_; }
+
+  LineProcess process_;
+  std::map<std::string, std::string> names_;
+  std::set<std::string> held_;
+};
+
+class Recovery : public ::testing::Test {
+ protected:
+  TestDrive drive_;
+};
+
+TEST_F(Recovery, ChangesMadeWhileTheDaemonIsDeadShowWithoutAnyoneAsking) {
+  drive_.write("before");
+  drive_.up();
+  Watch watch(drive_);
+  ASSERT_TRUE(watch.shows("before"));
+  const auto supervisor = drive_.status()["supervisor"]["pid"].get<pid_t>();
+  const pid_t daemon = drive_.pidOf(Process::Zarn);
+  kill(supervisor, SIGSTOP);
+  kill(daemon, SIGKILL);
+  drive_.write("meanwhile");
+  fs::remove(drive_.root() + "/before");
+  kill(supervisor, SIGCONT);
+  EXPECT_TRUE(watch.converges({"meanwhile"}));
+}
+
+TEST_F(Recovery, AWatchGoesOnWhenTheExtensionIsKilled) {
+  drive_.write("before");
+  drive_.up();
+  Watch watch(drive_);
+  ASSERT_TRUE(watch.shows("before"));
+  drive_.kill(Process::Extension);
+  drive_.write("after");
+  EXPECT_TRUE(watch.converges({"before", "after"}));
+}
+
+TEST_F(Recovery, AWatchEndsWithAClearErrorWhenTheHostIsKilled) {
+  drive_.up();
+  LineProcess watch(drive_.commandLine({"--json", "watch", "--list"}), drive_.environment());
+  drive_.write("first");
+  ASSERT_TRUE(watch.readUntil(
+      [](const std::string& line) { return line.find("first") != std::string::npos; }));
+  drive_.kill(Process::Host);
+  EXPECT_EQ(watch.waitForEnd(), 69);
+}
+
+TEST_F(Recovery, AStoppedDaemonIsNoDisconnectAndGoesOnAfterwards) {
+  drive_.write("kept");
+  drive_.environment()["YOMBER_DAEMON_TIMEOUT_MS"] = "500";
+  drive_.up();
+  ASSERT_EQ(drive_.names(), (std::vector<std::string>{"kept"}));
+  const pid_t daemon = drive_.pidOf(Process::Zarn);
+  kill(daemon, SIGSTOP);
+  const ProcessResult stuck = drive_.yomber({"ls"});
+  EXPECT_FALSE(stuck.timedOut);
+  EXPECT_NE(stuck.exitCode, 0);
+  EXPECT_FALSE(stuck.errors.empty());
+  kill(daemon, SIGCONT);
+  EXPECT_TRUE(eventually([&] { return drive_.yomber({"ls"}).output == "kept\n"; }));
+}
+
+TEST_F(Recovery, SigningOutInTheMiddleOfAListingEndsItWithAResultOrAClearError) {
+  for (int number = 0; number < 20'000; ++number) drive_.write("file " + std::to_string(number));
+  drive_.up();
+  LineProcess listing(drive_.commandLine({"--json", "ls"}), drive_.environment());
+  ASSERT_TRUE(listing.readUntil([](const std::string&) { return true; }));
+  ASSERT_EQ(drive_.yomber({"account", "sign-out"}).exitCode, 0);
+  std::size_t lines = 1;
+  listing.readUntil([&](const std::string&) { return ++lines > 20'000; });
+  EXPECT_EQ(listing.waitForEnd(), 77) << lines << " lines";
+  EXPECT_LT(lines, 20'000U);
+}
+
+TEST_F(Recovery, AFolderSoBusyThatItsHistoryOverflowsAgainAndAgainStillConverges) {
+  drive_.up();
+  Watch watch(drive_);
+  drive_.write("first");
+  ASSERT_TRUE(watch.shows("first"));
+  for (int burst = 0; burst < 4; ++burst) {
+    // While the host takes nothing, the extension's history overflows.
+    const pid_t host = drive_.pidOf(Process::Host);
+    kill(host, SIGSTOP);
+    for (int number = 0; number < 5'100; ++number) {
+      drive_.write("burst " + std::to_string(burst) + " file " + std::to_string(number));
+    }
+    kill(host, SIGCONT);
+    fs::remove(drive_.root() + "/burst " + std::to_string(burst) + " file 7");
+  }
+  EXPECT_TRUE(watch.converges(namesOnDisk(drive_.root())));
+}
+
+TEST_F(Recovery, AFolderWhoseInodeIsReusedAtOnceSharesNothingWithTheOldOne) {
+  drive_.makeFolder("first");
+  drive_.write("first/inside");
+  drive_.up();
+  const std::string before = drive_.json({"id", "first"}).at(0)["id"];
+  struct stat old{};
+  struct stat now{};
+  int reused = 0;
+  for (int round = 0; round < 50 && reused == 0; ++round) {
+    ASSERT_EQ(stat((drive_.root() + "/first").c_str(), &old), 0);
+    fs::remove_all(drive_.root() + "/first");
+    drive_.makeFolder("first");
+    ASSERT_EQ(stat((drive_.root() + "/first").c_str(), &now), 0);
+    reused += old.st_ino == now.st_ino ? 1 : 0;
+  }
+  if (reused == 0) GTEST_SKIP() << "this file system did not give an inode number twice";
+  std::string after;
+  EXPECT_TRUE(eventually([&] {
+    const ProcessResult found = drive_.yomber({"id", "first"});
+    after = found.output;
+    return found.exitCode == 0 && after != before + "\n";
+  })) << after;
+  EXPECT_TRUE(drive_.names("first").empty());
+  EXPECT_EQ(drive_.yomber({"stat", before}).exitCode, 66);
+}
+
+TEST_F(Recovery, OddNamesAreListedAsTheyAre) {
+  const std::string longest(255, 'n');
+  const std::vector<std::string> odd{longest,          "bad \xff\xfe utf-8", "two\nlines",
+                                     " leading blank", "tab\there",          "'quoted\""};
+  for (const std::string& name : odd) drive_.write(name);
+  drive_.write("caf\u00e9");   // composed
+  drive_.write("cafe\u0301");  // decomposed: the same name to a person
+  drive_.up();
+  std::set<std::string> shown;
+  std::size_t count = 0;
+  for (const nlohmann::json& item : drive_.json({"ls"})) {
+    ++count;
+    if (item.contains("name")) shown.insert(item["name"]);
+  }
+  EXPECT_EQ(count, odd.size() + 2);
+  for (const std::string& name : {longest, odd[2], odd[3], odd[4], odd[5]})
+    EXPECT_TRUE(shown.contains(name)) << name;
+  // One of the twins is shown under another name; both are items of their own.
+  EXPECT_FALSE(shown.contains("caf\u00e9") && shown.contains("cafe\u0301"));
+}
+
+TEST_F(Recovery, AnotherUsersProcessIsRefused) {
+  if (geteuid() != 0) GTEST_SKIP() << "only root can become another user";
+  drive_.write("secret");
+  drive_.up();
+  std::vector<std::string> words{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534",
+                                 "--clear-groups"};
+  for (const std::string& word : drive_.commandLine({"ls"})) words.push_back(word);
+  const ProcessResult refused = runProcess(words, drive_.environment());
+  EXPECT_NE(refused.exitCode, 0);
+  EXPECT_EQ(refused.output.find("secret"), std::string::npos);
+}
+
+/// Kills at random while clients list and watch.
+TEST_F(Recovery, AHundredKillsLeaveNothingHangingAndListsRight) {
+  for (int number = 0; number < 300; ++number) drive_.write("file " + std::to_string(number));
+  drive_.up();
+  const std::set<std::string> expected = namesOnDisk(drive_.root());
+  std::atomic<bool> stop = false;
+  std::atomic<int> calls = 0;
+  std::atomic<int> hung = 0;
+  std::vector<std::jthread> clients;
+  for (const char* order : {"name", "date"}) {
+    clients.emplace_back([&, order] {
+      while (!stop) {
+        hung += drive_.yomber({"ls", "--sort", order}).timedOut ? 1 : 0;
+        ++calls;
+      }
+    });
+  }
+  for (int watcher = 0; watcher < 2; ++watcher) {
+    clients.emplace_back([&] {
+      while (!stop) {
+        LineProcess watch(drive_.commandLine({"--json", "watch", "--list"}), drive_.environment());
+        watch.readUntil([&](const std::string&) { return stop.load(); }, std::chrono::seconds(2));
+      }
+    });
+  }
+  std::mt19937 random(20);  // the same order in every run
+  for (int round = 0; round < 100; ++round) {
+    const int before = calls;
+    drive_.kill(std::array{Process::Zarn, Process::Host, Process::Extension}[random() % 3]);
+    ASSERT_TRUE(eventually([&] { return calls > before; }))
+        << "no client call ended after kill " << round;
+  }
+  stop = true;
+  clients.clear();
+  EXPECT_EQ(hung, 0);
+  EXPECT_TRUE(eventually([&] {
+    const ProcessResult listed = drive_.yomber({"ls"});
+    return listed.exitCode == 0 &&
+           static_cast<std::size_t>(std::ranges::count(listed.output, '\n')) == expected.size();
+  }));
+  const std::vector<std::string> names = drive_.names();
+  EXPECT_EQ(std::set<std::string>(names.begin(), names.end()), expected);
+}
+
+TEST_F(Recovery, TheHostKeepsNothingOfExtensionsThatDied) {
+  drive_.write("file");
+  drive_.up();
+  const auto killAndRecover = [&] {
+    drive_.kill(Process::Extension);
+    ASSERT_TRUE(eventually([&] { return drive_.yomber({"ls"}).exitCode == 0; }));
+  };
+  for (int round = 0; round < 3; ++round) killAndRecover();
+  const nlohmann::json early = drive_.status()["fileproviderd"];
+  for (int round = 0; round < 6; ++round) killAndRecover();
+  const nlohmann::json late = drive_.status()["fileproviderd"];
+  EXPECT_LE(late["open_descriptors"].get<int>(), early["open_descriptors"].get<int>() + 2);
+  EXPECT_LE(late["resident_bytes"].get<long>(), early["resident_bytes"].get<long>() + 8'000'000);
+}
+
+}  // namespace
+}  // namespace yomber::testing

@@ -74,7 +74,7 @@ TEST_F(ContainersTest, TheUsersFileStandsInForTheSystems) {
 
 TEST_F(ContainersTest, NobodyTakesAnothersContainerOrTheDrivesOwn) {
   install("user/a.desktop", "Name=First\nX-Yomber-Container=org.shared\n");
-  install("system/b.desktop", "Name=Second\nX-Yomber-Containers=org.shared;org.b;" +
+  install("system/b.desktop", std::string("Name=Second\nX-Yomber-Containers=org.shared;org.b;") +
                                   QSUbiquitousDefaultContainerID + "\n");
   const auto list = read();
   ASSERT_EQ(list.size(), 2U);

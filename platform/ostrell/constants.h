@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <string>
 
 namespace yomber {
 
@@ -19,20 +18,22 @@ inline constexpr std::int64_t QSOstrellErrorWatcherTooSlow = 5;
 inline constexpr const char* QSOstrellErrorParameterKey = "QSOstrellErrorParameter";
 inline constexpr const char* QSOstrellErrorValueKey = "QSOstrellErrorValue";
 
+// Plain literals, never destroyed: threads may still use them while the process ends.
+
 /// Containers that every drive has. The default container's documents location is the drive's root.
-inline const std::string QSUbiquitousDefaultContainerID = "com.kelvo.YomberDrive";
-inline const std::string QSUbiquitousDocumentsContainerID = "com.kelvo.YomberDrive.Documents";
-inline const std::string QSUbiquitousDesktopContainerID = "com.kelvo.YomberDrive.Desktop";
+inline constexpr const char* QSUbiquitousDefaultContainerID = "com.kelvo.YomberDrive";
+inline constexpr const char* QSUbiquitousDocumentsContainerID = "com.kelvo.YomberDrive.Documents";
+inline constexpr const char* QSUbiquitousDesktopContainerID = "com.kelvo.YomberDrive.Desktop";
 
 /// Names of the ordinary folders in the root that those two containers stand for.
-inline const std::string QSUbiquitousDocumentsFolderName = "Documents";
-inline const std::string QSUbiquitousDesktopFolderName = "Desktop";
+inline constexpr const char* QSUbiquitousDocumentsFolderName = "Documents";
+inline constexpr const char* QSUbiquitousDesktopFolderName = "Desktop";
 
 /// Posted after the account changed; observers ask QSAccount afresh.
-inline const std::string QSAccountTokenDidChangeNotification =
+inline constexpr const char* QSAccountTokenDidChangeNotification =
     "QSAccountTokenDidChangeNotification";
 /// Posted after the list of containers changed.
-inline const std::string QSContainerListDidChangeNotification =
+inline constexpr const char* QSContainerListDidChangeNotification =
     "QSContainerListDidChangeNotification";
 
 }  // namespace yomber

@@ -68,7 +68,7 @@ TEST(Locations, ExcludedByAnyNameBelowTheDocuments) {
 TEST(Locations, ContainersAndTheirDocuments) {
   for (const std::string& containerID :
        {QSUbiquitousDefaultContainerID, QSUbiquitousDocumentsContainerID,
-        QSUbiquitousDesktopContainerID, std::string("org.example.App")}) {
+        QSUbiquitousDesktopContainerID, "org.example.App"}) {
     EXPECT_EQ(kDrive.containerOfDocuments(kDrive.containerDocuments(containerID)), containerID);
   }
   EXPECT_EQ(kDrive.containerDocuments(QSUbiquitousDesktopContainerID), kDrive.root() + "/Desktop");

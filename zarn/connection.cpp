@@ -8,7 +8,14 @@ namespace {
 
 constexpr int kBusyMilliseconds = 10000;
 
+/// SQLite's own accounting of memory takes a lock for every allocation. Nobody reads it.
+void configureOnce() {
+  static const int result = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0);
+  (void)result;
+}
+
 int openFlags(Connection::Mode mode) {
+  configureOnce();
   // No mutex: a connection is used by one thread at a time.
   const int access = mode == Connection::Mode::Read ? SQLite::OPEN_READONLY
                                                     : SQLite::OPEN_READWRITE | SQLite::OPEN_CREATE;

@@ -38,11 +38,9 @@ SortedSnapshot::SortedSnapshot(std::unique_ptr<FolderSnapshot> folder)
 
 std::uint64_t FirstScan::idFor(const FolderEntry& entry, const ItemAttributes& attributes) {
   const bool hasOwn = attributes.id && entry.carriesID();
-  if (hasOwn && usedIDs_.insert(*attributes.id).second) return *attributes.id;
-  for (;;) {
-    const std::uint64_t id = randomID();
-    if (usedIDs_.insert(id).second) return id;
-  }
+  if (hasOwn && knownIDs_.insert(*attributes.id).second) return *attributes.id;
+  // Should it ever be another item's, the index over the ids refuses, and the scan is done again.
+  return randomID();
 }
 
 void FirstScan::fillRow(const FolderSnapshot& snapshot, const FolderEntry& entry,
@@ -61,7 +59,7 @@ void FirstScan::fillRow(const FolderSnapshot& snapshot, const FolderEntry& entry
 }
 
 void FirstScan::addPlace(ItemRow row, std::uint64_t visit) {
-  if (row.id >= kFirstIssuedID) usedIDs_.insert(row.id);
+  if (row.id >= kFirstIssuedID) knownIDs_.insert(row.id);
   if (row.parent == kRootID) reserved_.push_back(row.name);
   visits_[visit] = {row.id, row.isTrashed()};
   load_.add(row, nameSortKey(row.name));
@@ -117,7 +115,7 @@ void FirstScan::addFolder(const SortedSnapshot& sorted) {
   for (std::size_t i = 0; i < sorted.order.size(); ++i) {
     const std::size_t index = sorted.order[i].entry;
     const FolderEntry& entry = snapshot.entries[index];
-    const ItemAttributes& attributes = snapshot.attributes[index];
+    const ItemAttributes& attributes = snapshot.attributesOf(index);
     row.id = idFor(entry, attributes);
     row.name = snapshot.nameOf(entry);
     row.diskName.clear();

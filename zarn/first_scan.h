@@ -64,9 +64,9 @@ class FirstScan {
   const LinkResolver& links_;
   const std::weak_ptr<FolderVisitor> visitor_;
   std::unordered_map<std::uint64_t, Parent> visits_;
-  std::unordered_set<std::uint64_t> usedIDs_;
-  std::vector<std::string> reserved_;  ///< in the root
-  std::vector<std::string> given_;     ///< in the current folder, beside its entries' own names
+  std::unordered_set<std::uint64_t> knownIDs_;  ///< those that files brought along
+  std::vector<std::string> reserved_;           ///< in the root
+  std::vector<std::string> given_;  ///< in the current folder, beside its entries' own names
 };
 
 }  // namespace yomber

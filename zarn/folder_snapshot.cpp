@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstddef>
@@ -56,6 +57,14 @@ void addEntry(int folder, const char* name, FolderSnapshot& snapshot) {
 }
 
 }  // namespace
+
+const ItemAttributes& FolderSnapshot::attributesOf(std::size_t entry) const {
+  static const ItemAttributes none;
+  const auto found = std::lower_bound(
+      attributes.begin(), attributes.end(), entry,
+      [](const auto& element, std::size_t index) { return element.first < index; });
+  return found != attributes.end() && found->first == entry ? found->second : none;
+}
 
 bool lookAtEntry(int folder, const char* name, FolderEntry& out) {
   constexpr unsigned kWanted = STATX_TYPE | STATX_MODE | STATX_NLINK | STATX_INO | STATX_SIZE |

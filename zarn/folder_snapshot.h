@@ -4,6 +4,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "zarn/file_descriptor.h"
@@ -45,12 +46,13 @@ struct FolderSnapshot {
   std::shared_ptr<const FileDescriptor> folder;  ///< open on the folder
   std::string names;
   std::vector<FolderEntry> entries;
-  std::vector<ItemAttributes>
-      attributes;  ///< beside `entries` when they were asked for, else empty
+  /// Those that say anything, by the entries' index, when they were asked for.
+  std::vector<std::pair<std::size_t, ItemAttributes>> attributes;
 
   [[nodiscard]] std::string_view nameOf(const FolderEntry& entry) const {
     return std::string_view(names).substr(entry.nameOffset, entry.nameLength);
   }
+  [[nodiscard]] const ItemAttributes& attributesOf(std::size_t entry) const;
 };
 
 /// Looks at `name` in the open folder, or with an empty name at the folder itself. False when it is

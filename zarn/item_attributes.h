@@ -23,6 +23,8 @@ struct ItemAttributes {
   bool isShared = false;
   bool isFault = false;  ///< its content is not here
   ItemExtra extra;       ///< without the container
+
+  [[nodiscard]] bool isEmpty() const { return !id && !isShared && !isFault && extra.isEmpty(); }
 };
 
 /// Reads them; none where the file is gone or has none. Values that make no sense count as absent.

@@ -95,13 +95,13 @@ std::unique_ptr<FolderSnapshot> TreeWalker::read(std::shared_ptr<const FileDescr
 void TreeWalker::readAttributes(FolderSnapshot& snapshot) {
   const int folder = snapshot.folder->get();
   const bool isRelative = hasOwnWorkingDirectory() && fchdir(folder) == 0;
-  snapshot.attributes.resize(snapshot.entries.size());
   for (std::size_t i = 0; i < snapshot.entries.size(); ++i) {
     const FolderEntry& entry = snapshot.entries[i];
     if (entry.type == EntryType::Symlink) continue;
     std::string name(snapshot.nameOf(entry));
     if (!isRelative) name = pathThroughDescriptor(folder, name);
-    snapshot.attributes[i] = readItemAttributes(name.c_str());
+    ItemAttributes attributes = readItemAttributes(name.c_str());
+    if (!attributes.isEmpty()) snapshot.attributes.emplace_back(i, std::move(attributes));
   }
 }
 

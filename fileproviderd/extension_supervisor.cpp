@@ -37,6 +37,13 @@ void ExtensionSupervisor::acquire(SessionHandler handler) {
   if (state_ == State::Idle) begin();
 }
 
+void ExtensionSupervisor::sessionWasLost(const ExtensionSessionRef& session,
+                                         const NSErrorRef& reason) {
+  if (state_ == State::Running && running_ == session) {
+    giveUpOn(extensionUnavailableError("closed its connection", reason));
+  }
+}
+
 void ExtensionSupervisor::begin() {
   state_ = State::Probing;
   daemon_.probe([weak = weak_from_this()](const NSErrorRef& error) {

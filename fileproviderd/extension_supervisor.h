@@ -54,6 +54,9 @@ class ExtensionSupervisor : public std::enable_shared_from_this<ExtensionSupervi
   /// Calls `handler` once, within a bounded time: with the running extension, or with why there is
   /// none. Calls it at once when there is one.
   void acquire(SessionHandler handler);
+  /// A call on `session` failed with the connection. The extension may not have been seen to end
+  /// yet: whoever acquires from now on gets the next one.
+  void sessionWasLost(const ExtensionSessionRef& session, const NSErrorRef& reason);
 
   /// The extension took too long for something: asks it for a sign of life.
   void suspect() { ping(); }

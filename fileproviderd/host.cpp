@@ -106,15 +106,19 @@ void Host::ask(Ask ask, std::function<void(std::optional<Answer>, NSErrorRef)> h
   supervisor_->acquire([weak = weak_from_this(), ask, handler = std::move(handler), attempts](
                            const ExtensionSessionRef& session, const NSErrorRef& error) {
     if (session == nullptr) return handler(std::nullopt, error);
-    ask(*session, [weak, ask, handler, attempts](std::optional<Answer> answer, NSErrorRef failure) {
-      const auto self = weak.lock();
-      if (self == nullptr) return handler(std::nullopt, failure);
-      if (wasLost(failure) && attempts > 1) return self->ask<Answer>(ask, handler, attempts - 1);
-      if (failure == nullptr) return handler(std::move(answer), nullptr);
-      self->explain(failure, [handler](NSErrorRef explained) {
-        handler(std::nullopt, std::move(explained));
-      });
-    });
+    ask(*session,
+        [weak, ask, handler, attempts, session](std::optional<Answer> answer, NSErrorRef failure) {
+          const auto self = weak.lock();
+          if (self == nullptr) return handler(std::nullopt, failure);
+          if (wasLost(failure)) {
+            self->supervisor_->sessionWasLost(session, failure);
+            if (attempts > 1) return self->ask<Answer>(ask, handler, attempts - 1);
+          }
+          if (failure == nullptr) return handler(std::move(answer), nullptr);
+          self->explain(failure, [handler](NSErrorRef explained) {
+            handler(std::nullopt, std::move(explained));
+          });
+        });
   });
 }
 

@@ -66,7 +66,7 @@ TEST(Locations, ExcludedByAnyNameBelowTheDocuments) {
 }
 
 TEST(Locations, ContainersAndTheirDocuments) {
-  for (const std::string& containerID :
+  for (const std::string containerID :
        {QSUbiquitousDefaultContainerID, QSUbiquitousDocumentsContainerID,
         QSUbiquitousDesktopContainerID, "org.example.App"}) {
     EXPECT_EQ(kDrive.containerOfDocuments(kDrive.containerDocuments(containerID)), containerID);

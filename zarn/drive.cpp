@@ -140,8 +140,8 @@ Drive::~Drive() { stop(); }
 
 void Drive::start() {
   if (!database->needsFirstScan()) {
-    firstScan->open();
     workingSetSignals_->start();
+    firstScan->open();
   }
   // Before the scan, so that it looks into the containers' folders too.
   (void)containers->start(

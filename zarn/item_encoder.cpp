@@ -14,10 +14,9 @@ namespace {
 class IdentifierText {
  public:
   IdentifierText(std::uint64_t id, ItemKind kind) {
-    if (id == kRootID) {
-      text_ = NSFileProviderRootContainerItemIdentifier;
-    } else if (id == kTrashID) {
-      text_ = NSFileProviderTrashContainerItemIdentifier;
+    if (id == kRootID || id == kTrashID) {
+      text_ = id == kRootID ? NSFileProviderRootContainerItemIdentifier
+                            : NSFileProviderTrashContainerItemIdentifier;
     } else {
       buffer_[0] = identifierLetter(kind);
       buffer_[1] = ':';

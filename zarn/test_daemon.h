@@ -13,6 +13,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <system_error>
 #include <vector>
 
 #include "platform/fileprovider/item_codec.h"
@@ -79,9 +80,10 @@ class Watcher {
     }
     return {};
   }
+  /// From a listing: what was told meanwhile is newer.
   void add(const ItemFields& item) {
     LockGuard guard(mutex_);
-    names_[item.identifier] = item.filename;
+    if (!told_.contains(item.identifier)) names_[item.identifier] = item.filename;
   }
 
  private:
@@ -89,6 +91,7 @@ class Watcher {
     LockGuard guard(mutex_);
     for (const auto item : items) {
       const ItemFields fields = decodeItem(item);
+      told_.insert(fields.identifier);
       if ((fields.flags & row_flag::kDead) != 0) {
         names_.erase(fields.identifier);
       } else {
@@ -106,6 +109,7 @@ class Watcher {
   Mutex mutex_;
   Condition changed_;
   std::map<std::string, std::string> names_ GUARDED_BY(mutex_);
+  std::set<std::string> told_ GUARDED_BY(mutex_);
   NSErrorRef failure_ GUARDED_BY(mutex_);
 };
 
@@ -177,7 +181,8 @@ class DaemonTest : public testing::Test {
   ~DaemonTest() override {
     FaultPoint::disarmAll();
     down();
-    fs::remove_all(base_);
+    std::error_code ignored;  // the database's own files go when it is closed
+    fs::remove_all(base_, ignored);
   }
 
   void up(Drive::Options options = {}) {
@@ -210,6 +215,7 @@ class DaemonTest : public testing::Test {
     if (drive_) drive_->stop();
     drive_.reset();
     while (!ending.expired()) ipc::EventLoop::shared().runAndWait([] {});
+    ipc::EventLoop::shared().runAndWait([] {});  // its destructor has run there
   }
   void write(const std::string& name, const std::string& text = "x") {
     fs::create_directories(fs::path(root_ + "/" + name).parent_path());

@@ -49,7 +49,7 @@ WorkingSetSignals::WorkingSetSignals(std::shared_ptr<ChangeFeed> feed, std::func
 WorkingSetSignals::~WorkingSetSignals() = default;
 
 void WorkingSetSignals::start() {
-  state_->queue->async([state = state_] { (void)state->readToEnd(); });
+  state_->queue->sync([this] { (void)state_->readToEnd(); });
 }
 
 void WorkingSetSignals::committed(const std::vector<ItemChange>&) { check_->request(); }

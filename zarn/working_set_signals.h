@@ -23,7 +23,7 @@ class WorkingSetSignals final : public ChangeSink {
   WorkingSetSignals(std::shared_ptr<ChangeFeed> feed, std::function<void()> signal);
   ~WorkingSetSignals() override;
 
-  /// Takes the set as it is now as known.
+  /// Takes the set as it is now as known; what changes after the return is signalled. Blocks.
   void start();
   void committed(const std::vector<ItemChange>& changes) override;
   /// To be called now and then: items leave the set as time goes by. `now` in ns since the epoch.

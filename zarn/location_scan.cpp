@@ -11,6 +11,8 @@
 namespace yomber {
 namespace {
 
+constexpr int kMaximumAttempts = 8;
+
 NSErrorRef noSuchItem(std::string_view path) {
   return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
                                   {{NSFilePathErrorKey, std::string(path)}});
@@ -26,6 +28,13 @@ NSErrorRef whyNotOpened(int number, std::string_view path) {
 std::string diskNameOf(const ItemStore& store, std::uint64_t folder, const std::string& name) {
   const auto row = store.itemByName(folder, name);
   return row && !row->isContainerFolder() ? row->nameOnDisk() : name;
+}
+
+void addOnlyEntry(FolderSnapshot& snapshot, const std::string& name, FolderEntry entry) {
+  snapshot.names = name;
+  entry.nameLength = static_cast<std::uint16_t>(name.size());
+  if (entry.type == EntryType::Folder) entry.visit = TreeWalker::nextVisit();
+  snapshot.entries.push_back(entry);
 }
 
 std::optional<ItemRow> rowOnDisk(const ItemStore& store, std::uint64_t folder,
@@ -69,36 +78,31 @@ std::optional<ItemRow> LocationScan::run(std::string_view path, NSErrorRef* erro
 std::optional<ItemRow> LocationScan::scanName(std::uint64_t folder,
                                               const std::shared_ptr<const FileDescriptor>& opened,
                                               const std::string& name, NSErrorRef& error) {
-  const NSErrorRef none = error;
   const std::string diskName = diskNameOf(store_, folder, name);
-  FolderSnapshot snapshot;
-  snapshot.rankBefore = options_.currentRank();
-  snapshot.folder = opened;
-  FolderEntry entry;
-  const bool exists = lookAtEntry(opened->get(), diskName.c_str(), entry);
-  if (!exists && errno != ENOENT && errno != EINVAL && errno != ENAMETOOLONG) {
-    error = NSError::errorWithErrno(errno, name);
-    return std::nullopt;
+  std::optional<ItemRow> row;
+  // Others may change the file or its row meanwhile. What was stored is looked at again, so that
+  // the answer is right, unless the file does not come to rest at all.
+  for (int attempt = 0; attempt < kMaximumAttempts; ++attempt) {
+    FolderSnapshot snapshot;
+    snapshot.rankBefore = options_.currentRank();
+    snapshot.folder = opened;
+    FolderEntry entry;
+    const bool exists = lookAtEntry(opened->get(), diskName.c_str(), entry);
+    if (!exists && errno != ENOENT && errno != EINVAL && errno != ENAMETOOLONG) {
+      error = NSError::errorWithErrno(errno, name);
+      return std::nullopt;
+    }
+    NSErrorRef failure;
+    row = rowOnDisk(store_, folder, diskName, failure);
+    const bool isRight = exists ? row && isAsBefore(*row, entry) : !row;
+    if (failure) error = failure;
+    if (isRight || failure) return row;
+    if (exists) addOnlyEntry(snapshot, diskName, entry);
+    if ((failure = compare(folder, diskName, snapshot))) {
+      error = failure;
+      return std::nullopt;
+    }
   }
-  auto row = rowOnDisk(store_, folder, diskName, error);
-  if (error) return std::nullopt;
-  error = none;
-  const bool isRight = exists && row && row->inode == entry.inode && row->ctime == entry.ctime;
-  if (isRight) return row;
-  if (!exists && !row) return std::nullopt;
-  if (exists) {
-    snapshot.names = diskName;
-    entry.nameLength = static_cast<std::uint16_t>(diskName.size());
-    if (entry.type == EntryType::Folder) entry.visit = TreeWalker::nextVisit();
-    snapshot.entries.push_back(entry);
-  }
-  if (NSErrorRef failure = compare(folder, diskName, snapshot)) {
-    error = failure;
-    return std::nullopt;
-  }
-  NSErrorRef failure;
-  row = rowOnDisk(store_, folder, diskName, failure);
-  if (failure) error = failure;
   return row;
 }
 
@@ -107,7 +111,12 @@ NSErrorRef LocationScan::compare(std::uint64_t folder, const std::string& diskNa
   ScanSession session(store_.database(), links_, visitor_);
   TreeWalker walker(options_);
   ScanReport report;
-  return session.compareNameAndFinish(folder, diskName, snapshot, walker, report);
+  const NSErrorRef error = session.compareNameAndFinish(folder, diskName, snapshot, walker, report);
+  for (DirtyFolder& conflict : session.takeConflicts()) {
+    // This very name is looked at again anyway.
+    if (conflict.id != folder) conflicts_.push_back(std::move(conflict));
+  }
+  return error;
 }
 
 }  // namespace yomber

@@ -3,6 +3,8 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
+#include <vector>
 
 #include "zarn/scan_session.h"
 
@@ -16,6 +18,8 @@ class LocationScan {
       : store_(store), links_(links), visitor_(std::move(visitor)), options_(std::move(options)) {}
 
   [[nodiscard]] std::optional<ItemRow> run(std::string_view path, NSErrorRef* error);
+  /// See Reconciler::takeConflicts.
+  [[nodiscard]] std::vector<DirtyFolder> takeConflicts() { return std::exchange(conflicts_, {}); }
 
  private:
   /// The row of `name` in an open folder, right as of now; nothing with an error when there is
@@ -30,6 +34,7 @@ class LocationScan {
   const LinkResolver& links_;
   const std::weak_ptr<FolderVisitor> visitor_;
   const TreeWalker::Options options_;
+  std::vector<DirtyFolder> conflicts_;
 };
 
 }  // namespace yomber

@@ -1,4 +1,3 @@
-#include <atomic>
 #include <thread>
 
 #include "zarn/scanner.h"
@@ -104,22 +103,22 @@ TEST_F(LocationScanTest, SymbolicLinksOnTheWayAreNotFollowed) {
 }
 
 TEST_F(LocationScanTest, AScanThatLookedEarlierUndoesNothing) {
-  std::atomic<bool> isDone = false;
-  std::thread reconciling([&] {
-    while (!isDone) EXPECT_EQ(scanner->scanAll(), nullptr);
+  const auto describe = [this] { return error ? error->description() : std::string("no error"); };
+  std::jthread reconciling([this](const std::stop_token& stop) {
+    while (!stop.stop_requested()) EXPECT_EQ(scanner->scanAll(), nullptr);
   });
   for (int i = 0; i < 300; ++i) {
     const std::string name = "file " + std::to_string(i);
     write(name);
     const auto found = look(name);
-    ASSERT_TRUE(found) << name;
+    ASSERT_TRUE(found) << name << ": " << describe();
     rename(name, "folder/" + name);
     const auto moved = look("folder/" + name);
-    ASSERT_TRUE(moved);
+    ASSERT_TRUE(moved) << name << ": " << describe();
     EXPECT_EQ(moved->id, found->id);
     EXPECT_TRUE(store->itemByID(found->id));
   }
-  isDone = true;
+  reconciling.request_stop();
   reconciling.join();
   scan();
   EXPECT_EQ(names(id("folder")).size(), 301U);

@@ -12,11 +12,11 @@ namespace {
 constexpr std::size_t kMaximumOpenFolders = 64;
 
 constexpr const char* kCompared =
-    "SELECT id,inode,ctime,rank,kind,coalesce(disk_name,name) FROM item WHERE parent=?1";
+    "SELECT id,inode,ctime,rank,size,coalesce(disk_name,name) FROM item WHERE parent=?1";
 
 // Containers' folders lie elsewhere and have no entries in the root.
 constexpr const char* kComparedInRoot =
-    "SELECT id,inode,ctime,rank,kind,coalesce(disk_name,name) FROM item WHERE parent=?1 "
+    "SELECT id,inode,ctime,rank,size,coalesce(disk_name,name) FROM item WHERE parent=?1 "
     "AND id NOT IN (SELECT id FROM extra WHERE container_id IS NOT NULL)";
 
 std::string attributePath(const FolderSnapshot& snapshot, const FolderEntry& entry) {
@@ -37,6 +37,11 @@ bool isSameType(const ItemRow& row, const FolderEntry& entry) {
   return false;
 }
 
+bool isAsBefore(const ItemRow& row, const FolderEntry& entry) {
+  // The size as well: while a file is written, its dates change a moment before its size does.
+  return row.inode == entry.inode && row.ctime == entry.ctime && row.size == entry.size;
+}
+
 bool isSameFile(const ItemRow& row, const FolderEntry& entry, const ItemAttributes& attributes) {
   if (!isSameType(row, entry) || row.inode != entry.inode) return false;
   if (entry.hasBirthTime) return row.btime == entry.btime;
@@ -50,6 +55,22 @@ bool Reconciler::isNewer(std::uint64_t rank, std::uint64_t rankBefore) const {
       std::lower_bound(ownRanks_.begin(), ownRanks_.end(), rank,
                        [](const auto& range, std::uint64_t r) { return range.second < r; });
   return own == ownRanks_.end() || rank <= own->first;
+}
+
+void Reconciler::noteConflict(std::uint64_t folder, std::string_view name) {
+  auto& names = conflicts_[folder];
+  if (!name.empty()) names.emplace(name);
+}
+
+std::vector<DirtyFolder> Reconciler::takeConflicts() {
+  std::vector<DirtyFolder> result;
+  for (const auto& [folder, names] : std::exchange(conflicts_, {})) {
+    DirtyFolder dirty;
+    dirty.id = folder;
+    dirty.names.assign(names.begin(), names.end());
+    result.push_back(std::move(dirty));
+  }
+  return result;
 }
 
 Reconciler::Differences Reconciler::findDifferences(WriteTransaction& transaction,
@@ -66,12 +87,18 @@ Reconciler::Differences Reconciler::findDifferences(WriteTransaction& transactio
     const bool isLeftAlone = isNewer(rows->id(3), snapshot.rankBefore);
     const auto index = table.find(rows->bytes(5));
     if (!index || result.isKnown[*index]) {
-      if (!isLeftAlone && !snapshot.isPartial) result.gone.push_back(id);
+      if (isLeftAlone) {
+        noteConflict(folder, rows->bytes(5));
+      } else if (!snapshot.isPartial) {
+        result.gone.push_back(id);
+      }
       continue;
     }
     result.isKnown[*index] = true;
     const FolderEntry& entry = snapshot.entries[*index];
-    const bool isUnchanged = rows->id(1) == entry.inode && rows->integer(2) == entry.ctime;
+    const bool isUnchanged =
+        rows->id(1) == entry.inode && rows->integer(2) == entry.ctime && rows->id(4) == entry.size;
+    if (isLeftAlone && !isUnchanged) noteConflict(folder, rows->bytes(5));
     if (isUnchanged || isLeftAlone) {
       if (entry.type == EntryType::Folder) noteFolder(snapshot, entry, id, false);
     } else {
@@ -132,13 +159,13 @@ void Reconciler::compareNames(WriteTransaction& transaction, std::uint64_t folde
 /// `entry` is null when nothing has that name.
 void Reconciler::compareEntry(WriteTransaction& transaction, std::uint64_t folder,
                               const std::string& name, const FolderSnapshot& snapshot,
-                              const FolderEntry* entry) {
+                              const FolderEntry* entry, Trust trust) {
   auto row = findByDiskName(transaction.connection(), folder, name);
   if (entry == nullptr) {
     if (row) noteGone(std::move(*row), snapshot);
   } else if (!row) {
     addCandidate(transaction, folder, snapshot, *entry, 0);
-  } else if (row->inode != entry->inode || row->ctime != entry->ctime) {
+  } else if (trust == Trust::Nothing || !isAsBefore(*row, *entry)) {
     settleKnown(transaction, snapshot, std::move(*row), *entry);
   }
 }
@@ -148,7 +175,7 @@ bool Reconciler::refreshFolder(WriteTransaction& transaction, std::uint64_t fold
   const auto row = findByID(transaction.connection(), folder);
   if (!row || !row->isFolder()) return false;
   const FolderEntry& self = snapshot.self;
-  if (row->inode == self.inode && row->ctime == self.ctime) return true;
+  if (isAsBefore(*row, self)) return true;
   Candidate candidate;
   candidate.parent = row->parent;
   candidate.name = row->nameOnDisk();
@@ -160,13 +187,20 @@ bool Reconciler::refreshFolder(WriteTransaction& transaction, std::uint64_t fold
   const bool isPlace = folder == kRootID || folder == kTrashID || row->isContainerFolder();
   // Another folder has come to this place since its entry was compared: its own turn will come.
   if (!isPlace && !isSameFile(*row, self, candidate.attributes)) return false;
-  if (!isNewer(row->rank, snapshot.rankBefore)) storeChanged(transaction, candidate, *row);
+  if (isNewer(row->rank, snapshot.rankBefore)) {
+    noteConflict(folder, {});
+  } else {
+    storeChanged(transaction, candidate, *row);
+  }
   return true;
 }
 
 void Reconciler::settleKnown(WriteTransaction& transaction, const FolderSnapshot& snapshot,
                              ItemRow row, const FolderEntry& entry) {
-  if (isNewer(row.rank, snapshot.rankBefore)) return;
+  if (isNewer(row.rank, snapshot.rankBefore)) {
+    noteConflict(row.parent, row.nameOnDisk());
+    return;
+  }
   ItemAttributes attributes;
   if (entry.type != EntryType::Symlink) {
     attributes = readItemAttributes(attributePath(snapshot, entry).c_str());
@@ -195,7 +229,11 @@ void Reconciler::settleKnown(WriteTransaction& transaction, const FolderSnapshot
 
 void Reconciler::noteGone(ItemRow row, const FolderSnapshot& snapshot) {
   // A container's folder lies elsewhere and has no entry in the root.
-  if (row.isContainerFolder() || isNewer(row.rank, snapshot.rankBefore)) return;
+  if (row.isContainerFolder()) return;
+  if (isNewer(row.rank, snapshot.rankBefore)) {
+    noteConflict(row.parent, row.nameOnDisk());
+    return;
+  }
   const std::uint64_t id = row.id;
   gone_.insert_or_assign(id, std::move(row));
 }

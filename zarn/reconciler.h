@@ -1,8 +1,10 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -10,6 +12,7 @@
 #include <utility>
 #include <vector>
 
+#include "zarn/dirty_folders.h"
 #include "zarn/folder_snapshot.h"
 #include "zarn/item_row.h"
 #include "zarn/link_resolver.h"
@@ -50,6 +53,9 @@ class Reconciler {
   /// Decides what was left open, and removes the rows of what is gone.
   void finish(WriteTransaction& transaction);
 
+  /// What was left alone because others had changed it since it was looked at: to be looked at
+  /// again.
+  [[nodiscard]] std::vector<DirtyFolder> takeConflicts();
   [[nodiscard]] bool hasNewFolders() const { return !newFolders_.empty(); }
   [[nodiscard]] std::vector<NewFolder> takeNewFolders() { return std::exchange(newFolders_, {}); }
 
@@ -96,11 +102,16 @@ class Reconciler {
     const std::uint64_t first_;
   };
 
+  void noteConflict(std::uint64_t folder, std::string_view name);
+
   // Telling (reconciler.cpp).
   Differences findDifferences(WriteTransaction& transaction, std::uint64_t folder,
                               const FolderSnapshot& snapshot);
+  /// Whether times that are the same mean that nothing has changed. Not where something is known to
+  /// have happened: two changes within one tick of the disk's clock have the same times.
+  enum class Trust { Times, Nothing };
   void compareEntry(WriteTransaction& transaction, std::uint64_t folder, const std::string& name,
-                    const FolderSnapshot& snapshot, const FolderEntry* entry);
+                    const FolderSnapshot& snapshot, const FolderEntry* entry, Trust trust);
   bool refreshFolder(WriteTransaction& transaction, std::uint64_t folder,
                      const FolderSnapshot& snapshot);
   void settleKnown(WriteTransaction& transaction, const FolderSnapshot& snapshot, ItemRow row,
@@ -116,6 +127,7 @@ class Reconciler {
   [[nodiscard]] std::optional<ItemRow> findOwnRow(WriteTransaction& transaction,
                                                   const Candidate& candidate);
   [[nodiscard]] bool isElsewhere(const ItemRow& row) const;
+  bool isStillThere(const Candidate& candidate);
   void decide(WriteTransaction& transaction, Candidate& candidate);
   void decideOpen(WriteTransaction& transaction);
   bool takeReplaced(WriteTransaction& transaction, Candidate& candidate);
@@ -138,11 +150,14 @@ class Reconciler {
   std::vector<Candidate> open_;
   std::size_t openFolders_ = 0;  ///< how many descriptors those hold
   std::unordered_set<std::uint64_t> openInodes_;
+  std::map<std::uint64_t, std::set<std::string>> conflicts_;  ///< by folder; no name: itself alone
   std::vector<NewFolder> newFolders_;
   std::vector<std::pair<std::uint64_t, std::uint64_t>>
       ownRanks_;  ///< rising; first < rank <= second
 };
 
+/// Whether an entry is what its row says, without reading more of it.
+[[nodiscard]] bool isAsBefore(const ItemRow& row, const FolderEntry& entry);
 /// Whether a row and an entry are of the same type.
 [[nodiscard]] bool isSameType(const ItemRow& row, const FolderEntry& entry);
 /// Whether a row's file is that of an entry, wherever each of them is: by inode and, since inode

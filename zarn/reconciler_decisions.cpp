@@ -31,11 +31,22 @@ bool Reconciler::isElsewhere(const ItemRow& row) const {
          });
 }
 
+/// A folder is read some time before its entries are decided on. What has gone meanwhile, and whose
+/// going others may have seen already, must not come back.
+bool Reconciler::isStillThere(const Candidate& candidate) {
+  FolderEntry now;
+  const bool isThere = lookAtEntry(candidate.folder->get(), candidate.name.c_str(), now) &&
+                       now.inode == candidate.entry.inode;
+  if (!isThere) noteConflict(candidate.parent, candidate.name);
+  return isThere;
+}
+
 bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidate) {
   const auto place = gone_.find(candidate.replaced);
   if (place == gone_.end() || candidate.entry.type != EntryType::File) return false;
   const ItemRow replaced = place->second;
   if (!isSameType(replaced, candidate.entry) || isElsewhere(replaced)) return false;
+  if (!isStillThere(candidate)) return false;
   const auto own = findOwnRow(transaction, candidate);
   if (own && (own->flags & row_flag::kUploaded) != 0) return false;
   // A file that nobody else knows yet, saved over a document: the document goes on.
@@ -50,8 +61,17 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
 }
 
 void Reconciler::decide(WriteTransaction& transaction, Candidate& candidate) {
+  if (!isStillThere(candidate)) {
+    // What it replaced is decided on with whatever is there now.
+    gone_.erase(candidate.replaced);
+    return;
+  }
   if (const auto own = findOwnRow(transaction, candidate)) {
-    if (!isNewer(own->rank, candidate.rankBefore)) move(transaction, candidate, *own);
+    if (isNewer(own->rank, candidate.rankBefore)) {
+      noteConflict(candidate.parent, candidate.name);
+    } else {
+      move(transaction, candidate, *own);
+    }
     return;
   }
   const auto& id = candidate.attributes.id;
@@ -113,8 +133,12 @@ void Reconciler::finish(WriteTransaction& transaction) {
 void Reconciler::removeGone(WriteTransaction& transaction) {
   for (const auto& [id, row] : gone_) {
     const auto current = findByID(transaction.connection(), id);
-    // Its folder may have taken it along, and somebody else's scan may know better.
-    if (current && current->rank == row.rank) transaction.remove(*current);
+    if (!current) continue;  // its folder has taken it along
+    if (current->rank == row.rank) {
+      transaction.remove(*current);
+    } else {
+      noteConflict(current->parent, current->nameOnDisk());
+    }
   }
   gone_.clear();
 }

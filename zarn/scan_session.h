@@ -56,6 +56,8 @@ class ScanSession {
   [[nodiscard]] NSErrorRef finish();
 
   [[nodiscard]] std::uint64_t changes() const { return changes_; }
+  /// See Reconciler::takeConflicts.
+  [[nodiscard]] std::vector<DirtyFolder> takeConflicts() { return reconciler_.takeConflicts(); }
 
  private:
   using Work = std::function<void(WriteTransaction&)>;
@@ -85,6 +87,8 @@ class FolderScan {
   [[nodiscard]] NSErrorRef run(const std::vector<DirtyFolder>& folders,
                                std::vector<DirtyFolder>& notFound, std::vector<std::uint64_t>& deep,
                                ScanReport& report);
+  /// See Reconciler::takeConflicts.
+  [[nodiscard]] std::vector<DirtyFolder> takeConflicts() { return session_.takeConflicts(); }
 
  private:
   std::shared_ptr<const FileDescriptor> open(std::uint64_t& folder);

@@ -22,6 +22,8 @@
 namespace yomber {
 namespace {
 
+/// How often what others keep changing is looked at again.
+constexpr int kMaximumRounds = 8;
 constexpr std::size_t kWaitingFolders = 64;
 constexpr std::size_t kWaitingEntries = 50'000;
 
@@ -96,6 +98,15 @@ class Scanner::State {
   NSErrorRef findPlaces(std::vector<ScanPlace>& places) const;
   NSErrorRef firstScan(ScanReport& report);
   NSErrorRef reconcile(ScanReport& report);
+  NSErrorRef scanFolders(const std::vector<std::uint64_t>& folders, FolderScan::Depth depth,
+                         ScanReport& report);
+  NSErrorRef scanDirty(const std::vector<DirtyFolder>& folders, std::vector<DirtyFolder>& notFound,
+                       ScanReport& report);
+  /// Looks again at what others have changed during a scan.
+  NSErrorRef settle(std::vector<DirtyFolder> conflicts);
+  [[nodiscard]] FolderScan folderScan() const {
+    return {*store, links, visitor, walkerOptions(false)};
+  }
 
   const std::shared_ptr<ItemStore> store;
   const std::weak_ptr<FolderVisitor> visitor;
@@ -173,7 +184,40 @@ NSErrorRef Scanner::State::reconcile(ScanReport& report) {
   }
   const NSErrorRef error = session.finish();
   report.changes = session.changes();
-  return error;
+  return error ? error : settle(session.takeConflicts());
+}
+
+NSErrorRef Scanner::State::settle(std::vector<DirtyFolder> conflicts) {
+  for (int round = 0; round < kMaximumRounds && !conflicts.empty(); ++round) {
+    FolderScan scan = folderScan();
+    ScanReport report;
+    // What has moved on, or is to be read as a whole, is told of by whoever moved it.
+    std::vector<DirtyFolder> notFound;
+    std::vector<std::uint64_t> deep;
+    if (NSErrorRef error = scan.run(conflicts, notFound, deep, report)) return error;
+    conflicts = scan.takeConflicts();
+  }
+  return nullptr;
+}
+
+NSErrorRef Scanner::State::scanFolders(const std::vector<std::uint64_t>& folders,
+                                       FolderScan::Depth depth, ScanReport& report) {
+  FolderScan scan = folderScan();
+  const NSErrorRef error = scan.run(folders, depth, report);
+  return error ? error : settle(scan.takeConflicts());
+}
+
+NSErrorRef Scanner::State::scanDirty(const std::vector<DirtyFolder>& folders,
+                                     std::vector<DirtyFolder>& notFound, ScanReport& report) {
+  std::vector<std::uint64_t> deep;
+  FolderScan scan = folderScan();
+  if (NSErrorRef error = scan.run(folders, notFound, deep, report)) return error;
+  if (NSErrorRef error = settle(scan.takeConflicts())) return error;
+  for (const std::uint64_t folder : deep) {
+    const auto depth = FolderScan::Depth::Everything;
+    if (NSErrorRef error = scanFolders({folder}, depth, report)) return error;
+  }
+  return nullptr;
 }
 
 Scanner::Scanner(std::shared_ptr<ItemStore> store, std::weak_ptr<FolderVisitor> visitor)
@@ -199,8 +243,7 @@ NSErrorRef Scanner::scanFolders(const std::vector<std::uint64_t>& folders, ScanR
   ScanReport own;
   ScanReport& out = report != nullptr ? *report : own;
   out = {};
-  FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
-  return scan.run(folders, FolderScan::Depth::NewOnly, out);
+  return state_->scanFolders(folders, FolderScan::Depth::NewOnly, out);
 }
 
 NSErrorRef Scanner::scanDirty(const std::vector<DirtyFolder>& folders,
@@ -208,24 +251,12 @@ NSErrorRef Scanner::scanDirty(const std::vector<DirtyFolder>& folders,
   ScanReport own;
   ScanReport& out = report != nullptr ? *report : own;
   out = {};
-  const auto run = [&](const std::vector<DirtyFolder>& some,
-                       std::vector<DirtyFolder>& missing) -> NSErrorRef {
-    std::vector<std::uint64_t> deep;
-    FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
-    if (NSErrorRef error = scan.run(some, missing, deep, out)) return error;
-    for (const std::uint64_t folder : deep) {
-      FolderScan below(*state_->store, state_->links, state_->visitor,
-                       state_->walkerOptions(false));
-      if (NSErrorRef error = below.run({folder}, FolderScan::Depth::Everything, out)) return error;
-    }
-    return nullptr;
-  };
   std::vector<DirtyFolder> missing;
   notFound.clear();
-  if (NSErrorRef error = run(folders, missing)) return error;
+  if (NSErrorRef error = state_->scanDirty(folders, missing, out)) return error;
   if (missing.empty()) return nullptr;
   // The others may have told where they are now.
-  if (NSErrorRef error = run(missing, notFound)) return error;
+  if (NSErrorRef error = state_->scanDirty(missing, notFound, out)) return error;
   for (DirtyFolder& folder : notFound) ++folder.attempts;
   return nullptr;
 }
@@ -234,13 +265,17 @@ NSErrorRef Scanner::scanSubtree(std::uint64_t folder, ScanReport* report) {
   ScanReport own;
   ScanReport& out = report != nullptr ? *report : own;
   out = {};
-  FolderScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
-  return scan.run({folder}, FolderScan::Depth::Everything, out);
+  return state_->scanFolders({folder}, FolderScan::Depth::Everything, out);
 }
 
 std::optional<ItemRow> Scanner::scanLocation(std::string_view path, NSErrorRef* error) {
   LocationScan scan(*state_->store, state_->links, state_->visitor, state_->walkerOptions(false));
-  return scan.run(path, error);
+  auto row = scan.run(path, error);
+  if (NSErrorRef failure = state_->settle(scan.takeConflicts())) {
+    storeError(error, failure);
+    return std::nullopt;
+  }
+  return row;
 }
 
 std::uint32_t Scanner::stampSome(std::uint32_t limit) { return state_->stamper.stampSome(limit); }

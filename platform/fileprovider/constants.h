@@ -7,17 +7,18 @@
 
 namespace yomber {
 
-/// An item's name between host and extension. The three constants below name no ordinary item.
+/// An item's name between host and extension. The constants below name no ordinary item; they are
+/// never destroyed, so that threads which outlive `main` may still use them.
 using NSFileProviderItemIdentifier = std::string;
 
-inline const NSFileProviderItemIdentifier NSFileProviderRootContainerItemIdentifier =
-    "NSFileProviderRootContainerItemIdentifier";
-inline const NSFileProviderItemIdentifier NSFileProviderWorkingSetContainerItemIdentifier =
-    "NSFileProviderWorkingSetContainerItemIdentifier";
-inline const NSFileProviderItemIdentifier NSFileProviderAllDirectoriesContainerItemIdentifier =
-    "NSFileProviderAllDirectoriesContainerItemIdentifier";
-inline const NSFileProviderItemIdentifier NSFileProviderTrashContainerItemIdentifier =
-    "NSFileProviderTrashContainerItemIdentifier";
+inline const NSFileProviderItemIdentifier& NSFileProviderRootContainerItemIdentifier =
+    *new NSFileProviderItemIdentifier("NSFileProviderRootContainerItemIdentifier");
+inline const NSFileProviderItemIdentifier& NSFileProviderWorkingSetContainerItemIdentifier =
+    *new NSFileProviderItemIdentifier("NSFileProviderWorkingSetContainerItemIdentifier");
+inline const NSFileProviderItemIdentifier& NSFileProviderAllDirectoriesContainerItemIdentifier =
+    *new NSFileProviderItemIdentifier("NSFileProviderAllDirectoriesContainerItemIdentifier");
+inline const NSFileProviderItemIdentifier& NSFileProviderTrashContainerItemIdentifier =
+    *new NSFileProviderItemIdentifier("NSFileProviderTrashContainerItemIdentifier");
 
 /// Where a listing resumes, and from which point changes are wanted: opaque to all but their maker.
 using NSFileProviderPage = NSDataRef;

@@ -98,7 +98,8 @@ std::optional<ItemRow> LocationScan::scanName(std::uint64_t folder,
     if (failure) error = failure;
     if (isRight || failure) return row;
     if (exists) addOnlyEntry(snapshot, diskName, entry);
-    if ((failure = compare(folder, diskName, snapshot))) {
+    failure = compare(folder, diskName, snapshot);
+    if (failure) {
       error = failure;
       return std::nullopt;
     }

@@ -141,7 +141,7 @@ void Reconciler::compareName(WriteTransaction& transaction, std::uint64_t folder
                              const std::string& name, const FolderSnapshot& snapshot) {
   const OwnRanks ownRanks(*this, transaction);
   compareEntry(transaction, folder, name, snapshot,
-               snapshot.entries.empty() ? nullptr : &snapshot.entries.front());
+               snapshot.entries.empty() ? nullptr : &snapshot.entries.front(), Trust::Times);
 }
 
 void Reconciler::compareNames(WriteTransaction& transaction, std::uint64_t folder,
@@ -152,7 +152,8 @@ void Reconciler::compareNames(WriteTransaction& transaction, std::uint64_t folde
   const EntryTable table(snapshot);
   for (const std::string& name : names) {
     const auto index = table.find(name);
-    compareEntry(transaction, folder, name, snapshot, index ? &snapshot.entries[*index] : nullptr);
+    compareEntry(transaction, folder, name, snapshot, index ? &snapshot.entries[*index] : nullptr,
+                 Trust::Nothing);
   }
 }
 

@@ -43,16 +43,20 @@ function(yomber_test name)
   if(NOT arg_TIMEOUT)
     set(arg_TIMEOUT ${YOMBER_TEST_TIMEOUT})
   endif()
-  set(properties TIMEOUT ${arg_TIMEOUT} ENVIRONMENT "${YOMBER_TEST_ENVIRONMENT}")
-  if(arg_LABELS)
-    list(APPEND properties LABELS "${arg_LABELS}")
-  endif()
-  if(arg_SERIAL)
-    list(APPEND properties RUN_SERIAL ON)
-  endif()
   set_target_properties(${name} PROPERTIES CROSSCOMPILING_EMULATOR "${YOMBER_TEST_LAUNCHER}")
   gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT 60
-    TEST_PREFIX "${name}." PROPERTIES ${properties})
+    TEST_PREFIX "${name}.")
+  # Properties that are lists do not survive gtest_discover_tests: they are set once ctest has its
+  # list of the tests.
+  set(properties "${CMAKE_CURRENT_BINARY_DIR}/${name}_properties.cmake")
+  file(CONFIGURE OUTPUT "${properties}" @ONLY CONTENT [[
+foreach(test IN LISTS @name@_TESTS)
+  set_tests_properties("${test}" PROPERTIES
+    TIMEOUT @arg_TIMEOUT@ RUN_SERIAL @arg_SERIAL@ LABELS "@arg_LABELS@"
+    ENVIRONMENT "@YOMBER_TEST_ENVIRONMENT@")
+endforeach()
+]])
+  set_property(DIRECTORY APPEND PROPERTY TEST_INCLUDE_FILES "${properties}")
 endfunction()
 
 # yomber_room(<name> SOURCES … [TESTS …] [DEPENDS …] [TEST_SOURCES …] [TEST_DEPENDS …]

@@ -18,7 +18,7 @@ set(YOMBER_TEST_ENVIRONMENT
   "ASAN_OPTIONS=strict_string_checks=1:detect_stack_use_after_return=1:check_initialization_order=1"
   "LSAN_OPTIONS=suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/leak.supp:print_suppressions=0"
   "UBSAN_OPTIONS=print_stacktrace=1"
-  "TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1:suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/thread.supp:print_suppressions=0"
+  "TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1:atexit_sleep_ms=0:suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/thread.supp:print_suppressions=0"
   "YOMBER_BUILD_DIR=${CMAKE_BINARY_DIR}"
   "YOMBER_SOURCE_DIR=${CMAKE_SOURCE_DIR}")
 

@@ -238,6 +238,34 @@ TEST_F(DriveConvergenceTest, AfterAnOverflowOfTheEventQueueAllHoldWhatIsOnDisk) 
   expectEverybodyAgrees();
 }
 
+TEST_F(DriveConvergenceTest, FoldersThatChangePlacesWithWhatTheyHoldKeepTheirIdentities) {
+  up();
+  for (int i = 0; i < 20; ++i) {
+    fs::create_directories(root_ + "/outer" + std::to_string(i) + "/inner" + std::to_string(i));
+  }
+  expectEverybodyAgrees();
+  const std::string go = base_ + "/go";
+  ASSERT_EQ(FaultPoint::arm("zarn.observer.before-read=pause-until-file:" + go), nullptr);
+  std::ofstream(root_ + "/first") << "x";
+  ASSERT_TRUE(waitUntil([&] { return fs::exists(go + ".reached"); }));
+  std::map<int, std::uint64_t> ids;
+  for (int i = 0; i < 20; ++i) {
+    const std::string outer = "/outer" + std::to_string(i);
+    const std::string inner = "/inner" + std::to_string(i);
+    ids[i] = drive_->store->itemAtPath(root_ + outer)->id;
+    fs::rename(root_ + outer + inner, root_ + inner);
+    fs::rename(root_ + outer, root_ + inner + outer);
+  }
+  std::ofstream(go).put('x');
+  expectEverybodyAgrees();
+  for (int i = 0; i < 20; ++i) {
+    const std::string path = "/inner" + std::to_string(i) + "/outer" + std::to_string(i);
+    const auto row = drive_->store->itemAtPath(root_ + path);
+    ASSERT_TRUE(row);
+    EXPECT_EQ(row->id, ids[i]) << path;
+  }
+}
+
 TEST_F(DriveConvergenceTest, AfterARestartAllHoldWhatIsOnDisk) {
   up();
   for (int round = 0; round < 3 && !HasFailure(); ++round) {

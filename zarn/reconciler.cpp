@@ -126,8 +126,16 @@ void Reconciler::compareFolder(WriteTransaction& transaction, const FolderSnapsh
     if (auto row = findByID(transaction.connection(), id)) noteGone(std::move(*row), snapshot);
   }
   for (const Differing& differing : differences.differing) {
+    const FolderEntry& entry = snapshot.entries[differing.entry];
     auto row = findByID(transaction.connection(), differing.id);
-    if (row) settleKnown(transaction, snapshot, std::move(*row), snapshot.entries[differing.entry]);
+    // It may have moved on to another name of this very folder just now.
+    const bool isStillHere =
+        row && row->parent == folder && row->nameOnDisk() == snapshot.nameOf(entry);
+    if (isStillHere) {
+      settleKnown(transaction, snapshot, std::move(*row), entry);
+    } else {
+      addCandidate(transaction, folder, snapshot, entry, 0);
+    }
   }
   for (std::size_t i = 0; i < snapshot.entries.size(); ++i) {
     if (differences.isKnown[i]) continue;
@@ -191,7 +199,7 @@ bool Reconciler::refreshFolder(WriteTransaction& transaction, std::uint64_t fold
   if (isNewer(row->rank, snapshot.rankBefore)) {
     noteConflict(folder, {});
   } else {
-    storeChanged(transaction, candidate, *row);
+    (void)storeChanged(transaction, candidate, *row);  // in its place
   }
   return true;
 }
@@ -224,7 +232,7 @@ void Reconciler::settleKnown(WriteTransaction& transaction, const FolderSnapshot
                       .folder = snapshot.folder,
                       .rankBefore = snapshot.rankBefore};
   const bool isOtherFolder = row.isFolder() && row.inode != entry.inode;
-  storeChanged(transaction, candidate, row);
+  (void)storeChanged(transaction, candidate, row);  // in its place
   if (entry.type == EntryType::Folder) noteFolder(snapshot, entry, row.id, isOtherFolder);
 }
 

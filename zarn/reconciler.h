@@ -132,6 +132,7 @@ class Reconciler {
   void decideOpen(WriteTransaction& transaction);
   bool takeReplaced(WriteTransaction& transaction, Candidate& candidate);
   void move(WriteTransaction& transaction, const Candidate& candidate, const ItemRow& row);
+  void postpone(const Candidate& candidate);
   void add(WriteTransaction& transaction, const Candidate& candidate);
   void removeGone(WriteTransaction& transaction);
 
@@ -139,7 +140,8 @@ class Reconciler {
   void describe(const Candidate& candidate, ItemRow& row) const;
   void choosePlace(WriteTransaction& transaction, const Candidate& candidate, ItemRow& row);
   void stamp(const Candidate& candidate, ItemRow& row) const;
-  void storeChanged(WriteTransaction& transaction, const Candidate& candidate,
+  /// False, with nothing stored, when a folder would come to lie below itself.
+  bool storeChanged(WriteTransaction& transaction, const Candidate& candidate,
                     const ItemRow& before);
 
   const LinkResolver& links_;

@@ -56,7 +56,7 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
   }
   gone_.erase(replaced.id);
   candidate.attributes.id.reset();
-  storeChanged(transaction, candidate, replaced);
+  (void)storeChanged(transaction, candidate, replaced);  // a file
   return true;
 }
 
@@ -85,10 +85,19 @@ void Reconciler::decide(WriteTransaction& transaction, Candidate& candidate) {
 void Reconciler::move(WriteTransaction& transaction, const Candidate& candidate,
                       const ItemRow& row) {
   gone_.erase(row.id);
-  storeChanged(transaction, candidate, row);
+  if (!storeChanged(transaction, candidate, row)) return postpone(candidate);
   if (candidate.entry.type == EntryType::Folder && candidate.snapshot != nullptr) {
     noteFolder(*candidate.snapshot, candidate.entry, row.id, false);
   }
+}
+
+/// A folder has moved into one that still has its row below it: that one has moved as well, which
+/// is seen when everything was compared.
+void Reconciler::postpone(const Candidate& candidate) {
+  if (candidate.snapshot == nullptr) return noteConflict(candidate.parent, candidate.name);
+  open_.push_back(candidate);
+  open_.back().snapshot = nullptr;
+  ++openFolders_;
 }
 
 void Reconciler::add(WriteTransaction& transaction, const Candidate& candidate) {

@@ -82,7 +82,7 @@ void Reconciler::stamp(const Candidate& candidate, ItemRow& row) const {
   if (isStill) row.ctime = now.ctime;
 }
 
-void Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& candidate,
+bool Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& candidate,
                               const ItemRow& before) {
   ItemRow after = before;
   describe(candidate, after);
@@ -92,12 +92,12 @@ void Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& ca
   if (!isPlace && isElsewhereNow) choosePlace(transaction, candidate, after);
   stamp(candidate, after);
   if (isShownDifferently(before, after)) {
-    // A folder that would come to lie below itself has moved on meanwhile; its next scan tells.
-    if (!transaction.update(before, after)) return;
+    if (!transaction.update(before, after)) return false;
   } else if (before.ctime != after.ctime || before.inode != after.inode ||
              before.flags != after.flags) {
     transaction.updateQuietly(after);
   }
+  return true;
 }
 
 }  // namespace yomber

@@ -21,6 +21,7 @@ namespace yomber {
 namespace {
 
 constexpr int kChildSocket = 3;
+constexpr const char* kHomeVariable = "YOMBER_HOME";
 
 // glibc 2.36 declares these two without C linkage.
 int openProcess(pid_t pid) { return static_cast<int>(syscall(SYS_pidfd_open, pid, 0)); }
@@ -70,13 +71,21 @@ class SpawnPlan {
   }
 
   void fillEnvironment(const std::string& home) {
-    const std::string ours[] = {"YOMBER_HOME=", std::string(kExtensionDescriptorVariable) + "="};
     for (char** entry = environ; *entry != nullptr; ++entry) {
       const std::string_view text(*entry);
-      if (!text.starts_with(ours[0]) && !text.starts_with(ours[1])) environment_.emplace_back(text);
+      const auto name = text.substr(0, text.find('='));
+      if (name != kHomeVariable && name != kExtensionDescriptorVariable) {
+        environment_.emplace_back(text);
+      }
     }
-    environment_.push_back(ours[0] + home);
-    environment_.push_back(ours[1] + std::to_string(kChildSocket));
+    setVariable(kHomeVariable, home);
+    setVariable(kExtensionDescriptorVariable, std::to_string(kChildSocket));
+  }
+
+  void setVariable(std::string_view name, std::string_view value) {
+    auto& entry = environment_.emplace_back(name);
+    entry += '=';
+    entry += value;
   }
 
   std::string program_;

@@ -18,6 +18,7 @@
 using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
 using Common = import "common.capnp";
+using Content = import "content.capnp".Content;
 
 interface Daemon {
   describe @0 () -> (home :Data, root :Data, program :Text, bootID :Text, pid :UInt32);
@@ -79,6 +80,10 @@ interface Daemon {
   # --- Status.
 
   status @16 () -> (status :Status);
+
+  # --- The content of items, and what else is done with items.
+
+  content @17 () -> (content :Content);
 
   enum ObjectKind {
     document @0;

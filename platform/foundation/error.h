@@ -26,6 +26,7 @@ inline constexpr const char* NSPOSIXErrorDomain = "NSPOSIXErrorDomain";
 /// Cocoa codes that this system makes or tests.
 inline constexpr std::int64_t NSFileNoSuchFileError = 4;
 inline constexpr std::int64_t NSFileReadUnknownError = 256;
+inline constexpr std::int64_t NSFileReadCorruptFileError = 259;
 inline constexpr std::int64_t NSFileWriteUnknownError = 512;
 inline constexpr std::int64_t NSFileWriteFileExistsError = 516;
 inline constexpr std::int64_t NSUserCancelledError = 3072;

@@ -13,6 +13,8 @@ inline constexpr std::int64_t QSOstrellErrorInvalidParameter = 3;
 inline constexpr std::int64_t QSOstrellErrorConnectionLost = 4;
 /// A watcher left too many changes waiting and was cut off; list again.
 inline constexpr std::int64_t QSOstrellErrorWatcherTooSlow = 5;
+/// The item's local content cannot be given up; the description says why.
+inline constexpr std::int64_t QSOstrellErrorCannotEvict = 6;
 
 /// User-information keys of QSOstrellErrorInvalidParameter.
 inline constexpr const char* QSOstrellErrorParameterKey = "QSOstrellErrorParameter";

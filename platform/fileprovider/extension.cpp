@@ -1,5 +1,7 @@
 #include "platform/fileprovider/extension.h"
 
+#include <utility>
+
 #include "platform/fileprovider/errors.h"
 
 namespace yomber {
@@ -7,6 +9,15 @@ namespace {
 
 void answerUnsupported(const ErrorHandler& completionHandler, const char* operation) {
   if (completionHandler) completionHandler(fileProviderErrorForUnsupportedFeature(operation));
+}
+
+/// For handlers that take a result before the error.
+template <typename Result>
+void answerUnsupported(const std::function<void(Result, NSErrorRef)>& completionHandler,
+                       const char* operation) {
+  if (completionHandler) {
+    completionHandler(Result(), fileProviderErrorForUnsupportedFeature(operation));
+  }
 }
 
 }  // namespace
@@ -46,8 +57,90 @@ void NSFileProviderExtension::startProvidingItemAtURL(const NSURLRef& /*url*/,
   answerUnsupported(completionHandler, "providing content");
 }
 
+void NSFileProviderExtension::startProvidingItemAtURL(
+    const NSURLRef& url, NSFileCoordinatorReadingOptions /*readingOptions*/,
+    ErrorHandler completionHandler) {
+  startProvidingItemAtURL(url, std::move(completionHandler));
+}
+
 void NSFileProviderExtension::stopProvidingItemAtURL(const NSURLRef& /*url*/) {}
 
 void NSFileProviderExtension::itemChangedAtURL(const NSURLRef& /*url*/) {}
+
+void NSFileProviderExtension::movingItemAtURL(const NSURLRef& /*url*/,
+                                              const NSURLRef& /*destinationURL*/,
+                                              MoveHandler completionHandler) {
+  answerUnsupported(completionHandler, "moving items");
+}
+
+void NSFileProviderExtension::importDocumentAtURL(
+    const NSURLRef& /*url*/, const NSFileProviderItemIdentifier& /*toParentItemIdentifier*/,
+    ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "importing documents");
+}
+
+void NSFileProviderExtension::createDirectoryWithName(
+    const std::string& /*name*/, const NSFileProviderItemIdentifier& /*inParentItemIdentifier*/,
+    ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "creating folders");
+}
+
+void NSFileProviderExtension::renameItemWithIdentifier(
+    const NSFileProviderItemIdentifier& /*identifier*/, const std::string& /*toName*/,
+    ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "renaming items");
+}
+
+void NSFileProviderExtension::reparentItemWithIdentifier(
+    const NSFileProviderItemIdentifier& /*identifier*/,
+    const NSFileProviderItemIdentifier& /*toParentItemWithIdentifier*/,
+    const std::optional<std::string>& /*newName*/, ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "moving items");
+}
+
+void NSFileProviderExtension::trashItemWithIdentifier(
+    const NSFileProviderItemIdentifier& /*identifier*/, ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "trashing items");
+}
+
+void NSFileProviderExtension::untrashItemWithIdentifier(
+    const NSFileProviderItemIdentifier& /*identifier*/,
+    const std::optional<NSFileProviderItemIdentifier>& /*toParentItemIdentifier*/,
+    ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "putting items back");
+}
+
+void NSFileProviderExtension::deleteItemWithIdentifier(
+    const NSFileProviderItemIdentifier& /*identifier*/, ErrorHandler completionHandler) {
+  answerUnsupported(completionHandler, "deleting items");
+}
+
+void NSFileProviderExtension::_trashItemAtURLWithoutCoordination(const NSURLRef& /*url*/,
+                                                                 URLHandler completionHandler) {
+  answerUnsupported(completionHandler, "trashing locations");
+}
+
+void NSFileProviderExtension::setLastUsedDate(
+    const std::optional<NSDate>& /*date*/,
+    const NSFileProviderItemIdentifier& /*forItemIdentifier*/, ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "last-used dates");
+}
+
+void NSFileProviderExtension::setTagData(const NSDataRef& /*tagData*/,
+                                         const NSFileProviderItemIdentifier& /*forItemIdentifier*/,
+                                         ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "tags");
+}
+
+void NSFileProviderExtension::setFavoriteRank(
+    const std::optional<std::int64_t>& /*rank*/,
+    const NSFileProviderItemIdentifier& /*forItemIdentifier*/, ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "favourites");
+}
+
+void NSFileProviderExtension::_defaultApplicationContainerForBundleIdentifier(
+    const std::optional<std::string>& /*bundleIdentifier*/, ItemHandler completionHandler) {
+  answerUnsupported(completionHandler, "applications' folders");
+}
 
 }  // namespace yomber

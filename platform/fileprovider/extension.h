@@ -9,6 +9,8 @@
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/enumerator.h"
 #include "platform/fileprovider/item.h"
+#include "platform/foundation/data.h"
+#include "platform/foundation/date.h"
 #include "platform/foundation/error.h"
 #include "platform/foundation/url.h"
 
@@ -17,6 +19,10 @@ namespace yomber {
 using ErrorHandler = std::function<void(NSErrorRef error)>;
 using ItemHandler = std::function<void(NSFileProviderItemRef item, NSErrorRef error)>;
 using MoveHandler = std::function<void(bool requiresProviding, NSErrorRef error)>;
+using URLHandler = std::function<void(NSURLRef url, NSErrorRef error)>;
+
+/// How the content is going to be read: Foundation's file-coordination reading options, a bit set.
+using NSFileCoordinatorReadingOptions = std::uint64_t;
 
 /// The base class of a file-provider extension. The host calls these operations concurrently, on
 /// threads of its own choosing; each has the framework's default answer, so that an extension
@@ -45,8 +51,57 @@ class NSFileProviderExtension {
   // Content.
   virtual void providePlaceholderAtURL(const NSURLRef& url, ErrorHandler completionHandler);
   virtual void startProvidingItemAtURL(const NSURLRef& url, ErrorHandler completionHandler);
+  /// Forwards to the form without options, for an extension that makes no difference.
+  virtual void startProvidingItemAtURL(const NSURLRef& url,
+                                       NSFileCoordinatorReadingOptions readingOptions,
+                                       ErrorHandler completionHandler);
   virtual void stopProvidingItemAtURL(const NSURLRef& url);
   virtual void itemChangedAtURL(const NSURLRef& url);
+  /// Whether the content at `url` has to be here before it can be moved to `destinationURL`.
+  virtual void movingItemAtURL(const NSURLRef& url, const NSURLRef& destinationURL,
+                               MoveHandler completionHandler);
+
+  // Changes of the tree. An item that is answered is the item as it is after the change.
+  virtual void importDocumentAtURL(const NSURLRef& url,
+                                   const NSFileProviderItemIdentifier& toParentItemIdentifier,
+                                   ItemHandler completionHandler);
+  virtual void createDirectoryWithName(const std::string& name,
+                                       const NSFileProviderItemIdentifier& inParentItemIdentifier,
+                                       ItemHandler completionHandler);
+  virtual void renameItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                        const std::string& toName, ItemHandler completionHandler);
+  /// Without a new name the item keeps the one it has.
+  virtual void reparentItemWithIdentifier(
+      const NSFileProviderItemIdentifier& identifier,
+      const NSFileProviderItemIdentifier& toParentItemWithIdentifier,
+      const std::optional<std::string>& newName, ItemHandler completionHandler);
+  virtual void trashItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                       ItemHandler completionHandler);
+  /// Without a parent the item goes back to where it came from.
+  virtual void untrashItemWithIdentifier(
+      const NSFileProviderItemIdentifier& identifier,
+      const std::optional<NSFileProviderItemIdentifier>& toParentItemIdentifier,
+      ItemHandler completionHandler);
+  virtual void deleteItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                        ErrorHandler completionHandler);
+  virtual void _trashItemAtURLWithoutCoordination(const NSURLRef& url,
+                                                  URLHandler completionHandler);
+
+  // Attributes; nothing (nil data) takes the attribute away.
+  virtual void setLastUsedDate(const std::optional<NSDate>& date,
+                               const NSFileProviderItemIdentifier& forItemIdentifier,
+                               ItemHandler completionHandler);
+  /// `tagData` is of the form that tags_data.h describes.
+  virtual void setTagData(const NSDataRef& tagData,
+                          const NSFileProviderItemIdentifier& forItemIdentifier,
+                          ItemHandler completionHandler);
+  virtual void setFavoriteRank(const std::optional<std::int64_t>& rank,
+                               const NSFileProviderItemIdentifier& forItemIdentifier,
+                               ItemHandler completionHandler);
+
+  /// An application's default folder; without a bundle, that of the drive itself.
+  virtual void _defaultApplicationContainerForBundleIdentifier(
+      const std::optional<std::string>& bundleIdentifier, ItemHandler completionHandler);
 };
 
 }  // namespace yomber

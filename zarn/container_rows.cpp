@@ -5,8 +5,8 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/foundation/bounced_name.h"
 #include "platform/ostrell/constants.h"
-#include "zarn/bounced_name.h"
 #include "zarn/item_store.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"

@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <numeric>
 
-#include "zarn/bounced_name.h"
+#include "platform/foundation/bounced_name.h"
 #include "zarn/name_collation.h"
 #include "zarn/random_id.h"
 

@@ -1,5 +1,5 @@
 // Reconciler: rows from entries.
-#include "zarn/bounced_name.h"
+#include "platform/foundation/bounced_name.h"
 #include "zarn/reconciler.h"
 #include "zarn/row_queries.h"
 

@@ -10,10 +10,10 @@
 #include <unicode/utf8.h>
 #include <nlohmann/json.hpp>
 
+#include "platform/foundation/bounced_name.h"
 #include "platform/foundation/url.h"
 #include "tests/fuzz/expect.h"
 #include "yomber/item_output.h"
-#include "zarn/bounced_name.h"
 #include "zarn/desktop_entry.h"
 #include "zarn/name_collation.h"
 #include "zarn/tree_layout.h"

@@ -1,4 +1,4 @@
-#include "zarn/bounced_name.h"
+#include "platform/foundation/bounced_name.h"
 
 #include <gtest/gtest.h>
 

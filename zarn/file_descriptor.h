@@ -1,31 +1,4 @@
 #pragma once
 
-#include <unistd.h>
-
-#include <utility>
-
-namespace yomber {
-
-/// Owns an open file descriptor; -1 owns none.
-class FileDescriptor {
- public:
-  FileDescriptor() = default;
-  explicit FileDescriptor(int descriptor) : descriptor_(descriptor) {}
-  FileDescriptor(FileDescriptor&& other) noexcept
-      : descriptor_(std::exchange(other.descriptor_, -1)) {}
-  FileDescriptor& operator=(FileDescriptor&& other) noexcept {
-    std::swap(descriptor_, other.descriptor_);
-    return *this;
-  }
-  ~FileDescriptor() {
-    if (descriptor_ >= 0) close(descriptor_);
-  }
-
-  explicit operator bool() const { return descriptor_ >= 0; }
-  [[nodiscard]] int get() const { return descriptor_; }
-
- private:
-  int descriptor_ = -1;
-};
-
-}  // namespace yomber
+// The owner of descriptors is the foundation's; this name stays for the daemon's own sources.
+#include "platform/foundation/file_descriptor.h"  // IWYU pragma: export

@@ -1,0 +1,38 @@
+#include "platform/rozzel/asset.h"
+
+namespace yomber {
+
+namespace {
+
+constexpr std::string_view kDigits = "0123456789abcdef";
+
+}  // namespace
+
+std::string RZAsset::hexHash() const {
+  std::string text;
+  text.reserve(hash.size() * 2);
+  for (const std::uint8_t byte : hash) {
+    text += kDigits[byte >> 4U];
+    text += kDigits[byte & 15U];
+  }
+  return text;
+}
+
+std::optional<RZAsset> RZAsset::fromHexHash(std::string_view hexHash, std::uint64_t size) {
+  RZAsset asset;
+  asset.size = size;
+  if (hexHash.size() != asset.hash.size() * 2) return std::nullopt;
+  for (std::size_t index = 0; index < hexHash.size(); ++index) {
+    const auto digit = kDigits.find(hexHash[index]);
+    if (digit == std::string_view::npos) return std::nullopt;
+    auto& byte = asset.hash[index / 2];
+    byte = static_cast<std::uint8_t>((byte << 4U) | digit);
+  }
+  return asset;
+}
+
+std::string RZAsset::description() const {
+  return "asset " + hexHash() + " of " + std::to_string(size) + " bytes";
+}
+
+}  // namespace yomber

@@ -20,6 +20,7 @@
 #include "platform/foundation/lock.h"
 #include "platform/foundation/log.h"
 #include "zarn/bulk_load.h"
+#include "zarn/busy_files.h"
 #include "zarn/connection.h"
 #include "zarn/schema.h"
 #include "zarn/write_transaction.h"
@@ -140,6 +141,8 @@ struct Database::State {
 
   Mutex sinksMutex;
   std::vector<std::weak_ptr<ChangeSink>> sinks GUARDED_BY(sinksMutex);
+  std::weak_ptr<CommitParticipant> participant GUARDED_BY(sinksMutex);
+  BusyFiles busyFiles;
 
   std::thread thread;
   std::thread checkpointer;
@@ -157,6 +160,7 @@ struct Database::State {
   NSErrorRef submitAndWait(Task task);
   void runTask(Task& task, WriteTransaction& transaction);
   void storeRank(WriteTransaction& transaction);
+  std::function<void()> letParticipate(WriteTransaction& transaction);
   void publish(const WriteTransaction& transaction);
   [[nodiscard]] NSErrorRef failure(const std::exception& exception);
   std::unique_ptr<Connection> takeReader();
@@ -231,10 +235,12 @@ void Database::State::runBatch(std::vector<Task>& batch) {
     for (Task& task : batch) task.result = error;
     return;
   }
-  WriteTransaction transaction(*writer, rank, nowNanoseconds());
+  WriteTransaction transaction(*writer, rank, nowNanoseconds(), busyFiles);
+  std::function<void()> afterwards;
   try {
     writer->execute("BEGIN");
     for (Task& task : batch) runTask(task, transaction);
+    afterwards = letParticipate(transaction);
     storeRank(transaction);
     if (beforeCommit.hit()) throw std::runtime_error("the disk is full");
     writer->execute("COMMIT");
@@ -251,8 +257,20 @@ void Database::State::runBatch(std::vector<Task>& batch) {
     return;
   }
   (void)afterCommit.hit();
+  rank = transaction.rank();
+  if (afterwards) afterwards();
   publish(transaction);
   requestCheckpoint();
+}
+
+std::function<void()> Database::State::letParticipate(WriteTransaction& transaction) {
+  if (transaction.changes().empty() && transaction.touched().empty()) return {};
+  std::shared_ptr<CommitParticipant> strong;
+  {
+    LockGuard guard(sinksMutex);
+    strong = participant.lock();
+  }
+  return strong ? strong->willCommit(transaction) : std::function<void()>();
 }
 
 /// On the writer thread, after a commit.
@@ -341,7 +359,6 @@ void Database::State::storeRank(WriteTransaction& transaction) {
 }
 
 void Database::State::publish(const WriteTransaction& transaction) {
-  rank = transaction.rank();
   if (transaction.changes().empty()) return;
   std::vector<std::shared_ptr<ChangeSink>> live;
   {
@@ -524,6 +541,13 @@ NSErrorRef Database::rebuild(const std::function<NSErrorRef(BulkLoad&)>& load) {
   if (error) removeWithCompanions(aside);
   return error;
 }
+
+void Database::setParticipant(std::weak_ptr<CommitParticipant> participant) {
+  LockGuard guard(state_->sinksMutex);
+  state_->participant = std::move(participant);
+}
+
+BusyFiles& Database::busyFiles() const { return state_->busyFiles; }
 
 void Database::addSink(std::weak_ptr<ChangeSink> sink) {
   LockGuard guard(state_->sinksMutex);

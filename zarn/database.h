@@ -12,6 +12,7 @@
 
 namespace yomber {
 
+class BusyFiles;
 class Connection;
 class WriteTransaction;
 class BulkLoad;
@@ -23,6 +24,16 @@ class ChangeSink {
  public:
   virtual ~ChangeSink() = default;
   virtual void committed(const std::vector<ItemChange>& changes) = 0;
+};
+
+/// Stores something of its own together with every change of rows.
+class CommitParticipant {
+ public:
+  virtual ~CommitParticipant() = default;
+  /// On the writer thread before the commit; what it stores is committed with the changes, and what
+  /// it throws undoes them. It must not change rows of items itself. What it answers (or nothing)
+  /// is called after the commit, before the sinks.
+  virtual std::function<void()> willCommit(WriteTransaction& transaction) = 0;
 };
 
 /// Errors of this domain are about the database file itself.
@@ -63,6 +74,10 @@ class Database {
 
   /// Sinks are held weakly and called in the order they were added.
   void addSink(std::weak_ptr<ChangeSink> sink);
+
+  /// Held weakly; replaces the one before.
+  void setParticipant(std::weak_ptr<CommitParticipant> participant);
+  [[nodiscard]] BusyFiles& busyFiles() const;
 
   /// No complete scan of the tree has been stored yet.
   [[nodiscard]] bool needsFirstScan() const;

@@ -11,6 +11,7 @@
 #include "platform/foundation/fault_points.h"
 #include "zarn/bulk_load.h"
 #include "zarn/row_queries.h"
+#include "zarn/schema.h"
 #include "zarn/test_drive.h"
 #include "zarn/write_transaction.h"
 
@@ -197,7 +198,8 @@ TEST_F(DatabaseTest, RefusesAFileOfANewerProgramAndLeavesIt) {
   ASSERT_NE(error, nullptr);
   EXPECT_TRUE(error->is(kDatabaseErrorDomain, kDatabaseTooNew));
   EXPECT_TRUE(damagedFiles().empty());
-  SQLite::Database(layout.databasePath(), SQLite::OPEN_READWRITE).exec("PRAGMA user_version=1");
+  SQLite::Database(layout.databasePath(), SQLite::OPEN_READWRITE)
+      .exec("PRAGMA user_version=" + std::to_string(kSchemaVersion));
   open();
   EXPECT_TRUE(store->itemByName(kRootID, "a"));
 }

@@ -20,6 +20,18 @@ bool isShownDifferently(const ItemRow& left, const ItemRow& right) {
          !hasSameExtra;
 }
 
+/// Its content is being filled in or given up: what is stored of it stays.
+void keepContent(const ItemRow& before, ItemRow& after) {
+  after.size = before.size;
+  after.mtime = before.mtime;
+  after.ctime = before.ctime;
+  after.flags = (after.flags & ~row_flag::kDownloaded) | (before.flags & row_flag::kDownloaded);
+}
+
+bool isSameContent(const ItemRow& left, const ItemRow& right) {
+  return left.inode == right.inode && left.size == right.size && left.mtime == right.mtime;
+}
+
 }  // namespace
 
 void Reconciler::describe(const Candidate& candidate, ItemRow& row) const {
@@ -86,6 +98,8 @@ bool Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& ca
                               const ItemRow& before) {
   ItemRow after = before;
   describe(candidate, after);
+  if (before.inode == after.inode && transaction.isBusy(after.inode)) keepContent(before, after);
+  if (!isSameContent(before, after)) after.flags &= ~row_flag::kUploaded;
   const bool isPlace = before.parent == kNoParent || before.isContainerFolder();
   const bool isElsewhereNow =
       before.parent != candidate.parent || before.nameOnDisk() != candidate.name;

@@ -8,6 +8,7 @@
 #include "platform/foundation/log.h"
 #include "zarn/name_collation.h"
 #include "zarn/random_id.h"
+#include "zarn/schema_migrations.h"
 
 namespace yomber {
 namespace {
@@ -109,6 +110,7 @@ void rebuildSortKeys(Connection& connection) {
 
 void createTables(Connection& connection) {
   connection.execute(kTables);
+  connection.execute(kContentTables);
   connection.execute(("PRAGMA application_id=" + std::to_string(kApplicationID)).c_str());
   connection.execute(("PRAGMA user_version=" + std::to_string(kSchemaVersion)).c_str());
   setMetaInteger(connection, meta::kIdentity, static_cast<std::int64_t>(randomID()));
@@ -128,8 +130,9 @@ void prepareSchema(Connection& connection) {
   if (version == 0) {
     createTables(connection);
     createIndexes(connection);
-  } else if (metaText(connection, kCollation) != nameCollationVersion()) {
-    rebuildSortKeys(connection);
+  } else {
+    migrateSchema(connection, version, kSchemaVersion);
+    if (metaText(connection, kCollation) != nameCollationVersion()) rebuildSortKeys(connection);
   }
   transaction.commit();
 }

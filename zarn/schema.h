@@ -8,7 +8,7 @@
 namespace yomber {
 
 /// The version of the tables that this program reads and writes.
-inline constexpr std::int64_t kSchemaVersion = 1;
+inline constexpr std::int64_t kSchemaVersion = 2;
 
 /// Thrown by `prepareSchema` for a file that a newer program made.
 struct SchemaTooNew {
@@ -22,6 +22,8 @@ inline constexpr const char* kRank = "rank";
 inline constexpr const char* kOldestRank = "oldestRank";    ///< see Database::oldestAnswerableRank
 inline constexpr const char* kIsComplete = "isComplete";    ///< 1 once a whole scan is stored
 inline constexpr const char* kStampedUpTo = "stampedUpTo";  ///< see Scanner::stampSome
+inline constexpr const char* kSweptUpTo = "sweptUpTo";      ///< see ContentJobs::sweep
+inline constexpr const char* kLastAccount = "lastAccount";  ///< key of who was signed in last
 }  // namespace meta
 
 /// Makes the tables in an empty file; brings those of an older version up to date; makes sort keys

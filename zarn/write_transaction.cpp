@@ -93,6 +93,7 @@ void WriteTransaction::updateQuietly(const ItemRow& row) {
   statement->bindID(3, row.inode);
   statement->bindInteger(4, row.ctime);
   statement->step();
+  touched_.push_back(row.id);
 }
 
 void WriteTransaction::remove(const ItemRow& row) {
@@ -217,6 +218,7 @@ void WriteTransaction::departFromWorkingSet(std::uint64_t id) {
 void WriteTransaction::rewind(const Mark& mark) {
   rank_ = mark.rank;
   changes_.resize(std::min(changes_.size(), mark.changes));
+  touched_.resize(std::min(touched_.size(), mark.touched));
 }
 
 std::uint64_t WriteTransaction::prune() {

@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "zarn/busy_files.h"
 #include "zarn/connection.h"
 #include "zarn/item_row.h"
 
@@ -22,14 +23,20 @@ inline constexpr std::int64_t kMaximumTombstones = 100'000;
 /// All throw SQLite::Exception. For the writer thread only, during its job.
 class WriteTransaction {
  public:
-  WriteTransaction(Connection& connection, std::uint64_t rank, std::int64_t now)
-      : connection_(connection), rank_(rank), now_(now) {}
+  WriteTransaction(Connection& connection, std::uint64_t rank, std::int64_t now,
+                   const BusyFiles& busyFiles)
+      : connection_(connection), rank_(rank), now_(now), busyFiles_(busyFiles) {}
 
   [[nodiscard]] Connection& connection() { return connection_; }
   /// Of the last change so far.
   [[nodiscard]] std::uint64_t rank() const { return rank_; }
   std::uint64_t nextRank() { return ++rank_; }
   [[nodiscard]] const std::vector<ItemChange>& changes() const { return changes_; }
+  /// Ids of rows that were changed quietly.
+  [[nodiscard]] const std::vector<std::uint64_t>& touched() const { return touched_; }
+  [[nodiscard]] std::int64_t now() const { return now_; }
+  /// See BusyFiles.
+  [[nodiscard]] bool isBusy(std::uint64_t inode) const { return busyFiles_.contains(inode); }
 
   /// An id that no item has.
   [[nodiscard]] std::uint64_t issueID();
@@ -59,8 +66,9 @@ class WriteTransaction {
   struct Mark {
     std::uint64_t rank = 0;
     std::size_t changes = 0;
+    std::size_t touched = 0;
   };
-  [[nodiscard]] Mark mark() const { return {rank_, changes_.size()}; }
+  [[nodiscard]] Mark mark() const { return {rank_, changes_.size(), touched_.size()}; }
   void rewind(const Mark& mark);
   /// Drops the oldest tombstones and departures where there are too many. Answers the rank up to
   /// which departures are now unknown, 0 when none were dropped.
@@ -77,7 +85,9 @@ class WriteTransaction {
   Connection& connection_;
   std::uint64_t rank_;
   const std::int64_t now_;
+  const BusyFiles& busyFiles_;
   std::vector<ItemChange> changes_;
+  std::vector<std::uint64_t> touched_;
 };
 
 }  // namespace yomber

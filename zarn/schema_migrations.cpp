@@ -1,0 +1,71 @@
+#include "zarn/schema_migrations.h"
+
+#include <array>
+#include <string>
+
+#include "platform/foundation/log.h"
+
+namespace yomber {
+
+// One job of a kind for an item. A newer one replaces it with a row number of its own, so that
+// whoever ends the older one leaves the newer alone. Whose file it is when nobody has ever been
+// signed in: account 0.
+// `content` is what the store is known to have, and of which file; a hash of null: nothing yet. Its
+// row outlives the item until the store's record is gone too.
+const char* const kContentTables = R"sql(
+  CREATE TABLE account(key INTEGER PRIMARY KEY, name BLOB NOT NULL UNIQUE);
+  CREATE TABLE job(
+    seq INTEGER PRIMARY KEY,
+    item INTEGER NOT NULL,
+    kind INTEGER NOT NULL,
+    account INTEGER NOT NULL,
+    state INTEGER NOT NULL,
+    attempts INTEGER NOT NULL,
+    due INTEGER NOT NULL,
+    created INTEGER NOT NULL,
+    error BLOB);
+  CREATE UNIQUE INDEX job_item ON job(item, kind);
+  CREATE INDEX job_due ON job(account, kind, due, seq);
+  CREATE TABLE content(
+    id INTEGER PRIMARY KEY,
+    account INTEGER NOT NULL,
+    pinned INTEGER NOT NULL,
+    zone BLOB,
+    parent INTEGER,
+    name BLOB,
+    hash BLOB,
+    tag BLOB,
+    size INTEGER,
+    inode INTEGER,
+    mtime INTEGER,
+    ctime INTEGER);
+  CREATE INDEX content_pinned ON content(id) WHERE pinned=1;
+)sql";
+
+namespace {
+
+/// What turns version n, its place in the table plus one, into the next. Never changed once
+/// released: files of every earlier version come by here.
+struct Migration {
+  const char* purpose;
+  void (*run)(Connection&);
+};
+
+constexpr std::array kMigrations{
+    Migration{"jobs and content",
+              [](Connection& connection) { connection.execute(kContentTables); }},
+};
+
+}  // namespace
+
+void migrateSchema(Connection& connection, std::int64_t from, std::int64_t to) {
+  for (std::int64_t version = from; version < to; ++version) {
+    const Migration& migration = kMigrations.at(static_cast<std::size_t>(version - 1));
+    log_default(defaultLog(), "[NOTICE] the database goes from version %lld to %lld: %@", version,
+                version + 1, migration.purpose);
+    migration.run(connection);
+    connection.execute(("PRAGMA user_version=" + std::to_string(version + 1)).c_str());
+  }
+}
+
+}  // namespace yomber

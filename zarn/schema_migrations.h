@@ -1,0 +1,16 @@
+#pragma once
+
+#include <cstdint>
+
+#include "zarn/connection.h"
+
+namespace yomber {
+
+/// The tables of uploads, downloads and evictions.
+extern const char* const kContentTables;
+
+/// Brings tables of version `from` to version `to`, one version after the other, inside the
+/// caller's transaction. Throws SQLite::Exception.
+void migrateSchema(Connection& connection, std::int64_t from, std::int64_t to);
+
+}  // namespace yomber

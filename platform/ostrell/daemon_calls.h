@@ -19,10 +19,10 @@ namespace yomber {
 /// read. For this room's sources only.
 ///
 /// `Invoker` says how a call is made. Its
-///   invoke(method, fill, decode, reply)
+///   invoke(method, fill, decode, reply, options)
 /// calls `method` with parameters from `fill`, takes the value that `decode(session, results)`
 /// makes of the results on the loop thread, and calls `reply(value)` where replies belong. A
-/// transport failure it keeps to itself.
+/// transport failure it keeps to itself. Without `options` the link's time limit holds.
 template <typename Base, typename Invoker>
 class DaemonCalls : public Base {
  public:

@@ -10,6 +10,7 @@
 #include "platform/foundation/data.h"
 #include "platform/foundation/error.h"
 #include "platform/foundation/url.h"
+#include "platform/ostrell/content_protocol.h"
 #include "platform/ostrell/file_object_id.h"
 #include "platform/ostrell/item_notifications.h"
 #include "platform/ostrell/query_item.h"
@@ -25,10 +26,8 @@ using QSPageHandler =
 
 /// What the daemon does for its clients. Implemented by the asynchronous and the synchronous proxy.
 /// Each call either replies or fails its proxy, once.
-class QSDaemonProtocol {
+class QSDaemonProtocol : public QSContentProtocol {
  public:
-  virtual ~QSDaemonProtocol() = default;
-
   virtual void getURLForItemIdentifier(const std::string& identifier,
                                        std::function<void(NSURLRef, NSErrorRef)> reply) = 0;
   /// `folder` is nil for the root. `limit` is at most 1000.

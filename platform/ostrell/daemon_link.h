@@ -7,6 +7,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -39,9 +40,23 @@ class DaemonLossObserver {
 class DaemonSession {
  public:
   DaemonSession(ipc::Connection::Ref connection, ipc::Remote<protocol::Daemon> daemon)
-      : connection_(std::move(connection)), daemon_(std::move(daemon)) {}
+      : connection_(std::move(connection)),
+        daemon_(std::move(daemon)),
+        content_(ipc::Remote<protocol::Content>::Resolver(
+            [daemon = daemon_] { return daemon.client().contentRequest().send().getContent(); })) {}
 
   [[nodiscard]] const ipc::Remote<protocol::Daemon>& daemon() const { return daemon_; }
+  /// Asked for when it is first called, along with that call.
+  [[nodiscard]] const ipc::Remote<protocol::Content>& content() const { return content_; }
+  /// The one of the two whose calls `Client` makes.
+  template <typename Client>
+  [[nodiscard]] const auto& remote() const {
+    if constexpr (std::is_same_v<Client, protocol::Content::Client>) {
+      return content_;
+    } else {
+      return daemon_;
+    }
+  }
   [[nodiscard]] const ipc::Connection::Ref& connection() const { return connection_; }
 
   /// Held weakly. Told soon when the session has ended already.
@@ -56,6 +71,7 @@ class DaemonSession {
  private:
   const ipc::Connection::Ref connection_;
   const ipc::Remote<protocol::Daemon> daemon_;
+  const ipc::Remote<protocol::Content> content_;
   ipc::Remote<protocol::Registration> registration_;
   std::atomic<bool> isLost_ = false;
 

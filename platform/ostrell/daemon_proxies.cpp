@@ -3,7 +3,7 @@
 #include <optional>
 #include <utility>
 
-#include "platform/ostrell/daemon_calls.h"
+#include "platform/ostrell/content_calls.h"
 #include "platform/ostrell/error_handler_slot.h"
 
 namespace yomber {
@@ -21,7 +21,7 @@ class AsyncInvoker {
   template <typename Client, typename Params, typename Results, typename Fill, typename Decode,
             typename Reply>
   void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
-              Reply reply) {
+              Reply reply, std::optional<ipc::CallOptions> options = {}) {
     link_->withSession([=, link = link_, slot = slot_](const DaemonSessionRef& session,
                                                        const NSErrorRef& error) {
       if (!session) {
@@ -39,7 +39,8 @@ class AsyncInvoker {
         link->noteFailure(session, failure);
         slot->fail(failure);
       };
-      (void)ipc::call(session->daemon(), method, fill, std::move(onReply), link->callOptions());
+      (void)ipc::call(session->remote<Client>(), method, fill, std::move(onReply),
+                      options.value_or(link->callOptions()));
     });
   }
 
@@ -58,15 +59,15 @@ class SyncInvoker {
   template <typename Client, typename Params, typename Results, typename Fill, typename Decode,
             typename Reply>
   void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
-              Reply reply) {
+              Reply reply, std::optional<ipc::CallOptions> options = {}) {
     const auto session = link_->waitForSession(&error);
     if (!session) return;
     using Value = decltype(decode(session, std::declval<const typename Results::Reader&>()));
     std::optional<Value> value;
     error = ipc::callAndWait(
-        session->daemon(), method, std::move(fill),
+        session->remote<Client>(), method, std::move(fill),
         [&](const typename Results::Reader& results) { value.emplace(decode(session, results)); },
-        link_->callOptions());
+        options.value_or(link_->callOptions()));
     if (error) {
       link_->noteFailure(session, error);
     } else if (value) {
@@ -80,11 +81,11 @@ class SyncInvoker {
   const std::shared_ptr<DaemonLink> link_;
 };
 
-using DaemonProxy = DaemonCalls<QSDaemonProtocol, AsyncInvoker>;
+using DaemonProxy = ContentCalls<QSDaemonProtocol, AsyncInvoker>;
 
-class DaemonSyncProxy final : public DaemonCalls<QSDaemonSyncProxy, SyncInvoker> {
+class DaemonSyncProxy final : public ContentCalls<QSDaemonSyncProxy, SyncInvoker> {
  public:
-  using DaemonCalls::DaemonCalls;
+  using ContentCalls::ContentCalls;
 
   void setObjResult(NSObjectRef result, NSErrorRef error) override {
     result_ = std::move(result);

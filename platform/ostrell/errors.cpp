@@ -19,6 +19,11 @@ NSErrorRef qsc_errorInvalidParameter(const std::string& parameter,
                                   std::move(userInfo));
 }
 
+NSErrorRef qs_errorWithPOSIXCode(int code, const std::string& description) {
+  return NSError::errorWithDomain(NSPOSIXErrorDomain, code,
+                                  {{NSLocalizedDescriptionKey, description}});
+}
+
 Log& qsc_default_log() { return defaultLog(); }
 
 }  // namespace yomber

@@ -15,6 +15,9 @@ namespace yomber {
 [[nodiscard]] NSErrorRef qsc_errorInvalidParameter(const std::string& parameter,
                                                    const std::optional<std::string>& value);
 
+/// NSPOSIXErrorDomain with a description for a person.
+[[nodiscard]] NSErrorRef qs_errorWithPOSIXCode(int code, const std::string& description);
+
 /// The log of the client library and of the extension.
 [[nodiscard]] Log& qsc_default_log();
 

@@ -126,6 +126,11 @@ ScriptedDaemon::Answers ScriptedDaemon::State::currentAnswers() {
   return answers;
 }
 
+ScriptedContentAnswers ScriptedDaemon::State::currentContentAnswers() {
+  LockGuard guard(mutex);
+  return contentAnswers;
+}
+
 ScriptedDaemon::Location ScriptedDaemon::State::locationOf(const std::string& identifier) {
   LockGuard guard(mutex);
   const auto found = items.find(identifier);
@@ -218,6 +223,12 @@ const std::string& ScriptedDaemon::root() const { return state_->locations.root(
 void ScriptedDaemon::script(const std::function<void(Answers& answers)>& change) {
   LockGuard guard(state_->mutex);
   change(state_->answers);
+}
+
+void ScriptedDaemon::scriptContent(
+    const std::function<void(ScriptedContentAnswers& answers)>& change) {
+  LockGuard guard(state_->mutex);
+  change(state_->contentAnswers);
 }
 
 void ScriptedDaemon::addItem(const ItemFields& item, const std::string& path) {

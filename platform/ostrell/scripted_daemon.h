@@ -11,6 +11,7 @@
 #include "platform/fileprovider/item.h"
 #include "platform/foundation/error.h"
 #include "platform/ostrell/file_object_id.h"
+#include "platform/ostrell/scripted_content.h"
 
 namespace yomber {
 
@@ -24,13 +25,10 @@ namespace yomber {
 /// otherwise. Those called `wait…` end after ten seconds at the latest and answer false then.
 class ScriptedDaemon {
  public:
-  struct Location {
-    std::string path;
-    NSErrorRef error;  ///< sent instead when set; so in all answers
-  };
+  using Location = ScriptedLocation;
   struct Item {
     ItemFields item;
-    NSErrorRef error;
+    NSErrorRef error;  ///< sent instead when set; so in all answers
   };
   struct Page {
     std::vector<ItemFields> items;
@@ -86,7 +84,7 @@ class ScriptedDaemon {
   /// A call that arrived and whose answer was made: the method as the protocol names it, and its
   /// parameters in their order, as text ("true", "200", "d:5"; the root folder and an absent token
   /// are ""). Of a sender's calls (boostPriority, watchItem, invalidate), the subscription's number
-  /// comes first.
+  /// comes first. "startProviding.dropped" is one that the client gave up before it was answered.
   struct Call {
     std::string method;
     std::vector<std::string> arguments;
@@ -107,6 +105,8 @@ class ScriptedDaemon {
 
   /// Changes the answers; takes effect for the calls that arrive later.
   void script(const std::function<void(Answers& answers)>& change);
+  /// The same for what is answered about content.
+  void scriptContent(const std::function<void(ScriptedContentAnswers& answers)>& change);
   /// Makes the item known, at that location, to the answers that were left alone. Replaces an item
   /// of the same identifier. Makes no file.
   void addItem(const ItemFields& item, const std::string& path);

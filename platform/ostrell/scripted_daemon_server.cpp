@@ -146,6 +146,7 @@ class DaemonServer final : public Wire::Server {
   kj::Promise<void> getItemUpdateSender(GetItemUpdateSenderContext context) override;
   kj::Promise<void> account(AccountContext context) override;
   kj::Promise<void> observe(ObserveContext context) override;
+  kj::Promise<void> content(ContentContext context) override;
 
  private:
   const std::shared_ptr<State> state_;
@@ -311,6 +312,11 @@ kj::Promise<void> DaemonServer::observe(ObserveContext context) {
   context.getResults().setRegistration(
       kj::heap<RegistrationServer>(state_, context.getParams().getObserver()));
   return state_->answered("observe", {});
+}
+
+kj::Promise<void> DaemonServer::content(ContentContext context) {
+  context.getResults().setContent(makeScriptedContent(state_));
+  return kj::READY_NOW;
 }
 
 }  // namespace

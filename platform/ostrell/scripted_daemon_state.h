@@ -31,6 +31,7 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
   Condition condition;
   std::uint64_t events GUARDED_BY(mutex) = 0;
   Answers answers GUARDED_BY(mutex);
+  ScriptedContentAnswers contentAnswers GUARDED_BY(mutex);
   std::vector<Call> calls GUARDED_BY(mutex);
   std::set<std::string> held GUARDED_BY(mutex);
   std::map<std::string, std::pair<ItemFields, std::string>> items GUARDED_BY(mutex);
@@ -57,6 +58,7 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
   /// Records a call whose answer is made; done when the answer may be sent. Loop thread.
   kj::Promise<void> answered(const std::string& method, std::vector<std::string> arguments);
   [[nodiscard]] Answers currentAnswers();
+  [[nodiscard]] ScriptedContentAnswers currentContentAnswers();
 
   // What is answered where the test gave no answer.
   Location locationOf(const std::string& identifier);
@@ -68,6 +70,8 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
 
 /// The daemon's side of one connection. Loop thread.
 [[nodiscard]] protocol::Daemon::Client makeScriptedServer(
+    std::shared_ptr<ScriptedDaemon::State> state);
+[[nodiscard]] protocol::Content::Client makeScriptedContent(
     std::shared_ptr<ScriptedDaemon::State> state);
 
 }  // namespace yomber

@@ -1,0 +1,151 @@
+#include "platform/ostrell/file_providing_operation.h"
+
+#include <chrono>
+#include <string>
+#include <utility>
+
+#include "platform/fileprovider/item_codec.h"
+#include "platform/foundation/thread_pool.h"
+#include "platform/ipc/call.h"
+#include "platform/ipc/error_codec.h"
+#include "platform/ostrell/daemon_link.h"
+#include "platform/ostrell/daemon_wire.h"
+#include "platform/ostrell/errors.h"
+
+namespace yomber {
+namespace {
+
+using Wire = protocol::Content;
+
+NSErrorRef wasCancelled(const std::string& path) {
+  return NSError::errorWithDomain(
+      NSCocoaErrorDomain, NSUserCancelledError,
+      {{NSFilePathErrorKey, path},
+       {NSLocalizedDescriptionKey, "providing the content of " + path + " was cancelled"}});
+}
+
+NSErrorRef lostWhileProviding(const NSErrorRef& reason, const std::string& path) {
+  return NSError::errorWithDomain(
+      QSOstrellErrorDomain, QSOstrellErrorConnectionLost,
+      {{NSUnderlyingErrorKey, reason},
+       {NSFilePathErrorKey, path},
+       {NSLocalizedDescriptionKey, "the connection to the daemon was lost while the content of " +
+                                       path + " was being provided; ask for it again"}});
+}
+
+}  // namespace
+
+/// The call under way, which a cancellation may meet at any point.
+class QSFileProvidingOperation::Call {
+ public:
+  /// Keeps the call, or gives it up when it was cancelled before it could be kept.
+  void keep(ipc::CallHandle handle) {
+    {
+      LockGuard guard(mutex_);
+      if (!isCancelled_) {
+        handle_ = std::move(handle);
+        return;
+      }
+    }
+    handle.cancel();
+  }
+  void cancel() {
+    ipc::CallHandle handle;
+    {
+      LockGuard guard(mutex_);
+      isCancelled_ = true;
+      handle = std::exchange(handle_, {});
+    }
+    handle.cancel();
+  }
+  bool isCancelled() {
+    LockGuard guard(mutex_);
+    return isCancelled_;
+  }
+
+ private:
+  Mutex mutex_;
+  bool isCancelled_ GUARDED_BY(mutex_) = false;
+  ipc::CallHandle handle_ GUARDED_BY(mutex_);
+};
+
+QSFileProvidingOperation::QSFileProvidingOperation(const NSURLRef& url,
+                                                   NSFileCoordinatorReadingOptions readingOptions)
+    : url_(url), readingOptions_(readingOptions), call_(std::make_unique<Call>()) {}
+
+QSFileProvidingOperation::~QSFileProvidingOperation() = default;
+
+std::shared_ptr<QSFileProvidingOperation> QSFileProvidingOperation::initWithURL(
+    const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions) {
+  return std::shared_ptr<QSFileProvidingOperation>(
+      new QSFileProvidingOperation(url, readingOptions));
+}
+
+std::shared_ptr<QSFileProvidingOperation> QSFileProvidingOperation::self() {
+  return std::static_pointer_cast<QSFileProvidingOperation>(shared_from_this());
+}
+
+void QSFileProvidingOperation::setFileProvidingCompletion(
+    std::function<void(NSErrorRef)> completion) {
+  LockGuard guard(mutex_);
+  std::swap(completion_, completion);
+}
+
+void QSFileProvidingOperation::cancel() {
+  NSOperation::cancel();
+  call_->cancel();
+  settle(wasCancelled(url_ ? url_->path() : std::string()));
+}
+
+void QSFileProvidingOperation::main() {
+  if (!url_) {
+    settle(NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError));
+    return;
+  }
+  const auto link = DaemonLink::current();
+  link->withSession([self = self(), link](const DaemonSessionRef& session,
+                                          const NSErrorRef& noSession) {
+    if (!session) {
+      self->settle(noSession);
+      return;
+    }
+    if (self->call_->isCancelled()) return;
+    using Results = Wire::StartProvidingResults;
+    auto onReply = [self, link, session](NSErrorRef failure, const Results::Reader* results) {
+      if (results != nullptr) {
+        NSErrorRef outcome;
+        failure = whatIsWrongWith([&] { outcome = ipc::decodeOptional(results->getFailure()); });
+        if (!failure) {
+          self->settle(outcome);
+          return;
+        }
+      }
+      link->noteFailure(session, failure);
+      const bool isLost = failure->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
+      self->settle(isLost ? lostWhileProviding(failure, self->url_->path()) : failure);
+    };
+    self->call_->keep(ipc::call(
+        session->content(), &Wire::Client::startProvidingRequest,
+        [self](Wire::StartProvidingParams::Builder params) {
+          params.setPath(wireData(self->url_->path()));
+          params.setOptions(self->readingOptions_);
+        },
+        std::move(onReply), ipc::CallOptions{std::chrono::milliseconds(0)}));
+  });
+}
+
+void QSFileProvidingOperation::settle(const NSErrorRef& outcome) {
+  std::function<void(NSErrorRef)> completion;
+  {
+    LockGuard guard(mutex_);
+    if (std::exchange(isSettled_, true)) return;
+    completion = std::exchange(completion_, nullptr);
+  }
+  // Not on this thread: it may be the loop's, or hold whatever a canceller holds.
+  ThreadPool::shared().async([self = self(), completion = std::move(completion), outcome] {
+    if (completion) completion(outcome);
+    self->finish();
+  });
+}
+
+}  // namespace yomber

@@ -1,0 +1,57 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <optional>
+
+#include "platform/fileprovider/extension.h"
+#include "platform/foundation/error.h"
+#include "platform/foundation/lock.h"
+#include "platform/foundation/operation.h"
+#include "platform/foundation/url.h"
+
+namespace yomber {
+
+/// Asks the daemon to make a file's content present on disk.
+///
+/// It ends once: with no error when the content can be read; with the daemon's error; with
+/// QSOstrellErrorConnectionLost when the daemon goes away meanwhile; or, when it is cancelled, also
+/// before it starts, with NSUserCancelledError, and then the daemon is told that nobody here waits
+/// any more. There is no time limit: content may be large, and the store slow.
+///
+/// Ownership: a queue keeps it until it is finished. Thread-safety: every public operation may be
+/// called on any thread.
+class QSFileProvidingOperation final : public NSOperation {
+ public:
+  static std::shared_ptr<QSFileProvidingOperation> initWithURL(
+      const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions);
+  ~QSFileProvidingOperation() override;
+
+  /// Called once, on a pool thread, before an operation that was started is finished. Set before the
+  /// start.
+  void setFileProvidingCompletion(std::function<void(NSErrorRef error)> completion);
+
+  void cancel() override;
+  [[nodiscard]] bool isAsynchronous() const override { return true; }
+
+ protected:
+  void main() override;
+
+ private:
+  class Call;
+
+  QSFileProvidingOperation(const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions);
+  std::shared_ptr<QSFileProvidingOperation> self();
+  /// The first outcome counts; it is delivered elsewhere.
+  void settle(const NSErrorRef& outcome);
+
+  const NSURLRef url_;
+  const NSFileCoordinatorReadingOptions readingOptions_;
+  const std::unique_ptr<Call> call_;
+
+  Mutex mutex_;
+  bool isSettled_ GUARDED_BY(mutex_) = false;
+  std::function<void(NSErrorRef)> completion_ GUARDED_BY(mutex_);
+};
+
+}  // namespace yomber

@@ -23,9 +23,9 @@ namespace yomber {
 // Errors:
 // - nothing there, a nil receiver, a nil folder: Cocoa 4
 // - the name is taken: Cocoa 516, with the location in the way (see `fp_collidingURL`)
-// - everything else: Cocoa 512 while writing, 256 while reading the source, each with the system's
-//   error underneath; a full disk is 640 with ENOSPC or EDQUOT, refused access 513
 // - a name that no file can have: Cocoa 514
+// - a full disk: Cocoa 640, refused access: 513, everything else: 512, each with the system's error
+//   underneath
 
 inline constexpr std::int64_t NSFileReadNoPermissionError = 257;
 inline constexpr std::int64_t NSFileWriteNoPermissionError = 513;

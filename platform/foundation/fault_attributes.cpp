@@ -17,13 +17,28 @@ const std::string& bootIdentifier() {
   return identifier;
 }
 
+namespace {
+
+/// `length` is what reading the attribute of a filled fault answered.
+bool isFilledInThisBoot(const std::array<char, 64>& value, ssize_t length) {
+  if (length <= 0 || bootIdentifier().empty()) return false;
+  return std::string_view(value.data(), static_cast<std::size_t>(length)) == bootIdentifier();
+}
+
+}  // namespace
+
 bool isFaultAtPath(const std::string& path) {
   if (lgetxattr(path.c_str(), kFaultAttribute, nullptr, 0) < 0) return false;
   std::array<char, 64> filled{};
-  const ssize_t length = lgetxattr(path.c_str(), kFilledAttribute, filled.data(), filled.size());
-  if (length <= 0) return true;
-  const std::string_view boot(filled.data(), static_cast<std::size_t>(length));
-  return bootIdentifier().empty() || boot != bootIdentifier();
+  return !isFilledInThisBoot(
+      filled, lgetxattr(path.c_str(), kFilledAttribute, filled.data(), filled.size()));
+}
+
+bool isFault(int descriptor) {
+  if (fgetxattr(descriptor, kFaultAttribute, nullptr, 0) < 0) return false;
+  std::array<char, 64> filled{};
+  return !isFilledInThisBoot(filled,
+                             fgetxattr(descriptor, kFilledAttribute, filled.data(), filled.size()));
 }
 
 }  // namespace yomber

@@ -16,5 +16,7 @@ inline constexpr const char* kFilledAttribute = "user.yomber.filled";
 
 /// Whether `path` (a final symbolic link is not followed) is a fault whose content cannot be read.
 [[nodiscard]] bool isFaultAtPath(const std::string& path);
+/// The same of an open file.
+[[nodiscard]] bool isFault(int descriptor);
 
 }  // namespace yomber

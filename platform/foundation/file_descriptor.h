@@ -23,6 +23,8 @@ class FileDescriptor {
 
   explicit operator bool() const { return descriptor_ >= 0; }
   [[nodiscard]] int get() const { return descriptor_; }
+  /// Gives the descriptor to the caller.
+  [[nodiscard]] int release() { return std::exchange(descriptor_, -1); }
 
  private:
   int descriptor_ = -1;

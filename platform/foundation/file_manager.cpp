@@ -1,6 +1,5 @@
 #include "platform/foundation/file_manager.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -10,9 +9,10 @@
 #include <array>
 #include <cerrno>
 #include <cstdio>
-#include <memory>
-#include <string_view>
 #include <utility>
+
+#include "platform/foundation/directory_stream.h"
+#include "platform/foundation/tree_removal.h"
 
 namespace yomber {
 namespace {
@@ -36,109 +36,6 @@ bool failTaken(NSErrorRef* error, const std::string& path) {
                                        {NSUnderlyingErrorKey, NSError::errorWithErrno(EEXIST)}}));
   return false;
 }
-
-struct CloseDirectory {
-  void operator()(DIR* directory) const { closedir(directory); }
-};
-using Directory = std::unique_ptr<DIR, CloseDirectory>;
-
-/// Opens the directory `name` of `parent`, never through a symbolic link; nil and errno otherwise.
-Directory openDirectory(int parent, const char* name) {
-  const int descriptor = openat(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-  if (descriptor < 0) return nullptr;
-  Directory directory(fdopendir(descriptor));
-  if (directory == nullptr) close(descriptor);
-  return directory;
-}
-
-/// The next name, or nil at the end (errno 0) and on failure.
-const char* nextName(DIR* directory) {
-  while (true) {
-    errno = 0;
-    const dirent* const entry = readdir(directory);
-    if (entry == nullptr) return nullptr;
-    const std::string_view name(entry->d_name);
-    if (name != "." && name != "..") return entry->d_name;
-  }
-}
-
-/// Removes trees without recursion, so that depth costs no stack; descriptors are one for each
-/// level.
-class TreeRemoval {
- public:
-  /// False, with `failedPath` and errno, at the first failure.
-  bool run(const std::string& path) {
-    failedPath = path;
-    if (unlink(path.c_str()) == 0) return true;
-    if (errno != EISDIR && errno != EPERM) return false;
-    if (!descend(AT_FDCWD, path)) return false;
-    while (!levels_.empty()) {
-      if (!step()) return false;
-    }
-    failedPath = path;
-    return rmdir(path.c_str()) == 0;
-  }
-
-  std::string failedPath;
-
- private:
-  struct Level {
-    Directory directory;
-    std::string name;
-    bool mayHoldMore = false;  ///< something was removed since the reading began
-  };
-
-  bool descend(int parent, const std::string& name) {
-    auto directory = openDirectory(parent, name.c_str());
-    if (directory == nullptr) return false;
-    levels_.push_back({std::move(directory), name, false});
-    return true;
-  }
-
-  std::string pathOf(const char* name) const {
-    std::string out;
-    for (const auto& level : levels_) out += level.name + "/";
-    return out + name;
-  }
-
-  bool failAt(const char* name) {
-    const int number = errno;
-    failedPath = pathOf(name);
-    errno = number;
-    return false;
-  }
-
-  bool step() {
-    DIR* const directory = levels_.back().directory.get();
-    const char* const name = nextName(directory);
-    if (name == nullptr && errno != 0) return failAt("");
-    if (name == nullptr) return readAgainOrAscend();
-    levels_.back().mayHoldMore = true;
-    if (unlinkat(dirfd(directory), name, 0) == 0 || errno == ENOENT) return true;
-    if (errno != EISDIR && errno != EPERM) return failAt(name);
-    if (unlinkat(dirfd(directory), name, AT_REMOVEDIR) == 0 || errno == ENOENT) return true;
-    if (errno != ENOTEMPTY && errno != EEXIST) return failAt(name);
-    return descend(dirfd(directory), name) || failAt(name);
-  }
-
-  /// Reading a directory while names go may skip some: it is done when a reading finds none.
-  bool readAgainOrAscend() {
-    if (!std::exchange(levels_.back().mayHoldMore, false)) return ascend();
-    rewinddir(levels_.back().directory.get());
-    return true;
-  }
-
-  bool ascend() {
-    const std::string name = std::move(levels_.back().name);
-    levels_.pop_back();
-    if (levels_.empty()) return true;  // the top is the caller's
-    const int parent = dirfd(levels_.back().directory.get());
-    if (unlinkat(parent, name.c_str(), AT_REMOVEDIR) == 0 || errno == ENOENT) return true;
-    return failAt(name.c_str());
-  }
-
-  std::vector<Level> levels_;
-};
 
 bool makeIntermediates(const std::string& path, unsigned mode) {
   for (std::size_t slash = path.find('/', 1); slash != std::string::npos;
@@ -183,7 +80,7 @@ bool NSFileManager::removeItemAtPath(const std::string& path, NSErrorRef* error)
   TreeRemoval removal;
   if (removal.run(path)) return true;
   const int number = errno;
-  return fail(error, number, removal.failedPath);
+  return fail(error, number, removal.failedPath());
 }
 
 bool NSFileManager::moveItemAtPath(const std::string& source, const std::string& destination,
@@ -200,7 +97,7 @@ bool NSFileManager::moveItemAtPath(const std::string& source, const std::string&
 
 std::optional<std::vector<std::string>> NSFileManager::contentsOfDirectoryAtPath(
     const std::string& path, NSErrorRef* error) const {
-  const Directory directory(opendir(path.c_str()));
+  const DirectoryStream directory(opendir(path.c_str()));
   if (directory == nullptr) {
     fail(error, errno, path);
     return std::nullopt;

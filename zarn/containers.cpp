@@ -12,7 +12,6 @@
 #include <array>
 #include <cstdlib>
 #include <map>
-#include <set>
 #include <string_view>
 #include <thread>
 #include <utility>
@@ -20,59 +19,19 @@
 #include "platform/foundation/atomic_cell.h"
 #include "platform/foundation/log.h"
 #include "platform/ipc/unix_socket.h"
+#include "platform/launchservices/bundle_proxy.h"
+#include "platform/launchservices/desktop_entry.h"
 #include "platform/ostrell/constants.h"
-#include "zarn/desktop_entry.h"
+#include "platform/ostrell/entitlements.h"
 
 namespace yomber {
 
 namespace {
 
-constexpr std::size_t kMaximumFileSize = 256 * 1024;
-constexpr std::string_view kSuffix = ".desktop";
 /// An installation writes many files: the list is read once it has gone quiet.
 constexpr int kQuietMilliseconds = 100;
 /// Directories that do not exist yet are looked for again, and what failed is tried again.
 constexpr int kRetryMilliseconds = 30'000;
-
-std::string environmentOr(const char* name, const std::string& otherwise) {
-  const char* const value = std::getenv(name);
-  return value != nullptr && *value != '\0' ? value : otherwise;
-}
-
-/// Every `.desktop` file below a directory, by its desktop file id: subdirectories are joined to
-/// the name with '-'.
-void collectEntries(const std::string& directory, const std::string& prefix, int depth,
-                    std::map<std::string, std::string>& pathsByID) {
-  constexpr int kMaximumDepth = 4;
-  DIR* const stream = opendir(directory.c_str());
-  if (stream == nullptr) return;
-  while (const dirent* const entry = readdir(stream)) {
-    const std::string name = entry->d_name;
-    if (name == "." || name == "..") continue;
-    const std::string path = directory + "/" + name;
-    if (name.ends_with(kSuffix)) {
-      pathsByID.try_emplace(prefix + name.substr(0, name.size() - kSuffix.size()), path);
-    } else if (entry->d_type == DT_DIR && depth < kMaximumDepth) {
-      collectEntries(path, prefix + name + "-", depth + 1, pathsByID);
-    }
-  }
-  closedir(stream);
-}
-
-std::string readFile(const std::string& path) {
-  // Non-blocking: what is called .desktop may be a pipe.
-  const ipc::UniqueFd file(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  struct stat status{};
-  if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return {};
-  std::string text;
-  std::array<char, 16384> buffer;
-  while (text.size() < kMaximumFileSize) {
-    const ssize_t length = read(file.get(), buffer.data(), buffer.size());
-    if (length <= 0) break;
-    text.append(buffer.data(), static_cast<std::size_t>(length));
-  }
-  return text;
-}
 
 std::vector<ContainerRecord> ownContainers(const TreeLayout& layout) {
   return {{.containerID = QSUbiquitousDefaultContainerID,
@@ -111,7 +70,9 @@ std::string displayName(const DesktopEntry& entry, const std::string& containerI
 
 void claim(const std::string& applicationID, const DesktopEntry& entry, const TreeLayout& layout,
            std::map<std::string, ContainerRecord>& containers) {
-  for (const auto& id : entry.containerIDs) {
+  const LSBundleProxy application(applicationID, entry);
+  for (const auto& id : QSEntitledContainerIdentifiers(application.entitlements())) {
+    if (!isValidContainerID(id)) continue;
     containers.try_emplace(id, ContainerRecord{.containerID = id,
                                                .displayName = displayName(entry, id),
                                                .documents = layout.documents(id),
@@ -122,39 +83,17 @@ void claim(const std::string& applicationID, const DesktopEntry& entry, const Tr
 
 }  // namespace
 
-std::vector<std::string> applicationDirectories() {
-  std::vector<std::string> result;
-  const std::string home = environmentOr("HOME", "");
-  std::string list = environmentOr("XDG_DATA_HOME", home.empty() ? "" : home + "/.local/share");
-  list += ":" + environmentOr("XDG_DATA_DIRS", "/usr/local/share:/usr/share");
-  std::string_view rest = list;
-  while (!rest.empty()) {
-    const auto colon = rest.find(':');
-    const std::string directory(rest.substr(0, colon));
-    rest = colon == std::string_view::npos ? std::string_view{} : rest.substr(colon + 1);
-    // Relative ones are to be ignored.
-    if (directory.starts_with('/')) result.push_back(directory + "/applications");
-  }
-  return result;
-}
-
 std::vector<ContainerRecord> readContainers(const std::vector<std::string>& directories,
                                             const TreeLayout& layout) {
   std::vector<ContainerRecord> result = ownContainers(layout);
   std::map<std::string, ContainerRecord> claimed;
-  std::set<std::string> seenIDs;
-  for (const auto& directory : directories) {
-    std::map<std::string, std::string> pathsByID;
-    collectEntries(directory, "", 0, pathsByID);
-    for (const auto& [id, path] : pathsByID) {
-      if (!seenIDs.insert(id).second) continue;  // an earlier directory's file stands in for it
-      std::vector<std::string> invalid;
-      const auto entry = parseDesktopEntry(readFile(path), &invalid);
-      for (const auto& bad : invalid) {
-        log_default(defaultLog(), "[NOTICE] %@ names a container that is not valid: %@", path, bad);
-      }
-      if (entry && !entry->isHidden) claim(id, *entry, layout, claimed);
+  for (const auto& [id, path] : desktopFiles(directories)) {
+    std::vector<std::string> invalid;
+    const auto entry = parseDesktopEntry(desktopFileText(path), &invalid);
+    for (const auto& bad : invalid) {
+      log_default(defaultLog(), "[NOTICE] %@ names a container that is not valid: %@", path, bad);
     }
+    if (entry && !entry->isHidden) claim(id, *entry, layout, claimed);
   }
   for (const auto& own : result) claimed.erase(own.containerID);
   for (auto& [id, container] : claimed) result.push_back(std::move(container));

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "platform/foundation/error.h"
+#include "platform/launchservices/desktop_files.h"
 #include "zarn/item_store.h"
 #include "zarn/tree_layout.h"
 
@@ -29,12 +30,9 @@ struct ContainerList {
 };
 using ContainerListRef = std::shared_ptr<const ContainerList>;
 
-/// Where applications are installed: `applications` below $XDG_DATA_HOME, then below each of
-/// $XDG_DATA_DIRS, with the defaults of the XDG base directories. The earlier ones count first.
-[[nodiscard]] std::vector<std::string> applicationDirectories();
-
-/// The containers that the `.desktop` files of these directories ask for, and the drive's own. Of
-/// several applications that claim a container, the first has it.
+/// The containers that the applications of these directories are entitled to
+/// (QSEntitledContainerIdentifiers), and the drive's own. Of several applications that claim a
+/// container, the first has it: in the order of the directories, then of their identifiers.
 [[nodiscard]] std::vector<ContainerRecord> readContainers(
     const std::vector<std::string>& directories, const TreeLayout& layout);
 

@@ -12,9 +12,9 @@
 
 #include "platform/foundation/bounced_name.h"
 #include "platform/foundation/url.h"
+#include "platform/launchservices/desktop_entry.h"
 #include "tests/fuzz/expect.h"
 #include "yomber/item_output.h"
-#include "zarn/desktop_entry.h"
 #include "zarn/name_collation.h"
 #include "zarn/tree_layout.h"
 

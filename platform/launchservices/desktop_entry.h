@@ -12,8 +12,10 @@ struct DesktopEntry {
   std::string name;           ///< Name=
   std::string iconName;       ///< Icon=
   std::string containerName;  ///< X-Yomber-Container-Name=; empty: the application's name
-  std::vector<std::string> containerIDs;  ///< valid ones, each once, in order
-  bool isHidden = false;                  ///< Hidden=true: as if the application were not installed
+  std::vector<std::string> containerIDs;  ///< X-Yomber-Containers=; valid ones, each once, in order
+  std::vector<std::string> sharedContainerIDs;  ///< X-Yomber-Shared-Containers=; the same
+  std::vector<std::string> services;            ///< X-Yomber-Services=; each once, in order
+  bool isHidden = false;  ///< Hidden=true: as if the application were not installed
 };
 
 /// Reads the group "[Desktop Entry]". Nothing when there is none. Container ids that are not valid

@@ -1,4 +1,4 @@
-#include "zarn/desktop_entry.h"
+#include "platform/launchservices/desktop_entry.h"
 
 #include <algorithm>
 
@@ -7,7 +7,7 @@ namespace yomber {
 namespace {
 
 constexpr std::size_t kMaximumIDLength = 255;
-constexpr std::size_t kMaximumContainers = 64;  // of one application
+constexpr std::size_t kMaximumEntries = 64;  // of one list
 constexpr std::size_t kMaximumTextLength = 1024;
 
 bool isIDCharacter(char c) {
@@ -54,19 +54,25 @@ std::string unescaped(std::string_view value) {
   return result;
 }
 
-void addContainers(std::string_view list, DesktopEntry& entry,
-                   std::vector<std::string>* invalidIDs) {
-  while (!list.empty() && entry.containerIDs.size() < kMaximumContainers) {
+/// Adds the entries of a list to `to`, each once.
+template <typename Accept>
+void addEntries(std::string_view list, std::vector<std::string>& to, const Accept& accepts) {
+  while (!list.empty() && to.size() < kMaximumEntries) {
     const auto end = list.find(';');
-    const std::string id(trimmed(list.substr(0, end)));
+    const std::string each(trimmed(list.substr(0, end)));
     list = end == std::string_view::npos ? std::string_view{} : list.substr(end + 1);
-    if (id.empty()) continue;
-    if (!isValidContainerID(id)) {
-      if (invalidIDs != nullptr) invalidIDs->push_back(id.substr(0, kMaximumIDLength));
-    } else if (std::ranges::find(entry.containerIDs, id) == entry.containerIDs.end()) {
-      entry.containerIDs.push_back(id);
-    }
+    const bool isKnown = std::ranges::find(to, each) != to.end();
+    if (!each.empty() && !isKnown && accepts(each)) to.push_back(each);
   }
+}
+
+void addContainers(std::string_view list, std::vector<std::string>& to,
+                   std::vector<std::string>* invalidIDs) {
+  addEntries(list, to, [invalidIDs](const std::string& id) {
+    if (isValidContainerID(id)) return true;
+    if (invalidIDs != nullptr) invalidIDs->push_back(id.substr(0, kMaximumIDLength));
+    return false;
+  });
 }
 
 void readKey(std::string_view line, DesktopEntry& entry, std::vector<std::string>* invalidIDs) {
@@ -83,7 +89,12 @@ void readKey(std::string_view line, DesktopEntry& entry, std::vector<std::string
   } else if (key == "X-Yomber-Container-Name") {
     entry.containerName = unescaped(value);
   } else if (key == "X-Yomber-Container" || key == "X-Yomber-Containers") {
-    addContainers(value, entry, invalidIDs);
+    addContainers(value, entry.containerIDs, invalidIDs);
+  } else if (key == "X-Yomber-Shared-Containers") {
+    addContainers(value, entry.sharedContainerIDs, invalidIDs);
+  } else if (key == "X-Yomber-Services") {
+    addEntries(value, entry.services,
+               [](const std::string& service) { return service.size() <= kMaximumIDLength; });
   }
 }
 

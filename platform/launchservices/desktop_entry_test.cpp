@@ -1,4 +1,4 @@
-#include "zarn/desktop_entry.h"
+#include "platform/launchservices/desktop_entry.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -31,6 +31,19 @@ TEST(DesktopEntryTest, ReadsListsAndReportsWhatIsNotValid) {
   EXPECT_THAT(entry->containerIDs, ElementsAre("org.a.b", "org.c.d"));
   EXPECT_THAT(invalid, ElementsAre("../etc"));
   EXPECT_TRUE(entry->isHidden);
+}
+
+TEST(DesktopEntryTest, SharedContainersAndServicesAreListsOfTheirOwn) {
+  std::vector<std::string> invalid;
+  const auto entry = parseDesktopEntry(
+      "[Desktop Entry]\nX-Yomber-Shared-Containers=org.a.b;x\n"
+      "X-Yomber-Services=Documents;Sharing;Documents;\n",
+      &invalid);
+  ASSERT_TRUE(entry);
+  EXPECT_THAT(entry->sharedContainerIDs, ElementsAre("org.a.b"));
+  EXPECT_THAT(entry->services, ElementsAre("Documents", "Sharing"));
+  EXPECT_THAT(entry->containerIDs, IsEmpty());
+  EXPECT_THAT(invalid, ElementsAre("x"));
 }
 
 TEST(DesktopEntryTest, AFileWithoutTheGroupIsNone) {

@@ -8,6 +8,7 @@
 using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
 using Common = import "common.capnp";
+using Changes = import "changes.capnp".Changes;
 
 interface Control {
   item @0 (identifier :Text) -> (result :ItemResult);
@@ -22,6 +23,25 @@ interface Control {
   # A folder, the root or the working set. The watcher gets the present items first, then each change.
 
   status @5 () -> (status :Status);
+
+  changes @6 () -> (changes :Changes);
+  # Changes are never repeated: when the extension ends in the middle of one, it fails, and whether it
+  # was carried out is to be looked up.
+
+  # --- Content, by location inside the tree.
+
+  startProviding @7 (path :Data, options :UInt64) -> (need :Need, failure :Common.OptionalError);
+  # Answered when the content can be read. From the call on, and until the need that is answered is
+  # dropped, the host asks nobody to give the content up. Dropping the call takes the wish back. Options
+  # are Foundation's reading options. A folder is answered at once.
+  stopProviding @8 (path :Data) -> (failure :Common.OptionalError);
+  # Asks for the content to be given up. Answered when that has been tried; what came of it only the
+  # daemon knows. NSPOSIXErrorDomain EBUSY while somebody needs it.
+  itemChanged @9 (path :Data) -> (failure :Common.OptionalError);
+  # The content was written through a path.
+  movingItem @10 (path :Data, destination :Data)
+      -> (requiresProviding :Bool, failure :Common.OptionalError);
+  # Whether the content has to be here before the item is moved.
 
   struct ItemResult {
     union {
@@ -69,6 +89,9 @@ interface Listing {
 }
 
 interface Watch {}
+
+interface Need {}
+# Somebody needs an item's content. It ends when it is dropped, or with its connection.
 
 interface Watcher {
   # The host sends one call after the other, each when the last was answered.

@@ -9,12 +9,28 @@
 using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
 using Common = import "common.capnp";
+using Changes = import "changes.capnp".Changes;
 
 interface Extension {
   urlForItem @0 (identifier :Text) -> (path :Common.OptionalData);
   identifierForPath @1 (path :Data) -> (found :Bool, identifier :Text);
   itemForIdentifier @2 (identifier :Text) -> (result :ItemResult);
   enumerator @3 (container :Text) -> (result :EnumeratorResult);
+
+  changes @4 () -> (changes :Changes);
+
+  # --- Content, by location.
+
+  startProviding @5 (path :Data, options :UInt64) -> (failure :Common.OptionalError);
+  # Answered when the content can be read. Options are Foundation's reading options. One call at a time
+  # for each location; `stopProviding` ends it early, dropping it does not.
+  stopProviding @6 (path :Data) -> ();
+  # Nobody needs the content any more: what is being brought here is given up, what is here may go.
+  # Answered when that has been seen to; what came of it only the daemon knows.
+  itemChanged @7 (path :Data) -> ();
+  movingItem @8 (path :Data, destination :Data)
+      -> (requiresProviding :Bool, failure :Common.OptionalError);
+  # Whether the content has to be here before the item is moved.
 
   struct ItemResult {
     union {

@@ -2,58 +2,23 @@
 
 #include <atomic>
 #include <cerrno>
+#include <climits>
 #include <optional>
 #include <string>
 #include <utility>
 
+#include "platform/fileprovider/changes_server.h"
 #include "platform/fileprovider/errors.h"
 #include "platform/fileprovider/item_codec.h"
+#include "platform/fileprovider/loop_reply.h"
 #include "platform/fileprovider/reply_observers.h"
-#include "platform/foundation/log.h"
-#include "platform/foundation/thread_pool.h"
 #include "platform/ipc/error_codec.h"
-#include "platform/ipc/event_loop.h"
-#include "platform/ipc/remote.h"
 #include "platform/ipc/server_call.h"
 
 namespace yomber {
 namespace {
 
 using ipc::CancelFlag;
-using ipc::EventLoop;
-
-/// A promise of this loop, and the function that keeps it from any thread.
-template <typename T>
-struct LoopReply {
-  kj::Promise<T> promise = nullptr;
-  std::function<void(T)> fulfill;
-
-  static LoopReply make() {
-    auto pair = kj::newPromiseAndFulfiller<T>();
-    using Fulfiller = kj::Own<kj::PromiseFulfiller<T>>;
-    auto slot = std::shared_ptr<Fulfiller>(new Fulfiller(kj::mv(pair.fulfiller)),
-                                           ipc::detail::DeleteOnLoop());
-    LoopReply reply;
-    reply.promise = kj::mv(pair.promise);
-    reply.fulfill = [slot = std::move(slot)](T value) {
-      EventLoop::shared().post(
-          [slot, value = std::move(value)]() mutable { (*slot)->fulfill(std::move(value)); });
-    };
-    return reply;
-  }
-};
-
-/// Runs extension code on the pool; nothing that it throws leaves it.
-template <typename Work>
-void runOnPool(const char* operation, Work work) {
-  ThreadPool::shared().async([operation, work = std::move(work)]() mutable {
-    try {
-      work();
-    } catch (const std::exception& exception) {
-      log_fault(defaultLog(), "[CRIT] %s of the extension threw: %s", operation, exception.what());
-    }
-  });
-}
 
 NSErrorRef tokenTooLong() {
   return NSError::errorWithDomain(
@@ -137,7 +102,7 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
   explicit EnumeratorServer(NSFileProviderEnumeratorRef enumerator)
       : held_(std::make_shared<HeldEnumerator>(std::move(enumerator))) {}
   ~EnumeratorServer() noexcept {
-    runOnPool("invalidate", [held = held_] { held->invalidateOnce(); });
+    runExtensionCode("invalidate", [held = held_] { held->invalidateOnce(); });
   }
 
  protected:
@@ -151,11 +116,12 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
     auto page = decodePage(wanted);
     context.releaseParams();
     auto reply = LoopReply<EnumeratedPage>::make();
-    runOnPool("enumerateItemsForObserver",
-              [held = held_, page = std::move(page),
-               observer = std::make_shared<PageObserver>(std::move(reply.fulfill))]() mutable {
-                held->items().enumerateItemsForObserver(std::move(observer), std::move(page));
-              });
+    runExtensionCode(
+        "enumerateItemsForObserver",
+        [held = held_, page = std::move(page),
+         observer = std::make_shared<PageObserver>(std::move(reply.fulfill))]() mutable {
+          held->items().enumerateItemsForObserver(std::move(observer), std::move(page));
+        });
     return reply.promise.then(
         [context](EnumeratedPage told) mutable { encodePage(told, context); });
   }
@@ -173,12 +139,12 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
     auto anchor = NSData::dataWithString(stringFromWire(given));
     context.releaseParams();
     auto reply = LoopReply<EnumeratedChanges>::make();
-    runOnPool("enumerateChangesForObserver",
-              [held = held_, anchor = std::move(anchor),
-               observer = std::make_shared<ChangesObserver>(std::move(reply.fulfill))]() mutable {
-                held->changes()->enumerateChangesForObserver(std::move(observer),
-                                                             std::move(anchor));
-              });
+    runExtensionCode(
+        "enumerateChangesForObserver",
+        [held = held_, anchor = std::move(anchor),
+         observer = std::make_shared<ChangesObserver>(std::move(reply.fulfill))]() mutable {
+          held->changes()->enumerateChangesForObserver(std::move(observer), std::move(anchor));
+        });
     return reply.promise.then(
         [context](EnumeratedChanges told) mutable { encodeChanges(told, context); });
   }
@@ -187,7 +153,7 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
     context.allowCancellation();
     if (held_->changes() == nullptr) return kj::READY_NOW;
     auto reply = LoopReply<NSFileProviderSyncAnchor>::make();
-    runOnPool("currentSyncAnchor", [held = held_, fulfill = std::move(reply.fulfill)] {
+    runExtensionCode("currentSyncAnchor", [held = held_, fulfill = std::move(reply.fulfill)] {
       held->changes()->currentSyncAnchorWithCompletionHandler(fulfill);
     });
     return reply.promise.then([context](NSFileProviderSyncAnchor anchor) mutable {
@@ -281,7 +247,94 @@ class ExtensionServer final : public protocol::Extension::Server {
         });
   }
 
+  kj::Promise<void> changes(ChangesContext context) override {
+    context.getResults().setChanges(serveChanges(extension_));
+    return kj::READY_NOW;
+  }
+
+  kj::Promise<void> startProviding(StartProvidingContext context) override {
+    context.allowCancellation();
+    const auto params = context.getParams();
+    auto url = locationOf(params.getPath());
+    if (url == nullptr) return refuse(context);
+    auto reply = LoopReply<NSErrorRef>::makeFor(dropped());
+    runExtensionCode("startProvidingItemAtURL",
+                     [extension = extension_, url = std::move(url), options = params.getOptions(),
+                      handler = std::move(reply.fulfill)] {
+                       extension->startProvidingItemAtURL(url, options, handler);
+                     });
+    context.releaseParams();
+    return reply.promise.then([context](const NSErrorRef& error) mutable {
+      ipc::encodeOptional(error, context.getResults().initFailure());
+    });
+  }
+
+  kj::Promise<void> stopProviding(StopProvidingContext context) override {
+    auto url = locationOf(context.getParams().getPath());
+    context.releaseParams();
+    if (url == nullptr) return kj::READY_NOW;
+    return ipc::onPool([extension = extension_, url = std::move(url)](const CancelFlag&) {
+      extension->stopProvidingItemAtURL(url);
+    });
+  }
+
+  kj::Promise<void> itemChanged(ItemChangedContext context) override {
+    auto url = locationOf(context.getParams().getPath());
+    context.releaseParams();
+    if (url == nullptr) return kj::READY_NOW;
+    return ipc::onPool([extension = extension_, url = std::move(url)](const CancelFlag&) {
+      extension->itemChangedAtURL(url);
+    });
+  }
+
+  kj::Promise<void> movingItem(MovingItemContext context) override {
+    context.allowCancellation();
+    struct Answer {
+      bool requiresProviding = false;
+      NSErrorRef error;
+    };
+    const auto params = context.getParams();
+    auto url = locationOf(params.getPath());
+    auto destination = locationOf(params.getDestination());
+    if (url == nullptr || destination == nullptr) return refuse(context);
+    context.releaseParams();
+    auto reply = LoopReply<Answer>::makeFor({false, dropped()});
+    MoveHandler handler = [fulfill = std::move(reply.fulfill)](bool needed, NSErrorRef error) {
+      fulfill({needed, std::move(error)});
+    };
+    runExtensionCode(
+        "movingItemAtURL",
+        [extension = extension_, url = std::move(url), destination = std::move(destination),
+         handler = std::move(handler)] { extension->movingItemAtURL(url, destination, handler); });
+    return reply.promise.then([context](const Answer& answer) mutable {
+      auto results = context.getResults();
+      results.setRequiresProviding(answer.requiresProviding);
+      ipc::encodeOptional(answer.error, results.initFailure());
+    });
+  }
+
  private:
+  /// Nil for what is no location.
+  static NSURLRef locationOf(capnp::Data::Reader path) {
+    return path.size() > PATH_MAX ? nullptr : NSURL::fileURLWithPath(stringFromWire(path));
+  }
+
+  static NSErrorRef dropped() {
+    return NSError::errorWithDomain(
+        NSCocoaErrorDomain, NSXPCConnectionReplyInvalid,
+        {{NSLocalizedDescriptionKey,
+          std::string("the extension dropped the request without answering it")}});
+  }
+
+  template <typename Context>
+  static kj::Promise<void> refuse(Context& context) {
+    const auto error = NSError::errorWithDomain(
+        NSPOSIXErrorDomain, EINVAL,
+        {{NSLocalizedDescriptionKey, std::string("a location has to be an absolute path")}});
+    ipc::encodeOptional(error, context.getResults().initFailure());
+    return kj::READY_NOW;
+  }
+
   template <typename Context>
   static std::string takeIdentifier(Context& context, capnp::Text::Reader text) {
     context.allowCancellation();

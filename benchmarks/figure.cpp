@@ -26,6 +26,26 @@ Figure compared(std::string name, double value, std::string unit, std::string ya
   return figure;
 }
 
+void Repeated::add(double value, double yardstickValue) {
+  values_.push_back(value);
+  yardsticks_.push_back(yardstickValue);
+  ratios_.push_back(yardstickValue == 0 ? 0 : value / yardstickValue);
+}
+
+Figure Repeated::figure(std::string name, std::string unit, std::string yardstick, std::string goal,
+                        const std::function<bool(double ratio)>& isReached) const {
+  Figure figure;
+  figure.name = std::move(name);
+  figure.value = percentile(values_, 0.5);
+  figure.unit = std::move(unit);
+  figure.yardstick = std::move(yardstick);
+  figure.yardstickValue = percentile(yardsticks_, 0.5);
+  figure.ratio = percentile(ratios_, 0.5);
+  figure.goal = std::move(goal);
+  figure.reached = isReached(figure.ratio);
+  return figure;
+}
+
 void print(const Figure& figure) {
   if (std::getenv("YOMBER_BENCH_JSON") != nullptr) {
     nlohmann::ordered_json json{

@@ -23,6 +23,22 @@ struct Figure {
                               std::string yardstick, double yardstickValue, std::string goal,
                               const std::function<bool(double ratio)>& isReached);
 
+/// What was measured several times, each time beside its yardstick, so that whatever else the
+/// machine did hit both alike.
+class Repeated {
+ public:
+  void add(double value, double yardstickValue);
+  /// The medians; the ratio is the median of the rounds' own ratios.
+  [[nodiscard]] Figure figure(std::string name, std::string unit, std::string yardstick,
+                              std::string goal,
+                              const std::function<bool(double ratio)>& isReached) const;
+
+ private:
+  std::vector<double> values_;
+  std::vector<double> yardsticks_;
+  std::vector<double> ratios_;
+};
+
 /// Prints the figure: one JSON object a line when YOMBER_BENCH_JSON is set, else a line for people.
 void print(const Figure& figure);
 

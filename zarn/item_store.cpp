@@ -23,6 +23,18 @@ auto query(const Database& database, NSErrorRef* error, const Query& job)
   return result;
 }
 
+ItemStore::Counts countItems(Connection& connection) {
+  // The root and the trash are no items.
+  StatementUse all(connection.prepared("SELECT COUNT(*) FROM item"));
+  all->step();
+  StatementUse places(connection.prepared("SELECT COUNT(*) FROM item WHERE id IN (0,1)"));
+  places->step();
+  StatementUse folders(connection.prepared(
+      "SELECT COUNT(*) FROM item WHERE kind=1 AND (flags & 2)=0 AND parent>=0"));
+  folders->step();
+  return {.items = all->id(0) - places->id(0), .folders = folders->id(0)};
+}
+
 std::uint64_t placeID(Connection& connection, const TreeLayout::Place& place, bool& isKnown) {
   isKnown = true;
   if (place.kind == TreeLayout::Place::Kind::Trash) return kTrashID;
@@ -125,20 +137,20 @@ std::optional<std::string> ItemStore::physicalPath(std::uint64_t id, NSErrorRef*
 }
 
 ItemStore::Counts ItemStore::counts(NSErrorRef* error) const {
-  return query(*database_, error, [](Connection& c) {
-    // The root and the trash are no items.
-    StatementUse all(c.prepared("SELECT COUNT(*) FROM item"));
-    all->step();
-    StatementUse places(c.prepared("SELECT COUNT(*) FROM item WHERE id IN (0,1)"));
-    places->step();
-    StatementUse folders(
-        c.prepared("SELECT COUNT(*) FROM item WHERE kind=1 AND (flags & 2)=0 AND parent>=0"));
-    folders->step();
-    Counts counts;
-    counts.items = all->id(0) - places->id(0);
-    counts.folders = folders->id(0);
-    return counts;
-  });
+  // Looked at before counting: what is committed meanwhile makes the next call count again.
+  Counted counted{.identity = database_->identity(), .rank = database_->currentRank(), .counts = {}};
+  const auto kept = counted_.load();
+  if (kept && kept->identity == counted.identity && kept->rank == counted.rank) {
+    return kept->counts;
+  }
+  NSErrorRef failure;
+  counted.counts = query(*database_, &failure, countItems);
+  if (failure) {
+    storeError(error, failure);
+  } else {
+    counted_.store(counted);
+  }
+  return counted.counts;
 }
 
 }  // namespace yomber

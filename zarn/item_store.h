@@ -8,6 +8,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/foundation/atomic_cell.h"
 #include "platform/foundation/error.h"
 #include "zarn/database.h"
 #include "zarn/item_row.h"
@@ -56,6 +57,7 @@ class ItemStore {
     std::uint64_t items = 0;  ///< folders included; neither the root nor the trash
     std::uint64_t folders = 0;
   };
+  /// Counts again only when something has changed since.
   [[nodiscard]] Counts counts(NSErrorRef* error = nullptr) const;
 
   /// Makes the root hold exactly these containers' folders: new ones get a row (and their Documents
@@ -66,8 +68,16 @@ class ItemStore {
   [[nodiscard]] const std::shared_ptr<Database>& database() const { return database_; }
 
  private:
+  /// What was counted, and of which state of which database.
+  struct Counted {
+    std::uint64_t identity = 0;
+    std::uint64_t rank = 0;
+    Counts counts;
+  };
+
   std::shared_ptr<Database> database_;
   TreeLayout layout_;
+  mutable AtomicCell<std::optional<Counted>> counted_;
 };
 
 }  // namespace yomber

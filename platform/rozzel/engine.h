@@ -266,7 +266,8 @@ class RZEngine {
                                             std::optional<std::uint64_t> limit) = 0;
   [[nodiscard]] virtual NSErrorRef fetchQuota(const std::string& accountName, RZQuota& quota) = 0;
 
-  // Assets. An asset that no record refers to stays for a day at least after it was committed.
+  // Assets. An asset that no record refers to stays for a day at least after it was committed. A
+  // group must not outlive its engine.
 
   [[nodiscard]] virtual std::unique_ptr<RZAssetGroup> newAssetGroup(NSErrorRef* error) = 0;
   /// A descriptor for reading the content from its start. Only presence and size are checked: who

@@ -5,12 +5,14 @@
 #include <cstdlib>
 #include <string_view>
 
+#include "platform/fileprovider/file_operations.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/wire_item.h"
 #include "platform/foundation/drive_paths.h"
 #include "platform/ipc/gate.h"
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
+#include "platform/ostrell/item_additions.h"
 
 namespace yomber {
 namespace {
@@ -111,7 +113,9 @@ void DaemonLink::replaceCurrent(const std::string& home) {
 
 std::shared_ptr<DaemonLink> DaemonLink::create(const std::string& home) {
   registerItemsInErrors();
+  setPhysicalLocationResolver([](const NSURLRef& logical) { return qs_physicalURL(logical); });
   const DrivePaths paths = DrivePaths::forHome(home);
+  setStagingFolder(paths.privateDirectory + "/copies");
   return std::shared_ptr<DaemonLink>(new DaemonLink(paths.home, paths.daemonSocket));
 }
 

@@ -36,6 +36,7 @@ NSURLRef qs_putBackURLForTrashedItemAtURL(const NSFileManager& /*manager*/, cons
 
 void qs_setLastOpenDate(const NSFileManager& /*manager*/, const std::optional<NSDate>& date,
                         const NSURLRef& onItemAtURL) {
+  if (!onItemAtURL) return;
   const NSErrorRef failure =
       waitForReply(onItemAtURL, [&](QSDaemonProtocol& daemon, const auto& reply) {
         daemon.setLastUsedDate(date, onItemAtURL, reply);
@@ -47,6 +48,7 @@ void qs_setLastOpenDate(const NSFileManager& /*manager*/, const std::optional<NS
 
 void qs_setFavoriteRank(const NSFileManager& /*manager*/, const std::optional<std::int64_t>& rank,
                         const NSURLRef& onItemAtURL) {
+  if (!onItemAtURL) return;
   const NSErrorRef failure =
       waitForReply(onItemAtURL, [&](QSDaemonProtocol& daemon, const auto& reply) {
         daemon.setFavoriteRank(rank, onItemAtURL, reply);

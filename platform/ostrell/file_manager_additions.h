@@ -11,7 +11,8 @@
 namespace yomber {
 
 // What the client library adds to the file manager: operations on items of the drive that the
-// daemon makes. Each is a synchronous daemon call. A nil location fails with Cocoa error 4.
+// daemon makes. Each is a synchronous daemon call. A nil location fails with Cocoa error 4, where
+// something can fail.
 
 /// Gives up the item's local content; the item stays. QSOstrellErrorCannotEvict says why that
 /// cannot be (not confirmed in the store, changed since, open, pinned).

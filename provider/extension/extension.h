@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <map>
 #include <memory>
 #include <optional>
@@ -7,9 +8,12 @@
 #include <vector>
 
 #include "platform/fileprovider/extension.h"
+#include "platform/foundation/data.h"
+#include "platform/foundation/date.h"
 #include "platform/foundation/lock.h"
 #include "platform/foundation/operation.h"
 #include "platform/foundation/serial_queue.h"
+#include "platform/ostrell/file_providing_operation.h"
 #include "platform/ostrell/query_item.h"
 
 namespace yomber {
@@ -26,8 +30,9 @@ enum class AttachPhysical : bool { No = false, Yes = true };
 /// Ownership: made by `init`; the notification centre holds it weakly.
 /// Thread-safety: every operation may be called on any thread, concurrently. The lookups block
 /// their thread for the daemon's replies. Errors: each `error` may be null and is written only on
-/// failure.
-class QSFileProviderExtension final : public NSFileProviderExtension {
+/// failure. Completion handlers may be empty, unless it is said otherwise, and are called once.
+class QSFileProviderExtension final : public NSFileProviderExtension,
+                                      public std::enable_shared_from_this<QSFileProviderExtension> {
  public:
   /// Never nil. From now on an account change signals the root's enumerator.
   static std::shared_ptr<QSFileProviderExtension> init();
@@ -35,6 +40,74 @@ class QSFileProviderExtension final : public NSFileProviderExtension {
 
   /// Calls the handler at once; no placeholder file is written.
   void providePlaceholderAtURL(const NSURLRef& url, ErrorHandler completionHandler) override;
+
+  // Content: providing.cpp and stopping.cpp.
+
+  /// Reads outside the synced tree, and of what is here already, are granted at once. Everything
+  /// else is provided by an operation that `stopProvidingItemAtURL` can cancel.
+  void startProvidingItemAtURL(const NSURLRef& url, ErrorHandler completionHandler) override;
+  void startProvidingItemAtURL(const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions,
+                               ErrorHandler completionHandler) override;
+  /// Cancels the item's providing operation, or gives up its local content; neither for what is
+  /// being downloaded so that it can be moved.
+  void stopProvidingItemAtURL(const NSURLRef& url) override;
+  void itemChangedAtURL(const NSURLRef& url) override;
+  /// Answers on the calling thread.
+  void movingItemAtURL(const NSURLRef& url, const NSURLRef& destinationURL,
+                       MoveHandler completionHandler) override;
+
+  // Changes of the tree: import.cpp, rename_and_reparent.cpp and trash.cpp. They return before the
+  // work is done, but for trashing, which answers on the calling thread.
+
+  /// An import whose item cannot be looked up answers neither item nor error.
+  void importDocumentAtURL(const NSURLRef& url,
+                           const NSFileProviderItemIdentifier& toParentItemIdentifier,
+                           ItemHandler completionHandler) override;
+  void createDirectoryWithName(const std::string& name,
+                               const NSFileProviderItemIdentifier& inParentItemIdentifier,
+                               ItemHandler completionHandler) override;
+  void renameItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                const std::string& toName, ItemHandler completionHandler) override;
+  /// A move that needs the content downloads it first, and keeps it until the move has begun.
+  void reparentItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                  const NSFileProviderItemIdentifier& toParentItemWithIdentifier,
+                                  const std::optional<std::string>& newName,
+                                  ItemHandler completionHandler) override;
+  /// Answers errors as they come, not in the framework's terms.
+  void trashItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                               ItemHandler completionHandler) override;
+  void _trashItemAtURLWithoutCoordination(const NSURLRef& url,
+                                          URLHandler completionHandler) override;
+  void untrashItemWithIdentifier(
+      const NSFileProviderItemIdentifier& identifier,
+      const std::optional<NSFileProviderItemIdentifier>& toParentItemIdentifier,
+      ItemHandler completionHandler) override;
+  void deleteItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                ErrorHandler completionHandler) override;
+
+  // Metadata: item_metadata.cpp. They answer on the calling thread.
+
+  void setLastUsedDate(const std::optional<NSDate>& date,
+                       const NSFileProviderItemIdentifier& forItemIdentifier,
+                       ItemHandler completionHandler) override;
+  /// REQUIRES: a completion handler. Tags land on a bookmark's target.
+  void setTagData(const NSDataRef& tagData, const NSFileProviderItemIdentifier& forItemIdentifier,
+                  ItemHandler completionHandler) override;
+  void setFavoriteRank(const std::optional<std::int64_t>& rank,
+                       const NSFileProviderItemIdentifier& forItemIdentifier,
+                       ItemHandler completionHandler) override;
+
+  // An application's folder: default_application_container.cpp.
+
+  /// Without a bundle, and for the drive's own files browser, the Documents folder of the root.
+  void _defaultApplicationContainerForBundleIdentifier(
+      const std::optional<std::string>& bundleIdentifier, ItemHandler completionHandler) override;
+
+  // Errors: collision_errors.cpp.
+
+  /// A clash of names becomes the framework's collision error with the item in the way; any other
+  /// error, and a clash whose item cannot be found, is answered as it is. Never logs.
+  NSErrorRef fileProviderErrorFromFSError(const NSErrorRef& error);
 
   // Lookup: item_lookup.cpp.
 
@@ -74,15 +147,39 @@ class QSFileProviderExtension final : public NSFileProviderExtension {
  private:
   QSFileProviderExtension();
 
+  void _provideItemAtURL(const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions,
+                         std::uint64_t section, ErrorHandler completionHandler);
+  void _didProvideItemAtPath(const std::string& path, std::uint64_t section,
+                             const NSErrorRef& error, const ErrorHandler& completionHandler);
+  /// Whether the item is downloaded so that it, or a folder above it, can be moved.
+  bool _isDownloadingForMove(const NSURLRef& url);
+
+  struct Reparenting;
+  void _refuseReparenting(const std::shared_ptr<Reparenting>& request);
+  void _provideForReparenting(const std::shared_ptr<Reparenting>& request);
+  void _didProvideForReparenting(const std::shared_ptr<Reparenting>& request,
+                                 const NSErrorRef& error);
+  void _reparent(const std::shared_ptr<Reparenting>& request);
+
+  NSURLRef _untrashDestination(
+      const NSURLRef& url,
+      const std::optional<NSFileProviderItemIdentifier>& toParentItemIdentifier);
+  /// Answers the item at the location that a change of the tree led to, or that change's failure.
+  void _answerItemAtNewURL(const NSURLRef& url, const NSErrorRef& error,
+                           const ItemHandler& completionHandler);
+  void _answerContainerWithIdentifier(const std::string& containerID,
+                                      ItemHandler completionHandler);
+
   // "The lock of the object itself", and that of the array. Never hold both at once, nor either
-  // while calling out.
+  // while calling out, except that a stop looks the array's items up while it holds the array's.
   RecursiveMutex _lock;
   RecursiveMutex _itemsForcedDownloadLock;
 
   // In this order: they are released from the last to the first.
 
   /// The downloads in flight, by the item's path.
-  std::map<std::string, std::shared_ptr<NSOperation>> _downloadOperationByPath GUARDED_BY(_lock);
+  std::map<std::string, std::shared_ptr<QSFileProvidingOperation>> _downloadOperationByPath
+      GUARDED_BY(_lock);
   std::shared_ptr<NSOperationQueue> _operationQueue;
   /// Part of the object's footprint; nothing is submitted to it.
   std::shared_ptr<SerialQueue> _queue;

@@ -1,14 +1,16 @@
 #include "fileproviderd/control_server.h"
 
 #include <climits>
-#include <optional>
 #include <utility>
 
+#include "fileproviderd/change_forwarder.h"
 #include "fileproviderd/host_errors.h"
 #include "fileproviderd/listing.h"
+#include "fileproviderd/outcome.h"
 #include "fileproviderd/remote_watcher.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/foundation/process_usage.h"
+#include "platform/foundation/url.h"
 #include "platform/ipc/error_codec.h"
 
 namespace yomber {
@@ -19,25 +21,6 @@ using protocol::Control;
 /// No identifier is longer.
 constexpr std::size_t kMaximumIdentifierLength = 1'024;
 
-/// A value or an error, on its way into a reply.
-template <typename Value>
-struct Outcome {
-  std::optional<Value> value;
-  NSErrorRef error;
-};
-
-/// The promise of what `start` hands to its handler.
-template <typename Value, typename Start>
-kj::Promise<Outcome<Value>> outcomeOf(Start start) {
-  auto pair = kj::newPromiseAndFulfiller<Outcome<Value>>();
-  auto fulfiller =
-      std::make_shared<kj::Own<kj::PromiseFulfiller<Outcome<Value>>>>(kj::mv(pair.fulfiller));
-  start([fulfiller](std::optional<Value> value, NSErrorRef error) {
-    (*fulfiller)->fulfill({std::move(value), std::move(error)});
-  });
-  return kj::mv(pair.promise);
-}
-
 /// Keeps a watch for as long as its client holds it.
 class WatchServer final : public protocol::Watch::Server {
  public:
@@ -46,6 +29,35 @@ class WatchServer final : public protocol::Watch::Server {
  private:
   const std::shared_ptr<ContainerWatch> watch_;
 };
+
+/// Keeps a need for as long as its client holds it.
+class NeedServer final : public protocol::Need::Server {
+ public:
+  explicit NeedServer(ContentNeeds::NeedRef need) : need_(std::move(need)) {}
+
+ private:
+  const ContentNeeds::NeedRef need_;
+};
+
+/// The location in its one form; empty for what is none.
+std::string locationOf(capnp::Data::Reader path) {
+  if (path.size() > PATH_MAX) return {};
+  const NSURLRef url = NSURL::fileURLWithPath(stringFromWire(path));
+  return url != nullptr ? url->path() : std::string();
+}
+
+NSErrorRef noLocationError() {
+  return invalidRequestError("a location has to be an absolute path");
+}
+
+/// The promise of the error that `start` hands to its handler.
+template <typename Start>
+kj::Promise<NSErrorRef> failureOf(Start start) {
+  return outcomeOf<bool>([&](auto handler) {
+           start([handler](NSErrorRef error) { handler(true, std::move(error)); });
+         })
+      .then([](Outcome<bool> outcome) { return std::move(outcome.error); });
+}
 
 class ControlServer final : public Control::Server {
  public:
@@ -138,7 +150,72 @@ class ControlServer final : public Control::Server {
     return kj::READY_NOW;
   }
 
+  kj::Promise<void> changes(ChangesContext context) override {
+    context.getResults().setChanges(makeChangeForwarder(host_));
+    return kj::READY_NOW;
+  }
+
+  kj::Promise<void> startProviding(StartProvidingContext context) override {
+    context.allowCancellation();
+    const auto params = context.getParams();
+    const std::string path = locationOf(params.getPath());
+    if (path.empty()) return fail(context, noLocationError());
+    ContentNeeds::NeedRef need;
+    auto failure = failureOf([&](ContentNeeds::Handler handler) {
+      need = host_->contentNeeds().need(path, params.getOptions(), std::move(handler));
+    });
+    if (need == nullptr) return fail(context, invalidRequestError("too many items are in use"));
+    return failure.then([context, need = std::move(need)](const NSErrorRef& error) mutable {
+      auto results = context.getResults();
+      ipc::encodeOptional(error, results.initFailure());
+      if (error == nullptr) results.setNeed(kj::heap<NeedServer>(std::move(need)));
+    });
+  }
+
+  kj::Promise<void> stopProviding(StopProvidingContext context) override {
+    const std::string path = locationOf(context.getParams().getPath());
+    if (path.empty()) return fail(context, noLocationError());
+    return failureOf([&](ContentNeeds::Handler handler) {
+             host_->contentNeeds().stop(path, std::move(handler));
+           })
+        .then([context](const NSErrorRef& error) mutable {
+          ipc::encodeOptional(error, context.getResults().initFailure());
+        });
+  }
+
+  kj::Promise<void> itemChanged(ItemChangedContext context) override {
+    const std::string path = locationOf(context.getParams().getPath());
+    if (path.empty()) return fail(context, noLocationError());
+    return failureOf([&](ContentNeeds::Handler handler) {
+             host_->content().itemChanged(path, std::move(handler));
+           })
+        .then([context](const NSErrorRef& error) mutable {
+          ipc::encodeOptional(error, context.getResults().initFailure());
+        });
+  }
+
+  kj::Promise<void> movingItem(MovingItemContext context) override {
+    context.allowCancellation();
+    const std::string path = locationOf(context.getParams().getPath());
+    const std::string destination = locationOf(context.getParams().getDestination());
+    if (path.empty() || destination.empty()) return fail(context, noLocationError());
+    return outcomeOf<bool>([&](auto handler) {
+             host_->content().movingItem(path, destination, std::move(handler));
+           })
+        .then([context](const Outcome<bool>& outcome) mutable {
+          auto results = context.getResults();
+          results.setRequiresProviding(outcome.value.value_or(false));
+          ipc::encodeOptional(outcome.error, results.initFailure());
+        });
+  }
+
  private:
+  template <typename Context>
+  static kj::Promise<void> fail(Context& context, const NSErrorRef& error) {
+    ipc::encodeOptional(error, context.getResults().initFailure());
+    return kj::READY_NOW;
+  }
+
   template <typename Context>
   static kj::Promise<void> refuse(Context& context, const char* what) {
     const auto error = invalidRequestError(std::string(what) + " is too long");

@@ -43,6 +43,8 @@ class ExtensionSession {
   virtual void openEnumerator(
       const std::string& container,
       std::function<void(ipc::Remote<protocol::Enumerator>, NSErrorRef)> handler) = 0;
+  /// The extension itself, for what is passed on and for what has no time limit.
+  [[nodiscard]] virtual ipc::Remote<protocol::Extension> remote() const = 0;
 };
 
 using ExtensionSessionRef = std::shared_ptr<ExtensionSession>;

@@ -48,6 +48,7 @@ class FakeSession final : public ExtensionSession {
   void openEnumerator(const std::string&,
                       std::function<void(ipc::Remote<protocol::Enumerator>, NSErrorRef)>) override {
   }
+  [[nodiscard]] ipc::Remote<protocol::Extension> remote() const override { return nullptr; }
 
   const ExtensionEvents events;
   bool hasEnded = false;

@@ -9,6 +9,8 @@
 #include <vector>
 
 #include "fileproviderd/container_watch.h"
+#include "fileproviderd/content_needs.h"
+#include "fileproviderd/extension_content.h"
 #include "fileproviderd/extension_supervisor.h"
 #include "fileproviderd/host_clock.h"
 #include "fileproviderd/remote_session.h"
@@ -29,6 +31,7 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
     std::chrono::milliseconds callLimit{30'000};  ///< for one request to the extension
     ExtensionSupervisor::Limits supervision;
     ContainerWatch::Limits watching;
+    ContentNeeds::Limits needs;
     std::size_t maximumWatches = 4'096;
   };
   static std::shared_ptr<Host> create(Options options);
@@ -54,6 +57,10 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
   /// Puts an error into words: one that comes from zarn not being there says so.
   void explain(const NSErrorRef& error, std::function<void(NSErrorRef)> handler);
 
+  /// Content as the extension has it, and who needs it. Both live as long as the host.
+  [[nodiscard]] ExtensionContent& content();
+  [[nodiscard]] ContentNeeds& contentNeeds();
+
   [[nodiscard]] ExtensionSupervisor& supervisor() { return *supervisor_; }
   [[nodiscard]] bool isDaemonReachable() const { return zarn_->isReachable(); }
   [[nodiscard]] std::uint32_t watchCount() const;
@@ -75,6 +82,8 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
   ProcessLauncher launcher_;
   std::shared_ptr<ZarnLink> zarn_;
   std::shared_ptr<ExtensionSupervisor> supervisor_;
+  std::shared_ptr<ExtensionContent> content_;  ///< made when it is first asked for
+  std::shared_ptr<ContentNeeds> needs_;
   std::vector<std::weak_ptr<ContainerWatch>> watches_;
 };
 

@@ -28,6 +28,13 @@ NSErrorRef extensionUnavailableError(const std::string& reason, const NSErrorRef
                      underlying);
 }
 
+NSErrorRef changeInterruptedError(const NSErrorRef& underlying) {
+  return unreachable(
+      "the drive's extension ended in the middle of the change: look whether it was carried out "
+      "before you try again",
+      underlying);
+}
+
 NSErrorRef invalidRequestError(const std::string& what) {
   return NSError::errorWithDomain(NSPOSIXErrorDomain, EINVAL, {{NSLocalizedDescriptionKey, what}});
 }

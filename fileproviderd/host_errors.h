@@ -12,6 +12,8 @@ namespace yomber {
 /// `reason` says what is wrong with it, e.g. "was ended by signal 9".
 [[nodiscard]] NSErrorRef extensionUnavailableError(const std::string& reason,
                                                    const NSErrorRef& underlying = nullptr);
+/// The extension was lost in the middle of a change.
+[[nodiscard]] NSErrorRef changeInterruptedError(const NSErrorRef& underlying);
 [[nodiscard]] NSErrorRef invalidRequestError(const std::string& what);
 
 /// Whether the error says that a peer was lost, is not there, or did not answer in time.

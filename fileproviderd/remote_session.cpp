@@ -64,6 +64,7 @@ class RemoteSession final : public ExtensionSession,
   void openEnumerator(
       const std::string& container,
       std::function<void(ipc::Remote<protocol::Enumerator>, NSErrorRef)> handler) override;
+  [[nodiscard]] ipc::Remote<protocol::Extension> remote() const override { return extension_; }
 
  private:
   void didEnd(const std::string& how, const NSErrorRef& underlying);

@@ -36,4 +36,28 @@ NSErrorRef invalidParameterError(const char* parameter, std::string_view value) 
        {NSLocalizedDescriptionKey, "not a valid " + std::string(parameter)}});
 }
 
+NSErrorRef outsideTreeError(std::string_view path) {
+  const std::string text = shortened(path);
+  return NSError::errorWithDomain(
+      QSOstrellErrorDomain, QSOstrellErrorInvalidParameter,
+      {{QSOstrellErrorParameterKey, std::string("path")},
+       {QSOstrellErrorValueKey, text},
+       {NSLocalizedDescriptionKey,
+        text + " is not inside the drive; give a location in its tree"}});
+}
+
+NSErrorRef refusedError(int number, std::string_view path, const std::string& reason) {
+  const std::string text = shortened(path);
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileWriteUnknownError,
+                                  {{NSFilePathErrorKey, text},
+                                   {NSUnderlyingErrorKey, NSError::errorWithErrno(number, text)},
+                                   {NSLocalizedDescriptionKey, reason}});
+}
+
+NSErrorRef cancelledError(std::string_view path) {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError,
+                                  {{NSFilePathErrorKey, shortened(path)},
+                                   {NSLocalizedDescriptionKey, std::string("cancelled")}});
+}
+
 }  // namespace yomber

@@ -75,12 +75,13 @@ int TreeLayout::createFolders() const {
 
 std::optional<TreeLayout::Place> TreeLayout::placeOf(std::string_view path) const {
   if (!isBelowOrEqual(path, tree_) || path.size() == tree_.size()) return std::nullopt;
+  if (path.find('\0') != std::string_view::npos) return std::nullopt;  // no file has that
   if (hasDotComponents(below(path, tree_))) return std::nullopt;
   if (isBelowOrEqual(path, trashFiles_)) {
     return Place{Place::Kind::Trash, {}, trashFiles_, std::string(below(path, trashFiles_))};
   }
   const std::string_view relative = below(path, tree_);
-  if (relative.front() == '.') return std::nullopt;
+  if (relative.empty() || relative.front() == '.') return std::nullopt;
   const std::string containerID(relative.substr(0, relative.find('/')));
   std::string place = documents(containerID);
   if (!isBelowOrEqual(path, place)) return std::nullopt;

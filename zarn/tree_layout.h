@@ -41,7 +41,7 @@ class TreeLayout {
     std::string relative;     ///< below it; empty for the place itself
   };
   /// Nothing for locations outside every place: private ones, promises, trash information, what is
-  /// not in the tree at all, and paths with "." or ".." components.
+  /// not in the tree at all, and paths that no file can have or with "." or ".." components.
   [[nodiscard]] std::optional<Place> placeOf(std::string_view path) const;
 
   /// Whether a location lies in the tree but is the drive's own business (promises, trash

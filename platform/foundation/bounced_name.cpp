@@ -23,13 +23,18 @@ std::string_view cutToBytes(std::string_view text, std::size_t length) {
 }  // namespace
 
 std::string bouncedName(std::string_view name,
-                        const std::function<bool(const std::string&)>& isTaken) {
-  std::string candidate(name);
+                        const std::function<bool(const std::string&)>& isTaken,
+                        std::size_t maximumLength) {
   const std::size_t dot = extensionBegin(name);
   const std::string_view extension = name.substr(dot);
+  std::string candidate(name);
+  if (name.size() > maximumLength) {
+    candidate = cutToBytes(name.substr(0, dot), maximumLength - extension.size());
+    candidate.append(extension);
+  }
   for (std::uint64_t number = 2; isTaken(candidate); ++number) {
     const std::string suffix = " " + std::to_string(number);
-    const std::size_t room = kMaximumNameLength - suffix.size() - extension.size();
+    const std::size_t room = maximumLength - suffix.size() - extension.size();
     candidate = cutToBytes(name.substr(0, dot), room);
     candidate.append(suffix).append(extension);
   }

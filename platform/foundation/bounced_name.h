@@ -10,9 +10,10 @@ namespace yomber {
 inline constexpr std::size_t kMaximumNameLength = 255;
 
 /// "report.pdf" becomes "report 2.pdf", "report 3.pdf" and so on, until `isTaken` says no. The stem
-/// is cut, at a character's boundary, where the result would be too long. Answers the name itself
-/// when it is free.
+/// is cut, at a character's boundary, where the result would be longer than `maximumLength`.
+/// Answers the name itself when it is free and short enough.
 [[nodiscard]] std::string bouncedName(std::string_view name,
-                                      const std::function<bool(const std::string&)>& isTaken);
+                                      const std::function<bool(const std::string&)>& isTaken,
+                                      std::size_t maximumLength = kMaximumNameLength);
 
 }  // namespace yomber

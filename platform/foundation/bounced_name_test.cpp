@@ -30,5 +30,15 @@ TEST(BouncedName, CutsLongStemsBetweenCharacters) {
   EXPECT_TRUE(result.ends_with("\u00e9 2.txt")) << result;
 }
 
+TEST(BouncedName, KeepsToAShorterLength) {
+  const auto isFree = [](const std::string&) { return false; };
+  EXPECT_EQ(bouncedName("abcdefgh.txt", isFree, 10), "abcdef.txt");
+  EXPECT_EQ(bouncedName("ab\u00e9cdefgh.txt", isFree, 7), "ab.txt");
+  EXPECT_EQ(bouncedName(
+                "abcdefgh.txt", [](const auto& name) { return name == "abcdef.txt"; }, 10),
+            "abcd 2.txt");
+  EXPECT_EQ(bouncedName("ab.txt", isFree, 10), "ab.txt");
+}
+
 }  // namespace
 }  // namespace yomber

@@ -81,14 +81,41 @@ ItemAttributes readItemAttributes(const char* path) {
   return result;
 }
 
-bool stampItem(int folder, const std::string& name, std::uint64_t inode, std::uint64_t id) {
+int writeItemAttribute(int folder, const std::string& name, std::uint64_t inode,
+                       const char* attribute, const std::optional<std::string>& value) {
   const FileDescriptor file(openat(folder, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   struct stat status{};
-  if (!file || fstat(file.get(), &status) != 0) return false;
-  if (status.st_ino != inode || S_ISLNK(status.st_mode)) return false;
+  if (!file || fstat(file.get(), &status) != 0) return errno;
+  if (status.st_ino != inode) return ESTALE;
+  if (S_ISLNK(status.st_mode)) return EPERM;  // the path below would be its target's
   const std::string path = "/proc/self/fd/" + std::to_string(file.get());
-  const std::string text = std::to_string(id);
-  return setxattr(path.c_str(), kIDAttribute, text.data(), text.size(), 0) == 0;
+  if (value) {
+    return setxattr(path.c_str(), attribute, value->data(), value->size(), 0) == 0 ? 0 : errno;
+  }
+  return removexattr(path.c_str(), attribute) == 0 || errno == ENODATA ? 0 : errno;
+}
+
+int writeItemExtra(int folder, const std::string& name, std::uint64_t inode,
+                   const ItemExtra& extra) {
+  const auto text = [](const std::optional<std::int64_t>& number) {
+    return number ? std::optional(std::to_string(*number)) : std::nullopt;
+  };
+  std::optional<std::string> tags;
+  if (!extra.tags.empty()) tags = joinTags(extra.tags);
+  const std::pair<const char*, std::optional<std::string>> values[] = {
+      {kTagsAttribute, std::move(tags)},
+      {kFavoriteAttribute, text(extra.favoriteRank)},
+      {kLastUsedAttribute, text(extra.lastUsed)}};
+  for (const auto& [attribute, value] : values) {
+    if (const int failure = writeItemAttribute(folder, name, inode, attribute, value)) {
+      return failure;
+    }
+  }
+  return 0;
+}
+
+bool stampItem(int folder, const std::string& name, std::uint64_t inode, std::uint64_t id) {
+  return writeItemAttribute(folder, name, inode, kIDAttribute, std::to_string(id)) == 0;
 }
 
 std::string pathThroughDescriptor(int folder, std::string_view name) {

@@ -31,6 +31,17 @@ struct ItemAttributes {
 /// `path` may be relative to the thread's working directory; a final symbolic link is not followed.
 [[nodiscard]] ItemAttributes readItemAttributes(const char* path);
 
+/// Writes an attribute of the file `name` in the folder open as `folder` (without a value: removes
+/// it), provided that it still has that inode. "." is the folder itself. Answers errno: 0 when it
+/// is so now, ESTALE when another file is there.
+[[nodiscard]] int writeItemAttribute(int folder, const std::string& name, std::uint64_t inode,
+                                     const char* attribute,
+                                     const std::optional<std::string>& value);
+
+/// The same for all that an item's extra says of its file; stops at the first failure.
+[[nodiscard]] int writeItemExtra(int folder, const std::string& name, std::uint64_t inode,
+                                 const ItemExtra& extra);
+
 /// Writes an id to the file `name` in the folder open as `folder`, provided that it still has that
 /// inode. Answers whether it is there now.
 bool stampItem(int folder, const std::string& name, std::uint64_t inode, std::uint64_t id);

@@ -66,6 +66,7 @@ std::uint32_t itemCapabilities(const ItemRow& row) {
   const bool isWritable = S_ISLNK(row.mode) || (row.mode & kOwnerWrite) != 0;
   std::uint32_t result = kReading | (isWritable ? kWriting : 0);
   if (!isPlace) result |= kArranging;
+  if (row.isTrashed()) result &= ~std::uint32_t{NSFileProviderItemCapabilitiesAllowsTrashing};
   return result;
 }
 

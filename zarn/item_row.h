@@ -29,6 +29,9 @@ inline constexpr std::uint32_t kShared = 16;
 inline constexpr std::uint32_t kWireMask = 0xffff;
 inline constexpr std::uint32_t kStamped = 1U << 16U;   ///< the file carries its id as an attribute
 inline constexpr std::uint32_t kHasExtra = 1U << 17U;  ///< there is an ItemExtra
+/// The row alone holds what else is known: the file cannot carry it (a symbolic link, several hard
+/// links). Whatever attributes the file has do not count.
+inline constexpr std::uint32_t kKeepsExtra = 1U << 18U;
 }  // namespace row_flag
 
 /// What few items have: kept apart so that rows stay slim.

@@ -139,6 +139,7 @@ class Reconciler {
   // Storing (reconciler_rows.cpp).
   void describe(const Candidate& candidate, ItemRow& row) const;
   void choosePlace(WriteTransaction& transaction, const Candidate& candidate, ItemRow& row);
+  void giveBack(const Candidate& candidate, ItemRow& row) const;
   void stamp(const Candidate& candidate, ItemRow& row) const;
   /// False, with nothing stored, when a folder would come to lie below itself.
   bool storeChanged(WriteTransaction& transaction, const Candidate& candidate,

@@ -10,7 +10,8 @@ constexpr std::uint32_t kFromDisk =
     row_flag::kShared | row_flag::kDownloaded | row_flag::kHasExtra | row_flag::kStamped;
 
 bool isShownDifferently(const ItemRow& left, const ItemRow& right) {
-  constexpr std::uint32_t kUnseen = row_flag::kStamped | row_flag::kHasExtra;
+  constexpr std::uint32_t kUnseen =
+      row_flag::kStamped | row_flag::kHasExtra | row_flag::kKeepsExtra;
   const bool hasSameExtra =
       left.extra == right.extra || (left.extra && right.extra && *left.extra == *right.extra);
   return left.parent != right.parent || left.name != right.name ||
@@ -56,7 +57,9 @@ void Reconciler::describe(const Candidate& candidate, ItemRow& row) const {
   row.inode = entry.inode;
 
   const ItemAttributes& attributes = candidate.attributes;
-  ItemExtra extra = attributes.extra;
+  const bool isKept = (row.flags & row_flag::kKeepsExtra) != 0;
+  ItemExtra extra = isKept ? ItemExtra{} : attributes.extra;
+  if (isKept && row.extra) extra = *row.extra;
   if (row.extra) extra.containerID = row.extra->containerID;
   row.extra = extra.isEmpty() ? nullptr : std::make_shared<const ItemExtra>(std::move(extra));
   row.flags &= ~kFromDisk;
@@ -94,6 +97,15 @@ void Reconciler::stamp(const Candidate& candidate, ItemRow& row) const {
   if (isStill) row.ctime = now.ctime;
 }
 
+/// What the row kept because the file could not carry it goes to the file as soon as it can.
+void Reconciler::giveBack(const Candidate& candidate, ItemRow& row) const {
+  if ((row.flags & row_flag::kKeepsExtra) == 0 || !candidate.entry.carriesID()) return;
+  const std::string name = candidate.isOpenedFolder ? "." : candidate.name;
+  const ItemExtra extra = row.extra ? *row.extra : ItemExtra{};
+  if (writeItemExtra(candidate.folder->get(), name, row.inode, extra) != 0) return;
+  row.flags &= ~row_flag::kKeepsExtra;
+}
+
 bool Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& candidate,
                               const ItemRow& before) {
   ItemRow after = before;
@@ -104,6 +116,7 @@ bool Reconciler::storeChanged(WriteTransaction& transaction, const Candidate& ca
   const bool isElsewhereNow =
       before.parent != candidate.parent || before.nameOnDisk() != candidate.name;
   if (!isPlace && isElsewhereNow) choosePlace(transaction, candidate, after);
+  giveBack(candidate, after);
   stamp(candidate, after);
   if (isShownDifferently(before, after)) {
     if (!transaction.update(before, after)) return false;

@@ -63,7 +63,9 @@ struct Item {
   flags @13 :UInt32;             # ItemFlag bits
   rank @14 :UInt64;              # the daemon's rank of the item's last change
   version @15 :UInt64;           # changes whenever the content changes
-  childCount @16 :UInt32;        # of folders; 0 when not known
+  childCount @16 :UInt32;        # of folders; 0 when not known. zarn says 0: a number that is kept would
+                                 # cost every change of a folder a write, one that is counted as much
+                                 # as the folder is large
   containerID @17 :Text;         # set on a container's own folder only
 
   enum Kind {

@@ -11,6 +11,7 @@
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/server_call.h"
 #include "platform/ostrell/constants.h"
+#include "zarn/content_server.h"
 #include "zarn/daemon_errors.h"
 #include "zarn/item_encoder.h"
 #include "zarn/item_sender_server.h"
@@ -426,6 +427,13 @@ kj::Promise<void> DaemonServer::status(StatusContext context) {
         status.setResidentBytes(sizes.process.residentBytes);
         status.setOpenDescriptors(sizes.process.openDescriptors);
       });
+}
+
+// --- Content.
+
+kj::Promise<void> DaemonServer::content(ContentContext context) {
+  context.getResults().setContent(kj::heap<ContentServer>(drive_, drive_->engine));
+  return kj::READY_NOW;
 }
 
 }  // namespace yomber

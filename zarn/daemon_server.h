@@ -43,6 +43,8 @@ class DaemonServer final : public protocol::Daemon::Server {
 
   kj::Promise<void> status(StatusContext context) override;
 
+  kj::Promise<void> content(ContentContext context) override;
+
  private:
   class RegistrationServer;
 

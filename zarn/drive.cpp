@@ -107,6 +107,7 @@ std::shared_ptr<Drive> Drive::open(const DrivePaths& paths, Options options, NSE
   std::shared_ptr<Drive> drive(
       new Drive(paths, std::move(options), std::move(database), std::move(account)));
   drive->account->onChange([drive = drive.get()] { drive->accountDidChange(); });
+  drive->trash->recover();
   return drive;
 }
 
@@ -127,6 +128,11 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
       firstScan(std::make_shared<FirstScanGate>()),
       account(std::move(openedAccount)),
       containers(std::make_shared<Containers>(std::move(options.applications), layout)),
+      trash(Trash::create(store, scanner)),
+      setters(std::make_shared<ItemSetters>(store, scanner)),
+      moves(std::make_shared<MoveCapabilities>(store, scanner, trash)),
+      locations(std::make_shared<ItemLocations>(store, scanner, containers)),
+      engine(std::move(options.engine)),
       workingSetSignals_(
           std::make_shared<WorkingSetSignals>(feed, [weak = std::weak_ptr(registrations)] {
             if (const auto strong = weak.lock()) strong->workingSetDidChange();
@@ -134,6 +140,7 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
   database->addSink(observer);
   database->addSink(watchers);
   database->addSink(workingSetSignals_);
+  database->addSink(trash);
 }
 
 Drive::~Drive() { stop(); }

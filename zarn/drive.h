@@ -10,12 +10,17 @@
 #include "zarn/account.h"
 #include "zarn/change_feed.h"
 #include "zarn/containers.h"
+#include "zarn/content_engine.h"
 #include "zarn/database.h"
 #include "zarn/first_scan_gate.h"
+#include "zarn/item_locations.h"
+#include "zarn/item_setters.h"
 #include "zarn/item_store.h"
 #include "zarn/listing.h"
+#include "zarn/move_capabilities.h"
 #include "zarn/registrations.h"
 #include "zarn/scanner.h"
+#include "zarn/trash.h"
 #include "zarn/tree_layout.h"
 #include "zarn/tree_observer.h"
 #include "zarn/watchers.h"
@@ -36,6 +41,8 @@ class Drive : public std::enable_shared_from_this<Drive> {
     Watchers::Options watchers;
     /// Where `.desktop` files are looked for.
     std::vector<std::string> applications = applicationDirectories();
+    /// Moves the items' content.
+    std::shared_ptr<ContentEngine> engine;
   };
 
   /// Makes what is missing in the home and opens the database and the account. Null with an error
@@ -67,6 +74,11 @@ class Drive : public std::enable_shared_from_this<Drive> {
   const std::shared_ptr<FirstScanGate> firstScan;
   const std::shared_ptr<Account> account;
   const std::shared_ptr<Containers> containers;
+  const std::shared_ptr<Trash> trash;
+  const std::shared_ptr<ItemSetters> setters;
+  const std::shared_ptr<MoveCapabilities> moves;
+  const std::shared_ptr<ItemLocations> locations;
+  const std::shared_ptr<ContentEngine> engine;
 
  private:
   Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Database> opened,

@@ -3,7 +3,8 @@
 //   items       "identifier version" a line: the one folder there is
 //   root        exists: the root's location is known
 //   hang        exists: what is asked now is never answered
-//   signed-out  exists: enumerators and pages fail with -1000
+//   signed-out  exists: items, enumerators and pages fail with -1000; paths have no identifier,
+//               and but the root no item has a location
 //   die-on-page exists: the process ends when a page is asked for
 //   commands    a pipe that takes "signal CONTAINER" lines
 //
@@ -166,6 +167,7 @@ class FakeExtension final : public NSFileProviderExtension {
     if (identifier == NSFileProviderRootContainerItemIdentifier) {
       return isCommanded("root") ? NSURL::fileURLWithPath("/root") : nullptr;
     }
+    if (isCommanded("signed-out")) return nullptr;
     return readItems().contains(identifier) ? NSURL::fileURLWithPath("/root/" + identifier)
                                             : nullptr;
   }
@@ -173,7 +175,7 @@ class FakeExtension final : public NSFileProviderExtension {
   std::optional<NSFileProviderItemIdentifier> persistentIdentifierForItemAtURL(
       const NSURLRef& url) override {
     auto name = url->lastPathComponent();
-    if (!readItems().contains(name)) return std::nullopt;
+    if (isCommanded("signed-out") || !readItems().contains(name)) return std::nullopt;
     return name;
   }
 
@@ -181,6 +183,10 @@ class FakeExtension final : public NSFileProviderExtension {
                                           NSErrorRef* error) override {
     hangIfCommanded();
     if (identifier == "self") return describeSelf();
+    if (isCommanded("signed-out")) {
+      storeError(error, signedOut());
+      return nullptr;
+    }
     const auto items = readItems();
     const auto item = items.find(identifier);
     if (item != items.end()) return makeItem(identifier, item->second);

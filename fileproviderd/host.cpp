@@ -13,6 +13,25 @@ namespace {
 
 constexpr int kAttempts = 2;
 
+/// Why the extension answered nil: what was asked for is missing, unless the root says that nothing
+/// can be had at all (nobody is signed in, say). `session` must live until the answer.
+void explainNil(ExtensionSession& session, NSErrorRef missing,
+                std::function<void(NSErrorRef)> handler) {
+  session.item(NSFileProviderRootContainerItemIdentifier,
+               [missing = std::move(missing), handler = std::move(handler)](
+                   const std::optional<ItemFields>& /*root*/, const NSErrorRef& error) {
+                 const bool isRootKnown = error == nullptr || isNoSuchItemError(error);
+                 handler(isRootKnown ? missing : error);
+               });
+}
+
+NSErrorRef noItemAtPathError(const std::string& path) {
+  return NSError::errorWithDomain(
+      NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem,
+      {{NSFilePathErrorKey, path},
+       {NSLocalizedDescriptionKey, "the drive has no item at " + path}});
+}
+
 bool wasLost(const NSErrorRef& error) {
   return error != nullptr && error->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
 }
@@ -106,6 +125,7 @@ void Host::ask(Ask ask, std::function<void(std::optional<Answer>, NSErrorRef)> h
   supervisor_->acquire([weak = weak_from_this(), ask, handler = std::move(handler), attempts](
                            const ExtensionSessionRef& session, const NSErrorRef& error) {
     if (session == nullptr) return handler(std::nullopt, error);
+    // The answer's handler keeps the session.
     ask(*session,
         [weak, ask, handler, attempts, session](std::optional<Answer> answer, NSErrorRef failure) {
           const auto self = weak.lock();
@@ -132,12 +152,13 @@ void Host::locate(const std::string& identifier, TextHandler handler) {
   ask<std::string>(
       [identifier, limit = options_.callLimit](ExtensionSession& session, TextHandler answer) {
         session.locate(identifier, limit,
-                       [identifier, answer = std::move(answer)](std::optional<std::string> path,
-                                                                NSErrorRef error) {
-                         if (!path && error == nullptr) {
-                           error = fileProviderErrorForNonExistentItemWithIdentifier(identifier);
-                         }
-                         answer(std::move(path), std::move(error));
+                       [identifier, &session, answer = std::move(answer)](
+                           std::optional<std::string> path, NSErrorRef error) {
+                         if (path || error != nullptr)
+                           return answer(std::move(path), std::move(error));
+                         explainNil(
+                             session, fileProviderErrorForNonExistentItemWithIdentifier(identifier),
+                             [answer](NSErrorRef why) { answer(std::nullopt, std::move(why)); });
                        });
       },
       std::move(handler), kAttempts);
@@ -146,15 +167,13 @@ void Host::locate(const std::string& identifier, TextHandler handler) {
 void Host::identify(const std::string& path, TextHandler handler) {
   ask<std::string>(
       [path](ExtensionSession& session, TextHandler answer) {
-        session.identify(path, [path, answer = std::move(answer)](
+        session.identify(path, [path, &session, answer = std::move(answer)](
                                    std::optional<std::string> identifier, NSErrorRef error) {
-          if (!identifier && error == nullptr) {
-            error = NSError::errorWithDomain(
-                NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem,
-                {{NSFilePathErrorKey, path},
-                 {NSLocalizedDescriptionKey, "the drive has no item at " + path}});
+          if (identifier || error != nullptr) {
+            return answer(std::move(identifier), std::move(error));
           }
-          answer(std::move(identifier), std::move(error));
+          explainNil(session, noItemAtPathError(path),
+                     [answer](NSErrorRef why) { answer(std::nullopt, std::move(why)); });
         });
       },
       std::move(handler), kAttempts);

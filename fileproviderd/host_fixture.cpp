@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <fstream>
 #include <set>
+#include <stdexcept>
 #include <thread>
 
 #include "fileproviderd/control_server.h"
@@ -26,6 +27,15 @@ using protocol::Daemon;
 using protocol::Listing;
 
 constexpr auto kPatience = 30s;
+
+/// Ends the test at once: nothing that it says afterwards would mean anything.
+void require(bool holds, const std::string& what) {
+  if (!holds) throw std::runtime_error("the test cannot be set up: " + what);
+}
+
+void require(const NSErrorRef& error) {
+  if (error != nullptr) require(false, error->description());
+}
 
 class Registration final : public protocol::Registration::Server {};
 
@@ -137,13 +147,15 @@ struct HostTest::Zarn {
 };
 
 HostTest::HostTest() {
-  char pattern[] = "/tmp/yomber-host-XXXXXX";
-  home = mkdtemp(pattern);
+  // Sockets lie in the home, whatever the caller's environment says.
   unsetenv("XDG_RUNTIME_DIR");
+  char pattern[] = "/tmp/yomber-host-XXXXXX";
+  require(mkdtemp(pattern) != nullptr, pattern);
+  home = pattern;
   paths = DrivePaths::forHome(home);
-  EXPECT_EQ(paths.create(), nullptr);
+  require(paths.create());
   std::filesystem::create_directory(home + "/fake");
-  EXPECT_EQ(mkfifo((home + "/fake/commands").c_str(), 0600), 0);
+  require(mkfifo((home + "/fake/commands").c_str(), 0600) == 0, "no pipe for commands");
   command("root");
   setItems({{"a", 1}, {"b", 1}, {"c", 1}});
   registerItemsInErrors();
@@ -174,9 +186,9 @@ void HostTest::startHost(const std::function<void(Host::Options&)>& change) {
         return makeControlServer(weak.lock());
       },
       &error);
-  ASSERT_EQ(error, nullptr) << error->description();
+  require(error);
   client = ipc::Connection::connect(paths.controlSocket, &error);
-  ASSERT_EQ(error, nullptr) << error->description();
+  require(error);
   remote = client->bootstrap<Control>();
 }
 
@@ -189,7 +201,7 @@ void HostTest::startZarn() {
       [home = paths.home, hosts = zarn->hosts](const ipc::PeerCredentials&)
           -> capnp::Capability::Client { return kj::heap<Zarn::Server>(home, hosts); },
       &error);
-  ASSERT_EQ(error, nullptr) << error->description();
+  require(error);
 }
 
 void HostTest::stopZarn() {

@@ -57,6 +57,19 @@ TEST_F(HostTest, TellsMissingItemsFromMissingDaemons) {
       error->underlyingError()->is(NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem));
 }
 
+TEST_F(HostTest, SignedOutEveryLookupSaysSo) {
+  startZarn();
+  startHost();
+  command("signed-out");
+  for (const auto& error : {item("a"), locate("a"), identify("/root/a"), identify("/root/none")}) {
+    ASSERT_NE(error, nullptr);
+    EXPECT_TRUE(error->is(NSFileProviderErrorDomain, NSFileProviderErrorNotAuthenticated))
+        << error->description();
+  }
+  countermand("signed-out");
+  EXPECT_EQ(identify("/root/a"), nullptr);
+}
+
 TEST_F(HostTest, RefusesWhatIsTooLong) {
   startZarn();
   startHost();

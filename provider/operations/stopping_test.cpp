@@ -91,8 +91,8 @@ TEST_F(StoppingTest, WhatIsDownloadingForAMoveIsNotStopped) {
                                        " which is downloading for CZM"),
       1U);
   expectNothingWasStopped();
-  daemon.release("startProviding");
   know(5, inRoot("elsewhere/moving.txt"));
+  daemon.release("startProviding");
   EXPECT_EQ(only(items).error, nullptr);
   EXPECT_TRUE(exists(inRoot("elsewhere/moving.txt")));
 }

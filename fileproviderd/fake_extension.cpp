@@ -7,6 +7,10 @@
 //               and but the root no item has a location
 //   die-on-page exists: the process ends when a page is asked for
 //   commands    a pipe that takes "signal CONTAINER" lines
+//   slow        exists: content is not provided until it is stopped, or "slow" goes
+//   die-on-content, die-on-rename  exists: the process ends in the middle of that
+//
+// What is done to content is noted in <home>/fake/journal, a line each.
 //
 // The item "self" tells of the process: its filename is a letter for each descriptor that it was
 // given, a slash, and the signal that it gets when its parent dies.
@@ -59,6 +63,7 @@ NSFileProviderItemRef makeItem(const std::string& identifier, std::uint64_t vers
   fields.identifier = identifier;
   fields.filename = "name of " + identifier;
   fields.version = version;
+  fields.capabilities = NSFileProviderItemCapabilitiesAllowsRenaming;
   return std::make_shared<WireItem>(fields);
 }
 
@@ -208,13 +213,65 @@ class FakeExtension final : public NSFileProviderExtension {
     return std::make_shared<FileEnumerator>();
   }
 
+  using NSFileProviderExtension::startProvidingItemAtURL;
+  void startProvidingItemAtURL(const NSURLRef& url, NSFileCoordinatorReadingOptions options,
+                               ErrorHandler completionHandler) override {
+    note("start " + url->path() + " " + std::to_string(options));
+    if (isCommanded("die-on-content")) {
+      std::filesystem::remove(fakePath("die-on-content"));
+      _exit(3);
+    }
+    if (isCommanded("slow")) {
+      LockGuard guard(mutex_);
+      held_[url->path()] = std::move(completionHandler);
+      return;
+    }
+    completionHandler(nullptr);
+  }
+
+  void stopProvidingItemAtURL(const NSURLRef& url) override {
+    note("stop " + url->path());
+    ErrorHandler held;
+    {
+      LockGuard guard(mutex_);
+      held = std::exchange(held_[url->path()], nullptr);
+    }
+    if (held) held(NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError));
+  }
+
+  void itemChangedAtURL(const NSURLRef& url) override { note("changed " + url->path()); }
+
+  void movingItemAtURL(const NSURLRef& url, const NSURLRef& destinationURL,
+                       MoveHandler completionHandler) override {
+    note("moving " + url->path() + " " + destinationURL->path());
+    completionHandler(true, nullptr);
+  }
+
+  void renameItemWithIdentifier(const NSFileProviderItemIdentifier& identifier,
+                                const std::string& toName, ItemHandler completionHandler) override {
+    note("rename " + identifier + " " + toName);
+    if (isCommanded("die-on-rename")) {
+      std::filesystem::remove(fakePath("die-on-rename"));
+      _exit(3);
+    }
+    completionHandler(makeItem(identifier, 2), nullptr);
+  }
+
  private:
+  void note(const std::string& line) {
+    LockGuard guard(mutex_);
+    std::ofstream(fakePath("journal"), std::ios::app) << line << std::endl;
+  }
+
   static NSFileProviderItemRef describeSelf() {
     ItemFields fields;
     fields.identifier = "self";
     fields.filename = selfDescription();
     return std::make_shared<WireItem>(fields);
   }
+
+  Mutex mutex_;
+  std::map<std::string, ErrorHandler> held_ GUARDED_BY(mutex_);
 };
 
 void takeCommands() {

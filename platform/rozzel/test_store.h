@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -38,6 +39,8 @@ class TestStore {
   [[nodiscard]] RZDatabaseRef sharedDatabase(const std::string& account) const {
     return RZContainer(engine_, "com.example.drive", account).sharedCloudDatabase();
   }
+  /// Before a fork: SQLite's connections must not be carried across.
+  void close() { engine_.reset(); }
   /// As a process that has just started would see it.
   void reopen() { engine_ = std::make_shared<EmbeddedEngine>(folder(), options_); }
 
@@ -93,13 +96,26 @@ inline RZAsset storeText(RZEngine& engine, std::string_view text) {
   return asset;
 }
 
-/// Runs `work` in a process of its own; its answer is the exit status. 128 + signal when killed.
-inline int inAnotherProcess(const std::function<int()>& work) {
+/// Starts `work` in a process of its own; its answer is the exit status. No store may be open here.
+inline pid_t startProcess(const std::function<int()>& work) {
   const pid_t child = fork();
-  if (child == 0) _exit(work());
+  if (child == 0) {
+    const rlimit noCore{.rlim_cur = 0, .rlim_max = 0};
+    setrlimit(RLIMIT_CORE, &noCore);
+    _exit(work());
+  }
+  return child;
+}
+
+/// The exit status of a process; 128 + signal when it was killed.
+inline int waitForProcess(pid_t child) {
   int status = 0;
   if (child < 0 || waitpid(child, &status, 0) != child) return -1;
   return WIFSIGNALED(status) ? 128 + WTERMSIG(status) : WEXITSTATUS(status);
+}
+
+inline int inAnotherProcess(const std::function<int()>& work) {
+  return waitForProcess(startProcess(work));
 }
 
 inline FileDescriptor newFile(const std::string& path) {

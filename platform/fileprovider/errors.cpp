@@ -6,6 +6,11 @@ namespace yomber {
 
 NSErrorRef fileProviderErrorForNonExistentItemWithIdentifier(
     const NSFileProviderItemIdentifier& identifier) {
+  if (identifier.empty()) {
+    return NSError::errorWithDomain(
+        NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem,
+        {{NSLocalizedDescriptionKey, std::string("there is no such item in the drive")}});
+  }
   return NSError::errorWithDomain(
       NSFileProviderErrorDomain, NSFileProviderErrorNoSuchItem,
       {{NSFileProviderErrorNonExistentItemIdentifierKey, identifier},

@@ -11,7 +11,7 @@ namespace yomber {
 /// Cocoa domain: the extension does not implement the operation.
 inline constexpr std::int64_t NSFeatureUnsupportedError = 3328;
 
-/// NSFileProviderErrorNoSuchItem that carries the identifier.
+/// NSFileProviderErrorNoSuchItem that carries the identifier (empty: none is named).
 [[nodiscard]] NSErrorRef fileProviderErrorForNonExistentItemWithIdentifier(
     const NSFileProviderItemIdentifier& identifier);
 

@@ -7,6 +7,7 @@
 #include "platform/foundation/file_manager.h"
 #include "platform/ostrell/constants.h"
 #include "platform/ostrell/daemon_link.h"
+#include "platform/ostrell/file_manager_additions.h"
 #include "platform/ostrell/locations.h"
 #include "platform/ostrell/trash_info.h"
 #include "platform/ostrell/url_additions.h"
@@ -106,9 +107,13 @@ QSContainerRef qs_ostrellContainer(const NSURLRef& url) {
   const auto& locations = DaemonLink::current()->locations();
   if (!locations.isInTrash(url->path())) return containerHolding(url->path());
   const auto containers = QSContainer::allContainersByContainerID();
-  auto found = containers.find(containerOfTrashed(url->path(), locations));
-  if (found == containers.end()) found = containers.find(QSUbiquitousDefaultContainerID);
-  return found == containers.end() ? nullptr : found->second;
+  const auto known = containers.find(containerOfTrashed(url->path(), locations));
+  if (known != containers.end()) return known->second;
+  // Other programs' trash information has nothing but where the item was.
+  const auto origin = qs_putBackURLForTrashedItemAtURL(NSFileManager::defaultManager(), url);
+  if (auto container = origin ? containerHolding(origin->path()) : nullptr) return container;
+  const auto own = containers.find(QSUbiquitousDefaultContainerID);
+  return own == containers.end() ? nullptr : own->second;
 }
 
 }  // namespace yomber

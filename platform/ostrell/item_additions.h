@@ -33,7 +33,7 @@ bool qs_setTagNames(const NSURLRef& url, const std::vector<std::string>& names,
                     NSErrorRef* error = nullptr);
 
 /// The container that holds the location; that of a trashed item is the one it came from, and the
-/// drive's own where the trash does not know. Documents and Desktop count while their folders
+/// drive's own where nobody knows. Documents and Desktop count while their folders
 /// exist. Nil outside of all containers. Asks the daemon for the list of containers.
 [[nodiscard]] QSContainerRef qs_ostrellContainer(const NSURLRef& url);
 

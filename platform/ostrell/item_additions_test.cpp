@@ -158,6 +158,17 @@ TEST_F(ItemAdditionsTest, ATrashedItemOfAnUnknownContainerBelongsToTheDrivesOwn)
   }
 }
 
+TEST_F(ItemAdditionsTest, OfWhatOthersTrashedThePutBackLocationTellsTheContainer) {
+  const std::string origin = addNotesContainer()->path() + "/gone/foreign.txt";
+  rememberInTrash("foreign.txt", "");
+  daemon.scriptContent([&](ScriptedContentAnswers& answers) {
+    answers.putBackLocation = [origin](const std::string&) {
+      return ScriptedLocation{origin, nullptr};
+    };
+  });
+  EXPECT_EQ(containerOf(inTrash("foreign.txt")), "org.example.Notes");
+}
+
 // ---- The file manager --------------------------------------------------------------------------
 
 TEST_F(ItemAdditionsTest, TrashingAnswersWhereTheItemIs) {

@@ -16,8 +16,8 @@ class UntrashTest : public OperationsTest {
  protected:
   UntrashTest() {
     trashed = addTrashed(5, "old.txt");
-    daemon.script([this](ScriptedDaemon::Answers& answers) {
-      // Wherever it is put, it is the item d:5; what is in its way is d:6.
+    daemon.script([](ScriptedDaemon::Answers& answers) {
+      // Wherever it is put, it is the item d:5.
       answers.itemAtLocation = [](const std::string&, bool) {
         return ScriptedDaemon::Item{.item = scriptedDocument(5, "old.txt"), .error = nullptr};
       };
@@ -124,7 +124,7 @@ TEST_F(UntrashTest, WithNoDestinationAtAllTheParentIsMissing) {
   EXPECT_EQ(missingIdentifier(only(items).error), "i:404");
   EXPECT_TRUE(exists(trashed));
   untrash();
-  EXPECT_EQ(domainAndCode(items->wait(2).back().error), "NSFileProviderErrorDomain -1005");
+  EXPECT_EQ(missingIdentifier(items->wait(2).back().error), "no identifier");
 }
 
 TEST_F(UntrashTest, ATakenNameIsMadeFree) {

@@ -23,6 +23,8 @@ namespace yomber {
 namespace {
 
 constexpr std::chrono::seconds kPatience{10};
+/// What a test waits for may come about without anything happening here.
+constexpr std::chrono::milliseconds kRetestTime{20};
 
 /// A test cannot go on without what failed.
 [[noreturn]] void giveUp(const std::string& what) {
@@ -270,9 +272,11 @@ bool ScriptedDaemon::waitUntil(const std::function<bool()>& condition) {
       seen = state_->events;
     }
     if (condition()) return true;
+    const auto now = std::chrono::steady_clock::now();
+    if (now >= deadline) return false;
     LockGuard guard(state_->mutex);
     while (state_->events == seen) {
-      if (!state_->condition.waitUntil(state_->mutex, deadline)) return false;
+      if (!state_->condition.waitUntil(state_->mutex, std::min(deadline, now + kRetestTime))) break;
     }
   }
 }

@@ -117,8 +117,8 @@ class ScriptedDaemon {
   void forgetCalls();
   /// Waits until `count` calls of `method` have arrived since the last `forgetCalls`.
   [[nodiscard]] bool waitForCalls(const std::string& method, std::size_t count = 1);
-  /// Waits until `condition` holds; it is tested whenever anything happens here, and may call this
-  /// object's getters.
+  /// Waits until `condition` holds; it is tested whenever anything happens here, and now and then
+  /// besides, and may call this object's getters.
   [[nodiscard]] bool waitUntil(const std::function<bool()>& condition);
 
   /// From now on answers to `method` are made, but not sent, until `release`. "*" is every method.

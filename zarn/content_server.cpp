@@ -173,10 +173,7 @@ kj::Promise<void> ContentServer::runUntilDone(Context context, Begin begin) {
              begin = std::move(begin)](NSErrorRef failure) mutable -> kj::Promise<NSErrorRef> {
         if (!failure && !engine) failure = noEngineError();
         if (failure) return kj::mv(failure);
-        return PendingWish::start(
-            [engine, begin = std::move(begin)](ContentEngine::Completion completion) {
-              return begin(*engine, std::move(completion));
-            });
+        return PendingWish::start(std::move(engine), std::move(begin));
       })
       .then([context](NSErrorRef error) mutable {
         ipc::encodeOptional(error, context.getResults().initFailure());

@@ -7,12 +7,13 @@
 
 namespace yomber {
 
-kj::Promise<NSErrorRef> PendingWish::start(Begin begin) {
+kj::Promise<NSErrorRef> PendingWish::start(std::shared_ptr<ContentEngine> engine, Begin begin) {
   auto pair = kj::newPromiseAndFulfiller<NSErrorRef>();
-  auto pending = std::make_shared<PendingWish>();
+  auto pending = std::make_shared<PendingWish>(std::move(engine));
   pending->fulfiller_ = kj::mv(pair.fulfiller);
   ThreadPool::shared().async([pending, begin = std::move(begin)] {
-    pending->keep(begin([pending](NSErrorRef error) { pending->complete(std::move(error)); }));
+    pending->keep(begin(*pending->engine_,
+                        [pending](NSErrorRef error) { pending->complete(std::move(error)); }));
   });
   return pair.promise.attach(kj::defer([pending] { pending->drop(); }));
 }

@@ -109,13 +109,21 @@ TEST_F(Browse, LocationsOutsideTheDriveHaveNoItem) {
 
 TEST_F(Browse, SignedOutNothingIsListedAndSigningInGoesOn) {
   drive_.write("kept");
+  drive_.makeFolder("folder");
   drive_.up();
+  const std::string folder = drive_.json({"id", "folder"}).at(0)["id"];
   ASSERT_EQ(drive_.yomber({"account", "sign-out"}).exitCode, 0);
-  const ProcessResult refused = drive_.yomber({"ls"});
-  EXPECT_EQ(refused.exitCode, 77) << refused.output << refused.errors;
+  const std::vector<std::vector<std::string>> commands{
+      {"ls"},           {"ls", "folder"}, {"ls", folder},          {"stat", "kept"},
+      {"stat", folder}, {"id", "kept"},   {"ls", "no such folder"}};
+  for (const auto& command : commands) {
+    const ProcessResult refused = drive_.yomber(command);
+    EXPECT_EQ(refused.exitCode, 77) << command.back() << refused.output << refused.errors;
+  }
   EXPECT_TRUE(fs::exists(drive_.root() + "/kept"));
   drive_.signIn();
-  EXPECT_EQ(drive_.names(), (std::vector<std::string>{"kept"}));
+  EXPECT_EQ(drive_.names(), (std::vector<std::string>{"folder", "kept"}));
+  EXPECT_EQ(drive_.yomber({"ls", "no such folder"}).exitCode, 66);
 }
 
 TEST_F(Browse, IdentifiersSurviveARestart) {

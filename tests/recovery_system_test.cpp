@@ -4,15 +4,15 @@
 #include <csignal>
 #include <filesystem>
 #include <fstream>
-#include <map>
 #include <random>
 #include <set>
 #include <thread>
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 
-#include "tests/harness/test_drive.h"
+#include "tests/harness/watch_process.h"
 
 namespace yomber::testing {
 namespace {
@@ -26,49 +26,10 @@ std::set<std::string> namesOnDisk(const std::string& folder) {
   return names;
 }
 
-/// What a `yomber watch` holds, kept up to date from the lines it prints.
-class Watch {
- public:
-  explicit Watch(TestDrive& drive, const std::string& folder = "/")
-      : process_(drive.commandLine({"--json", "watch", "--list", folder}), drive.environment()) {}
-
-  /// Reads until what the watch holds is what is on disk.
-  bool converges(const std::set<std::string>& expected) {
-    return held() == expected || process_.readUntil([&](const std::string& line) {
-      take(nlohmann::json::parse(line));
-      return held() == expected;
-    });
-  }
-
-  bool shows(const std::string& name) {
-    return process_.readUntil([&](const std::string& line) {
-      take(nlohmann::json::parse(line));
-      return held().contains(name);
-    });
-  }
-
- private:
-  void take(const nlohmann::json& change) {
-    const std::string event = change["event"];
-    if (event == "removed") {
-      const auto known = names_.find(change["id"]);
-      if (known == names_.end()) return;
-      held_.erase(known->second);
-      names_.erase(known);
-    } else if (change.contains("item")) {
-      const std::string id = change["item"]["id"];
-      const auto known = names_.find(id);
-      if (known != names_.end()) held_.erase(known->second);
-      names_[id] = change["item"]["name"];
-      held_.insert(names_[id]);
-    }
-  }
-  const std::set<std::string>& held() const { return held_; }
-
-  LineProcess process_;
-  std::map<std::string, std::string> names_;
-  std::set<std::string> held_;
-};
+std::size_t openDescriptors(pid_t process) {
+  const fs::directory_iterator all("/proc/" + std::to_string(process) + "/fd");
+  return static_cast<std::size_t>(std::distance(all, fs::directory_iterator()));
+}
 
 class Recovery : public ::testing::Test {
  protected:
@@ -78,7 +39,7 @@ class Recovery : public ::testing::Test {
 TEST_F(Recovery, ChangesMadeWhileTheDaemonIsDeadShowWithoutAnyoneAsking) {
   drive_.write("before");
   drive_.up();
-  Watch watch(drive_);
+  WatchProcess watch(drive_);
   ASSERT_TRUE(watch.shows("before"));
   const auto supervisor = drive_.status()["supervisor"]["pid"].get<pid_t>();
   const pid_t daemon = drive_.pidOf(Process::Zarn);
@@ -93,7 +54,7 @@ TEST_F(Recovery, ChangesMadeWhileTheDaemonIsDeadShowWithoutAnyoneAsking) {
 TEST_F(Recovery, AWatchGoesOnWhenTheExtensionIsKilled) {
   drive_.write("before");
   drive_.up();
-  Watch watch(drive_);
+  WatchProcess watch(drive_);
   ASSERT_TRUE(watch.shows("before"));
   drive_.kill(Process::Extension);
   drive_.write("after");
@@ -139,7 +100,7 @@ TEST_F(Recovery, SigningOutInTheMiddleOfAListingEndsItWithAResultOrAClearError) 
 
 TEST_F(Recovery, AFolderSoBusyThatItsHistoryOverflowsAgainAndAgainStillConverges) {
   drive_.up();
-  Watch watch(drive_);
+  WatchProcess watch(drive_);
   drive_.write("first");
   ASSERT_TRUE(watch.shows("first"));
   for (int burst = 0; burst < 4; ++burst) {
@@ -202,16 +163,43 @@ TEST_F(Recovery, OddNamesAreListedAsTheyAre) {
   EXPECT_FALSE(shown.contains("caf\u00e9") && shown.contains("cafe\u0301"));
 }
 
-TEST_F(Recovery, AnotherUsersProcessIsRefused) {
-  if (geteuid() != 0) GTEST_SKIP() << "only root can become another user";
-  drive_.write("secret");
+TEST_F(Recovery, SigningOutPausesAWatchAndSigningInBringsWhatWasMissed) {
+  drive_.write("before");
   drive_.up();
-  std::vector<std::string> words{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534",
-                                 "--clear-groups"};
-  for (const std::string& word : drive_.commandLine({"ls"})) words.push_back(word);
-  const ProcessResult refused = runProcess(words, drive_.environment());
-  EXPECT_NE(refused.exitCode, 0);
-  EXPECT_EQ(refused.output.find("secret"), std::string::npos);
+  WatchProcess watch(drive_);
+  ASSERT_TRUE(watch.shows("before"));
+  ASSERT_EQ(drive_.yomber({"account", "sign-out"}).exitCode, 0);
+  ASSERT_TRUE(watch.tells("paused"));
+  EXPECT_TRUE(std::ifstream(drive_.root() + "/before").good()) << "local files stay readable";
+  drive_.write("meanwhile");
+  fs::remove(drive_.root() + "/before");
+  drive_.signIn();
+  EXPECT_TRUE(watch.converges({"meanwhile"}));
+}
+
+TEST_F(Recovery, TheWorkingSetIsFollowedAcrossTheDaemonsEnd) {
+  const auto tag = [&](const std::string& name) {
+    drive_.write(name);
+    ASSERT_EQ(setxattr((drive_.root() + "/" + name).c_str(), "user.xdg.tags", "red", 3, 0), 0);
+  };
+  tag("first");
+  drive_.up();
+  LineProcess follow(drive_.commandLine({"--json", "working-set", "--follow"}),
+                     drive_.environment());
+  const auto tells = [&](const std::string& event, const std::string& name) {
+    return follow.readUntil([&](const std::string& line) {
+      const nlohmann::json change = nlohmann::json::parse(line);
+      return change["event"] == event && (name.empty() || change["item"]["name"] == name);
+    });
+  };
+  ASSERT_TRUE(tells("present", "first"));
+  tag("second");
+  EXPECT_TRUE(tells("added", "second"));
+  drive_.kill(Process::Zarn);
+  tag("third");
+  EXPECT_TRUE(tells("added", "third"));
+  ASSERT_EQ(removexattr((drive_.root() + "/first").c_str(), "user.xdg.tags"), 0);
+  EXPECT_TRUE(tells("removed", ""));
 }
 
 /// Kills at random while clients list and watch.
@@ -240,6 +228,8 @@ TEST_F(Recovery, AHundredKillsLeaveNothingHangingAndListsRight) {
     });
   }
   std::mt19937 random(20);  // the same order in every run
+  const auto supervisor = drive_.status()["supervisor"]["pid"].get<pid_t>();
+  const std::size_t descriptors = openDescriptors(supervisor);
   for (int round = 0; round < 100; ++round) {
     const int before = calls;
     drive_.kill(std::array{Process::Zarn, Process::Host, Process::Extension}[random() % 3]);
@@ -249,6 +239,7 @@ TEST_F(Recovery, AHundredKillsLeaveNothingHangingAndListsRight) {
   stop = true;
   clients.clear();
   EXPECT_EQ(hung, 0);
+  EXPECT_EQ(openDescriptors(supervisor), descriptors) << "of who starts them all again";
   EXPECT_TRUE(eventually([&] {
     const ProcessResult listed = drive_.yomber({"ls"});
     return listed.exitCode == 0 &&

@@ -91,6 +91,37 @@ TEST_F(DaemonWatchingTest, DroppingTheSenderEndsItsWatch) {
   EXPECT_EQ(drive_->watchers->count(), 0U);
 }
 
+TEST_F(DaemonWatchingTest, AWatchIsActiveBeforeAnyLaterCallOfItsConnectionAndBringsNoItems) {
+  using protocol::ItemSender;
+  write("folder/there");
+  upSignedIn();
+  constexpr std::size_t kRounds = 50;
+  std::vector<Subscribed> subscribed;
+  ipc::Gate watched;
+  for (std::size_t round = 1; round <= kRounds; ++round) {
+    subscribed.push_back(subscribe());
+    // Its answer is not waited for.
+    (void)ipc::call(
+        subscribed.back().sender, &ItemSender::Client::watchItemRequest,
+        [&](ItemSender::WatchItemParams::Builder params) {
+          params.setPath(wireData(root_ + "/folder"));
+          params.setOptions(19);
+        },
+        [&](const NSErrorRef& error, const ItemSender::WatchItemResults::Reader*) {
+          EXPECT_EQ(error, nullptr);
+          watched.open();
+        });
+    std::size_t active = 0;
+    call(
+        &Wire::Client::describeRequest, [](auto) {},
+        [&](auto) { active = drive_->watchers->count(); });
+    EXPECT_EQ(active, round);
+  }
+  EXPECT_TRUE(watched.wait(kRounds));
+  write("folder/new");
+  for (const auto& each : subscribed) EXPECT_TRUE(each.watcher->waitForNames({"new"}));
+}
+
 TEST_F(DaemonWatchingTest, WithoutEnoughWatchesItSaysWhatToRaiseAndStillSeesChanges) {
   write("a/x");
   write("b/x");

@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
+#include <stdexcept>
 
 #include <unistd.h>
 
@@ -23,6 +24,11 @@ std::string programPath(const std::string& name) {
 }
 
 namespace {
+
+/// Ends the test at once: nothing that it says afterwards would mean anything.
+void require(bool holds, const std::string& what) {
+  if (!holds) throw std::runtime_error("the drive for this test cannot be had: " + what);
+}
 
 /// The pid of the child of `parent` whose program has that name.
 std::optional<pid_t> childNamed(pid_t parent, const std::string& program) {
@@ -43,7 +49,8 @@ std::optional<pid_t> childNamed(pid_t parent, const std::string& program) {
 
 TestDrive::TestDrive() {
   std::string pattern = (fs::temp_directory_path() / "yomber.XXXXXX").string();
-  directory_ = mkdtemp(pattern.data());
+  require(mkdtemp(pattern.data()) != nullptr, pattern);
+  directory_ = pattern;
   home_ = directory_ + "/home";
   root_ = home_ + "/tree/" + QSUbiquitousDefaultContainerID + "/Documents";
   for (const std::string& place :
@@ -70,16 +77,18 @@ TestDrive::~TestDrive() {
   fs::remove_all(directory_, failure);
 }
 
-void TestDrive::up() {
+void TestDrive::up(const std::vector<std::string>& command) {
   up_ = true;
-  const ProcessResult started = yomber({"up"});
-  ASSERT_EQ(started.exitCode, 0) << started.errors;
+  std::vector<std::string> words = command;
+  for (std::string& word : commandLine({"up"})) words.push_back(std::move(word));
+  const ProcessResult started = runProcess(words, environment_);
+  require(started.exitCode == 0, started.errors);
   signIn();
 }
 
 void TestDrive::signIn() {
   const ProcessResult signedIn = yomber({"account", "sign-in", "ada"});
-  ASSERT_EQ(signedIn.exitCode, 0) << signedIn.errors;
+  require(signedIn.exitCode == 0, signedIn.errors);
 }
 
 void TestDrive::down() {
@@ -149,7 +158,7 @@ void TestDrive::kill(Process process) const {
 void TestDrive::write(const std::string& relativePath, const std::string& content) const {
   std::ofstream file(root_ + "/" + relativePath, std::ios::binary | std::ios::trunc);
   file << content;
-  ASSERT_TRUE(file.good()) << relativePath;
+  require(file.good(), "cannot write " + relativePath);
 }
 
 void TestDrive::makeFolder(const std::string& relativePath) const {

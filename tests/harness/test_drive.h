@@ -19,8 +19,10 @@ class TestDrive {
   TestDrive(const TestDrive&) = delete;
   TestDrive& operator=(const TestDrive&) = delete;
 
-  /// Starts the drive and signs in; fails the test when it does not come up.
-  void up();
+  /// Starts the drive and signs in; ends the test when it does not come up.
+  void up() { up({}); }
+  /// The same, with `yomber up` as the last words of a command that starts it ("env NAME=VALUE").
+  void up(const std::vector<std::string>& command);
   void down();
   void signIn();
 

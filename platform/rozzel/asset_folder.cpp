@@ -51,12 +51,15 @@ std::string AssetFolder::pathFor(const RZAsset& asset) const {
 void AssetFolder::create() const {
   makeFolder(stagingFolder());
   makeFolder(storeFolder_ + "/assets");
+  syncStoreFolder(storeFolder_);
+}
+
+void AssetFolder::createSubfolders() const {
+  create();
   for (unsigned byte = 0; byte < 256; ++byte) {
     makeFolder(folderFor(static_cast<std::uint8_t>(byte)));
   }
-  syncStoreFolder(stagingFolder());
   syncStoreFolder(storeFolder_ + "/assets");
-  syncStoreFolder(storeFolder_);
 }
 
 void AssetFolder::require(const RZAsset& asset) const {

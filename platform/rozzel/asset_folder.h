@@ -22,8 +22,10 @@ class AssetFolder {
   [[nodiscard]] std::string folderFor(std::uint8_t firstByte) const;
   [[nodiscard]] std::string pathFor(const RZAsset& asset) const;
 
-  /// Makes the folders that are missing.
+  /// Makes `assets` and `staging` where they are missing.
   void create() const;
+  /// Makes the folders below `assets`, all at once: a sync for each would cost more.
+  void createSubfolders() const;
 
   /// Throws RZErrorAssetMissing or, when it has another size, RZErrorAssetDamaged.
   void require(const RZAsset& asset) const;

@@ -119,7 +119,7 @@ void StagedFile::publish(const AssetFolder& folder, const RZAsset& asset, NSDate
   };
   bool moved = moveTo(RENAME_NOREPLACE);
   if (!moved && errno == ENOENT) {
-    folder.create();
+    folder.createSubfolders();
     moved = moveTo(RENAME_NOREPLACE);
   }
   if (!moved && (errno == EEXIST || errno == EINVAL)) {

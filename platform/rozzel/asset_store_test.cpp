@@ -416,6 +416,7 @@ TEST_F(AssetGarbageTest, DropsTheAssetsOfADeletedZone) {
 }
 
 TEST_F(AssetGarbageTest, LeavesFilesAloneThatAreNoAssets) {
+  storeText(*store_.engine(), "content");
   const std::string stray = store_.folder() + "/assets/00/notes.txt";
   newFile(stray);
   now_ += 10'000 * kDay;

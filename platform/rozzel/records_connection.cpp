@@ -49,8 +49,23 @@ const char* adviceFor(RZErrorCode code) {
   }
 }
 
+/// What the system said when the database or its log was last written in vain. (SQLite's own
+/// answer, sqlite3_system_errno, is of whatever call came last.)
+int lastSystemError(sqlite3* database) {
+  sqlite3_file* log = nullptr;
+  int number = 0;
+  const int found = sqlite3_file_control(database, nullptr, SQLITE_FCNTL_JOURNAL_POINTER,
+                                         static_cast<void*>(&log));
+  if (found == SQLITE_OK && log != nullptr && log->pMethods != nullptr) {
+    log->pMethods->xFileControl(log, SQLITE_FCNTL_LAST_ERRNO, &number);
+  }
+  if (number == 0) sqlite3_file_control(database, nullptr, SQLITE_FCNTL_LAST_ERRNO, &number);
+  return number;
+}
+
 [[noreturn]] void throwResult(sqlite3* database, int result) {
-  const int systemError = database != nullptr ? sqlite3_system_errno(database) : 0;
+  const int systemError =
+      database != nullptr && (result & 0xff) == SQLITE_IOERR ? lastSystemError(database) : 0;
   const RZErrorCode code = codeForResult(result, systemError);
   const char* const detail =
       database != nullptr ? sqlite3_errmsg(database) : sqlite3_errstr(result);

@@ -90,7 +90,7 @@ class ContentEngine {
 
   struct Options {
     std::size_t uploadWorkers = 2;
-    std::size_t downloadWorkers = 2;
+    std::size_t downloadWorkers = 4;
     std::size_t evictWorkers = 1;
     /// Pauses between attempts double from the first to the second.
     std::chrono::milliseconds firstPause{1'000};
@@ -114,6 +114,8 @@ class ContentEngine {
   virtual void start() = 0;
   /// Ends the threads; what they were doing goes on after the next start. Wishes end with 3072.
   virtual void stop() = 0;
+  /// To be called when a database was built anew: gives jobs to the documents in it.
+  virtual void sweep() = 0;
   /// The store of the account that is signed in now, under the name that tells accounts apart; null
   /// when nobody is. Jobs belong to the account under which they were made, and wait for it.
   virtual void setStore(std::shared_ptr<ContentStore> contents, const std::string& account) = 0;

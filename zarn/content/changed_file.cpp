@@ -1,0 +1,155 @@
+#include "zarn/content/changed_file.h"
+
+#include <fcntl.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <utility>
+
+#include "zarn/content/fault_record.h"
+
+namespace yomber {
+namespace {
+
+constexpr int kOpening = O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+constexpr std::int64_t kNanoseconds = 1'000'000'000;
+
+std::int64_t toNanoseconds(const std::timespec& time) {
+  return static_cast<std::int64_t>(time.tv_sec) * kNanoseconds + time.tv_nsec;
+}
+
+std::timespec toTimespec(std::int64_t nanoseconds) {
+  std::int64_t seconds = nanoseconds / kNanoseconds;
+  std::int64_t rest = nanoseconds % kNanoseconds;
+  if (rest < 0) {
+    rest += kNanoseconds;
+    --seconds;
+  }
+  return {.tv_sec = seconds, .tv_nsec = rest};
+}
+
+/// Opens a file that its owner may only read; `status` is from before, `mode` is to be put back.
+FileDescriptor openReadOnlyFile(const std::string& path, struct stat& status,
+                                std::optional<std::uint32_t>& mode) {
+  const FileDescriptor reading(open(path.c_str(), O_RDONLY | kOpening));
+  if (!reading || fstat(reading.get(), &status) != 0) return {};
+  const bool isOurs = S_ISREG(status.st_mode) && status.st_uid == geteuid();
+  if (!isOurs || (status.st_mode & S_IWUSR) != 0) {
+    errno = EACCES;
+    return {};
+  }
+  const mode_t own = status.st_mode & 07777U;
+  if (fchmod(reading.get(), own | S_IWUSR) != 0) return {};
+  const std::string again = "/proc/self/fd/" + std::to_string(reading.get());
+  FileDescriptor writing(open(again.c_str(), O_RDWR | O_NONBLOCK | O_CLOEXEC));
+  if (!writing) {
+    (void)fchmod(reading.get(), own);
+  } else {
+    mode = own;
+  }
+  return writing;
+}
+
+}  // namespace
+
+ChangedFile ChangedFile::open(const std::string& path, NSErrorRef* error) {
+  ChangedFile result;
+  result.path_ = path;
+  FileDescriptor file(::open(path.c_str(), O_RDWR | kOpening));
+  if (!file && errno == EACCES)
+    file = openReadOnlyFile(path, result.status_, result.modeToPutBack_);
+  if (!file) {
+    storeError(error, result.failure(errno));
+    return result;
+  }
+  result.file_ = std::move(file);
+  const bool isKnown = result.modeToPutBack_ || fstat(result.file_.get(), &result.status_) == 0;
+  if (!isKnown || !S_ISREG(result.status_.st_mode)) {
+    storeError(error, result.failure(isKnown ? EINVAL : errno));
+    result.file_ = FileDescriptor();
+  }
+  result.mtime_ = result.status_.st_mtim;
+  return result;
+}
+
+ChangedFile::ChangedFile(ChangedFile&& other) noexcept
+    : file_(std::move(other.file_)),
+      path_(std::move(other.path_)),
+      status_(other.status_),
+      modeToPutBack_(std::exchange(other.modeToPutBack_, std::nullopt)),
+      mtime_(other.mtime_),
+      isHeld_(std::exchange(other.isHeld_, false)) {}
+
+ChangedFile::~ChangedFile() {
+  if (file_ && modeToPutBack_) (void)fchmod(file_.get(), *modeToPutBack_);
+}
+
+NSErrorRef ChangedFile::failure(int number) const { return NSError::errorWithErrno(number, path_); }
+
+NSErrorRef ChangedFile::holdDate() {
+  if (const auto earlier = heldDate(file_.get())) {
+    mtime_ = toTimespec(*earlier);
+  } else if (auto error = setAttribute(kHeldDateAttribute, std::to_string(toNanoseconds(mtime_)))) {
+    return error;
+  }
+  isHeld_ = true;
+  return nullptr;
+}
+
+NSErrorRef ChangedFile::putDatesBack() {
+  const std::array<std::timespec, 2> times{status_.st_atim, mtime_};
+  if (futimens(file_.get(), times.data()) != 0) return failure(errno);
+  return std::exchange(isHeld_, false) ? removeAttribute(kHeldDateAttribute) : nullptr;
+}
+
+NSErrorRef ChangedFile::punch() const {
+  struct stat now{};
+  if (fstat(file_.get(), &now) != 0) return failure(errno);
+  const auto size = static_cast<std::uint64_t>(now.st_size);
+  if (size <= kKeptBytes) return nullptr;
+  // To the end of the last block, which would stay otherwise.
+  const std::uint64_t length = (size - kKeptBytes + kKeptBytes - 1) / kKeptBytes * kKeptBytes;
+  constexpr int kMode = FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE;
+  if (fallocate(file_.get(), kMode, kKeptBytes, static_cast<off_t>(length)) != 0) {
+    return failure(errno);
+  }
+  return nullptr;
+}
+
+NSErrorRef ChangedFile::setAttribute(const char* name, const std::string& value) const {
+  return fsetxattr(file_.get(), name, value.data(), value.size(), 0) == 0 ? nullptr
+                                                                          : failure(errno);
+}
+
+NSErrorRef ChangedFile::removeAttribute(const char* name) const {
+  const bool isGone = fremovexattr(file_.get(), name) == 0 || errno == ENODATA;
+  return isGone ? nullptr : failure(errno);
+}
+
+NSErrorRef ChangedFile::sync() const { return fsync(file_.get()) == 0 ? nullptr : failure(errno); }
+
+std::optional<std::int64_t> heldDate(int file) {
+  std::array<char, 32> text{};
+  const ssize_t length = fgetxattr(file, kHeldDateAttribute, text.data(), text.size());
+  if (length <= 0) return std::nullopt;
+  std::int64_t number = 0;
+  const char* const end = text.data() + length;
+  const auto [rest, failure] = std::from_chars(text.data(), end, number);
+  if (failure != std::errc() || rest != end) return std::nullopt;
+  return number;
+}
+
+bool hasHoleFrom(int file, std::uint64_t offset, std::uint64_t size) {
+  if (offset >= size) return false;
+  const off_t hole = lseek(file, static_cast<off_t>(offset), SEEK_HOLE);
+  return hole >= 0 && static_cast<std::uint64_t>(hole) < size;
+}
+
+bool hasDataFrom(int file, std::uint64_t offset) {
+  return lseek(file, static_cast<off_t>(offset), SEEK_DATA) >= 0;
+}
+
+}  // namespace yomber

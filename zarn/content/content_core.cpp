@@ -1,0 +1,201 @@
+#include "zarn/content/content_core.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/foundation/date.h"
+#include "platform/foundation/log.h"
+#include "zarn/busy_files.h"
+#include "zarn/row_queries.h"
+#include "zarn/schema.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+constexpr std::int64_t kNanosecondsInMillisecond = 1'000'000;
+constexpr std::chrono::milliseconds kTickOfForeignClocks{10};
+
+ContentEngine::Options withClock(ContentEngine::Options options) {
+  if (!options.clock) options.clock = [] { return NSDate::now().nanoseconds(); };
+  return options;
+}
+
+std::shared_ptr<JobQueue> makeQueue(const ItemStore& items, const ContentEngine::Options& given) {
+  JobQueue::Options options;
+  if (given.clock) options.tick = kTickOfForeignClocks;
+  options.clock = withClock(given).clock;
+  return std::make_shared<JobQueue>(items.database(), std::move(options));
+}
+
+}  // namespace
+
+ContentCore::ContentCore(std::shared_ptr<ItemStore> itemStore, std::shared_ptr<Scanner> itemScanner,
+                         ContentEngine::Options engineOptions)
+    : items(std::move(itemStore)),
+      scanner(std::move(itemScanner)),
+      options(withClock(engineOptions)),
+      queue(makeQueue(*items, engineOptions)),
+      participant(std::make_shared<ContentParticipant>(queue, options.clock)) {
+  // Jobs of changes that come while nobody is signed in are those of who was last.
+  (void)database().read([&](Connection& connection) {
+    queue->setAccount(metaInteger(connection, meta::kLastAccount));
+  });
+}
+
+std::shared_ptr<ContentStore> ContentCore::store() const {
+  LockGuard guard(mutex_);
+  return store_;
+}
+
+std::string ContentCore::account() const {
+  LockGuard guard(mutex_);
+  return account_;
+}
+
+void ContentCore::setStore(std::shared_ptr<ContentStore> store, const std::string& account) {
+  const bool isSignedIn = store != nullptr;
+  queue->setStoreOpen(false);
+  if (isSignedIn) {
+    std::int64_t key = 0;
+    const NSErrorRef error = database().write([&](WriteTransaction& transaction) {
+      Connection& connection = transaction.connection();
+      key = accountKey(connection, account);
+      claimForAccount(connection, key);
+      setMetaInteger(connection, meta::kLastAccount, key);
+      return NSErrorRef();
+    });
+    if (error) {
+      log_error(defaultLog(), "[ERROR] jobs wait, for the account cannot be stored: %@", error);
+      store = nullptr;
+    } else {
+      queue->setAccount(key);
+    }
+  }
+  {
+    LockGuard guard(mutex_);
+    store_ = std::move(store);
+    account_ = account;
+  }
+  isOffline_ = false;
+  if (isSignedIn) probe();
+}
+
+void ContentCore::noteOutOfReach() {
+  if (isOffline_.exchange(true)) return;
+  log_default(defaultLog(), "[NOTICE] the store is out of reach; jobs wait until it is back");
+  queue->setStoreOpen(false);
+}
+
+void ContentCore::probe() {
+  const auto current = store();
+  if (!current) return;
+  if (current->checkReachability()) return noteOutOfReach();
+  if (isOffline_.exchange(false)) log_default(defaultLog(), "[NOTICE] the store is back");
+  queue->setStoreOpen(true);
+}
+
+NSErrorRef ContentCore::readSubjects(const std::vector<Job>& jobs,
+                                     std::vector<JobSubject>& subjects) const {
+  std::vector<JobSubject> found;
+  NSErrorRef error = database().read([&](Connection& connection) {
+    const bool mayBePinned = hasPins(connection);
+    for (const Job& job : jobs) {
+      JobSubject& subject = found.emplace_back();
+      subject.job = job;
+      if (job.seq == 0) {
+        if (const auto stored = findJob(connection, job.item, job.kind)) subject.job = *stored;
+      }
+      subject.row = findByID(connection, job.item);
+      subject.content = findContent(connection, job.item);
+      if (!subject.row) continue;
+      subject.zone =
+          zoneOf(connection, job.item, subject.content ? subject.content->zone : std::string());
+      subject.isPinned = mayBePinned && isPinned(connection, job.item);
+      subject.isUploadDue = findJob(connection, job.item, JobKind::Upload).has_value();
+    }
+  });
+  for (JobSubject& subject : found) {
+    if (!error && subject.row) {
+      subject.path = items->physicalPath(subject.job.item, &error).value_or(std::string());
+    }
+  }
+  subjects = std::move(found);
+  return error;
+}
+
+std::int64_t ContentCore::nextAttempt(std::uint32_t attempts) const {
+  constexpr std::uint32_t kDoublings = 20;
+  const std::int64_t first = options.firstPause.count();
+  const std::int64_t pause = first << std::min(attempts > 0 ? attempts - 1 : 0, kDoublings);
+  return now() +
+         std::min<std::int64_t>(pause, options.longestPause.count()) * kNanosecondsInMillisecond;
+}
+
+void ContentCore::postpone(Connection& connection, Job job, const NSErrorRef& error) const {
+  ++job.attempts;
+  job.state = isOverQuota(error) ? JobState::OverQuota : JobState::Retrying;
+  job.due = nextAttempt(job.attempts);
+  job.error = error;
+  updateJob(connection, job);
+}
+
+NSErrorRef ContentCore::settleWritten(const std::string& path, const FaultExamination& found) {
+  NSErrorRef error;
+  if (found.condition == FaultCondition::Rewritten) {
+    FileStamp after;
+    error = removeFaultMarks(path, found.stamp.inode, after);
+  } else if (found.condition == FaultCondition::PartlyWritten) {
+    std::string rescued;
+    error = rescuePartialWrite(path, found.record, rescued);
+    if (!error) (void)scanner->scanLocation(rescued, &error);
+  } else if (found.condition == FaultCondition::Damaged) {
+    return NSError::errorWithDomain(
+        NSCocoaErrorDomain, NSFileReadCorruptFileError,
+        {{NSLocalizedDescriptionKey,
+          std::string("The file's mark cannot be understood; remove the file, or put another in "
+                      "its place.")},
+         {NSFilePathErrorKey, path}});
+  }
+  if (!error) (void)scanner->scanLocation(path, &error);
+  return error;
+}
+
+BusyFile::BusyFile(const ContentCore& core, std::uint64_t inode)
+    : database_(core.items->database()), inode_(inode) {
+  database_->busyFiles().add(inode_);
+}
+
+BusyFile::BusyFile(BusyFile&& other) noexcept
+    : database_(other.database_), inode_(std::exchange(other.inode_, 0)) {}
+
+BusyFile::~BusyFile() {
+  if (inode_ != 0) database_->busyFiles().remove(inode_);
+}
+
+void storeLocalState(WriteTransaction& transaction, std::uint64_t item, const FileStamp& before,
+                     const FileStamp& after, bool isHere) {
+  Connection& connection = transaction.connection();
+  auto content = findContent(connection, item);
+  if (content && content->stamp.hasSameContent(after)) {
+    content->stamp.ctime = after.ctime;
+    storeContent(connection, *content);
+  }
+  const auto row = findByID(connection, item);
+  if (!row || row->inode != before.inode) return;
+  ItemRow changed = *row;
+  changed.flags =
+      isHere ? changed.flags | row_flag::kDownloaded : changed.flags & ~row_flag::kDownloaded;
+  changed.size = after.size;
+  changed.mtime = after.mtime;
+  changed.ctime = after.ctime;
+  const bool isShownSame =
+      changed.flags == row->flags && changed.size == row->size && changed.mtime == row->mtime;
+  if (!isShownSame) {
+    (void)transaction.update(*row, changed);
+  } else if (changed.ctime != row->ctime) {
+    transaction.updateQuietly(changed);
+  }
+}
+
+}  // namespace yomber

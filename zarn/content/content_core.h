@@ -1,0 +1,108 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/foundation/lock.h"
+#include "zarn/content/content_participant.h"
+#include "zarn/content/content_store.h"
+#include "zarn/content/fault_file.h"
+#include "zarn/content/job_queue.h"
+#include "zarn/content/wishes.h"
+#include "zarn/content_engine.h"
+#include "zarn/item_store.h"
+#include "zarn/scanner.h"
+
+namespace yomber {
+
+/// What an item's job needs to know, read at once.
+struct JobSubject {
+  Job job;
+  std::optional<ItemRow> row;
+  std::optional<ContentRow> content;
+  std::string path;  ///< on this disk; empty when the item is gone
+  std::string zone;  ///< where its record belongs now
+  bool isPinned = false;
+  bool isUploadDue = false;
+};
+
+/// What the workers of the engine share.
+///
+/// Thread-safety: every operation may be called on any thread but the writer's.
+class ContentCore {
+ public:
+  ContentCore(std::shared_ptr<ItemStore> itemStore, std::shared_ptr<Scanner> itemScanner,
+              ContentEngine::Options engineOptions);
+
+  [[nodiscard]] std::int64_t now() const { return options.clock(); }
+  [[nodiscard]] Database& database() const { return *items->database(); }
+
+  /// Null while nobody is signed in.
+  [[nodiscard]] std::shared_ptr<ContentStore> store() const;
+  [[nodiscard]] std::string account() const;
+  void setStore(std::shared_ptr<ContentStore> store, const std::string& account);
+  /// The store did not answer: jobs that need it wait until it does.
+  void noteOutOfReach();
+  /// Looks whether it can be reached again.
+  void probe();
+  [[nodiscard]] bool isOffline() const { return isOffline_.load(); }
+
+  [[nodiscard]] NSErrorRef readSubjects(const std::vector<Job>& jobs,
+                                        std::vector<JobSubject>& subjects) const;
+
+  /// When a job that has failed `attempts` times is tried again.
+  [[nodiscard]] std::int64_t nextAttempt(std::uint32_t attempts) const;
+  /// Stores that a job failed, and when it is tried again.
+  void postpone(Connection& connection, Job job, const NSErrorRef& error) const;
+
+  /// Decides on a fault that somebody has written to: what they wrote over all of it counts, what
+  /// they wrote into it is brought to a file of its own.
+  NSErrorRef settleWritten(const std::string& path, const FaultExamination& found);
+
+  const std::shared_ptr<ItemStore> items;
+  const std::shared_ptr<Scanner> scanner;
+  const ContentEngine::Options options;
+  const std::shared_ptr<JobQueue> queue;
+  const std::shared_ptr<ContentParticipant> participant;
+  Wishes wishes;     ///< for content to come
+  Wishes evictions;  ///< for content to go; never taken back
+  std::atomic<std::uint64_t> finished{0};
+
+ private:
+  mutable Mutex mutex_;
+  std::shared_ptr<ContentStore> store_ GUARDED_BY(mutex_);
+  std::string account_ GUARDED_BY(mutex_);
+  std::atomic<bool> isOffline_{false};
+};
+
+/// Rows that are as they are while a file is filled or given up.
+class BusyFile {
+ public:
+  BusyFile(const ContentCore& core, std::uint64_t inode);
+  ~BusyFile();
+  BusyFile(BusyFile&& other) noexcept;
+  BusyFile& operator=(BusyFile&&) = delete;
+
+ private:
+  const std::shared_ptr<Database> database_;
+  std::uint64_t inode_;
+};
+
+/// Each does the jobs given, stores what came of them, and tells who waits.
+void doUploads(ContentCore& core, const std::vector<Job>& jobs);
+void doDownloads(ContentCore& core, const std::vector<Job>& jobs);
+void doEvictions(ContentCore& core, const std::vector<Job>& jobs);
+void doSettling(ContentCore& core, const std::vector<Job>& jobs);
+
+/// Stores in an item's row that its content is here or not, and as which file. Leaves alone what a
+/// scan has seen to be another file meanwhile.
+void storeLocalState(WriteTransaction& transaction, std::uint64_t item, const FileStamp& before,
+                     const FileStamp& after, bool isHere);
+
+}  // namespace yomber

@@ -1,0 +1,364 @@
+#include "zarn/content_engine.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <thread>
+#include <utility>
+
+#include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/log.h"
+#include "platform/ostrell/constants.h"
+#include "zarn/content/content_core.h"
+#include "zarn/row_queries.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+constexpr std::size_t kUploadsAtOnce = 256;
+constexpr std::size_t kDownloadsAtOnce = 32;
+constexpr std::size_t kEvictionsAtOnce = 128;
+constexpr std::size_t kSettlingAtOnce = 1024;
+
+NSErrorRef cancelled() {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
+}
+
+NSErrorRef noSuchFile(std::string_view path) {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
+                                  {{NSFilePathErrorKey, std::string(path)}});
+}
+
+/// A wish that has been answered already.
+class GrantedWish final : public ContentWish {
+ public:
+  [[nodiscard]] NSProgressRef progress() const override {
+    return NSProgress::progressWithTotalUnitCount(0);
+  }
+};
+
+class WaitingWish final : public ContentWish {
+ public:
+  WaitingWish(std::shared_ptr<ContentCore> core, std::uint64_t item,
+              ContentEngine::Completion completion)
+      : core_(std::move(core)),
+        item_(item),
+        number_(core_->wishes.add(item, std::move(completion), progress_)) {}
+  ~WaitingWish() override {
+    if (const auto completion = core_->wishes.remove(item_, number_)) completion(cancelled());
+  }
+  WaitingWish(const WaitingWish&) = delete;
+  WaitingWish& operator=(const WaitingWish&) = delete;
+
+  [[nodiscard]] NSProgressRef progress() const override { return progress_; }
+
+ private:
+  const std::shared_ptr<ContentCore> core_;
+  const std::uint64_t item_;
+  NSProgressRef progress_;
+  const std::uint64_t number_;
+};
+
+class Engine final : public ContentEngine {
+ public:
+  Engine(std::shared_ptr<ItemStore> items, std::shared_ptr<Scanner> scanner, Options options)
+      : core_(std::make_shared<ContentCore>(std::move(items), std::move(scanner),
+                                            std::move(options))) {
+    core_->database().setParticipant(core_->participant);
+  }
+  ~Engine() override { end(); }
+
+  void start() override;
+  void stop() override { end(); }
+  void setStore(std::shared_ptr<ContentStore> contents, const std::string& account) override {
+    core_->setStore(std::move(contents), account);
+  }
+  void sweep() override;
+
+  [[nodiscard]] std::unique_ptr<ContentWish> startProviding(std::string_view path,
+                                                            std::uint64_t options,
+                                                            Completion completion) override;
+  void evict(std::string_view path, Completion completion) override;
+  [[nodiscard]] NSErrorRef setPinned(std::string_view path, bool isPinned) override;
+  [[nodiscard]] std::optional<ContentState> contentState(std::string_view path,
+                                                         NSErrorRef* error) const override;
+  [[nodiscard]] ContentTransfers transfers(std::size_t limit) const override;
+  void retryNow() override;
+  [[nodiscard]] bool waitUntilIdle(std::chrono::milliseconds patience) override {
+    return core_->queue->waitUntilIdle(std::chrono::steady_clock::now() + patience);
+  }
+
+ private:
+  using Work = void (*)(ContentCore&, const std::vector<Job>&);
+  void addWorkers(JobKind kind, std::size_t count, std::size_t atOnce, Work work);
+  void watchStore();
+  void end();
+  std::optional<ItemRow> find(std::string_view path, NSErrorRef* error) const;
+  [[nodiscard]] ContentTransfer describe(const Job& job) const;
+
+  const std::shared_ptr<ContentCore> core_;
+  std::vector<std::thread> threads_;
+  Mutex mutex_;
+  Condition changed_;
+  bool isEnding_ GUARDED_BY(mutex_) = false;
+};
+
+void Engine::addWorkers(JobKind kind, std::size_t count, std::size_t atOnce, Work work) {
+  for (std::size_t i = 0; i < count; ++i) {
+    threads_.emplace_back([core = core_, kind, atOnce, work] {
+      for (;;) {
+        const auto jobs = core->queue->take(kind, atOnce);
+        if (jobs.empty()) return;
+        work(*core, jobs);
+        core->queue->release(jobs);
+      }
+    });
+  }
+}
+
+void Engine::start() {
+  const Options& options = core_->options;
+  addWorkers(JobKind::Upload, options.uploadWorkers, kUploadsAtOnce, doUploads);
+  addWorkers(JobKind::Download, options.downloadWorkers, kDownloadsAtOnce, doDownloads);
+  addWorkers(JobKind::Evict, options.evictWorkers, kEvictionsAtOnce, doEvictions);
+  addWorkers(JobKind::Settle, 1, kSettlingAtOnce, doSettling);
+  threads_.emplace_back([this] { watchStore(); });
+  if (!core_->database().needsFirstScan()) sweep();
+}
+
+/// Notices when a store out of reach is back.
+void Engine::watchStore() {
+  for (;;) {
+    {
+      LockGuard guard(mutex_);
+      if (isEnding_) return;
+      (void)changed_.waitUntil(mutex_,
+                               std::chrono::steady_clock::now() + core_->options.offlinePause);
+      if (isEnding_) return;
+    }
+    if (core_->isOffline()) core_->probe();
+  }
+}
+
+void Engine::end() {
+  {
+    LockGuard guard(mutex_);
+    isEnding_ = true;
+    changed_.notifyAll();
+  }
+  core_->queue->end();
+  for (std::thread& thread : threads_) thread.join();
+  threads_.clear();
+  for (Wishes* wishes : {&core_->wishes, &core_->evictions}) {
+    for (auto& completion : wishes->takeAll()) {
+      if (completion) completion(cancelled());
+    }
+  }
+}
+
+/// A part at a time, so that others get their turn.
+void sweepOn(const std::shared_ptr<ContentCore>& core) {
+  const auto isDone = std::make_shared<bool>(true);
+  core->database().writeLater(
+      [core, isDone](WriteTransaction& transaction) {
+        *isDone = core->participant->sweep(transaction);
+        return NSErrorRef();
+      },
+      [core, isDone](const NSErrorRef& error) {
+        if (error) log_error(defaultLog(), "[ERROR] documents get no jobs: %@", error);
+        core->queue->noteJobs(JobKind::Upload);
+        if (!error && !*isDone && !core->queue->isEnding()) sweepOn(core);
+      });
+}
+
+void Engine::sweep() { sweepOn(core_); }
+
+std::optional<ItemRow> Engine::find(std::string_view path, NSErrorRef* error) const {
+  NSErrorRef failure;
+  auto row = core_->items->itemAtPath(path, &failure);
+  if (!row && !failure) row = core_->scanner->scanLocation(path, &failure);
+  if (!row) storeError(error, failure ? failure : noSuchFile(path));
+  return row;
+}
+
+std::unique_ptr<ContentWish> Engine::startProviding(std::string_view path, std::uint64_t options,
+                                                    Completion completion) {
+  NSErrorRef error;
+  const auto row = find(path, &error);
+  if (row && row->kind == ItemKind::Document) {
+    const auto physical = core_->items->physicalPath(row->id, &error);
+    const auto running = core_->queue->running(row->id);
+    const bool isLeaving = running && running->job.kind == JobKind::Evict;
+    const bool isToCome =
+        physical && (isLeaving || (options & kAfterWhatGoesOn) != 0 || isFaultAtPath(*physical));
+    if (!physical && !error) error = noSuchFile(path);
+    if (isToCome) {
+      auto wish = std::make_unique<WaitingWish>(core_, row->id, std::move(completion));
+      core_->queue->pushUrgent(row->id);
+      return wish;
+    }
+  }
+  if (completion) completion(error);
+  return std::make_unique<GrantedWish>();
+}
+
+void Engine::evict(std::string_view path, Completion completion) {
+  NSErrorRef error;
+  const auto row = find(path, &error);
+  if (row && row->kind != ItemKind::Document) {
+    error = NSError::errorWithDomain(
+        QSOstrellErrorDomain, QSOstrellErrorCannotEvict,
+        {{NSLocalizedDescriptionKey, std::string("only documents can be given up")}});
+  }
+  if (error) {
+    if (completion) completion(error);
+    return;
+  }
+  NSProgressRef progress;
+  (void)core_->evictions.add(row->id, std::move(completion), progress);
+  core_->database().writeLater(
+      [core = core_, id = row->id](WriteTransaction& transaction) {
+        const std::int64_t now = core->now();
+        addJob(transaction.connection(), id, JobKind::Evict, core->queue->account(), now, now);
+        return NSErrorRef();
+      },
+      [core = core_, id = row->id](const NSErrorRef& failure) {
+        if (!failure) return core->queue->noteJobs(JobKind::Evict);
+        for (auto& each : core->evictions.take(id)) {
+          if (each) each(failure);
+        }
+      });
+}
+
+NSErrorRef Engine::setPinned(std::string_view path, bool isPinned) {
+  NSErrorRef error;
+  const auto row = find(path, &error);
+  if (!row) return error;
+  error = core_->database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    ContentRow content;
+    content.id = row->id;
+    content.account = core_->queue->account();
+    if (const auto known = findContent(connection, row->id)) content = *known;
+    content.isPinned = isPinned;
+    storeContent(connection, content);
+    std::vector<ItemRow> below{*row};
+    const std::int64_t now = core_->now();
+    while (isPinned && !below.empty()) {
+      const ItemRow item = below.back();
+      below.pop_back();
+      if (item.isFolder()) {
+        for (ItemRow& child : findChildren(connection, item.id)) below.push_back(std::move(child));
+      } else if (item.kind == ItemKind::Document && (item.flags & row_flag::kDownloaded) == 0) {
+        addJob(connection, item.id, JobKind::Download, content.account, now, now);
+      }
+    }
+    return NSErrorRef();
+  });
+  core_->queue->noteJobs(JobKind::Download);
+  return error;
+}
+
+std::optional<ContentState> Engine::contentState(std::string_view path, NSErrorRef* error) const {
+  NSErrorRef failure;
+  const auto row = find(path, &failure);
+  const auto physical = row ? core_->items->physicalPath(row->id, &failure) : std::nullopt;
+  if (!physical) {
+    storeError(error, failure ? failure : noSuchFile(path));
+    return std::nullopt;
+  }
+  ContentState state;
+  state.size = row->size;
+  struct stat status{};
+  constexpr std::uint64_t kBlock = 512;
+  if (lstat(physical->c_str(), &status) == 0) {
+    state.localBytes = static_cast<std::uint64_t>(status.st_blocks) * kBlock;
+  }
+  const auto running = core_->queue->running(row->id);
+  const bool isDocument = row->kind == ItemKind::Document;
+  if (isDocument && isFaultAtPath(*physical)) state.local = ContentState::Local::Fault;
+  if (running && running->job.kind == JobKind::Evict) state.local = ContentState::Local::Evicting;
+  if (running && running->job.kind == JobKind::Download && state.local != ContentState::Local::Here)
+    state.local = ContentState::Local::Downloading;
+  failure = core_->database().read([&](Connection& connection) {
+    state.isPinned = isPinned(connection, row->id);
+    const auto upload = findJob(connection, row->id, JobKind::Upload);
+    const auto download = findJob(connection, row->id, JobKind::Download);
+    if (download) state.lastFailure = download->error;
+    if (upload && upload->error) state.lastFailure = upload->error;
+    if (!isDocument) return;
+    const auto content = findContent(connection, row->id);
+    const bool isStored = content && !upload && isConfirmed(*row, *content);
+    state.upload = isStored ? ContentState::Upload::Confirmed : ContentState::Upload::Waiting;
+  });
+  if (running && running->job.kind == JobKind::Upload)
+    state.upload = ContentState::Upload::Uploading;
+  storeError(error, failure);
+  if (failure) return std::nullopt;
+  return state;
+}
+
+ContentTransfer Engine::describe(const Job& job) const {
+  ContentTransfer result;
+  result.item = job.item;
+  result.path = core_->items->logicalPath(job.item).value_or(std::string());
+  result.kind = static_cast<ContentTransfer::Kind>(job.kind);
+  result.attempts = job.attempts;
+  result.failure = job.error;
+  if (job.state != JobState::Waiting) result.nextAttempt = job.due;
+  if (const auto row = core_->items->itemByID(job.item)) result.total = row->size;
+  return result;
+}
+
+ContentTransfers Engine::transfers(std::size_t limit) const {
+  ContentTransfers result;
+  for (const JobQueue::Running& running : core_->queue->allRunning()) {
+    if (running.job.kind == JobKind::Settle || result.transfers.size() >= limit) continue;
+    ContentTransfer transfer = describe(running.job);
+    transfer.isRunning = true;
+    transfer.nextAttempt.reset();
+    transfer.done = static_cast<std::uint64_t>(running.progress->completedUnitCount());
+    result.transfers.push_back(std::move(transfer));
+  }
+  std::vector<Job> failed;
+  (void)core_->database().read([&](Connection& connection) {
+    const std::int64_t account = core_->queue->account();
+    failed = failedJobs(connection, account, limit);
+    result.waiting = countJobs(connection, account);
+  });
+  const std::size_t running = result.transfers.size();
+  for (const Job& job : failed) {
+    if (result.transfers.size() >= limit) break;
+    const bool isListed = std::any_of(
+        result.transfers.begin(), result.transfers.begin() + static_cast<std::ptrdiff_t>(running),
+        [&](const ContentTransfer& each) { return each.item == job.item; });
+    if (!isListed) result.transfers.push_back(describe(job));
+  }
+  result.finished = core_->finished.load();
+  result.isOffline = core_->isOffline();
+  return result;
+}
+
+void Engine::retryNow() {
+  core_->probe();
+  const NSErrorRef error = core_->database().write([&](WriteTransaction& transaction) {
+    makeAllDue(transaction.connection(), core_->queue->account(), core_->now());
+    return NSErrorRef();
+  });
+  if (error) log_error(defaultLog(), "[ERROR] jobs cannot be tried now: %@", error);
+  for (const JobKind kind : {JobKind::Upload, JobKind::Download, JobKind::Evict}) {
+    core_->queue->noteJobs(kind);
+  }
+}
+
+}  // namespace
+
+std::shared_ptr<ContentEngine> ContentEngine::create(std::shared_ptr<ItemStore> items,
+                                                     std::shared_ptr<Scanner> scanner,
+                                                     Options options) {
+  return std::make_shared<Engine>(std::move(items), std::move(scanner), std::move(options));
+}
+
+}  // namespace yomber

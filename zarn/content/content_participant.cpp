@@ -1,0 +1,130 @@
+#include "zarn/content/content_participant.h"
+
+#include <vector>
+
+#include "zarn/row_queries.h"
+#include "zarn/schema.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+constexpr std::int64_t kSweptAtOnce = 2000;
+constexpr std::int64_t kAllSwept = -1;
+
+bool isSameFileContent(const ItemRow& row, const FileStamp& stamp) {
+  return row.inode == stamp.inode && row.size == stamp.size && row.mtime == stamp.mtime;
+}
+
+}  // namespace
+
+bool isConfirmed(const ItemRow& row, const ContentRow& content) {
+  return content.content && isSameFileContent(row, content.stamp) && row.name == content.name &&
+         row.parent == content.parent;
+}
+
+void ContentParticipant::noteDocument(Connection& connection, const ItemRow& row, Made& made) {
+  const auto content = findContent(connection, row.id);
+  const bool isHere = (row.flags & row_flag::kDownloaded) != 0;
+  const bool isMarked = (row.flags & row_flag::kUploaded) != 0;
+  // A ctime of its own may hide a change that kept size and date.
+  const bool isDone = content && isMarked && isConfirmed(row, *content) &&
+                      (!isHere || row.ctime == content->stamp.ctime);
+  const std::int64_t account = content && content->content ? content->account : queue_->account();
+  const std::int64_t now = clock_();
+  if (!isDone) {
+    addJob(connection, row.id, JobKind::Upload, account, now, now);
+    made.hasUploads = true;
+  }
+  const bool isToCome = !isHere && !findJob(connection, row.id, JobKind::Download);
+  if (isToCome && isPinned(connection, row.id)) {
+    addJob(connection, row.id, JobKind::Download, account, now, now);
+    made.hasDownloads = true;
+  }
+}
+
+void ContentParticipant::noteRemoval(Connection& connection, std::uint64_t id, Made& made) {
+  removeJobsOf(connection, id);
+  const auto content = findContent(connection, id);
+  if (!content) return;
+  if (!content->content) return removeContent(connection, id);
+  const std::int64_t now = clock_();
+  addJob(connection, id, JobKind::Upload, content->account, now, now);
+  made.hasUploads = true;
+}
+
+void ContentParticipant::noteMovedFolder(Connection& connection, const ItemChange& change,
+                                         Made& made) {
+  const bool isElsewhere =
+      zoneOf(connection, change.parentBefore, {}) != zoneOf(connection, change.row.parent, {});
+  if (!isElsewhere && !hasPins(connection)) return;
+  std::vector<std::uint64_t> folders{change.row.id};
+  while (!folders.empty()) {
+    const std::uint64_t folder = folders.back();
+    folders.pop_back();
+    for (const ItemRow& child : findChildren(connection, folder)) {
+      if (child.isFolder()) folders.push_back(child.id);
+      if (child.kind != ItemKind::Document) continue;
+      ItemRow unconfirmed = child;
+      if (isElsewhere) unconfirmed.flags &= ~row_flag::kUploaded;
+      noteDocument(connection, unconfirmed, made);
+    }
+  }
+}
+
+std::function<void()> ContentParticipant::announcement(const Made& made) const {
+  if (!made.hasUploads && !made.hasDownloads) return {};
+  return [queue = queue_, made] {
+    if (made.hasUploads) queue->noteJobs(JobKind::Upload);
+    if (made.hasDownloads) queue->noteJobs(JobKind::Download);
+  };
+}
+
+std::function<void()> ContentParticipant::willCommit(WriteTransaction& transaction) {
+  Connection& connection = transaction.connection();
+  Made made;
+  for (const ItemChange& change : transaction.changes()) {
+    if (change.isDead()) {
+      noteRemoval(connection, change.row.id, made);
+    } else if (change.row.isFolder()) {
+      if (change.hasMoved()) noteMovedFolder(connection, change, made);
+    } else if (change.row.kind == ItemKind::Document) {
+      // As it is now: it may have changed several times.
+      const auto row = findByID(connection, change.row.id);
+      if (row) noteDocument(connection, *row, made);
+    }
+  }
+  for (const std::uint64_t id : transaction.touched()) {
+    const auto row = findByID(connection, id);
+    if (row && row->kind == ItemKind::Document) noteDocument(connection, *row, made);
+  }
+  return announcement(made);
+}
+
+bool ContentParticipant::sweep(WriteTransaction& transaction) {
+  Connection& connection = transaction.connection();
+  std::int64_t at = metaInteger(connection, meta::kSweptUpTo);
+  if (at == kAllSwept) return true;
+  std::vector<ItemRow> rows;
+  std::int64_t last = kAllSwept;
+  {
+    StatementUse statement(connection.prepared(
+        "SELECT " YOMBER_ROW_COLUMNS ",seq FROM item WHERE seq>?1 ORDER BY seq LIMIT ?2"));
+    statement->bindInteger(1, at);
+    statement->bindInteger(2, kSweptAtOnce);
+    while (statement->step()) {
+      readRow(*statement, rows.emplace_back());
+      last = statement->integer(kRowColumnCount);
+    }
+  }
+  Made made;
+  for (const ItemRow& row : rows) {
+    const bool isKnown = row.kind != ItemKind::Document || findContent(connection, row.id) ||
+                         findJob(connection, row.id, JobKind::Upload);
+    if (!isKnown) noteDocument(connection, row, made);
+  }
+  setMetaInteger(connection, meta::kSweptUpTo, last);
+  return last == kAllSwept;
+}
+
+}  // namespace yomber

@@ -1,0 +1,43 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+
+#include "zarn/content/content_rows.h"
+#include "zarn/content/job_queue.h"
+#include "zarn/database.h"
+
+namespace yomber {
+
+/// Makes jobs of what changes, in the very transaction that stores the change.
+///
+/// Thread-safety: for the writer thread.
+class ContentParticipant : public CommitParticipant {
+ public:
+  ContentParticipant(std::shared_ptr<JobQueue> queue, std::function<std::int64_t()> clock)
+      : queue_(std::move(queue)), clock_(std::move(clock)) {}
+
+  std::function<void()> willCommit(WriteTransaction& transaction) override;
+
+  /// Gives jobs to documents that were there before this program made jobs, some thousands at a
+  /// time. True when all have been seen to.
+  bool sweep(WriteTransaction& transaction);
+
+ private:
+  struct Made {
+    bool hasUploads = false;
+    bool hasDownloads = false;
+  };
+  void noteDocument(Connection& connection, const ItemRow& row, Made& made);
+  void noteRemoval(Connection& connection, std::uint64_t id, Made& made);
+  void noteMovedFolder(Connection& connection, const ItemChange& change, Made& made);
+  [[nodiscard]] std::function<void()> announcement(const Made& made) const;
+
+  const std::shared_ptr<JobQueue> queue_;
+  const std::function<std::int64_t()> clock_;
+};
+
+/// Whether the store's record says what the row does, and has its content.
+[[nodiscard]] bool isConfirmed(const ItemRow& row, const ContentRow& content);
+
+}  // namespace yomber

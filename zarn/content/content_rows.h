@@ -1,0 +1,93 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/foundation/error.h"
+#include "zarn/connection.h"
+#include "zarn/content/fault_record.h"
+
+namespace yomber {
+
+// How jobs and content are stored. All throw SQLite::Exception; what changes something needs the
+// writer's connection.
+
+enum class JobKind : std::uint8_t {
+  Upload,  ///< makes the store's record what the item is, or removes it
+  Download,
+  Evict,
+  Settle,  ///< syncs a filled file, then takes its marks off
+};
+inline constexpr std::size_t kJobKinds = 4;
+
+enum class JobState : std::uint8_t { Waiting, Retrying, OverQuota };
+
+struct Job {
+  std::int64_t seq = 0;
+  std::uint64_t item = 0;
+  JobKind kind = JobKind::Upload;
+  std::int64_t account = 0;
+  JobState state = JobState::Waiting;
+  std::uint32_t attempts = 0;  ///< that failed
+  std::int64_t due = 0;        ///< ns since the epoch
+  std::int64_t created = 0;    ///< ns since the epoch
+  NSErrorRef error;            ///< of the last attempt
+};
+
+/// Replaces the item's job of that kind.
+void addJob(Connection& connection, std::uint64_t item, JobKind kind, std::int64_t account,
+            std::int64_t due, std::int64_t now);
+/// Nothing happens when another has taken its place.
+void removeJob(Connection& connection, const Job& job);
+/// Stores its state, attempts, due time and error.
+void updateJob(Connection& connection, const Job& job);
+void removeJobsOf(Connection& connection, std::uint64_t item);
+[[nodiscard]] std::optional<Job> findJob(Connection& connection, std::uint64_t item, JobKind kind);
+/// Those due at `now`, in the order in which they fell due.
+[[nodiscard]] std::vector<Job> dueJobs(Connection& connection, std::int64_t account, JobKind kind,
+                                       std::int64_t now, std::size_t limit);
+[[nodiscard]] std::optional<std::int64_t> nextDue(Connection& connection, std::int64_t account,
+                                                  JobKind kind, std::int64_t after);
+/// Those that have failed before.
+[[nodiscard]] std::vector<Job> failedJobs(Connection& connection, std::int64_t account,
+                                          std::size_t limit);
+[[nodiscard]] std::uint64_t countJobs(Connection& connection, std::int64_t account);
+/// All jobs that wait to be tried again are due at `now`.
+void makeAllDue(Connection& connection, std::int64_t account, std::int64_t now);
+
+/// What is known of an item's content.
+struct ContentRow {
+  std::uint64_t id = 0;
+  std::int64_t account = 0;
+  bool isPinned = false;
+  std::string zone;                ///< of the store's record
+  std::uint64_t parent = 0;        ///< as the record has it
+  std::string name;                ///< as the record has it
+  std::optional<RZAsset> content;  ///< that the store has; nothing: none yet
+  std::string tag;                 ///< of the record
+  FileStamp stamp;                 ///< of the file when that was its content
+};
+
+[[nodiscard]] std::optional<ContentRow> findContent(Connection& connection, std::uint64_t id);
+void storeContent(Connection& connection, const ContentRow& row);
+void removeContent(Connection& connection, std::uint64_t id);
+[[nodiscard]] bool hasPins(Connection& connection);
+/// Whether an item or a folder above it is pinned.
+[[nodiscard]] bool isPinned(Connection& connection, std::uint64_t id);
+/// The container that an item belongs to; `before` for what is in the trash.
+[[nodiscard]] std::string zoneOf(Connection& connection, std::uint64_t id,
+                                 const std::string& before);
+
+/// The number that stands for an account in the tables; makes one where there is none.
+[[nodiscard]] std::int64_t accountKey(Connection& connection, const std::string& account);
+[[nodiscard]] std::string accountName(Connection& connection, std::int64_t key);
+/// Jobs and content made before anybody ever signed in become that account's.
+void claimForAccount(Connection& connection, std::int64_t key);
+
+/// Errors as they are stored: domain, code and description.
+[[nodiscard]] std::string encodeError(const NSErrorRef& error);
+[[nodiscard]] NSErrorRef decodeError(std::string_view text);
+
+}  // namespace yomber

@@ -1,0 +1,283 @@
+// Downloads: filling faults in their places, and taking their marks off later.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+
+#include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
+#include "platform/foundation/log.h"
+#include "platform/ostrell/constants.h"
+#include "zarn/content/content_core.h"
+#include "zarn/row_queries.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+FaultPoint downloadNoted("zarn.download.noted");
+FaultPoint downloadFilled("zarn.download.filled");
+FaultPoint settleSynced("zarn.settle.synced");
+
+constexpr int kAttempts = 3;
+
+NSErrorRef noSuchFile(const std::string& path) {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
+                                  {{NSFilePathErrorKey, path}});
+}
+
+NSErrorRef notSignedIn() {
+  return NSError::errorWithDomain(
+      QSOstrellErrorDomain, QSOstrellErrorLoggedOut,
+      {{NSLocalizedDescriptionKey,
+        std::string("nobody is signed in to the drive: yomber account sign-in NAME")}});
+}
+
+struct Download {
+  JobSubject subject;
+  bool isByItself = false;  ///< goes on without anybody who waits
+  std::uint64_t inode = 0;
+  FileStamp after;
+  NSErrorRef error;
+};
+
+class DownloadBatch {
+ public:
+  explicit DownloadBatch(ContentCore& core) : core_(core), store_(core.store()) {}
+
+  void run(const std::vector<Job>& jobs) {
+    std::vector<JobSubject> subjects;
+    if (NSErrorRef error = core_.readSubjects(jobs, subjects)) {
+      for (const Job& job : jobs) answer(job.item, error);
+      return;
+    }
+    for (std::size_t i = 0; i < subjects.size(); ++i) {
+      const bool isByItself = jobs[i].seq != 0 || subjects[i].isPinned;
+      Download& download = downloads_.emplace_back();
+      download.subject = std::move(subjects[i]);
+      download.isByItself = isByItself;
+    }
+    noteJobs();
+    std::vector<BusyFile> busy;
+    for (Download& download : downloads_) {
+      if (!download.error) download.error = fill(download, busy);
+    }
+    (void)downloadFilled.hit();
+    const NSErrorRef error = store();
+    busy.clear();
+    for (Download& download : downloads_) {
+      if (error && !download.error) download.error = error;
+      finish(download);
+    }
+  }
+
+ private:
+  /// What changes a file before it is whole again is written down first.
+  void noteJobs() {
+    std::vector<Download*> unnoted;
+    for (Download& download : downloads_) {
+      const auto& row = download.subject.row;
+      const bool isNoted = download.subject.job.seq != 0 || !row || row->size <= kKeptBytes;
+      if (!isNoted) unnoted.push_back(&download);
+    }
+    if (unnoted.empty()) return;
+    const NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+      for (Download* download : unnoted) {
+        Job& job = download->subject.job;
+        const std::int64_t now = core_.now();
+        addJob(transaction.connection(), job.item, JobKind::Download, job.account, now, now);
+        const auto added = findJob(transaction.connection(), job.item, JobKind::Download);
+        if (added) job = *added;
+      }
+      return NSErrorRef();
+    });
+    for (Download* download : unnoted) download->error = error;
+    (void)downloadNoted.hit();
+  }
+
+  [[nodiscard]] bool isWanted(const Download& download) const {
+    if (core_.queue->isEnding()) return false;
+    return download.isByItself || core_.wishes.isWanted(download.subject.job.item);
+  }
+
+  NSErrorRef fill(Download& download, std::vector<BusyFile>& busy) {
+    NSErrorRef error;
+    for (int attempt = 0; attempt < kAttempts; ++attempt) {
+      if (!download.subject.row || download.subject.path.empty()) return noSuchFile({});
+      error = fillOnce(download, busy);
+      if (!error || !error->is(NSPOSIXErrorDomain, EAGAIN)) break;
+      // Somebody has written to the fault.
+      const std::string& path = download.subject.path;
+      const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+      if (!file) break;
+      if (NSErrorRef failure = core_.settleWritten(path, examineFault(file.get()))) return failure;
+    }
+    if (error && error->is(NSPOSIXErrorDomain, ENOENT)) {
+      (void)core_.scanner->scanLocation(download.subject.path, nullptr);
+      return noSuchFile(download.subject.path);
+    }
+    return error;
+  }
+
+  NSErrorRef fillOnce(Download& download, std::vector<BusyFile>& busy) {
+    const JobSubject& subject = download.subject;
+    struct stat status{};
+    if (lstat(subject.path.c_str(), &status) != 0) {
+      return NSError::errorWithErrno(errno, subject.path);
+    }
+    download.inode = status.st_ino;
+    if (status.st_size > static_cast<off_t>(kKeptBytes)) busy.emplace_back(core_, status.st_ino);
+    const auto shown = progressOf(subject.job.item);
+    for (const auto& progress : shown) progress->setTotalUnitCount(status.st_size);
+    const auto goesOn = [&](std::uint64_t done) {
+      for (const auto& progress : shown) {
+        progress->setCompletedUnitCount(static_cast<std::int64_t>(done));
+      }
+      return isWanted(download);
+    };
+    const auto fetch = [&](const FaultRecord& record, int file,
+                           const std::function<bool(std::uint64_t)>& watch) {
+      if (!store_) return notSignedIn();
+      return store_->copy(record.content, file, watch);
+    };
+    return fillFault(subject.path, fetch, goesOn, download.after);
+  }
+
+  [[nodiscard]] std::vector<NSProgressRef> progressOf(std::uint64_t item) const {
+    std::vector<NSProgressRef> result;
+    if (auto running = core_.queue->running(item)) result.push_back(running->progress);
+    if (auto wished = core_.wishes.progress(item)) result.push_back(wished);
+    return result;
+  }
+
+  NSErrorRef store() {
+    bool hasSettling = false;
+    NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+      for (const Download& download : downloads_) {
+        if (download.error) {
+          storeFailure(transaction.connection(), download);
+          continue;
+        }
+        storeSuccess(transaction, download);
+        hasSettling = true;
+      }
+      return NSErrorRef();
+    });
+    if (hasSettling) core_.queue->noteJobs(JobKind::Settle);
+    return error;
+  }
+
+  void storeSuccess(WriteTransaction& transaction, const Download& download) const {
+    Connection& connection = transaction.connection();
+    const Job& job = download.subject.job;
+    FileStamp before = download.after;
+    before.inode = download.inode;
+    storeLocalState(transaction, job.item, before, download.after, true);
+    removeJob(connection, job);
+    const std::int64_t now = core_.now();
+    const std::int64_t pause = std::chrono::nanoseconds(core_.options.settlePause).count();
+    addJob(connection, job.item, JobKind::Settle, job.account, now + pause, now);
+  }
+
+  void storeFailure(Connection& connection, const Download& download) const {
+    const Job& job = download.subject.job;
+    if (job.seq == 0 || core_.queue->isEnding()) return;
+    const bool isKept = download.isByItself && download.subject.row;
+    if (!isKept) {
+      removeJob(connection, job);
+    } else if (!isOutOfReach(download.error)) {
+      core_.postpone(connection, job, download.error);
+    }
+  }
+
+  void finish(const Download& download) {
+    const std::uint64_t item = download.subject.job.item;
+    if (isOutOfReach(download.error)) core_.noteOutOfReach();
+    if (!download.error) core_.finished.fetch_add(1);
+    const bool isCancelled =
+        download.error && download.error->is(NSCocoaErrorDomain, NSUserCancelledError);
+    // Given up, and wished for again meanwhile.
+    if (isCancelled && !core_.queue->isEnding() && core_.wishes.isWanted(item)) {
+      return core_.queue->pushUrgent(item);
+    }
+    answer(item, download.error);
+  }
+
+  void answer(std::uint64_t item, const NSErrorRef& error) {
+    for (auto& completion : core_.wishes.take(item)) {
+      if (completion) completion(error);
+    }
+  }
+
+  ContentCore& core_;
+  const std::shared_ptr<ContentStore> store_;
+  std::vector<Download> downloads_;
+};
+
+}  // namespace
+
+void doDownloads(ContentCore& core, const std::vector<Job>& jobs) { DownloadBatch(core).run(jobs); }
+
+namespace {
+
+struct Settling {
+  JobSubject subject;
+  FileStamp before;
+  FileStamp after;
+  bool isHere = false;
+  bool isLater = false;
+};
+
+/// Whether the file is one to take the marks off; what it is otherwise is found out as well.
+bool isFilled(Settling& settling) {
+  const std::string& path = settling.subject.path;
+  const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  struct stat status{};
+  if (path.empty() || !file || fstat(file.get(), &status) != 0) return false;
+  settling.before = FileStamp::of(status);
+  settling.after = settling.before;
+  settling.isHere = !isUnfilledFault(file.get());
+  bool isDamaged = false;
+  return settling.isHere && readFaultRecord(file.get(), isDamaged);
+}
+
+}  // namespace
+
+void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
+  std::vector<JobSubject> subjects;
+  if (core.readSubjects(jobs, subjects)) return;
+  std::vector<Settling> all;
+  std::vector<std::size_t> filled;
+  for (JobSubject& subject : subjects) {
+    all.push_back({.subject = std::move(subject), .before = {}, .after = {}});
+    if (isFilled(all.back())) filled.push_back(all.size() - 1);
+  }
+  // One sync for all: what was written to them is on the disk when it returns.
+  const FileDescriptor tree(
+      open(core.items->layout().tree().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const bool isSynced = filled.empty() || (tree && syncfs(tree.get()) == 0);
+  if (!isSynced) log_error(defaultLog(), "[ERROR] filled files cannot be synced: errno %d", errno);
+  (void)settleSynced.hit();
+  for (const std::size_t index : filled) {
+    Settling& settling = all[index];
+    settling.isLater = !isSynced || removeFaultMarks(settling.subject.path, settling.before.inode,
+                                                     settling.after) != nullptr;
+  }
+  const NSErrorRef error = core.database().write([&](WriteTransaction& transaction) {
+    for (const Settling& settling : all) {
+      const Job& job = settling.subject.job;
+      if (settling.isLater) {
+        core.postpone(transaction.connection(), job, NSError::errorWithErrno(EIO));
+        continue;
+      }
+      removeJob(transaction.connection(), job);
+      if (settling.before.inode == 0) continue;
+      storeLocalState(transaction, job.item, settling.before, settling.after, settling.isHere);
+    }
+    return NSErrorRef();
+  });
+  if (error) log_error(defaultLog(), "[ERROR] filled files cannot be noted: %@", error);
+}
+
+}  // namespace yomber

@@ -1,0 +1,191 @@
+// Evictions: giving up content that the store has.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <memory>
+
+#include "platform/foundation/fault_points.h"
+#include "platform/foundation/log.h"
+#include "platform/ostrell/constants.h"
+#include "zarn/content/content_core.h"
+#include "zarn/row_queries.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+FaultPoint evictStored("zarn.evict.stored");
+
+/// From so many on, one sync of the file system costs less than theirs.
+constexpr std::size_t kManyFiles = 8;
+
+NSErrorRef refusal(const char* reason) {
+  return NSError::errorWithDomain(QSOstrellErrorDomain, QSOstrellErrorCannotEvict,
+                                  {{NSLocalizedDescriptionKey, std::string(reason)}});
+}
+
+struct Departure {
+  JobSubject subject;
+  std::unique_ptr<Eviction> eviction;
+  FileStamp before;
+  FileStamp after;
+  bool isFault = false;  ///< its content is gone
+  NSErrorRef error;
+};
+
+/// Why an item cannot be given up, as far as the rows say.
+NSErrorRef reasonInRows(const ContentCore& core, const JobSubject& subject) {
+  if (!subject.row) {
+    return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError);
+  }
+  if (subject.row->kind != ItemKind::Document) return refusal("only documents can be given up");
+  if (subject.isPinned) return refusal("it is pinned");
+  if (core.wishes.isWanted(subject.job.item)) return refusal("somebody is about to read it");
+  if (!subject.content || !subject.content->content) {
+    return refusal("it is not confirmed in the store yet");
+  }
+  return nullptr;
+}
+
+/// What changes with attributes and names only must not look like a change of content: the content
+/// itself decides.
+NSErrorRef compareContent(Departure& departure, int file) {
+  ContentRow& content = *departure.subject.content;
+  if (departure.before == content.stamp) return nullptr;
+  const bool mayBeSame = content.stamp.hasSameContent(departure.before);
+  const auto hashed =
+      mayBeSame ? hashUnchanged(file, departure.before, nullptr) : std::optional<RZAsset>();
+  if (!hashed || *hashed != *content.content) {
+    return refusal("it has changed since it was confirmed in the store");
+  }
+  content.stamp = departure.before;
+  return nullptr;
+}
+
+NSErrorRef lookAt(Departure& departure) {
+  const std::string& path = departure.subject.path;
+  const FileDescriptor file(
+      open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  struct stat status{};
+  if (!file || fstat(file.get(), &status) != 0) return NSError::errorWithErrno(errno, path);
+  departure.before = FileStamp::of(status);
+  if (!S_ISREG(status.st_mode)) return refusal("only documents can be given up");
+  if (status.st_nlink > 1) return refusal("it has several names (hard links)");
+  const FaultExamination found = examineFault(file.get());
+  if (found.condition == FaultCondition::NoFault) return compareContent(departure, file.get());
+  if (found.condition != FaultCondition::Pristine) {
+    return refusal("it has changed since it was confirmed in the store");
+  }
+  // One that an earlier process left half-way is finished.
+  departure.isFault = !heldDate(file.get());
+  departure.after = departure.before;
+  return nullptr;
+}
+
+class EvictionBatch {
+ public:
+  explicit EvictionBatch(ContentCore& core) : core_(core) {}
+
+  void run(std::vector<JobSubject> subjects) {
+    std::vector<BusyFile> busy;
+    for (JobSubject& subject : subjects) {
+      Departure& departure = departures_.emplace_back();
+      departure.subject = std::move(subject);
+      departure.error = begin(departure, busy);
+    }
+    sync();
+    for (Departure& departure : departures_) {
+      if (departure.error || !departure.eviction) continue;
+      // Somebody may have come to wish for it meanwhile.
+      if (core_.wishes.isWanted(departure.subject.job.item)) {
+        departure.error = refusal("somebody is about to read it");
+      } else {
+        departure.error = departure.eviction->finish(departure.after);
+        departure.isFault = !departure.error;
+      }
+      departure.eviction.reset();
+    }
+    store();
+    busy.clear();
+    for (const Departure& departure : departures_) answer(departure);
+  }
+
+ private:
+  NSErrorRef begin(Departure& departure, std::vector<BusyFile>& busy) {
+    if (NSErrorRef error = reasonInRows(core_, departure.subject)) return error;
+    if (NSErrorRef error = lookAt(departure)) return error;
+    if (departure.isFault) return nullptr;
+    const ContentRow& content = *departure.subject.content;
+    if (content.content->size > kKeptBytes) busy.emplace_back(core_, departure.before.inode);
+    const FaultRecord record{.item = departure.subject.job.item,
+                             .content = *content.content,
+                             .mtime = content.stamp.mtime,
+                             .head = 0,
+                             .tag = content.tag,
+                             .account = core_.account()};
+    NSErrorRef error;
+    departure.eviction = Eviction::begin(departure.subject.path, departure.before, record, &error);
+    return error;
+  }
+
+  /// The marks must be on the disk before any block is given up. What is all kept gives up none.
+  void sync() {
+    std::vector<Departure*> marked;
+    for (Departure& departure : departures_) {
+      const bool isLarge = departure.before.size > kKeptBytes;
+      if (departure.eviction && isLarge) marked.push_back(&departure);
+    }
+    if (marked.size() < kManyFiles) {
+      for (Departure* departure : marked) departure->error = departure->eviction->sync();
+    } else {
+      const FileDescriptor tree(
+          open(core_.items->layout().tree().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+      const int number = tree && syncfs(tree.get()) == 0 ? 0 : errno;
+      for (Departure* departure : marked) {
+        if (number != 0) departure->error = NSError::errorWithErrno(number);
+      }
+    }
+    for (Departure& departure : departures_) {
+      if (departure.error) departure.eviction.reset();
+    }
+  }
+
+  void store() {
+    const NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+      for (const Departure& departure : departures_) {
+        const Job& job = departure.subject.job;
+        removeJob(transaction.connection(), job);
+        if (departure.error || !departure.isFault) continue;
+        storeLocalState(transaction, job.item, departure.before, departure.after, false);
+      }
+      return NSErrorRef();
+    });
+    if (error) log_error(defaultLog(), "[ERROR] evictions cannot be noted: %@", error);
+    (void)evictStored.hit();
+  }
+
+  void answer(const Departure& departure) {
+    if (!departure.error) core_.finished.fetch_add(1);
+    for (auto& completion : core_.evictions.take(departure.subject.job.item)) {
+      if (completion) completion(departure.error);
+    }
+  }
+
+  ContentCore& core_;
+  std::vector<Departure> departures_;
+};
+
+}  // namespace
+
+void doEvictions(ContentCore& core, const std::vector<Job>& jobs) {
+  std::vector<JobSubject> subjects;
+  if (NSErrorRef error = core.readSubjects(jobs, subjects)) {
+    log_error(defaultLog(), "[ERROR] what is to be evicted cannot be read: %@", error);
+    return;
+  }
+  EvictionBatch(core).run(std::move(subjects));
+}
+
+}  // namespace yomber

@@ -1,0 +1,290 @@
+#include "zarn/content/fault_file.h"
+
+#include <fcntl.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <string_view>
+
+#include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
+#include "platform/ostrell/constants.h"
+#include "platform/rozzel/hashed_copy.h"
+
+namespace yomber {
+namespace {
+
+FaultPoint evictLeased("zarn.evict.leased");
+FaultPoint evictMarked("zarn.evict.marked");
+FaultPoint evictSynced("zarn.evict.synced");
+FaultPoint evictPunched("zarn.evict.punched");
+FaultPoint fillBegun("zarn.fill.begun");
+FaultPoint fillCopying("zarn.fill.copying");
+FaultPoint fillVerified("zarn.fill.verified");
+FaultPoint fillDated("zarn.fill.dated");
+FaultPoint fillFilled("zarn.fill.filled");
+FaultPoint settleUnmarked("zarn.settle.unmarked");
+
+NSErrorRef refusal(const std::string& reason) {
+  return NSError::errorWithDomain(QSOstrellErrorDomain, QSOstrellErrorCannotEvict,
+                                  {{NSLocalizedDescriptionKey, reason}});
+}
+
+NSErrorRef cancellation() {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
+}
+
+FileStamp stampOf(int file) {
+  struct stat status{};
+  return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
+}
+
+std::string readHead(int file) {
+  std::string head(kKeptBytes, '\0');
+  const ssize_t length = pread(file, head.data(), head.size(), 0);
+  head.resize(length > 0 ? static_cast<std::size_t>(length) : 0);
+  return head;
+}
+
+/// Whether a small file's content, all of which is kept, is that of the record.
+bool hasContentOf(int file, const FaultRecord& record) {
+  RZAsset found;
+  return !rz_hashFile(file, {}, found) && found == record.content;
+}
+
+}  // namespace
+
+// Giving up.
+
+std::unique_ptr<Eviction> Eviction::begin(const std::string& path, const FileStamp& expected,
+                                          const FaultRecord& record, NSErrorRef* error) {
+  ChangedFile file = ChangedFile::open(path, error);
+  if (!file.isValid()) return nullptr;
+  std::unique_ptr<Eviction> result(new Eviction(std::move(file)));
+  if (!result->lease_.isHeld()) {
+    storeError(error, refusal("it is open somewhere"));
+    return nullptr;
+  }
+  const ChangedFile& opened = result->file_;
+  result->wasFault_ = isUnfilledFault(opened.get());
+  if (!result->wasFault_ && FileStamp::of(opened.status()) != expected) {
+    storeError(error, refusal("it has changed since it was confirmed in the store"));
+    return nullptr;
+  }
+  if (evictLeased.hit()) {
+    storeError(error, opened.failure(EIO));
+    return nullptr;
+  }
+  if (NSErrorRef failure = result->mark(record)) {
+    storeError(error, std::move(failure));
+    return nullptr;
+  }
+  return result;
+}
+
+NSErrorRef Eviction::mark(FaultRecord record) {
+  if (file_.status().st_size > static_cast<off_t>(kKeptBytes)) {
+    if (NSErrorRef error = file_.holdDate()) return error;
+    record.head = headChecksum(readHead(file_.get()));
+  }
+  // First of all, so that an old fill of this boot does not count.
+  if (NSErrorRef error = file_.removeAttribute(kFilledAttribute)) return error;
+  isMarked_ = true;
+  if (!wasFault_) {
+    if (NSErrorRef error = file_.setAttribute(kFaultAttribute, record.encoded())) return error;
+  }
+  marked_ = stampOf(file_.get());
+  return evictMarked.hit() ? file_.failure(ENOSPC) : nullptr;
+}
+
+NSErrorRef Eviction::sync() const { return file_.sync(); }
+
+NSErrorRef Eviction::finish(FileStamp& after) {
+  if (evictSynced.hit()) return file_.failure(EIO);
+  // Who waits for the lease gets the file with its content; the mark goes when we do.
+  if (!lease_.isHeld()) return refusal("it was opened meanwhile");
+  if (stampOf(file_.get()) != marked_) return refusal("it has changed meanwhile");
+  isMarked_ = false;
+  if (NSErrorRef error = file_.punch()) return error;
+  (void)evictPunched.hit();
+  if (file_.status().st_size > static_cast<off_t>(kKeptBytes)) {
+    if (NSErrorRef error = file_.putDatesBack()) return error;
+  }
+  after = stampOf(file_.get());
+  return nullptr;
+}
+
+Eviction::~Eviction() {
+  if (!isMarked_ || wasFault_) return;
+  (void)file_.removeAttribute(kFaultAttribute);
+  (void)file_.removeAttribute(kHeldDateAttribute);
+}
+
+// Looking.
+
+namespace {
+
+/// `record` is of a larger file than what is kept.
+FaultCondition conditionOfLarge(int file, const FaultExamination& found) {
+  const FileStamp& stamp = found.stamp;
+  const bool hasHole = hasHoleFrom(file, kKeptBytes, stamp.size);
+  if (stamp.size == found.record.content.size) {
+    if (heldDate(file) || stamp.mtime == found.record.mtime) return FaultCondition::Pristine;
+    const bool isWritten =
+        hasDataFrom(file, kKeptBytes) || headChecksum(readHead(file)) != found.record.head;
+    if (!isWritten) return FaultCondition::Pristine;
+  }
+  return hasHole ? FaultCondition::PartlyWritten : FaultCondition::Rewritten;
+}
+
+FaultCondition conditionOfSmall(int file, const FaultExamination& found) {
+  const bool isSame = found.stamp.size == found.record.content.size;
+  if (isSame && found.stamp.mtime == found.record.mtime) return FaultCondition::Pristine;
+  return isSame && hasContentOf(file, found.record) ? FaultCondition::Pristine
+                                                    : FaultCondition::Rewritten;
+}
+
+}  // namespace
+
+FaultExamination examineFault(int file) {
+  FaultExamination result;
+  result.stamp = stampOf(file);
+  if (!isUnfilledFault(file)) return result;
+  bool isDamaged = false;
+  const auto record = readFaultRecord(file, isDamaged);
+  if (!record) {
+    result.condition = isDamaged ? FaultCondition::Damaged : FaultCondition::NoFault;
+    return result;
+  }
+  result.record = *record;
+  result.condition = record->content.size > kKeptBytes ? conditionOfLarge(file, result)
+                                                       : conditionOfSmall(file, result);
+  return result;
+}
+
+NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode, FileStamp& after) {
+  // Not opened for reading or writing: that would keep others from leasing it.
+  const FileDescriptor file(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  struct stat status{};
+  if (!file || fstat(file.get(), &status) != 0) return NSError::errorWithErrno(errno, path);
+  if (status.st_ino != inode) return NSError::errorWithErrno(ESTALE, path);
+  const std::string self = "/proc/self/fd/" + std::to_string(file.get());
+  // The fault first: without it the others mean nothing.
+  for (const char* name : {kFaultAttribute, kFilledAttribute, kHeldDateAttribute}) {
+    if (removexattr(self.c_str(), name) != 0 && errno != ENODATA) {
+      return NSError::errorWithErrno(errno, path);
+    }
+    if (settleUnmarked.hit()) return NSError::errorWithErrno(EIO, path);
+  }
+  after = stampOf(file.get());
+  return nullptr;
+}
+
+// Filling.
+
+namespace {
+
+/// What is around one filling.
+class Filling {
+ public:
+  Filling(ChangedFile file, FaultRecord record)
+      : file_(std::move(file)), record_(std::move(record)), lease_(file_.get()) {}
+
+  NSErrorRef run(const FaultContent& content, const std::function<bool(std::uint64_t)>& goesOn) {
+    NSErrorRef error = file_.holdDate();
+    // What an earlier filling may have left would show where the content has holes.
+    if (!error) error = file_.punch();
+    if (!error && fillBegun.hit()) error = file_.failure(ENOSPC);
+    if (!error) error = copy(content, goesOn);
+    if (!error) error = verify();
+    if (!error && fillVerified.hit()) error = file_.failure(EIO);
+    if (!error) error = markFilled();
+    if (error && !isWritten_) {
+      (void)file_.punch();
+      (void)file_.putDatesBack();
+    }
+    return error;
+  }
+
+ private:
+  NSErrorRef copy(const FaultContent& content, const std::function<bool(std::uint64_t)>& goesOn) {
+    isAlone_ = lease_.isHeld();
+    const auto watch = [&](std::uint64_t done) {
+      if (fillCopying.hit()) return false;
+      if (isAlone_ && !lease_.isHeld()) {
+        isAlone_ = false;
+        lease_.release();
+      }
+      // Blocks where we have not been: somebody else's.
+      if (!isAlone_ && done < record_.content.size && done > kKeptBytes) {
+        isWritten_ = hasDataFrom(file_.get(), done);
+      }
+      return !isWritten_ && (!goesOn || goesOn(done));
+    };
+    return content(record_, file_.get(), watch);
+  }
+
+  /// The content itself is verified as it is written; what others wrote is not.
+  NSErrorRef verify() {
+    if (isAlone_ && !lease_.isHeld()) isAlone_ = false;
+    const bool isWhole = stampOf(file_.get()).size == record_.content.size &&
+                         (isAlone_ || hasContentOf(file_.get(), record_));
+    if (isWhole) return nullptr;
+    isWritten_ = true;
+    return file_.failure(EAGAIN);
+  }
+
+  NSErrorRef markFilled() {
+    if (NSErrorRef error = file_.putDatesBack()) return error;
+    if (fillDated.hit()) return file_.failure(EIO);
+    if (NSErrorRef error = file_.setAttribute(kFilledAttribute, bootIdentifier())) return error;
+    (void)fillFilled.hit();
+    return nullptr;
+  }
+
+  ChangedFile file_;
+  const FaultRecord record_;
+  FileLease lease_;
+  bool isAlone_ = false;
+  bool isWritten_ = false;  ///< by somebody else: nothing of it may be taken back
+};
+
+}  // namespace
+
+NSErrorRef fillFault(const std::string& path, const FaultContent& content,
+                     const std::function<bool(std::uint64_t)>& goesOn, FileStamp& after) {
+  NSErrorRef error;
+  ChangedFile file = ChangedFile::open(path, &error);
+  if (!file.isValid()) return error;
+  const int descriptor = file.get();
+  const FaultExamination found = examineFault(descriptor);
+  after = found.stamp;
+  if (found.condition == FaultCondition::NoFault) return nullptr;
+  if (found.condition != FaultCondition::Pristine) return file.failure(EAGAIN);
+  if (goesOn && !goesOn(0)) return cancellation();
+  if (found.stamp.size <= kKeptBytes && hasContentOf(descriptor, found.record)) {
+    if (fillVerified.hit()) return file.failure(EIO);
+    error = file.setAttribute(kFilledAttribute, bootIdentifier());
+    (void)fillFilled.hit();
+    if (!error) after = stampOf(descriptor);
+    return error;
+  }
+  const FileDescriptor same(fcntl(descriptor, F_DUPFD_CLOEXEC, 0));
+  error = Filling(std::move(file), found.record).run(content, goesOn);
+  after = stampOf(same.get());
+  return error;
+}
+
+std::optional<RZAsset> hashUnchanged(int file, const FileStamp& stamp, NSErrorRef* error) {
+  RZAsset result;
+  NSErrorRef failure = stampOf(file) == stamp ? nullptr : NSError::errorWithErrno(EAGAIN);
+  if (!failure) failure = rz_hashFile(file, {}, result);
+  if (!failure && stampOf(file) != stamp) failure = NSError::errorWithErrno(EAGAIN);
+  if (!failure) return result;
+  storeError(error, std::move(failure));
+  return std::nullopt;
+}
+
+}  // namespace yomber

@@ -1,0 +1,61 @@
+#pragma once
+
+#include <sys/stat.h>
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/rozzel/asset.h"
+
+namespace yomber {
+
+/// How much of a fault's content stays in its file: one block, which it costs anyway.
+inline constexpr std::uint64_t kKeptBytes = 4096;
+
+/// While a file is filled in or given up: its modification date, decimal ns, which it gets back
+/// when that has ended.
+inline constexpr const char* kHeldDateAttribute = "user.yomber.mtime";
+
+/// Which file, and as which it was when it was looked at.
+struct FileStamp {
+  std::uint64_t inode = 0;
+  std::uint64_t size = 0;
+  std::int64_t mtime = 0;  ///< ns since the epoch
+  std::int64_t ctime = 0;  ///< ns
+
+  static FileStamp of(const struct stat& status);
+  /// Apart from the ctime, which changes with names and attributes too.
+  [[nodiscard]] bool hasSameContent(const FileStamp& other) const {
+    return inode == other.inode && size == other.size && mtime == other.mtime;
+  }
+  friend bool operator==(const FileStamp&, const FileStamp&) = default;
+};
+
+/// What a fault's attribute says: all that is needed to know the item again, and to bring its
+/// content back, should the database be lost.
+struct FaultRecord {
+  std::uint64_t item = 0;
+  RZAsset content;
+  std::int64_t mtime = 0;  ///< of the file when its content was given up
+  std::uint64_t head = 0;  ///< tells whether the kept bytes are still those of then
+  std::string tag;         ///< of the store's record
+  std::string account;     ///< whose record that is
+
+  [[nodiscard]] std::string encoded() const;
+  /// Nothing when the text makes no sense, or is of a later version.
+  static std::optional<FaultRecord> decode(std::string_view text);
+  friend bool operator==(const FaultRecord&, const FaultRecord&) = default;
+};
+
+/// Tells kept bytes apart.
+[[nodiscard]] std::uint64_t headChecksum(std::string_view bytes);
+
+/// The record of the file open as `file`. Nothing when it is no fault; with `isDamaged` set when it
+/// is one that cannot be understood.
+[[nodiscard]] std::optional<FaultRecord> readFaultRecord(int file, bool& isDamaged);
+/// Whether the open file is a fault whose content cannot be read; as isFaultAtPath.
+[[nodiscard]] bool isUnfilledFault(int file);
+
+}  // namespace yomber

@@ -1,0 +1,222 @@
+#include "zarn/content/job_queue.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/foundation/log.h"
+
+namespace yomber {
+namespace {
+
+/// More than all workers together can hold, so that a page is never all taken.
+constexpr std::size_t kWindow = 2048;
+
+}  // namespace
+
+JobQueue::JobQueue(std::shared_ptr<Database> database, Options options)
+    : database_(std::move(database)), options_(std::move(options)) {}
+
+void JobQueue::setAccount(std::int64_t account) {
+  LockGuard guard(mutex_);
+  account_ = account;
+  for (Lane& lane : lanes_) {
+    lane.window.clear();
+    lane.mayHaveMore = true;
+    ++lane.notes;
+  }
+  changed_.notifyAll();
+}
+
+std::int64_t JobQueue::account() const {
+  LockGuard guard(mutex_);
+  return account_;
+}
+
+void JobQueue::setStoreOpen(bool isOpen) {
+  LockGuard guard(mutex_);
+  isStoreOpen_ = isOpen;
+  changed_.notifyAll();
+}
+
+void JobQueue::noteJobs(JobKind kind) {
+  LockGuard guard(mutex_);
+  lane(kind).mayHaveMore = true;
+  ++lane(kind).notes;
+  changed_.notifyAll();
+}
+
+void JobQueue::pushUrgent(std::uint64_t item) {
+  LockGuard guard(mutex_);
+  if (std::find(urgent_.begin(), urgent_.end(), item) == urgent_.end()) urgent_.push_back(item);
+  changed_.notifyAll();
+}
+
+bool JobQueue::isOpen(JobKind kind) const {
+  return isStoreOpen_ || (kind != JobKind::Upload && kind != JobKind::Download);
+}
+
+void JobQueue::claim(const Job& job, std::vector<Job>& taken) {
+  running_.emplace(job.item, Running{job, NSProgress::progressWithTotalUnitCount(0)});
+  taken.push_back(job);
+}
+
+std::vector<Job> JobQueue::pick(JobKind kind, std::size_t limit) {
+  std::vector<Job> taken;
+  if (kind == JobKind::Download) {
+    for (auto item = urgent_.begin(); item != urgent_.end() && taken.size() < limit;) {
+      if (running_.contains(*item)) {
+        ++item;
+        continue;
+      }
+      Job job;
+      job.item = *item;
+      job.kind = JobKind::Download;
+      job.account = account_;
+      claim(job, taken);
+      item = urgent_.erase(item);
+    }
+    if (!taken.empty()) return taken;
+  }
+  if (!isOpen(kind)) return taken;
+  auto& window = lane(kind).window;
+  for (auto job = window.begin(); job != window.end() && taken.size() < limit;) {
+    // Who is being worked on comes again with the next page.
+    if (!running_.contains(job->item)) {
+      claim(*job, taken);
+    } else {
+      lane(kind).mayHaveMore = true;
+      lane(kind).blockedAt = releases_;
+    }
+    job = window.erase(job);
+  }
+  return taken;
+}
+
+void JobQueue::refill(JobKind kind) {
+  std::int64_t account = 0;
+  std::uint64_t notes = 0;
+  {
+    LockGuard guard(mutex_);
+    lane(kind).isReading = true;
+    account = account_;
+    notes = lane(kind).notes;
+  }
+  std::vector<Job> page;
+  std::optional<std::int64_t> next;
+  const std::int64_t now = options_.clock();
+  const NSErrorRef error = database_->read([&](Connection& connection) {
+    page = dueJobs(connection, account, kind, now, kWindow);
+    next = nextDue(connection, account, kind, now);
+  });
+  if (error) log_error(defaultLog(), "[ERROR] jobs cannot be read: %@", error);
+  LockGuard guard(mutex_);
+  Lane& its = lane(kind);
+  its.isReading = false;
+  its.nextDue = next;
+  if (account == account_) {
+    const bool isAll = page.size() < kWindow && notes == its.notes;
+    its.mayHaveMore = !isAll;
+    for (Job& job : page) {
+      if (running_.contains(job.item)) {
+        its.mayHaveMore = true;
+        its.blockedAt = releases_;
+      } else {
+        its.window.push_back(std::move(job));
+      }
+    }
+    if (!its.window.empty() || notes != its.notes) its.blockedAt = ~0ULL;
+  }
+  changed_.notifyAll();
+}
+
+bool JobQueue::hasWork(JobKind kind) const {
+  const Lane& its = lanes_[static_cast<std::size_t>(kind)];
+  const bool isUrgent = kind == JobKind::Download && !urgent_.empty();
+  return isUrgent || (isOpen(kind) && (its.mayHaveMore || !its.window.empty() || its.isReading));
+}
+
+void JobQueue::waitForWork(JobKind kind) {
+  auto wait = options_.tick;
+  if (const auto due = lane(kind).nextDue) {
+    const std::chrono::nanoseconds left(*due - options_.clock());
+    const auto rounded =
+        std::chrono::duration_cast<std::chrono::milliseconds>(left) + std::chrono::milliseconds(1);
+    wait = std::clamp(rounded, std::chrono::milliseconds(0), wait);
+  }
+  (void)changed_.waitUntil(mutex_, std::chrono::steady_clock::now() + wait);
+  if (const auto due = lane(kind).nextDue; due && *due <= options_.clock()) {
+    lane(kind).nextDue.reset();
+    lane(kind).mayHaveMore = true;
+    lane(kind).blockedAt = ~0ULL;
+  }
+}
+
+std::vector<Job> JobQueue::take(JobKind kind, std::size_t limit) {
+  for (;;) {
+    {
+      LockGuard guard(mutex_);
+      if (isEnding_) return {};
+      auto taken = pick(kind, limit);
+      if (!taken.empty()) return taken;
+      const Lane& its = lane(kind);
+      const bool isWorthReading = isOpen(kind) && its.mayHaveMore && !its.isReading &&
+                                  its.window.empty() && its.blockedAt != releases_;
+      if (!isWorthReading) {
+        waitForWork(kind);
+        continue;
+      }
+    }
+    refill(kind);
+  }
+}
+
+void JobQueue::release(const std::vector<Job>& jobs) {
+  LockGuard guard(mutex_);
+  for (const Job& job : jobs) running_.erase(job.item);
+  ++releases_;
+  changed_.notifyAll();
+}
+
+std::optional<JobQueue::Running> JobQueue::running(std::uint64_t item) const {
+  LockGuard guard(mutex_);
+  const auto found = running_.find(item);
+  if (found == running_.end()) return std::nullopt;
+  return found->second;
+}
+
+std::vector<JobQueue::Running> JobQueue::allRunning() const {
+  LockGuard guard(mutex_);
+  std::vector<Running> result;
+  result.reserve(running_.size());
+  for (const auto& [item, running] : running_) result.push_back(running);
+  return result;
+}
+
+void JobQueue::end() {
+  LockGuard guard(mutex_);
+  isEnding_ = true;
+  changed_.notifyAll();
+}
+
+bool JobQueue::isEnding() const {
+  LockGuard guard(mutex_);
+  return isEnding_;
+}
+
+bool JobQueue::waitUntilIdle(std::chrono::steady_clock::time_point deadline) {
+  constexpr std::chrono::milliseconds kLook{5};
+  LockGuard guard(mutex_);
+  const auto isIdle = [&]() REQUIRES(mutex_) {
+    if (!running_.empty() || !urgent_.empty()) return false;
+    // Marks that wait to be taken off are nothing to wait for.
+    return !hasWork(JobKind::Upload) && !hasWork(JobKind::Download) && !hasWork(JobKind::Evict);
+  };
+  while (!isIdle()) {
+    const auto now = std::chrono::steady_clock::now();
+    if (now >= deadline) return false;
+    (void)changed_.waitUntil(mutex_, std::min(deadline, now + kLook));
+  }
+  return true;
+}
+
+}  // namespace yomber

@@ -1,0 +1,279 @@
+// Uploads: reading documents, making the store's records what they are, and confirming that.
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <memory>
+
+#include "platform/foundation/fault_points.h"
+#include "platform/foundation/log.h"
+#include "zarn/content/content_core.h"
+#include "zarn/row_queries.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+FaultPoint uploadRead("zarn.upload.read");
+FaultPoint uploadStaged("zarn.upload.staged");
+FaultPoint uploadSynced("zarn.upload.synced");
+FaultPoint uploadCommitted("zarn.upload.committed");
+FaultPoint uploadConfirmed("zarn.upload.confirmed");
+
+/// So much is read before it is synced and committed together.
+constexpr std::uint64_t kGroupBytes = 64 << 20;
+constexpr int kReadings = 3;
+
+/// One document on its way.
+struct Upload {
+  JobSubject subject;
+  enum class Kind { Save, Remove, Nothing, Failed } kind = Kind::Failed;
+  ContentRow confirmed;  ///< what will be so when the store has it
+  std::string previousZone;
+  NSErrorRef error;
+};
+
+class UploadGroup {
+ public:
+  UploadGroup(ContentCore& core, std::shared_ptr<ContentStore> store)
+      : core_(core), store_(std::move(store)) {}
+
+  void add(JobSubject subject) {
+    Upload& upload = uploads_.emplace_back();
+    upload.subject = std::move(subject);
+    prepare(upload);
+    if (bytes_ >= kGroupBytes) finish();
+  }
+
+  void finish() {
+    NSErrorRef error = commitAssets();
+    if (!error) error = saveRecords();
+    confirm(error);
+    uploads_.clear();
+    group_.reset();
+    bytes_ = 0;
+  }
+
+ private:
+  void prepare(Upload& upload) {
+    JobSubject& subject = upload.subject;
+    upload.confirmed.id = subject.job.item;
+    upload.confirmed.account = core_.queue->account();
+    if (subject.content) upload.confirmed = *subject.content;
+    if (!subject.row) {
+      upload.kind = subject.content && subject.content->content ? Upload::Kind::Remove
+                                                                : Upload::Kind::Nothing;
+      return;
+    }
+    if (subject.row->kind != ItemKind::Document || subject.path.empty()) {
+      upload.kind = Upload::Kind::Nothing;
+      return;
+    }
+    upload.error = read(upload);
+    upload.kind = upload.error ? Upload::Kind::Failed : Upload::Kind::Save;
+    if (!upload.error && isInStore(upload)) upload.kind = Upload::Kind::Nothing;
+  }
+
+  /// Whether the store's record needs no change.
+  static bool isInStore(Upload& upload) {
+    const auto& before = upload.subject.content;
+    ContentRow& after = upload.confirmed;
+    if (before && before->zone != upload.subject.zone) upload.previousZone = before->zone;
+    after.zone = upload.subject.zone;
+    after.parent = upload.subject.row->parent;
+    after.name = upload.subject.row->name;
+    return before && before->content == after.content && !before->tag.empty() &&
+           before->zone == after.zone && before->parent == after.parent &&
+           before->name == after.name && before->stamp.mtime == after.stamp.mtime;
+  }
+
+  NSErrorRef read(Upload& upload) {
+    const std::string& path = upload.subject.path;
+    const FileDescriptor file(
+        open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+    if (!file) return look(path, errno);
+    if (uploadRead.hit()) return NSError::errorWithErrno(EIO, path);
+    const FaultExamination found = examineFault(file.get());
+    switch (found.condition) {
+      case FaultCondition::NoFault:
+        return readContent(upload, file.get());
+      case FaultCondition::Pristine:
+        return readFault(upload, found);
+      default:
+        break;
+    }
+    if (NSErrorRef error = core_.settleWritten(path, found)) return error;
+    return NSError::errorWithErrno(EAGAIN, path);  // as what it is now, the next time
+  }
+
+  /// The row is behind the disk.
+  NSErrorRef look(const std::string& path, int number) {
+    NSErrorRef error;
+    (void)core_.scanner->scanLocation(path, &error);
+    return NSError::errorWithErrno(number, path);
+  }
+
+  static NSErrorRef readFault(Upload& upload, const FaultExamination& found) {
+    upload.confirmed.content = found.record.content;
+    upload.confirmed.stamp = found.stamp;
+    return nullptr;
+  }
+
+  NSErrorRef readContent(Upload& upload, int file) {
+    struct stat status{};
+    if (fstat(file, &status) != 0) return NSError::errorWithErrno(errno, upload.subject.path);
+    if (!S_ISREG(status.st_mode)) return look(upload.subject.path, ESTALE);
+    FileStamp stamp = FileStamp::of(status);
+    ContentRow& confirmed = upload.confirmed;
+    if (confirmed.content && confirmed.stamp == stamp) return nullptr;
+    if (confirmed.content && confirmed.stamp.hasSameContent(stamp)) {
+      NSErrorRef error;
+      const auto hashed = hashUnchanged(file, stamp, &error);
+      if (!hashed) return error;
+      confirmed.stamp.ctime = stamp.ctime;
+      if (*hashed == *confirmed.content) return nullptr;
+    }
+    return take(upload, file, stamp);
+  }
+
+  NSErrorRef take(Upload& upload, int file, FileStamp stamp) {
+    NSErrorRef error;
+    if (!group_) group_ = store_->newGroup(&error);
+    if (!group_) return error;
+    const auto running = core_.queue->running(upload.subject.job.item);
+    if (running) running->progress->setTotalUnitCount(static_cast<std::int64_t>(stamp.size));
+    const auto goesOn = [&](std::uint64_t done) {
+      if (running) running->progress->setCompletedUnitCount(static_cast<std::int64_t>(done));
+      return !core_.queue->isEnding();
+    };
+    for (int reading = 0; reading < kReadings; ++reading) {
+      RZAsset content;
+      if ((error = store_->take(*group_, file, goesOn, content))) return error;
+      bytes_ += content.size;
+      struct stat status{};
+      if (fstat(file, &status) != 0) return NSError::errorWithErrno(errno, upload.subject.path);
+      const FileStamp after = FileStamp::of(status);
+      if (after == stamp && content.size == stamp.size) {
+        upload.confirmed.content = content;
+        upload.confirmed.stamp = stamp;
+        return uploadStaged.hit() ? NSError::errorWithErrno(EIO) : nullptr;
+      }
+      stamp = after;
+    }
+    return NSError::errorWithErrno(EAGAIN, upload.subject.path);  // somebody is writing to it
+  }
+
+  NSErrorRef commitAssets() {
+    if (!group_) return nullptr;
+    NSErrorRef error = store_->commit(*group_);
+    if (!error && uploadSynced.hit()) error = NSError::errorWithErrno(EIO);
+    return error;
+  }
+
+  NSErrorRef saveRecords() {
+    std::vector<StoredDocument> documents;
+    std::vector<RemovedDocument> removed;
+    std::vector<Upload*> saving;
+    for (Upload& upload : uploads_) {
+      if (upload.kind == Upload::Kind::Remove) {
+        removed.push_back({upload.subject.job.item, upload.confirmed.zone});
+      } else if (upload.kind == Upload::Kind::Save) {
+        saving.push_back(&upload);
+        documents.push_back({.item = upload.confirmed.id,
+                             .zone = upload.confirmed.zone,
+                             .previousZone = upload.previousZone,
+                             .parent = upload.confirmed.parent,
+                             .name = upload.confirmed.name,
+                             .mtime = upload.confirmed.stamp.mtime,
+                             .btime = upload.subject.row->btime,
+                             .content = *upload.confirmed.content});
+      }
+    }
+    std::vector<ContentStore::Saved> saved;
+    if (NSErrorRef error = store_->save(documents, removed, saved)) return error;
+    for (std::size_t i = 0; i < saving.size(); ++i) {
+      saving[i]->confirmed.tag = saved[i].tag;
+      saving[i]->error = saved[i].error;
+      if (saved[i].error) saving[i]->kind = Upload::Kind::Failed;
+    }
+    return uploadCommitted.hit() ? NSError::errorWithErrno(EIO) : nullptr;
+  }
+
+  /// `failure` is of all that was to go to the store.
+  void confirm(const NSErrorRef& failure) {
+    const bool isAway = isOutOfReach(failure);
+    const NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+      for (Upload& upload : uploads_) {
+        const bool isConcerned =
+            upload.kind == Upload::Kind::Save || upload.kind == Upload::Kind::Remove;
+        if (failure && isConcerned) upload.error = failure;
+        store(transaction, upload);
+      }
+      return NSErrorRef();
+    });
+    if (error) log_error(defaultLog(), "[ERROR] uploads cannot be confirmed: %@", error);
+    if (isAway) core_.noteOutOfReach();
+    (void)uploadConfirmed.hit();
+  }
+
+  void store(WriteTransaction& transaction, const Upload& upload) {
+    Connection& connection = transaction.connection();
+    const Job& job = upload.subject.job;
+    if (isOutOfReach(upload.error)) return core_.noteOutOfReach();
+    if (upload.error) {
+      if (upload.error->is(NSCocoaErrorDomain, NSUserCancelledError)) return;  // we are ending
+      return core_.postpone(connection, job, upload.error);
+    }
+    core_.finished.fetch_add(1);
+    removeJob(connection, job);
+    if (!upload.subject.row) return removeContent(connection, job.item);
+    if (upload.subject.row->kind != ItemKind::Document || !upload.confirmed.content) return;
+    storeConfirmed(transaction, upload.confirmed);
+  }
+
+  void storeConfirmed(WriteTransaction& transaction, ContentRow confirmed) {
+    Connection& connection = transaction.connection();
+    if (const auto now = findContent(connection, confirmed.id)) confirmed.isPinned = now->isPinned;
+    storeContent(connection, confirmed);
+    const auto row = findByID(connection, confirmed.id);
+    if (!row) {  // removed meanwhile
+      const std::int64_t now = core_.now();
+      addJob(connection, confirmed.id, JobKind::Upload, confirmed.account, now, now);
+      return;
+    }
+    ItemRow after = *row;
+    if (isConfirmed(after, confirmed)) after.flags |= row_flag::kUploaded;
+    if (after.flags != row->flags) {
+      (void)transaction.update(*row, after);
+    } else if (!isConfirmed(after, confirmed) && after.inode == confirmed.stamp.inode) {
+      // The row is behind the disk, or was changed meanwhile: to be seen to again.
+      transaction.updateQuietly(after);
+    }
+  }
+
+  ContentCore& core_;
+  const std::shared_ptr<ContentStore> store_;
+  std::unique_ptr<RZAssetGroup> group_;
+  std::vector<Upload> uploads_;
+  std::uint64_t bytes_ = 0;
+};
+
+}  // namespace
+
+void doUploads(ContentCore& core, const std::vector<Job>& jobs) {
+  const auto store = core.store();
+  if (!store) return;  // signed out meanwhile
+  std::vector<JobSubject> subjects;
+  if (const NSErrorRef error = core.readSubjects(jobs, subjects)) {
+    log_error(defaultLog(), "[ERROR] what is to be uploaded cannot be read: %@", error);
+    return;
+  }
+  UploadGroup group(core, store);
+  for (JobSubject& subject : subjects) {
+    if (core.queue->isEnding() || core.isOffline()) break;
+    group.add(std::move(subject));
+  }
+  group.finish();
+}
+
+}  // namespace yomber

@@ -7,8 +7,9 @@ NSErrorRef RZEngine::importAsset(int descriptor, const RZTransfer& transfer, RZA
   const auto group = newAssetGroup(&error);
   if (!group) return error;
   RZAsset imported;
-  if ((error = group->importAsset(descriptor, transfer, imported))) return error;
-  if ((error = group->commit())) return error;
+  error = group->importAsset(descriptor, transfer, imported);
+  if (!error) error = group->commit();
+  if (error) return error;
   asset = imported;
   return nullptr;
 }
@@ -19,10 +20,11 @@ NSErrorRef RZEngine::storeAsset(std::span<const std::byte> bytes, RZAsset& asset
   if (!group) return error;
   const auto writer = group->newWriter(&error);
   if (!writer) return error;
-  if ((error = writer->write(bytes))) return error;
   RZAsset written;
-  if ((error = writer->finish(written))) return error;
-  if ((error = group->commit())) return error;
+  error = writer->write(bytes);
+  if (!error) error = writer->finish(written);
+  if (!error) error = group->commit();
+  if (error) return error;
   asset = written;
   return nullptr;
 }

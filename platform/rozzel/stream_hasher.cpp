@@ -1,5 +1,7 @@
 #include "platform/rozzel/stream_hasher.h"
 
+#include <pthread.h>
+
 #include <array>
 #include <thread>
 
@@ -71,6 +73,7 @@ class StreamHasher::Worker {
   }
 
   void hashSubmitted() {
+    pthread_setname_np(pthread_self(), "asset hash");
     while (true) {
       std::uint64_t next = 0;
       {

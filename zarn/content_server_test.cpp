@@ -86,6 +86,7 @@ class CommandedEngine final : public ContentEngine {
     result.finished = 12;
     return result;
   }
+  void sweep() override {}
   void retryNow() override {}
   bool waitUntilIdle(std::chrono::milliseconds) override { return true; }
 

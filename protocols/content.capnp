@@ -34,7 +34,8 @@ interface Content {
   # Pinned content is brought here and never evicted. A pinned folder pins what is below it, also later.
 
   capabilityToMove @3 (source :Data, destination :Data) -> (capability :UInt32, failure :Common.OptionalError);
-  # Bits as QSMoveCapability of the client library lists them; 0 where the move is refused.
+  # Bits as QSMoveCapability of the client library lists them; none of those that allow where the move
+  # is refused, and mostly a failure that says why.
   # The destination is the location after the move; it need not exist.
 
   trash @4 (path :Data) -> (result :LocationResult);

@@ -51,10 +51,9 @@ class DefaultApplicationContainerTest : public OperationsTest {
       "[DEBUG] ┏# lookup for default location of org.example.Notes";
 };
 
-// ---- Without an application
-// ---------------------------------------------------------------------- Each in a process of its
-// own, since the root's location is kept for the life of a process.
+// ---- Without an application ---------------------------------------------------------------------
 
+// Each in a process of its own, since the root's location is kept for the life of a process.
 TEST_F(DefaultApplicationContainerTest, WithoutABundleItIsTheDocumentsFolderWhichIsMade) {
   EXPECT_IN_FRESH_PROCESS({
     daemon.addItem(scriptedFolder(7, "Documents"), inRoot("Documents"));
@@ -88,8 +87,7 @@ TEST_F(DefaultApplicationContainerTest, WhatStopsTheFoldersCreationIsTheAnswer) 
   });
 }
 
-// ---- For an application
-// ----------------------------------------------------------------------------
+// ---- For an application -------------------------------------------------------------------------
 
 TEST_F(DefaultApplicationContainerTest, AnApplicationGetsItsFirstContainer) {
   addContainer("org.example.Second");

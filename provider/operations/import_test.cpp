@@ -112,8 +112,7 @@ TEST_F(ImportTest, NobodyNeedsToBeSignedInAndHandlersMayBeEmpty) {
   EXPECT_EQ(daemon.callCount("account"), 0U);
 }
 
-// ---- Folders
-// ----------------------------------------------------------------------------------------
+// ---- Folders ------------------------------------------------------------------------------------
 
 class DirectoryCreationTest : public ImportTest {
  protected:

@@ -161,8 +161,7 @@ TEST_F(ProvidingTest, ALostDaemonIsAnError) {
   EXPECT_EQ(domainAndCode(only(errors)), "QSOstrellErrorDomain 4");
 }
 
-// ---- The table of what runs
-// ----------------------------------------------------------------------
+// ---- The table of what runs ---------------------------------------------------------------------
 
 TEST_F(ProvidingTest, OnceItHasEndedAStopFindsItNoMore) {
   daemon.hold("startProviding");

@@ -155,8 +155,7 @@ TEST_F(ReparentTest, AnErrorThatAnAllowedMoveCameWithStaysInTheAnswer) {
   EXPECT_EQ(domainAndCode(answer.error), "SomeDomain 5");
 }
 
-// ---- Capabilities
-// ----------------------------------------------------------------------------------
+// ---- Capabilities -------------------------------------------------------------------------------
 
 class AllowedMoveTest : public ReparentTest, public ::testing::WithParamInterface<unsigned> {};
 

@@ -78,8 +78,7 @@ TEST_F(StoppingTest, WithoutALocationThereIsNothingToGiveUp) {
   EXPECT_EQ(daemon.callCount("evict"), 0U);
 }
 
-// ---- Downloads that a move needs
-// ------------------------------------------------------------------
+// ---- Downloads that a move needs ----------------------------------------------------------------
 
 TEST_F(StoppingTest, WhatIsDownloadingForAMoveIsNotStopped) {
   addDocument(5, "moving.txt");
@@ -195,8 +194,7 @@ TEST_F(StoppingTest, AFailedDownloadEndsTheKeepingToo) {
   }));
 }
 
-// ---- Change notices and moves
-// ----------------------------------------------------------------------
+// ---- Change notices and moves -------------------------------------------------------------------
 
 TEST_F(StoppingTest, AChangeIsLoggedByItsURL) {
   extension->itemChangedAtURL(urlInRoot("a b.txt"));

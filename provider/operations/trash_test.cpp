@@ -117,8 +117,7 @@ TEST_F(TrashTest, HandlersMayBeEmpty) {
   EXPECT_TRUE(exists(inTrash("old.txt")));
 }
 
-// ---- Deleting
-// ---------------------------------------------------------------------------------------
+// ---- Deleting -----------------------------------------------------------------------------------
 
 class DeleteTest : public OperationsTest {
  protected:

@@ -24,12 +24,17 @@ struct CommandContext {
 };
 
 // Each adds its commands to the application. The context outlives the application's run.
-void addDriveCommands(CLI::App& app, CommandContext& context);      // up, down, status
-void addAccountCommands(CLI::App& app, CommandContext& context);    // account …
-void addListingCommands(CLI::App& app, CommandContext& context);    // ls, folders
-void addItemCommands(CLI::App& app, CommandContext& context);       // stat, id, url
-void addWatchCommands(CLI::App& app, CommandContext& context);      // watch, working-set
-void addLogCommand(CLI::App& app, CommandContext& context);         // log
+void addDriveCommands(CLI::App& app, CommandContext& context);    // up, down, status
+void addAccountCommands(CLI::App& app, CommandContext& context);  // account …
+void addListingCommands(CLI::App& app, CommandContext& context);  // ls, folders
+void addItemCommands(CLI::App& app, CommandContext& context);     // stat, id, url
+void addChangeCommands(CLI::App& app, CommandContext& context);  // put, mkdir, rename, mv, trash, …
+void addContentCommands(CLI::App& app, CommandContext& context);  // provide, evict, pin, unpin
+void addGetCommand(CLI::App& app, CommandContext& context);       // get
+void addMarkCommands(CLI::App& app, CommandContext& context);     // tag, favorite, used, app-folder
+void addChangesCommand(CLI::App& app, CommandContext& context);   // changes
+void addWatchCommands(CLI::App& app, CommandContext& context);    // watch, working-set
+void addLogCommand(CLI::App& app, CommandContext& context);       // log
 void addCompletionCommand(CLI::App& app, CommandContext& context);  // completion
 
 }  // namespace yomber

@@ -23,6 +23,7 @@ extern "C" {
 #include "yomber/drive_status.h"
 #include "yomber/item_output.h"
 #include "yomber/supervisor.h"
+#include "yomber/transfer_view.h"
 
 namespace yomber {
 
@@ -154,11 +155,32 @@ void runDown(CommandContext& context) {
   }
 }
 
-void runStatus(CommandContext& context) {
+/// At a terminal, transfers are shown for as long as there are any.
+void showTransfers(CommandContext& context, DriveStatus& status) {
+  const bool isBusy =
+      status.transfers && (!status.transfers->underWay.empty() || status.transfers->waiting > 0);
+  if (isBusy) status.transfers.reset();  // drawn below
+  std::cout << statusText(status) << std::flush;
+  if (!isBusy) return;
+  DriveClient client(context.paths());
+  NSErrorRef error;
+  const auto daemon = client.daemon(&error);
+  if (!error) error = followTransfers(daemon);
+  if (error) context.fail(error);
+}
+
+void runStatus(CommandContext& context, bool once) {
   const DrivePaths paths = context.paths();
-  const DriveStatus status = readDriveStatus(paths, Supervisor::runningPid(supervisorLock(paths)));
-  std::cout << (context.json ? statusJson(status).dump() + "\n" : statusText(status)) << std::flush;
+  DriveStatus status = readDriveStatus(paths, Supervisor::runningPid(supervisorLock(paths)));
   if (!status.daemon || !status.host) context.exitCode = ExitCode::Unavailable;
+  if (context.json) {
+    std::cout << statusJson(status).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace)
+              << std::endl;
+  } else if (once || isatty(STDOUT_FILENO) == 0) {
+    std::cout << statusText(status) << std::flush;
+  } else {
+    showTransfers(context, status);
+  }
 }
 
 }  // namespace
@@ -173,7 +195,9 @@ void addDriveCommands(CLI::App& app, CommandContext& context) {
   down->callback([&context] { runDown(context); });
 
   CLI::App* status = app.add_subcommand("status", "Show what the drive is doing");
-  status->callback([&context] { runStatus(context); });
+  auto once = std::make_shared<bool>(false);
+  status->add_flag("--once", *once, "Do not wait for transfers, also at a terminal");
+  status->callback([&context, once] { runStatus(context, *once); });
 }
 
 }  // namespace yomber

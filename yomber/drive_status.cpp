@@ -1,6 +1,8 @@
 #include "yomber/drive_status.h"
 
+#include <array>
 #include <sstream>
+#include <utility>
 
 #include <nlohmann/json.hpp>
 
@@ -8,6 +10,7 @@
 #include "platform/ipc/error_codec.h"
 #include "yomber/drive_client.h"
 #include "yomber/item_output.h"
+#include "yomber/transfer_view.h"
 
 namespace yomber {
 
@@ -100,6 +103,8 @@ DriveStatus readDriveStatus(const DrivePaths& paths, std::optional<pid_t> superv
   if (const auto daemon = client.daemon(nullptr)) {
     status.daemon = askDaemon(daemon);
     status.account = askAccount(daemon);
+    Transfers transfers;
+    if (!DriveContent::transfers(daemon, transfers)) status.transfers = std::move(transfers);
   }
   if (const auto control = client.control(nullptr)) status.host = askHost(control);
   return status;
@@ -119,9 +124,39 @@ std::string statusText(const DriveStatus& status) {
   } else {
     out << "fileproviderd  does not answer\n";
   }
+  if (status.transfers) {
+    for (const Transfer& transfer : status.transfers->underWay) {
+      out << transferLine(transfer, 0) << "\n";
+    }
+    out << "transfers      " << transferSummary(*status.transfers) << "\n";
+  }
   if (!status.supervisor) out << "Start the drive with 'yomber up'.\n";
   return out.str();
 }
+
+namespace {
+
+nlohmann::ordered_json transferJson(const Transfer& transfer) {
+  constexpr std::array<const char*, 3> kinds{"upload", "download", "evict"};
+  nlohmann::ordered_json json{{"kind", kinds.at(static_cast<std::size_t>(transfer.kind))},
+                              {"location", transfer.path},
+                              {"done", transfer.done},
+                              {"total", transfer.total},
+                              {"attempts", transfer.attempts}};
+  if (transfer.failure) json["failure"] = errorJson(transfer.failure);
+  if (transfer.nextAttempt) json["next_attempt"] = transfer.nextAttempt->description();
+  return json;
+}
+
+nlohmann::ordered_json transfersJson(const Transfers& transfers) {
+  auto underWay = nlohmann::ordered_json::array();
+  for (const Transfer& transfer : transfers.underWay) underWay.push_back(transferJson(transfer));
+  return {{"under_way", std::move(underWay)},
+          {"waiting", transfers.waiting},
+          {"finished", transfers.finished}};
+}
+
+}  // namespace
 
 nlohmann::ordered_json statusJson(const DriveStatus& status) {
   nlohmann::ordered_json json{{"home", status.home}, {"up", status.daemon && status.host}};
@@ -150,6 +185,7 @@ nlohmann::ordered_json statusJson(const DriveStatus& status) {
     if (status.host->lastFailure)
       json["extension"]["failure"] = errorJson(status.host->lastFailure);
   }
+  if (status.transfers) json["transfers"] = transfersJson(*status.transfers);
   return json;
 }
 

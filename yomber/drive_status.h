@@ -10,6 +10,7 @@
 
 #include "platform/foundation/drive_paths.h"
 #include "platform/foundation/error.h"
+#include "yomber/drive_content.h"
 
 namespace yomber {
 
@@ -44,6 +45,7 @@ struct DriveStatus {
   std::optional<std::string> account;
   std::optional<Daemon> daemon;
   std::optional<Host> host;
+  std::optional<Transfers> transfers;
 };
 
 [[nodiscard]] DriveStatus readDriveStatus(const DrivePaths& paths, std::optional<pid_t> supervisor);

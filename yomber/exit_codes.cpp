@@ -3,6 +3,7 @@
 #include <cerrno>
 
 #include "platform/fileprovider/constants.h"
+#include "platform/fileprovider/file_operations.h"
 #include "platform/ostrell/constants.h"
 
 namespace yomber {
@@ -14,6 +15,34 @@ bool isConnectionError(const NSError& error) {
   if (error.domain() != NSCocoaErrorDomain) return false;
   return error.code() == NSXPCConnectionInterrupted || error.code() == NSXPCConnectionInvalid ||
          error.code() == NSXPCConnectionReplyInvalid || error.code() == NSXPCConnectionTimedOut;
+}
+
+/// What a file or its content could not be had for; Failure when it is nothing of the kind.
+ExitCode exitCodeForFile(const NSError& error) {
+  if (error.is(NSFileProviderErrorDomain, NSFileProviderErrorFilenameCollision) ||
+      error.is(NSCocoaErrorDomain, NSFileWriteFileExistsError)) {
+    return ExitCode::NameTaken;
+  }
+  if (error.is(NSFileProviderErrorDomain, NSFileProviderErrorInsufficientQuota) ||
+      error.is(NSCocoaErrorDomain, NSUbiquitousFileNotUploadedDueToQuotaError) ||
+      error.is(NSCocoaErrorDomain, NSFileWriteOutOfSpaceError) ||
+      error.is(NSPOSIXErrorDomain, ENOSPC) || error.is(NSPOSIXErrorDomain, EDQUOT)) {
+    return ExitCode::NoRoom;
+  }
+  if (error.is(NSCocoaErrorDomain, NSFileReadCorruptFileError)) return ExitCode::Damaged;
+  if (error.is(NSCocoaErrorDomain, NSUbiquitousFileUnavailableError) ||
+      error.is(QSOstrellErrorDomain, QSOstrellErrorCannotEvict) ||
+      error.is(NSPOSIXErrorDomain, EBUSY)) {
+    return ExitCode::TryAgain;
+  }
+  return ExitCode::Failure;
+}
+
+/// The framework says "unreachable" of the store and of the drive's own processes alike.
+ExitCode exitCodeForUnreachable(const NSError& error) {
+  const NSErrorRef cause = error.underlyingError();
+  const bool isStore = cause && cause->is(NSCocoaErrorDomain, NSUbiquitousFileUnavailableError);
+  return isStore ? ExitCode::TryAgain : ExitCode::Unavailable;
 }
 
 }  // namespace
@@ -31,7 +60,10 @@ ExitCode exitCodeFor(const NSErrorRef& error) {
   }
   if (error->is(QSOstrellErrorDomain, QSOstrellErrorInvalidParameter)) return ExitCode::Usage;
   if (isConnectionError(*error)) return ExitCode::Unavailable;
-  return ExitCode::Failure;
+  if (error->is(NSFileProviderErrorDomain, NSFileProviderErrorServerUnreachable)) {
+    return exitCodeForUnreachable(*error);
+  }
+  return exitCodeForFile(*error);
 }
 
 }  // namespace yomber

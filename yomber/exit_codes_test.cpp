@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include "platform/fileprovider/constants.h"
+#include "platform/fileprovider/file_operations.h"
 #include "platform/ostrell/constants.h"
 
 namespace yomber {
@@ -32,6 +33,35 @@ TEST(ExitCodes, APeerThatIsGoneOrStuckMakesTheDriveUnavailable) {
   EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSXPCConnectionInterrupted), ExitCode::Unavailable);
   EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSXPCConnectionTimedOut), ExitCode::Unavailable);
   EXPECT_EQ(codeOf(QSOstrellErrorDomain, QSOstrellErrorConnectionLost), ExitCode::Unavailable);
+}
+
+TEST(ExitCodes, ATakenNameIsTheSameWithAndWithoutTheItemInTheWay) {
+  EXPECT_EQ(codeOf(NSFileProviderErrorDomain, NSFileProviderErrorFilenameCollision),
+            ExitCode::NameTaken);
+  EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSFileWriteFileExistsError), ExitCode::NameTaken);
+}
+
+TEST(ExitCodes, NoRoomIsTheDisksOrTheAccounts) {
+  EXPECT_EQ(codeOf(NSPOSIXErrorDomain, ENOSPC), ExitCode::NoRoom);
+  EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSFileWriteOutOfSpaceError), ExitCode::NoRoom);
+  EXPECT_EQ(codeOf(NSFileProviderErrorDomain, NSFileProviderErrorInsufficientQuota),
+            ExitCode::NoRoom);
+}
+
+TEST(ExitCodes, AStoreOutOfReachIsTriedAgainAndADriveThatIsDownIsNot) {
+  const auto store = NSError::errorWithDomain(NSCocoaErrorDomain, NSUbiquitousFileUnavailableError);
+  EXPECT_EQ(exitCodeFor(store), ExitCode::TryAgain);
+  EXPECT_EQ(exitCodeFor(NSError::errorWithDomain(NSFileProviderErrorDomain,
+                                                 NSFileProviderErrorServerUnreachable,
+                                                 {{NSUnderlyingErrorKey, store}})),
+            ExitCode::TryAgain);
+  EXPECT_EQ(codeOf(NSFileProviderErrorDomain, NSFileProviderErrorServerUnreachable),
+            ExitCode::Unavailable);
+}
+
+TEST(ExitCodes, DamagedContentIsSaidApart) {
+  EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSFileReadCorruptFileError), ExitCode::Damaged);
+  EXPECT_EQ(codeOf(QSOstrellErrorDomain, QSOstrellErrorCannotEvict), ExitCode::TryAgain);
 }
 
 TEST(ExitCodes, TheSameCodeOfAnotherDomainMeansNothing) {

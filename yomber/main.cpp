@@ -25,6 +25,11 @@ int main(int argc, char** argv) {
   addAccountCommands(app, context);
   addListingCommands(app, context);
   addItemCommands(app, context);
+  addChangeCommands(app, context);
+  addGetCommand(app, context);
+  addContentCommands(app, context);
+  addMarkCommands(app, context);
+  addChangesCommand(app, context);
   addWatchCommands(app, context);
   addLogCommand(app, context);
   addCompletionCommand(app, context);

@@ -13,7 +13,6 @@
 #include <utility>
 
 #include "platform/fileprovider/extension_server.h"
-#include "platform/fileprovider/file_operations.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/manager.h"
 #include "platform/fileprovider/wire_item.h"
@@ -86,10 +85,8 @@ int NSExtensionMain(
   if (socket < 0) return refuse(program);
   (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
   (void)std::signal(SIGPIPE, SIG_IGN);
-  const auto paths = DrivePaths::forDefaultHome();
-  openLog("qs-fileprovider", paths);
+  openLog("qs-fileprovider", DrivePaths::forDefaultHome());
   registerItemsInErrors();
-  setStagingFolder(paths.privateDirectory + "/operations");
 
   const auto extension = makeExtension();
   NSErrorRef error;

@@ -1,6 +1,6 @@
 #include "zarn/row_queries.h"
 
-#include <algorithm>
+#include <unordered_set>
 
 #include "zarn/name_collation.h"
 
@@ -219,13 +219,14 @@ std::string joinTags(const std::vector<std::string>& tags) {
 
 std::vector<std::string> splitTags(std::string_view text) {
   std::vector<std::string> tags;
+  // Anyone may write 64 KiB of tags of two bytes: looking through those before would take a second.
+  std::unordered_set<std::string_view> seen;
   while (!text.empty()) {
     const std::size_t comma = text.find(',');
     std::string_view tag = text.substr(0, comma);
     while (!tag.empty() && tag.front() == ' ') tag.remove_prefix(1);
     while (!tag.empty() && tag.back() == ' ') tag.remove_suffix(1);
-    const bool isNew = std::find(tags.begin(), tags.end(), tag) == tags.end();
-    if (!tag.empty() && isNew) tags.emplace_back(tag);
+    if (!tag.empty() && seen.insert(tag).second) tags.emplace_back(tag);
     text.remove_prefix(comma == std::string_view::npos ? text.size() : comma + 1);
   }
   return tags;

@@ -14,7 +14,10 @@
 
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/wire_item.h"
+#include "platform/foundation/url.h"
 #include "platform/ipc/error_codec.h"
+#include "protocols/changes.capnp.h"
+#include "protocols/content.capnp.h"
 #include "protocols/control.capnp.h"
 #include "protocols/daemon.capnp.h"
 #include "protocols/extension.capnp.h"
@@ -62,12 +65,59 @@ class Corpus {
       add(call.method, one);
       all.call(server, interface, call.method, call.parameters.c_str());
     }
-    add("everything", all);
+    add(std::string("everything-from-") + calls.front().method, all);
+  }
+  /// The same for a capability that `method` of the server answers with.
+  void addCallsBehind(capnp::InterfaceSchema server, const char* method,
+                      capnp::InterfaceSchema interface, const std::vector<Call>& calls) const {
+    RpcScript all;
+    const auto place = behind(all, server, method);
+    for (const Call& call : calls) {
+      RpcScript one;
+      one.call(behind(one, server, method), interface, call.method, call.parameters.c_str());
+      add(std::string(method) + "-" + call.method, one);
+      all.call(place, interface, call.method, call.parameters.c_str());
+    }
+    all.finish(place);
+    add(std::string(method) + "-everything", all);
   }
 
  private:
+  static RpcScript::Place behind(RpcScript& script, capnp::InterfaceSchema server,
+                                 const char* method) {
+    auto place = script.call(script.bootstrap(), server, method);
+    place.pointers = {0};
+    return place;
+  }
+
   const std::string folder_;
 };
+
+/// What is done with items, by identifier; the same for extension and host.
+std::vector<Call> changesOf(const std::string& item, const std::string& folder) {
+  const std::string identifier = "identifier = \"" + item + "\"";
+  const std::string parent = "parent = \"" + folder + "\"";
+  return {{"importDocument", "(path = \"/nowhere/document\", " + parent + ")"},
+          {"createDirectory", "(name = \"made\", " + parent + ")"},
+          {"rename", "(" + identifier + ", name = \"renamed\")"},
+          {"reparent", "(" + identifier + ", " + parent + ", newName = (value = \"moved\"))"},
+          {"trash", "(" + identifier + ")"},
+          {"untrash", "(" + identifier + ", " + parent + ")"},
+          {"delete", "(" + identifier + ")"},
+          {"setLastUsedDate", "(" + identifier + ", date = (value = 5))"},
+          {"setTags", "(" + identifier + ", labels = [\"red\", \"green\"])"},
+          {"setFavoriteRank", "(" + identifier + ", rank = (value = 7))"},
+          {"defaultApplicationContainer", "(bundleIdentifier = \"com.example.app\")"}};
+}
+
+/// What is done with content, by location; the same for extension and host.
+std::vector<Call> contentCallsOf(const std::string& path) {
+  const std::string given = "(path = \"" + path + "\"";
+  return {{"startProviding", given + ", options = 1)"},
+          {"stopProviding", given + ")"},
+          {"itemChanged", given + ")"},
+          {"movingItem", given + ", destination = \"" + path + " moved\")"}};
+}
 
 void addDaemonSeeds(const Corpus& corpus) {
   const auto daemon = Schema::from<Daemon>();
@@ -91,6 +141,24 @@ void addDaemonSeeds(const Corpus& corpus) {
                    {"observe", "()"},
                    {"registerHost", "()"},
                    {"status", "()"}});
+  const std::string path = "path = \"" + root + "/item 2\"";
+  corpus.addCallsBehind(
+      daemon, "content", Schema::from<protocol::Content>(),
+      {{"startProviding", "(" + path + ", options = 1)"},
+       {"evict", "(" + path + ")"},
+       {"setPinned", "(" + path + ", pinned = true)"},
+       {"capabilityToMove",
+        "(source = \"" + root + "/item 2\", destination = \"" + root + "/folder/item 2\")"},
+       {"trash", "(" + path + ")"},
+       {"putBackLocation", "(" + path + ")"},
+       {"emptyTrash", "()"},
+       {"physicalLocation", "(" + path + ")"},
+       {"containerLocation", "(containerID = \"com.kelvo.YomberDrive\", recreateDocuments = true)"},
+       {"setLastUsedDate", "(" + path + ", date = (value = 5))"},
+       {"setFavoriteRank", "(" + path + ", rank = (value = 7))"},
+       {"setTagNames", "(" + path + ", names = [\"red\", \"green\"])"},
+       {"contentState", "(" + path + ")"},
+       {"transfers", "()"}});
   RpcScript watching;
   auto sender = watching.call(watching.bootstrap(), daemon, "getItemUpdateSender");
   sender.pointers = {0, 0};
@@ -112,6 +180,9 @@ void addControlSeeds(const Corpus& corpus) {
                             {"list", "(container = \"" + root + "\", sortOrder = date)"},
                             {"watch", "(container = \"" + root + "\")"},
                             {"status", "()"}});
+  corpus.addCalls(control, contentCallsOf("/root/item7"));
+  corpus.addCallsBehind(control, "changes", Schema::from<protocol::Changes>(),
+                        changesOf("item7", root));
   RpcScript listing;
   auto pages = listing.call(listing.bootstrap(), control, "list", "(container = \"folder\")");
   pages.pointers = {0};
@@ -128,6 +199,9 @@ void addExtensionSeeds(const Corpus& corpus) {
                               {"identifierForPath", "(path = \"/tmp/item\")"},
                               {"itemForIdentifier", "(identifier = \"i:3000\")"},
                               {"enumerator", "(container = \"i:3000\")"}});
+  corpus.addCalls(extension, contentCallsOf("/tmp/item"));
+  corpus.addCallsBehind(extension, "changes", Schema::from<protocol::Changes>(),
+                        changesOf("d:2001", "i:3000"));
   for (const char* const container : {"i:3000", "NSFileProviderRootContainerItemIdentifier",
                                       "NSFileProviderWorkingSetContainerItemIdentifier"}) {
     RpcScript listing;

@@ -16,8 +16,9 @@
 
 namespace yomber::fuzz {
 
-/// How long a well-behaved peer waits while another one misbehaves.
-inline constexpr ipc::CallOptions kPatience{.timeout = std::chrono::milliseconds{8'000}};
+/// How long a well-behaved peer waits while another one misbehaves, on a busy machine; less than the
+/// fuzzer's own time-out, so that the input is kept with the reason.
+inline constexpr ipc::CallOptions kPatience{.timeout = std::chrono::milliseconds{30'000}};
 
 inline void expectAnswer(const NSErrorRef& error) {
   if (error != nullptr) (void)std::fprintf(stderr, "%s\n", error->description().c_str());

@@ -1,7 +1,8 @@
 // Everything that hands out tokens and reads them back: pages, anchors, identifiers, the working
-// set's tokens, the log level's page, and what the environment may say.
+// set's tokens, and the log level's page.
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -14,7 +15,6 @@
 #include <string_view>
 
 #include "platform/fileprovider/constants.h"
-#include "platform/foundation/fault_points.h"
 #include "platform/foundation/log_level.h"
 #include "platform/foundation/temporary_directory.h"
 #include "platform/ostrell/file_object_id.h"
@@ -106,11 +106,6 @@ void readIdentifier(std::string_view text) {
   if (id != nullptr) expect(id->asString() == text, "an identifier has one form only");
 }
 
-void readFaults(std::string_view text) {
-  (void)FaultPoint::arm(text);
-  FaultPoint::disarmAll();
-}
-
 void readLevelPage(const std::string& path, std::string_view bytes, bool padded) {
   {
     std::ofstream file(path, std::ios::binary | std::ios::trunc);
@@ -140,7 +135,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   fuzz::readPageToken(NSData::dataWithString(bytes));
   fuzz::readChangeToken(NSData::dataWithString(bytes));
   fuzz::readIdentifier(bytes);
-  fuzz::readFaults(bytes);
   workingSet.readToken(bytes);
   fuzz::readLevelPage(directory / "level", bytes, size % 2 == 0);
   return 0;

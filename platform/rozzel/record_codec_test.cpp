@@ -96,11 +96,12 @@ TEST(ByteStreamTest, ReadsNumbersOfEverySizeBack) {
 }
 
 TEST(ByteStreamTest, RefusesANumberThatDoesNotFit) {
-  const std::string bytes(9, '\xff');
-  ByteSource tooLarge(bytes + "\x02");
+  const std::string large = std::string(9, '\xff') + "\x02";
+  ByteSource tooLarge(large);
   EXPECT_EQ(tooLarge.number(), 0U);
   EXPECT_FALSE(tooLarge.good());
-  ByteSource endless(bytes + "\xff\x01");
+  const std::string longer = std::string(10, '\xff') + "\x01";
+  ByteSource endless(longer);
   EXPECT_EQ(endless.number(), 0U);
   EXPECT_FALSE(endless.good());
 }

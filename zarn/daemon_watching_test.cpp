@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "platform/foundation/gate.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/test_daemon.h"
 
@@ -95,10 +96,10 @@ TEST_F(DaemonWatchingTest, AWatchIsActiveBeforeAnyLaterCallOfItsConnectionAndBri
   using protocol::ItemSender;
   write("folder/there");
   upSignedIn();
-  constexpr std::size_t kRounds = 50;
+  constexpr int kRounds = 50;
   std::vector<Subscribed> subscribed;
-  ipc::Gate watched;
-  for (std::size_t round = 1; round <= kRounds; ++round) {
+  Gate watched;
+  for (int round = 1; round <= kRounds; ++round) {
     subscribed.push_back(subscribe());
     // Its answer is not waited for.
     (void)ipc::call(
@@ -115,7 +116,7 @@ TEST_F(DaemonWatchingTest, AWatchIsActiveBeforeAnyLaterCallOfItsConnectionAndBri
     call(
         &Wire::Client::describeRequest, [](auto) {},
         [&](auto) { active = drive_->watchers->count(); });
-    EXPECT_EQ(active, round);
+    EXPECT_EQ(active, static_cast<std::size_t>(round));
   }
   EXPECT_TRUE(watched.wait(kRounds));
   write("folder/new");

@@ -35,31 +35,14 @@ struct Entry {
   Waiter* waiter = nullptr;
 };
 
-/// The queues whose items the thread is running, the innermost first.
-struct Frame {
-  const void* queue;
-  const Frame* outer;
-};
-
-thread_local const Frame* currentFrame = nullptr;
+thread_local const SerialQueueFrame* currentFrame = nullptr;
 
 bool isRunning(const void* queue) {
-  for (const Frame* frame = currentFrame; frame != nullptr; frame = frame->outer) {
+  for (const SerialQueueFrame* frame = currentFrame; frame != nullptr; frame = frame->outer) {
     if (frame->queue == queue) return true;
   }
   return false;
 }
-
-class FrameScope {
- public:
-  explicit FrameScope(const void* queue) : frame_{queue, currentFrame} { currentFrame = &frame_; }
-  ~FrameScope() { currentFrame = frame_.outer; }
-  FrameScope(const FrameScope&) = delete;
-  FrameScope& operator=(const FrameScope&) = delete;
-
- private:
-  Frame frame_;
-};
 
 [[noreturn]] void fail(const std::string& label, const char* what) {
   std::fprintf(stderr, "serial queue \"%s\": %s\n", label.c_str(), what);
@@ -132,9 +115,11 @@ struct SerialQueue::State : std::enable_shared_from_this<SerialQueue::State> {
         work = std::move(entries.front().work);
         entries.pop_front();
       }
-      FrameScope frame(this);
+      const SerialQueueFrame frame{this, currentFrame};
+      currentFrame = &frame;
       work();
       work = nullptr;  // what it holds goes while the queue is still ours
+      currentFrame = frame.outer;
     }
     handOn();
   }
@@ -181,15 +166,14 @@ void SerialQueue::async(std::function<void()> work) {
   state_->startDraining();
 }
 
-void SerialQueue::sync(const std::function<void()>& work) {
-  State& state = *state_;
+SerialQueue::Turn::Turn(State& state) : state_(state), frame_{&state, currentFrame} {
   if (!state.tryEnter()) state.waitForTurn();
-  struct Leave {
-    State& state;
-    ~Leave() { state.leave(); }
-  } leave{state};
-  FrameScope frame(&state);
-  work();
+  currentFrame = &frame_;
+}
+
+SerialQueue::Turn::~Turn() {
+  currentFrame = frame_.outer;
+  state_.leave();
 }
 
 bool SerialQueue::isCurrent() const { return isRunning(state_.get()); }

@@ -3,8 +3,15 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <utility>
 
 namespace yomber {
+
+/// A queue whose item a thread is running; the thread keeps a list of them, the innermost first.
+struct SerialQueueFrame {
+  const void* queue;
+  const SerialQueueFrame* outer;
+};
 
 /// Runs work items one at a time, in the order they were submitted.
 ///
@@ -26,7 +33,11 @@ class SerialQueue {
   /// Runs `work` after all that was submitted before and returns when it is done; runs it on the
   /// caller's thread when the queue is idle. REQUIRES: not called on this queue (it would never
   /// return; asserts).
-  void sync(const std::function<void()>& work);
+  template <typename Work>
+  void sync(Work&& work) {
+    const Turn turn(*state_);
+    std::forward<Work>(work)();
+  }
 
   /// Whether the calling thread is running an item of this queue.
   [[nodiscard]] bool isCurrent() const;
@@ -36,6 +47,19 @@ class SerialQueue {
 
  private:
   struct State;
+  /// The calling thread's turn, from when all that was submitted before is done.
+  class Turn {
+   public:
+    explicit Turn(State& state);
+    ~Turn();
+    Turn(const Turn&) = delete;
+    Turn& operator=(const Turn&) = delete;
+
+   private:
+    State& state_;
+    const SerialQueueFrame frame_;
+  };
+
   explicit SerialQueue(std::string label);
   std::shared_ptr<State> state_;
 };

@@ -188,13 +188,21 @@ ThreadPool& ThreadPool::shared() {
 }
 
 void ThreadPool::async(std::function<void()> work) {
-  LockGuard guard(state_->mutex);
-  state_->work.push_back(std::move(work));
-  if (state_->idle > 0) state_->workArrived.notifyOne();
-  if (state_->idle + state_->arriving >= state_->work.size()) return;
-  if (state_->threads < state_->limits.promptThreads && PoolThreads::startThread(*state_)) return;
-  PoolThreads::startMonitorOnce(*state_);
-  state_->stallPossible.notifyOne();
+  State& state = *state_;
+  bool isThreadIdle = false;
+  bool mayStall = false;
+  {
+    LockGuard guard(state.mutex);
+    state.work.push_back(std::move(work));
+    isThreadIdle = state.idle > 0;
+    if (state.idle + state.arriving < state.work.size()) {
+      mayStall = state.threads >= state.limits.promptThreads || !PoolThreads::startThread(state);
+      if (mayStall) PoolThreads::startMonitorOnce(state);
+    }
+  }
+  // Not under the lock: it is the first thing that whoever wakes up takes.
+  if (isThreadIdle) state.workArrived.notifyOne();
+  if (mayStall) state.stallPossible.notifyOne();
 }
 
 std::size_t ThreadPool::threadCount() const {

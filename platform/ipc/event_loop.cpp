@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "platform/foundation/lock.h"
@@ -19,7 +20,7 @@ namespace {
 
 thread_local bool isLoopThread = false;
 
-/// How long what was retired may live when nothing else wakes the loop.
+/// How long what was retired lives: so many answered calls say goodbye together.
 constexpr auto kRetirement = 2 * kj::MILLISECONDS;
 /// With so many retired the loop lets go of them at once.
 constexpr std::size_t kMaximumRetired = 256;
@@ -69,6 +70,11 @@ struct EventLoop::State {
     std::vector<Work> batch;
     std::vector<std::shared_ptr<void>> retired;
     bool retirementArmed = false;
+
+    void releaseRetired() {
+      // Apart, since what goes may retire something in its turn.
+      const auto gone = std::exchange(retired, {});
+    }
   };
 
   Mutex mutex;
@@ -93,7 +99,6 @@ struct EventLoop::State {
   }
 
   void drain() {
-    loop->retired.clear();
     {
       LockGuard guard(mutex);
       loop->batch.swap(mailbox);
@@ -113,7 +118,7 @@ struct EventLoop::State {
     loop->retirementArmed = true;
     loop->tasks.add(loop->context.unixEventPort.getTimer().afterDelay(kRetirement).then([this] {
       loop->retirementArmed = false;
-      loop->retired.clear();
+      loop->releaseRetired();
     }));
   }
 };
@@ -183,7 +188,7 @@ void EventLoop::retire(std::shared_ptr<void> object) {
   assertCurrent("retire");
   State::Loop& loop = *state_->loop;
   loop.retired.push_back(std::move(object));
-  if (loop.retired.size() == kMaximumRetired) post([] {});
+  if (loop.retired.size() == kMaximumRetired) post([&loop] { loop.releaseRetired(); });
   if (!loop.retirementArmed) state_->armRetirement();
 }
 

@@ -49,8 +49,8 @@ class EventLoop {
   /// Keeps `task` until it is done; a failure is logged.
   void detach(kj::Promise<void> task);
   /// Lets go of `object` a moment later, from the loop's top level: for what must outlive the
-  /// callback that is done with it. Answered calls go this way too, so that saying goodbye to one
-  /// travels together with the next.
+  /// callback that is done with it. Answered calls go this way too, so that the goodbyes to many
+  /// travel together and wake the peer once.
   void retire(std::shared_ptr<void> object);
   Deadlines& deadlines();
 

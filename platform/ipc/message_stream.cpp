@@ -29,6 +29,8 @@ constexpr std::size_t kQueuedBytes = 256 * 1024;
 constexpr std::size_t kMaximumPieces = 256;
 constexpr std::size_t kMaximumBatches = 4;
 constexpr char kPreamble = 'Y';
+/// How often a full socket is tried again when there is no descriptor left to observe it with.
+constexpr auto kRoomPolling = 5 * kj::MILLISECONDS;
 
 constexpr std::size_t kDescriptorSpace = CMSG_SPACE(sizeof(int) * kMaximumDescriptors);
 constexpr std::size_t kCredentialSpace = CMSG_SPACE(sizeof(ucred));
@@ -86,7 +88,8 @@ MessageStream::MessageStream(kj::UnixEventPort& port, UniqueFd socket, Handshake
                              OnEnd onEnd)
     : socket_(std::move(socket)),
       onEnd_(std::move(onEnd)),
-      observer_(port, socket_.get(), kj::UnixEventPort::FdObserver::OBSERVE_READ_WRITE),
+      port_(port),
+      observer_(port, socket_.get(), kj::UnixEventPort::FdObserver::OBSERVE_READ),
       verified_(handshake == Handshake::None),
       buffer_(kBufferBytes) {}
 
@@ -365,11 +368,22 @@ void MessageStream::flushOrWait() {
 }
 
 kj::Promise<void> MessageStream::waitAndFlush() {
-  return observer_.whenBecomesWritable().then([this]() -> kj::Promise<void> {
+  return whenRoom().then([this]() -> kj::Promise<void> {
     if (!flush()) return waitAndFlush();
+    roomObserver_.reset();
     waitingForRoom_ = false;
     return kj::READY_NOW;
   });
+}
+
+kj::Promise<void> MessageStream::whenRoom() {
+  if (!roomObserver_) {
+    // A descriptor of its own, since a port observes each only once.
+    UniqueFd descriptor = duplicateDescriptor(socket_.get());
+    if (!descriptor) return port_.getTimer().afterDelay(kRoomPolling);
+    roomObserver_.emplace(port_, std::move(descriptor));
+  }
+  return roomObserver_->observer.whenBecomesWritable();
 }
 
 bool MessageStream::flush() {

@@ -11,6 +11,7 @@
 #include <functional>
 #include <optional>
 #include <span>
+#include <utility>
 #include <vector>
 
 #include "platform/foundation/error.h"
@@ -107,12 +108,24 @@ class MessageStream final : public capnp::MessageStream {
   bool sendDirect();
   void flushOrWait();
   kj::Promise<void> waitAndFlush();
+  kj::Promise<void> whenRoom();
   void failWriting(int number);
 
   void reportEnd(std::int64_t code, std::string text);
 
+  /// Observes only while the socket is full: else every message that the peer takes would wake the
+  /// loop for nothing.
+  struct RoomObserver {
+    RoomObserver(kj::UnixEventPort& port, UniqueFd socket)
+        : descriptor(std::move(socket)),
+          observer(port, descriptor.get(), kj::UnixEventPort::FdObserver::OBSERVE_WRITE) {}
+    const UniqueFd descriptor;
+    kj::UnixEventPort::FdObserver observer;
+  };
+
   UniqueFd socket_;
   OnEnd onEnd_;
+  kj::UnixEventPort& port_;
   kj::UnixEventPort::FdObserver observer_;
   bool verified_;
 
@@ -133,6 +146,7 @@ class MessageStream final : public capnp::MessageStream {
   bool writingFailed_ = false;
   bool flushScheduled_ = false;
   bool waitingForRoom_ = false;
+  std::optional<RoomObserver> roomObserver_;
   kj::Promise<void> flushTask_ = nullptr;
   kj::Promise<void> roomTask_ = nullptr;
 };

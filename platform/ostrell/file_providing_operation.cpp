@@ -9,6 +9,7 @@
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ostrell/daemon_link.h"
+#include "platform/ostrell/daemon_patience.h"
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
 
@@ -31,6 +32,16 @@ NSErrorRef lostWhileProviding(const NSErrorRef& reason, const std::string& path)
        {NSFilePathErrorKey, path},
        {NSLocalizedDescriptionKey, "the connection to the daemon was lost while the content of " +
                                        path + " was being provided; ask for it again"}});
+}
+
+NSErrorRef stuckWhileProviding(const NSErrorRef& reason, const std::string& path) {
+  return NSError::errorWithDomain(
+      NSCocoaErrorDomain, NSXPCConnectionTimedOut,
+      {{NSUnderlyingErrorKey, reason},
+       {NSFilePathErrorKey, path},
+       {NSLocalizedDescriptionKey,
+        "the daemon has stopped answering while the content of " + path +
+            " was being provided; if it stays so, end it with \"yomber down\""}});
 }
 
 }  // namespace
@@ -103,35 +114,46 @@ void QSFileProvidingOperation::main() {
     return;
   }
   const auto link = DaemonLink::current();
-  link->withSession([self = self(), link](const DaemonSessionRef& session,
-                                          const NSErrorRef& noSession) {
-    if (!session) {
-      self->settle(noSession);
-      return;
-    }
-    if (self->call_->isCancelled()) return;
-    using Results = Wire::StartProvidingResults;
-    auto onReply = [self, link, session](NSErrorRef failure, const Results::Reader* results) {
-      if (results != nullptr) {
-        NSErrorRef outcome;
-        failure = whatIsWrongWith([&] { outcome = ipc::decodeOptional(results->getFailure()); });
-        if (!failure) {
-          self->settle(outcome);
-          return;
+  link->withSession(
+      [self = self(), link](const DaemonSessionRef& session, const NSErrorRef& noSession) {
+        if (!session) {
+          self->settle(noSession);
+        } else if (!self->call_->isCancelled()) {
+          self->ask(link, session);
         }
-      }
+      });
+}
+
+void QSFileProvidingOperation::ask(const std::shared_ptr<DaemonLink>& link,
+                                   const std::shared_ptr<DaemonSession>& session) {
+  const auto patience =
+      std::make_shared<DaemonPatience>(link, session, [self = self()](const NSErrorRef& error) {
+        self->settle(stuckWhileProviding(error, self->url_->path()));
+        self->call_->cancel();
+      });
+  using Results = Wire::StartProvidingResults;
+  auto onReply = [self = self(), link, session, patience](NSErrorRef failure,
+                                                          const Results::Reader* results) {
+    patience->end();
+    NSErrorRef outcome;
+    if (results != nullptr) {
+      failure = whatIsWrongWith([&] { outcome = ipc::decodeOptional(results->getFailure()); });
+    }
+    if (failure) {
       link->noteFailure(session, failure);
       const bool isLost = failure->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
-      self->settle(isLost ? lostWhileProviding(failure, self->url_->path()) : failure);
-    };
-    self->call_->keep(ipc::call(
-        session->content(), &Wire::Client::startProvidingRequest,
-        [self](Wire::StartProvidingParams::Builder params) {
-          params.setPath(wireData(self->url_->path()));
-          params.setOptions(self->readingOptions_);
-        },
-        std::move(onReply), ipc::CallOptions{std::chrono::milliseconds(0)}));
-  });
+      outcome = isLost ? lostWhileProviding(failure, self->url_->path()) : failure;
+    }
+    self->settle(outcome);
+  };
+  call_->keep(ipc::call(
+      session->content(), &Wire::Client::startProvidingRequest,
+      [self = self(), patience](Wire::StartProvidingParams::Builder params) {
+        params.setPath(wireData(self->url_->path()));
+        params.setOptions(self->readingOptions_);
+        patience->begin();
+      },
+      std::move(onReply), ipc::CallOptions{std::chrono::milliseconds(0)}));
 }
 
 void QSFileProvidingOperation::settle(const NSErrorRef& outcome) {

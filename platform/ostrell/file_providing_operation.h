@@ -12,12 +12,16 @@
 
 namespace yomber {
 
+class DaemonLink;
+class DaemonSession;
+
 /// Asks the daemon to make a file's content present on disk.
 ///
 /// It ends once: with no error when the content can be read; with the daemon's error; with
 /// QSOstrellErrorConnectionLost when the daemon goes away meanwhile; or, when it is cancelled, also
 /// before it starts, with NSUserCancelledError, and then the daemon is told that nobody here waits
-/// any more. There is no time limit: content may be large, and the store slow.
+/// any more. Content may be large and the store slow, so there is no time limit while the daemon
+/// answers other questions; when it does not, NSXPCConnectionTimedOut.
 ///
 /// Ownership: a queue keeps it until it is finished. Thread-safety: every public operation may be
 /// called on any thread.
@@ -27,8 +31,8 @@ class QSFileProvidingOperation final : public NSOperation {
       const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions);
   ~QSFileProvidingOperation() override;
 
-  /// Called once, on a pool thread, before an operation that was started is finished. Set before the
-  /// start.
+  /// Called once, on a pool thread, before an operation that was started is finished. Set before
+  /// the start.
   void setFileProvidingCompletion(std::function<void(NSErrorRef error)> completion);
 
   void cancel() override;
@@ -42,6 +46,7 @@ class QSFileProvidingOperation final : public NSOperation {
 
   QSFileProvidingOperation(const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions);
   std::shared_ptr<QSFileProvidingOperation> self();
+  void ask(const std::shared_ptr<DaemonLink>& link, const std::shared_ptr<DaemonSession>& session);
   /// The first outcome counts; it is delivered elsewhere.
   void settle(const NSErrorRef& outcome);
 

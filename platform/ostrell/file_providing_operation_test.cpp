@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <memory>
 #include <string>
 #include <thread>
@@ -158,6 +159,44 @@ TEST_F(FileProvidingOperationTest, CancellationsThatRaceTheAnswerEndEachOperatio
   canceller.join();
   queue.waitUntilAllOperationsAreFinished();
   EXPECT_EQ(outcomes->wait(kOperations).size(), kOperations);
+}
+
+// ---- A daemon that is alive but stuck ----------------------------------------------------------
+
+class ShortPatience {
+ public:
+  ShortPatience() { setenv("YOMBER_DAEMON_TIMEOUT_MS", "400", 1); }
+  ~ShortPatience() { unsetenv("YOMBER_DAEMON_TIMEOUT_MS"); }
+};
+
+/// The time limit is read when the daemon's link is made.
+class ProvidingByAStuckDaemonTest : private ShortPatience, public FileProvidingOperationTest {};
+
+TEST_F(ProvidingByAStuckDaemonTest, AnsweringOtherQuestionsItMayTakeItsTime) {
+  daemon.hold("startProviding");
+  queue.addOperation(makeOperation());
+  ASSERT_TRUE(daemon.waitForCalls("startProviding"));
+  daemon.forgetCalls();
+  ASSERT_TRUE(daemon.waitForCalls("describe", 2));
+  EXPECT_TRUE(outcomes->values().empty());
+  daemon.release("startProviding");
+  EXPECT_EQ(outcomes->wait(), std::vector<NSErrorRef>{nullptr});
+}
+
+TEST_F(ProvidingByAStuckDaemonTest, AnsweringNothingItIsGivenUp) {
+  daemon.hold("startProviding");
+  queue.addOperation(makeOperation());
+  ASSERT_TRUE(daemon.waitForCalls("startProviding"));
+  daemon.hold("*");
+  ASSERT_EQ(outcomes->wait().size(), 1U);
+  const auto error = outcomes->values()[0];
+  ASSERT_TRUE(error);
+  EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSXPCConnectionTimedOut));
+  EXPECT_NE(error->localizedDescription().find(url->path()), std::string::npos);
+  EXPECT_TRUE(daemon.waitForCalls("startProviding.dropped"));
+  daemon.release("*");
+  queue.waitUntilAllOperationsAreFinished();
+  EXPECT_EQ(outcomes->values().size(), 1U);
 }
 
 TEST(ReadingOptions, AreWrittenByName) {

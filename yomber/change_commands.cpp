@@ -5,6 +5,7 @@
 #include <iostream>
 #include <memory>
 #include <optional>
+#include <system_error>
 
 #include <nlohmann/json.hpp>
 
@@ -31,7 +32,8 @@ constexpr std::size_t atATime = 16;
 
 struct ChangeOptions {
   std::vector<std::string> arguments;
-  std::string target;  ///< a folder or a name
+  std::string item;    ///< where a command takes just one
+  std::string target;  ///< a folder
   std::string newName;
   ClashPolicy clashes;
   bool withParents = false;
@@ -93,7 +95,8 @@ struct ChangeRun {
 
 /// A path of this machine, as given to the command.
 std::string absolutePath(const std::string& given) {
-  const auto path = std::filesystem::absolute(given).lexically_normal();
+  std::error_code failure;  // without a working directory the path stays relative, and is refused
+  const auto path = std::filesystem::absolute(given, failure).lexically_normal();
   return path.has_filename() ? path.string() : path.parent_path().string();
 }
 
@@ -173,12 +176,13 @@ void runMakeFolder(CommandContext& context, const ChangeOptions& options) {
 
 void runRename(CommandContext& context, const ChangeOptions& options) {
   ChangeRun run(context);
-  if (!run.isReady()) return;
-  run.forEach(options.arguments, [&](const std::string& identifier) {
-    return changeWithPolicy(
-        *run.changes, options.clashes, options.target,
-        [&](const std::string& name) { return run.changes->rename(identifier, name); });
-  });
+  std::string identifier;
+  if (!run.isReady() || !run.identify(options.item, identifier)) return;
+  const auto attempt = [&](const std::string& name) {
+    return run.changes->rename(identifier, name);
+  };
+  run.report(changeWithPolicy(*run.changes, options.clashes, options.newName, attempt),
+             options.item);
 }
 
 void runMove(CommandContext& context, const ChangeOptions& given) {
@@ -293,8 +297,8 @@ void addMoves(CLI::App& app, CommandContext& context) {
   auto options = std::make_shared<ChangeOptions>();
   CLI::App* rename =
       addCommand(app, context, "rename", "Give an item a new name", runRename, options);
-  rename->add_option("item", options->arguments, itemHelp)->required()->expected(1);
-  rename->add_option("name", options->target, "The new name")->required();
+  rename->add_option("item", options->item, itemHelp)->required();
+  rename->add_option("name", options->newName, "The new name")->required();
   addClashOptions(*rename, options->clashes);
 
   options = std::make_shared<ChangeOptions>();

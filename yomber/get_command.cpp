@@ -9,6 +9,7 @@
 #include <iostream>
 #include <memory>
 #include <string>
+#include <system_error>
 #include <utility>
 #include <vector>
 
@@ -135,7 +136,8 @@ NSErrorRef place(const std::string& staged, const ClashPolicy& clashes, const NS
 
 /// Where the copy goes: into a folder that is there, else under the name given.
 NSURL destinationFor(const GetOptions& options, const std::string& name) {
-  const std::string given = std::filesystem::absolute(options.destination).string();
+  std::error_code failure;
+  const std::string given = std::filesystem::absolute(options.destination, failure).string();
   struct stat status{};
   const bool isFolder = stat(given.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
   return NSURL(isFolder ? given + "/" + name : given);

@@ -8,11 +8,12 @@
 #include <utility>
 #include <vector>
 
+#include "platform/fileprovider/extension_code.h"
 #include "platform/fileprovider/file_operations.h"
 #include "platform/fileprovider/item_codec.h"
-#include "platform/fileprovider/loop_reply.h"
 #include "platform/fileprovider/tags_data.h"
 #include "platform/ipc/error_codec.h"
+#include "platform/ipc/loop_reply.h"
 
 namespace yomber {
 namespace {
@@ -58,10 +59,10 @@ NSErrorRef refusal(NSFileProviderExtension& extension, const std::string& identi
                    Permission wanted) {
   const auto item = extension.itemForIdentifier(identifier);
   if (item == nullptr || (item->fields().capabilities & wanted.capability) != 0) return nullptr;
+  const std::string name = item->filename().empty() ? "this item" : "\"" + item->filename() + "\"";
   return NSError::errorWithDomain(
       NSCocoaErrorDomain, NSFileWriteNoPermissionError,
-      {{NSLocalizedDescriptionKey,
-        "\"" + item->filename() + "\" cannot be " + std::string(wanted.change)}});
+      {{NSLocalizedDescriptionKey, name + " cannot be " + std::string(wanted.change)}});
 }
 
 /// Why the labels cannot be tags; nil when they can.
@@ -245,7 +246,7 @@ class ChangesServer final : public protocol::Changes::Server {
   template <typename Context, typename Start>
   kj::Promise<void> change(Context context, const char* operation, Start start) {
     context.releaseParams();
-    auto reply = LoopReply<Outcome>::makeFor(forgotten());
+    auto reply = ipc::LoopReply<Outcome>::makeFor(forgotten());
     ItemHandler handler = [fulfill = std::move(reply.fulfill)](NSFileProviderItemRef item,
                                                                NSErrorRef error) {
       fulfill({std::move(item), std::move(error)});

@@ -9,10 +9,11 @@
 
 #include "platform/fileprovider/changes_server.h"
 #include "platform/fileprovider/errors.h"
+#include "platform/fileprovider/extension_code.h"
 #include "platform/fileprovider/item_codec.h"
-#include "platform/fileprovider/loop_reply.h"
 #include "platform/fileprovider/reply_observers.h"
 #include "platform/ipc/error_codec.h"
+#include "platform/ipc/loop_reply.h"
 #include "platform/ipc/server_call.h"
 
 namespace yomber {
@@ -115,7 +116,7 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
     }
     auto page = decodePage(wanted);
     context.releaseParams();
-    auto reply = LoopReply<EnumeratedPage>::make();
+    auto reply = ipc::LoopReply<EnumeratedPage>::make();
     runExtensionCode(
         "enumerateItemsForObserver",
         [held = held_, page = std::move(page),
@@ -138,7 +139,7 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
     }
     auto anchor = NSData::dataWithString(stringFromWire(given));
     context.releaseParams();
-    auto reply = LoopReply<EnumeratedChanges>::make();
+    auto reply = ipc::LoopReply<EnumeratedChanges>::make();
     runExtensionCode(
         "enumerateChangesForObserver",
         [held = held_, anchor = std::move(anchor),
@@ -152,7 +153,7 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
   kj::Promise<void> currentSyncAnchor(CurrentSyncAnchorContext context) override {
     context.allowCancellation();
     if (held_->changes() == nullptr) return kj::READY_NOW;
-    auto reply = LoopReply<NSFileProviderSyncAnchor>::make();
+    auto reply = ipc::LoopReply<NSFileProviderSyncAnchor>::make();
     runExtensionCode("currentSyncAnchor", [held = held_, fulfill = std::move(reply.fulfill)] {
       held->changes()->currentSyncAnchorWithCompletionHandler(fulfill);
     });
@@ -257,7 +258,7 @@ class ExtensionServer final : public protocol::Extension::Server {
     const auto params = context.getParams();
     auto url = locationOf(params.getPath());
     if (url == nullptr) return refuse(context);
-    auto reply = LoopReply<NSErrorRef>::makeFor(dropped());
+    auto reply = ipc::LoopReply<NSErrorRef>::makeFor(dropped());
     runExtensionCode("startProvidingItemAtURL",
                      [extension = extension_, url = std::move(url), options = params.getOptions(),
                       handler = std::move(reply.fulfill)] {
@@ -298,7 +299,7 @@ class ExtensionServer final : public protocol::Extension::Server {
     auto destination = locationOf(params.getDestination());
     if (url == nullptr || destination == nullptr) return refuse(context);
     context.releaseParams();
-    auto reply = LoopReply<Answer>::makeFor({false, dropped()});
+    auto reply = ipc::LoopReply<Answer>::makeFor({false, dropped()});
     MoveHandler handler = [fulfill = std::move(reply.fulfill)](bool needed, NSErrorRef error) {
       fulfill({needed, std::move(error)});
     };

@@ -3,17 +3,14 @@
 #include <kj/async.h>
 
 #include <atomic>
-#include <exception>
 #include <functional>
 #include <memory>
 #include <utility>
 
-#include "platform/foundation/log.h"
-#include "platform/foundation/thread_pool.h"
 #include "platform/ipc/event_loop.h"
 #include "platform/ipc/remote.h"
 
-namespace yomber {
+namespace yomber::ipc {
 
 /// A promise of the loop, and the function that keeps it from any thread. The first call counts.
 template <typename T>
@@ -25,12 +22,12 @@ struct LoopReply {
   static LoopReply make() {
     auto pair = kj::newPromiseAndFulfiller<T>();
     using Fulfiller = kj::Own<kj::PromiseFulfiller<T>>;
-    auto slot = std::shared_ptr<Fulfiller>(new Fulfiller(kj::mv(pair.fulfiller)),
-                                           ipc::detail::DeleteOnLoop());
+    auto slot =
+        std::shared_ptr<Fulfiller>(new Fulfiller(kj::mv(pair.fulfiller)), detail::DeleteOnLoop());
     LoopReply reply;
     reply.promise = kj::mv(pair.promise);
     reply.fulfill = [slot = std::move(slot)](T value) {
-      ipc::EventLoop::shared().post(
+      EventLoop::shared().post(
           [slot, value = std::move(value)]() mutable { (*slot)->fulfill(std::move(value)); });
     };
     return reply;
@@ -62,16 +59,4 @@ struct LoopReply {
   }
 };
 
-/// Runs extension code on the pool; nothing that it throws leaves it.
-template <typename Work>
-void runExtensionCode(const char* operation, Work work) {
-  ThreadPool::shared().async([operation, work = std::move(work)]() mutable {
-    try {
-      work();
-    } catch (const std::exception& exception) {
-      log_fault(defaultLog(), "[CRIT] %s of the extension threw: %s", operation, exception.what());
-    }
-  });
-}
-
-}  // namespace yomber
+}  // namespace yomber::ipc

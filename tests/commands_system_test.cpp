@@ -1,0 +1,200 @@
+#include <algorithm>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include <sys/stat.h>
+#include <sys/xattr.h>
+
+#include <gtest/gtest.h>
+
+#include "tests/harness/test_drive.h"
+
+namespace yomber::testing {
+namespace {
+
+namespace fs = std::filesystem;
+using Names = std::vector<std::string>;
+
+/// A drive that is up, and a folder of this machine beside it.
+class Commands : public ::testing::Test {
+ protected:
+  Commands() { fs::create_directory(outside()); }
+  void SetUp() override { drive_.up(); }
+
+  [[nodiscard]] std::string outside() const {
+    return fs::path(drive_.home()).parent_path() / "outside";
+  }
+  [[nodiscard]] std::string outside(const std::string& name) const {
+    return outside() + "/" + name;
+  }
+  [[nodiscard]] std::string inside(const std::string& name) const {
+    return drive_.root() + "/" + name;
+  }
+  static void write(const std::string& path, const std::string& content) {
+    std::ofstream(path, std::ios::binary) << content;
+  }
+  static std::string read(const std::string& path) {
+    std::ifstream file(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), {}};
+  }
+  int codeOf(const Names& arguments) const { return drive_.yomber(arguments).exitCode; }
+
+  TestDrive drive_;
+};
+
+TEST_F(Commands, WhatIsPutIsThereAsItWas) {
+  fs::create_directories(outside("folder/inner"));
+  write(outside("folder/inner/file"), "deep");
+  write(outside("file"), "content");
+  fs::create_symlink("file", outside("link"));
+  ASSERT_EQ(setxattr(outside("file").c_str(), "user.comment", "mine", 4, 0), 0);
+  const auto put = drive_.json({"put", outside("file"), outside("folder"), outside("link"), "/"});
+  EXPECT_EQ(put.size(), 3U);
+  EXPECT_EQ(drive_.names(), (Names{"file", "folder", "link"}));
+  EXPECT_EQ(read(inside("file")), "content");
+  EXPECT_EQ(read(inside("folder/inner/file")), "deep");
+  EXPECT_EQ(fs::read_symlink(inside("link")), "file");
+  EXPECT_TRUE(fs::exists(outside("file"))) << "a copy leaves what it was made of";
+  EXPECT_EQ(codeOf({"put", outside("nothing")}), 66);
+}
+
+TEST_F(Commands, ATakenNameIsAClashUntilTheUserSaysWhatToDo) {
+  write(outside("report.pdf"), "new");
+  drive_.write("report.pdf", "old");
+  EXPECT_EQ(codeOf({"put", outside("report.pdf")}), 17);
+  EXPECT_EQ(read(inside("report.pdf")), "old");
+
+  const auto both = drive_.json({"put", outside("report.pdf"), "--keep-both"});
+  EXPECT_EQ(both.at(0)["name"], "report 2.pdf");
+  EXPECT_EQ(read(inside("report 2.pdf")), "new");
+
+  const auto replaced = drive_.json({"put", outside("report.pdf"), "--replace"});
+  EXPECT_EQ(replaced.at(0)["name"], "report.pdf");
+  EXPECT_EQ(read(inside("report.pdf")), "new");
+  EXPECT_EQ(drive_.json({"trash", "--list"}).at(0)["name"], "report.pdf")
+      << "what was replaced is not lost";
+}
+
+TEST_F(Commands, RenamesAndMovesKnowClashesToo) {
+  ASSERT_EQ(codeOf({"mkdir", "a", "b"}), 0);
+  drive_.write("a/x", "1");
+  drive_.write("a/y", "2");
+  drive_.write("b/x", "3");
+  EXPECT_EQ(codeOf({"rename", "a/x", "y"}), 17);
+  EXPECT_EQ(codeOf({"mv", "a/x", "b"}), 17);
+  EXPECT_EQ(drive_.json({"rename", "a/x", "y", "--keep-both"}).at(0)["name"], "y 2");
+  EXPECT_EQ(drive_.json({"mv", "a/y 2", "b", "--as", "x", "--keep-both"}).at(0)["name"], "x 2");
+  EXPECT_EQ(drive_.json({"mv", "a/y", "b", "--as", "x", "--replace"}).at(0)["name"], "x");
+  EXPECT_EQ(read(inside("b/x")), "2");
+  EXPECT_EQ(read(inside("b/x 2")), "1");
+  EXPECT_EQ(drive_.names("a"), Names{});
+}
+
+TEST_F(Commands, FoldersAreMadeOnceAndWithThoseAbove) {
+  const auto made = drive_.json({"mkdir", "one/two/three", "--parents"});
+  EXPECT_EQ(made.at(0)["name"], "three");
+  EXPECT_EQ(drive_.json({"mkdir", "one/two/three"}).at(0)["id"], made.at(0)["id"])
+      << "a folder that exists is the answer";
+  EXPECT_EQ(codeOf({"mkdir", "no/such"}), 66);
+  drive_.write("file");
+  EXPECT_EQ(codeOf({"mkdir", "file"}), 17);
+  EXPECT_EQ(codeOf({"mkdir", "one/" + std::string(256, 'n')}), 1);
+}
+
+TEST_F(Commands, WhatIsRemovedIsGoneAndTheRootNeverIs) {
+  ASSERT_EQ(codeOf({"mkdir", "many/inner", "-p"}), 0);
+  drive_.write("many/inner/file");
+  EXPECT_EQ(codeOf({"rm", "many"}), 0);
+  EXPECT_FALSE(fs::exists(inside("many")));
+  EXPECT_EQ(codeOf({"rm", "many"}), 66);
+  for (const char* const command : {"rm", "trash"}) EXPECT_EQ(codeOf({command, "/"}), 1) << command;
+  EXPECT_EQ(codeOf({"rename", "/", "name"}), 1);
+  EXPECT_TRUE(fs::exists(drive_.root()));
+}
+
+TEST_F(Commands, WhatIsGotIsAWholeCopyOutsideOfTheDrive) {
+  ASSERT_EQ(codeOf({"mkdir", "folder/inner", "-p"}), 0);
+  drive_.write("folder/inner/file", "content");
+  fs::create_symlink("inner/file", inside("folder/link"));
+  const auto got = drive_.json({"get", "folder", outside()});
+  EXPECT_EQ(got.at(0)["path"], outside("folder"));
+  EXPECT_EQ(read(outside("folder/inner/file")), "content");
+  EXPECT_EQ(fs::read_symlink(outside("folder/link")), "inner/file");
+  EXPECT_EQ(getxattr(outside("folder/inner/file").c_str(), "user.yomber.id", nullptr, 0), -1)
+      << "the copy is no item of the drive";
+
+  EXPECT_EQ(codeOf({"get", "folder", outside()}), 17);
+  EXPECT_EQ(drive_.json({"get", "folder", outside(), "--keep-both"}).at(0)["path"],
+            outside("folder 2"));
+  drive_.write("folder/inner/file", "newer");
+  EXPECT_EQ(codeOf({"get", "folder", outside(), "--replace"}), 0);
+  EXPECT_EQ(read(outside("folder/inner/file")), "newer");
+  EXPECT_EQ(drive_.json({"get", "folder/inner/file", outside("copy")}).at(0)["path"],
+            outside("copy"));
+  EXPECT_EQ(fs::directory_iterator(outside()) == fs::directory_iterator(), false);
+  for (const auto& entry : fs::directory_iterator(outside())) {
+    EXPECT_NE(entry.path().filename().string().front(), '.') << entry.path();
+  }
+}
+
+TEST_F(Commands, MarksAreSetShownAndTakenAway) {
+  drive_.write("file");
+  const auto tags = [&](Names arguments) {
+    arguments.insert(arguments.begin(), {"tag", "file"});
+    return drive_.json(arguments).at(0)["tags"];
+  };
+  EXPECT_EQ(tags({"red", "two words"}), nlohmann::json({"red", "two words"}));
+  EXPECT_EQ(tags({"blue", "red", "--add"}), nlohmann::json({"red", "two words", "blue"}));
+  EXPECT_EQ(tags({"red", "--remove"}), nlohmann::json({"two words", "blue"}));
+  EXPECT_EQ(tags({}), nlohmann::json({"two words", "blue"}));
+  EXPECT_EQ(tags({"--clear"}), nlohmann::json::array());
+  EXPECT_EQ(drive_.json({"favorite", "file", "7"}).at(0)["favorite_rank"], 7);
+  EXPECT_FALSE(drive_.json({"favorite", "file", "--clear"}).at(0).contains("favorite_rank"));
+  EXPECT_EQ(drive_.json({"used", "file", "--at", "2026-03-01T12:00:00Z"}).at(0)["last_used"],
+            "2026-03-01T12:00:00Z");
+  EXPECT_EQ(codeOf({"used", "file", "--at", "yesterday"}), 64);
+}
+
+TEST_F(Commands, ChangesAreToldSinceTheLastTime) {
+  drive_.write("file");
+  ASSERT_EQ(codeOf({"favorite", "file"}), 0);
+  const auto first = drive_.json({"changes"});
+  ASSERT_EQ(first.size(), 2U);
+  EXPECT_EQ(first[0]["item"]["name"], "file");
+  const std::string token = first[1]["token"];
+  EXPECT_EQ(drive_.json({"changes", "--since", token}).size(), 1U);
+  ASSERT_EQ(codeOf({"rm", "file"}), 0);
+  const auto later = drive_.json({"changes", "--since", token});
+  ASSERT_EQ(later.size(), 2U);
+  EXPECT_EQ(later[0]["event"], "removed");
+  EXPECT_EQ(later[0]["id"], first[0]["item"]["id"]);
+  EXPECT_EQ(codeOf({"changes", "--since", "nonsense"}), 64);
+}
+
+TEST_F(Commands, AManyHandedPutLosesNothing) {
+  Names arguments{"put"};
+  for (int number = 0; number < 100; ++number) {
+    const std::string name = "file " + std::to_string(number);
+    write(outside(name), name);
+    arguments.push_back(outside(name));
+  }
+  arguments.insert(arguments.end(), {"--to", "/"});
+  EXPECT_EQ(drive_.json(arguments).size(), 100U);
+  EXPECT_EQ(drive_.names().size(), 100U);
+  for (const std::string& name : drive_.names()) EXPECT_EQ(read(inside(name)), name);
+}
+
+TEST_F(Commands, ADriveThatIsDownSaysSo) {
+  drive_.down();
+  write(outside("file"), "x");
+  for (const Names& arguments :
+       {Names{"put", outside("file")}, Names{"mkdir", "a"}, Names{"evict", "a"}, Names{"tag", "a"},
+        Names{"changes"}, Names{"trash", "--empty"}, Names{"get", "a"}}) {
+    EXPECT_EQ(codeOf(arguments), 69) << arguments.front();
+  }
+}
+
+}  // namespace
+}  // namespace yomber::testing

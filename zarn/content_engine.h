@@ -115,7 +115,7 @@ class ContentEngine {
   /// Ends the threads; what they were doing goes on after the next start. Wishes end with 3072.
   virtual void stop() = 0;
   /// To be called when a database was built anew: gives jobs to the documents in it.
-  virtual void sweep() = 0;
+  virtual void sweep() {}
   /// The store of the account that is signed in now, under the name that tells accounts apart; null
   /// when nobody is. Jobs belong to the account under which they were made, and wait for it.
   virtual void setStore(std::shared_ptr<ContentStore> contents, const std::string& account) = 0;

@@ -51,7 +51,7 @@ NSErrorRef contentError(NSErrorRef error) {
     case RZErrorStoreFull:
       return NSError::errorWithDomain(
           NSPOSIXErrorDomain, ENOSPC,
-          {{NSLocalizedDescriptionKey, std::string("The disk that holds the store is full.")},
+          {{NSLocalizedDescriptionKey, std::string("The disk is full; make room, then try again.")},
            {NSUnderlyingErrorKey, error}});
     default:
       return error;

@@ -34,6 +34,13 @@ NSErrorRef notSignedIn() {
         std::string("nobody is signed in to the drive: yomber account sign-in NAME")}});
 }
 
+/// Leaves the file closed: nobody else may have it open when it is decided on.
+FaultExamination examineAt(const std::string& path) {
+  const FileDescriptor file(
+      open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  return file ? examineFault(file.get()) : FaultExamination{};
+}
+
 struct Download {
   JobSubject subject;
   bool isByItself = false;  ///< goes on without anybody who waits
@@ -109,9 +116,7 @@ class DownloadBatch {
       if (!error || !error->is(NSPOSIXErrorDomain, EAGAIN)) break;
       // Somebody has written to the fault.
       const std::string& path = download.subject.path;
-      const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-      if (!file) break;
-      if (NSErrorRef failure = core_.settleWritten(path, examineFault(file.get()))) return failure;
+      if (NSErrorRef failure = core_.settleWritten(path, examineAt(path))) return failure;
     }
     if (error && error->is(NSPOSIXErrorDomain, ENOENT)) {
       (void)core_.scanner->scanLocation(download.subject.path, nullptr);

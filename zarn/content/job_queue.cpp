@@ -172,7 +172,12 @@ std::vector<Job> JobQueue::take(JobKind kind, std::size_t limit) {
 
 void JobQueue::release(const std::vector<Job>& jobs) {
   LockGuard guard(mutex_);
-  for (const Job& job : jobs) running_.erase(job.item);
+  for (const Job& job : jobs) {
+    running_.erase(job.item);
+    // What was not done, or is to be tried again, is a row as before.
+    lane(job.kind).mayHaveMore = true;
+    ++lane(job.kind).notes;
+  }
   ++releases_;
   changed_.notifyAll();
 }

@@ -22,6 +22,7 @@
 #include "platform/rozzel/embedded_engine.h"
 #include "zarn/content/content_rows.h"
 #include "zarn/content/content_store.h"
+#include "zarn/content/fault_file.h"
 #include "zarn/content_engine.h"
 #include "zarn/test_drive.h"
 

@@ -89,7 +89,7 @@ class UploadGroup {
 
   NSErrorRef read(Upload& upload) {
     const std::string& path = upload.subject.path;
-    const FileDescriptor file(
+    FileDescriptor file(
         open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
     if (!file) return look(path, errno);
     if (uploadRead.hit()) return NSError::errorWithErrno(EIO, path);
@@ -102,6 +102,7 @@ class UploadGroup {
       default:
         break;
     }
+    file = FileDescriptor();  // nobody else may have it open for that
     if (NSErrorRef error = core_.settleWritten(path, found)) return error;
     return NSError::errorWithErrno(EAGAIN, path);  // as what it is now, the next time
   }

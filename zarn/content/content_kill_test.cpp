@@ -1,0 +1,114 @@
+#include <sys/wait.h>
+
+#include "zarn/content/test_content.h"
+
+namespace yomber {
+namespace {
+
+/// What happens in a process that dies at a fault point is finished by the next one.
+class ContentKillTest : public ContentDrive, public testing::WithParamInterface<const char*> {
+ protected:
+  /// Runs `work` with a drive of its own in a child that ends at the fault point. Threads are not
+  /// carried across a fork: everything of ours is closed before.
+  void dieDuring(const std::string& point, const std::function<void()>& work) {
+    engine->stop();
+    engine.reset();
+    records.reset();
+    close();
+    const pid_t child = fork();
+    if (child == 0) {
+      open();
+      records = std::make_shared<EmbeddedEngine>(storePath);
+      if (FaultPoint::arm(point + "=abort")) _exit(1);
+      options.settlePause = std::chrono::milliseconds(1);
+      startEngine();
+      work();
+      (void)engine->waitUntilIdle(kPatience);
+      // What takes marks off comes after everything else.
+      (void)waitUntil([&] { return false; });
+      _exit(0);
+    }
+    int ending = 0;
+    ASSERT_EQ(waitpid(child, &ending, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(ending)) << point << " was not reached";
+    open();
+    records = std::make_shared<EmbeddedEngine>(storePath);
+    scan();
+    startEngine();
+    ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  }
+};
+
+class UploadKillTest : public ContentKillTest {};
+class EvictionKillTest : public ContentKillTest {};
+class DownloadKillTest : public ContentKillTest {};
+
+TEST_P(UploadKillTest, TheNextProcessGoesOnWithTheUpload) {
+  const std::string text = content(500'000);
+  write("a", text);
+  dieDuring(GetParam(), [&] { scan(); });
+  EXPECT_TRUE(read("a") == text);
+  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_TRUE(contentInStore(id("a")) == text);
+  EXPECT_EQ(engine->transfers().waiting, 0U);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, UploadKillTest,
+                         testing::Values("zarn.upload.read", "zarn.upload.staged",
+                                         "zarn.upload.synced", "zarn.upload.committed",
+                                         "zarn.upload.confirmed"));
+
+TEST_P(EvictionKillTest, TheFileIsWholeOrAFaultAndItsContentComesBack) {
+  const std::string text = content(500'000);
+  write("a", text);
+  settle();
+  const struct stat before = status("a");
+  dieDuring(GetParam(), [&] { (void)evict("a"); });
+  const struct stat after = status("a");
+  EXPECT_EQ(after.st_ino, before.st_ino);
+  EXPECT_EQ(after.st_size, before.st_size);
+  if (!isFault("a")) {
+    EXPECT_TRUE(read("a") == text);
+  }
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == text);
+  EXPECT_EQ(status("a").st_mtim.tv_sec, before.st_mtim.tv_sec);
+  EXPECT_EQ(status("a").st_mtim.tv_nsec, before.st_mtim.tv_nsec);
+  EXPECT_TRUE(contentInStore(id("a")) == text);
+  EXPECT_EQ(evict("a"), nullptr);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, EvictionKillTest,
+                         testing::Values("zarn.evict.leased", "zarn.evict.marked",
+                                         "zarn.evict.synced", "zarn.evict.punched",
+                                         "zarn.evict.stored"));
+
+TEST_P(DownloadKillTest, TheFileIsAFaultUntilItsContentIsWhole) {
+  const std::string text = content(5'000'000);
+  write("a", text);
+  settle();
+  const struct stat before = status("a");
+  ASSERT_EQ(evict("a"), nullptr);
+  dieDuring(GetParam(), [&] { (void)provide("a"); });
+  if (!isFault("a")) {
+    EXPECT_TRUE(read("a") == text);
+  }
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == text);
+  EXPECT_EQ(status("a").st_ino, before.st_ino);
+  EXPECT_EQ(status("a").st_mtim.tv_sec, before.st_mtim.tv_sec);
+  EXPECT_EQ(status("a").st_mtim.tv_nsec, before.st_mtim.tv_nsec);
+  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_TRUE(contentInStore(id("a")) == text);
+  EXPECT_EQ(engine->transfers().waiting, 0U);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, DownloadKillTest,
+                         testing::Values("zarn.download.noted", "zarn.fill.begun",
+                                         "zarn.fill.copying", "zarn.fill.verified",
+                                         "zarn.fill.dated", "zarn.fill.filled",
+                                         "zarn.download.filled", "zarn.settle.synced",
+                                         "zarn.settle.unmarked"));
+
+}  // namespace
+}  // namespace yomber

@@ -1,0 +1,254 @@
+#include <thread>
+
+#include "zarn/content/test_content.h"
+
+namespace yomber {
+namespace {
+
+class ContentUploadsTest : public ContentDrive {
+ protected:
+  /// Stops whoever comes to a fault point until `go`.
+  void stopAt(const std::string& point) {
+    gate_ = layout.home() + "/go-" + point;
+    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate_), nullptr);
+  }
+  bool isStopped() const {
+    return waitUntil([&] { return std::filesystem::exists(gate_ + ".reached"); });
+  }
+  void go() const { std::ofstream(gate_).put('x'); }
+
+  std::string gate_;
+};
+
+TEST_F(ContentUploadsTest, AnEditIsUploadedInPlaceOfWhatWasThere) {
+  write("a", "first");
+  settle();
+  write("a", "second edition");
+  settle();
+  EXPECT_EQ(contentInStore(id("a")), "second edition");
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Confirmed);
+}
+
+TEST_F(ContentUploadsTest, ASecondEditDuringAnUploadIsUploadedToo) {
+  write("a", "first");
+  stopAt("zarn.upload.synced");
+  scan();
+  ASSERT_TRUE(isStopped());
+  write("a", "second edition");
+  scan();
+  go();
+  settle();
+  EXPECT_EQ(contentInStore(id("a")), "second edition");
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Confirmed);
+}
+
+TEST_F(ContentUploadsTest, AnEditThatKeepsSizeAndDateIsUploadedToo) {
+  write("a", "first");
+  settle();
+  const struct stat before = status("a");
+  write("a", "other");
+  const timespec times[2] = {before.st_atim, before.st_mtim};
+  ASSERT_EQ(utimensat(AT_FDCWD, at("a").c_str(), times, 0), 0);
+  settle();
+  EXPECT_EQ(contentInStore(id("a")), "other");
+}
+
+TEST_F(ContentUploadsTest, ARenameChangesTheRecordAndMovesNoContent) {
+  write("a", content(50'000));
+  settle();
+  const std::uint64_t item = id("a");
+  const auto assets = assetFiles();
+  rename("a", "b");
+  settle();
+  EXPECT_EQ(id("b"), item);
+  EXPECT_EQ(nameInStore(item), "b");
+  EXPECT_EQ(assetFiles(), assets);
+  EXPECT_EQ(state("b").upload, ContentState::Upload::Confirmed);
+}
+
+TEST_F(ContentUploadsTest, AFaultThatIsRenamedAndMovedKeepsItsContentInTheStore) {
+  const std::string text = content(200'000);
+  write("a", text);
+  makeFolder("folder");
+  settle();
+  ASSERT_EQ(evict("a"), nullptr);
+  rename("a", "folder/b");
+  settle();
+  EXPECT_EQ(nameInStore(id("folder/b")), "b");
+  EXPECT_TRUE(isFault("folder/b"));
+  ASSERT_EQ(provide("folder/b"), nullptr);
+  EXPECT_EQ(read("folder/b"), text);
+}
+
+TEST_F(ContentUploadsTest, WhatIsRemovedLosesItsRecord) {
+  write("a", "text");
+  settle();
+  const std::uint64_t item = id("a");
+  ASSERT_NE(record(item), nullptr);
+  remove("a");
+  settle();
+  EXPECT_EQ(record(item), nullptr);
+}
+
+TEST_F(ContentUploadsTest, WhatIsRemovedDuringItsUploadLosesItsRecordToo) {
+  write("a", "text");
+  stopAt("zarn.upload.committed");
+  scan();
+  ASSERT_TRUE(isStopped());
+  const std::uint64_t item = id("a");
+  remove("a");
+  scan();
+  go();
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(record(item), nullptr);
+}
+
+TEST_F(ContentUploadsTest, FoldersLinksAndExcludedNamesAreNotUploaded) {
+  makeFolder("folder");
+  write("folder/.x.swp", "text");
+  ASSERT_EQ(symlink("nowhere", at("link").c_str()), 0);
+  settle();
+  EXPECT_EQ(state("folder").upload, ContentState::Upload::None);
+  EXPECT_EQ(state("link").upload, ContentState::Upload::None);
+  EXPECT_TRUE(assetFiles().empty());
+}
+
+TEST_F(ContentUploadsTest, WithTheStoreOutOfReachJobsWaitWithoutCountingAttempts) {
+  goOffline();
+  write("a", "text");
+  scan();
+  ASSERT_TRUE(waitUntil([&] { return engine->transfers().isOffline; }));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Waiting);
+  EXPECT_EQ(state("a").lastFailure, nullptr);
+  EXPECT_EQ(engine->transfers().waiting, 1U);
+  comeBack();
+  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_EQ(contentInStore(id("a")), "text");
+}
+
+TEST_F(ContentUploadsTest, OverQuotaTheJobWaitsAndOthersGoOn) {
+  ASSERT_EQ(records->setQuota("ann", 100'000), nullptr);
+  write("large", content(200'000));
+  write("small", content(1'000, 2));
+  scan();
+  ASSERT_TRUE(waitUntil([&] {
+    const ContentState large = state("large");
+    return large.lastFailure &&
+           large.lastFailure->is(NSCocoaErrorDomain, NSUbiquitousFileNotUploadedDueToQuotaError);
+  }));
+  ASSERT_TRUE(waitUntil([&] { return state("small").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_EQ(evict("large")->code(), QSOstrellErrorCannotEvict);
+  ASSERT_EQ(records->setQuota("ann", std::nullopt), nullptr);
+  engine->retryNow();
+  ASSERT_TRUE(waitUntil([&] { return state("large").upload == ContentState::Upload::Confirmed; }));
+}
+
+TEST_F(ContentUploadsTest, AJobThatFailsIsTriedAgainAndSaysHowOften) {
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  write("a", "text");
+  scan();
+  ASSERT_TRUE(waitUntil([&] {
+    const auto transfers = engine->transfers().transfers;
+    return transfers.size() == 1 && transfers.front().attempts >= 3;
+  }));
+  const auto transfer = engine->transfers().transfers.front();
+  EXPECT_EQ(transfer.path, at("a"));
+  EXPECT_NE(transfer.failure, nullptr);
+  FaultPoint::disarmAll();
+  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+}
+
+TEST_F(ContentUploadsTest, PausesBetweenAttemptsGrowByTheClockThatIsGiven) {
+  const auto now = std::make_shared<std::atomic<std::int64_t>>(1'000'000'000'000'000);
+  engine->stop();
+  options.clock = [now] { return now->load(); };
+  engine.reset();
+  startEngine();
+  engine->stop();
+  engine.reset();
+  options.firstPause = std::chrono::milliseconds(1'000);
+  engine = ContentEngine::create(
+      store, std::make_shared<Scanner>(store, std::weak_ptr<FolderVisitor>()), [&] {
+        auto slow = options;
+        slow.firstPause = std::chrono::milliseconds(1'000);
+        slow.longestPause = std::chrono::milliseconds(3'000);
+        return slow;
+      }());
+  signIn("ann");
+  engine->start();
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  write("a", "text");
+  scan();
+  constexpr std::int64_t kSecond = 1'000'000'000;
+  const std::vector<std::int64_t> pauses{1 * kSecond, 2 * kSecond, 3 * kSecond, 3 * kSecond};
+  for (std::uint32_t attempt = 1; attempt <= pauses.size(); ++attempt) {
+    ContentTransfers found;
+    ASSERT_TRUE(waitUntil([&] {
+      found = engine->transfers();
+      return found.transfers.size() == 1 && !found.transfers.front().isRunning &&
+             found.transfers.front().attempts == attempt;
+    }));
+    ASSERT_TRUE(found.transfers.front().nextAttempt);
+    EXPECT_EQ(*found.transfers.front().nextAttempt - now->load(), pauses[attempt - 1]);
+    now->store(*found.transfers.front().nextAttempt);
+  }
+}
+
+TEST_F(ContentUploadsTest, SignedOutJobsWaitAndNoOtherAccountSeesThem) {
+  write("a", "of ann");
+  settle();
+  engine->setStore(nullptr, {});
+  write("b", "of ann, too");
+  settle();
+  EXPECT_EQ(state("b").upload, ContentState::Upload::Waiting);
+  signIn("bob");
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(engine->transfers().waiting, 0U);
+  EXPECT_EQ(record(id("b"), "bob"), nullptr);
+  EXPECT_EQ(record(id("b"), "ann"), nullptr);
+  signIn("ann");
+  ASSERT_TRUE(waitUntil([&] { return state("b").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_EQ(contentInStore(id("b")), "of ann, too");
+}
+
+TEST_F(ContentUploadsTest, WhatWasMadeBeforeAnybodySignedInIsTheFirstAccounts) {
+  engine->stop();
+  engine.reset();
+  startEngine("");
+  write("a", "text");
+  settle();
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Waiting);
+  signIn("ann");
+  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+}
+
+TEST_F(ContentUploadsTest, DocumentsOfARebuiltDatabaseAreGivenJobs) {
+  write("a", "text");
+  const std::string away = content(100'000);
+  write("b", away);
+  settle();
+  ASSERT_EQ(evict("b"), nullptr);
+  const std::uint64_t item = id("b");
+  engine->stop();
+  engine.reset();
+  close();
+  for (const char* suffix : {"", "-wal", "-shm"}) {
+    std::filesystem::remove(layout.databasePath() + suffix);
+  }
+  open();
+  startEngine();
+  scan();
+  engine->sweep();
+  ASSERT_TRUE(waitUntil([&] {
+    return state("a").upload == ContentState::Upload::Confirmed &&
+           state("b").upload == ContentState::Upload::Confirmed;
+  }));
+  EXPECT_EQ(id("b"), item);
+  ASSERT_EQ(provide("b"), nullptr);
+  EXPECT_EQ(read("b"), away);
+  ASSERT_EQ(evict("b"), nullptr);
+}
+
+}  // namespace
+}  // namespace yomber

@@ -22,6 +22,7 @@
 #include "zarn/bulk_load.h"
 #include "zarn/busy_files.h"
 #include "zarn/connection.h"
+#include "zarn/recent_backups.h"
 #include "zarn/schema.h"
 #include "zarn/write_transaction.h"
 
@@ -143,6 +144,7 @@ struct Database::State {
   std::vector<std::weak_ptr<ChangeSink>> sinks GUARDED_BY(sinksMutex);
   std::weak_ptr<CommitParticipant> participant GUARDED_BY(sinksMutex);
   BusyFiles busyFiles;
+  RecentBackups recentBackups;
 
   std::thread thread;
   std::thread checkpointer;
@@ -235,7 +237,7 @@ void Database::State::runBatch(std::vector<Task>& batch) {
     for (Task& task : batch) task.result = error;
     return;
   }
-  WriteTransaction transaction(*writer, rank, nowNanoseconds(), busyFiles);
+  WriteTransaction transaction(*writer, rank, nowNanoseconds(), busyFiles, recentBackups);
   std::function<void()> afterwards;
   try {
     writer->execute("BEGIN");
@@ -548,6 +550,7 @@ void Database::setParticipant(std::weak_ptr<CommitParticipant> participant) {
 }
 
 BusyFiles& Database::busyFiles() const { return state_->busyFiles; }
+RecentBackups& Database::recentBackups() const { return state_->recentBackups; }
 
 void Database::addSink(std::weak_ptr<ChangeSink> sink) {
   LockGuard guard(state_->sinksMutex);

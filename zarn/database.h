@@ -13,6 +13,7 @@
 namespace yomber {
 
 class BusyFiles;
+class RecentBackups;
 class Connection;
 class WriteTransaction;
 class BulkLoad;
@@ -78,6 +79,7 @@ class Database {
   /// Held weakly; replaces the one before.
   void setParticipant(std::weak_ptr<CommitParticipant> participant);
   [[nodiscard]] BusyFiles& busyFiles() const;
+  [[nodiscard]] RecentBackups& recentBackups() const;
 
   /// No complete scan of the tree has been stored yet.
   [[nodiscard]] bool needsFirstScan() const;

@@ -131,6 +131,8 @@ class Reconciler {
   void decide(WriteTransaction& transaction, Candidate& candidate);
   void decideOpen(WriteTransaction& transaction);
   bool takeReplaced(WriteTransaction& transaction, Candidate& candidate);
+  bool takeBackedUp(WriteTransaction& transaction, Candidate& candidate,
+                    const std::optional<ItemRow>& own);
   void move(WriteTransaction& transaction, const Candidate& candidate, const ItemRow& row);
   void postpone(const Candidate& candidate);
   void add(WriteTransaction& transaction, const Candidate& candidate);

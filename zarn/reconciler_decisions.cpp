@@ -60,13 +60,39 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
   return true;
 }
 
+/// The new file of a document whose old one has just become a backup.
+bool Reconciler::takeBackedUp(WriteTransaction& transaction, Candidate& candidate,
+                              const std::optional<ItemRow>& own) {
+  if (candidate.entry.type != EntryType::File) return false;
+  if (own && (own->flags & row_flag::kUploaded) != 0) return false;
+  const auto backup = transaction.recentBackups().take(candidate.parent, candidate.name);
+  if (!backup || (own && own->id == backup->item)) return false;
+  const auto row = findByID(transaction.connection(), backup->item);
+  const bool isBackup = row && row->parent == candidate.parent &&
+                        row->nameOnDisk() == backup->backupName &&
+                        isSameType(*row, candidate.entry);
+  if (!isBackup) return false;
+  if (own) {
+    gone_.erase(own->id);
+    transaction.remove(*own);
+  }
+  gone_.erase(row->id);
+  candidate.attributes.id.reset();
+  (void)storeChanged(transaction, candidate, *row);
+  // What is there now, if it is still there, is a file of its own.
+  noteConflict(candidate.parent, backup->backupName);
+  return true;
+}
+
 void Reconciler::decide(WriteTransaction& transaction, Candidate& candidate) {
   if (!isStillThere(candidate)) {
     // What it replaced is decided on with whatever is there now.
     gone_.erase(candidate.replaced);
     return;
   }
-  if (const auto own = findOwnRow(transaction, candidate)) {
+  const auto own = findOwnRow(transaction, candidate);
+  if (takeBackedUp(transaction, candidate, own)) return;
+  if (own) {
     if (isNewer(own->rank, candidate.rankBefore)) {
       noteConflict(candidate.parent, candidate.name);
     } else {
@@ -86,6 +112,10 @@ void Reconciler::move(WriteTransaction& transaction, const Candidate& candidate,
                       const ItemRow& row) {
   gone_.erase(row.id);
   if (!storeChanged(transaction, candidate, row)) return postpone(candidate);
+  const std::string& name = row.nameOnDisk();
+  const bool isBackup = row.kind == ItemKind::Document && row.parent == candidate.parent &&
+                        isBackupName(candidate.name, name);
+  if (isBackup) transaction.recentBackups().note(row.id, row.parent, name, candidate.name);
   if (candidate.entry.type == EntryType::Folder && candidate.snapshot != nullptr) {
     noteFolder(*candidate.snapshot, candidate.entry, row.id, false);
   }

@@ -10,6 +10,7 @@
 #include "zarn/busy_files.h"
 #include "zarn/connection.h"
 #include "zarn/item_row.h"
+#include "zarn/recent_backups.h"
 
 namespace yomber {
 
@@ -24,8 +25,12 @@ inline constexpr std::int64_t kMaximumTombstones = 100'000;
 class WriteTransaction {
  public:
   WriteTransaction(Connection& connection, std::uint64_t rank, std::int64_t now,
-                   const BusyFiles& busyFiles)
-      : connection_(connection), rank_(rank), now_(now), busyFiles_(busyFiles) {}
+                   const BusyFiles& busyFiles, RecentBackups& recentBackups)
+      : connection_(connection),
+        rank_(rank),
+        now_(now),
+        busyFiles_(busyFiles),
+        recentBackups_(recentBackups) {}
 
   [[nodiscard]] Connection& connection() { return connection_; }
   /// Of the last change so far.
@@ -37,6 +42,7 @@ class WriteTransaction {
   [[nodiscard]] std::int64_t now() const { return now_; }
   /// See BusyFiles.
   [[nodiscard]] bool isBusy(std::uint64_t inode) const { return busyFiles_.contains(inode); }
+  [[nodiscard]] RecentBackups& recentBackups() { return recentBackups_; }
 
   /// An id that no item has.
   [[nodiscard]] std::uint64_t issueID();
@@ -86,6 +92,7 @@ class WriteTransaction {
   std::uint64_t rank_;
   const std::int64_t now_;
   const BusyFiles& busyFiles_;
+  RecentBackups& recentBackups_;
   std::vector<ItemChange> changes_;
   std::vector<std::uint64_t> touched_;
 };

@@ -37,13 +37,6 @@ std::optional<std::int64_t> optionalFromWire(protocol::OptionalInt64::Reader rea
   return reader.getValue();
 }
 
-NSErrorRef noEngineError() {
-  return NSError::errorWithDomain(
-      NSCocoaErrorDomain, NSUbiquitousFileUnavailableError,
-      {{NSLocalizedDescriptionKey,
-        std::string("the drive's content is not served yet; try again")}});
-}
-
 Wire::State::Local wireLocal(ContentState::Local local) {
   switch (local) {
     case ContentState::Local::Here:
@@ -171,7 +164,6 @@ kj::Promise<void> ContentServer::runUntilDone(Context context, Begin begin) {
   return ready
       .then([engine = engine_,
              begin = std::move(begin)](NSErrorRef failure) mutable -> kj::Promise<NSErrorRef> {
-        if (!failure && !engine) failure = noEngineError();
         if (failure) return kj::mv(failure);
         return PendingWish::start(std::move(engine), std::move(begin));
       })
@@ -203,8 +195,7 @@ kj::Promise<void> ContentServer::setPinned(SetPinnedContext context) {
       context, SignedIn::NotNeeded,
       [engine = engine_, path = stringFromWire(params.getPath()),
        isPinned = params.getPinned()](const ipc::CancelFlag&) {
-        return Failure{.value = {},
-                       .error = engine ? engine->setPinned(path, isPinned) : noEngineError()};
+        return Failure{.value = {}, .error = engine->setPinned(path, isPinned)};
       },
       [](auto results, const Failure& outcome) {
         ipc::encodeOptional(outcome.error, results.initFailure());
@@ -218,11 +209,7 @@ kj::Promise<void> ContentServer::contentState(ContentStateContext context) {
       [engine = engine_,
        path = stringFromWire(context.getParams().getPath())](const ipc::CancelFlag&) {
         Found found;
-        if (engine) {
-          found.value = engine->contentState(path, &found.error);
-        } else {
-          found.error = noEngineError();
-        }
+        found.value = engine->contentState(path, &found.error);
         return found;
       },
       [](auto results, const Found& found) {
@@ -235,7 +222,7 @@ kj::Promise<void> ContentServer::transfers(TransfersContext context) {
   context.releaseParams();
   context.allowCancellation();
   return ipc::onPool([engine = engine_](const ipc::CancelFlag&) {
-           return engine ? engine->transfers(kMaximumTransfers) : ContentTransfers();
+           return engine->transfers(kMaximumTransfers);
          })
       .then([context](ContentTransfers found) mutable {
         auto results = context.getResults();

@@ -96,6 +96,7 @@ TEST_F(DaemonWatchingTest, AWatchIsActiveBeforeAnyLaterCallOfItsConnectionAndBri
   using protocol::ItemSender;
   write("folder/there");
   upSignedIn();
+  EXPECT_THAT(list(), ElementsAre("folder"));  // over an empty database calls wait for the scan
   constexpr int kRounds = 50;
   std::vector<Subscribed> subscribed;
   Gate watched;

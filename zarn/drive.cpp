@@ -1,5 +1,8 @@
 #include "zarn/drive.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <chrono>
 #include <thread>
@@ -10,6 +13,8 @@
 #include "platform/foundation/lock.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
+#include "platform/rozzel/embedded_engine.h"
+#include "zarn/content/content_store.h"
 
 namespace yomber {
 
@@ -29,6 +34,25 @@ NSErrorRef folderError(int number, const TreeLayout& layout) {
       {{NSFilePathErrorKey, layout.tree()},
        {NSLocalizedDescriptionKey, "the drive's folders cannot be made in " + layout.home() + ": " +
                                        cause->localizedDescription()}});
+}
+
+/// The store is made once. One that is missing later is out of reach: an empty one in its place
+/// would have lost everything that is not here.
+void makeStoreOnce(const DrivePaths& paths) {
+  const std::string mark = paths.home + "/store.made";
+  if (access(mark.c_str(), F_OK) == 0) return;
+  NSErrorRef error = EmbeddedEngine::create(paths.store);
+  if (!error) {
+    const FileDescriptor made(open(mark.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+    if (!made) error = NSError::errorWithErrno(errno, mark);
+  }
+  if (error) log_error(defaultLog(), "[ERROR] the record store cannot be made: %@", error);
+}
+
+RZEngineRef openStore(const DrivePaths& paths, const std::shared_ptr<ContentEngine>& other) {
+  if (other) return nullptr;
+  makeStoreOnce(paths);
+  return std::make_shared<EmbeddedEngine>(paths.store);
 }
 
 }  // namespace
@@ -132,11 +156,13 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
       setters(std::make_shared<ItemSetters>(store, scanner)),
       moves(std::make_shared<MoveCapabilities>(store, scanner, trash)),
       locations(std::make_shared<ItemLocations>(store, scanner, containers)),
-      engine(std::move(options.engine)),
-      workingSetSignals_(
-          std::make_shared<WorkingSetSignals>(feed, [weak = std::weak_ptr(registrations)] {
-            if (const auto strong = weak.lock()) strong->workingSetDidChange();
-          })) {
+      engine(options.engine ? options.engine : ContentEngine::create(store, scanner, {})),
+      workingSetSignals_(std::make_shared<WorkingSetSignals>(feed,
+                                                             [weak = std::weak_ptr(registrations)] {
+                                                               if (const auto strong = weak.lock())
+                                                                 strong->workingSetDidChange();
+                                                             })),
+      records_(openStore(paths, options.engine)) {
   database->addSink(observer);
   database->addSink(watchers);
   database->addSink(workingSetSignals_);
@@ -150,6 +176,8 @@ void Drive::start() {
     workingSetSignals_->start();
     firstScan->open();
   }
+  updateStore();
+  engine->start();
   // Before the scan, so that it looks into the containers' folders too.
   (void)containers->start(
       {.apply = [this](const auto& folders) { return applyContainers(folders); },
@@ -165,6 +193,7 @@ void Drive::start() {
 }
 
 void Drive::stop() {
+  engine->stop();
   containers->stop();
   observer->stop();
   housekeeping_.reset();
@@ -195,6 +224,8 @@ NSErrorRef Drive::scanAll() {
   if (isFirst) {
     workingSetSignals_->start();
     firstScan->open();
+    updateStore();
+    engine->sweep();
   }
   return nullptr;
 }
@@ -212,7 +243,20 @@ NSErrorRef Drive::applyContainers(const std::vector<ContainerFolder>& folders) {
 
 void Drive::accountDidChange() {
   if (auto error = accountError()) watchers->failAll(error);
+  updateStore();
   registrations->accountTokenDidChange();
+}
+
+void Drive::updateStore() {
+  // A first scan starts with a database of its own; it is told of the account then.
+  if (!records_ || database->needsFirstScan()) return;
+  LockGuard guard(storeMutex_);
+  const auto current = account->current();
+  if (current) {
+    engine->setStore(std::make_shared<ContentStore>(records_, current->name), current->name);
+  } else {
+    engine->setStore(nullptr, {});
+  }
 }
 
 NSErrorRef Drive::accountError() const { return account->current() ? nullptr : loggedOutError(); }

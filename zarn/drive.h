@@ -7,6 +7,8 @@
 
 #include "platform/foundation/drive_paths.h"
 #include "platform/foundation/error.h"
+#include "platform/foundation/lock.h"
+#include "platform/rozzel/engine.h"
 #include "zarn/account.h"
 #include "zarn/change_feed.h"
 #include "zarn/containers.h"
@@ -41,7 +43,7 @@ class Drive : public std::enable_shared_from_this<Drive> {
     Watchers::Options watchers;
     /// Where `.desktop` files are looked for.
     std::vector<std::string> applications = applicationDirectories();
-    /// Moves the items' content.
+    /// In the place of the drive's own, which then has no record store.
     std::shared_ptr<ContentEngine> engine;
   };
 
@@ -86,10 +88,14 @@ class Drive : public std::enable_shared_from_this<Drive> {
   [[nodiscard]] NSErrorRef scanAll();
   [[nodiscard]] NSErrorRef applyContainers(const std::vector<ContainerFolder>& folders);
   void accountDidChange();
+  /// Gives the engine the store of whoever is signed in, once there are rows.
+  void updateStore();
 
   class Housekeeping;
   std::atomic<bool> hasBegunScanning_{false};
   const std::shared_ptr<WorkingSetSignals> workingSetSignals_;
+  const RZEngineRef records_;  ///< null in the company of another engine
+  Mutex storeMutex_;  ///< held while the engine is told, so that the last one told is right
   std::unique_ptr<Housekeeping> housekeeping_;
 };
 

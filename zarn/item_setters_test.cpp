@@ -251,6 +251,24 @@ TEST_F(ItemSettersTest, GivesAFileItsTagsOnceItCanCarryThem) {
   EXPECT_THAT(extraOf("two.txt").tags, ElementsAre("others"));
 }
 
+TEST_F(ItemSettersTest, LeavesADocumentItsTagsWhenItIsSavedAnew) {
+  write("a.txt", "first");
+  EXPECT_EQ(tag("a.txt", {"work"}), nullptr);
+  const std::uint64_t before = id("a.txt");
+  write(".a.txt.new", "second");
+  rename(".a.txt.new", "a.txt");
+  scan();
+  EXPECT_EQ(id("a.txt"), before);
+  EXPECT_THAT(extraOf("a.txt").tags, ElementsAre("work"));
+  EXPECT_EQ(attributeOf("a.txt", kTagsAttribute), "work");
+  write(".a.txt.new", "third");
+  setAttribute(".a.txt.new", kTagsAttribute, "of its own");
+  rename(".a.txt.new", "a.txt");
+  scan();
+  EXPECT_EQ(id("a.txt"), before);
+  EXPECT_THAT(extraOf("a.txt").tags, ElementsAre("of its own"));
+}
+
 TEST_F(ItemSettersTest, TakesPhysicalLocationsToo) {
   write("e\xcc\x81");
   write("\xc3\xa9");

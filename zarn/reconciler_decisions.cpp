@@ -44,7 +44,7 @@ bool Reconciler::isStillThere(const Candidate& candidate) {
 bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidate) {
   const auto place = gone_.find(candidate.replaced);
   if (place == gone_.end() || candidate.entry.type != EntryType::File) return false;
-  const ItemRow replaced = place->second;
+  ItemRow replaced = place->second;
   if (!isSameType(replaced, candidate.entry) || isElsewhere(replaced)) return false;
   if (!isStillThere(candidate)) return false;
   const auto own = findOwnRow(transaction, candidate);
@@ -56,6 +56,8 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
   }
   gone_.erase(replaced.id);
   candidate.attributes.id.reset();
+  // Its tags too, where the program that saved it did not copy them.
+  if (candidate.attributes.extra.isEmpty()) replaced.flags |= row_flag::kKeepsExtra;
   (void)storeChanged(transaction, candidate, replaced);  // a file
   return true;
 }

@@ -91,7 +91,7 @@ class UploadGroup {
     const std::string& path = upload.subject.path;
     FileDescriptor file(
         open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
-    if (!file) return look(path, errno);
+    if (!file) return look(upload, errno);
     if (uploadRead.hit()) return NSError::errorWithErrno(EIO, path);
     const FaultExamination found = examineFault(file.get());
     switch (found.condition) {
@@ -108,9 +108,13 @@ class UploadGroup {
   }
 
   /// The row is behind the disk.
-  NSErrorRef look(const std::string& path, int number) {
-    NSErrorRef error;
-    (void)core_.scanner->scanLocation(path, &error);
+  NSErrorRef look(const Upload& upload, int number) {
+    const std::string& path = upload.subject.path;
+    // A file that does not carry its id yet may have moved: only a scan of both places knows it
+    // again, and the observer makes one.
+    const bool mayHaveMoved =
+        number == ENOENT && (upload.subject.row->flags & row_flag::kStamped) == 0;
+    if (!mayHaveMoved) (void)core_.scanner->scanLocation(path);
     return NSError::errorWithErrno(number, path);
   }
 
@@ -123,7 +127,7 @@ class UploadGroup {
   NSErrorRef readContent(Upload& upload, int file) {
     struct stat status{};
     if (fstat(file, &status) != 0) return NSError::errorWithErrno(errno, upload.subject.path);
-    if (!S_ISREG(status.st_mode)) return look(upload.subject.path, ESTALE);
+    if (!S_ISREG(status.st_mode)) return look(upload, ESTALE);
     FileStamp stamp = FileStamp::of(status);
     ContentRow& confirmed = upload.confirmed;
     if (confirmed.content && confirmed.stamp == stamp) return nullptr;

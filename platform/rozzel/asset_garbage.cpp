@@ -24,7 +24,12 @@ namespace {
 constexpr std::int64_t kRecordsAtOnce = 500;
 constexpr std::size_t kAssetsAtOnce = 64;
 
+FaultPoint whenChosen("rozzel.garbage.chosen");
 FaultPoint whenMovedAway("rozzel.garbage.moved");
+
+void pass(FaultPoint& point) {
+  if (point.hit()) throwErrno("dropping assets was told to fail", EIO);
+}
 
 std::string_view hashBytes(const RZAsset& asset) {
   // NOLINTNEXTLINE: a hash is bytes to SQLite.
@@ -87,7 +92,11 @@ class AssetDropper {
     if (candidates_.size() >= kAssetsAtOnce) drop();
   }
 
+  /// What was chosen may have been stored or referred to again since: looks once more, now that
+  /// nobody can.
   void drop() {
+    if (candidates_.empty()) return;
+    pass(whenChosen);
     std::vector<std::string> away;
     {
       const AssetLock lock(folder_, AssetLock::Kind::Dropping);
@@ -95,7 +104,7 @@ class AssetDropper {
       for (const RZAsset& asset : candidates_) {
         if (!isUsed(asset)) moveAway(asset, away);
       }
-      if (whenMovedAway.hit()) throwErrno("dropping assets was told to fail", EIO);
+      pass(whenMovedAway);
       transaction.commit();
     }
     // Large files take long to go, so nobody waits for this.

@@ -4,13 +4,16 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "platform/foundation/fault_points.h"
 #include "platform/rozzel/hashed_copy.h"
 #include "platform/rozzel/sha256.h"
 #include "platform/rozzel/test_store.h"
@@ -422,6 +425,49 @@ TEST_F(AssetGarbageTest, LeavesFilesAloneThatAreNoAssets) {
   now_ += 10'000 * kDay;
   collect();
   EXPECT_EQ(access(stray.c_str(), F_OK), 0);
+}
+
+/// What happens to an asset after it was chosen to be dropped, and before it is.
+class AssetGarbageChoiceTest : public AssetGarbageTest {
+ protected:
+  void collectWhile(const std::function<void()>& work) {
+    TemporaryDirectory directory;
+    const std::string go = directory / "go";
+    ASSERT_EQ(FaultPoint::arm("rozzel.garbage.chosen=pause-until-file:" + go), nullptr);
+    std::thread collector([&] { collect(); });
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    while (access((go + ".reached").c_str(), F_OK) != 0 &&
+           std::chrono::steady_clock::now() < deadline) {
+      std::this_thread::yield();
+    }
+    EXPECT_EQ(access((go + ".reached").c_str(), F_OK), 0);
+    work();
+    newFile(go);
+    collector.join();
+    FaultPoint::disarmAll();
+  }
+};
+
+TEST_F(AssetGarbageChoiceTest, IsTakenBackWhenARecordRefersToItAgain) {
+  const RZAsset stray = storeText(*store_.engine(), "stray");
+  const RZAsset released = storeText(*store_.engine(), "released");
+  ASSERT_EQ(save(store_.database(), {newRecord("a", {{"content", released}})}), nullptr);
+  ASSERT_EQ(remove(store_.database(), recordID("a")), nullptr);
+  now_ += 2 * kDay;
+  collectWhile([&] {
+    EXPECT_EQ(save(store_.database(), {newRecord("b", {{"x", stray}, {"y", released}})}), nullptr);
+  });
+  EXPECT_EQ(store_.engine()->verifyAsset(stray, {}), nullptr);
+  EXPECT_EQ(store_.engine()->verifyAsset(released, {}), nullptr);
+}
+
+TEST_F(AssetGarbageChoiceTest, IsTakenBackWhenTheContentIsStoredAgain) {
+  const RZAsset stray = storeText(*store_.engine(), "stray");
+  const RZAsset dropped = storeText(*store_.engine(), "dropped");
+  now_ += 2 * kDay;
+  collectWhile([&] { storeText(*store_.engine(), "stray"); });
+  EXPECT_EQ(store_.engine()->verifyAsset(stray, {}), nullptr);
+  EXPECT_FALSE(isThere(dropped));
 }
 
 TEST(AssetGarbageRaceTest, NeverDropsWhatASaveHasJustReferredTo) {

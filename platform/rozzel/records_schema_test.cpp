@@ -163,8 +163,15 @@ TEST(RecordsSchemaTest, RefusesAStoreOfALaterVersionAndLeavesItAlone) {
   TestStore store;
   ASSERT_EQ(save(store.database(), {newRecord("a")}), nullptr);
   store.close();
-  runSql(databaseOf(store), "PRAGMA user_version=99");
+  {
+    // As a kill would leave it: the last change is in the log alone.
+    RecordsConnection later(databaseOf(store), RecordsConnection::Missing::Fail, 1000);
+    later.setWriteBackOnClose(false);
+    later.execute("PRAGMA user_version=99");
+  }
   const std::string before = fileBytes(databaseOf(store));
+  const std::string logBefore = fileBytes(databaseOf(store) + "-wal");
+  ASSERT_FALSE(logBefore.empty());
   store.reopen();
   NSErrorRef error;
   EXPECT_EQ(store.database()->fetchRecord(recordID("a"), &error), nullptr);
@@ -172,7 +179,9 @@ TEST(RecordsSchemaTest, RefusesAStoreOfALaterVersionAndLeavesItAlone) {
   EXPECT_NE(error->localizedDescription().find("99"), std::string::npos);
   EXPECT_TRUE(rz_isError(save(store.database(), {newRecord("b")}), RZErrorStoreTooNew));
   EXPECT_TRUE(rz_isError(EmbeddedEngine::create(store.folder()), RZErrorStoreTooNew));
+  store.close();
   EXPECT_EQ(fileBytes(databaseOf(store)), before);
+  EXPECT_EQ(fileBytes(databaseOf(store) + "-wal"), logBefore);
   EXPECT_EQ(versionOf(databaseOf(store)), 99);
 }
 

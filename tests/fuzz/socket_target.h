@@ -16,8 +16,8 @@
 
 namespace yomber::fuzz {
 
-/// How long a well-behaved peer waits while another one misbehaves, on a busy machine; less than the
-/// fuzzer's own time-out, so that the input is kept with the reason.
+/// How long a well-behaved peer waits while another one misbehaves, on a busy machine; less than
+/// the fuzzer's own time-out, so that the input is kept with the reason.
 inline constexpr ipc::CallOptions kPatience{.timeout = std::chrono::milliseconds{30'000}};
 
 inline void expectAnswer(const NSErrorRef& error) {

@@ -44,7 +44,7 @@ using Options = std::shared_ptr<ChangeOptions>;
 
 /// What a command on items needs; prints what comes of each.
 struct ChangeRun {
-  ChangeRun(CommandContext& given) : context(given), client(given.paths()) {
+  explicit ChangeRun(CommandContext& given) : context(given), client(given.paths()) {
     NSErrorRef error;
     changes = DriveChanges::open(client, &error);
     if (!changes) context.fail(error);
@@ -113,6 +113,21 @@ ChangeResult importAs(const DriveChanges& changes, const DrivePaths& paths,
   return changes.importDocument(copy, parent);
 }
 
+/// False, and said so, when there is no such folder to put something into.
+bool identifyTarget(ChangeRun& run, const std::string& target, std::string& identifier) {
+  const NSErrorRef error = run.client.identifierFor(target, identifier);
+  if (!error) return true;
+  const bool isMissing = exitCodeFor(error) == ExitCode::NoSuchItem;
+  if (!isMissing) {
+    run.context.fail(error);
+  } else {
+    run.context.fail(ExitCode::NoSuchItem,
+                     "there is no folder " + printableName(target) +
+                         " in the drive; the folder comes last, and / is the root");
+  }
+  return false;
+}
+
 /// Without --to, the last of several arguments is the folder, as shells have it.
 void takeTarget(ChangeOptions& options) {
   if (!options.target.empty() || options.arguments.size() < 2) return;
@@ -125,7 +140,7 @@ void runPut(CommandContext& context, const ChangeOptions& given) {
   takeTarget(options);
   ChangeRun run(context);
   std::string parent;
-  if (!run.isReady() || !run.identify(options.target, parent)) return;
+  if (!run.isReady() || !identifyTarget(run, options.target, parent)) return;
   const DrivePaths paths = context.paths();
   sideBySide(options.arguments.size(), atATime, [&](std::size_t index) {
     const std::string source = absolutePath(options.arguments[index]);
@@ -194,7 +209,7 @@ void runMove(CommandContext& context, const ChangeOptions& given) {
   }
   ChangeRun run(context);
   std::string parent;
-  if (!run.isReady() || !run.identify(options.target, parent)) return;
+  if (!run.isReady() || !identifyTarget(run, options.target, parent)) return;
   for (const std::string& argument : options.arguments) {
     std::string identifier;
     ItemFields item;

@@ -19,7 +19,7 @@ NSErrorRef withAdvice(const NSErrorRef& error) {
 
 ChangeResult replaceWith(const DriveChanges& changes, const ItemFields& inTheWay,
                          const std::function<ChangeResult()>& attempt) {
-  const ChangeResult trashed = changes.trash(inTheWay.identifier);
+  ChangeResult trashed = changes.trash(inTheWay.identifier);
   if (trashed.error) return trashed;
   ChangeResult result = attempt();
   if (result.error) (void)changes.untrash(inTheWay.identifier, inTheWay.parentIdentifier);

@@ -103,16 +103,15 @@ NSErrorRef ContentCore::readSubjects(const std::vector<Job>& jobs,
     for (const Job& job : jobs) {
       JobSubject& subject = found.emplace_back();
       subject.job = job;
-      if (job.seq == 0) {
-        if (const auto stored = findJob(connection, job.item, job.kind)) subject.job = *stored;
-      }
+      const auto stored = findJob(connection, job.item, job.kind);
+      if (job.seq == 0 && stored) subject.job = *stored;
+      subject.isStale = job.seq != 0 && (!stored || stored->seq != job.seq);
       subject.row = findByID(connection, job.item);
       subject.content = findContent(connection, job.item);
       if (!subject.row) continue;
       subject.zone =
           zoneOf(connection, job.item, subject.content ? subject.content->zone : std::string());
       subject.isPinned = mayBePinned && isPinned(connection, job.item);
-      subject.isUploadDue = findJob(connection, job.item, JobKind::Upload).has_value();
     }
   });
   for (JobSubject& subject : found) {

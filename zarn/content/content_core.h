@@ -29,7 +29,7 @@ struct JobSubject {
   std::string path;  ///< on this disk; empty when the item is gone
   std::string zone;  ///< where its record belongs now
   bool isPinned = false;
-  bool isUploadDue = false;
+  bool isStale = false;  ///< the job was ended, or replaced, before it was handed out
 };
 
 /// What the workers of the engine share.

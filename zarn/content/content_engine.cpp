@@ -194,7 +194,9 @@ std::unique_ptr<ContentWish> Engine::startProviding(std::string_view path, std::
     const bool isToCome =
         physical && (isLeaving || (options & kAfterWhatGoesOn) != 0 || isFaultAtPath(*physical));
     if (!physical && !error) error = noSuchFile(path);
-    if (isToCome) {
+    if (isToCome && core_->queue->isEnding()) {
+      error = cancelled();
+    } else if (isToCome) {
       auto wish = std::make_unique<WaitingWish>(core_, row->id, std::move(completion));
       core_->queue->pushUrgent(row->id);
       return wish;
@@ -212,6 +214,7 @@ void Engine::evict(std::string_view path, Completion completion) {
         QSOstrellErrorDomain, QSOstrellErrorCannotEvict,
         {{NSLocalizedDescriptionKey, std::string("only documents can be given up")}});
   }
+  if (!error && core_->queue->isEnding()) error = cancelled();
   if (error) {
     if (completion) completion(error);
     return;

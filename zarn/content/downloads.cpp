@@ -21,6 +21,8 @@ FaultPoint downloadFilled("zarn.download.filled");
 FaultPoint settleSynced("zarn.settle.synced");
 
 constexpr int kAttempts = 3;
+/// Downloads of so much together are stored and answered at once.
+constexpr std::uint64_t kBytesTogether = 1 << 20;
 
 NSErrorRef noSuchFile(const std::string& path) {
   return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
@@ -59,12 +61,27 @@ class DownloadBatch {
       for (const Job& job : jobs) answer(job.item, error);
       return;
     }
+    std::uint64_t bytes = 0;
     for (std::size_t i = 0; i < subjects.size(); ++i) {
+      if (subjects[i].isStale) continue;
       const bool isByItself = jobs[i].seq != 0 || subjects[i].isPinned;
+      // Asked for once more than there were wishes, or taken back.
+      if (!isByItself && !core_.wishes.isWanted(subjects[i].job.item)) continue;
+      bytes += subjects[i].row ? subjects[i].row->size : 0;
       Download& download = downloads_.emplace_back();
       download.subject = std::move(subjects[i]);
       download.isByItself = isByItself;
+      // Nobody is to wait for what others have wished for, unless it takes no time.
+      if (bytes < kBytesTogether) continue;
+      runTogether();
+      bytes = 0;
     }
+    runTogether();
+  }
+
+ private:
+  void runTogether() {
+    if (downloads_.empty()) return;
     noteJobs();
     std::vector<BusyFile> busy;
     for (Download& download : downloads_) {
@@ -77,9 +94,9 @@ class DownloadBatch {
       if (error && !download.error) download.error = error;
       finish(download);
     }
+    downloads_.clear();
   }
 
- private:
   /// What changes a file before it is whole again is written down first.
   void noteJobs() {
     std::vector<Download*> unnoted;
@@ -255,6 +272,7 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
   std::vector<Settling> all;
   std::vector<std::size_t> filled;
   for (JobSubject& subject : subjects) {
+    if (subject.isStale) continue;
     all.push_back({.subject = std::move(subject), .before = {}, .after = {}});
     if (isFilled(all.back())) filled.push_back(all.size() - 1);
   }

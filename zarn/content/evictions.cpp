@@ -91,6 +91,7 @@ class EvictionBatch {
   void run(std::vector<JobSubject> subjects) {
     std::vector<BusyFile> busy;
     for (JobSubject& subject : subjects) {
+      if (subject.isStale) continue;
       Departure& departure = departures_.emplace_back();
       departure.subject = std::move(subject);
       departure.error = begin(departure, busy);

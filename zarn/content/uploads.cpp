@@ -276,7 +276,7 @@ void doUploads(ContentCore& core, const std::vector<Job>& jobs) {
   UploadGroup group(core, store);
   for (JobSubject& subject : subjects) {
     if (core.queue->isEnding() || core.isOffline()) break;
-    group.add(std::move(subject));
+    if (!subject.isStale) group.add(std::move(subject));
   }
   group.finish();
 }

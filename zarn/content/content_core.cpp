@@ -57,20 +57,22 @@ void ContentCore::setStore(std::shared_ptr<ContentStore> store, const std::strin
   const bool isSignedIn = store != nullptr;
   queue->setStoreOpen(false);
   if (isSignedIn) {
+    const std::int64_t before = queue->account();
     std::int64_t key = 0;
     const NSErrorRef error = database().write([&](WriteTransaction& transaction) {
       Connection& connection = transaction.connection();
       key = accountKey(connection, account);
       claimForAccount(connection, key);
       setMetaInteger(connection, meta::kLastAccount, key);
+      // Here, where jobs are made: one made for nobody after the claim would wait for ever.
+      queue->setAccount(key);
       return NSErrorRef();
     });
     if (error) {
       log_error(defaultLog(), "[ERROR] jobs wait, for the account cannot be stored: %@", error);
       store = nullptr;
-    } else {
-      queue->setAccount(key);
     }
+    queue->setAccount(error ? before : key);  // what it has read meanwhile was not committed
   }
   {
     LockGuard guard(mutex_);

@@ -40,7 +40,8 @@ class WatchedPicture {
 };
 
 /// A host with a real extension process, a zarn that answers as much as the host asks of it, and a
-/// client on the control socket; all in a temporary home. A test that cannot be set up ends at once.
+/// client on the control socket; all in a temporary home. A test that cannot be set up ends at
+/// once.
 class HostTest : public testing::Test {
  protected:
   HostTest();

@@ -1,4 +1,5 @@
 #include <algorithm>
+#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -39,6 +40,17 @@ class Commands : public ::testing::Test {
     std::ifstream file(path, std::ios::binary);
     return {std::istreambuf_iterator<char>(file), {}};
   }
+  /// Makes a file behind the drive's back, and waits until the drive has seen it.
+  void add(const std::string& name, const std::string& content = "") const {
+    drive_.write(name, content);
+    waitUntilSeen(name);
+  }
+  void waitUntilSeen(const std::string& name) const {
+    const auto deadline = std::chrono::steady_clock::now() + patience;
+    while (codeOf({"id", name}) != 0) {
+      ASSERT_LT(std::chrono::steady_clock::now(), deadline) << name << " was never seen";
+    }
+  }
   int codeOf(const Names& arguments) const { return drive_.yomber(arguments).exitCode; }
 
   TestDrive drive_;
@@ -62,7 +74,7 @@ TEST_F(Commands, WhatIsPutIsThereAsItWas) {
 
 TEST_F(Commands, ATakenNameIsAClashUntilTheUserSaysWhatToDo) {
   write(outside("report.pdf"), "new");
-  drive_.write("report.pdf", "old");
+  add("report.pdf", "old");
   EXPECT_EQ(codeOf({"put", outside("report.pdf")}), 17);
   EXPECT_EQ(read(inside("report.pdf")), "old");
 
@@ -79,9 +91,9 @@ TEST_F(Commands, ATakenNameIsAClashUntilTheUserSaysWhatToDo) {
 
 TEST_F(Commands, RenamesAndMovesKnowClashesToo) {
   ASSERT_EQ(codeOf({"mkdir", "a", "b"}), 0);
-  drive_.write("a/x", "1");
-  drive_.write("a/y", "2");
-  drive_.write("b/x", "3");
+  add("a/x", "1");
+  add("a/y", "2");
+  add("b/x", "3");
   EXPECT_EQ(codeOf({"rename", "a/x", "y"}), 17);
   EXPECT_EQ(codeOf({"mv", "a/x", "b"}), 17);
   EXPECT_EQ(drive_.json({"rename", "a/x", "y", "--keep-both"}).at(0)["name"], "y 2");
@@ -98,14 +110,14 @@ TEST_F(Commands, FoldersAreMadeOnceAndWithThoseAbove) {
   EXPECT_EQ(drive_.json({"mkdir", "one/two/three"}).at(0)["id"], made.at(0)["id"])
       << "a folder that exists is the answer";
   EXPECT_EQ(codeOf({"mkdir", "no/such"}), 66);
-  drive_.write("file");
+  add("file");
   EXPECT_EQ(codeOf({"mkdir", "file"}), 17);
   EXPECT_EQ(codeOf({"mkdir", "one/" + std::string(256, 'n')}), 1);
 }
 
 TEST_F(Commands, WhatIsRemovedIsGoneAndTheRootNeverIs) {
   ASSERT_EQ(codeOf({"mkdir", "many/inner", "-p"}), 0);
-  drive_.write("many/inner/file");
+  add("many/inner/file");
   EXPECT_EQ(codeOf({"rm", "many"}), 0);
   EXPECT_FALSE(fs::exists(inside("many")));
   EXPECT_EQ(codeOf({"rm", "many"}), 66);
@@ -116,8 +128,9 @@ TEST_F(Commands, WhatIsRemovedIsGoneAndTheRootNeverIs) {
 
 TEST_F(Commands, WhatIsGotIsAWholeCopyOutsideOfTheDrive) {
   ASSERT_EQ(codeOf({"mkdir", "folder/inner", "-p"}), 0);
-  drive_.write("folder/inner/file", "content");
+  add("folder/inner/file", "content");
   fs::create_symlink("inner/file", inside("folder/link"));
+  waitUntilSeen("folder/link");
   const auto got = drive_.json({"get", "folder", outside()});
   EXPECT_EQ(got.at(0)["path"], outside("folder"));
   EXPECT_EQ(read(outside("folder/inner/file")), "content");
@@ -128,7 +141,7 @@ TEST_F(Commands, WhatIsGotIsAWholeCopyOutsideOfTheDrive) {
   EXPECT_EQ(codeOf({"get", "folder", outside()}), 17);
   EXPECT_EQ(drive_.json({"get", "folder", outside(), "--keep-both"}).at(0)["path"],
             outside("folder 2"));
-  drive_.write("folder/inner/file", "newer");
+  write(inside("folder/inner/file"), "newer");
   EXPECT_EQ(codeOf({"get", "folder", outside(), "--replace"}), 0);
   EXPECT_EQ(read(outside("folder/inner/file")), "newer");
   EXPECT_EQ(drive_.json({"get", "folder/inner/file", outside("copy")}).at(0)["path"],
@@ -140,7 +153,7 @@ TEST_F(Commands, WhatIsGotIsAWholeCopyOutsideOfTheDrive) {
 }
 
 TEST_F(Commands, MarksAreSetShownAndTakenAway) {
-  drive_.write("file");
+  add("file");
   const auto tags = [&](Names arguments) {
     arguments.insert(arguments.begin(), {"tag", "file"});
     return drive_.json(arguments).at(0)["tags"];
@@ -158,7 +171,7 @@ TEST_F(Commands, MarksAreSetShownAndTakenAway) {
 }
 
 TEST_F(Commands, ChangesAreToldSinceTheLastTime) {
-  drive_.write("file");
+  add("file");
   ASSERT_EQ(codeOf({"favorite", "file"}), 0);
   const auto first = drive_.json({"changes"});
   ASSERT_EQ(first.size(), 2U);

@@ -150,11 +150,13 @@ NSErrorRef get(DriveClient& client, const GetOptions& options, std::string& plac
   std::unique_ptr<StagingFolder> staging;
   std::unique_ptr<Copy> copy;
   std::optional<NSURL> destination;
+  int number = 0;
   error = walkItem(client, options.item, [&](const WalkedItem& found) {
     if (!copy) {
       const std::string name = NSURL(found.path).lastPathComponent();
       destination.emplace(destinationFor(options, name).path());
       staging = StagingFolder::make(destination->URLByDeletingLastPathComponent()->path());
+      number = staging ? 0 : errno;
       if (!staging) return false;
       copy = std::make_unique<Copy>(*content, staging->content());
     }
@@ -162,8 +164,8 @@ NSErrorRef get(DriveClient& client, const GetOptions& options, std::string& plac
     return true;
   });
   if (error) return error;
-  if (!staging) return NSError::errorWithErrno(errno, destination ? destination->path() : "");
-  if ((error = copy->fill())) return error;
+  if (!staging) return NSError::errorWithErrno(number, destination ? destination->path() : "");
+  if (NSErrorRef failure = copy->fill()) return failure;
   return place(staging->content(), options.clashes, *destination, placed);
 }
 

@@ -97,6 +97,22 @@ bool Statement::isNull(int column) const {
   return sqlite3_column_type(statement_, column) == SQLITE_NULL;
 }
 
+ReadTransaction::ReadTransaction(Connection& connection)
+    : connection_(connection),
+      isOutermost_(sqlite3_get_autocommit(connection.database().getHandle()) != 0) {
+  if (isOutermost_) connection_.prepared("BEGIN").run();
+}
+
+ReadTransaction::~ReadTransaction() {
+  if (!isOutermost_) return;
+  try {
+    connection_.prepared("COMMIT").run();
+  } catch (const SQLite::Exception&) {
+    // Nothing was written, so nothing can be lost; the next use of the connection says what is
+    // wrong.
+  }
+}
+
 Connection::Connection(const std::string& path, Mode mode)
     : database_(path, openFlags(mode), kBusyMilliseconds) {
   database_.exec(pragmas(mode));

@@ -65,6 +65,22 @@ class StatementUse {
   Statement& statement_;
 };
 
+class Connection;
+
+/// Lets all that is read in a scope see one state of the database, at the price of one lock on the
+/// file instead of one for each statement. Nothing when the connection is within a transaction.
+class ReadTransaction {
+ public:
+  explicit ReadTransaction(Connection& connection);
+  ~ReadTransaction();
+  ReadTransaction(const ReadTransaction&) = delete;
+  ReadTransaction& operator=(const ReadTransaction&) = delete;
+
+ private:
+  Connection& connection_;
+  const bool isOutermost_;
+};
+
 /// One connection to the database with its prepared statements. For one thread at a time.
 class Connection {
  public:

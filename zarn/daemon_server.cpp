@@ -80,6 +80,34 @@ void answerItem(Context context, const FoundItem& found, const std::string& what
   }
 }
 
+/// Where the item of that id is, provided that `isIt` holds for it. Root and trash, which were
+/// issued no id, are always what they are.
+template <typename IsIt>
+std::optional<std::string> locationOf(const ItemStore& store, std::uint64_t id, const IsIt& isIt,
+                                      const std::string& what, NSErrorRef& failure) {
+  if (failure) return std::nullopt;
+  std::optional<std::string> path;
+  if (id < kFirstIssuedID) {
+    path = store.logicalPath(id, &failure);
+  } else if (auto located = store.located(id, &failure); located && isIt(located->row)) {
+    path = std::move(located->path);
+  }
+  if (!path && !failure) failure = noSuchItemError(what);
+  return path;
+}
+
+template <typename Context>
+void answerLocation(Context context, const std::optional<std::string>& path,
+                    const NSErrorRef& failure) {
+  const std::uint64_t words = path ? path->size() / sizeof(capnp::word) + 16 : 64;
+  auto result = context.getResults(capnp::MessageSize{words, 0}).initResult();
+  if (path) {
+    result.setPath(wireData(*path));
+  } else {
+    ipc::encodeError(failure, result.initError());
+  }
+}
+
 }  // namespace
 
 /// Ends what it stands for when the client drops it.
@@ -116,50 +144,31 @@ kj::Promise<void> DaemonServer::describe(DescribeContext context) {
 
 // --- Lookups.
 
-template <typename Context>
-kj::Promise<void> DaemonServer::answerLocation(Context context, std::uint64_t id,
-                                               const NSErrorRef& failure) {
-  NSErrorRef error = failure;
-  std::optional<std::string> path;
-  if (!error) path = drive_->store->logicalPath(id, &error);
-  if (!path && !error) error = noSuchItemError(std::to_string(id));
-  const std::uint64_t words = path ? path->size() / sizeof(capnp::word) + 16 : 64;
-  auto result = context.getResults(capnp::MessageSize{words, 0}).initResult();
-  if (path) {
-    result.setPath(wireData(*path));
-  } else {
-    ipc::encodeError(error, result.initError());
-  }
-  return kj::READY_NOW;
-}
-
 kj::Promise<void> DaemonServer::urlForItemIdentifier(UrlForItemIdentifierContext context) {
   return whenScanned(context, [this, context](NSErrorRef failure) mutable {
     const std::string identifier = stringFromWire(context.getParams().getIdentifier());
     context.releaseParams();
     const auto id = rawIDFromIdentifier(identifier);
     if (!failure && !id) failure = noSuchItemError(identifier);
-    if (!failure && *id >= kFirstIssuedID) {
-      const auto row = drive_->store->itemByID(*id, &failure);
-      const bool isIt = row && itemIdentifier(row->id, row->kind) == identifier;
-      if (!failure && !isIt) failure = noSuchItemError(identifier);
-    }
-    return answerLocation(context, id.value_or(kRootID), failure);
+    const auto isIt = [&](const ItemRow& row) {
+      return itemIdentifier(row.id, row.kind) == identifier;
+    };
+    const auto path = locationOf(*drive_->store, id.value_or(kRootID), isIt, identifier, failure);
+    answerLocation(context, path, failure);
+    return kj::Promise<void>(kj::READY_NOW);
   });
 }
 
 kj::Promise<void> DaemonServer::documentLocation(DocumentLocationContext context) {
   return whenScanned(context, [this, context](NSErrorRef failure) mutable {
     const auto object = context.getParams().getObject();
+    const auto isIt = [&](const ItemRow& row) { return isOfKind(row, object.getKind()); };
     const std::uint64_t id = object.getRawID();
-    if (!failure) {
-      std::optional<ItemRow> row;
-      if (id >= kFirstIssuedID) row = drive_->store->itemByID(id, &failure);
-      if (!failure && (!row || !isOfKind(*row, object.getKind()))) {
-        failure = noSuchItemError(yomber::describe(object));
-      }
-    }
-    return answerLocation(context, id, failure);
+    const std::string what = yomber::describe(object);
+    if (!failure && id < kFirstIssuedID) failure = noSuchItemError(what);
+    const auto path = locationOf(*drive_->store, id, isIt, what, failure);
+    answerLocation(context, path, failure);
+    return kj::Promise<void>(kj::READY_NOW);
   });
 }
 

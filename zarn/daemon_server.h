@@ -51,9 +51,6 @@ class DaemonServer final : public protocol::Daemon::Server {
   /// Runs `work` once the database has rows, at once when it has; it gets the failure otherwise.
   template <typename Context, typename Work>
   kj::Promise<void> whenScanned(Context context, Work work);
-  /// The item's location, or `failure`.
-  template <typename Context>
-  kj::Promise<void> answerLocation(Context context, std::uint64_t id, const NSErrorRef& failure);
   template <typename Context, typename Find>
   kj::Promise<void> answerPage(Context context, Find find);
   template <typename Context>

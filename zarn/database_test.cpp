@@ -10,6 +10,7 @@
 
 #include "platform/foundation/fault_points.h"
 #include "zarn/bulk_load.h"
+#include "zarn/connection.h"
 #include "zarn/row_queries.h"
 #include "zarn/schema.h"
 #include "zarn/test_drive.h"
@@ -49,6 +50,27 @@ class DatabaseTest : public TestDrive {
     return result;
   }
 };
+
+TEST_F(DatabaseTest, AReadTransactionSeesOneStateWhateverIsWrittenMeanwhile) {
+  ASSERT_EQ(insert("a"), nullptr);
+  const auto sees = [](Connection& connection, const char* name) {
+    return findByName(connection, kRootID, name).has_value();
+  };
+  const NSErrorRef error = database->read([&](Connection& connection) {
+    {
+      const ReadTransaction outer(connection);
+      EXPECT_TRUE(sees(connection, "a"));
+      ASSERT_EQ(insert("b"), nullptr);
+      {
+        const ReadTransaction inner(connection);
+        EXPECT_FALSE(sees(connection, "b"));
+      }
+      EXPECT_FALSE(sees(connection, "b")) << "the inner one ended the outer";
+    }
+    EXPECT_TRUE(sees(connection, "b"));
+  });
+  EXPECT_EQ(error, nullptr);
+}
 
 TEST_F(DatabaseTest, RanksGrowOverRestarts) {
   const std::uint64_t start = database->currentRank();

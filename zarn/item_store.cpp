@@ -14,8 +14,10 @@ template <typename Query>
 auto query(const Database& database, NSErrorRef* error, const Query& job)
     -> decltype(job(std::declval<Connection&>())) {
   decltype(job(std::declval<Connection&>())) result{};
-  const NSErrorRef failure =
-      database.read([&](Connection& connection) { result = job(connection); });
+  const NSErrorRef failure = database.read([&](Connection& connection) {
+    const ReadTransaction transaction(connection);
+    result = job(connection);
+  });
   if (failure) {
     storeError(error, failure);
     return {};
@@ -46,15 +48,16 @@ std::uint64_t placeID(Connection& connection, const TreeLayout::Place& place, bo
 
 std::optional<ItemRow> findBelow(Connection& connection, std::uint64_t place,
                                  std::string_view relative) {
-  std::optional<ItemRow> row = findByID(connection, place);
-  while (row && !relative.empty()) {
+  if (relative.empty()) return findByID(connection, place);
+  std::optional<ItemRow> row;
+  for (std::uint64_t parent = place; !relative.empty(); parent = row->id) {
     const std::size_t slash = relative.find('/');
     const std::string_view name = relative.substr(0, slash);
-    const std::uint64_t parent = row->id;
     row = findByName(connection, parent, name);
     // A container's folder has its place elsewhere: through the root's location it is not there.
     if (row && row->isContainerFolder()) row.reset();
     if (!row) row = findByDiskName(connection, parent, name);
+    if (!row) break;
     relative.remove_prefix(slash == std::string_view::npos ? relative.size() : slash + 1);
   }
   return row;
@@ -128,6 +131,15 @@ std::optional<std::string> ItemStore::logicalPath(std::uint64_t id, NSErrorRef* 
   });
 }
 
+std::optional<ItemStore::Located> ItemStore::located(std::uint64_t id, NSErrorRef* error) const {
+  return query(*database_, error, [&](Connection& c) -> std::optional<Located> {
+    auto chain = findChain(c, id);
+    if (!chain || chain->rows.empty()) return std::nullopt;
+    std::string path = pathOfChain(layout_, *chain, false);
+    return Located{std::move(chain->rows.front()), std::move(path)};
+  });
+}
+
 std::optional<std::string> ItemStore::physicalPath(std::uint64_t id, NSErrorRef* error) const {
   return query(*database_, error, [&](Connection& c) -> std::optional<std::string> {
     const auto chain = findChain(c, id);
@@ -138,7 +150,8 @@ std::optional<std::string> ItemStore::physicalPath(std::uint64_t id, NSErrorRef*
 
 ItemStore::Counts ItemStore::counts(NSErrorRef* error) const {
   // Looked at before counting: what is committed meanwhile makes the next call count again.
-  Counted counted{.identity = database_->identity(), .rank = database_->currentRank(), .counts = {}};
+  Counted counted{
+      .identity = database_->identity(), .rank = database_->currentRank(), .counts = {}};
   const auto kept = counted_.load();
   if (kept && kept->identity == counted.identity && kept->rank == counted.rank) {
     return kept->counts;

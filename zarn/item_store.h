@@ -53,6 +53,13 @@ class ItemStore {
   [[nodiscard]] std::optional<std::string> physicalPath(std::uint64_t id,
                                                         NSErrorRef* error = nullptr) const;
 
+  struct Located {
+    ItemRow row;
+    std::string path;
+  };
+  /// An item that was issued an id, and its logical path.
+  [[nodiscard]] std::optional<Located> located(std::uint64_t id, NSErrorRef* error = nullptr) const;
+
   struct Counts {
     std::uint64_t items = 0;  ///< folders included; neither the root nor the trash
     std::uint64_t folders = 0;

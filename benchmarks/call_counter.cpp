@@ -6,6 +6,7 @@
 
 #include <array>
 #include <cstdio>
+#include <cstring>
 #include <stdexcept>
 #include <utility>
 
@@ -41,24 +42,25 @@ bool writeAll(int to, const void* from, std::size_t bytes) {
 }
 
 /// The next message with its framing; false when the client has left or makes no sense.
-bool readMessage(int from, std::vector<capnp::word>& message) {
-  message.resize(1);
-  if (!readAll(from, message.data(), sizeof(capnp::word))) return false;
+bool readMessage(int from, kj::Array<capnp::word>& message) {
+  message = kj::heapArray<capnp::word>(1);
+  if (!readAll(from, message.begin(), sizeof(capnp::word))) return false;
   // The frame's head says how many segments there are, then how many words each has.
   while (true) {
-    const std::size_t expected =
-        capnp::expectedSizeInWordsFromPrefix(kj::arrayPtr(message.data(), message.size()));
+    const std::size_t expected = capnp::expectedSizeInWordsFromPrefix(message);
     if (expected > kMaximumMessageWords) return false;
     if (expected <= message.size()) return true;
     const std::size_t have = message.size();
-    message.resize(expected);
-    if (!readAll(from, message.data() + have, (expected - have) * sizeof(capnp::word)))
+    auto whole = kj::heapArray<capnp::word>(expected);
+    std::memcpy(whole.begin(), message.begin(), have * sizeof(capnp::word));
+    message = kj::mv(whole);
+    if (!readAll(from, message.begin() + have, (expected - have) * sizeof(capnp::word)))
       return false;
   }
 }
 
-bool isCall(const std::vector<capnp::word>& message) {
-  capnp::FlatArrayMessageReader reader(kj::arrayPtr(message.data(), message.size()));
+bool isCall(kj::ArrayPtr<const capnp::word> message) {
+  capnp::FlatArrayMessageReader reader(message);
   return reader.getRoot<capnp::rpc::Message>().isCall();
 }
 
@@ -110,10 +112,10 @@ void CallCounter::passOn(int client) {
   const ipc::UniqueFd far = ipc::connectUnixSocket(movedTo_, nullptr);
   if (!far) return;
   std::thread back([&] { copyBytes(far.get(), near.get()); });
-  std::vector<capnp::word> message;
+  kj::Array<capnp::word> message;
   while (readMessage(near.get(), message)) {
     if (isCall(message)) ++calls_;
-    if (!writeAll(far.get(), message.data(), message.size() * sizeof(capnp::word))) break;
+    if (!writeAll(far.get(), message.begin(), message.size() * sizeof(capnp::word))) break;
   }
   ::shutdown(far.get(), SHUT_RDWR);
   back.join();

@@ -23,7 +23,7 @@ set_property(CACHE YOMBER_SANITIZE PROPERTY STRINGS "" address thread fuzzer)
 find_program(YOMBER_CCACHE ccache)
 if(YOMBER_CCACHE)
   # Precompiled headers are only cacheable with these two liberties.
-  set(launcher "${CMAKE_COMMAND};-E;env;CCACHE_SLOPPINESS=pch_defines,time_macros;${YOMBER_CCACHE}")
+  set(launcher "${CMAKE_COMMAND};-E;env;CCACHE_SLOPPINESS=pch_defines,time_macros;CCACHE_BASEDIR=/;CCACHE_NOHASHDIR=true;${YOMBER_CCACHE}")
   set(CMAKE_C_COMPILER_LAUNCHER "${launcher}")
   set(CMAKE_CXX_COMPILER_LAUNCHER "${launcher}")
   if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")

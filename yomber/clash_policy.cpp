@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/foundation/bounced_name.h"
+#include "yomber/failure_text.h"
 
 namespace yomber {
 
@@ -12,7 +13,7 @@ namespace {
 NSErrorRef withAdvice(const NSErrorRef& error) {
   auto info = error->userInfo();
   info[NSLocalizedDescriptionKey] =
-      error->localizedDescription() +
+      failureText(error) +
       "; use --keep-both for another name, or --replace to move what is there to the trash";
   return NSError::errorWithDomain(error->domain(), error->code(), std::move(info));
 }

@@ -4,6 +4,7 @@
 
 #include <nlohmann/json.hpp>
 
+#include "yomber/failure_text.h"
 #include "yomber/item_output.h"
 
 namespace yomber {
@@ -18,7 +19,7 @@ void CommandContext::fail(const NSErrorRef& error) {
     std::cerr << nlohmann::ordered_json{{"error", errorJson(error)}}.dump() << std::endl;
     return;
   }
-  std::cerr << "yomber: " << error->localizedDescription();
+  std::cerr << "yomber: " << failureText(error);
   if (exitCode == ExitCode::NotSignedIn)
     std::cerr << " (sign in with 'yomber account sign-in NAME')";
   std::cerr << std::endl;

@@ -7,6 +7,7 @@
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ostrell/file_object_id.h"
+#include "yomber/failure_text.h"
 
 namespace yomber {
 
@@ -28,10 +29,9 @@ std::shared_ptr<ipc::Connection> connected(std::shared_ptr<ipc::Connection>& con
   connection = ipc::Connection::connect(socket, &failure);
   if (!connection) {
     // Whatever the system's reason is, to the caller the drive is not there.
-    storeError(error, NSError::errorWithDomain(
-                          NSCocoaErrorDomain, NSXPCConnectionInvalid,
-                          {{NSLocalizedDescriptionKey, failure->localizedDescription()},
-                           {NSUnderlyingErrorKey, failure}}));
+    storeError(error, NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionInvalid,
+                                               {{NSLocalizedDescriptionKey, failureText(failure)},
+                                                {NSUnderlyingErrorKey, failure}}));
   }
   return connection;
 }

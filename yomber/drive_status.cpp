@@ -1,6 +1,8 @@
 #include "yomber/drive_status.h"
 
+#include <algorithm>
 #include <array>
+#include <span>
 #include <sstream>
 #include <utility>
 
@@ -9,12 +11,15 @@
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "yomber/drive_client.h"
+#include "yomber/failure_text.h"
 #include "yomber/item_output.h"
 #include "yomber/transfer_view.h"
 
 namespace yomber {
-
 namespace {
+
+/// Of hundreds that are under way, a person sees the first.
+constexpr std::size_t kShownTransfers = 10;
 
 std::optional<DriveStatus::Daemon> askDaemon(const ipc::Remote<protocol::Daemon>& remote) {
   DriveStatus::Daemon daemon;
@@ -88,7 +93,7 @@ void describeHost(std::ostream& out, const DriveStatus::Host& host) {
         << host.extensionStarts << " times\n";
   } else {
     out << "extension      not running";
-    if (host.lastFailure) out << ": " << host.lastFailure->localizedDescription();
+    if (host.lastFailure) out << ": " << failureText(host.lastFailure);
     out << "\n";
   }
 }
@@ -125,7 +130,9 @@ std::string statusText(const DriveStatus& status) {
     out << "fileproviderd  does not answer\n";
   }
   if (status.transfers) {
-    for (const Transfer& transfer : status.transfers->underWay) {
+    const auto& underWay = status.transfers->underWay;
+    const std::size_t shown = std::min(underWay.size(), kShownTransfers);
+    for (const Transfer& transfer : std::span(underWay).first(shown)) {
       out << transferLine(transfer, 0) << "\n";
     }
     out << "transfers      " << transferSummary(*status.transfers) << "\n";

@@ -2,6 +2,8 @@
 
 #include <cerrno>
 
+#include "yomber/failure_text.h"
+
 namespace yomber {
 
 const char* nameOf(Eviction::Outcome outcome) {
@@ -25,9 +27,8 @@ std::string reasonToKeep(const ContentState& state) {
     case ContentState::Upload::UPLOADING:
       return "it is being uploaded";
     case ContentState::Upload::WAITING:
-      return state.lastFailure
-                 ? "it could not be uploaded yet: " + state.lastFailure->localizedDescription()
-                 : "it is not uploaded yet";
+      return state.lastFailure ? "it could not be uploaded yet: " + failureText(state.lastFailure)
+                               : "it is not uploaded yet";
     case ContentState::Upload::CONFIRMED:
       return "";
   }
@@ -64,7 +65,7 @@ Eviction evictContent(const DriveContent& content, const std::string& path) {
 
   const NSErrorRef refused = content.stopProviding(path);
   if (refused && refused->is(NSPOSIXErrorDomain, EBUSY)) {
-    return kept(state, refused->localizedDescription());
+    return kept(state, failureText(refused));
   }
   if (refused) return failed(refused);
   if (NSErrorRef error = content.state(path, state)) return failed(error);
@@ -73,7 +74,7 @@ Eviction evictContent(const DriveContent& content, const std::string& path) {
 
   // The state does not say why: the daemon's own refusal does.
   if (const NSErrorRef reason = content.evict(path)) {
-    return kept(state, reason->localizedDescription());
+    return kept(state, failureText(reason));
   }
   if (NSErrorRef error = content.state(path, state)) return failed(error);
   return ended(Eviction::Outcome::Evicted, state);

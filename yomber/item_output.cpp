@@ -9,6 +9,7 @@
 #include <nlohmann/json.hpp>
 
 #include "protocols/common.capnp.h"
+#include "yomber/failure_text.h"
 
 namespace yomber {
 
@@ -148,7 +149,7 @@ nlohmann::ordered_json errorJson(const NSErrorRef& error) {
   nlohmann::ordered_json json;
   json["domain"] = error->domain();
   json["code"] = error->code();
-  json["message"] = error->localizedDescription();
+  json["message"] = failureText(error);
   return json;
 }
 

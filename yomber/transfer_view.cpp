@@ -9,6 +9,7 @@
 #include <iostream>
 
 #include "platform/foundation/url.h"
+#include "yomber/failure_text.h"
 #include "yomber/item_output.h"
 
 namespace yomber {
@@ -82,7 +83,7 @@ std::string transferLine(const Transfer& transfer, std::size_t barWidth) {
   const std::string name = printableName(NSURL(transfer.path).lastPathComponent());
   if (transfer.nextAttempt) {
     line += "waiting  " + name;
-    if (transfer.failure) line += ": " + transfer.failure->localizedDescription();
+    if (transfer.failure) line += ": " + failureText(transfer.failure);
     return line;
   }
   const double fraction = fractionOf(transfer);

@@ -15,6 +15,7 @@
 #include "platform/ipc/event_loop.h"
 #include "yomber/command.h"
 #include "yomber/drive_client.h"
+#include "yomber/failure_text.h"
 #include "yomber/item_output.h"
 
 namespace yomber {
@@ -64,7 +65,7 @@ class ChangePrinter {
       std::cout << nlohmann::ordered_json{{"event", "paused"}, {"error", errorJson(error)}}.dump()
                 << std::endl;
     } else {
-      std::cerr << "waiting: " << error->localizedDescription() << std::endl;
+      std::cerr << "waiting: " << failureText(error) << std::endl;
     }
   }
 

@@ -6,6 +6,7 @@
 #include "platform/ostrell/constants.h"
 #include "zarn/connection.h"
 #include "zarn/listing_cursors.h"
+#include "zarn/pages_ahead.h"
 #include "zarn/row_queries.h"
 
 namespace yomber {
@@ -14,6 +15,7 @@ namespace {
 constexpr std::size_t kMaximumCursors = 8192;
 constexpr std::size_t kMaximumFencedListings = 64;
 constexpr std::size_t kMaximumFencePoints = 200'000;
+constexpr std::size_t kMaximumPagesAhead = 32;
 
 constexpr int kNameKeyColumn = kRowColumnCount;
 
@@ -70,27 +72,46 @@ void bindPoint(Statement& statement, const ListingScope& scope, const ListingPoi
   statement.bindID(4, after.id);
 }
 
-/// Reads up to `limit` rows right after a point, leaving out the first `skip`. Moves `point` to the
-/// last one; true when there are more.
-bool readPage(Connection& connection, const ListingScope& scope, ListingPoint& point,
-              std::uint64_t skip, std::uint32_t limit, std::vector<ItemRow>& rows) {
+/// Where a page begins: right after a point, leaving out the first `skip` rows.
+struct Start {
+  ListingPoint point;
+  std::uint64_t skip = 0;
+  bool isBeyondEnd = false;
+};
+
+/// Reads up to `limit` rows; answers where the last one is when there are more.
+std::optional<ListingPoint> readRows(Connection& connection, const ListingScope& scope,
+                                     const Start& start, std::uint32_t limit,
+                                     std::vector<ItemRow>& rows) {
   StatementUse statement(connection.prepared(pageQuery(scope)));
-  bindPoint(*statement, scope, point);
-  statement->bindID(5, skip + limit + 1);
-  for (std::uint64_t i = 0; i < skip; ++i) {
-    if (!statement->step()) return false;
+  bindPoint(*statement, scope, start.point);
+  statement->bindID(5, start.skip + limit + 1);
+  for (std::uint64_t i = 0; i < start.skip; ++i) {
+    if (!statement->step()) return std::nullopt;
   }
   rows.reserve(limit);
   std::string lastKey;
   while (statement->step()) {
     if (rows.size() == limit) {
-      point = {-rows.back().mtime, std::move(lastKey), rows.back().id};
-      return true;
+      return ListingPoint{-rows.back().mtime, std::move(lastKey), rows.back().id};
     }
     readRow(*statement, rows.emplace_back());
     if (rows.size() == limit) lastKey = statement->bytes(kNameKeyColumn);
   }
-  return false;
+  return std::nullopt;
+}
+
+PagesAhead::Page readPage(Connection& connection, const ListingScope& scope, const Start& start,
+                          std::uint64_t offset, std::uint32_t limit) {
+  PagesAhead::Page result;
+  if (start.isBeyondEnd) return result;
+  std::vector<ItemRow>& rows = result.page.rows;
+  auto end = readRows(connection, scope, start, limit, rows);
+  for (ItemRow& row : rows) loadExtra(connection, row);
+  if (!end) return result;
+  result.page.nextOffset = offset + rows.size();
+  result.end = *std::move(end);
+  return result;
 }
 
 std::shared_ptr<const ListingFences> readFences(Connection& connection, const ListingScope& scope) {
@@ -114,23 +135,23 @@ class Listing::State : public ChangeSink {
   NSErrorRef page(std::uint64_t connection, const ListingScope& scope, std::uint64_t offset,
                   std::uint32_t limit, ListingPage& out);
   void connectionEnded(std::uint64_t connection) {
+    pagesAhead_.removeConnection(connection);
     LockGuard guard(mutex_);
     cursors_.removeConnection(connection);
   }
   void committed(const std::vector<ItemChange>& changes) override;
 
  private:
-  struct Start {
-    ListingPoint point;
-    std::uint64_t skip = 0;
-    bool isBeyondEnd = false;
-  };
-  Start findStart(Connection& reader, std::uint64_t connection, const ListingScope& scope,
-                  std::uint64_t offset);
+  using Key = ListingCursors::Key;
+
+  NSErrorRef readNow(const Key& key, std::uint32_t limit, PagesAhead::Page& out);
+  void readAhead(const Key& key, std::uint32_t limit, const ListingPoint& after);
+  Start findStart(Connection& reader, const Key& key);
   std::shared_ptr<const ListingFences> fencesOf(Connection& reader, const ListingScope& scope);
   void forgetOtherDatabase() REQUIRES(mutex_);
 
   const std::shared_ptr<Database> database_;
+  PagesAhead pagesAhead_{kMaximumPagesAhead};
   Mutex mutex_;
   std::uint64_t identity_ GUARDED_BY(mutex_) = 0;
   ListingCursors cursors_ GUARDED_BY(mutex_){kMaximumCursors};
@@ -174,14 +195,14 @@ std::shared_ptr<const ListingFences> Listing::State::fencesOf(Connection& reader
   return fences;
 }
 
-Listing::State::Start Listing::State::findStart(Connection& reader, std::uint64_t connection,
-                                                const ListingScope& scope, std::uint64_t offset) {
+Start Listing::State::findStart(Connection& reader, const Key& key) {
+  const ListingScope& scope = key.scope;
+  const std::uint64_t offset = key.offset;
   if (offset == 0) return {};
   {
     LockGuard guard(mutex_);
     forgetOtherDatabase();
-    if (auto point = cursors_.find({connection, scope, offset}))
-      return {std::move(*point), 0, false};
+    if (auto point = cursors_.find(key)) return {std::move(*point), 0, false};
   }
   if (offset < ListingFences::kDistance) return {{}, offset, false};
   const auto fences = fencesOf(reader, scope);
@@ -201,17 +222,41 @@ NSErrorRef Listing::State::page(std::uint64_t connection, const ListingScope& sc
          {NSLocalizedDescriptionKey, std::string("A page's limit must be at least 1.")}});
   }
   const std::uint32_t count = std::min(limit, kMaximumLimit);
+  const Key key{connection, scope, offset};
+  PagesAhead::Page result;
+  if (auto ahead = pagesAhead_.take(key, count, database_->currentRank())) {
+    result = *std::move(ahead);
+  } else if (NSErrorRef error = readNow(key, count, result)) {
+    return error;
+  }
+  out = std::move(result.page);
+  if (out.nextOffset == 0) return nullptr;
+  const Key next{connection, scope, out.nextOffset};
+  // Many ask for one page and no more.
+  if (offset != 0) readAhead(next, count, result.end);
+  LockGuard guard(mutex_);
+  forgetOtherDatabase();
+  cursors_.store(next, std::move(result.end));
+  return nullptr;
+}
+
+NSErrorRef Listing::State::readNow(const Key& key, std::uint32_t limit, PagesAhead::Page& out) {
   return database_->read([&](Connection& reader) {
-    Start start = findStart(reader, connection, scope, offset);
-    if (start.isBeyondEnd) return;
-    const bool hasMore = readPage(reader, scope, start.point, start.skip, count, out.rows);
-    for (ItemRow& row : out.rows) loadExtra(reader, row);
-    if (!hasMore) return;
-    out.nextOffset = offset + out.rows.size();
-    LockGuard guard(mutex_);
-    forgetOtherDatabase();
-    cursors_.store({connection, scope, out.nextOffset}, std::move(start.point));
+    out = readPage(reader, key.scope, findStart(reader, key), key.offset, limit);
   });
+}
+
+void Listing::State::readAhead(const Key& key, std::uint32_t limit, const ListingPoint& after) {
+  const auto read = [key, limit, after, database = database_]() -> std::optional<PagesAhead::Page> {
+    PagesAhead::Page result;
+    const NSErrorRef error = database->read([&](Connection& reader) {
+      result = readPage(reader, key.scope, {after, 0, false}, key.offset, limit);
+    });
+    // Whoever asks for the page is told.
+    if (error) return std::nullopt;
+    return result;
+  };
+  pagesAhead_.readAhead(key, limit, database_->currentRank(), read);
 }
 
 Listing::Listing(std::shared_ptr<Database> database) : state_(std::make_shared<State>(database)) {

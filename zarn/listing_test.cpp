@@ -140,6 +140,18 @@ TEST_F(ListingTest, AChangeBetweenPagesNeitherRepeatsNorLosesWhatStayed) {
   EXPECT_EQ(seen.count("a new one 0"), 0U);
 }
 
+TEST_F(ListingTest, APageThatWasReadAheadShowsWhatChangedSince) {
+  fill(1000);
+  // From the second page on, the next one is read ahead.
+  EXPECT_EQ(page(ListingOrder::Name, 0, 100).nextOffset, 100U);
+  const ListingPage second = page(ListingOrder::Name, 100, 100);
+  inTransaction([](WriteTransaction& transaction) { add(transaction, "item 200 a", 0); });
+  const ListingPage third = page(ListingOrder::Name, second.nextOffset, 100);
+  ASSERT_EQ(third.rows.size(), 100U);
+  EXPECT_EQ(third.rows[0].name, "item 200");
+  EXPECT_EQ(third.rows[1].name, "item 200 a");
+}
+
 TEST_F(ListingTest, FencesFollowChanges) {
   fill(600);
   EXPECT_EQ(page(ListingOrder::Name, 400, 1, 5).rows.front().name, "item 400");

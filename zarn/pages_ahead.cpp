@@ -1,0 +1,71 @@
+#include "zarn/pages_ahead.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/foundation/thread_pool.h"
+
+namespace yomber {
+
+std::shared_ptr<PagesAhead::Entry> PagesAhead::State::remove(const Key& key) {
+  const auto place = std::ranges::find_if(entries, [&](const auto& e) { return e->key == key; });
+  if (place == entries.end()) return nullptr;
+  auto entry = std::move(*place);
+  entries.erase(place);
+  return entry;
+}
+
+void PagesAhead::State::run(const std::shared_ptr<Entry>& entry, const Read& read) {
+  {
+    LockGuard guard(mutex);
+    if (entry->stage == Entry::Stage::Abandoned) return;
+    entry->stage = Entry::Stage::Reading;
+  }
+  std::optional<Page> page = read();
+  LockGuard guard(mutex);
+  entry->page = std::move(page);
+  entry->stage = Entry::Stage::Done;
+  done.notifyAll();
+}
+
+void PagesAhead::readAhead(const Key& key, std::uint32_t limit, std::uint64_t rank, Read read) {
+  auto entry = std::make_shared<Entry>();
+  entry->key = key;
+  entry->limit = limit;
+  entry->rank = rank;
+  {
+    LockGuard guard(state_->mutex);
+    if (const auto older = state_->remove(key)) older->stage = Entry::Stage::Abandoned;
+    if (state_->entries.size() >= state_->capacity) {
+      state_->entries.front()->stage = Entry::Stage::Abandoned;
+      state_->entries.pop_front();
+    }
+    state_->entries.push_back(entry);
+  }
+  ThreadPool::shared().async(
+      [state = state_, entry, read = std::move(read)] { state->run(entry, read); });
+}
+
+std::optional<PagesAhead::Page> PagesAhead::take(const Key& key, std::uint32_t limit,
+                                                 std::uint64_t rank) {
+  LockGuard guard(state_->mutex);
+  const auto entry = state_->remove(key);
+  if (entry == nullptr) return std::nullopt;
+  // One that has not begun is read as quickly by whoever asks.
+  if (entry->stage == Entry::Stage::Queued || entry->limit != limit || entry->rank != rank) {
+    entry->stage = Entry::Stage::Abandoned;
+    return std::nullopt;
+  }
+  while (entry->stage == Entry::Stage::Reading) state_->done.wait(state_->mutex);
+  return std::move(entry->page);
+}
+
+void PagesAhead::removeConnection(std::uint64_t connection) {
+  LockGuard guard(state_->mutex);
+  for (const auto& entry : state_->entries) {
+    if (entry->key.connection == connection) entry->stage = Entry::Stage::Abandoned;
+  }
+  std::erase_if(state_->entries, [&](const auto& e) { return e->key.connection == connection; });
+}
+
+}  // namespace yomber

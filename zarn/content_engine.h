@@ -75,7 +75,8 @@ class ContentWish {
 /// nobody is signed in, jobs wait without counting attempts.
 ///
 /// Why content cannot be had: NSCocoaErrorDomain 4354 while the store is out of reach, 4355 when
-/// the store's quota is used up, NSPOSIXErrorDomain ENOSPC when this disk is full,
+/// the store's quota is used up, NSPOSIXErrorDomain ENOSPC when this disk is full, EBUSY while
+/// another program has the fault open for writing,
 /// NSCocoaErrorDomain 259 when what the store has is not the content that was put there,
 /// NSCocoaErrorDomain 4 when nothing is at the location.
 ///

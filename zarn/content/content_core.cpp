@@ -1,5 +1,7 @@
 #include "zarn/content/content_core.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <utility>
 
@@ -146,9 +148,10 @@ NSErrorRef ContentCore::settleWritten(const std::string& path, const FaultExamin
   if (found.condition == FaultCondition::Rewritten) {
     FileStamp after;
     error = removeFaultMarks(path, found.stamp.inode, after);
-  } else if (found.condition == FaultCondition::PartlyWritten) {
+  } else if (found.condition == FaultCondition::PartlyWritten ||
+             found.condition == FaultCondition::Mixed) {
     std::string rescued;
-    error = rescuePartialWrite(path, found.record, rescued);
+    error = rescuePartialWrite(path, found.condition, found.record, rescued);
     if (!error) (void)scanner->scanLocation(rescued, &error);
   } else if (found.condition == FaultCondition::Damaged) {
     return NSError::errorWithDomain(
@@ -160,6 +163,13 @@ NSErrorRef ContentCore::settleWritten(const std::string& path, const FaultExamin
   }
   if (!error) (void)scanner->scanLocation(path, &error);
   return error;
+}
+
+void ContentCore::lookAgain(const std::string& path, const FileStamp& stored) const {
+  struct stat status{};
+  const bool isSame =
+      !path.empty() && lstat(path.c_str(), &status) == 0 && FileStamp::of(status) == stored;
+  if (!isSame) (void)scanner->scanLocation(path);
 }
 
 BusyFile::BusyFile(const ContentCore& core, std::uint64_t inode)

@@ -64,6 +64,9 @@ class ContentCore {
   /// Decides on a fault that somebody has written to: what they wrote over all of it counts, what
   /// they wrote into it is brought to a file of its own.
   NSErrorRef settleWritten(const std::string& path, const FaultExamination& found);
+  /// A file that was busy, or whose change by us was stored, is looked at once more unless it still
+  /// is what was stored: what others did to it meanwhile was passed over, or hidden by ours.
+  void lookAgain(const std::string& path, const FileStamp& stored) const;
 
   const std::shared_ptr<ItemStore> items;
   const std::shared_ptr<Scanner> scanner;

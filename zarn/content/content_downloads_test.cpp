@@ -10,22 +10,6 @@ namespace {
 
 class ContentDownloadsTest : public ContentDrive {
  protected:
-  /// A document whose content is in the store only.
-  void makeFault(const std::string& path, const std::string& text) {
-    write(path, text);
-    settle();
-    const NSErrorRef error = evict(path);
-    ASSERT_EQ(error, nullptr) << error->description();
-    ASSERT_TRUE(isFault(path));
-  }
-  void stopAt(const std::string& point) {
-    gate_ = layout.home() + "/go-" + point;
-    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate_), nullptr);
-  }
-  bool isStopped() const {
-    return waitUntil([&] { return std::filesystem::exists(gate_ + ".reached"); });
-  }
-  void go() const { std::ofstream(gate_).put('x'); }
   void expectCorrupt(const std::string& path) {
     const NSErrorRef error = provide(path);
     ASSERT_NE(error, nullptr);
@@ -33,8 +17,6 @@ class ContentDownloadsTest : public ContentDrive {
     EXPECT_TRUE(isFault(path));
     EXPECT_LE(status(path).st_blocks * 512, 8192);
   }
-
-  std::string gate_;
 };
 
 TEST_F(ContentDownloadsTest, TenWaitersShareOneDownload) {
@@ -290,25 +272,6 @@ TEST_F(ContentDownloadsTest, SomebodyWhoHasTheFaultOpenIsNoHindrance) {
   EXPECT_TRUE(read("a") == text);
 }
 
-TEST_F(ContentDownloadsTest, AWriteDuringADownloadIsNeverPartOfAMixture) {
-  const std::string text = content(5'000'000);
-  makeFault("a", text);
-  const FileDescriptor writer(::open(at("a").c_str(), O_WRONLY | O_CLOEXEC));
-  stopAt("zarn.fill.copying");
-  Answer answer;
-  const auto wish = engine->startProviding(at("a"), 0, answer.take());
-  ASSERT_TRUE(isStopped());
-  ASSERT_EQ(pwrite(writer.get(), "written", 7, 4'500'000), 7);
-  go();
-  const NSErrorRef error = answer.get();
-  if (!error) {
-    EXPECT_TRUE(read("a") == text);
-  } else {
-    EXPECT_TRUE(isFault("a"));
-  }
-  EXPECT_EQ(contentInStore(id("a")), text);
-}
-
 TEST_F(ContentDownloadsTest, HolesInTheContentStayHoles) {
   {
     const FileDescriptor file(::open(at("a").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
@@ -398,21 +361,25 @@ TEST_F(ContentDownloadsTest, AFullDiskIsAnErrorAndAfterRoomIsMadeTheContentComes
   ASSERT_EQ(eviction->sync(), nullptr);
   ASSERT_EQ(eviction->finish(after), nullptr);
   eviction.reset();
-  const auto fill = [&](const FaultRecord& record, int target,
-                        const std::function<bool(std::uint64_t)>& goesOn) {
-    return ContentStore(records, "ann").copy(record.content, target, goesOn);
-  };
+  const FaultSource source{
+      .copy =
+          [&](const FaultRecord& record, int target,
+              const std::function<bool(std::uint64_t)>& goesOn) {
+            return ContentStore(records, "ann").copy(record.content, target, goesOn);
+          },
+      .open = {}};
+  bool isMixed = false;
   {
     std::ofstream filler(place + "/filler", std::ios::binary);
     while (filler.write(text.data(), 64 << 10).flush()) {
     }
   }
-  error = fillFault(file, fill, {}, after);
+  error = fillFault(file, source, {}, after, isMixed);
   ASSERT_NE(error, nullptr);
   EXPECT_TRUE(error->is(NSPOSIXErrorDomain, ENOSPC)) << error->description();
   EXPECT_TRUE(isFaultAtPath(file));
   std::filesystem::remove(place + "/filler");
-  EXPECT_EQ(fillFault(file, fill, {}, after), nullptr);
+  EXPECT_EQ(fillFault(file, source, {}, after, isMixed), nullptr);
   EXPECT_FALSE(isFaultAtPath(file));
   std::ifstream back(file, std::ios::binary);
   EXPECT_TRUE(std::string(std::istreambuf_iterator<char>(back), {}) == text);

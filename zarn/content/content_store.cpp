@@ -92,6 +92,10 @@ NSErrorRef ContentStore::copy(const RZAsset& content, int file, const GoesOn& go
   return contentError(engine_->copyAsset(content, file, {.progress = goesOn}));
 }
 
+NSErrorRef ContentStore::open(const RZAsset& content, FileDescriptor& descriptor) const {
+  return contentError(engine_->openAsset(content, descriptor));
+}
+
 NSErrorRef ContentStore::makeZones(const RZRecordBatch& batch) {
   for (const RZRecordRef& record : batch.recordsToSave) {
     const RZRecordZoneID& zone = record->recordID().zoneID();

@@ -64,6 +64,8 @@ class ContentStore {
 
   /// Writes verified content into an open file; see RZEngine::copyAsset.
   [[nodiscard]] NSErrorRef copy(const RZAsset& content, int file, const GoesOn& goesOn) const;
+  /// For reading from its start; not verified.
+  [[nodiscard]] NSErrorRef open(const RZAsset& content, FileDescriptor& descriptor) const;
 
  private:
   NSErrorRef saveBatch(const std::vector<StoredDocument>& documents, std::size_t begin,

@@ -36,6 +36,13 @@ NSErrorRef notSignedIn() {
         std::string("nobody is signed in to the drive: yomber account sign-in NAME")}});
 }
 
+NSErrorRef ofAnotherAccount(const std::string& account) {
+  return NSError::errorWithDomain(
+      QSOstrellErrorDomain, QSOstrellErrorLoggedOut,
+      {{NSLocalizedDescriptionKey,
+        "its content belongs to the account \"" + account + "\"; sign in to that one"}});
+}
+
 /// Leaves the file closed: nobody else may have it open when it is decided on.
 FaultExamination examineAt(const std::string& path) {
   const FileDescriptor file(
@@ -92,6 +99,7 @@ class DownloadBatch {
     busy.clear();
     for (Download& download : downloads_) {
       if (error && !download.error) download.error = error;
+      if (!download.error) core_.lookAgain(download.subject.path, download.after);
       finish(download);
     }
     downloads_.clear();
@@ -129,11 +137,14 @@ class DownloadBatch {
     NSErrorRef error;
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
       if (!download.subject.row || download.subject.path.empty()) return noSuchFile({});
-      error = fillOnce(download, busy);
+      bool isMixed = false;
+      error = fillOnce(download, busy, isMixed);
       if (!error || !error->is(NSPOSIXErrorDomain, EAGAIN)) break;
       // Somebody has written to the fault.
       const std::string& path = download.subject.path;
-      if (NSErrorRef failure = core_.settleWritten(path, examineAt(path))) return failure;
+      FaultExamination found = examineAt(path);
+      if (isMixed && found.isInterrupted) found.condition = FaultCondition::Mixed;
+      if (NSErrorRef failure = core_.settleWritten(path, found)) return failure;
     }
     if (error && error->is(NSPOSIXErrorDomain, ENOENT)) {
       (void)core_.scanner->scanLocation(download.subject.path, nullptr);
@@ -142,7 +153,7 @@ class DownloadBatch {
     return error;
   }
 
-  NSErrorRef fillOnce(Download& download, std::vector<BusyFile>& busy) {
+  NSErrorRef fillOnce(Download& download, std::vector<BusyFile>& busy, bool& isMixed) {
     const JobSubject& subject = download.subject;
     struct stat status{};
     if (lstat(subject.path.c_str(), &status) != 0) {
@@ -158,12 +169,24 @@ class DownloadBatch {
       }
       return isWanted(download);
     };
-    const auto fetch = [&](const FaultRecord& record, int file,
-                           const std::function<bool(std::uint64_t)>& watch) {
-      if (!store_) return notSignedIn();
-      return store_->copy(record.content, file, watch);
-    };
-    return fillFault(subject.path, fetch, goesOn, download.after);
+    const FaultSource source{.copy =
+                                 [&](const FaultRecord& record, int file,
+                                     const std::function<bool(std::uint64_t)>& watch) {
+                                   NSErrorRef error = whyNotOurs(record);
+                                   return error ? error : store_->copy(record.content, file, watch);
+                                 },
+                             .open =
+                                 [&](const FaultRecord& record, FileDescriptor& content) {
+                                   NSErrorRef error = whyNotOurs(record);
+                                   return error ? error : store_->open(record.content, content);
+                                 }};
+    return fillFault(subject.path, source, goesOn, download.after, isMixed);
+  }
+
+  [[nodiscard]] NSErrorRef whyNotOurs(const FaultRecord& record) const {
+    if (!store_) return notSignedIn();
+    const bool isOurs = record.account.empty() || record.account == core_.account();
+    return isOurs ? nullptr : ofAnotherAccount(record.account);
   }
 
   [[nodiscard]] std::vector<NSProgressRef> progressOf(std::uint64_t item) const {
@@ -301,6 +324,9 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
     return NSErrorRef();
   });
   if (error) log_error(defaultLog(), "[ERROR] filled files cannot be noted: %@", error);
+  for (const Settling& settling : all) {
+    if (settling.before.inode != 0) core.lookAgain(settling.subject.path, settling.after);
+  }
 }
 
 }  // namespace yomber

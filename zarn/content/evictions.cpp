@@ -64,7 +64,15 @@ NSErrorRef compareContent(Departure& departure, int file) {
   return nullptr;
 }
 
-NSErrorRef lookAt(Departure& departure) {
+/// Whether what an interrupted filling or giving up left is all the content's.
+bool isOurs(const ContentCore& core, const FaultRecord& record, int file) {
+  const auto store = core.store();
+  FileDescriptor content;
+  return store && !store->open(record.content, content) &&
+         !hasForeignBytes(file, record, content.get());
+}
+
+NSErrorRef lookAt(const ContentCore& core, Departure& departure) {
   const std::string& path = departure.subject.path;
   const FileDescriptor file(
       open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
@@ -79,7 +87,12 @@ NSErrorRef lookAt(Departure& departure) {
     return refusal("it has changed since it was confirmed in the store");
   }
   // One that an earlier process left half-way is finished.
-  departure.isFault = !heldDate(file.get());
+  if (found.isInterrupted && !isOurs(core, found.record, file.get())) {
+    return refusal(
+        "it was left half-way, and cannot be told from what was written since; "
+        "provide it first");
+  }
+  departure.isFault = !found.isInterrupted;
   departure.after = departure.before;
   return nullptr;
 }
@@ -110,13 +123,18 @@ class EvictionBatch {
     }
     store();
     busy.clear();
-    for (const Departure& departure : departures_) answer(departure);
+    for (const Departure& departure : departures_) {
+      if (departure.isFault) {
+        core_.lookAgain(departure.subject.path, departure.after);
+      }
+      answer(departure);
+    }
   }
 
  private:
   NSErrorRef begin(Departure& departure, std::vector<BusyFile>& busy) {
     if (NSErrorRef error = reasonInRows(core_, departure.subject)) return error;
-    if (NSErrorRef error = lookAt(departure)) return error;
+    if (NSErrorRef error = lookAt(core_, departure)) return error;
     if (departure.isFault) return nullptr;
     const ContentRow& content = *departure.subject.content;
     if (content.content->size > kKeptBytes) busy.emplace_back(core_, departure.before.inode);

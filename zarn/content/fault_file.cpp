@@ -20,11 +20,6 @@ FaultPoint evictLeased("zarn.evict.leased");
 FaultPoint evictMarked("zarn.evict.marked");
 FaultPoint evictSynced("zarn.evict.synced");
 FaultPoint evictPunched("zarn.evict.punched");
-FaultPoint fillBegun("zarn.fill.begun");
-FaultPoint fillCopying("zarn.fill.copying");
-FaultPoint fillVerified("zarn.fill.verified");
-FaultPoint fillDated("zarn.fill.dated");
-FaultPoint fillFilled("zarn.fill.filled");
 FaultPoint settleUnmarked("zarn.settle.unmarked");
 
 NSErrorRef refusal(const std::string& reason) {
@@ -32,14 +27,12 @@ NSErrorRef refusal(const std::string& reason) {
                                   {{NSLocalizedDescriptionKey, reason}});
 }
 
-NSErrorRef cancellation() {
-  return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
-}
-
 FileStamp stampOf(int file) {
   struct stat status{};
   return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
 }
+
+}  // namespace
 
 std::string readHead(int file) {
   std::string head(kKeptBytes, '\0');
@@ -48,13 +41,10 @@ std::string readHead(int file) {
   return head;
 }
 
-/// Whether a small file's content, all of which is kept, is that of the record.
 bool hasContentOf(int file, const FaultRecord& record) {
   RZAsset found;
   return !rz_hashFile(file, {}, found) && found == record.content;
 }
-
-}  // namespace
 
 // Giving up.
 
@@ -127,11 +117,12 @@ Eviction::~Eviction() {
 namespace {
 
 /// `record` is of a larger file than what is kept.
-FaultCondition conditionOfLarge(int file, const FaultExamination& found) {
+FaultCondition conditionOfLarge(int file, FaultExamination& found) {
   const FileStamp& stamp = found.stamp;
   const bool hasHole = hasHoleFrom(file, kKeptBytes, stamp.size);
   if (stamp.size == found.record.content.size) {
-    if (heldDate(file) || stamp.mtime == found.record.mtime) return FaultCondition::Pristine;
+    found.isInterrupted = heldDate(file).has_value();
+    if (found.isInterrupted || stamp.mtime == found.record.mtime) return FaultCondition::Pristine;
     const bool isWritten =
         hasDataFrom(file, kKeptBytes) || headChecksum(readHead(file)) != found.record.head;
     if (!isWritten) return FaultCondition::Pristine;
@@ -180,101 +171,6 @@ NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode, FileSt
   }
   after = stampOf(file.get());
   return nullptr;
-}
-
-// Filling.
-
-namespace {
-
-/// What is around one filling.
-class Filling {
- public:
-  Filling(ChangedFile file, FaultRecord record)
-      : file_(std::move(file)), record_(std::move(record)), lease_(file_.get()) {}
-
-  NSErrorRef run(const FaultContent& content, const std::function<bool(std::uint64_t)>& goesOn) {
-    NSErrorRef error = file_.holdDate();
-    // What an earlier filling may have left would show where the content has holes.
-    if (!error) error = file_.punch();
-    if (!error && fillBegun.hit()) error = file_.failure(ENOSPC);
-    if (!error) error = copy(content, goesOn);
-    if (!error) error = verify();
-    if (!error && fillVerified.hit()) error = file_.failure(EIO);
-    if (!error) error = markFilled();
-    if (error && !isWritten_) {
-      (void)file_.punch();
-      (void)file_.putDatesBack();
-    }
-    return error;
-  }
-
- private:
-  NSErrorRef copy(const FaultContent& content, const std::function<bool(std::uint64_t)>& goesOn) {
-    isAlone_ = lease_.isHeld();
-    const auto watch = [&](std::uint64_t done) {
-      if (fillCopying.hit()) return false;
-      if (isAlone_ && !lease_.isHeld()) {
-        isAlone_ = false;
-        lease_.release();
-      }
-      // Blocks where we have not been: somebody else's.
-      if (!isAlone_ && done < record_.content.size && done > kKeptBytes) {
-        isWritten_ = hasDataFrom(file_.get(), done);
-      }
-      return !isWritten_ && (!goesOn || goesOn(done));
-    };
-    return content(record_, file_.get(), watch);
-  }
-
-  /// The content itself is verified as it is written; what others wrote is not.
-  NSErrorRef verify() {
-    if (isAlone_ && !lease_.isHeld()) isAlone_ = false;
-    const bool isWhole = stampOf(file_.get()).size == record_.content.size &&
-                         (isAlone_ || hasContentOf(file_.get(), record_));
-    if (isWhole) return nullptr;
-    isWritten_ = true;
-    return file_.failure(EAGAIN);
-  }
-
-  NSErrorRef markFilled() {
-    if (NSErrorRef error = file_.putDatesBack()) return error;
-    if (fillDated.hit()) return file_.failure(EIO);
-    if (NSErrorRef error = file_.setAttribute(kFilledAttribute, bootIdentifier())) return error;
-    (void)fillFilled.hit();
-    return nullptr;
-  }
-
-  ChangedFile file_;
-  const FaultRecord record_;
-  FileLease lease_;
-  bool isAlone_ = false;
-  bool isWritten_ = false;  ///< by somebody else: nothing of it may be taken back
-};
-
-}  // namespace
-
-NSErrorRef fillFault(const std::string& path, const FaultContent& content,
-                     const std::function<bool(std::uint64_t)>& goesOn, FileStamp& after) {
-  NSErrorRef error;
-  ChangedFile file = ChangedFile::open(path, &error);
-  if (!file.isValid()) return error;
-  const int descriptor = file.get();
-  const FaultExamination found = examineFault(descriptor);
-  after = found.stamp;
-  if (found.condition == FaultCondition::NoFault) return nullptr;
-  if (found.condition != FaultCondition::Pristine) return file.failure(EAGAIN);
-  if (goesOn && !goesOn(0)) return cancellation();
-  if (found.stamp.size <= kKeptBytes && hasContentOf(descriptor, found.record)) {
-    if (fillVerified.hit()) return file.failure(EIO);
-    error = file.setAttribute(kFilledAttribute, bootIdentifier());
-    (void)fillFilled.hit();
-    if (!error) after = stampOf(descriptor);
-    return error;
-  }
-  const FileDescriptor same(fcntl(descriptor, F_DUPFD_CLOEXEC, 0));
-  error = Filling(std::move(file), found.record).run(content, goesOn);
-  after = stampOf(same.get());
-  return error;
 }
 
 std::optional<RZAsset> hashUnchanged(int file, const FileStamp& stamp, NSErrorRef* error) {

@@ -56,6 +56,7 @@ class Eviction {
 enum class FaultCondition {
   NoFault,        ///< the content is here, or there is no mark
   Pristine,       ///< as we left it, or left it half-way; its date or its name may be others
+  Mixed,          ///< we left it half-way, and somebody wrote into it since; see `hasForeignBytes`
   Rewritten,      ///< somebody has written all there is: their content counts
   PartlyWritten,  ///< somebody has written into it: their bytes stand between holes
   Damaged,        ///< its mark cannot be understood
@@ -65,8 +66,10 @@ struct FaultExamination {
   FaultCondition condition = FaultCondition::NoFault;
   FaultRecord record;
   FileStamp stamp;
+  /// Left half-way while it was filled or given up: what is in it is to be compared.
+  bool isInterrupted = false;
 };
-/// Looks at an open file.
+/// Looks at an open file. Never answers Mixed.
 [[nodiscard]] FaultExamination examineFault(int file);
 
 /// Takes the marks off a file that somebody has rewritten, or whose content is known to be whole
@@ -74,27 +77,51 @@ struct FaultExamination {
 [[nodiscard]] NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode,
                                           FileStamp& after);
 
-/// Brings what somebody wrote into a fault to a new file next to it, and makes the fault what it
-/// was before. Answers where the new file is.
-[[nodiscard]] NSErrorRef rescuePartialWrite(const std::string& path, const FaultRecord& record,
-                                            std::string& rescued);
+/// Brings what somebody wrote into a fault (`condition` PartlyWritten or Mixed) to a new file next
+/// to it, and makes the fault what it was before. Answers where the new file is. EBUSY while
+/// anybody has the fault open.
+[[nodiscard]] NSErrorRef rescuePartialWrite(const std::string& path, FaultCondition condition,
+                                            const FaultRecord& record, std::string& rescued);
 
-/// Writes the content into an open file at the same offsets, and fails unless it is verified to be
-/// that of the record. Calls `goesOn` about once a MiB with the bytes done, and gives up with
-/// NSCocoaErrorDomain 3072 when that answers false.
-using FaultContent = std::function<NSErrorRef(const FaultRecord& record, int file,
-                                              const std::function<bool(std::uint64_t)>& goesOn)>;
+/// Whether an interrupted fault, open as `file`, holds any byte that is not the content's, open as
+/// `content`. An error of reading counts as one.
+[[nodiscard]] bool hasForeignBytes(int file, const FaultRecord& record, int content);
+
+/// NSPOSIXErrorDomain EBUSY: it is open in another program.
+[[nodiscard]] NSErrorRef openElsewhereError(const std::string& path);
+
+/// The bytes that a fault keeps.
+[[nodiscard]] std::string readHead(int file);
+/// Hashes the whole file.
+[[nodiscard]] bool hasContentOf(int file, const FaultRecord& record);
+
+/// Where a fault's content comes from.
+struct FaultSource {
+  /// Writes the content into an open file at the same offsets, and fails unless it is verified to
+  /// be that of the record. Calls `goesOn` about once a MiB with the bytes done, and gives up with
+  /// NSCocoaErrorDomain 3072 when that answers false.
+  std::function<NSErrorRef(const FaultRecord& record, int file,
+                           const std::function<bool(std::uint64_t)>& goesOn)>
+      copy;
+  /// A descriptor of the content, not verified.
+  std::function<NSErrorRef(const FaultRecord& record, FileDescriptor& content)> open;
+};
 
 /// Fills a fault in its place. Its content can be read from then on, in this boot of the machine;
-/// once it was synced, `removeFaultMarks` makes it an ordinary file.
+/// once it was synced, `removeFaultMarks` makes it an ordinary file. A file whose content is here
+/// already is a success. Fails leaving a fault.
 ///
-/// Where nobody else has the file open, nobody gets in meanwhile. Otherwise others may write at the
-/// same time: that is noticed (by blocks that were holes before, and by hashing the file at the
-/// end), and then nothing is marked as filled: the file is left to `examineFault`. Fails leaving a
-/// fault. A file whose content is here already is a success.
-[[nodiscard]] NSErrorRef fillFault(const std::string& path, const FaultContent& content,
+/// Nobody's writing is lost, and nothing that is mixed with it is marked as filled:
+///   - While somebody has it open for writing it is refused, with NSPOSIXErrorDomain EBUSY.
+///   - Who opens it meanwhile waits for the content; a writer for whom the system would not let us
+///     wait any longer gets the fault as it was, and the filling fails with EBUSY.
+///   - Where somebody had it open for reading only, others may come to write: blocks that appear
+///     where we have not been, and the hash at the end, tell. Then, as after an interruption,
+///     nothing is taken back, and the next filling compares what it finds: with `isMixed` set and
+///     EAGAIN when it is not all the content's.
+[[nodiscard]] NSErrorRef fillFault(const std::string& path, const FaultSource& source,
                                    const std::function<bool(std::uint64_t)>& goesOn,
-                                   FileStamp& after);
+                                   FileStamp& after, bool& isMixed);
 
 /// The SHA-256 and size of an open file, provided that it does not change meanwhile; nothing with
 /// an error (EAGAIN when it does).

@@ -45,6 +45,27 @@ int copyWritten(int from, int to, off_t size) {
   return 0;
 }
 
+bool isSameRange(int left, int right, off_t begin, off_t end) {
+  std::vector<char> ours(kPiece);
+  std::vector<char> theirs(kPiece);
+  while (begin < end) {
+    const auto length = std::min<std::size_t>(kPiece, static_cast<std::size_t>(end - begin));
+    const ssize_t got = pread(left, ours.data(), length, begin);
+    if (got <= 0 || pread(right, theirs.data(), static_cast<std::size_t>(got), begin) != got) {
+      return false;
+    }
+    if (!std::equal(ours.begin(), ours.begin() + got, theirs.begin())) return false;
+    begin += got;
+  }
+  return true;
+}
+
+bool syncFolderOf(const std::string& path) {
+  const std::string folder = path.substr(0, path.rfind('/') + 1);
+  const FileDescriptor opened(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  return opened && fsync(opened.get()) == 0;
+}
+
 FileDescriptor makeSibling(const std::string& path, mode_t mode, std::string& made) {
   const std::size_t slash = path.rfind('/');
   const std::string folder = path.substr(0, slash + 1);
@@ -60,21 +81,50 @@ FileDescriptor makeSibling(const std::string& path, mode_t mode, std::string& ma
 
 }  // namespace
 
-NSErrorRef rescuePartialWrite(const std::string& path, const FaultRecord& record,
-                              std::string& rescued) {
+NSErrorRef openElsewhereError(const std::string& path) {
+  return NSError::errorWithDomain(
+      NSPOSIXErrorDomain, EBUSY,
+      {{NSFilePathErrorKey, path},
+       {NSLocalizedDescriptionKey,
+        std::string("it is open for writing in another program, without its content; close it "
+                    "there, then try again")}});
+}
+
+bool hasForeignBytes(int file, const FaultRecord& record, int content) {
+  const std::string head = readHead(file);
+  if (headChecksum(head) != record.head) return true;
+  struct stat status{};
+  if (fstat(file, &status) != 0) return true;
+  for (off_t at = kKeptBytes; at < status.st_size;) {
+    const off_t data = lseek(file, at, SEEK_DATA);
+    if (data < 0) return errno != ENXIO;
+    const off_t hole = lseek(file, data, SEEK_HOLE);
+    if (hole < 0 || !isSameRange(file, content, data, std::min(hole, status.st_size))) return true;
+    at = hole;
+  }
+  return false;
+}
+
+NSErrorRef rescuePartialWrite(const std::string& path, FaultCondition condition,
+                              const FaultRecord& record, std::string& rescued) {
   NSErrorRef error;
   ChangedFile file = ChangedFile::open(path, &error);
   if (!file.isValid()) return error;
   // Its writer may not have finished.
   const FileLease lease(file.get());
-  if (!lease.isHeld()) return file.failure(EAGAIN);
-  if (examineFault(file.get()).condition != FaultCondition::PartlyWritten) {
-    return file.failure(EAGAIN);
-  }
+  if (lease.state() != FileLease::State::Held) return openElsewhereError(path);
+  const FaultExamination found = examineFault(file.get());
+  const bool isStillSo = condition == FaultCondition::Mixed
+                             ? found.condition == FaultCondition::Pristine && found.isInterrupted
+                             : found.condition == condition;
+  if (!isStillSo) return file.failure(EAGAIN);
   const FileDescriptor copy = makeSibling(path, file.status().st_mode & 0777U, rescued);
   if (!copy) return file.failure(errno);
   int number = copyWritten(file.get(), copy.get(), file.status().st_size);
   if (number == 0 && fsync(copy.get()) != 0) number = errno;
+  if (number == 0 && !syncFolderOf(rescued)) number = errno;
+  // Nobody has got in meanwhile: what follows takes away what they would have written.
+  if (number == 0 && lease.state() == FileLease::State::Lost) number = EAGAIN;
   if (number != 0) {
     unlink(rescued.c_str());
     return file.failure(number);

@@ -174,7 +174,26 @@ class ContentDrive : public TestDrive {
     return true;
   }
 
+  /// A document whose content is in the store only.
+  void makeFault(const std::string& path, const std::string& text) {
+    write(path, text);
+    settle();
+    const NSErrorRef error = evict(path);
+    ASSERT_EQ(error, nullptr) << error->description();
+    ASSERT_TRUE(isFault(path));
+  }
+  void stopAt(const std::string& point) {
+    gate_ = layout.home() + "/go-" + point;
+    for (const char* const suffix : {"", ".reached"}) std::filesystem::remove(gate_ + suffix);
+    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate_), nullptr);
+  }
+  bool isStopped() const {
+    return waitUntil([&] { return std::filesystem::exists(gate_ + ".reached"); });
+  }
+  void go() const { std::ofstream(gate_).put('x'); }
+
   std::string storePath;
+  std::string gate_;
   std::shared_ptr<EmbeddedEngine> records;
   ContentEngine::Options options;
   std::shared_ptr<ContentEngine> engine;

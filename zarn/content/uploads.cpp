@@ -4,6 +4,7 @@
 
 #include <cerrno>
 #include <memory>
+#include <utility>
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
@@ -30,6 +31,8 @@ struct Upload {
   enum class Kind { Save, Remove, Nothing, Failed } kind = Kind::Failed;
   ContentRow confirmed;  ///< what will be so when the store has it
   std::string previousZone;
+  std::string owner;        ///< another account, whose content it is
+  bool isToSettle = false;  ///< it is here, and still marked
   NSErrorRef error;
 };
 
@@ -71,7 +74,8 @@ class UploadGroup {
     }
     upload.error = read(upload);
     upload.kind = upload.error ? Upload::Kind::Failed : Upload::Kind::Save;
-    if (!upload.error && isInStore(upload)) upload.kind = Upload::Kind::Nothing;
+    const bool isNothing = !upload.error && (!upload.owner.empty() || isInStore(upload));
+    if (isNothing) upload.kind = Upload::Kind::Nothing;
   }
 
   /// Whether the store's record needs no change.
@@ -95,8 +99,12 @@ class UploadGroup {
     if (uploadRead.hit()) return NSError::errorWithErrno(EIO, path);
     const FaultExamination found = examineFault(file.get());
     switch (found.condition) {
-      case FaultCondition::NoFault:
+      case FaultCondition::NoFault: {
+        // Marked as filled: a copy of one that was so, for which nobody has a job.
+        bool isDamaged = false;
+        upload.isToSettle = readFaultRecord(file.get(), isDamaged).has_value();
         return readContent(upload, file.get());
+      }
       case FaultCondition::Pristine:
         return readFault(upload, found);
       default:
@@ -118,7 +126,12 @@ class UploadGroup {
     return NSError::errorWithErrno(number, path);
   }
 
-  static NSErrorRef readFault(Upload& upload, const FaultExamination& found) {
+  NSErrorRef readFault(Upload& upload, const FaultExamination& found) const {
+    const std::string& account = found.record.account;
+    if (!account.empty() && account != core_.account()) {
+      upload.owner = account;
+      return nullptr;
+    }
     upload.confirmed.content = found.record.content;
     upload.confirmed.stamp = found.stamp;
     return nullptr;
@@ -218,6 +231,7 @@ class UploadGroup {
     });
     if (error) log_error(defaultLog(), "[ERROR] uploads cannot be confirmed: %@", error);
     if (isAway) core_.noteOutOfReach();
+    if (std::exchange(hasSettling_, false)) core_.queue->noteJobs(JobKind::Settle);
     (void)uploadConfirmed.hit();
   }
 
@@ -231,9 +245,21 @@ class UploadGroup {
     }
     core_.finished.fetch_add(1);
     removeJob(connection, job);
+    if (!upload.owner.empty()) return leaveToOwner(connection, upload);
+    if (upload.isToSettle && !findJob(connection, job.item, JobKind::Settle)) {
+      addJob(connection, job.item, JobKind::Settle, job.account, core_.now(), core_.now());
+      hasSettling_ = true;
+    }
     if (!upload.subject.row) return removeContent(connection, job.item);
     if (upload.subject.row->kind != ItemKind::Document || !upload.confirmed.content) return;
     storeConfirmed(transaction, upload.confirmed);
+  }
+
+  /// A copy of another account's fault: no content of ours.
+  void leaveToOwner(Connection& connection, const Upload& upload) const {
+    const std::int64_t owner = accountKey(connection, upload.owner);
+    const std::int64_t now = core_.now();
+    addJob(connection, upload.subject.job.item, JobKind::Upload, owner, now, now);
   }
 
   void storeConfirmed(WriteTransaction& transaction, ContentRow confirmed) {
@@ -261,6 +287,7 @@ class UploadGroup {
   std::unique_ptr<RZAssetGroup> group_;
   std::vector<Upload> uploads_;
   std::uint64_t bytes_ = 0;
+  bool hasSettling_ = false;
 };
 
 }  // namespace

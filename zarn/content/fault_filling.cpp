@@ -1,0 +1,174 @@
+// Filling faults in their places.
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+
+#include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
+#include "zarn/content/fault_file.h"
+
+namespace yomber {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+FaultPoint fillBegun("zarn.fill.begun");
+FaultPoint fillCopying("zarn.fill.copying");
+FaultPoint fillWaited("zarn.fill.waited");
+FaultPoint fillVerified("zarn.fill.verified");
+FaultPoint fillDated("zarn.fill.dated");
+FaultPoint fillFilled("zarn.fill.filled");
+
+NSErrorRef cancellation() {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
+}
+
+FileStamp stampOf(int file) {
+  struct stat status{};
+  return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
+}
+
+/// What is around one filling.
+class Filling {
+ public:
+  Filling(ChangedFile file, const FaultExamination& found, const FaultSource& source)
+      : file_(std::move(file)),
+        record_(found.record),
+        isInterrupted_(found.isInterrupted),
+        source_(source),
+        lease_(file_.get()) {}
+
+  NSErrorRef run(const std::function<bool(std::uint64_t)>& goesOn, bool& isMixed) {
+    isAlone_ = lease_.isHeld();
+    lastHeld_ = Clock::now();
+    if (isInterrupted_) {
+      if (NSErrorRef error = compare(isMixed)) return error;
+    }
+    NSErrorRef error = file_.holdDate();
+    // What an earlier filling may have left would show where the content has holes.
+    if (!error) error = file_.punch();
+    if (!error && fillBegun.hit()) error = file_.failure(ENOSPC);
+    if (!error) error = copy(goesOn);
+    if (!error) error = verify();
+    if (!error && fillVerified.hit()) error = file_.failure(EIO);
+    if (!error) error = markFilled();
+    if (error && !mayBeWritten_) {
+      (void)file_.punch();
+      (void)file_.putDatesBack();
+    }
+    return isGivenUp_ ? openElsewhereError(file_.path()) : error;
+  }
+
+ private:
+  /// What an earlier filling or giving up left, and what somebody wrote since, look the same until
+  /// they are compared.
+  NSErrorRef compare(bool& isMixed) {
+    FileDescriptor content;
+    if (NSErrorRef error = source_.open(record_, content)) return error;
+    isMixed = hasForeignBytes(file_.get(), record_, content.get());
+    return isMixed ? file_.failure(EAGAIN) : nullptr;
+  }
+
+  NSErrorRef copy(const std::function<bool(std::uint64_t)>& goesOn) {
+    const auto watch = [&](std::uint64_t done) {
+      if (fillCopying.hit()) return false;
+      if (isAlone_ && !keepsOthersOut()) return false;
+      // Blocks where we have not been: somebody else's.
+      if (!isAlone_ && done < record_.content.size && done > kKeptBytes) {
+        mayBeWritten_ = hasDataFrom(file_.get(), done);
+      }
+      return !mayBeWritten_ && (!goesOn || goesOn(done));
+    };
+    return source_.copy(record_, file_.get(), watch);
+  }
+
+  /// Who wants the file waits for its content, as long as the system lets them. False: a writer
+  /// is to get it as it was.
+  bool keepsOthersOut() {
+    const FileLease::State state = lease_.state();
+    const auto now = Clock::now();
+    if (state == FileLease::State::Held) {
+      lastHeld_ = now;
+      return true;
+    }
+    const auto longest = FileLease::longestWait();
+    const bool isOver = fillWaited.hit() || now - lastHeld_ > longest * 3 / 4;
+    if (!isOver) return true;
+    if (state == FileLease::State::WantedToRead) {
+      isAlone_ = false;
+      lease_.release();
+      return true;
+    }
+    isGivenUp_ = true;
+    // The system may have lost its patience before we asked.
+    mayBeWritten_ = now - lastHeld_ >= longest;
+    return false;
+  }
+
+  /// The content itself is verified as it is written; what others wrote is not.
+  NSErrorRef verify() {
+    if (isAlone_ && lease_.state() == FileLease::State::Lost &&
+        Clock::now() - lastHeld_ >= FileLease::longestWait()) {
+      isAlone_ = false;
+    }
+    const bool isWhole = stampOf(file_.get()).size == record_.content.size &&
+                         (isAlone_ || hasContentOf(file_.get(), record_));
+    if (isWhole) return nullptr;
+    mayBeWritten_ = true;
+    return file_.failure(EAGAIN);
+  }
+
+  NSErrorRef markFilled() {
+    if (NSErrorRef error = file_.putDatesBack()) return error;
+    if (fillDated.hit()) return file_.failure(EIO);
+    if (NSErrorRef error = file_.setAttribute(kFilledAttribute, bootIdentifier())) return error;
+    (void)fillFilled.hit();
+    return nullptr;
+  }
+
+  ChangedFile file_;
+  const FaultRecord record_;
+  const bool isInterrupted_;
+  const FaultSource& source_;
+  FileLease lease_;
+  bool isAlone_ = false;
+  Clock::time_point lastHeld_;
+  bool isGivenUp_ = false;     ///< for a writer who waits
+  bool mayBeWritten_ = false;  ///< by somebody else: nothing of it may be taken back
+};
+
+}  // namespace
+
+NSErrorRef fillFault(const std::string& path, const FaultSource& source,
+                     const std::function<bool(std::uint64_t)>& goesOn, FileStamp& after,
+                     bool& isMixed) {
+  isMixed = false;
+  NSErrorRef error;
+  const bool isWritten = isOpenForWriting(path);
+  ChangedFile file = ChangedFile::open(path, &error);
+  if (!file.isValid()) return error;
+  const int descriptor = file.get();
+  const FaultExamination found = examineFault(descriptor);
+  if (found.condition == FaultCondition::NoFault) {
+    after = found.stamp;
+    return nullptr;
+  }
+  if (found.condition != FaultCondition::Pristine) return file.failure(EAGAIN);
+  if (goesOn && !goesOn(0)) return cancellation();
+  if (found.stamp.size <= kKeptBytes && hasContentOf(descriptor, found.record)) {
+    if (fillVerified.hit()) return file.failure(EIO);
+    error = file.setAttribute(kFilledAttribute, bootIdentifier());
+    (void)fillFilled.hit();
+    if (!error) after = stampOf(descriptor);
+    return error;
+  }
+  if (isWritten) return openElsewhereError(path);
+  const FileDescriptor same(fcntl(descriptor, F_DUPFD_CLOEXEC, 0));
+  error = Filling(std::move(file), found, source).run(goesOn, isMixed);
+  after = stampOf(same.get());
+  return error;
+}
+
+}  // namespace yomber

@@ -50,7 +50,7 @@ void FirstScan::fillRow(const FolderSnapshot& snapshot, const FolderEntry& entry
   row.size = entry.size;
   row.mtime = entry.mtime;
   row.btime = entry.btime;
-  row.ctime = entry.ctime;
+  row.ctime = entry.changeTimeToRemember();
   row.inode = entry.inode;
   row.extra =
       attributes.extra.isEmpty() ? nullptr : std::make_shared<const ItemExtra>(attributes.extra);

@@ -10,6 +10,7 @@
 #include <cstddef>
 #include <limits>
 
+#include "zarn/change_times.h"
 #include "zarn/tree_layout.h"
 
 namespace yomber {
@@ -72,7 +73,9 @@ bool lookAtEntry(int folder, const char* name, FolderEntry& out) {
   struct statx status;
   const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_STATX_DONT_SYNC |
                     (*name == '\0' ? AT_EMPTY_PATH : 0);
+  const std::int64_t before = coarseNow();
   if (statx(folder, name, flags, kWanted, &status) != 0) return false;
+  const std::int64_t after = coarseNow();
   const bool isMountRoot = (status.stx_attributes & STATX_ATTR_MOUNT_ROOT) != 0;
   // What is mounted inside the tree is not of the tree.
   if (!typeOf(status.stx_mode, out.type) || (isMountRoot && *name != '\0')) {
@@ -85,6 +88,7 @@ bool lookAtEntry(int folder, const char* name, FolderEntry& out) {
   out.size = out.type == EntryType::Folder ? 0 : status.stx_size;
   out.mtime = nanoseconds(status.stx_mtime);
   out.ctime = nanoseconds(status.stx_ctime);
+  out.isSettled = isSettledTime(out.ctime, before, after);
   out.hasBirthTime = (status.stx_mask & STATX_BTIME) != 0;
   out.btime = out.hasBirthTime ? nanoseconds(status.stx_btime) : out.mtime;
   return true;

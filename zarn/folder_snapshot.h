@@ -20,6 +20,7 @@ struct FolderEntry {
   std::uint16_t nameLength = 0;
   EntryType type = EntryType::File;
   bool hasBirthTime = false;
+  bool isSettled = false;  ///< a later change has another ctime
   std::uint32_t mode = 0;
   std::uint32_t links = 0;
   std::uint64_t inode = 0;
@@ -33,6 +34,8 @@ struct FolderEntry {
   [[nodiscard]] bool carriesID() const {
     return type == EntryType::Folder || (type == EntryType::File && links == 1);
   }
+  /// The ctime, or one that no look finds where a later change may have this one too.
+  [[nodiscard]] std::int64_t changeTimeToRemember() const { return isSettled ? ctime : ctime - 1; }
 };
 
 /// A folder's entries as they were when it was read. What never syncs, and what is neither file nor

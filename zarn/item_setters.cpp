@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "zarn/change_times.h"
 #include "zarn/daemon_errors.h"
 #include "zarn/folder_snapshot.h"
 #include "zarn/item_attributes.h"
@@ -104,12 +105,9 @@ int applyChange(WriteTransaction& transaction, const LocatedItem& item, const ch
     // What is kept goes to the file, which can carry it by now, with the next scan.
     const int failure = writeItemAttribute(folder, item.name, entry.inode, attribute, value);
     if (failure != 0) return failure;
-    FolderEntry now;
-    // Otherwise the older time makes the next scan look again.
-    const bool isSame = before->ctime == entry.ctime && !transaction.isBusy(entry.inode) &&
-                        lookAtEntry(folder, item.name.c_str(), now) && now.inode == entry.inode &&
-                        now.mtime == before->mtime && now.size == before->size;
-    if (isSame) after.ctime = now.ctime;
+    if (before->ctime == entry.ctime && !transaction.isBusy(entry.inode)) {
+      after.ctime = changeTimeAfterOwnWrite(folder, item.name, after).value_or(after.ctime);
+    }
   }
   const bool hasSameExtra = before->extra == after.extra ||
                             (before->extra && after.extra && *before->extra == *after.extra);

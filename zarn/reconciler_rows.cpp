@@ -1,5 +1,7 @@
 // Reconciler: rows from entries.
 #include "platform/foundation/bounced_name.h"
+#include "platform/foundation/fault_points.h"
+#include "zarn/change_times.h"
 #include "zarn/reconciler.h"
 #include "zarn/row_queries.h"
 
@@ -53,7 +55,7 @@ void Reconciler::describe(const Candidate& candidate, ItemRow& row) const {
   row.size = entry.size;
   row.mtime = entry.mtime;
   row.btime = entry.btime;
-  row.ctime = entry.ctime;
+  row.ctime = entry.changeTimeToRemember();
   row.inode = entry.inode;
 
   const ItemAttributes& attributes = candidate.attributes;
@@ -88,13 +90,10 @@ void Reconciler::stamp(const Candidate& candidate, ItemRow& row) const {
   }
   const int folder = candidate.folder->get();
   const std::string name = candidate.isOpenedFolder ? "." : candidate.name;
-  if (!stampItem(folder, name, row.inode, row.id)) return;
+  static FaultPoint beforeStamp("zarn.reconciler.before-stamp");
+  if (beforeStamp.hit() || !stampItem(folder, name, row.inode, row.id)) return;
   row.flags |= row_flag::kStamped;
-  FolderEntry now;
-  const bool isStill = lookAtEntry(folder, name.c_str(), now) && now.inode == row.inode &&
-                       now.mtime == row.mtime && now.size == row.size;
-  // Otherwise the older time makes the next scan look again.
-  if (isStill) row.ctime = now.ctime;
+  row.ctime = changeTimeAfterOwnWrite(folder, name, row).value_or(row.ctime);
 }
 
 /// What the row kept because the file could not carry it goes to the file as soon as it can.

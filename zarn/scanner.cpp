@@ -77,7 +77,7 @@ ItemRow rowOfPlace(const ScanPlace& place) {
   row.inode = entry.inode;
   row.mtime = entry.mtime;
   row.btime = entry.btime;
-  row.ctime = entry.ctime;
+  row.ctime = entry.changeTimeToRemember();
   return row;
 }
 

@@ -4,6 +4,7 @@
 
 #include <vector>
 
+#include "zarn/change_times.h"
 #include "zarn/connection.h"
 #include "zarn/folder_opener.h"
 #include "zarn/folder_snapshot.h"
@@ -36,6 +37,7 @@ NSErrorRef readBatch(const Database& database, std::uint32_t limit, Batch& batch
       readRow(*statement, batch.rows.emplace_back());
       batch.end = statement->integer(kRowColumnCount);
     }
+    for (ItemRow& row : batch.rows) loadExtra(connection, row);
   });
 }
 
@@ -48,12 +50,10 @@ bool isToBeStamped(const ItemRow& row) {
 bool stampRow(int folder, const std::string& name, const ItemRow& row, Stamped& out) {
   FolderEntry before;
   if (!lookAtEntry(folder, name.c_str(), before) || !before.carriesID()) return false;
-  if (before.inode != row.inode || before.ctime != row.ctime) return false;
-  if (!stampItem(folder, name, row.inode, row.id)) return false;
-  FolderEntry after;
-  if (!lookAtEntry(folder, name.c_str(), after) || after.inode != row.inode) return false;
-  const bool isStill = after.mtime == before.mtime && after.size == before.size;
-  out = {row.id, row.ctime, isStill ? after.ctime : row.ctime};
+  const bool isStill = before.inode == row.inode && before.btime == row.btime &&
+                       before.mtime == row.mtime && before.size == row.size;
+  if (!isStill || !stampItem(folder, name, row.inode, row.id)) return false;
+  out = {row.id, row.ctime, changeTimeAfterOwnWrite(folder, name, row).value_or(row.ctime)};
   return true;
 }
 

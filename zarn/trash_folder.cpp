@@ -5,7 +5,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <ctime>
@@ -21,8 +20,6 @@ namespace {
 constexpr int kOpenFolder = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr mode_t kPrivateFile = 0600;
 constexpr std::size_t kLongestName = kMaximumNameLength - kTrashInfoSuffix.size();
-/// Paths may be long, but not without end.
-constexpr std::size_t kLargestInfo = 1024 * 1024;
 constexpr std::time_t kOthersGrace = 60;  // seconds
 
 int writeAll(int file, std::string_view text) {
@@ -33,23 +30,6 @@ int writeAll(int file, std::string_view text) {
     text.remove_prefix(static_cast<std::size_t>(length));
   }
   return 0;
-}
-
-/// Nothing when it cannot be read, or is too large.
-std::optional<std::string> readAll(const std::string& path) {
-  const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
-  struct stat status{};
-  if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return std::nullopt;
-  std::string text;
-  std::array<char, 4096> buffer;
-  for (;;) {
-    const ssize_t length = read(file.get(), buffer.data(), buffer.size());
-    if (length < 0 && errno == EINTR) continue;
-    if (length < 0) return std::nullopt;
-    if (length == 0) return text;
-    text.append(buffer.data(), static_cast<std::size_t>(length));
-    if (text.size() > kLargestInfo) return std::nullopt;
-  }
 }
 
 }  // namespace
@@ -123,8 +103,7 @@ int TrashFolder::writeInfo(const std::string& path, const std::string& text) con
 }
 
 std::optional<TrashInfo> TrashFolder::infoOf(const std::string& name) const {
-  const auto text = readAll(infoPath(name));
-  return text ? parseTrashInfo(*text) : std::nullopt;
+  return readTrashInfo(infoPath(name));
 }
 
 bool TrashFolder::isInTrash(const std::string& name) const {

@@ -98,6 +98,24 @@ TEST_F(FileOperationsTest, BouncesToAFreeNameOnlyWhenAllowed) {
   EXPECT_EQ(get("tree/folder/report 3.pdf"), "third");
 }
 
+TEST_F(FileOperationsTest, WhatLeavesATrashGetsBackTheNameThatItHad) {
+  setFormerNameResolver([](const std::string& onDisk) {
+    return std::optional(onDisk.ends_with("/odd") ? std::string("a/b") : std::string("report"));
+  });
+  put("tree/report 2", "first");
+  put("tree/report 3", "second");
+  put("tree/report 4", "third");
+  put("tree/odd", "fourth");
+  const auto to = [&](const std::string& name, Bouncing bouncing) {
+    return move(url("tree/" + name), url("tree/folder"), bouncing).path();
+  };
+  EXPECT_EQ(to("report 2", Bouncing::Allowed), at("tree/folder/report"));
+  EXPECT_EQ(to("report 3", Bouncing::Allowed), at("tree/folder/report 2"));
+  EXPECT_EQ(to("report 4", Bouncing::Forbidden), at("tree/folder/report 4"));
+  EXPECT_EQ(to("odd", Bouncing::Allowed), at("tree/folder/odd"));
+  EXPECT_EQ(get("tree/folder/report"), "first");
+}
+
 TEST_F(FileOperationsTest, BouncesManyAtOnceEachToANameOfItsOwn) {
   constexpr int kMany = 16;
   std::vector<std::future<OperationAnswer>> answers;

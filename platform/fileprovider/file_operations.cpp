@@ -87,7 +87,15 @@ void fp_reparentUnderFolder(const NSURLRef& url, const NSURLRef& folderURL,
 
 void fp_reparentUnderFolder(const NSURLRef& url, const NSURLRef& folderURL, Bouncing allowBouncing,
                             URLHandler completionHandler) {
-  placeUnder(url, folderURL, nameOf(url), allowBouncing, std::move(completionHandler), moveFile);
+  placeOnPool(std::move(completionHandler), [=]() -> Placed {
+    if (url == nullptr || folderURL == nullptr) return {nullptr, noLocation()};
+    const FileLocation source = locateFile(url);
+    const auto former =
+        allowBouncing == Bouncing::Allowed ? formerNameOf(source) : std::optional<std::string>();
+    const std::string name = former.value_or(nameOf(url));
+    if (NSErrorRef error = checkFileName(name)) return {nullptr, std::move(error)};
+    return moveFile(source, {locateFolder(folderURL), name, allowBouncing});
+  });
 }
 
 void fp_deleteWithCompletionHandler(const NSURLRef& url, ErrorHandler completionHandler) {

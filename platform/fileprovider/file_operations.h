@@ -54,6 +54,7 @@ void fp_renameWithNewName(const NSURLRef& url, const std::string& newName,
 void fp_reparentUnderFolder(const NSURLRef& url, const NSURLRef& folderURL,
                             const std::optional<std::string>& withNewName,
                             URLHandler completionHandler);
+/// Where bouncing is allowed, what a trash kept under another name gets back the name that it had.
 void fp_reparentUnderFolder(const NSURLRef& url, const NSURLRef& folderURL, Bouncing allowBouncing,
                             URLHandler completionHandler);
 
@@ -79,6 +80,12 @@ inline constexpr const char* FPCollidingURLKey = "FPCollidingURL";
 using PhysicalLocationResolver = std::function<NSURLRef(const NSURLRef& logical)>;
 /// The client library sets it. Any thread; an empty one takes it away.
 void setPhysicalLocationResolver(PhysicalLocationResolver resolver);
+
+/// The name that a file had before a trash took it, by where it is on this disk; nothing for what
+/// is in no trash, or whose name is not known. May block.
+using FormerNameResolver = std::function<std::optional<std::string>(const std::string& onDisk)>;
+/// The client library sets it. Any thread; an empty one takes it away.
+void setFormerNameResolver(FormerNameResolver resolver);
 
 /// Where copies are made before they are renamed into place: a folder of this user's on the tree's
 /// file system, made when it is missing. What a crash left there is removed by the next copy. Empty

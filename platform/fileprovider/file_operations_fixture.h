@@ -48,6 +48,7 @@ class FileOperationsTest : public testing::Test {
   ~FileOperationsTest() override {
     setStagingFolder({});
     setPhysicalLocationResolver({});
+    setFormerNameResolver({});
     FaultPoint::disarmAll();
   }
 

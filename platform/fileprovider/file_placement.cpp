@@ -30,6 +30,7 @@ FaultPoint treeIsTakenAway("fileprovider.delete.taken-away");
 
 struct Settings {
   AtomicCell<PhysicalLocationResolver> resolver;
+  AtomicCell<FormerNameResolver> formerName;
   AtomicCell<std::string> staging;
 };
 
@@ -188,6 +189,16 @@ bool isUnspeakable(int number) { return number == ENAMETOOLONG || number == EILS
 
 void setPhysicalLocationResolver(PhysicalLocationResolver resolver) {
   settings().resolver.store(std::move(resolver));
+}
+
+void setFormerNameResolver(FormerNameResolver resolver) {
+  settings().formerName.store(std::move(resolver));
+}
+
+std::optional<std::string> formerNameOf(const FileLocation& file) {
+  const auto resolver = settings().formerName.load();
+  auto name = resolver ? resolver(file.onDisk) : std::nullopt;
+  return name && checkFileName(*name) == nullptr ? name : std::nullopt;
 }
 
 void setStagingFolder(std::string path) { settings().staging.store(std::move(path)); }

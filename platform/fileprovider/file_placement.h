@@ -37,6 +37,9 @@ struct Placed {
 /// saying so.
 [[nodiscard]] FileLocation locateFolder(const NSURLRef& url);
 
+/// See FormerNameResolver; nothing as well for a name that no file can have.
+[[nodiscard]] std::optional<std::string> formerNameOf(const FileLocation& file);
+
 [[nodiscard]] Placed makeFolder(const FileDestination& destination);
 [[nodiscard]] Placed moveFile(const FileLocation& source, const FileDestination& destination);
 /// In its folder. The name that it has already is no clash with itself.

@@ -13,6 +13,7 @@
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
 #include "platform/ostrell/item_additions.h"
+#include "platform/ostrell/trash_info.h"
 
 namespace yomber {
 namespace {
@@ -114,6 +115,7 @@ void DaemonLink::replaceCurrent(const std::string& home) {
 std::shared_ptr<DaemonLink> DaemonLink::create(const std::string& home) {
   registerItemsInErrors();
   setPhysicalLocationResolver([](const NSURLRef& logical) { return qs_physicalURL(logical); });
+  setFormerNameResolver(trashedName);
   const DrivePaths paths = DrivePaths::forHome(home);
   setStagingFolder(paths.privateDirectory + "/copies");
   return std::shared_ptr<DaemonLink>(new DaemonLink(paths.home, paths.daemonSocket));

@@ -1,8 +1,16 @@
 #include "platform/ostrell/trash_info.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <array>
+#include <cerrno>
 #include <cstdint>
 #include <ctime>
+#include <utility>
+
+#include "platform/foundation/file_descriptor.h"
 
 namespace yomber {
 namespace {
@@ -13,6 +21,33 @@ constexpr std::string_view kDeletionDate = "DeletionDate";
 constexpr std::string_view kContainer = "X-Yomber-Container";
 constexpr std::string_view kPathInContainer = "X-Yomber-Path";
 constexpr std::string_view kKind = "X-Yomber-Kind";
+
+/// Paths may be long, but not without end.
+constexpr std::size_t kLargestInfo = 1024 * 1024;
+
+/// Nothing when it cannot be read, or is too large.
+std::optional<std::string> readAll(const std::string& path) {
+  const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
+  struct stat status{};
+  if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return std::nullopt;
+  std::string text;
+  std::array<char, 4096> buffer;
+  for (;;) {
+    const ssize_t length = read(file.get(), buffer.data(), buffer.size());
+    if (length < 0 && errno == EINTR) continue;
+    if (length < 0) return std::nullopt;
+    if (length == 0) return text;
+    text.append(buffer.data(), static_cast<std::size_t>(length));
+    if (text.size() > kLargestInfo) return std::nullopt;
+  }
+}
+
+/// What comes before the last slash, and what after it.
+std::pair<std::string_view, std::string_view> splitPath(std::string_view path) {
+  const std::size_t slash = path.rfind('/');
+  if (slash == std::string_view::npos) return {{}, path};
+  return {path.substr(0, slash), path.substr(slash + 1)};
+}
 
 bool isPlain(char c) {
   const bool isLetter = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
@@ -136,6 +171,23 @@ std::optional<TrashInfo> parseTrashInfo(std::string_view text) {
     info.pathInContainer.clear();
   }
   return info;
+}
+
+std::optional<TrashInfo> readTrashInfo(const std::string& path) {
+  const auto text = readAll(path);
+  return text ? parseTrashInfo(*text) : std::nullopt;
+}
+
+std::optional<std::string> trashedName(const std::string& path) {
+  const auto [folder, name] = splitPath(path);
+  const auto [trash, files] = splitPath(folder);
+  const auto trashName = splitPath(trash).second;
+  if (files != "files" || !trashName.starts_with(".Trash") || name.empty()) return std::nullopt;
+  const auto info = readTrashInfo(std::string(trash) + "/info/" + std::string(name) +
+                                  std::string(kTrashInfoSuffix));
+  if (!info) return std::nullopt;
+  const std::string former(splitPath(info->path).second);
+  return former.empty() ? std::nullopt : std::optional(former);
 }
 
 std::string trashDeletionDate(NSDate date) {

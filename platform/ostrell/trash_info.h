@@ -31,6 +31,12 @@ inline constexpr std::string_view kTrashInfoSuffix = ".trashinfo";
 [[nodiscard]] std::string trashInfoText(const TrashInfo& info);
 [[nodiscard]] std::optional<TrashInfo> parseTrashInfo(std::string_view text);
 
+/// Of a file; nothing as well when it cannot be read, or is too large to be one.
+[[nodiscard]] std::optional<TrashInfo> readTrashInfo(const std::string& path);
+/// The name that a file at `<trash>/files/NAME` had, by the information beside it. Nothing for what
+/// lies elsewhere, or deeper. Reads the disk.
+[[nodiscard]] std::optional<std::string> trashedName(const std::string& path);
+
 /// A deletion date as it is written.
 [[nodiscard]] std::string trashDeletionDate(NSDate date);
 

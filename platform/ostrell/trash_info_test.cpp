@@ -1,9 +1,13 @@
 #include "platform/ostrell/trash_info.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cstdlib>
 #include <ctime>
+#include <fstream>
+
+#include "platform/foundation/temporary_directory.h"
 
 namespace yomber {
 namespace {
@@ -58,6 +62,22 @@ TEST(TrashInfoTest, DropsAPlaceInAContainerThatMakesNoSense) {
     EXPECT_EQ(parsed->containerID, "") << path;
     EXPECT_EQ(parsed->pathInContainer, "") << path;
   }
+}
+
+TEST(TrashInfoTest, TellsTheNameThatAFileInTheTrashHad) {
+  const TemporaryDirectory directory;
+  const std::string trash = directory.path() + "/.Trash";
+  for (const char* folder : {"", "/files", "/info"}) {
+    ASSERT_EQ(mkdir((trash + folder).c_str(), 0700), 0);
+  }
+  TrashInfo info;
+  info.path = "Reports/" + std::string(255, 'x');
+  std::ofstream(trash + "/info/x 2.trashinfo") << trashInfoText(info);
+  EXPECT_EQ(trashedName(trash + "/files/x 2"), std::string(255, 'x'));
+  EXPECT_FALSE(trashedName(trash + "/files/x"));
+  EXPECT_FALSE(trashedName(trash + "/files/x 2/below"));
+  EXPECT_FALSE(trashedName(directory.path() + "/files/x 2"));
+  EXPECT_FALSE(trashedName("x 2"));
 }
 
 TEST(TrashInfoTest, DatesAreLocalTime) {

@@ -145,6 +145,7 @@ struct Database::State {
   std::weak_ptr<CommitParticipant> participant GUARDED_BY(sinksMutex);
   BusyFiles busyFiles;
   RecentBackups recentBackups;
+  RecentlyGone recentlyGone;  // the writer's
 
   std::thread thread;
   std::thread checkpointer;
@@ -237,7 +238,8 @@ void Database::State::runBatch(std::vector<Task>& batch) {
     for (Task& task : batch) task.result = error;
     return;
   }
-  WriteTransaction transaction(*writer, rank, nowNanoseconds(), busyFiles, recentBackups);
+  WriteTransaction transaction(*writer, rank, nowNanoseconds(), busyFiles, recentBackups,
+                               recentlyGone);
   std::function<void()> afterwards;
   try {
     writer->execute("BEGIN");

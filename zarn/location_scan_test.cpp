@@ -72,6 +72,62 @@ TEST_F(LocationScanTest, WhatIsGoneLosesItsRowAndComesBackUnderItsId) {
   EXPECT_EQ(look("b.txt")->id, a);
 }
 
+/// What no scan but the first has seen carries no id yet; links never do.
+class HalfSeenMoveTest : public TestDrive {
+ protected:
+  void vanish(const std::string& path) {
+    NSErrorRef error;
+    EXPECT_FALSE(scanner->scanLocation(at(path), &error)) << path;
+    EXPECT_FALSE(row(path)) << path;
+  }
+};
+
+TEST_F(HalfSeenMoveTest, KeepsTheIdsOfWhatCarriesNone) {
+  makeFolder("folder");
+  write("folder/below");
+  write("file");
+  ASSERT_EQ(symlink("nowhere", at("link").c_str()), 0);
+  scan();
+  ASSERT_FALSE(idOnDisk("file"));
+  const auto folder = id("folder");
+  const auto below = id("folder/below");
+  const auto file = id("file");
+  const auto link = id("link");
+  for (const char* name : {"folder", "file", "link"}) {
+    rename(name, std::string("moved ") + name);
+    vanish(name);
+  }
+  EXPECT_EQ(scanFolders({""}), nullptr);
+  EXPECT_EQ(id("moved folder"), folder);
+  EXPECT_EQ(id("moved folder/below"), below);
+  EXPECT_EQ(id("moved file"), file);
+  EXPECT_EQ(id("moved link"), link);
+}
+
+TEST_F(HalfSeenMoveTest, GivesAnotherFileAnotherId) {
+  write("a");
+  scan();
+  const auto a = id("a");
+  remove("a");
+  vanish("a");
+  // Most likely with the inode that has just become free.
+  for (int i = 0; i < 20; ++i) write("new" + std::to_string(i));
+  EXPECT_EQ(scanFolders({""}), nullptr);
+  for (int i = 0; i < 20; ++i) EXPECT_NE(id("new" + std::to_string(i)), a);
+}
+
+TEST_F(HalfSeenMoveTest, GivesAnIdToOneItemOnly) {
+  write("a");
+  scan();
+  const auto a = id("a");
+  rename("a", "b");
+  vanish("a");
+  ASSERT_EQ(link(at("b").c_str(), at("c").c_str()), 0);
+  EXPECT_EQ(scanFolders({""}), nullptr);
+  EXPECT_TRUE((id("b") == a) != (id("c") == a));
+  EXPECT_NE(id("b"), id("c"));
+}
+
 TEST_F(LocationScanTest, ReplacedTypesAreOtherItems) {
   const auto a = id("folder/a.txt");
   remove("folder/a.txt");

@@ -136,6 +136,8 @@ class Reconciler {
   void move(WriteTransaction& transaction, const Candidate& candidate, const ItemRow& row);
   void postpone(const Candidate& candidate);
   void add(WriteTransaction& transaction, const Candidate& candidate);
+  [[nodiscard]] static std::optional<ItemRow> findFormer(WriteTransaction& transaction,
+                                                         const Candidate& candidate);
   void removeGone(WriteTransaction& transaction);
 
   // Storing (reconciler_rows.cpp).

@@ -132,13 +132,30 @@ void Reconciler::postpone(const Candidate& candidate) {
   ++openFolders_;
 }
 
+/// What it was before it was seen to go, without being seen to come.
+std::optional<ItemRow> Reconciler::findFormer(WriteTransaction& transaction,
+                                              const Candidate& candidate) {
+  // Without a birth time another file with its inode could be taken for it.
+  if (candidate.attributes.id || !candidate.entry.hasBirthTime) return std::nullopt;
+  return transaction.recentlyGone().take(candidate.entry.inode, [&](const ItemRow& row) {
+    return isSameFile(row, candidate.entry, candidate.attributes) &&
+           !findByID(transaction.connection(), row.id);
+  });
+}
+
 void Reconciler::add(WriteTransaction& transaction, const Candidate& candidate) {
   // Somebody else's scan may have been faster.
   const auto present = findByDiskName(transaction.connection(), candidate.parent, candidate.name);
   if (present && !gone_.contains(present->id)) return;
   ItemRow row;
+  const auto former = findFormer(transaction, candidate);
+  if (former) {
+    row.extra = former->extra;
+    row.flags = former->flags & row_flag::kKeepsExtra;
+  }
   describe(candidate, row);
-  row.id = candidate.attributes.id ? *candidate.attributes.id : transaction.issueID();
+  row.id = candidate.attributes.id ? *candidate.attributes.id
+                                   : (former ? former->id : transaction.issueID());
   row.parent = candidate.parent;
   choosePlace(transaction, candidate, row);
   stamp(candidate, row);

@@ -115,6 +115,8 @@ void WriteTransaction::remove(const ItemRow& row) {
 }
 
 void WriteTransaction::removeOne(const ItemRow& row) {
+  const bool carriesID = (row.flags & row_flag::kStamped) != 0 || row.isContainerFolder();
+  if (!carriesID && row.id >= kFirstIssuedID) recentlyGone_.note(row);
   StatementUse erase(connection_.prepared("DELETE FROM item WHERE id=?1"));
   erase->bindID(1, row.id);
   erase->step();

@@ -11,6 +11,7 @@
 #include "zarn/connection.h"
 #include "zarn/item_row.h"
 #include "zarn/recent_backups.h"
+#include "zarn/recently_gone.h"
 
 namespace yomber {
 
@@ -25,12 +26,14 @@ inline constexpr std::int64_t kMaximumTombstones = 100'000;
 class WriteTransaction {
  public:
   WriteTransaction(Connection& connection, std::uint64_t rank, std::int64_t now,
-                   const BusyFiles& busyFiles, RecentBackups& recentBackups)
+                   const BusyFiles& busyFiles, RecentBackups& recentBackups,
+                   RecentlyGone& recentlyGone)
       : connection_(connection),
         rank_(rank),
         now_(now),
         busyFiles_(busyFiles),
-        recentBackups_(recentBackups) {}
+        recentBackups_(recentBackups),
+        recentlyGone_(recentlyGone) {}
 
   [[nodiscard]] Connection& connection() { return connection_; }
   /// Of the last change so far.
@@ -43,6 +46,7 @@ class WriteTransaction {
   /// See BusyFiles.
   [[nodiscard]] bool isBusy(std::uint64_t inode) const { return busyFiles_.contains(inode); }
   [[nodiscard]] RecentBackups& recentBackups() { return recentBackups_; }
+  [[nodiscard]] RecentlyGone& recentlyGone() { return recentlyGone_; }
 
   /// An id that no item has.
   [[nodiscard]] std::uint64_t issueID();
@@ -93,6 +97,7 @@ class WriteTransaction {
   const std::int64_t now_;
   const BusyFiles& busyFiles_;
   RecentBackups& recentBackups_;
+  RecentlyGone& recentlyGone_;
   std::vector<ItemChange> changes_;
   std::vector<std::uint64_t> touched_;
 };

@@ -130,6 +130,7 @@ class Reconciler {
   bool isStillThere(const Candidate& candidate);
   void decide(WriteTransaction& transaction, Candidate& candidate);
   void decideOpen(WriteTransaction& transaction);
+  [[nodiscard]] static bool isBeingSaved(const Candidate& candidate, const ItemRow& own);
   bool takeReplaced(WriteTransaction& transaction, Candidate& candidate);
   bool takeBackedUp(WriteTransaction& transaction, Candidate& candidate,
                     const std::optional<ItemRow>& own);

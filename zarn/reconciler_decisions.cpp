@@ -41,6 +41,16 @@ bool Reconciler::isStillThere(const Candidate& candidate) {
   return isThere;
 }
 
+/// Whether a file is what a program has just written next to a document in order to save it. One
+/// that the store has already counts as well while it is young: uploads are faster than some
+/// programs. The rename was its last change, so its age then can still be told.
+bool Reconciler::isBeingSaved(const Candidate& candidate, const ItemRow& own) {
+  constexpr std::int64_t kLongestSave = 60'000'000'000;
+  const bool isYoung = candidate.entry.ctime - candidate.entry.btime < kLongestSave;
+  const bool isUploaded = (own.flags & row_flag::kUploaded) != 0;
+  return !isUploaded || (isYoung && own.parent == candidate.parent);
+}
+
 bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidate) {
   const auto place = gone_.find(candidate.replaced);
   if (place == gone_.end() || candidate.entry.type != EntryType::File) return false;
@@ -48,7 +58,7 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
   if (!isSameType(replaced, candidate.entry) || isElsewhere(replaced)) return false;
   if (!isStillThere(candidate)) return false;
   const auto own = findOwnRow(transaction, candidate);
-  if (own && (own->flags & row_flag::kUploaded) != 0) return false;
+  if (own && !isBeingSaved(candidate, *own)) return false;
   // A file that nobody else knows yet, saved over a document: the document goes on.
   if (own) {
     gone_.erase(own->id);
@@ -66,7 +76,7 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
 bool Reconciler::takeBackedUp(WriteTransaction& transaction, Candidate& candidate,
                               const std::optional<ItemRow>& own) {
   if (candidate.entry.type != EntryType::File) return false;
-  if (own && (own->flags & row_flag::kUploaded) != 0) return false;
+  if (own && !isBeingSaved(candidate, *own)) return false;
   const auto backup = transaction.recentBackups().take(candidate.parent, candidate.name);
   if (!backup || (own && own->id == backup->item)) return false;
   const auto row = findByID(transaction.connection(), backup->item);

@@ -7,7 +7,12 @@
 #include <sstream>
 #include <stdexcept>
 
+#include <poll.h>
 #include <unistd.h>
+
+extern "C" {
+#include <sys/pidfd.h>  // Debian 12's does not say extern "C" itself
+}
 
 #include <gtest/gtest.h>
 
@@ -30,25 +35,34 @@ void require(bool holds, const std::string& what) {
   if (!holds) throw std::runtime_error("the drive for this test cannot be had: " + what);
 }
 
-/// The pid of the child of `parent` whose program has that name.
-std::optional<pid_t> childNamed(pid_t parent, const std::string& program) {
+std::vector<pid_t> childrenOf(pid_t parent) {
+  std::vector<pid_t> result;
   std::error_code failure;
   for (const auto& task :
        fs::directory_iterator("/proc/" + std::to_string(parent) + "/task", failure)) {
     std::ifstream children(task.path() / "children");
-    for (pid_t child = 0; children >> child;) {
-      const fs::path executable =
-          fs::read_symlink("/proc/" + std::to_string(child) + "/exe", failure);
-      if (!failure && executable.filename() == program) return child;
-    }
+    for (pid_t child = 0; children >> child;) result.push_back(child);
+  }
+  return result;
+}
+
+/// The pid of the child of `parent` whose program has that name.
+std::optional<pid_t> childNamed(pid_t parent, const std::string& program) {
+  for (const pid_t child : childrenOf(parent)) {
+    std::error_code failure;
+    const fs::path executable =
+        fs::read_symlink("/proc/" + std::to_string(child) + "/exe", failure);
+    if (!failure && executable.filename() == program) return child;
   }
   return std::nullopt;
 }
 
 }  // namespace
 
-TestDrive::TestDrive() {
-  std::string pattern = (fs::temp_directory_path() / "yomber.XXXXXX").string();
+TestDrive::TestDrive() : TestDrive(fs::temp_directory_path().string()) {}
+
+TestDrive::TestDrive(const std::string& parent) {
+  std::string pattern = (fs::path(parent) / "yomber.XXXXXX").string();
   require(mkdtemp(pattern.data()) != nullptr, pattern);
   directory_ = pattern;
   home_ = directory_ + "/home";
@@ -83,6 +97,7 @@ void TestDrive::up(const std::vector<std::string>& command) {
   for (std::string& word : commandLine({"up"})) words.push_back(std::move(word));
   const ProcessResult started = runProcess(words, environment_);
   require(started.exitCode == 0, started.errors);
+  supervisor_ = status()["supervisor"]["pid"];
   signIn();
 }
 
@@ -95,6 +110,26 @@ void TestDrive::down() {
   up_ = false;
   const ProcessResult ended = yomber({"down"});
   EXPECT_EQ(ended.exitCode, 0) << ended.errors;
+}
+
+void TestDrive::crash() {
+  up_ = false;
+  // Nothing is started again meanwhile, and nothing is missed.
+  ::kill(supervisor_, SIGSTOP);
+  std::vector<pid_t> processes{supervisor_};
+  for (std::size_t i = 0; i < processes.size(); ++i) {
+    for (const pid_t child : childrenOf(processes[i])) processes.push_back(child);
+  }
+  std::vector<pollfd> ends;
+  for (const pid_t process : processes) {
+    ends.push_back({.fd = pidfd_open(process, 0), .events = POLLIN, .revents = 0});
+    ::kill(process, SIGKILL);
+  }
+  const int limit = static_cast<int>(std::chrono::milliseconds(patience).count());
+  for (pollfd& end : ends) {
+    require(end.fd < 0 || poll(&end, 1, limit) == 1, "a process cannot be killed");
+    if (end.fd >= 0) close(end.fd);
+  }
 }
 
 std::vector<std::string> TestDrive::commandLine(const std::vector<std::string>& arguments) const {

@@ -15,6 +15,8 @@ namespace yomber::testing {
 class TestDrive {
  public:
   TestDrive();
+  /// In a folder of its own below that one.
+  explicit TestDrive(const std::string& parent);
   ~TestDrive();
   TestDrive(const TestDrive&) = delete;
   TestDrive& operator=(const TestDrive&) = delete;
@@ -24,6 +26,8 @@ class TestDrive {
   /// The same, with `yomber up` as the last words of a command that starts it ("env NAME=VALUE").
   void up(const std::vector<std::string>& command);
   void down();
+  /// kill -9 of all its processes at once, as when the machine stops. Returns when they are gone.
+  void crash();
   void signIn();
 
   [[nodiscard]] const std::string& home() const { return home_; }
@@ -60,6 +64,7 @@ class TestDrive {
   std::string root_;
   Environment environment_;
   bool up_ = false;
+  pid_t supervisor_ = -1;
 };
 
 /// Where the build put its programs.

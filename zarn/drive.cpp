@@ -15,6 +15,7 @@
 #include "platform/ostrell/constants.h"
 #include "platform/rozzel/embedded_engine.h"
 #include "zarn/content/content_store.h"
+#include "zarn/lent_mode.h"
 
 namespace yomber {
 
@@ -132,6 +133,8 @@ std::shared_ptr<Drive> Drive::open(const DrivePaths& paths, Options options, NSE
       new Drive(paths, std::move(options), std::move(database), std::move(account)));
   drive->account->onChange([drive = drive.get()] { drive->accountDidChange(); });
   drive->trash->recover();
+  setLentModesFolder(drive->layout.privateArea() + "/modes");
+  restoreLentModes();
   return drive;
 }
 

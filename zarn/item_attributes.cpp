@@ -12,6 +12,7 @@
 
 #include "platform/foundation/fault_attributes.h"
 #include "zarn/file_descriptor.h"
+#include "zarn/lent_mode.h"
 #include "zarn/row_queries.h"
 
 namespace yomber {
@@ -39,6 +40,14 @@ std::optional<std::int64_t> readNumber(const char* path, const char* name) {
   const auto [rest, failure] = std::from_chars(text->data(), end, number);
   if (failure != std::errc() || rest != end) return std::nullopt;
   return number;
+}
+
+int writeValue(int file, const char* attribute, const std::optional<std::string>& value) {
+  const std::string path = "/proc/self/fd/" + std::to_string(file);
+  if (value) {
+    return setxattr(path.c_str(), attribute, value->data(), value->size(), 0) == 0 ? 0 : errno;
+  }
+  return removexattr(path.c_str(), attribute) == 0 || errno == ENODATA ? 0 : errno;
 }
 
 void readOne(const char* path, std::string_view name, ItemAttributes& out) {
@@ -88,11 +97,7 @@ int writeItemAttribute(int folder, const std::string& name, std::uint64_t inode,
   if (!file || fstat(file.get(), &status) != 0) return errno;
   if (status.st_ino != inode) return ESTALE;
   if (S_ISLNK(status.st_mode)) return EPERM;  // the path below would be its target's
-  const std::string path = "/proc/self/fd/" + std::to_string(file.get());
-  if (value) {
-    return setxattr(path.c_str(), attribute, value->data(), value->size(), 0) == 0 ? 0 : errno;
-  }
-  return removexattr(path.c_str(), attribute) == 0 || errno == ENODATA ? 0 : errno;
+  return withWritePermission(file.get(), [&] { return writeValue(file.get(), attribute, value); });
 }
 
 int writeItemExtra(int folder, const std::string& name, std::uint64_t inode,

@@ -31,26 +31,20 @@ std::timespec toTimespec(std::int64_t nanoseconds) {
   return {.tv_sec = seconds, .tv_nsec = rest};
 }
 
-/// Opens a file that its owner may only read; `status` is from before, `mode` is to be put back.
-FileDescriptor openReadOnlyFile(const std::string& path, struct stat& status,
-                                std::optional<std::uint32_t>& mode) {
-  const FileDescriptor reading(open(path.c_str(), O_RDONLY | kOpening));
-  if (!reading || fstat(reading.get(), &status) != 0) return {};
-  const bool isOurs = S_ISREG(status.st_mode) && status.st_uid == geteuid();
-  if (!isOurs || (status.st_mode & S_IWUSR) != 0) {
+/// Opens a file that its owner may not write to, or not even read; `status` is from before.
+FileDescriptor openProtectedFile(const std::string& path, struct stat& status,
+                                 std::optional<LentMode>& lent) {
+  const FileDescriptor place(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (!place || fstat(place.get(), &status) != 0) return {};
+  if (!S_ISREG(status.st_mode)) {
     errno = EACCES;
     return {};
   }
-  const mode_t own = status.st_mode & 07777U;
-  if (fchmod(reading.get(), own | S_IWUSR) != 0) return {};
-  const std::string again = "/proc/self/fd/" + std::to_string(reading.get());
-  FileDescriptor writing(open(again.c_str(), O_RDWR | O_NONBLOCK | O_CLOEXEC));
-  if (!writing) {
-    (void)fchmod(reading.get(), own);
-  } else {
-    mode = own;
-  }
-  return writing;
+  auto taken = LentMode::lend(place.get());
+  if (!taken) return {};
+  lent.emplace(std::move(*taken));
+  const std::string again = "/proc/self/fd/" + std::to_string(place.get());
+  return FileDescriptor(open(again.c_str(), O_RDWR | O_NONBLOCK | O_CLOEXEC));
 }
 
 }  // namespace
@@ -59,14 +53,13 @@ ChangedFile ChangedFile::open(const std::string& path, NSErrorRef* error) {
   ChangedFile result;
   result.path_ = path;
   FileDescriptor file(::open(path.c_str(), O_RDWR | kOpening));
-  if (!file && errno == EACCES)
-    file = openReadOnlyFile(path, result.status_, result.modeToPutBack_);
+  if (!file && errno == EACCES) file = openProtectedFile(path, result.status_, result.lent_);
   if (!file) {
     storeError(error, result.failure(errno));
     return result;
   }
   result.file_ = std::move(file);
-  const bool isKnown = result.modeToPutBack_ || fstat(result.file_.get(), &result.status_) == 0;
+  const bool isKnown = result.lent_ || fstat(result.file_.get(), &result.status_) == 0;
   if (!isKnown || !S_ISREG(result.status_.st_mode)) {
     storeError(error, result.failure(isKnown ? EINVAL : errno));
     result.file_ = FileDescriptor();
@@ -79,13 +72,11 @@ ChangedFile::ChangedFile(ChangedFile&& other) noexcept
     : file_(std::move(other.file_)),
       path_(std::move(other.path_)),
       status_(other.status_),
-      modeToPutBack_(std::exchange(other.modeToPutBack_, std::nullopt)),
+      lent_(std::move(other.lent_)),
       mtime_(other.mtime_),
       isHeld_(std::exchange(other.isHeld_, false)) {}
 
-ChangedFile::~ChangedFile() {
-  if (file_ && modeToPutBack_) (void)fchmod(file_.get(), *modeToPutBack_);
-}
+ChangedFile::~ChangedFile() = default;
 
 NSErrorRef ChangedFile::failure(int number) const { return NSError::errorWithErrno(number, path_); }
 

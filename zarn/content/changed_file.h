@@ -9,6 +9,7 @@
 
 #include "platform/foundation/error.h"
 #include "platform/foundation/file_descriptor.h"
+#include "zarn/lent_mode.h"
 
 namespace yomber {
 
@@ -47,7 +48,7 @@ class ChangedFile {
   FileDescriptor file_;
   std::string path_;
   struct stat status_{};
-  std::optional<std::uint32_t> modeToPutBack_;
+  std::optional<LentMode> lent_;
   std::timespec mtime_{};
   bool isHeld_ = false;
 };

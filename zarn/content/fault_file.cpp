@@ -12,6 +12,7 @@
 #include "platform/foundation/fault_points.h"
 #include "platform/ostrell/constants.h"
 #include "platform/rozzel/hashed_copy.h"
+#include "zarn/lent_mode.h"
 
 namespace yomber {
 namespace {
@@ -164,9 +165,10 @@ NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode, FileSt
   const std::string self = "/proc/self/fd/" + std::to_string(file.get());
   // The fault first: without it the others mean nothing.
   for (const char* name : {kFaultAttribute, kFilledAttribute, kHeldDateAttribute}) {
-    if (removexattr(self.c_str(), name) != 0 && errno != ENODATA) {
-      return NSError::errorWithErrno(errno, path);
-    }
+    const int number = withWritePermission(file.get(), [&] {
+      return removexattr(self.c_str(), name) == 0 || errno == ENODATA ? 0 : errno;
+    });
+    if (number != 0) return NSError::errorWithErrno(number, path);
     if (settleUnmarked.hit()) return NSError::errorWithErrno(EIO, path);
   }
   after = stampOf(file.get());

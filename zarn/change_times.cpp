@@ -3,7 +3,6 @@
 #include <ctime>
 
 #include "zarn/folder_snapshot.h"
-#include "zarn/item_attributes.h"
 
 namespace yomber {
 namespace {
@@ -13,17 +12,14 @@ bool isAsKnown(const ItemRow& row, const FolderEntry& entry) {
          row.size == entry.size && row.mtime == entry.mtime;
 }
 
-ItemAttributes attributesOf(const ItemRow& row) {
-  ItemAttributes result;
-  result.id = row.id;
-  result.isShared = (row.flags & row_flag::kShared) != 0;
-  result.isFault = (row.flags & row_flag::kDownloaded) == 0;
-  if (row.extra) result.extra = *row.extra;
-  result.extra.containerID.clear();
-  return result;
-}
-
 }  // namespace
+
+bool isDescribedBy(const ItemRow& row, const ItemAttributes& attributes) {
+  ItemExtra extra = row.extra ? *row.extra : ItemExtra{};
+  extra.containerID.clear();
+  const bool isShared = (row.flags & row_flag::kShared) != 0;
+  return attributes.id == row.id && attributes.isShared == isShared && attributes.extra == extra;
+}
 
 std::int64_t coarseNow() {
   timespec now{};
@@ -38,7 +34,8 @@ std::optional<std::int64_t> changeTimeAfterOwnWrite(int folder, const std::strin
   if (!entry.isSettled || !isAsKnown(row, entry)) return std::nullopt;
   // Read after the look: what comes later has a later time.
   const auto attributes = readItemAttributes(pathThroughDescriptor(folder, name).c_str());
-  if (attributes != attributesOf(row)) return std::nullopt;
+  const bool isHere = (row.flags & row_flag::kDownloaded) != 0;
+  if (attributes.isFault == isHere || !isDescribedBy(row, attributes)) return std::nullopt;
   return entry.ctime;
 }
 

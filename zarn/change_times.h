@@ -4,6 +4,7 @@
 #include <optional>
 #include <string>
 
+#include "zarn/item_attributes.h"
 #include "zarn/item_row.h"
 
 namespace yomber {
@@ -22,6 +23,10 @@ namespace yomber {
 
 /// CLOCK_REALTIME_COARSE.
 [[nodiscard]] std::int64_t coarseNow();
+
+/// Whether the attributes are what a file with this row carries, apart from whether its content is
+/// here.
+[[nodiscard]] bool isDescribedBy(const ItemRow& row, const ItemAttributes& attributes);
 
 /// The time to remember of the file `name` ("." is the folder itself) in the folder open as
 /// `folder`, after the drive has written to the file's attributes: provided that the file still is

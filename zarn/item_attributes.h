@@ -25,7 +25,6 @@ struct ItemAttributes {
   ItemExtra extra;       ///< without the container
 
   [[nodiscard]] bool isEmpty() const { return !id && !isShared && !isFault && extra.isEmpty(); }
-  friend bool operator==(const ItemAttributes&, const ItemAttributes&) = default;
 };
 
 /// Reads them; none where the file is gone or has none. Values that make no sense count as absent.

@@ -8,6 +8,7 @@
 #include "platform/foundation/date.h"
 #include "platform/foundation/log.h"
 #include "zarn/busy_files.h"
+#include "zarn/change_times.h"
 #include "zarn/row_queries.h"
 #include "zarn/schema.h"
 #include "zarn/write_transaction.h"
@@ -165,11 +166,26 @@ NSErrorRef ContentCore::settleWritten(const std::string& path, const FaultExamin
   return error;
 }
 
-void ContentCore::lookAgain(const std::string& path, const FileStamp& stored) const {
+void ContentCore::lookAgain(const JobSubject& subject, const FileStamp& stored) const {
+  const std::string& path = subject.path;
+  if (path.empty()) return;
   struct stat status{};
-  const bool isSame =
-      !path.empty() && lstat(path.c_str(), &status) == 0 && FileStamp::of(status) == stored;
-  if (!isSame) (void)scanner->scanLocation(path);
+  const bool isSame = lstat(path.c_str(), &status) == 0 && FileStamp::of(status) == stored;
+  const bool isDescribed =
+      subject.row && isDescribedBy(*subject.row, readItemAttributes(path.c_str()));
+  if (isSame && isDescribed) return;
+  if (isSame && subject.row) forgetChangeTime(subject.row->id);
+  (void)scanner->scanLocation(path);
+}
+
+void ContentCore::forgetChangeTime(std::uint64_t item) const {
+  (void)items->database()->write([item](WriteTransaction& transaction) {
+    if (auto row = findByID(transaction.connection(), item)) {
+      --row->ctime;
+      transaction.updateQuietly(*row);
+    }
+    return NSErrorRef();
+  });
 }
 
 BusyFile::BusyFile(const ContentCore& core, std::uint64_t inode)

@@ -66,7 +66,7 @@ class ContentCore {
   NSErrorRef settleWritten(const std::string& path, const FaultExamination& found);
   /// A file that was busy, or whose change by us was stored, is looked at once more unless it still
   /// is what was stored: what others did to it meanwhile was passed over, or hidden by ours.
-  void lookAgain(const std::string& path, const FileStamp& stored) const;
+  void lookAgain(const JobSubject& subject, const FileStamp& stored) const;
 
   const std::shared_ptr<ItemStore> items;
   const std::shared_ptr<Scanner> scanner;
@@ -78,6 +78,8 @@ class ContentCore {
   std::atomic<std::uint64_t> finished{0};
 
  private:
+  void forgetChangeTime(std::uint64_t item) const;
+
   mutable Mutex mutex_;
   std::shared_ptr<ContentStore> store_ GUARDED_BY(mutex_);
   std::string account_ GUARDED_BY(mutex_);

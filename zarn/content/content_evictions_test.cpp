@@ -85,6 +85,22 @@ TEST_F(ContentEvictionsTest, WhatIsOpenedDuringItKeepsItsContent) {
   EXPECT_TRUE(read("a") == text);
 }
 
+TEST_F(ContentEvictionsTest, ATagThatIsSetDuringItIsSeen) {
+  write("a", content(100'000));
+  settle();
+  stopAt("zarn.evict.punched");
+  Answer answer;
+  engine->evict(at("a"), answer.take());
+  ASSERT_TRUE(isStopped());
+  setAttribute("a", kTagsAttribute, "red");
+  go();
+  EXPECT_EQ(answer.get(), nullptr);
+  EXPECT_TRUE(isFault("a"));
+  scan();
+  ASSERT_NE(row("a")->extra, nullptr);
+  EXPECT_EQ(row("a")->extra->tags, std::vector<std::string>{"red"});
+}
+
 TEST_F(ContentEvictionsTest, FoldersLinksAndFilesWithSeveralNamesStay) {
   makeFolder("folder");
   ASSERT_EQ(symlink("nowhere", at("link").c_str()), 0);

@@ -99,7 +99,7 @@ class DownloadBatch {
     busy.clear();
     for (Download& download : downloads_) {
       if (error && !download.error) download.error = error;
-      if (!download.error) core_.lookAgain(download.subject.path, download.after);
+      if (!download.error) core_.lookAgain(download.subject, download.after);
       finish(download);
     }
     downloads_.clear();
@@ -325,7 +325,7 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
   });
   if (error) log_error(defaultLog(), "[ERROR] filled files cannot be noted: %@", error);
   for (const Settling& settling : all) {
-    if (settling.before.inode != 0) core.lookAgain(settling.subject.path, settling.after);
+    if (settling.before.inode != 0) core.lookAgain(settling.subject, settling.after);
   }
 }
 

@@ -125,7 +125,7 @@ class EvictionBatch {
     busy.clear();
     for (const Departure& departure : departures_) {
       if (departure.isFault) {
-        core_.lookAgain(departure.subject.path, departure.after);
+        core_.lookAgain(departure.subject, departure.after);
       }
       answer(departure);
     }

@@ -89,8 +89,9 @@ void describeHost(std::ostream& out, const DriveStatus::Host& host) {
   out << "fileproviderd  running, " << readableSize(host.residentBytes) << ", " << host.watches
       << " watches\n";
   if (host.extensionPid != 0) {
-    out << "extension      running, pid " << host.extensionPid << ", started "
-        << host.extensionStarts << " times\n";
+    out << "extension      running, pid " << host.extensionPid;
+    if (host.extensionStarts > 1) out << ", started " << host.extensionStarts << " times";
+    out << "\n";
   } else {
     out << "extension      not running";
     if (host.lastFailure) out << ": " << failureText(host.lastFailure);

@@ -35,6 +35,16 @@ constexpr std::chrono::seconds kPatience{600};
   std::exit(1);
 }
 
+/// Says what is going on, and how long it took: a round takes a while.
+template <typename Work>
+double step(const std::string& what, const Work& work) {
+  std::fprintf(stderr, "content_bench: %s", what.c_str());
+  std::fflush(stderr);
+  const double seconds = bench::secondsFor(work);
+  std::fprintf(stderr, ": %.2f s\n", seconds);
+  return seconds;
+}
+
 void run(const std::string& command) {
   if (std::system(command.c_str()) != 0) giveUp("cannot run: " + command);
 }
@@ -76,10 +86,16 @@ class BenchDrive {
     if (!error) drive_ = Drive::open(paths_, {}, &error);
     if (!error) error = drive_->account->signIn("bench");
     if (error) giveUp(error->description());
-    drive_->start();
-    if (!waitUntil([&] { return drive_->firstScan->isOpen(); })) giveUp("the drive does not start");
+    (void)step("start a drive", [&] {
+      drive_->start();
+      if (!waitUntil([&] { return drive_->firstScan->isOpen(); }))
+        giveUp("the drive does not start");
+    });
   }
-  ~BenchDrive() { drive_->stop(); }
+  ~BenchDrive() {
+    (void)step("stop the drive", [&] { drive_->stop(); });
+    (void)step("remove its files", [&] { fs::remove_all(directory_.path()); });
+  }
 
   [[nodiscard]] std::string at(const std::string& path) const {
     return drive_->layout.root() + "/" + path;
@@ -148,45 +164,54 @@ struct Measured {
 void measureSmall(std::size_t count, Measured& measured) {
   BenchDrive drive;
   const std::string source = drive.beside("source");
-  fs::create_directory(source);
   std::vector<std::string> paths;
-  for (std::size_t i = 0; i < count; ++i) {
-    const std::string name = "file " + std::to_string(i);
-    makeContent(source + "/" + name, 4096, i + 1);
-    paths.push_back(drive.at("small/" + name));
-  }
-  run("sync");
-  const double copied = bench::secondsFor(
-      [&] { run("cp -r '" + source + "' '" + drive.beside("copy") + "' && sync"); });
-  const double imported = bench::secondsFor([&] {
+  (void)step("make " + std::to_string(count) + " files", [&] {
+    fs::create_directory(source);
+    for (std::size_t i = 0; i < count; ++i) {
+      const std::string name = "file " + std::to_string(i);
+      makeContent(source + "/" + name, 4096, i + 1);
+      paths.push_back(drive.at("small/" + name));
+    }
+    run("sync");
+  });
+  const double copied = step("cp -r and sync", [&] {
+    run("cp -r '" + source + "' '" + drive.beside("copy") + "' && sync");
+  });
+  const double imported = step("import until confirmed", [&] {
     run("cp -r '" + source + "' '" + drive.at("small") + "'");
     drive.waitUntilConfirmed(paths);
   });
   measured.import.add(imported, copied);
 
-  drive.evictAll(paths);
-  run("sync");
+  (void)step("evict", [&] { drive.evictAll(paths); });
+  (void)step("sync", [] { run("sync"); });
   const double again =
-      bench::secondsFor([&] { run("cp -r '" + source + "' '" + drive.beside("copy 2") + "'"); });
-  const double provided = bench::secondsFor([&] { drive.provideAll(paths); });
+      step("cp -r", [&] { run("cp -r '" + source + "' '" + drive.beside("copy 2") + "'"); });
+  const double provided = step("provide", [&] { drive.provideAll(paths); });
   measured.small.add(provided, again);
 }
 
-void measureLarge(std::size_t bytes, Measured& measured) {
+void measureLarge(std::size_t bytes, std::size_t rounds, Measured& measured) {
   BenchDrive drive;
   const std::string source = drive.beside("large");
-  makeContent(source, bytes, 1);
   const std::string path = drive.at("large");
-  run("cp '" + source + "' '" + path + "'");
-  drive.waitUntilConfirmed({path});
-  drive.evictAll({path});
-  (void)dropCaches();
-  const double copied =
-      bench::secondsFor([&] { run("cp '" + source + "' '" + drive.beside("copy") + "'"); });
-  (void)dropCaches();
-  const double provided = bench::secondsFor([&] { drive.provideAll({path}); });
-  measured.large.add(provided, copied);
-  run("cmp '" + source + "' '" + path + "'");
+  (void)step("make a file of " + std::to_string(bytes >> 20U) + " MiB",
+             [&] { makeContent(source, bytes, 1); });
+  (void)step("import until confirmed", [&] {
+    run("cp '" + source + "' '" + path + "'");
+    drive.waitUntilConfirmed({path});
+  });
+  for (std::size_t round = 0; round < rounds; ++round) {
+    (void)step("evict", [&] { drive.evictAll({path}); });
+    const std::string copy = drive.beside("copy");
+    fs::remove(copy);
+    (void)step("drop the caches", [] { (void)dropCaches(); });
+    const double copied = step("cp", [&] { run("cp '" + source + "' '" + copy + "'"); });
+    (void)step("drop the caches", [] { (void)dropCaches(); });
+    const double provided = step("provide", [&] { drive.provideAll({path}); });
+    measured.large.add(provided, copied);
+  }
+  (void)step("compare", [&] { run("cmp '" + source + "' '" + path + "'"); });
 }
 
 bool print(const bench::Repeated& measured, const std::string& name, const std::string& yardstick,
@@ -219,10 +244,8 @@ int main() {
   const std::size_t bytes = bench::sizeFromEnvironment("YOMBER_BENCH_LARGE_BYTES", 1UL << 30U);
   const std::size_t rounds = bench::sizeFromEnvironment("YOMBER_BENCH_ROUNDS", 3);
   Measured measured;
-  for (std::size_t round = 0; round < rounds; ++round) {
-    measureSmall(count, measured);
-    measureLarge(bytes, measured);
-  }
+  for (std::size_t round = 0; round < rounds; ++round) measureSmall(count, measured);
+  measureLarge(bytes, rounds, measured);
   const std::string files = std::to_string(count) + " files of 4 KiB";
   bool isReached =
       print(measured.import, "import of " + files + " until confirmed", "cp -r and sync", 6);

@@ -56,6 +56,12 @@ std::int64_t nowNanoseconds() {
   return std::chrono::duration_cast<std::chrono::nanoseconds>(now).count();
 }
 
+/// What the log and its index cannot grow for.
+bool isLackOfRoom(const SQLite::Exception& exception) {
+  const int code = exception.getExtendedErrorCode();
+  return code == SQLITE_FULL || code == SQLITE_IOERR_SHMSIZE;
+}
+
 bool isDamage(const SQLite::Exception& exception) {
   const int code = exception.getErrorCode();
   return code == SQLITE_CORRUPT || code == SQLITE_NOTADB;
@@ -195,6 +201,7 @@ NSErrorRef Database::State::failure(const std::exception& exception) {
     log_fault(defaultLog(), "[CRIT] the database is damaged (%@); restart zarn to build it anew",
               exception.what());
   }
+  if (sqlite != nullptr && isLackOfRoom(*sqlite)) return NSError::errorWithErrno(ENOSPC, path);
   return databaseError(kDatabaseFailure, exception.what());
 }
 

@@ -9,6 +9,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/foundation/atomic_cell.h"
 #include "platform/foundation/lock.h"
 #include "zarn/content/content_participant.h"
 #include "zarn/content/content_store.h"
@@ -61,6 +62,11 @@ class ContentCore {
   /// Stores that a job failed, and when it is tried again.
   void postpone(Connection& connection, Job job, const NSErrorRef& error) const;
 
+  /// To be told what came of storing the outcome of jobs. Where that failed, as on a full disk,
+  /// they are found again at once as they were: whoever did them rests before.
+  void noteStored(const NSErrorRef& error) { storingFailure_.store(error); }
+  [[nodiscard]] NSErrorRef storingFailure() const { return storingFailure_.load(); }
+
   /// Decides on a fault that somebody has written to: what they wrote over all of it counts, what
   /// they wrote into it is brought to a file of its own.
   NSErrorRef settleWritten(const std::string& path, const FaultExamination& found);
@@ -84,6 +90,7 @@ class ContentCore {
   std::shared_ptr<ContentStore> store_ GUARDED_BY(mutex_);
   std::string account_ GUARDED_BY(mutex_);
   std::atomic<bool> isOffline_{false};
+  AtomicCell<NSErrorRef> storingFailure_;
 };
 
 /// Rows that are as they are while a file is filled or given up.

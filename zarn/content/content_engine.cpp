@@ -112,6 +112,7 @@ void Engine::addWorkers(JobKind kind, std::size_t count, std::size_t atOnce, Wor
         const auto jobs = core->queue->take(kind, atOnce);
         if (jobs.empty()) return;
         work(*core, jobs);
+        if (core->storingFailure()) core->queue->rest(core->options.offlinePause);
         core->queue->release(jobs);
       }
     });
@@ -291,6 +292,7 @@ std::optional<ContentState> Engine::contentState(std::string_view path, NSErrorR
     const auto download = findJob(connection, row->id, JobKind::Download);
     if (download) state.lastFailure = download->error;
     if (upload && upload->error) state.lastFailure = upload->error;
+    if (!state.lastFailure && (upload || download)) state.lastFailure = core_->storingFailure();
     if (!isDocument) return;
     const auto content = findContent(connection, row->id);
     const bool isStored = content && !upload && isConfirmed(*row, *content);

@@ -5,20 +5,7 @@
 namespace yomber {
 namespace {
 
-class ContentUploadsTest : public ContentDrive {
- protected:
-  /// Stops whoever comes to a fault point until `go`.
-  void stopAt(const std::string& point) {
-    gate_ = layout.home() + "/go-" + point;
-    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate_), nullptr);
-  }
-  bool isStopped() const {
-    return waitUntil([&] { return std::filesystem::exists(gate_ + ".reached"); });
-  }
-  void go() const { std::ofstream(gate_).put('x'); }
-
-  std::string gate_;
-};
+class ContentUploadsTest : public ContentDrive {};
 
 TEST_F(ContentUploadsTest, AnEditIsUploadedInPlaceOfWhatWasThere) {
   write("a", "first");
@@ -157,6 +144,21 @@ TEST_F(ContentUploadsTest, AJobThatFailsIsTriedAgainAndSaysHowOften) {
   EXPECT_NE(transfer.failure, nullptr);
   FaultPoint::disarmAll();
   ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+}
+
+TEST_F(ContentUploadsTest, AnUploadThatCannotBeNotedSaysSoAndIsNotedLater) {
+  write("a", "text");
+  stopAt("zarn.upload.staged");
+  scan();
+  ASSERT_TRUE(isStopped());
+  ASSERT_EQ(FaultPoint::arm("zarn.database.before-commit=error"), nullptr);
+  go();
+  EXPECT_TRUE(waitUntil([&] { return state("a").lastFailure != nullptr; }));
+  EXPECT_NE(state("a").upload, ContentState::Upload::Confirmed);
+  FaultPoint::disarmAll();
+  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_EQ(state("a").lastFailure, nullptr);
+  EXPECT_EQ(contentInStore(id("a")), "text");
 }
 
 TEST_F(ContentUploadsTest, PausesBetweenAttemptsGrowByTheClockThatIsGiven) {

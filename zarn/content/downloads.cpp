@@ -96,6 +96,7 @@ class DownloadBatch {
     }
     (void)downloadFilled.hit();
     const NSErrorRef error = store();
+    core_.noteStored(error);
     busy.clear();
     for (Download& download : downloads_) {
       if (error && !download.error) download.error = error;
@@ -324,6 +325,7 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
     return NSErrorRef();
   });
   if (error) log_error(defaultLog(), "[ERROR] filled files cannot be noted: %@", error);
+  core.noteStored(error);
   for (const Settling& settling : all) {
     if (settling.before.inode != 0) core.lookAgain(settling.subject, settling.after);
   }

@@ -182,6 +182,7 @@ class EvictionBatch {
       return NSErrorRef();
     });
     if (error) log_error(defaultLog(), "[ERROR] evictions cannot be noted: %@", error);
+    core_.noteStored(error);
     (void)evictStored.hit();
   }
 

@@ -197,6 +197,13 @@ std::vector<JobQueue::Running> JobQueue::allRunning() const {
   return result;
 }
 
+void JobQueue::rest(std::chrono::milliseconds length) {
+  const auto until = std::chrono::steady_clock::now() + length;
+  LockGuard guard(mutex_);
+  while (!isEnding_ && changed_.waitUntil(mutex_, until)) {
+  }
+}
+
 void JobQueue::end() {
   LockGuard guard(mutex_);
   isEnding_ = true;

@@ -46,6 +46,8 @@ class JobQueue {
   /// once the queue ends.
   [[nodiscard]] std::vector<Job> take(JobKind kind, std::size_t limit);
   void release(const std::vector<Job>& jobs);
+  /// Waits that long, or until the queue ends.
+  void rest(std::chrono::milliseconds length);
 
   struct Running {
     Job job;

@@ -230,6 +230,7 @@ class UploadGroup {
       return NSErrorRef();
     });
     if (error) log_error(defaultLog(), "[ERROR] uploads cannot be confirmed: %@", error);
+    core_.noteStored(error);
     if (isAway) core_.noteOutOfReach();
     if (std::exchange(hasSettling_, false)) core_.queue->noteJobs(JobKind::Settle);
     (void)uploadConfirmed.hit();

@@ -84,7 +84,7 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
     callForLocation(
         &Wire::Client::trashRequest,
         [path = pathOf(url)](Wire::TrashParams::Builder params) { params.setPath(wireData(path)); },
-        std::move(reply));
+        std::move(reply), Limit::None);
   }
 
   void putBackURLForTrashedItemAtURL(const NSURLRef& url, QSURLReply reply) override {
@@ -106,7 +106,7 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
         [reply = std::move(reply)](const Result& result) {
           if (reply) reply(result.first, result.second);
         },
-        kAsLongAsItTakes);
+        Limit::None);
   }
 
   void physicalURLForItemAtURL(const NSURLRef& url, QSURLReply reply) override {
@@ -175,7 +175,6 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
   using Wire = protocol::Content;
 
   /// Work that grows with what the user has; the connection's loss still ends it.
-  static constexpr ipc::CallOptions kAsLongAsItTakes{std::chrono::milliseconds(0)};
 
   static std::string pathOf(const NSURLRef& url) { return url ? url->path() : std::string(); }
 
@@ -194,7 +193,7 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
 
   /// A call whose results are a location or a failure.
   template <typename Method, typename Fill>
-  void callForLocation(Method method, Fill fill, QSURLReply reply) {
+  void callForLocation(Method method, Fill fill, QSURLReply reply, Limit limit = Limit::Links) {
     using Result = std::pair<NSURLRef, NSErrorRef>;
     this->invoker().invoke(
         method, std::move(fill),
@@ -205,7 +204,8 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
         },
         [reply = std::move(reply)](const Result& result) {
           if (reply) reply(result.first, result.second);
-        });
+        },
+        limit);
   }
 };
 

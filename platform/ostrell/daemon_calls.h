@@ -15,14 +15,20 @@
 
 namespace yomber {
 
+/// How long a call may take.
+enum class Limit {
+  Links,  ///< the link's time limit
+  None,   ///< as long as its work takes, while the daemon answers at all
+};
+
 /// The daemon's protocol, written once for both proxies: what each call sends and how its reply is
 /// read. For this room's sources only.
 ///
 /// `Invoker` says how a call is made. Its
-///   invoke(method, fill, decode, reply, options)
+///   invoke(method, fill, decode, reply, limit)
 /// calls `method` with parameters from `fill`, takes the value that `decode(session, results)`
 /// makes of the results on the loop thread, and calls `reply(value)` where replies belong. A
-/// transport failure it keeps to itself. Without `options` the link's time limit holds.
+/// transport failure it keeps to itself.
 template <typename Base, typename Invoker>
 class DaemonCalls : public Base {
  public:

@@ -17,6 +17,7 @@
 #include "platform/ostrell/awaited.h"
 #include "platform/ostrell/constants.h"
 #include "platform/ostrell/daemon_link.h"
+#include "platform/ostrell/query_item.h"
 #include "platform/ostrell/scripted_daemon.h"
 #include "platform/ostrell/url_additions.h"
 
@@ -377,6 +378,51 @@ TEST_F(StuckDaemonTest, CallsEndWithTheTimeOut) {
   daemon->release("*");
   EXPECT_FALSE(askForLocation());
   EXPECT_EQ(daemon->callCount("describe"), 1U);
+}
+
+TEST_F(StuckDaemonTest, WorkThatTakesLongIsWaitedForWhileTheDaemonAnswers) {
+  const auto file = daemon->root() + "/five.txt";
+  daemon->addItem(scriptedDocument(5, "five.txt"), file);
+  const auto url = NSURL::fileURLWithPath(file);
+  for (const bool isScan : {true, false}) {
+    const std::string method = isScan ? "itemAtLocation" : "emptyTrash";
+    daemon->hold(method);
+    daemon->forgetCalls();
+    std::thread worker([&] {
+      // So often it was asked whether it is stuck.
+      EXPECT_TRUE(daemon->waitForCalls("describe", 5));
+      daemon->release(method);
+    });
+    if (isScan) {
+      NSErrorRef error;
+      EXPECT_TRUE(QSQueryItem::askDaemonQueryItemForURL(url, ForceScan::Yes, &error));
+      EXPECT_FALSE(error);
+    } else {
+      int answers = 0;
+      const auto proxy = QSDaemonConnection::defaultConnection().newSyncProxy();
+      proxy->emptyTrashWithReply([&](std::uint64_t, const NSErrorRef& error) {
+        ++answers;
+        EXPECT_FALSE(error);
+      });
+      EXPECT_EQ(answers, 1);
+      EXPECT_FALSE(proxy->error());
+    }
+    worker.join();
+  }
+}
+
+TEST_F(StuckDaemonTest, WorkOfADaemonThatIsStuckEndsWithTheTimeOutAndIsAnsweredOnce) {
+  daemon->addItem(scriptedDocument(5, "five.txt"), daemon->root() + "/five.txt");
+  EXPECT_FALSE(askForLocation());
+  daemon->hold("*");
+  const auto proxy = QSDaemonConnection::defaultConnection().newSyncProxy();
+  int answers = 0;
+  proxy->emptyTrashWithReply([&](std::uint64_t, const NSErrorRef&) { ++answers; });
+  ASSERT_TRUE(proxy->error());
+  EXPECT_TRUE(proxy->error()->is(NSCocoaErrorDomain, NSXPCConnectionTimedOut));
+  daemon->release("*");
+  EXPECT_FALSE(askForLocation());
+  EXPECT_EQ(answers, 0);
 }
 
 TEST_F(StuckDaemonTest, ConnectingToOneThatNeverAnswersFailsEveryCallerAndIsTriedAgain) {

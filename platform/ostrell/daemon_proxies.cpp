@@ -5,6 +5,7 @@
 
 #include "platform/ostrell/content_calls.h"
 #include "platform/ostrell/error_handler_slot.h"
+#include "platform/ostrell/patient_call.h"
 
 namespace yomber {
 namespace {
@@ -21,7 +22,7 @@ class AsyncInvoker {
   template <typename Client, typename Params, typename Results, typename Fill, typename Decode,
             typename Reply>
   void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
-              Reply reply, std::optional<ipc::CallOptions> options = {}) {
+              Reply reply, Limit limit = Limit::Links) {
     link_->withSession([=, link = link_, slot = slot_](const DaemonSessionRef& session,
                                                        const NSErrorRef& error) {
       if (!session) {
@@ -29,6 +30,14 @@ class AsyncInvoker {
         return;
       }
       using Reader = typename Results::Reader;
+      if (limit == Limit::None) {
+        const auto take = [=](const Reader& results) {
+          link->replyQueue()->async([reply, value = decode(session, results)] { reply(value); });
+        };
+        callPatiently(link, session, method, fill, take,
+                      [slot](const NSErrorRef& failure) { slot->fail(failure); });
+        return;
+      }
       auto onReply = [decode, reply, slot, session, link](NSErrorRef failure,
                                                           const Reader* results) {
         const auto take = [&] {
@@ -40,7 +49,7 @@ class AsyncInvoker {
         slot->fail(failure);
       };
       (void)ipc::call(session->remote<Client>(), method, fill, std::move(onReply),
-                      options.value_or(link->callOptions()));
+                      link->callOptions());
     });
   }
 
@@ -59,15 +68,22 @@ class SyncInvoker {
   template <typename Client, typename Params, typename Results, typename Fill, typename Decode,
             typename Reply>
   void invoke(ipc::RequestMethod<Client, Params, Results> method, Fill fill, Decode decode,
-              Reply reply, std::optional<ipc::CallOptions> options = {}) {
+              Reply reply, Limit limit = Limit::Links) {
     const auto session = link_->waitForSession(&error);
     if (!session) return;
     using Value = decltype(decode(session, std::declval<const typename Results::Reader&>()));
     std::optional<Value> value;
+    if (limit == Limit::None) {
+      error = waitPatiently(
+          link_, session, method, std::move(fill),
+          [decode, session](const auto& results) { return decode(session, results); }, value);
+      if (value) reply(*value);
+      return;
+    }
     error = ipc::callAndWait(
         session->remote<Client>(), method, std::move(fill),
         [&](const typename Results::Reader& results) { value.emplace(decode(session, results)); },
-        options.value_or(link_->callOptions()));
+        link_->callOptions());
     if (error) {
       link_->noteFailure(session, error);
     } else if (value) {

@@ -1,5 +1,6 @@
 #include "platform/ostrell/query_item.h"
 
+#include <optional>
 #include <utility>
 
 #include "platform/fileprovider/item_codec.h"
@@ -7,6 +8,7 @@
 #include "platform/ostrell/daemon_link.h"
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
+#include "platform/ostrell/patient_call.h"
 
 namespace yomber {
 namespace {
@@ -55,22 +57,31 @@ QSQueryItemRef QSQueryItem::askDaemonQueryItemForURL(const NSURLRef& url, ForceS
     storeError(error, NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError));
     return nullptr;
   }
-  QSQueryItemRef item;
-  NSErrorRef refusal;
-  const NSErrorRef failure = DaemonLink::current()->callAndWait(
-      &Wire::Client::itemAtLocationRequest,
-      [&](Wire::ItemAtLocationParams::Builder params) {
-        params.setPath(wireData(url->path()));
-        params.setFakeFSEvent(andFakeFSEvent == ForceScan::Yes);
-      },
-      [&](const Wire::ItemAtLocationResults::Reader& results) {
-        item = decodeItemResult(results.getResult(), &refusal);
-      });
-  if (failure || refusal) {
-    storeError(error, failure ? failure : refusal);
-    return nullptr;
+  const bool isScan = andFakeFSEvent == ForceScan::Yes;
+  const auto link = DaemonLink::current();
+  NSErrorRef failure;
+  const auto session = link->waitForSession(&failure);
+  using Answer = std::pair<QSQueryItemRef, NSErrorRef>;
+  std::optional<Answer> answer;
+  const auto fill = [path = url->path(), isScan](Wire::ItemAtLocationParams::Builder params) {
+    params.setPath(wireData(path));
+    params.setFakeFSEvent(isScan);
+  };
+  const auto decode = [](const Wire::ItemAtLocationResults::Reader& results) {
+    Answer decoded;
+    decoded.first = decodeItemResult(results.getResult(), &decoded.second);
+    return decoded;
+  };
+  if (session && isScan) {  // reads all that a new folder holds
+    failure =
+        waitPatiently(link, session, &Wire::Client::itemAtLocationRequest, fill, decode, answer);
+  } else if (session) {
+    failure = link->callAndWait(&Wire::Client::itemAtLocationRequest, fill,
+                                [&](const auto& results) { answer = decode(results); });
   }
-  return item;
+  if (answer && answer->second) failure = answer->second;
+  if (failure) storeError(error, failure);
+  return answer && !failure ? answer->first : nullptr;
 }
 
 NSFileProviderItems fileProviderItems(const QSQueryItems& items) {

@@ -113,6 +113,27 @@ TEST_F(TrashSystem, ItemsComeBackWhereTheyAreWanted) {
   EXPECT_FALSE(fs::exists(at("a/x")));
 }
 
+TEST_F(TrashSystem, WhatComesBackHasTheNameThatItHad) {
+  const std::string longest = std::string(251, 'n') + ".txt";
+  for (const char* folder : {"a", "b"}) {
+    drive_.makeFolder(folder);
+    drive_.write(std::string(folder) + "/x.txt", folder);
+    drive_.write(std::string(folder) + "/" + longest, folder);
+  }
+  drive_.up();
+  for (const std::string& name : {std::string("x.txt"), longest}) {
+    std::vector<std::string> ids;
+    for (const char* folder : {"a/", "b/"}) {
+      ids.push_back(idOf(folder + name));
+      ASSERT_EQ(drive_.json({"trash", folder + name}).size(), 1U) << name;
+    }
+    for (const std::string& id : ids) ASSERT_EQ(drive_.json({"untrash", id}).size(), 1U) << name;
+    EXPECT_EQ(idOf("a/" + name), ids[0]);
+    EXPECT_EQ(idOf("b/" + name), ids[1]);
+  }
+  EXPECT_TRUE(eventually([&] { return filesIn("tree/.Trash/info") == 0; }));
+}
+
 TEST_F(TrashSystem, EmptyingRemovesEverything) {
   drive_.makeFolder("folder/below");
   drive_.write("folder/below/x");

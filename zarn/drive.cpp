@@ -58,15 +58,16 @@ RZEngineRef openStore(const DrivePaths& paths, const std::shared_ptr<ContentEngi
 
 }  // namespace
 
-/// What has to be done now and then: marks for files that the first scan left unmarked, and items
-/// that leave the working set as time goes by.
+/// What has to be done now and then: marks for files that the first scan left unmarked, items that
+/// leave the working set as time goes by, and content in the store that nobody refers to any more.
 class Drive::Housekeeping {
  public:
   Housekeeping(std::shared_ptr<Database> database, std::shared_ptr<Scanner> scanner,
-               std::shared_ptr<WorkingSetSignals> signals)
+               std::shared_ptr<WorkingSetSignals> signals, std::optional<StoreUpkeep> upkeep)
       : database_(std::move(database)),
         scanner_(std::move(scanner)),
         signals_(std::move(signals)),
+        upkeep_(std::move(upkeep)),
         thread_([this] { run(); }) {}
   ~Housekeeping() {
     {
@@ -102,12 +103,14 @@ class Drive::Housekeeping {
         if (!pause(isBusy ? kBusyPause : kStampPause)) return;
       }
       if (!pause(kPause)) return;
+      if (upkeep_) (void)upkeep_->runIfDue();
     }
   }
 
   const std::shared_ptr<Database> database_;
   const std::shared_ptr<Scanner> scanner_;
   const std::shared_ptr<WorkingSetSignals> signals_;
+  std::optional<StoreUpkeep> upkeep_;
   std::uint64_t lastRank_ = 0;  // own thread
   Mutex mutex_;
   Condition changed_;
@@ -191,7 +194,8 @@ void Drive::start() {
                            auto& notFound) { return scanner->scanDirty(dirty, notFound); },
        .didFinishFirstScan =
            [this] {
-             housekeeping_ = std::make_unique<Housekeeping>(database, scanner, workingSetSignals_);
+             housekeeping_ = std::make_unique<Housekeeping>(database, scanner, workingSetSignals_,
+                                                            storeUpkeep());
            }});
 }
 
@@ -260,6 +264,14 @@ void Drive::updateStore() {
   } else {
     engine->setStore(nullptr, {});
   }
+}
+
+std::optional<StoreUpkeep> Drive::storeUpkeep() const {
+  if (!records_) return std::nullopt;
+  const auto isIdle = [content = engine] {
+    return content->waitUntilIdle(std::chrono::milliseconds::zero());
+  };
+  return StoreUpkeep(records_, database, isIdle, {});
 }
 
 NSErrorRef Drive::accountError() const { return account->current() ? nullptr : loggedOutError(); }

@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -12,6 +13,7 @@
 #include "zarn/account.h"
 #include "zarn/change_feed.h"
 #include "zarn/containers.h"
+#include "zarn/content/store_upkeep.h"
 #include "zarn/content_engine.h"
 #include "zarn/database.h"
 #include "zarn/first_scan_gate.h"
@@ -90,6 +92,9 @@ class Drive : public std::enable_shared_from_this<Drive> {
   void accountDidChange();
   /// Gives the engine the store of whoever is signed in, once there are rows.
   void updateStore();
+
+  /// Nothing in the company of another engine.
+  [[nodiscard]] std::optional<StoreUpkeep> storeUpkeep() const;
 
   class Housekeeping;
   std::atomic<bool> hasBegunScanning_{false};

@@ -24,6 +24,7 @@ inline constexpr const char* kIsComplete = "isComplete";    ///< 1 once a whole 
 inline constexpr const char* kStampedUpTo = "stampedUpTo";  ///< see Scanner::stampSome
 inline constexpr const char* kSweptUpTo = "sweptUpTo";      ///< see ContentJobs::sweep
 inline constexpr const char* kLastAccount = "lastAccount";  ///< key of who was signed in last
+inline constexpr const char* kCollectedAt = "collectedAt";  ///< see StoreUpkeep; ns since the epoch
 }  // namespace meta
 
 /// Makes the tables in an empty file; brings those of an older version up to date; makes sort keys

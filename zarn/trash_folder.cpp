@@ -17,7 +17,6 @@
 namespace yomber {
 namespace {
 
-constexpr int kOpenFolder = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr mode_t kPrivateFile = 0600;
 constexpr std::size_t kLongestName = kMaximumNameLength - kTrashInfoSuffix.size();
 constexpr std::time_t kOthersGrace = 60;  // seconds
@@ -95,9 +94,9 @@ int TrashFolder::writeInfo(const std::string& path, const std::string& text) con
       open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kPrivateFile));
   if (!file) return errno;
   int failure = writeAll(file.get(), text);
+  // The sync of a file that is new brings its name to the disk as well, wherever names are
+  // journalled; an item's own move comes after it in that journal.
   if (failure == 0 && fsync(file.get()) != 0) failure = errno;
-  const FileDescriptor folder(open(info_.c_str(), kOpenFolder));
-  if (failure == 0 && (!folder || fsync(folder.get()) != 0)) failure = errno;
   if (failure != 0) (void)unlink(path.c_str());
   return failure;
 }

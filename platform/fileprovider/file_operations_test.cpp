@@ -122,6 +122,22 @@ TEST_F(FileOperationsTest, CleansUpAfterAnImportThatFailed) {
   EXPECT_EQ(count("staging"), 0U);
 }
 
+TEST_F(FileOperationsTest, CleansUpWhenTheNameDoesNotReachTheDisk) {
+  put("file");
+  fs::create_directories(at("source/below"));
+  put("source/below/file");
+  ASSERT_EQ(FaultPoint::arm("fileprovider.copy.name-synced=error"), nullptr);
+  for (const char* name : {"file", "source"}) {
+    EXPECT_EQ(import(url(name), url("tree/folder")).number(), EIO) << name;
+    EXPECT_EQ(count("tree/folder"), 0U) << name;
+    EXPECT_TRUE(fs::exists(at(name)));
+  }
+  FaultPoint::disarmAll();
+  for (const char* name : {"file", "source"}) {
+    EXPECT_TRUE(import(url(name), url("tree/folder")).url) << name;
+  }
+}
+
 TEST_F(FileOperationsTest, CleansUpWhatACrashLeft) {
   put("source", "content");
   EXPECT_EXIT(

@@ -26,6 +26,7 @@ using Identity = TreeCopy::Identity;
 
 FaultPoint copyIsStaged("fileprovider.copy.staged");
 FaultPoint copyIsInPlace("fileprovider.move.copy-in-place");
+FaultPoint nameIsSynced("fileprovider.copy.name-synced");
 FaultPoint treeIsTakenAway("fileprovider.delete.taken-away");
 
 struct Settings {
@@ -98,6 +99,17 @@ NSErrorRef syncFolder(const std::string& path) {
   return folder && fsync(folder.get()) == 0 ? nullptr : fileError(errno, path);
 }
 
+/// A new file is answered when its name is on the disk as well; the disk makes one write of many
+/// that ask for it at once.
+Placed syncPlaced(const FileDestination& destination, Placed placed) {
+  NSErrorRef error = syncFolder(destination.folder.onDisk);
+  if (nameIsSynced.hit()) error = fileError(EIO, destination.folder.onDisk);
+  if (error == nullptr) return placed;
+  TreeRemoval removal;
+  (void)removal.run(onDisk(destination, placed.url->lastPathComponent()));
+  return failed(std::move(error));
+}
+
 /// Copies into the staging folder and renames into place. EXDEV when the staging folder is no good
 /// for this destination.
 int placeCopy(const StagingFolder& staging, const FileLocation& source,
@@ -123,6 +135,7 @@ int placeCopy(const StagingFolder& staging, const FileLocation& source,
   } else {
     placed = placedAt(destination, name);
     if (const auto mode = copy.pendingMode()) (void)chmod(onDisk(destination, name).c_str(), *mode);
+    if (identity == Identity::New) placed = syncPlaced(destination, std::move(placed));
   }
   return 0;
 }

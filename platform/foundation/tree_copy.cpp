@@ -47,11 +47,24 @@ int copyProperties(int source, int destination, const struct stat& status, mode_
   return futimens(destination, timesOf(status).data()) == 0 ? 0 : errno;
 }
 
+/// Without waiting for whoever might be at the other end of what has become a pipe; but for a
+/// document whose content is just being filled in or given up.
+FileDescriptor openSource(int folder, const char* name) {
+  constexpr int kFlags = O_RDONLY | O_NOFOLLOW | O_CLOEXEC;
+  FileDescriptor source(openat(folder, name, kFlags | O_NONBLOCK));
+  if (source || errno != EWOULDBLOCK) return source;
+  const FileDescriptor place(openat(folder, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  struct stat status{};
+  if (!place || fstat(place.get(), &status) != 0) return {};
+  errno = EWOULDBLOCK;
+  if (!S_ISREG(status.st_mode)) return {};
+  const std::string path = "/proc/self/fd/" + std::to_string(place.get());
+  return FileDescriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+}
+
 int copyRegularFile(int sourceFolder, const char* name, int destinationFolder, const char* copyName,
                     Identity identity, bool syncs) {
-  // Not waiting for whoever might be at the other end of what has become a pipe.
-  const FileDescriptor source(
-      openat(sourceFolder, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  const FileDescriptor source = openSource(sourceFolder, name);
   struct stat status{};
   if (!source || fstat(source.get(), &status) != 0) return errno;
   if (!S_ISREG(status.st_mode)) return kNeitherFileNorFolder;

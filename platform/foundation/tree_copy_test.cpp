@@ -8,11 +8,15 @@
 
 #include <array>
 #include <cerrno>
+#include <chrono>
+#include <csignal>
 #include <ctime>
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/file_manager.h"
 #include "platform/foundation/temporary_directory.h"
 #include "platform/foundation/tree_removal.h"
@@ -62,6 +66,23 @@ class TreeCopyTest : public testing::Test {
 
   TemporaryDirectory directory_;
 };
+
+TEST_F(TreeCopyTest, WaitsForContentThatIsJustBeingChangedUnderALease) {
+  put("file", "old");
+  const FileDescriptor file(open(at("file").c_str(), O_RDWR | O_CLOEXEC));
+  ASSERT_EQ(fcntl(file.get(), F_SETSIG, SIGURG), 0);
+  if (fcntl(file.get(), F_SETLEASE, F_WRLCK) != 0) GTEST_SKIP() << "no leases on this file system";
+  std::thread copier([&] { EXPECT_EQ(copy("file", "copy"), nullptr); });
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (fcntl(file.get(), F_GETLEASE) == F_WRLCK && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::yield();
+  }
+  EXPECT_EQ(fcntl(file.get(), F_GETLEASE), F_RDLCK);
+  EXPECT_EQ(pwrite(file.get(), "new", 3, 0), 3);
+  EXPECT_EQ(fcntl(file.get(), F_SETLEASE, F_UNLCK), 0);
+  copier.join();
+  EXPECT_EQ(get("copy"), "new");
+}
 
 TEST_F(TreeCopyTest, CopiesContentModeDatesAndAttributes) {
   put("source", "some bytes");

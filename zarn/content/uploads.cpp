@@ -166,7 +166,8 @@ class UploadGroup {
     };
     for (int reading = 0; reading < kReadings; ++reading) {
       RZAsset content;
-      if ((error = store_->take(*group_, file, goesOn, content))) return error;
+      error = store_->take(*group_, file, goesOn, content);
+      if (error) return error;
       bytes_ += content.size;
       struct stat status{};
       if (fstat(file, &status) != 0) return NSError::errorWithErrno(errno, upload.subject.path);

@@ -58,13 +58,16 @@ class RoundTrip : public ::testing::Test {
 
   [[nodiscard]] std::string there() const { return drive_.root() + "/many"; }
 
-  /// Says how long a step took.
+  /// Says how long a step took, and how much memory was needed.
   template <typename Step>
   void timed(const char* name, const Step& step) {
     const auto start = std::chrono::steady_clock::now();
     step();
     const std::chrono::duration<double> seconds = std::chrono::steady_clock::now() - start;
-    std::cout << name << ": " << seconds.count() << " s" << std::endl;
+    std::cout << name << ": " << seconds.count() << " s; so far at most "
+              << (peakOf(drive_.pidOf(TestDrive::Process::Zarn)) >> 20U) << " MiB of zarn, "
+              << (peakOf(drive_.pidOf(TestDrive::Process::Extension)) >> 20U)
+              << " MiB of the extension" << std::endl;
   }
 
   void run(const std::vector<std::string>& arguments) {
@@ -124,8 +127,6 @@ class RoundTrip : public ::testing::Test {
   void expectLittleMemory() {
     const std::uint64_t daemon = peakOf(drive_.pidOf(TestDrive::Process::Zarn));
     const std::uint64_t extension = peakOf(drive_.pidOf(TestDrive::Process::Extension));
-    std::cout << "at most " << (daemon >> 20U) << " MiB of zarn, " << (extension >> 20U)
-              << " MiB of the extension" << std::endl;
     if (kIsSanitized) return;  // their shadow is larger than what it shadows
     EXPECT_LE(daemon, kMostOfDaemon);
     EXPECT_LE(extension, kMostOfExtension);

@@ -131,7 +131,7 @@ class RZAssetWriter {
   RZAssetWriter(const RZAssetWriter&) = delete;
   RZAssetWriter& operator=(const RZAssetWriter&) = delete;
 
-  /// Large pieces (1 MiB) are hashed beside being written. Blocks of zeros take no room. After a
+  /// Large pieces (256 KiB) are hashed beside being written. Blocks of zeros take no room. After a
   /// failure the writer answers that failure to everything.
   [[nodiscard]] virtual NSErrorRef write(std::span<const std::byte> bytes) = 0;
   /// As many zeros, without passing them.

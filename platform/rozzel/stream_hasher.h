@@ -18,7 +18,7 @@ namespace yomber {
 /// Thread-safety: one thread at a time.
 class StreamHasher {
  public:
-  static constexpr std::size_t kBufferBytes = 1 << 20;
+  static constexpr std::size_t kBufferBytes = 256 << 10;
   static constexpr std::size_t kBuffers = 4;
 
   StreamHasher();

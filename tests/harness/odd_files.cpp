@@ -140,10 +140,11 @@ class OddFile {
       const auto length = static_cast<std::size_t>(std::min<std::uint64_t>(kPiece, size_ - offset));
       for (std::size_t i = 0; i < (length + 7) / 8; ++i) piece[i] = random_();
       const bool isHole = hasHoles() && (index % 4 != 0 || length > 4 * kBlock);
-      // In pieces with a hole just some blocks in their middle.
-      const std::size_t begin = isHole ? length / 2 : 0;
-      const std::size_t end =
-          isHole ? std::min(length, begin + (index % 4 == 0 ? kBlock : 0)) : length;
+      // In pieces with a hole just one block, or none.
+      const bool beginsWithData = index == 0 && number_ % 12 == 1;
+      const std::size_t begin = isHole && !beginsWithData ? length / 2 : 0;
+      const std::size_t kept = index % 4 == 0 ? kBlock : 0;
+      const std::size_t end = isHole ? std::min(length, begin + kept) : length;
       const auto* bytes = reinterpret_cast<const char*>(piece.data());
       const ssize_t written =
           pwrite(file_.get(), bytes + begin, end - begin, static_cast<off_t>(offset + begin));

@@ -103,11 +103,27 @@ NSErrorRef ChangedFile::punch() const {
   if (size <= kKeptBytes) return nullptr;
   // To the end of the last block, which would stay otherwise.
   const std::uint64_t length = (size - kKeptBytes + kKeptBytes - 1) / kKeptBytes * kKeptBytes;
-  constexpr int kMode = FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE;
-  if (fallocate(file_.get(), kMode, kKeptBytes, static_cast<off_t>(length)) != 0) {
-    return failure(errno);
-  }
+  if (!punchAt(kKeptBytes, length)) return failure(errno);
+  shrinkMap();
   return nullptr;
+}
+
+bool ChangedFile::punchAt(std::uint64_t offset, std::uint64_t length) const {
+  constexpr int kMode = FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE;
+  return fallocate(file_.get(), kMode, static_cast<off_t>(offset), static_cast<off_t>(length)) == 0;
+}
+
+/// The map of a file in many pieces has blocks of its own. ext4 takes the last one back only when a
+/// piece is added to the one that is left.
+void ChangedFile::shrinkMap() const {
+  constexpr std::uint64_t kSector = 512;
+  struct stat now{};
+  const bool isSmall = fstat(file_.get(), &now) != 0 ||
+                       static_cast<std::uint64_t>(now.st_blocks) * kSector <= 2 * kKeptBytes;
+  if (isSmall) return;
+  // Without room for it, it stays as it is.
+  (void)fallocate(file_.get(), FALLOC_FL_KEEP_SIZE, kKeptBytes, kKeptBytes);
+  (void)punchAt(kKeptBytes, kKeptBytes);
 }
 
 NSErrorRef ChangedFile::setAttribute(const char* name, const std::string& value) const {

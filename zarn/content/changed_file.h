@@ -45,6 +45,9 @@ class ChangedFile {
 
  private:
   ChangedFile() = default;
+  [[nodiscard]] bool punchAt(std::uint64_t offset, std::uint64_t length) const;
+  void shrinkMap() const;
+
   FileDescriptor file_;
   std::string path_;
   struct stat status_{};

@@ -160,19 +160,23 @@ class UploadGroup {
     if (!group_) return error;
     const auto running = core_.queue->running(upload.subject.job.item);
     if (running) running->progress->setTotalUnitCount(static_cast<std::int64_t>(stamp.size));
+    const auto stampNow = [file] {
+      struct stat status{};
+      return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
+    };
+    bool isSame = true;
     const auto goesOn = [&](std::uint64_t done) {
       if (running) running->progress->setCompletedUnitCount(static_cast<std::int64_t>(done));
-      return !core_.queue->isEnding();
+      isSame = stampNow() == stamp;  // or else all of it is for nothing
+      return isSame && !core_.queue->isEnding();
     };
     for (int reading = 0; reading < kReadings; ++reading) {
       RZAsset content;
       error = store_->take(*group_, file, goesOn, content);
-      if (error) return error;
-      bytes_ += content.size;
-      struct stat status{};
-      if (fstat(file, &status) != 0) return NSError::errorWithErrno(errno, upload.subject.path);
-      const FileStamp after = FileStamp::of(status);
-      if (after == stamp && content.size == stamp.size) {
+      if (error && isSame) return error;
+      const FileStamp after = stampNow();
+      if (!error) bytes_ += content.size;
+      if (!error && after == stamp && content.size == stamp.size) {
         upload.confirmed.content = content;
         upload.confirmed.stamp = stamp;
         return uploadStaged.hit() ? NSError::errorWithErrno(EIO) : nullptr;

@@ -17,6 +17,7 @@
 #include <thread>
 
 #include "platform/foundation/fault_points.h"
+#include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/lock.h"
 #include "platform/foundation/log.h"
 #include "zarn/bulk_load.h"
@@ -516,6 +517,15 @@ NSErrorRef Database::write(const Job& job) {
 
 void Database::writeLater(Job job, std::function<void(NSErrorRef)> done) {
   state_->submit({.job = std::move(job), .alone = {}, .done = std::move(done), .result = nullptr});
+}
+
+NSErrorRef Database::makeDurable() const {
+  // What the log does not hold any more was synced before it left it. (SQLite keeps no lock on the
+  // log that closing it here would drop.)
+  const std::string log = state_->path + "-wal";
+  const FileDescriptor file(::open(log.c_str(), O_RDONLY | O_CLOEXEC));
+  const bool isDurable = file ? fdatasync(file.get()) == 0 : errno == ENOENT;
+  return isDurable ? nullptr : NSError::errorWithErrno(errno, log);
 }
 
 NSErrorRef Database::read(const Read& job) const {

@@ -65,6 +65,10 @@ class Database {
   /// Same without waiting. `done` may be empty; runs on the writer thread after the commit.
   void writeLater(Job job, std::function<void(NSErrorRef)> done);
 
+  /// When it returns, what was committed before survives a loss of power. Commits alone survive
+  /// the end of this program only.
+  [[nodiscard]] NSErrorRef makeDurable() const;
+
   /// Runs `job` with a reading connection of the calling thread's own choosing.
   using Read = std::function<void(Connection&)>;
   [[nodiscard]] NSErrorRef read(const Read& job) const;

@@ -200,6 +200,7 @@ bool LoadWorker::saveSafely(Document& document) {
     if (!isSynced) return false;
   }
   document.versions.push_back(version);
+  document.isIdSafe = false;  // it is another file from here on
   const bool isSaved = ::rename(aside.c_str(), document.path.c_str()) == 0;
   EXPECT_TRUE(isSaved || isCut()) << document.path;
   return isSaved && succeeded(document, "save");

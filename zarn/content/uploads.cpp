@@ -1,10 +1,12 @@
 // Uploads: reading documents, making the store's records what they are, and confirming that.
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <memory>
 #include <utility>
+#include <vector>
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
@@ -24,6 +26,8 @@ FaultPoint uploadConfirmed("zarn.upload.confirmed");
 /// So much is read before it is synced and committed together.
 constexpr std::uint64_t kGroupBytes = 64 << 20;
 constexpr int kReadings = 3;
+/// Up to so many are synced one by one, more by syncing the file system.
+constexpr std::size_t kFewFiles = 4;
 
 /// One document on its way.
 struct Upload {
@@ -49,7 +53,8 @@ class UploadGroup {
   }
 
   void finish() {
-    NSErrorRef error = commitAssets();
+    NSErrorRef error = syncDocuments();
+    if (!error) error = commitAssets();
     if (!error) error = saveRecords();
     confirm(error);
     uploads_.clear();
@@ -103,7 +108,7 @@ class UploadGroup {
         // Marked as filled: a copy of one that was so, for which nobody has a job.
         bool isDamaged = false;
         upload.isToSettle = readFaultRecord(file.get(), isDamaged).has_value();
-        return readContent(upload, file.get());
+        return readDocument(upload, std::move(file));
       }
       case FaultCondition::Pristine:
         return readFault(upload, found);
@@ -135,6 +140,31 @@ class UploadGroup {
     upload.confirmed.content = found.record.content;
     upload.confirmed.stamp = found.stamp;
     return nullptr;
+  }
+
+  NSErrorRef readDocument(Upload& upload, FileDescriptor file) {
+    const FileStamp before = upload.confirmed.stamp;
+    if (NSErrorRef error = readContent(upload, file.get())) return error;
+    if (upload.confirmed.stamp == before) return nullptr;
+    if (unsynced_.size() >= kFewFiles) file = FileDescriptor();
+    unsynced_.push_back(std::move(file));
+    return nullptr;
+  }
+
+  /// What this disk could still forget, its document and the row with its id, must not be told to
+  /// the store: after a loss of power, what was left of it would go there as a change.
+  NSErrorRef syncDocuments() {
+    const std::vector<FileDescriptor> files = std::exchange(unsynced_, {});
+    if (files.empty()) return nullptr;
+    const std::string& tree = core_.items->layout().tree();
+    bool isSynced = true;
+    if (files.size() <= kFewFiles) {
+      for (const FileDescriptor& file : files) isSynced = isSynced && fsync(file.get()) == 0;
+    } else {
+      const FileDescriptor folder(open(tree.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+      isSynced = folder && syncfs(folder.get()) == 0;
+    }
+    return isSynced ? core_.database().makeDurable() : NSError::errorWithErrno(errno, tree);
   }
 
   NSErrorRef readContent(Upload& upload, int file) {
@@ -292,6 +322,8 @@ class UploadGroup {
   const std::shared_ptr<ContentStore> store_;
   std::unique_ptr<RZAssetGroup> group_;
   std::vector<Upload> uploads_;
+  /// Documents that were read; closed from the fifth on.
+  std::vector<FileDescriptor> unsynced_;
   std::uint64_t bytes_ = 0;
   bool hasSettling_ = false;
 };

@@ -1,6 +1,7 @@
 // Reconciler: which row an entry without one gets, and which rows go.
 #include <algorithm>
 
+#include "platform/foundation/fault_points.h"
 #include "zarn/reconciler.h"
 #include "zarn/row_queries.h"
 
@@ -122,8 +123,12 @@ void Reconciler::decide(WriteTransaction& transaction, Candidate& candidate) {
 
 void Reconciler::move(WriteTransaction& transaction, const Candidate& candidate,
                       const ItemRow& row) {
+  static FaultPoint seen("zarn.move.seen");
+  static FaultPoint stored("zarn.move.stored");
+  (void)seen.hit();
   gone_.erase(row.id);
   if (!storeChanged(transaction, candidate, row)) return postpone(candidate);
+  (void)stored.hit();
   const std::string& name = row.nameOnDisk();
   const bool isBackup = row.kind == ItemKind::Document && row.parent == candidate.parent &&
                         isBackupName(candidate.name, name);

@@ -4,6 +4,7 @@
 
 #include "zarn/recent_backups.h"
 #include "zarn/test_drive.h"
+#include "zarn/write_transaction.h"
 
 namespace yomber {
 namespace {
@@ -13,6 +14,16 @@ class SafeSavesTest : public TestDrive {
  protected:
   void useClock() {
     database->recentBackups().setClock([this] { return now_; });
+  }
+  void markUploaded(const std::string& name) {
+    const NSErrorRef error = database->write([&](WriteTransaction& transaction) -> NSErrorRef {
+      const ItemRow before = *row(name);
+      ItemRow uploaded = before;
+      uploaded.flags |= row_flag::kUploaded;
+      (void)transaction.update(before, uploaded);
+      return nullptr;
+    });
+    ASSERT_EQ(error, nullptr);
   }
   std::chrono::steady_clock::time_point now_{std::chrono::hours(1)};
 };
@@ -89,6 +100,35 @@ TEST_F(SafeSavesTest, ANewFileRenamedOverADocumentTakesItsID) {
     EXPECT_EQ(id("a.txt"), document);
     EXPECT_EQ(names(), std::vector<std::string>{"a.txt"});
   }
+}
+
+TEST_F(SafeSavesTest, ANewFileThatWasUploadedBeforeItWasRenamedOverADocumentTakesItsID) {
+  for (const bool hasBackup : {false, true}) {
+    const std::string name = hasBackup ? "b.txt" : "a.txt";
+    write(name, "first");
+    scan();
+    const std::uint64_t document = id(name);
+    write("new.txt", "second");
+    scan();
+    markUploaded("new.txt");
+    if (hasBackup) rename(name, name + "~");
+    rename("new.txt", name);
+    scan();
+    EXPECT_EQ(id(name), document) << name;
+    EXPECT_EQ(id("new.txt"), 0U);
+  }
+}
+
+TEST_F(SafeSavesTest, AnUploadedDocumentOfAnotherFolderThatIsMovedOverOneKeepsItsID) {
+  makeFolder("folder");
+  write("folder/mine.txt", "mine");
+  write("a.txt", "first");
+  scan();
+  const std::uint64_t mine = id("folder/mine.txt");
+  markUploaded("folder/mine.txt");
+  rename("folder/mine.txt", "a.txt");
+  scan();
+  EXPECT_EQ(id("a.txt"), mine);
 }
 
 TEST(BackupNamesTest, AreToldFromOtherNames) {

@@ -33,8 +33,9 @@ class ContentKillTest : public ContentDrive, public testing::WithParamInterface<
     ASSERT_TRUE(WIFSIGNALED(ending)) << point << " was not reached";
     open();
     records = std::make_shared<EmbeddedEngine>(storePath);
-    scan();
+    // In this order, as zarn does it: what the scan finds makes jobs.
     startEngine();
+    scan();
     ASSERT_TRUE(engine->waitUntilIdle(kPatience));
   }
 };
@@ -109,6 +110,33 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, DownloadKillTest,
                                          "zarn.fill.dated", "zarn.fill.filled",
                                          "zarn.download.filled", "zarn.settle.synced",
                                          "zarn.settle.unmarked"));
+
+class MoveKillTest : public ContentKillTest {};
+
+TEST_P(MoveKillTest, TheNextProcessKnowsTheDocumentAgainAndTheStoreHearsOfIt) {
+  const std::string text = content(500'000);
+  makeFolder("folder");
+  write("a", text);
+  settle();
+  const std::uint64_t document = id("a");
+  ASSERT_EQ(evict("a"), nullptr);
+  dieDuring(GetParam(), [&] {
+    rename("a", "folder/b");
+    scan();
+  });
+  EXPECT_EQ(id("folder/b"), document);
+  EXPECT_FALSE(row("a"));
+  EXPECT_TRUE(isFault("folder/b"));
+  ASSERT_TRUE(
+      waitUntil([&] { return state("folder/b").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_TRUE(contentInStore(document) == text);
+  EXPECT_EQ(provide("folder/b"), nullptr);
+  EXPECT_TRUE(read("folder/b") == text);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, MoveKillTest,
+                         testing::Values("zarn.move.seen", "zarn.move.stored", "zarn.upload.read",
+                                         "zarn.upload.committed", "zarn.upload.confirmed"));
 
 }  // namespace
 }  // namespace yomber

@@ -137,7 +137,6 @@ TEST_F(FullDiskSystem, ADriveThatIsStartedOnAFullDiskGoesOnToo) {
   ASSERT_EQ(client_->evict(at("away")), nullptr);
   fill();
   drive_.kill(TestDrive::Process::Zarn);
-  makeRoom();
   ASSERT_TRUE(eventually([&] {
     try {
       client_.emplace(drive_.home());
@@ -146,6 +145,9 @@ TEST_F(FullDiskSystem, ADriveThatIsStartedOnAFullDiskGoesOnToo) {
       return false;
     }
   }));
+  EXPECT_NE(client_->provide(at("away")), nullptr);
+  EXPECT_EQ(client_->state(at("away")).local, Local::FAULT);
+  makeRoom();
   EXPECT_EQ(client_->provide(at("away")), nullptr);
   EXPECT_TRUE(contentOf(at("away")) == away);
 }

@@ -56,34 +56,55 @@ std::string ContentCore::account() const {
   return account_;
 }
 
+std::shared_ptr<ContentStore> ContentCore::storeOf(std::int64_t account) const {
+  LockGuard guard(mutex_);
+  return storeKey_ == account ? store_ : nullptr;
+}
+
 void ContentCore::setStore(std::shared_ptr<ContentStore> store, const std::string& account) {
+  LockGuard signing(signingMutex_);
   const bool isSignedIn = store != nullptr;
   queue->setStoreOpen(false);
-  if (isSignedIn) {
-    const std::int64_t before = queue->account();
-    std::int64_t key = 0;
-    const NSErrorRef error = database().write([&](WriteTransaction& transaction) {
-      Connection& connection = transaction.connection();
-      key = accountKey(connection, account);
-      claimForAccount(connection, key);
-      setMetaInteger(connection, meta::kLastAccount, key);
-      // Here, where jobs are made: one made for nobody after the claim would wait for ever.
-      queue->setAccount(key);
-      return NSErrorRef();
-    });
-    if (error) {
-      log_error(defaultLog(), "[ERROR] jobs wait, for the account cannot be stored: %@", error);
-      store = nullptr;
-    }
-    queue->setAccount(error ? before : key);  // what it has read meanwhile was not committed
-  }
+  isAccountStored_ = !isSignedIn || storeAccount(account);
   {
     LockGuard guard(mutex_);
     store_ = std::move(store);
     account_ = account;
+    storeKey_ = isAccountStored_ ? queue->account() : kNoAccount;
   }
   isOffline_ = false;
-  if (isSignedIn) probe();
+  if (isSignedIn && isAccountStored_) probe();
+}
+
+bool ContentCore::storeAccount(const std::string& account) {
+  const std::int64_t before = queue->account();
+  std::int64_t key = 0;
+  const NSErrorRef error = database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    key = accountKey(connection, account);
+    claimForAccount(connection, key);
+    setMetaInteger(connection, meta::kLastAccount, key);
+    // Here, where jobs are made: one made for nobody after the claim would wait for ever.
+    queue->setAccount(key);
+    return NSErrorRef();
+  });
+  if (error) {
+    log_error(defaultLog(), "[ERROR] jobs wait, for the account cannot be stored: %@", error);
+  }
+  queue->setAccount(error ? before : key);  // what it has read meanwhile was not committed
+  return !error;
+}
+
+void ContentCore::storeAccountAgain() {
+  LockGuard signing(signingMutex_);
+  if (isAccountStored_) return;
+  isAccountStored_ = storeAccount(account());
+  if (!isAccountStored_) return;
+  {
+    LockGuard guard(mutex_);
+    storeKey_ = queue->account();
+  }
+  probe();
 }
 
 void ContentCore::noteOutOfReach() {

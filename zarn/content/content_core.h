@@ -46,8 +46,12 @@ class ContentCore {
 
   /// Null while nobody is signed in.
   [[nodiscard]] std::shared_ptr<ContentStore> store() const;
+  /// For jobs of that account; null when another one is signed in by now.
+  [[nodiscard]] std::shared_ptr<ContentStore> storeOf(std::int64_t account) const;
   [[nodiscard]] std::string account() const;
   void setStore(std::shared_ptr<ContentStore> store, const std::string& account);
+  /// To be called now and then: jobs wait while the account could not be stored, as on a full disk.
+  void storeAccountAgain();
   /// The store did not answer: jobs that need it wait until it does.
   void noteOutOfReach();
   /// Looks whether it can be reached again.
@@ -86,9 +90,16 @@ class ContentCore {
  private:
   void forgetChangeTime(std::uint64_t item) const;
 
+  [[nodiscard]] bool storeAccount(const std::string& account) REQUIRES(signingMutex_);
+
+  Mutex signingMutex_;  ///< held while the account is stored, so that the last one is
+  bool isAccountStored_ GUARDED_BY(signingMutex_) = true;
+
   mutable Mutex mutex_;
   std::shared_ptr<ContentStore> store_ GUARDED_BY(mutex_);
   std::string account_ GUARDED_BY(mutex_);
+  static constexpr std::int64_t kNoAccount = -1;
+  std::int64_t storeKey_ GUARDED_BY(mutex_) = kNoAccount;  ///< the account's, as jobs have it
   std::atomic<bool> isOffline_{false};
   AtomicCell<NSErrorRef> storingFailure_;
 };

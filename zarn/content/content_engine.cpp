@@ -139,6 +139,7 @@ void Engine::watchStore() {
                                std::chrono::steady_clock::now() + core_->options.offlinePause);
       if (isEnding_) return;
     }
+    core_->storeAccountAgain();
     if (core_->isOffline()) core_->probe();
   }
 }

@@ -214,6 +214,21 @@ TEST_F(ContentUploadsTest, SignedOutJobsWaitAndNoOtherAccountSeesThem) {
   EXPECT_EQ(contentInStore(id("b")), "of ann, too");
 }
 
+TEST_F(ContentUploadsTest, AnAccountThatCannotBeStoredAtFirstIsStoredLater) {
+  const std::string text = content(100'000);
+  makeFault("a", text);
+  engine->setStore(nullptr, {});
+  write("b", "text");
+  scan();
+  ASSERT_EQ(FaultPoint::arm("zarn.database.before-commit=error"), nullptr);
+  signIn("ann");
+  EXPECT_EQ(state("b").upload, ContentState::Upload::Waiting);
+  FaultPoint::disarmAll();
+  ASSERT_TRUE(waitUntil([&] { return state("b").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == text);
+}
+
 TEST_F(ContentUploadsTest, WhatWasMadeBeforeAnybodySignedInIsTheFirstAccounts) {
   engine->stop();
   engine.reset();

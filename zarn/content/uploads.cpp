@@ -66,7 +66,7 @@ class UploadGroup {
   void prepare(Upload& upload) {
     JobSubject& subject = upload.subject;
     upload.confirmed.id = subject.job.item;
-    upload.confirmed.account = core_.queue->account();
+    upload.confirmed.account = subject.job.account;
     if (subject.content) upload.confirmed = *subject.content;
     if (!subject.row) {
       upload.kind = subject.content && subject.content->content ? Upload::Kind::Remove
@@ -331,7 +331,7 @@ class UploadGroup {
 }  // namespace
 
 void doUploads(ContentCore& core, const std::vector<Job>& jobs) {
-  const auto store = core.store();
+  const auto store = jobs.empty() ? nullptr : core.storeOf(jobs.front().account);
   if (!store) return;  // signed out meanwhile
   std::vector<JobSubject> subjects;
   if (const NSErrorRef error = core.readSubjects(jobs, subjects)) {

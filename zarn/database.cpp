@@ -250,7 +250,9 @@ void Database::State::runBatch(std::vector<Task>& batch) {
                                recentlyGone);
   std::function<void()> afterwards;
   try {
-    writer->execute("BEGIN");
+    // A reader that meets a half-written header of the log holds the writer's lock for an instant;
+    // only here is it waited for, not once something was read.
+    writer->execute("BEGIN IMMEDIATE");
     for (Task& task : batch) runTask(task, transaction);
     afterwards = letParticipate(transaction);
     storeRank(transaction);

@@ -72,6 +72,32 @@ TEST_F(DatabaseTest, AReadTransactionSeesOneStateWhateverIsWrittenMeanwhile) {
   EXPECT_EQ(error, nullptr);
 }
 
+TEST_F(DatabaseTest, WaitsForTheWritersLockAlsoWhenAChangeReadsFirst) {
+  // As a reader does that meets a half-written header of the log.
+  Connection other(layout.databasePath(), Connection::Mode::Write);
+  other.execute("BEGIN IMMEDIATE");
+  std::promise<void> tried;
+  std::promise<NSErrorRef> ended;
+  database->writeLater(
+      [&](WriteTransaction& transaction) {
+        EXPECT_FALSE(findByName(transaction.connection(), kRootID, "a").has_value());
+        struct Notice {
+          std::promise<void>& promise;
+          ~Notice() { promise.set_value(); }
+        } const notice{tried};
+        ItemRow row = document("a");
+        row.id = transaction.issueID();
+        transaction.insert(row);
+        return NSErrorRef();
+      },
+      [&](const NSErrorRef& error) { ended.set_value(error); });
+  // It must not get that far; if it did, it would have failed by then.
+  EXPECT_EQ(tried.get_future().wait_for(std::chrono::milliseconds(200)),
+            std::future_status::timeout);
+  other.execute("COMMIT");
+  EXPECT_EQ(ended.get_future().get(), nullptr);
+}
+
 TEST_F(DatabaseTest, RanksGrowOverRestarts) {
   const std::uint64_t start = database->currentRank();
   ASSERT_EQ(insert("a"), nullptr);

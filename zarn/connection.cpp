@@ -25,7 +25,8 @@ int openFlags(Connection::Mode mode) {
 const char* pragmas(Connection::Mode mode) {
   switch (mode) {
     case Connection::Mode::Read:
-      return "PRAGMA mmap_size=2147418112; PRAGMA cache_size=-4096; PRAGMA query_only=1;";
+      // What is not in the log is read where it is mapped; several of these stay open.
+      return "PRAGMA mmap_size=2147418112; PRAGMA cache_size=-1024; PRAGMA query_only=1;";
     case Connection::Mode::Write:
       return "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA mmap_size=2147418112;"
              "PRAGMA cache_size=-32768; PRAGMA temp_store=MEMORY; PRAGMA secure_delete=0;"

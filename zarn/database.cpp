@@ -438,9 +438,9 @@ NSErrorRef Database::State::swapIn(const std::string& aside) {
   return error;
 }
 
-Database::Database(std::unique_ptr<State> state) : state_(std::move(state)) {
+Database::Database(std::shared_ptr<State> state) : state_(std::move(state)) {
   State* const running = state_.get();
-  running->thread = std::thread([running] { running->run(); });
+  running->thread = std::thread([state = state_] { state->run(); });
   running->checkpointer = std::thread([running] { running->runCheckpoints(); });
 }
 
@@ -450,7 +450,12 @@ Database::~Database() {
     state_->isClosing = true;
     state_->queueChanged.notifyAll();
   }
-  state_->thread.join();
+  // The last reference may go in what the writer calls, which then outlives us.
+  if (state_->thread.get_id() == std::this_thread::get_id()) {
+    state_->thread.detach();
+  } else {
+    state_->thread.join();
+  }
   state_->endCheckpoints();
 }
 
@@ -469,7 +474,7 @@ std::shared_ptr<Database> Database::open(const std::string& path, NSErrorRef* er
   removeWithCompanions(path + kAsideSuffix);
   const std::string suspect = path + kSuspectSuffix;
   for (const bool isSecondTry : {false, true}) {
-    auto state = std::make_unique<State>(path);
+    auto state = std::make_shared<State>(path);
     try {
       if (access(suspect.c_str(), F_OK) == 0 && access(path.c_str(), F_OK) == 0 && !isSound(path)) {
         throw SQLite::Exception("a check found it malformed", SQLITE_CORRUPT);

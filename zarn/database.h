@@ -96,8 +96,8 @@ class Database {
 
  private:
   struct State;
-  explicit Database(std::unique_ptr<State> state);
-  std::unique_ptr<State> state_;
+  explicit Database(std::shared_ptr<State> state);
+  const std::shared_ptr<State> state_;
 };
 
 }  // namespace yomber

@@ -7,6 +7,7 @@
 #include <chrono>
 #include <future>
 #include <thread>
+#include <utility>
 
 #include "platform/foundation/fault_points.h"
 #include "zarn/bulk_load.h"
@@ -130,6 +131,26 @@ TEST_F(DatabaseTest, SinksAreToldOfEveryChangeInOrder) {
   EXPECT_TRUE(changes[2].isDead());
   EXPECT_LT(changes[1].row.rank, changes[2].row.rank);
   EXPECT_FALSE(store->itemByName(kRootID, "b"));
+}
+
+TEST_F(DatabaseTest, ItsLastReferenceMayGoOnItsOwnThread) {
+  ASSERT_EQ(insert("kept"), nullptr);
+  std::promise<void> others;
+  std::promise<void> over;
+  Database& all = *database;
+  all.writeLater([](WriteTransaction&) { return NSErrorRef(); },
+                 [last = std::exchange(database, nullptr), &over,
+                  gone = others.get_future().share()](NSErrorRef) mutable {
+                   gone.wait();
+                   last.reset();
+                   over.set_value();
+                 });
+  close();
+  others.set_value();
+  over.get_future().wait();
+  open();
+  EXPECT_TRUE(store->itemByName(kRootID, "kept"));
+  EXPECT_EQ(insert("another"), nullptr);
 }
 
 TEST_F(DatabaseTest, AFailingJobUndoesOnlyItself) {

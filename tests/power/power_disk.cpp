@@ -8,6 +8,8 @@
 #include <stdexcept>
 
 #include <fcntl.h>
+#include <sched.h>
+#include <sys/mount.h>
 #include <unistd.h>
 
 #include "tests/harness/test_drive.h"
@@ -29,10 +31,20 @@ int run(const std::vector<std::string>& command) {
   return result.exitCode;
 }
 
+/// Mounts of this test are its own: a copy in anybody else's namespace would keep the disk in use.
+/// For this thread and those that it starts.
+bool leaveSharedMounts() {
+  return unshare(CLONE_NEWNS) == 0 &&
+         ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+}
+
 }  // namespace
 
 std::optional<std::string> PowerDisk::reasonItCannotBe() {
   if (geteuid() != 0) return "mounting needs root";
+  if (runProcess({"/usr/bin/unshare", "-m", "/bin/true"}).exitCode != 0) {
+    return "mounts of its own are not allowed";
+  }
   if (access("/dev/fuse", R_OK | W_OK) != 0) return "there is no /dev/fuse";
   if (access("/usr/sbin/mkfs.ext4", X_OK) != 0) return "there is no mkfs.ext4 (e2fsprogs)";
   if (runProcess({"/usr/sbin/losetup", "-f"}).exitCode != 0) return "there are no loop devices";
@@ -40,6 +52,7 @@ std::optional<std::string> PowerDisk::reasonItCannotBe() {
 }
 
 PowerDisk::PowerDisk(std::uint64_t bytes) {
+  require(leaveSharedMounts(), "a mount namespace of its own");
   std::string pattern = (fs::temp_directory_path() / "yomber-disk.XXXXXX").string();
   require(mkdtemp(pattern.data()) != nullptr, pattern);
   directory_ = pattern;

@@ -12,7 +12,8 @@ namespace yomber::testing {
 /// An ext4 file system on a disk whose power can be cut: what was not synced is lost. It is an
 /// image behind `volatile_disk`, mounted by way of a loop device. Needs root.
 ///
-/// For one thread, but for `cut`.
+/// Mounted in a namespace of the thread that makes it, and of what that starts: to be made before
+/// other threads. For one thread.
 class PowerDisk {
  public:
   /// Why this machine cannot have one.

@@ -15,12 +15,14 @@
 
 #include <fcntl.h>
 #include <fuse.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <csignal>
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
@@ -29,6 +31,7 @@
 #include <sstream>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/foundation/lock.h"
 
@@ -53,25 +56,23 @@ class VolatileDisk {
   int read(char* into, std::size_t length, std::uint64_t offset) {
     LockGuard guard(mutex_);
     if (isCut_) return -EIO;
-    return forEachPiece(length, offset,
-                        [&](std::uint64_t block, std::size_t at, std::size_t from, std::size_t n) {
-                          Block bytes;
-                          if (!load(block, bytes)) return false;
-                          std::memcpy(into + from, bytes.data() + at, n);
-                          return true;
-                        });
+    for (const Piece& piece : pieces(length, offset)) {
+      Block bytes;
+      if (!load(piece.block, bytes)) return -EIO;
+      std::memcpy(into + piece.done, bytes.data() + piece.begin, piece.length);
+    }
+    return bytesFrom(length, offset);
   }
   int write(const char* from, std::size_t length, std::uint64_t offset) {
     LockGuard guard(mutex_);
     if (isCut_) return -EIO;
-    return forEachPiece(length, offset,
-                        [&](std::uint64_t block, std::size_t at, std::size_t begin, std::size_t n) {
-                          Block bytes;
-                          if (!load(block, bytes)) return false;
-                          std::memcpy(bytes.data() + at, from + begin, n);
-                          cache_[block] = bytes;
-                          return true;
-                        });
+    for (const Piece& piece : pieces(length, offset)) {
+      Block bytes;
+      if (!load(piece.block, bytes)) return -EIO;
+      std::memcpy(bytes.data() + piece.begin, from + piece.done, piece.length);
+      cache_[piece.block] = bytes;
+    }
+    return bytesFrom(length, offset);
   }
   int sync() {
     LockGuard guard(mutex_);
@@ -106,18 +107,28 @@ class VolatileDisk {
   }
 
  private:
-  /// Calls `piece(block, offset in it, offset in the request, bytes)` for each block touched.
-  template <typename Piece>
-  int forEachPiece(std::size_t length, std::uint64_t offset, const Piece& piece) {
+  /// A part of a request that lies in one block.
+  struct Piece {
+    std::uint64_t block = 0;
+    std::size_t begin = 0;  ///< in the block
+    std::size_t done = 0;   ///< of the request before it
+    std::size_t length = 0;
+  };
+  [[nodiscard]] int bytesFrom(std::size_t length, std::uint64_t offset) const {
     if (offset >= size_) return 0;
-    length = std::min<std::uint64_t>(length, size_ - offset);
-    for (std::size_t done = 0; done < length;) {
-      const std::size_t at = (offset + done) % kBlock;
-      const std::size_t n = std::min(length - done, kBlock - at);
-      if (!piece((offset + done) / kBlock, at, done, n)) return -EIO;
-      done += n;
+    return static_cast<int>(std::min<std::uint64_t>(length, size_ - offset));
+  }
+  [[nodiscard]] std::vector<Piece> pieces(std::size_t length, std::uint64_t offset) const {
+    std::vector<Piece> result;
+    const auto all = static_cast<std::size_t>(bytesFrom(length, offset));
+    for (std::size_t done = 0; done < all; done += result.back().length) {
+      const std::size_t begin = (offset + done) % kBlock;
+      result.push_back({.block = (offset + done) / kBlock,
+                        .begin = begin,
+                        .done = done,
+                        .length = std::min(all - done, kBlock - begin)});
     }
-    return static_cast<int>(length);
+    return result;
   }
   bool load(std::uint64_t block, Block& bytes) REQUIRES(mutex_) {
     const auto cached = cache_.find(block);
@@ -226,5 +237,6 @@ int main(int argc, char** argv) {
     (void)std::fprintf(stderr, "usage: volatile_disk BACKING MOUNTPOINT\n");
     return 64;
   }
+  (void)prctl(PR_SET_PDEATHSIG, SIGKILL);  // no test leaves it behind
   return yomber::testing::serve(argv[0], argv[2]);
 }

@@ -26,10 +26,10 @@ const char* pragmas(Connection::Mode mode) {
   switch (mode) {
     case Connection::Mode::Read:
       // What is not in the log is read where it is mapped; several of these stay open.
-      return "PRAGMA mmap_size=2147418112; PRAGMA cache_size=-1024; PRAGMA query_only=1;";
+      return "PRAGMA mmap_size=2147418112; PRAGMA cache_size=-512; PRAGMA query_only=1;";
     case Connection::Mode::Write:
       return "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA mmap_size=2147418112;"
-             "PRAGMA cache_size=-32768; PRAGMA temp_store=MEMORY; PRAGMA secure_delete=0;"
+             "PRAGMA cache_size=-8192; PRAGMA temp_store=MEMORY; PRAGMA secure_delete=0;"
              "PRAGMA wal_autocheckpoint=0; PRAGMA journal_size_limit=67108864;";
     case Connection::Mode::Bulk:
       // The file counts for nothing until it is complete, so nothing needs a journal.

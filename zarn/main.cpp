@@ -88,7 +88,9 @@ sigset_t blockEndingSignals() {
 /// With a heap for nearly every thread, what one load has freed in its heap would help no other.
 void shareHeaps() {
   constexpr int kHeaps = 2;
+  constexpr int kLargeBlock = 128 * 1024;  // given back as soon as it is free; fixed, not growing
   (void)mallopt(M_ARENA_MAX, kHeaps);
+  (void)mallopt(M_MMAP_THRESHOLD, kLargeBlock);
 }
 
 /// Standard input belongs to whoever started us.

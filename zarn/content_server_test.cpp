@@ -23,7 +23,8 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 
 /// An engine that does what the test says, when it says so.
-class CommandedEngine final : public ContentEngine {
+class CommandedEngine final : public ContentEngine,
+                              public std::enable_shared_from_this<CommandedEngine> {
  public:
   void start() override {}
   void stop() override {}
@@ -32,19 +33,20 @@ class CommandedEngine final : public ContentEngine {
                                               Completion completion) override {
     class Wish final : public ContentWish {
      public:
-      Wish(CommandedEngine& engine, std::string path) : engine_(engine), path_(std::move(path)) {}
-      ~Wish() override { engine_.end(path_); }
+      Wish(std::shared_ptr<CommandedEngine> engine, std::string path)
+          : engine_(std::move(engine)), path_(std::move(path)) {}
+      ~Wish() override { engine_->end(path_); }
       NSProgressRef progress() const override { return nullptr; }
 
      private:
-      CommandedEngine& engine_;
+      const std::shared_ptr<CommandedEngine> engine_;  // a wish may be dropped after the test
       const std::string path_;
     };
     LockGuard guard(mutex_);
     options_[std::string(path)] = options;
     wishes_[std::string(path)] = std::move(completion);
     changed_.notifyAll();
-    return std::make_unique<Wish>(*this, std::string(path));
+    return std::make_unique<Wish>(shared_from_this(), std::string(path));
   }
   void evict(std::string_view path, Completion completion) override {
     completion(path.ends_with("here")

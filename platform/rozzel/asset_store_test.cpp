@@ -348,7 +348,8 @@ class AssetGarbageTest : public testing::Test {
   }
 
   std::atomic<std::int64_t> now_{1'700'000'000 * kSecond};
-  TestStore store_{{.clock = [this] { return NSDate::fromNanoseconds(now_); }}};
+  TestStore store_{{.clock = [this] { return NSDate::fromNanoseconds(now_); },
+                    .assetGraceSeconds = kDay / kSecond}};
 };
 
 TEST_F(AssetGarbageTest, KeepsWhatARecordRefersToForEver) {

@@ -14,8 +14,9 @@ namespace yomber {
 struct EmbeddedEngineOptions {
   /// The store's clock. Empty: the machine's.
   std::function<NSDate()> clock = {};
-  /// How long an asset that nobody refers to is kept.
-  std::int64_t assetGraceSeconds = 24 * 3600;
+  /// How long an asset that nobody refers to is kept: as long as users expect what they have
+  /// removed, or moved out of the drive without its content, to be had back.
+  std::int64_t assetGraceSeconds = std::int64_t{30} * 24 * 3600;
   /// How many deletions a zone remembers for its change feed.
   std::size_t maximumTombstones = 100000;
   /// How long a call waits for other processes' writes before RZErrorStoreBusy.

@@ -266,8 +266,8 @@ class RZEngine {
                                             std::optional<std::uint64_t> limit) = 0;
   [[nodiscard]] virtual NSErrorRef fetchQuota(const std::string& accountName, RZQuota& quota) = 0;
 
-  // Assets. An asset that no record refers to stays for a day at least after it was committed. A
-  // group must not outlive its engine.
+  // Assets. An asset that no record refers to stays for a day at least after it was committed, as
+  // long as its engine says. A group must not outlive its engine.
 
   [[nodiscard]] virtual std::unique_ptr<RZAssetGroup> newAssetGroup(NSErrorRef* error) = 0;
   /// A descriptor for reading the content from its start. Only presence and size are checked: who
@@ -287,8 +287,8 @@ class RZEngine {
   [[nodiscard]] virtual NSErrorRef verifyAsset(const RZAsset& asset,
                                                const RZTransfer& transfer) = 0;
 
-  /// Drops assets that no record has referred to for a day, what dead processes left, and what is
-  /// left of deleted zones. Never what a committed record refers to. Made to be called now and
+  /// Drops assets that no record has referred to for that time, what dead processes left, and what
+  /// is left of deleted zones. Never what a committed record refers to. Made to be called now and
   /// then, by whoever has the time; other calls go on meanwhile.
   [[nodiscard]] virtual NSErrorRef collectGarbage(RZGarbageReport& report) = 0;
 

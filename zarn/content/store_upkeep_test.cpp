@@ -25,7 +25,7 @@ class StoreUpkeepTest : public ContentDrive {
   std::shared_ptr<EmbeddedEngine> store_;
 };
 
-TEST_F(StoreUpkeepTest, DropsContentThatNobodyHasReferredToForADay) {
+TEST_F(StoreUpkeepTest, DropsContentThatNobodyHasReferredToForAMonth) {
   write("kept", "of ann");
   write("edited", "first");
   write("removed", "gone");
@@ -35,10 +35,10 @@ TEST_F(StoreUpkeepTest, DropsContentThatNobodyHasReferredToForADay) {
   settle();
   ASSERT_EQ(evict("kept"), nullptr);
   ASSERT_EQ(assetFiles().size(), 4U);
-  now_ += 23 * kHour;
+  now_ += 29 * 24 * kHour;
   EXPECT_TRUE(upkeep().runIfDue());
-  EXPECT_EQ(assetFiles().size(), 4U) << "the grace is a day";
-  now_ += 25 * kHour;
+  EXPECT_EQ(assetFiles().size(), 4U) << "the grace is 30 days";
+  now_ += 2 * 24 * kHour;
   EXPECT_TRUE(upkeep().runIfDue());
   EXPECT_EQ(assetFiles().size(), 2U);
   EXPECT_EQ(provide("kept"), nullptr);

@@ -174,8 +174,6 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
  private:
   using Wire = protocol::Content;
 
-  /// Work that grows with what the user has; the connection's loss still ends it.
-
   static std::string pathOf(const NSURLRef& url) { return url ? url->path() : std::string(); }
 
   /// A call whose results are a failure or nothing.

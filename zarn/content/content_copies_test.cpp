@@ -1,6 +1,10 @@
 // Copies of faults, further names of them, and faults of other accounts.
+#include <sys/stat.h>
+#include <sys/xattr.h>
+
 #include <cstdlib>
 
+#include "platform/foundation/fault_attributes.h"
 #include "zarn/content/test_content.h"
 
 namespace yomber {
@@ -13,6 +17,29 @@ class ContentCopiesTest : public ContentDrive {
     ASSERT_EQ(std::system(command.c_str()), 0) << command;
   }
 };
+
+TEST_F(ContentCopiesTest, ACopyThatWasMadeWhileItsOriginalWasFilledIsNoContent) {
+  const std::string text = content(100'000);
+  makeFault("a", text);
+  const struct stat original = status("a");
+  // As a copier leaves it that has read the holes, and then the attributes.
+  write("b", "");
+  ASSERT_EQ(truncate(at("b").c_str(), original.st_size), 0);
+  std::string mark(4096, '\0');
+  const ssize_t length = getxattr(at("a").c_str(), kFaultAttribute, mark.data(), mark.size());
+  ASSERT_GT(length, 0);
+  setAttribute("b", kFaultAttribute, mark.substr(0, static_cast<std::size_t>(length)));
+  setAttribute("b", kFilledAttribute, bootIdentifier());
+  const timespec times[2] = {original.st_atim, original.st_mtim};
+  ASSERT_EQ(utimensat(AT_FDCWD, at("b").c_str(), times, 0), 0);
+  ASSERT_FALSE(isFault("b"));
+  settle();
+  EXPECT_TRUE(waitUntil([&] { return isFault("b"); }));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_TRUE(contentInStore(id("b")) == text);
+  EXPECT_EQ(provide("b"), nullptr);
+  EXPECT_TRUE(read("b") == text);
+}
 
 TEST_F(ContentCopiesTest, ACopyOfAFaultIsAFaultWithAnIDOfItsOwn) {
   const std::string text = content(300'000);

@@ -1,3 +1,5 @@
+#include <sys/mman.h>
+
 #include <thread>
 
 #include "zarn/content/test_content.h"
@@ -99,6 +101,55 @@ TEST_F(ContentEvictionsTest, ATagThatIsSetDuringItIsSeen) {
   scan();
   ASSERT_NE(row("a")->extra, nullptr);
   EXPECT_EQ(row("a")->extra->tags, std::vector<std::string>{"red"});
+}
+
+TEST_F(ContentEvictionsTest, WhatWasWrittenThroughAMapStaysAndGoesToTheStore) {
+  const std::size_t size = 100'000;
+  write("a", content(size));
+  {
+    const FileDescriptor file(::open(at("a").c_str(), O_RDWR | O_CLOEXEC));
+    void* const map = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, file.get(), 0);
+    ASSERT_NE(map, MAP_FAILED);
+    auto* const bytes = static_cast<char*>(map);
+    bytes[50'000] = 'x';
+    settle();
+    bytes[50'001] = 'y';  // the page is dirty already: the file's times stay as they are
+    munmap(map, size);
+  }
+  const std::string text = read("a");
+  expectRefused("a", "changed");
+  EXPECT_EQ(read("a").substr(50'000, 2), "xy");
+  EXPECT_TRUE(waitUntil([&] { return contentInStore(id("a")) == text; }));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(evict("a"), nullptr);
+}
+
+TEST_F(ContentEvictionsTest, WhatTheStoreHasLostStaysAndGoesThereAgain) {
+  const std::string text = content(100'000);
+  write("a", text);
+  settle();
+  for (const std::string& asset : assetFiles()) std::filesystem::remove(asset);
+  expectRefused("a", "lost");
+  EXPECT_TRUE(read("a") == text);
+  EXPECT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(assetFiles().size(), 1U);
+  EXPECT_EQ(evict("a"), nullptr);
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == text);
+}
+
+TEST_F(ContentEvictionsTest, AFaultBelongsToTheAccountWhoseStoreHasIt) {
+  write("a", content(100'000));
+  settle();
+  signIn("bob");
+  ASSERT_EQ(evict("a"), nullptr);
+  const NSErrorRef error = provide("a");
+  ASSERT_NE(error, nullptr);
+  EXPECT_NE(error->localizedDescription().find("ann"), std::string::npos);
+  signIn("ann");
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == content(100'000));
 }
 
 TEST_F(ContentEvictionsTest, FoldersLinksAndFilesWithSeveralNamesStay) {

@@ -97,15 +97,22 @@ NSErrorRef ContentStore::open(const RZAsset& content, FileDescriptor& descriptor
 }
 
 NSErrorRef ContentStore::makeZones(const RZRecordBatch& batch) {
+  std::set<std::string> zones;
   for (const RZRecordRef& record : batch.recordsToSave) {
-    const RZRecordZoneID& zone = record->recordID().zoneID();
+    zones.insert(record->recordID().zoneID().zoneName());
+  }
+  // One that never was has nothing to be removed from, which the store would refuse.
+  for (const auto& removal : batch.recordsToDelete) {
+    zones.insert(removal.recordID.zoneID().zoneName());
+  }
+  for (const std::string& zone : zones) {
     {
       LockGuard guard(mutex_);
-      if (zones_.contains(zone.zoneName())) continue;
+      if (zones_.contains(zone)) continue;
     }
-    if (NSErrorRef error = engine_->createZone(database_, zone)) return error;
+    if (NSErrorRef error = engine_->createZone(database_, RZRecordZoneID(zone))) return error;
     LockGuard guard(mutex_);
-    zones_.insert(zone.zoneName());
+    zones_.insert(zone);
   }
   return nullptr;
 }
@@ -123,8 +130,7 @@ NSErrorRef ContentStore::modify(const RZRecordBatch& batch, std::vector<RZRecord
 }
 
 NSErrorRef ContentStore::saveBatch(const std::vector<StoredDocument>& documents, std::size_t begin,
-                                   std::size_t end, const std::vector<RemovedDocument>& removed,
-                                   std::vector<Saved>& saved) {
+                                   std::size_t end, std::vector<Saved>& saved) {
   RZRecordBatch batch;
   batch.savePolicy = RZRecordSavePolicy::ChangedKeys;
   for (std::size_t i = begin; i < end; ++i) {
@@ -133,8 +139,6 @@ NSErrorRef ContentStore::saveBatch(const std::vector<StoredDocument>& documents,
     if (document.previousZone.empty() || document.previousZone == document.zone) continue;
     batch.recordsToDelete.push_back({recordIDOf(document.item, document.previousZone)});
   }
-  for (const auto& each : removed)
-    batch.recordsToDelete.push_back({recordIDOf(each.item, each.zone)});
   std::vector<RZRecordRef> stored;
   NSErrorRef error = contentError(modify(batch, stored));
   if (!error) {
@@ -147,22 +151,44 @@ NSErrorRef ContentStore::saveBatch(const std::vector<StoredDocument>& documents,
   }
   // One that is refused must not keep the others.
   const std::size_t middle = begin + (end - begin) / 2;
-  NSErrorRef first = saveBatch(documents, begin, middle, removed, saved);
-  NSErrorRef second = saveBatch(documents, middle, end, {}, saved);
+  NSErrorRef first = saveBatch(documents, begin, middle, saved);
+  NSErrorRef second = saveBatch(documents, middle, end, saved);
   return first ? first : second;
 }
 
 NSErrorRef ContentStore::save(const std::vector<StoredDocument>& documents,
-                              const std::vector<RemovedDocument>& removed,
                               std::vector<Saved>& saved) {
   saved.assign(documents.size(), {});
-  if (documents.empty() && removed.empty()) return nullptr;
-  // Apart: what is refused of the one must not keep the other.
-  if (!removed.empty()) {
-    if (NSErrorRef error = saveBatch({}, 0, 0, removed, saved)) return error;
-  }
   if (documents.empty()) return nullptr;
-  NSErrorRef error = saveBatch(documents, 0, documents.size(), {}, saved);
+  NSErrorRef error = saveBatch(documents, 0, documents.size(), saved);
+  return isOutOfReach(error) ? error : nullptr;
+}
+
+NSErrorRef ContentStore::removeBatch(const std::vector<RemovedDocument>& removed, std::size_t begin,
+                                     std::size_t end, std::vector<NSErrorRef>& refused) {
+  RZRecordBatch batch;
+  batch.savePolicy = RZRecordSavePolicy::ChangedKeys;
+  for (std::size_t i = begin; i < end; ++i) {
+    batch.recordsToDelete.push_back({recordIDOf(removed[i].item, removed[i].zone)});
+  }
+  std::vector<RZRecordRef> stored;
+  NSErrorRef error = contentError(modify(batch, stored));
+  if (!error) return nullptr;
+  if (isOutOfReach(error) || end - begin <= 1) {
+    for (std::size_t i = begin; i < end; ++i) refused[i] = error;
+    return error;
+  }
+  const std::size_t middle = begin + (end - begin) / 2;
+  NSErrorRef first = removeBatch(removed, begin, middle, refused);
+  NSErrorRef second = removeBatch(removed, middle, end, refused);
+  return first ? first : second;
+}
+
+NSErrorRef ContentStore::remove(const std::vector<RemovedDocument>& removed,
+                                std::vector<NSErrorRef>& refused) {
+  refused.assign(removed.size(), nullptr);
+  if (removed.empty()) return nullptr;
+  NSErrorRef error = removeBatch(removed, 0, removed.size(), refused);
   return isOutOfReach(error) ? error : nullptr;
 }
 

@@ -56,11 +56,13 @@ class ContentStore {
     std::string tag;
     NSErrorRef error;
   };
-  /// Durable when it returns. `saved` gets an answer for each document, in order; removals that did
-  /// not happen are answered with an error. Removing what is not there is a success.
+  /// Durable when it returns. `saved` gets an answer for each document, in order; the error is of
+  /// the store itself, when it cannot be reached.
   [[nodiscard]] NSErrorRef save(const std::vector<StoredDocument>& documents,
-                                const std::vector<RemovedDocument>& removed,
                                 std::vector<Saved>& saved);
+  /// The same; `refused` gets an error, or nil, for each. Removing what is not there is a success.
+  [[nodiscard]] NSErrorRef remove(const std::vector<RemovedDocument>& removed,
+                                  std::vector<NSErrorRef>& refused);
 
   /// Writes verified content into an open file; see RZEngine::copyAsset.
   [[nodiscard]] NSErrorRef copy(const RZAsset& content, int file, const GoesOn& goesOn) const;
@@ -69,8 +71,9 @@ class ContentStore {
 
  private:
   NSErrorRef saveBatch(const std::vector<StoredDocument>& documents, std::size_t begin,
-                       std::size_t end, const std::vector<RemovedDocument>& removed,
-                       std::vector<Saved>& saved);
+                       std::size_t end, std::vector<Saved>& saved);
+  NSErrorRef removeBatch(const std::vector<RemovedDocument>& removed, std::size_t begin,
+                         std::size_t end, std::vector<NSErrorRef>& refused);
   NSErrorRef makeZones(const RZRecordBatch& batch);
   NSErrorRef modify(const RZRecordBatch& batch, std::vector<RZRecordRef>& saved);
 

@@ -264,7 +264,8 @@ TEST_F(ContentUploadsTest, DocumentsOfARebuiltDatabaseAreGivenJobs) {
   EXPECT_EQ(id("b"), item);
   ASSERT_EQ(provide("b"), nullptr);
   EXPECT_EQ(read("b"), away);
-  ASSERT_EQ(evict("b"), nullptr);
+  const NSErrorRef refusal = evict("b");
+  EXPECT_EQ(refusal, nullptr) << refusal->description();
 }
 
 }  // namespace

@@ -66,6 +66,7 @@ class DownloadBatch {
     std::vector<JobSubject> subjects;
     if (NSErrorRef error = core_.readSubjects(jobs, subjects)) {
       for (const Job& job : jobs) answer(job.item, error);
+      core_.noteStored(error);
       return;
     }
     std::uint64_t bytes = 0;
@@ -74,14 +75,16 @@ class DownloadBatch {
       const bool isByItself = jobs[i].seq != 0 || subjects[i].isPinned;
       // Asked for once more than there were wishes, or taken back.
       if (!isByItself && !core_.wishes.isWanted(subjects[i].job.item)) continue;
-      bytes += subjects[i].row ? subjects[i].row->size : 0;
+      const std::uint64_t size = subjects[i].row ? subjects[i].row->size : 0;
+      // Nobody is to wait for what others have wished for, unless it takes no time.
+      if (bytes + size >= kBytesTogether) {
+        runTogether();
+        bytes = 0;
+      }
+      bytes += size;
       Download& download = downloads_.emplace_back();
       download.subject = std::move(subjects[i]);
       download.isByItself = isByItself;
-      // Nobody is to wait for what others have wished for, unless it takes no time.
-      if (bytes < kBytesTogether) continue;
-      runTogether();
-      bytes = 0;
     }
     runTogether();
   }
@@ -280,7 +283,12 @@ bool isFilled(Settling& settling) {
   const std::string& path = settling.subject.path;
   const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   struct stat status{};
-  if (path.empty() || !file || fstat(file.get(), &status) != 0) return false;
+  if (path.empty()) return false;
+  if (!file || fstat(file.get(), &status) != 0) {
+    // One that may not be read now keeps its marks, and is seen to again.
+    settling.isLater = errno == EACCES || errno == EMFILE || errno == ENFILE;
+    return false;
+  }
   settling.before = FileStamp::of(status);
   settling.after = settling.before;
   settling.isHere = !isUnfilledFault(file.get());
@@ -292,7 +300,11 @@ bool isFilled(Settling& settling) {
 
 void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
   std::vector<JobSubject> subjects;
-  if (core.readSubjects(jobs, subjects)) return;
+  if (NSErrorRef error = core.readSubjects(jobs, subjects)) {
+    log_error(defaultLog(), "[ERROR] what was filled cannot be read: %@", error);
+    core.noteStored(error);
+    return;
+  }
   std::vector<Settling> all;
   std::vector<std::size_t> filled;
   for (JobSubject& subject : subjects) {

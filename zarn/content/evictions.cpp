@@ -4,7 +4,9 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <memory>
+#include <thread>
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
@@ -32,6 +34,8 @@ struct Departure {
   FileStamp before;
   FileStamp after;
   bool isFault = false;  ///< its content is gone
+  /// What the store has is not what is here, or is not there any longer.
+  enum class Doubt : std::uint8_t { None, Changed, Lost } doubt = Doubt::None;
   NSErrorRef error;
 };
 
@@ -49,19 +53,46 @@ NSErrorRef reasonInRows(const ContentCore& core, const JobSubject& subject) {
   return nullptr;
 }
 
-/// What changes with attributes and names only must not look like a change of content: the content
-/// itself decides.
-NSErrorRef compareContent(Departure& departure, int file) {
+/// Bytes are given up only where the store still has the same ones: dates alone prove nothing,
+/// since what is written through a map, or within one tick of the clock, may leave them as they
+/// are.
+NSErrorRef compareContent(const ContentCore& core, Departure& departure, int file) {
   ContentRow& content = *departure.subject.content;
-  if (departure.before == content.stamp) return nullptr;
+  if (isOpenForWriting(departure.subject.path)) return refusal("it is open somewhere");
+  const auto store = core.storeOf(content.account);
+  FileDescriptor stored;
+  const NSErrorRef error = store ? store->open(*content.content, stored) : nullptr;
+  if (error && !isOutOfReach(error)) {
+    departure.doubt = Departure::Doubt::Lost;
+    return refusal("the store has lost its content; it is sent there again");
+  }
   const bool mayBeSame = content.stamp.hasSameContent(departure.before);
   const auto hashed =
       mayBeSame ? hashUnchanged(file, departure.before, nullptr) : std::optional<RZAsset>();
   if (!hashed || *hashed != *content.content) {
+    departure.doubt = Departure::Doubt::Changed;
     return refusal("it has changed since it was confirmed in the store");
   }
   content.stamp = departure.before;
   return nullptr;
+}
+
+/// The stamp of an open file, at a time when a change that is still to come is sure to show in it.
+FileStamp settledStamp(int file) {
+  while (true) {
+    const StampedLook look = lookAtStamp(file);
+    if (look.isSettled) return look.stamp;
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));  // less than a tick
+  }
+}
+
+/// The name under which the store has the content; empty when it cannot be read.
+std::string ownerOf(const ContentCore& core, const ContentRow& content) {
+  if (core.storeOf(content.account)) return core.account();
+  std::string name;
+  (void)core.database().read(
+      [&](Connection& connection) { name = accountName(connection, content.account); });
+  return name;
 }
 
 /// Whether what an interrupted filling or giving up left is all the content's.
@@ -78,11 +109,12 @@ NSErrorRef lookAt(const ContentCore& core, Departure& departure) {
       open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
   struct stat status{};
   if (!file || fstat(file.get(), &status) != 0) return NSError::errorWithErrno(errno, path);
-  departure.before = FileStamp::of(status);
   if (!S_ISREG(status.st_mode)) return refusal("only documents can be given up");
+  departure.before = settledStamp(file.get());
   if (status.st_nlink > 1) return refusal("it has several names (hard links)");
   const FaultExamination found = examineFault(file.get());
-  if (found.condition == FaultCondition::NoFault) return compareContent(departure, file.get());
+  if (found.condition == FaultCondition::NoFault)
+    return compareContent(core, departure, file.get());
   if (found.condition != FaultCondition::Pristine) {
     return refusal("it has changed since it was confirmed in the store");
   }
@@ -137,13 +169,15 @@ class EvictionBatch {
     if (NSErrorRef error = lookAt(core_, departure)) return error;
     if (departure.isFault) return nullptr;
     const ContentRow& content = *departure.subject.content;
+    const std::string owner = ownerOf(core_, content);
+    if (owner.empty()) return refusal("it is not confirmed in the store yet");
     if (content.content->size > kKeptBytes) busy.emplace_back(core_, departure.before.inode);
     const FaultRecord record{.item = departure.subject.job.item,
                              .content = *content.content,
                              .mtime = content.stamp.mtime,
                              .head = 0,
                              .tag = content.tag,
-                             .account = core_.account()};
+                             .account = owner};
     NSErrorRef error;
     departure.eviction = Eviction::begin(departure.subject.path, departure.before, record, &error);
     return error;
@@ -176,6 +210,7 @@ class EvictionBatch {
       for (const Departure& departure : departures_) {
         const Job& job = departure.subject.job;
         removeJob(transaction.connection(), job);
+        if (departure.doubt != Departure::Doubt::None) doubt(transaction, departure);
         if (departure.error || !departure.isFault) continue;
         storeLocalState(transaction, job.item, departure.before, departure.after, false);
       }
@@ -184,6 +219,24 @@ class EvictionBatch {
     if (error) log_error(defaultLog(), "[ERROR] evictions cannot be noted: %@", error);
     core_.noteStored(error);
     (void)evictStored.hit();
+  }
+
+  /// Has the content looked at once more, and sent to the store where that has another or none.
+  static void doubt(WriteTransaction& transaction, const Departure& departure) {
+    Connection& connection = transaction.connection();
+    auto content = findContent(connection, departure.subject.job.item);
+    auto row = findByID(connection, departure.subject.job.item);
+    if (!content || !row) return;
+    if (departure.doubt == Departure::Doubt::Lost) content->content.reset();
+    --content->stamp.ctime;
+    storeContent(connection, *content);
+    ItemRow after = *row;
+    after.flags &= ~row_flag::kUploaded;
+    if (after.flags != row->flags) {
+      (void)transaction.update(*row, after);
+    } else {
+      transaction.updateQuietly(after);
+    }
   }
 
   void answer(const Departure& departure) {
@@ -203,6 +256,7 @@ void doEvictions(ContentCore& core, const std::vector<Job>& jobs) {
   std::vector<JobSubject> subjects;
   if (NSErrorRef error = core.readSubjects(jobs, subjects)) {
     log_error(defaultLog(), "[ERROR] what is to be evicted cannot be read: %@", error);
+    core.noteStored(error);
     return;
   }
   EvictionBatch(core).run(std::move(subjects));

@@ -18,6 +18,7 @@ namespace yomber {
 namespace {
 
 FaultPoint evictLeased("zarn.evict.leased");
+FaultPoint evictRecorded("zarn.evict.recorded");
 FaultPoint evictMarked("zarn.evict.marked");
 FaultPoint evictSynced("zarn.evict.synced");
 FaultPoint evictPunched("zarn.evict.punched");
@@ -80,12 +81,14 @@ NSErrorRef Eviction::mark(FaultRecord record) {
     if (NSErrorRef error = file_.holdDate()) return error;
     record.head = headChecksum(readHead(file_.get()));
   }
-  // First of all, so that an old fill of this boot does not count.
-  if (NSErrorRef error = file_.removeAttribute(kFilledAttribute)) return error;
   isMarked_ = true;
+  // While an old fill of this boot counts, the new record changes nothing; the old one never counts
+  // for this content.
   if (!wasFault_) {
     if (NSErrorRef error = file_.setAttribute(kFaultAttribute, record.encoded())) return error;
+    if (evictRecorded.hit()) return file_.failure(EIO);
   }
+  if (NSErrorRef error = file_.removeAttribute(kFilledAttribute)) return error;
   marked_ = stampOf(file_.get());
   return evictMarked.hit() ? file_.failure(ENOSPC) : nullptr;
 }

@@ -36,6 +36,7 @@ class Filling {
   Filling(ChangedFile file, const FaultExamination& found, const FaultSource& source)
       : file_(std::move(file)),
         record_(found.record),
+        examined_(found.stamp),
         isInterrupted_(found.isInterrupted),
         source_(source),
         lease_(file_.get()) {}
@@ -43,6 +44,8 @@ class Filling {
   NSErrorRef run(const std::function<bool(std::uint64_t)>& goesOn, bool& isMixed) {
     isAlone_ = lease_.isHeld();
     lastHeld_ = Clock::now();
+    // Written to before others were kept out.
+    if (stampOf(file_.get()) != examined_) return file_.failure(EAGAIN);
     if (isInterrupted_) {
       if (NSErrorRef error = compare(isMixed)) return error;
     }
@@ -54,7 +57,7 @@ class Filling {
     if (!error) error = verify();
     if (!error && fillVerified.hit()) error = file_.failure(EIO);
     if (!error) error = markFilled();
-    if (error && !mayBeWritten_) {
+    if (error && mayTakeBack()) {
       (void)file_.punch();
       (void)file_.putDatesBack();
     }
@@ -107,12 +110,19 @@ class Filling {
     return false;
   }
 
+  /// Whether others were kept out to this moment.
+  [[nodiscard]] bool wasAlone() const {
+    const bool isLost = lease_.state() == FileLease::State::Lost &&
+                        Clock::now() - lastHeld_ >= FileLease::longestWait();
+    return isAlone_ && !isLost;
+  }
+
+  /// Else the held date stays, and the next filling compares what it finds.
+  [[nodiscard]] bool mayTakeBack() const { return !mayBeWritten_ && wasAlone(); }
+
   /// The content itself is verified as it is written; what others wrote is not.
   NSErrorRef verify() {
-    if (isAlone_ && lease_.state() == FileLease::State::Lost &&
-        Clock::now() - lastHeld_ >= FileLease::longestWait()) {
-      isAlone_ = false;
-    }
+    isAlone_ = wasAlone();
     const bool isWhole = stampOf(file_.get()).size == record_.content.size &&
                          (isAlone_ || hasContentOf(file_.get(), record_));
     if (isWhole) return nullptr;
@@ -130,6 +140,7 @@ class Filling {
 
   ChangedFile file_;
   const FaultRecord record_;
+  const FileStamp examined_;
   const bool isInterrupted_;
   const FaultSource& source_;
   FileLease lease_;

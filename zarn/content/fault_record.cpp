@@ -1,5 +1,6 @@
 #include "zarn/content/fault_record.h"
 
+#include <sys/stat.h>
 #include <sys/xattr.h>
 
 #include <algorithm>
@@ -10,6 +11,7 @@
 #include <vector>
 
 #include "platform/foundation/fault_attributes.h"
+#include "zarn/change_times.h"
 
 namespace yomber {
 namespace {
@@ -103,6 +105,15 @@ std::optional<FaultRecord> FaultRecord::decode(std::string_view text) {
   record.tag = std::move(*tag);
   record.account = std::move(*account);
   return record;
+}
+
+StampedLook lookAtStamp(int file) {
+  struct stat status{};
+  const std::int64_t before = coarseNow();
+  if (fstat(file, &status) != 0) return {};
+  const std::int64_t after = coarseNow();
+  const FileStamp stamp = FileStamp::of(status);
+  return {stamp, isSettledTime(stamp.ctime, before, after)};
 }
 
 std::uint64_t headChecksum(std::string_view bytes) {

@@ -33,6 +33,20 @@ struct FileStamp {
   friend bool operator==(const FileStamp&, const FileStamp&) = default;
 };
 
+/// The stamp of an open file, and whether a change that comes after the look is sure to show in it.
+struct StampedLook {
+  FileStamp stamp;  ///< all zero when the file cannot be looked at
+  bool isSettled = true;
+
+  /// What to remember of it: where it is not settled, one that the file never has.
+  [[nodiscard]] FileStamp toRemember() const {
+    FileStamp result = stamp;
+    if (!isSettled) --result.ctime;
+    return result;
+  }
+};
+[[nodiscard]] StampedLook lookAtStamp(int file);
+
 /// What a fault's attribute says: all that is needed to know the item again, and to bring its
 /// content back, should the database be lost.
 struct FaultRecord {

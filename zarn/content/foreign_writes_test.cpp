@@ -122,6 +122,32 @@ TEST_F(ForeignWritesTest, AWriterWhoCannotWaitAnyLongerGetsTheFaultAsItWas) {
   expectCopyWithWhatWasWritten();
 }
 
+TEST_F(ForeignWritesTest, WhatIsWrittenBehindAFillingThatEndsEarlyIsKept) {
+  const std::string text = content(kSize);
+  makeFault("a", text);
+  auto reader = openAt("a", O_RDONLY);
+  stopAt("zarn.fill.copying");
+  Answer answer;
+  auto wish = engine->startProviding(at("a"), 0, answer.take());
+  ASSERT_TRUE(isStopped());
+  constexpr off_t kBehind = 8192;
+  ASSERT_EQ(lseek(reader.get(), kBehind, SEEK_DATA), kBehind)
+      << "the filling has not come here yet";
+  auto writer = openAt("a", O_WRONLY);
+  EXPECT_EQ(pwrite(writer.get(), "written", 7, kBehind), 7);
+  wish.reset();
+  ASSERT_EQ(FaultPoint::arm("zarn.fill.copying=error"), nullptr);
+  go();
+  EXPECT_NE(answer.get(), nullptr);
+  FaultPoint::disarmAll();
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  reader = FileDescriptor();
+  writer = FileDescriptor();
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == text);
+  EXPECT_EQ(read("a 2").substr(kBehind, 7), "written");
+}
+
 TEST_F(ForeignWritesTest, AWriterBesideAReaderLosesNothing) {
   const std::string text = content(kSize);
   makeFault("a", text);

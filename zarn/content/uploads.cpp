@@ -8,6 +8,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "zarn/content/content_core.h"
@@ -107,8 +108,14 @@ class UploadGroup {
       case FaultCondition::NoFault: {
         // Marked as filled: a copy of one that was so, for which nobody has a job.
         bool isDamaged = false;
-        upload.isToSettle = readFaultRecord(file.get(), isDamaged).has_value();
-        return readDocument(upload, std::move(file));
+        const auto record = readFaultRecord(file.get(), isDamaged);
+        upload.isToSettle = record.has_value();
+        NSErrorRef error = readDocument(upload, std::move(file));
+        const bool isCopiedTooSoon = !error && record &&
+                                     upload.confirmed.stamp.mtime == record->mtime &&
+                                     upload.confirmed.stamp.size == record->content.size &&
+                                     upload.confirmed.content != record->content;
+        return isCopiedTooSoon ? unfill(path) : error;
       }
       case FaultCondition::Pristine:
         return readFault(upload, found);
@@ -118,6 +125,16 @@ class UploadGroup {
     file = FileDescriptor();  // nobody else may have it open for that
     if (NSErrorRef error = core_.settleWritten(path, found)) return error;
     return NSError::errorWithErrno(EAGAIN, path);  // as what it is now, the next time
+  }
+
+  /// A copy of a fault that was made while that was filled: it has the mark, but not the content.
+  NSErrorRef unfill(const std::string& path) const {
+    NSErrorRef error;
+    const ChangedFile file = ChangedFile::open(path, &error);
+    if (file.isValid()) error = file.removeAttribute(kFilledAttribute);
+    if (error) return error;
+    (void)core_.scanner->scanLocation(path);
+    return NSError::errorWithErrno(EAGAIN, path);  // as the fault that it is, the next time
   }
 
   /// The row is behind the disk.
@@ -171,47 +188,44 @@ class UploadGroup {
     struct stat status{};
     if (fstat(file, &status) != 0) return NSError::errorWithErrno(errno, upload.subject.path);
     if (!S_ISREG(status.st_mode)) return look(upload, ESTALE);
-    FileStamp stamp = FileStamp::of(status);
+    const StampedLook look = lookAtStamp(file);
+    const FileStamp& stamp = look.stamp;
     ContentRow& confirmed = upload.confirmed;
     if (confirmed.content && confirmed.stamp == stamp) return nullptr;
     if (confirmed.content && confirmed.stamp.hasSameContent(stamp)) {
       NSErrorRef error;
       const auto hashed = hashUnchanged(file, stamp, &error);
       if (!hashed) return error;
-      confirmed.stamp.ctime = stamp.ctime;
+      confirmed.stamp.ctime = look.toRemember().ctime;
       if (*hashed == *confirmed.content) return nullptr;
     }
-    return take(upload, file, stamp);
+    return take(upload, file, look);
   }
 
-  NSErrorRef take(Upload& upload, int file, FileStamp stamp) {
+  NSErrorRef take(Upload& upload, int file, StampedLook look) {
     NSErrorRef error;
     if (!group_) group_ = store_->newGroup(&error);
     if (!group_) return error;
     const auto running = core_.queue->running(upload.subject.job.item);
-    if (running) running->progress->setTotalUnitCount(static_cast<std::int64_t>(stamp.size));
-    const auto stampNow = [file] {
-      struct stat status{};
-      return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
-    };
+    if (running) running->progress->setTotalUnitCount(static_cast<std::int64_t>(look.stamp.size));
     bool isSame = true;
     const auto goesOn = [&](std::uint64_t done) {
       if (running) running->progress->setCompletedUnitCount(static_cast<std::int64_t>(done));
-      isSame = stampNow() == stamp;  // or else all of it is for nothing
+      isSame = lookAtStamp(file).stamp == look.stamp;  // or else all of it is for nothing
       return isSame && !core_.queue->isEnding();
     };
     for (int reading = 0; reading < kReadings; ++reading) {
       RZAsset content;
       error = store_->take(*group_, file, goesOn, content);
       if (error && isSame) return error;
-      const FileStamp after = stampNow();
+      const StampedLook after = lookAtStamp(file);
       if (!error) bytes_ += content.size;
-      if (!error && after == stamp && content.size == stamp.size) {
+      if (!error && after.stamp == look.stamp && content.size == look.stamp.size) {
         upload.confirmed.content = content;
-        upload.confirmed.stamp = stamp;
+        upload.confirmed.stamp = look.toRemember();
         return uploadStaged.hit() ? NSError::errorWithErrno(EIO) : nullptr;
       }
-      stamp = after;
+      look = after;
     }
     return NSError::errorWithErrno(EAGAIN, upload.subject.path);  // somebody is writing to it
   }
@@ -227,8 +241,10 @@ class UploadGroup {
     std::vector<StoredDocument> documents;
     std::vector<RemovedDocument> removed;
     std::vector<Upload*> saving;
+    std::vector<Upload*> removing;
     for (Upload& upload : uploads_) {
       if (upload.kind == Upload::Kind::Remove) {
+        removing.push_back(&upload);
         removed.push_back({upload.subject.job.item, upload.confirmed.zone});
       } else if (upload.kind == Upload::Kind::Save) {
         saving.push_back(&upload);
@@ -243,7 +259,10 @@ class UploadGroup {
       }
     }
     std::vector<ContentStore::Saved> saved;
-    if (NSErrorRef error = store_->save(documents, removed, saved)) return error;
+    std::vector<NSErrorRef> refused;
+    if (NSErrorRef error = store_->remove(removed, refused)) return error;
+    if (NSErrorRef error = store_->save(documents, saved)) return error;
+    for (std::size_t i = 0; i < removing.size(); ++i) removing[i]->error = refused[i];
     for (std::size_t i = 0; i < saving.size(); ++i) {
       saving[i]->confirmed.tag = saved[i].tag;
       saving[i]->error = saved[i].error;
@@ -264,6 +283,9 @@ class UploadGroup {
       }
       return NSErrorRef();
     });
+    // Not every change is told of: one through a map is not. Without a look the row would stay.
+    for (const std::string& path : std::exchange(behind_, {}))
+      (void)core_.scanner->scanLocation(path);
     if (error) log_error(defaultLog(), "[ERROR] uploads cannot be confirmed: %@", error);
     core_.noteStored(error);
     if (isAway) core_.noteOutOfReach();
@@ -288,7 +310,7 @@ class UploadGroup {
     }
     if (!upload.subject.row) return removeContent(connection, job.item);
     if (upload.subject.row->kind != ItemKind::Document || !upload.confirmed.content) return;
-    storeConfirmed(transaction, upload.confirmed);
+    if (!storeConfirmed(transaction, upload.confirmed)) behind_.push_back(upload.subject.path);
   }
 
   /// A copy of another account's fault: no content of ours.
@@ -298,7 +320,8 @@ class UploadGroup {
     addJob(connection, upload.subject.job.item, JobKind::Upload, owner, now, now);
   }
 
-  void storeConfirmed(WriteTransaction& transaction, ContentRow confirmed) {
+  /// False when the row is behind the disk.
+  bool storeConfirmed(WriteTransaction& transaction, ContentRow confirmed) {
     Connection& connection = transaction.connection();
     if (const auto now = findContent(connection, confirmed.id)) confirmed.isPinned = now->isPinned;
     storeContent(connection, confirmed);
@@ -306,7 +329,7 @@ class UploadGroup {
     if (!row) {  // removed meanwhile
       const std::int64_t now = core_.now();
       addJob(connection, confirmed.id, JobKind::Upload, confirmed.account, now, now);
-      return;
+      return true;
     }
     ItemRow after = *row;
     if (isConfirmed(after, confirmed)) after.flags |= row_flag::kUploaded;
@@ -315,7 +338,9 @@ class UploadGroup {
     } else if (!isConfirmed(after, confirmed) && after.inode == confirmed.stamp.inode) {
       // The row is behind the disk, or was changed meanwhile: to be seen to again.
       transaction.updateQuietly(after);
+      return after.size == confirmed.stamp.size && after.mtime == confirmed.stamp.mtime;
     }
+    return true;
   }
 
   ContentCore& core_;
@@ -324,6 +349,7 @@ class UploadGroup {
   std::vector<Upload> uploads_;
   /// Documents that were read; closed from the fifth on.
   std::vector<FileDescriptor> unsynced_;
+  std::vector<std::string> behind_;  ///< documents whose rows are
   std::uint64_t bytes_ = 0;
   bool hasSettling_ = false;
 };
@@ -336,6 +362,7 @@ void doUploads(ContentCore& core, const std::vector<Job>& jobs) {
   std::vector<JobSubject> subjects;
   if (const NSErrorRef error = core.readSubjects(jobs, subjects)) {
     log_error(defaultLog(), "[ERROR] what is to be uploaded cannot be read: %@", error);
+    core.noteStored(error);
     return;
   }
   UploadGroup group(core, store);

@@ -224,7 +224,8 @@ TEST_F(ContentEvictionsTest, AFilePointFailingTakesTheMarkBack) {
   const std::string text = content(100'000);
   write("a", text);
   settle();
-  for (const char* point : {"zarn.evict.leased", "zarn.evict.marked", "zarn.evict.synced"}) {
+  for (const char* point :
+       {"zarn.evict.leased", "zarn.evict.recorded", "zarn.evict.marked", "zarn.evict.synced"}) {
     ASSERT_EQ(FaultPoint::arm(std::string(point) + "=error"), nullptr);
     EXPECT_NE(evict("a"), nullptr) << point;
     FaultPoint::disarmAll();

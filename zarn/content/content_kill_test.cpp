@@ -80,9 +80,9 @@ TEST_P(EvictionKillTest, TheFileIsWholeOrAFaultAndItsContentComesBack) {
 }
 
 INSTANTIATE_TEST_SUITE_P(AtEachPoint, EvictionKillTest,
-                         testing::Values("zarn.evict.leased", "zarn.evict.marked",
-                                         "zarn.evict.synced", "zarn.evict.punched",
-                                         "zarn.evict.stored"));
+                         testing::Values("zarn.evict.leased", "zarn.evict.recorded",
+                                         "zarn.evict.marked", "zarn.evict.synced",
+                                         "zarn.evict.punched", "zarn.evict.stored"));
 
 TEST_P(DownloadKillTest, TheFileIsAFaultUntilItsContentIsWhole) {
   const std::string text = content(5'000'000);

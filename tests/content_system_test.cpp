@@ -114,7 +114,7 @@ class ContentSystem : public ::testing::Test {
     ASSERT_TRUE(isConfirmed(at(name))) << name;
     const NSErrorRef error = client_->evict(at(name));
     ASSERT_EQ(error, nullptr) << error->description();
-    ASSERT_EQ(client_->state(at(name)).local, Local::FAULT);
+    ASSERT_TRUE(eventually([&] { return client_->state(at(name)).local == Local::FAULT; }));
   }
 
   TestDrive drive_;

@@ -16,6 +16,11 @@ find_package(benchmark REQUIRED CONFIG)
 
 pkg_check_modules(uuid REQUIRED IMPORTED_TARGET uuid)
 pkg_check_modules(libsystemd REQUIRED IMPORTED_TARGET libsystemd)
+pkg_check_modules(fuse3 REQUIRED IMPORTED_TARGET fuse3)
+pkg_check_modules(vips REQUIRED IMPORTED_TARGET vips-cpp)
+pkg_check_modules(libseccomp REQUIRED IMPORTED_TARGET libseccomp)
+# What thumbnails look like is read in tests only.
+pkg_check_modules(libpng REQUIRED IMPORTED_TARGET libpng)
 
 if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")
   # See the header for why Cap'n Proto needs it.

@@ -13,12 +13,14 @@ if(YOMBER_SANITIZE STREQUAL "thread")
   set(YOMBER_TEST_LAUNCHER "${CMAKE_SOURCE_DIR}/tests/sanitizers/fixed-addresses")
 endif()
 
+find_program(YOMBER_SYMBOLIZER NAMES llvm-symbolizer-19 llvm-symbolizer)
+
 # What the sanitizers are told at run time, for ctest and for scripts.
 set(YOMBER_TEST_ENVIRONMENT
-  "ASAN_OPTIONS=strict_string_checks=1:detect_stack_use_after_return=1:check_initialization_order=1"
-  "LSAN_OPTIONS=suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/leak.supp:print_suppressions=0"
-  "UBSAN_OPTIONS=print_stacktrace=1"
-  "TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1:atexit_sleep_ms=0:suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/thread.supp:print_suppressions=0"
+  "ASAN_OPTIONS=external_symbolizer_path=${YOMBER_SYMBOLIZER}:strict_string_checks=1:detect_stack_use_after_return=1:check_initialization_order=1"
+  "LSAN_OPTIONS=external_symbolizer_path=${YOMBER_SYMBOLIZER}:suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/leak.supp:print_suppressions=0"
+  "UBSAN_OPTIONS=external_symbolizer_path=${YOMBER_SYMBOLIZER}:print_stacktrace=1"
+  "TSAN_OPTIONS=external_symbolizer_path=${YOMBER_SYMBOLIZER}:halt_on_error=1:second_deadlock_stack=1:atexit_sleep_ms=0:suppressions=${CMAKE_SOURCE_DIR}/tests/sanitizers/thread.supp:print_suppressions=0"
   "YOMBER_BUILD_DIR=${CMAKE_BINARY_DIR}"
   "YOMBER_SOURCE_DIR=${CMAKE_SOURCE_DIR}")
 
@@ -34,6 +36,7 @@ function(yomber_test name)
   add_executable(${name} ${arg_SOURCES})
   target_link_libraries(${name} PRIVATE
     yomber_options ${arg_DEPENDS} GTest::gmock GTest::gtest GTest::gtest_main Threads::Threads)
+  target_compile_options(${name} PRIVATE ${YOMBER_TEST_OPTIONS})
   if(NOT arg_PCH)
     set(arg_PCH gtest)
   endif()
@@ -138,7 +141,8 @@ endfunction()
 function(yomber_finish_bench_all)
   get_property(benches GLOBAL PROPERTY YOMBER_BENCHES)
   add_custom_target(bench_all)
-  foreach(program IN ITEMS qs-fileprovider zarn fileproviderd yomber)
+  foreach(program IN ITEMS qs-fileprovider zarn fileproviderd yomber yomber-mount
+      yomber-thumbnailer)
     if(TARGET ${program}_program)
       add_dependencies(bench_all ${program}_program)
     endif()

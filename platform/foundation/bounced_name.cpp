@@ -1,7 +1,5 @@
 #include "platform/foundation/bounced_name.h"
 
-#include <cstdint>
-
 namespace yomber {
 namespace {
 
@@ -24,7 +22,7 @@ std::string_view cutToBytes(std::string_view text, std::size_t length) {
 
 std::string bouncedName(std::string_view name,
                         const std::function<bool(const std::string&)>& isTaken,
-                        std::size_t maximumLength) {
+                        std::size_t maximumLength, std::uint64_t firstNumber) {
   const std::size_t dot = extensionBegin(name);
   const std::string_view extension = name.substr(dot);
   std::string candidate(name);
@@ -32,7 +30,7 @@ std::string bouncedName(std::string_view name,
     candidate = cutToBytes(name.substr(0, dot), maximumLength - extension.size());
     candidate.append(extension);
   }
-  for (std::uint64_t number = 2; isTaken(candidate); ++number) {
+  for (std::uint64_t number = firstNumber; isTaken(candidate); ++number) {
     const std::string suffix = " " + std::to_string(number);
     const std::size_t room = maximumLength - suffix.size() - extension.size();
     candidate = cutToBytes(name.substr(0, dot), room);

@@ -23,6 +23,8 @@ class NSData final : public NSObject {
 
   static NSDataRef dataWithBytes(const void* bytes, std::size_t length);
   static NSDataRef dataWithString(std::string_view bytes);
+  /// The whole of a regular file; nil when it cannot be read, or is longer than `maximumLength`.
+  static NSDataRef dataWithContentsOfFile(const std::string& path, std::size_t maximumLength);
 
   [[nodiscard]] std::size_t length() const { return bytes_.size(); }
   [[nodiscard]] std::string_view bytes() const { return bytes_; }

@@ -10,7 +10,10 @@
 #include <cerrno>
 #include <cstdlib>
 #include <filesystem>
+#include <span>
 #include <vector>
+
+#include "platform/foundation/hexadecimal.h"
 
 namespace yomber {
 namespace {
@@ -61,13 +64,7 @@ std::string canonical(std::string_view home) {
 std::string hashOf(const std::string& text) {
   std::array<unsigned char, SHA256_DIGEST_LENGTH> digest{};
   SHA256(reinterpret_cast<const unsigned char*>(text.data()), text.size(), digest.data());
-  constexpr const char* kDigits = "0123456789abcdef";
-  std::string out;
-  for (std::size_t i = 0; i < 8; ++i) {
-    out += kDigits[digest[i] >> 4U];
-    out += kDigits[digest[i] & 0xfU];
-  }
-  return out;
+  return hexadecimal(std::as_bytes(std::span(digest).first<8>()));
 }
 
 /// Checks what stands at `path` itself; a symbolic link is never followed.
@@ -155,7 +152,8 @@ DrivePaths DrivePaths::forHome(std::string_view home) {
   paths.tree = paths.home + "/tree";
   paths.privateDirectory = paths.home + "/private";
   paths.database = paths.home + "/zarn.db";
-  paths.store = paths.home + "/store";
+  const auto shared = absoluteFromEnvironment("YOMBER_STORE");
+  paths.store = shared.empty() ? paths.home + "/store" : canonical(shared);
   paths.log = paths.home + "/log";
   const auto session = absoluteFromEnvironment("XDG_RUNTIME_DIR");
   paths.runtimeDirectory =

@@ -17,8 +17,8 @@ struct DrivePaths {
   std::string tree;              ///< the synced tree
   std::string privateDirectory;  ///< staging, on the tree's file system
   std::string database;          ///< the daemon's database file
-  std::string store;             ///< the embedded record store
-  std::string log;               ///< log files, where there is no journal
+  std::string store;  ///< the embedded record store; $YOMBER_STORE where drives have one together
+  std::string log;    ///< log files, where there is no journal
   std::string runtimeDirectory;  ///< sockets and the log level, gone with the session
   std::string daemonSocket;      ///< where zarn listens
   std::string controlSocket;     ///< where the host listens

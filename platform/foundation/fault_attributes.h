@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -10,6 +11,13 @@ inline constexpr const char* kFaultAttribute = "user.yomber.fault";
 /// Holds the boot identifier under which a fault was filled and verified: in that boot the content
 /// is readable although the fault attribute still stands; after another it is a fault again.
 inline constexpr const char* kFilledAttribute = "user.yomber.filled";
+
+/// While a file is filled in or given up: its modification date, decimal ns, which it gets back
+/// when that has ended.
+inline constexpr const char* kHeldDateAttribute = "user.yomber.mtime";
+
+/// How much of a fault's content stays in its file: one block, which it costs anyway.
+inline constexpr std::uint64_t kKeptBytes = 4096;
 
 /// The identifier of the running system's boot; empty when the system tells none.
 [[nodiscard]] const std::string& bootIdentifier();

@@ -12,6 +12,7 @@
 #include <utility>
 
 #include "platform/foundation/directory_stream.h"
+#include "platform/foundation/file_time.h"
 #include "platform/foundation/tree_removal.h"
 
 namespace yomber {
@@ -119,13 +120,8 @@ bool NSFileManager::setPermissions(const std::string& path, unsigned mode,
 
 bool NSFileManager::setModificationDate(const std::string& path, NSDate date,
                                         NSErrorRef* error) const {
-  constexpr std::int64_t kSecond = 1'000'000'000;
-  std::timespec time{date.nanoseconds() / kSecond, date.nanoseconds() % kSecond};
-  if (time.tv_nsec < 0) {
-    --time.tv_sec;
-    time.tv_nsec += kSecond;
-  }
-  const std::array<std::timespec, 2> times{std::timespec{0, UTIME_OMIT}, time};
+  const std::array<std::timespec, 2> times{std::timespec{0, UTIME_OMIT},
+                                           timespecOf(date.nanoseconds())};
   return utimensat(AT_FDCWD, path.c_str(), times.data(), AT_SYMLINK_NOFOLLOW) == 0 ||
          fail(error, errno, path);
 }

@@ -11,8 +11,10 @@
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
+#include <span>
 #include <vector>
 
+#include "platform/foundation/hexadecimal.h"
 #include "platform/foundation/lock.h"
 #include "platform/foundation/log_level.h"
 
@@ -88,7 +90,6 @@ bool isControl(char c) {
 }
 
 std::string escaped(std::string_view line) {
-  constexpr const char* kDigits = "0123456789abcdef";
   std::string out;
   out.reserve(line.size() + 8);
   for (const char c : line) {
@@ -97,9 +98,7 @@ std::string escaped(std::string_view line) {
     } else if (c == '\n') {
       out += "\\n";
     } else {
-      out += "\\x";
-      out += kDigits[static_cast<unsigned char>(c) >> 4U];
-      out += kDigits[static_cast<unsigned char>(c) & 0xfU];
+      out += "\\x" + hexadecimal(std::as_bytes(std::span(&c, 1)));
     }
   }
   return out;

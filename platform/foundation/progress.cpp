@@ -22,6 +22,7 @@ struct NSProgress::State {
   std::int64_t completed GUARDED_BY(mutex) = 0;
   std::vector<Child> children GUARDED_BY(mutex);
   std::function<void()> cancellationHandler GUARDED_BY(mutex);
+  std::shared_ptr<const std::function<void()>> updateHandler GUARDED_BY(mutex);
   bool cancellable GUARDED_BY(mutex) = true;
   bool cancelled GUARDED_BY(mutex) = false;
 };
@@ -41,19 +42,29 @@ std::int64_t NSProgress::totalUnitCount() const {
   return state_->total;
 }
 
-void NSProgress::setTotalUnitCount(std::int64_t count) {
-  LockGuard guard(state_->mutex);
-  state_->total = count;
-}
+void NSProgress::setTotalUnitCount(std::int64_t count) { set(&State::total, count); }
 
 std::int64_t NSProgress::completedUnitCount() const {
   LockGuard guard(state_->mutex);
   return state_->completed;
 }
 
-void NSProgress::setCompletedUnitCount(std::int64_t count) {
+void NSProgress::setCompletedUnitCount(std::int64_t count) { set(&State::completed, count); }
+
+void NSProgress::set(std::int64_t State::* count, std::int64_t value) {
+  std::shared_ptr<const std::function<void()>> handler;
+  {
+    LockGuard guard(state_->mutex);
+    (*state_).*count = value;
+    handler = state_->updateHandler;
+  }
+  if (handler != nullptr) (*handler)();
+}
+
+void NSProgress::setUpdateHandler(std::function<void()> handler) {
+  auto next = handler ? std::make_shared<const std::function<void()>>(std::move(handler)) : nullptr;
   LockGuard guard(state_->mutex);
-  state_->completed = count;
+  state_->updateHandler.swap(next);
 }
 
 double NSProgress::fractionCompleted() const {

@@ -25,6 +25,9 @@ class NSProgress {
   void setTotalUnitCount(std::int64_t count);
   [[nodiscard]] std::int64_t completedUnitCount() const;
   void setCompletedUnitCount(std::int64_t count);
+  /// Called after each setting of a count, on the thread that set it; so it must not block. One at
+  /// a time may be there; empty takes it away. Held strongly.
+  void setUpdateHandler(std::function<void()> handler);
   /// Between 0 and 1, children included by their share; 0 while nothing is known.
   [[nodiscard]] double fractionCompleted() const;
   /// `child` makes up `pendingUnitCount` units of this one, and is cancelled with it. It is kept.
@@ -42,6 +45,7 @@ class NSProgress {
  private:
   struct State;
   explicit NSProgress(std::int64_t unitCount);
+  void set(std::int64_t State::* count, std::int64_t value);
   std::unique_ptr<State> state_;
 };
 

@@ -10,6 +10,7 @@
 #include <string_view>
 #include <utility>
 
+#include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/directory_stream.h"
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/file_copy.h"
@@ -58,7 +59,7 @@ FileDescriptor openSource(int folder, const char* name) {
   if (!place || fstat(place.get(), &status) != 0) return {};
   errno = EWOULDBLOCK;
   if (!S_ISREG(status.st_mode)) return {};
-  const std::string path = "/proc/self/fd/" + std::to_string(place.get());
+  const std::string path = pathOfDescriptor(place.get());
   return FileDescriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC));
 }
 

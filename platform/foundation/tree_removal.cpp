@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "platform/foundation/deep_directory.h"
+#include "platform/foundation/descriptor_path.h"
 
 namespace yomber {
 namespace {
@@ -27,7 +28,7 @@ bool liftProtection(int parent, const char* name) {
   const FileDescriptor directory(
       openat(parent, name, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (!directory) return false;
-  return chmod(("/proc/self/fd/" + std::to_string(directory.get())).c_str(), S_IRWXU) == 0;
+  return chmod(pathOfDescriptor(directory.get()).c_str(), S_IRWXU) == 0;
 }
 
 }  // namespace

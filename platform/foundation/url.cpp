@@ -2,9 +2,11 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/percent_encoding.h"
 
 namespace yomber {
 namespace {
@@ -24,10 +26,10 @@ std::string normalised(std::string_view path) {
   return out.empty() ? "/" : out;
 }
 
-/// Characters that a file URL's path shows as they are.
-bool isPlain(char c) {
-  return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
-         std::string_view("-._~/!$&'()*+,=:@").find(c) != std::string_view::npos;
+constexpr std::size_t kMaximumTextBytes = 4096;
+
+bool isInScheme(char c) {
+  return (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' || c == '+' || c == '.';
 }
 
 }  // namespace
@@ -39,6 +41,15 @@ NSURLRef NSURL::fileURLWithPath(std::string_view path) {
     return nullptr;
   }
   return std::make_shared<NSURL>(std::string(path));
+}
+
+NSURLRef NSURL::URLWithString(std::string_view text) {
+  const std::string_view scheme = text.substr(0, text.find(':'));
+  const bool isURL = text.size() <= kMaximumTextBytes && scheme.size() + 1 < text.size() &&
+                     !scheme.empty() && scheme != "file" && scheme.front() >= 'a' &&
+                     scheme.front() <= 'z' && std::ranges::all_of(scheme, isInScheme) &&
+                     std::ranges::all_of(text, [](char c) { return c > ' ' && c < '\x7f'; });
+  return isURL ? NSURLRef(new NSURL(Elsewhere{std::string(text)})) : nullptr;
 }
 
 std::string NSURL::lastPathComponent() const {
@@ -54,20 +65,8 @@ NSURLRef NSURL::URLByDeletingLastPathComponent() const {
 }
 
 std::string NSURL::absoluteString() const {
-  constexpr std::string_view kDigits = "0123456789ABCDEF";
-  std::string out = "file://";
-  out.reserve(out.size() + path_.size());
-  for (const char c : path_) {
-    if (isPlain(c)) {
-      out += c;
-      continue;
-    }
-    const auto byte = static_cast<unsigned char>(c);
-    out += '%';
-    out += kDigits[byte >> 4U];
-    out += kDigits[byte & 0xfU];
-  }
-  return out;
+  if (!isFileURL()) return text_;
+  return "file://" + percentEncoded(path_, kPlainInURLPaths);
 }
 
 void NSURL::setMark(Mark mark) {

@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "platform/foundation/date.h"
 #include "platform/foundation/error.h"
@@ -26,6 +27,8 @@ struct NSURLResourceValues {
 };
 
 /// A location on disk: an absolute path of bytes, plus marks that are set on the object in place.
+/// Or, where it is no file URL, a text that leads elsewhere, such as a share's link; its path is
+/// empty then, and there is nothing at it on disk.
 ///
 /// `path` is always the logical path. A mark (see `setMark`) is carried by this very object and by
 /// nothing made from it.
@@ -46,11 +49,16 @@ class NSURL final : public NSObject {
   /// Nil when `path` is empty, relative or holds a NUL byte.
   static NSURLRef fileURLWithPath(std::string_view path);
 
+  /// Nil for what is no URL ("scheme:rest", plain ASCII without spaces, at most 4096 bytes), and
+  /// for file URLs.
+  static NSURLRef URLWithString(std::string_view text);
+  [[nodiscard]] bool isFileURL() const { return text_.empty(); }
+
   [[nodiscard]] const std::string& path() const { return path_; }
   [[nodiscard]] std::string lastPathComponent() const;
   [[nodiscard]] NSURLRef URLByAppendingPathComponent(std::string_view component) const;
   [[nodiscard]] NSURLRef URLByDeletingLastPathComponent() const;
-  /// Percent-encoded "file://" form.
+  /// Percent-encoded "file://" form; what is no file URL, as it is.
   [[nodiscard]] std::string absoluteString() const;
 
   void setMark(Mark mark);
@@ -65,7 +73,13 @@ class NSURL final : public NSObject {
   [[nodiscard]] std::string description() const override { return absoluteString(); }
 
  private:
+  struct Elsewhere {
+    std::string text;
+  };
+  explicit NSURL(Elsewhere elsewhere) : text_(std::move(elsewhere.text)) {}
+
   const std::string path_;
+  const std::string text_;
   std::atomic<std::uint32_t> marks_{0};
 };
 

@@ -28,6 +28,25 @@ TEST(UrlTest, RefusesWhatIsNoAbsolutePath) {
   EXPECT_NE(NSURL::fileURLWithPath("/\xff\n"), nullptr);
 }
 
+TEST(UrlTest, KeepsAnAddressThatIsNoFile) {
+  const NSURLRef url = NSURL::URLWithString("some-scheme:0a/b?c");
+  ASSERT_NE(url, nullptr);
+  EXPECT_FALSE(url->isFileURL());
+  EXPECT_EQ(url->absoluteString(), "some-scheme:0a/b?c");
+  EXPECT_EQ(url->path(), "");
+  EXPECT_FALSE(url->checkResourceIsReachableAndReturnError());
+  EXPECT_TRUE(NSURL("/a").isFileURL());
+}
+
+TEST(UrlTest, RefusesWhatIsNoAddress) {
+  for (const std::string& text :
+       {std::string(), std::string("a"), std::string("a:"), std::string(":a"), std::string("/a:b"),
+        std::string("a b:c"), std::string("a:b c"), std::string("a:\xff"), std::string("a:\0", 3),
+        std::string("file:///a"), "a:" + std::string(4095, 'b')}) {
+    EXPECT_EQ(NSURL::URLWithString(text), nullptr) << text;
+  }
+}
+
 TEST(UrlTest, TakesPathsApartAndTogether) {
   const NSURL url("/a/b c");
   EXPECT_EQ(url.lastPathComponent(), "b c");

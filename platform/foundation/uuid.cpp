@@ -6,6 +6,9 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <span>
+
+#include "platform/foundation/hexadecimal.h"
 
 namespace yomber {
 
@@ -30,13 +33,8 @@ int uuid_compare(const UUID& left, const UUID& right) {
 }
 
 std::string uuid_unparse(const UUID& uuid) {
-  constexpr const char* kDigits = "0123456789abcdef";
-  std::string out;
-  for (std::size_t i = 0; i < uuid.size(); ++i) {
-    if (i == 4 || i == 6 || i == 8 || i == 10) out += '-';
-    out += kDigits[uuid[i] >> 4U];
-    out += kDigits[uuid[i] & 0xfU];
-  }
+  std::string out = hexadecimal(std::as_bytes(std::span(uuid)));
+  for (const std::size_t place : {8U, 13U, 18U, 23U}) out.insert(place, 1, '-');
   return out;
 }
 

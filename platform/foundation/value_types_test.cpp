@@ -1,11 +1,14 @@
 #include <gtest/gtest.h>
 
 #include <array>
+#include <fstream>
 #include <limits>
 #include <set>
+#include <string>
 
 #include "platform/foundation/data.h"
 #include "platform/foundation/date.h"
+#include "platform/foundation/temporary_directory.h"
 #include "platform/foundation/uuid.h"
 
 namespace yomber {
@@ -27,6 +30,17 @@ TEST(DataTest, IsEqualByItsBytes) {
   EXPECT_FALSE(data->isEqualToData(NSData::dataWithString("abd")));
   EXPECT_FALSE(data->isEqualToData(NSData::dataWithString("ab")));
   EXPECT_FALSE(data->isEqualToData(nullptr));
+}
+
+TEST(DataTest, HoldsAWholeFileThatIsNotTooLong) {
+  const TemporaryDirectory directory;
+  const std::string path = directory / "file";
+  std::ofstream(path) << "content";
+  ASSERT_NE(NSData::dataWithContentsOfFile(path, 7), nullptr);
+  EXPECT_EQ(NSData::dataWithContentsOfFile(path, 7)->bytes(), "content");
+  EXPECT_EQ(NSData::dataWithContentsOfFile(path, 6), nullptr);
+  EXPECT_EQ(NSData::dataWithContentsOfFile(directory.path(), 100), nullptr);
+  EXPECT_EQ(NSData::dataWithContentsOfFile(directory / "missing", 100), nullptr);
 }
 
 TEST(DateTest, PrintsTheFractionThatIsThere) {

@@ -36,6 +36,9 @@ struct Wire {
         network(stream, kMaximumDescriptors, Side::SERVER, readerOptions()),
         rpc(network, kj::mv(own)) {
     rpc.setFlowLimit(kMaximumUnansweredWords);
+    stream.limitBacklog([this] {
+      return MessageStream::Backlog{network.getCurrentQueueSize(), network.getCurrentQueueCount()};
+    });
   }
 
   capnp::Capability::Client bootstrap() {
@@ -68,15 +71,28 @@ struct Connection::Link final : std::enable_shared_from_this<Link> {
   kj::Maybe<capnp::Capability::Client> peer;
   std::vector<std::function<void(NSErrorRef)>> handlers;
   NSErrorRef endReason;
+  bool ending = false;  ///< the wire has ended, and the link will in a moment
 
   /// Does nothing when started or ended already.
   void start() {
     if (!socket || endReason) return;
     kj::Maybe<capnp::Capability::Client> own;
     if (ownBootstrap) own = std::exchange(ownBootstrap, nullptr)();
-    wire = std::make_unique<Wire>(
-        std::move(socket), handshake, kj::mv(own),
-        [weak = weak_from_this()](NSErrorRef reason) { endSoon(weak, std::move(reason)); });
+    // Whoever waits for the end has to hear of a socket that cannot be observed, too.
+    KJ_IF_MAYBE (exception, kj::runCatchingExceptions([&] { makeWire(kj::mv(own)); })) {
+      log_error(defaultLog(), "[ERROR] a connection cannot begin: %s",
+                exception->getDescription().cStr());
+      endSoon(weak_from_this(),
+              connectionError(NSXPCConnectionInterrupted, exception->getDescription().cStr()));
+    }
+  }
+
+  void makeWire(kj::Maybe<capnp::Capability::Client> own) {
+    wire = std::make_unique<Wire>(std::move(socket), handshake, kj::mv(own),
+                                  [this, weak = weak_from_this()](NSErrorRef reason) {
+                                    ending = true;
+                                    endSoon(weak, std::move(reason));
+                                  });
   }
 
   /// Ends the link once all that the loop has in hand is done: it is called from inside the wire.
@@ -111,7 +127,8 @@ struct Connection::Link final : std::enable_shared_from_this<Link> {
   capnp::Capability::Client peerCapability() {
     start();
     KJ_IF_MAYBE (known, peer) return *known;
-    if (!wire) {
+    // A wire that has ended takes no new bootstrap: asked for one, it would end the process.
+    if (!wire || ending) {
       return kj::Exception(kj::Exception::Type::DISCONNECTED, __FILE__, __LINE__,
                            kj::heapString("The connection has ended."));
     }

@@ -17,7 +17,7 @@ namespace yomber::ipc {
 /// Either side may export a bootstrap capability, and descriptors travel on capabilities
 /// (`capnp::Capability::Server::getFd`). A message is at most 64 MiB: a larger call fails alone, a
 /// larger reply becomes an error for its caller alone, and a peer that sends one regardless, or
-/// bytes that are no message, is disconnected.
+/// bytes that are no message, or reads nothing while much waits for it, is disconnected.
 ///
 /// Dropping the last reference closes the connection. When it ends, every outstanding call on its
 /// capabilities fails, once each.

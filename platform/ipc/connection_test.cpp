@@ -1,5 +1,8 @@
 #include "platform/ipc/connection.h"
 
+#include <capnp/message.h>
+#include <capnp/rpc.capnp.h>
+#include <capnp/serialize.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -270,6 +273,98 @@ TEST(Connection, AnotherUsersListenerIsRefused) {
   EXPECT_NE(error->localizedDescription().find("another user"), std::string::npos);
   ASSERT_EQ(::write(release.get(), "x", 1), 1);
   server.join();
+}
+
+/// The other end of a connection that serves echoes, which sends calls by hand and reads replies
+/// only when it is told to.
+class DeafPeer {
+ public:
+  DeafPeer() {
+    UniqueFd theirs;
+    EXPECT_TRUE(makeSocketPair(socket_, theirs));
+    EXPECT_EQ(MessageStream::sendCredentials(socket_.get()), 0);
+    connection = Connection::adopt(theirs.release(), echoes(state_));
+    send([](capnp::rpc::Message::Builder message) { message.initBootstrap().setQuestionId(0); });
+  }
+  /// False when the connection has ended.
+  template <typename Params, typename Fill>
+  bool call(std::uint16_t method, Fill fill) {
+    return send([&](capnp::rpc::Message::Builder message) {
+      auto request = message.initCall();
+      request.setQuestionId(++lastQuestion_);
+      request.initTarget().initPromisedAnswer().setQuestionId(0);
+      request.setInterfaceId(capnp::typeId<Echo>());
+      request.setMethodId(method);
+      fill(request.initParams().getContent().initAs<Params>());
+    });
+  }
+  void askForLarge(std::uint64_t bytes) {
+    constexpr std::uint16_t kLarge = 9;
+    EXPECT_TRUE(call<Echo::LargeParams>(kLarge, [&](auto params) { params.setBytes(bytes); }));
+  }
+  /// How many bytes have come when there are so many, or no more do.
+  [[nodiscard]] std::uint64_t read(std::uint64_t wanted) const {
+    std::vector<char> buffer(1 << 20);
+    std::uint64_t total = 0;
+    while (total < wanted) {
+      const ssize_t count = ::recv(socket_.get(), buffer.data(), buffer.size(), 0);
+      if (count <= 0) break;
+      total += static_cast<std::uint64_t>(count);
+    }
+    return total;
+  }
+
+  Connection::Ref connection;
+
+ private:
+  template <typename Fill>
+  bool send(Fill fill) {
+    capnp::MallocMessageBuilder builder;
+    fill(builder.initRoot<capnp::rpc::Message>());
+    const auto words = capnp::messageToFlatArray(builder);
+    auto bytes = words.asBytes();
+    while (bytes.size() > 0) {
+      const ssize_t sent = ::send(socket_.get(), bytes.begin(), bytes.size(), MSG_NOSIGNAL);
+      if (sent <= 0) return false;
+      bytes = bytes.slice(static_cast<std::size_t>(sent), bytes.size());
+    }
+    return true;
+  }
+
+  const test::EchoStateRef state_ = std::make_shared<test::EchoState>();
+  UniqueFd socket_;
+  std::uint32_t lastQuestion_ = 0;
+};
+
+constexpr std::uint64_t kLargeReply = 60 << 20;
+
+TEST(Connection, APeerThatReadsNoLargeRepliesIsDisconnected) {
+  DeafPeer peer;
+  EndWatch watch(peer.connection);
+  for (std::uint64_t bytes = 0; bytes <= kMaximumBacklogBytes; bytes += kLargeReply)
+    peer.askForLarge(kLargeReply);
+  const NSErrorRef reason = watch.reason();
+  EXPECT_TRUE(test::isCocoaError(reason, NSXPCConnectionInvalid));
+  EXPECT_NE(reason->localizedDescription().find("takes in nothing"), std::string::npos);
+}
+
+TEST(Connection, APeerThatReadsNoSmallRepliesIsReadNoFurtherAndDisconnected) {
+  DeafPeer peer;
+  EndWatch watch(peer.connection);
+  constexpr std::size_t kCalls = 20 * kMaximumBacklogMessages;
+  std::size_t calls = 0;
+  const auto fill = [](auto params) { params.setValue(7); };
+  while (calls < kCalls && peer.call<Echo::EchoParams>(0, fill)) ++calls;
+  EXPECT_TRUE(test::isCocoaError(watch.reason(), NSXPCConnectionInvalid));
+  EXPECT_LT(calls, kCalls / 4) << "what waits is bounded, here and in the sockets";
+}
+
+TEST(Connection, APeerThatReadsLateGetsEverything) {
+  DeafPeer peer;
+  std::uint64_t bytes = 0;
+  for (; bytes <= kMaximumBacklogBytes; bytes += kLargeReply) peer.askForLarge(kLargeReply);
+  EXPECT_GE(peer.read(bytes), bytes);
+  EXPECT_TRUE(peer.connection->isConnected());
 }
 
 TEST(Connection, PathsOfAnyLengthWork) {

@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/foundation/sanitized.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/connection.h"
 #include "platform/ipc/deadlines.h"
@@ -172,9 +173,7 @@ TEST_F(ListenerTest, RandomBytesHarmNobody) {
 }
 
 TEST_F(ListenerTest, OutOfDescriptorsItWaitsAndGoesOn) {
-#if defined(__SANITIZE_ADDRESS__)
-  GTEST_SKIP() << "the sanitizer needs descriptors to look at memory";
-#endif
+  if (kHasAddressSanitizer) GTEST_SKIP() << "the sanitizer needs descriptors to look at memory";
   const auto listener = listen();
   ASSERT_NE(listener, nullptr);
   ASSERT_TRUE(serves());

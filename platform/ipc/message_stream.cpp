@@ -12,6 +12,7 @@
 #include <string>
 #include <utility>
 
+#include "platform/foundation/log.h"
 #include "platform/ipc/error_codec.h"
 
 namespace yomber::ipc {
@@ -31,6 +32,12 @@ constexpr std::size_t kMaximumBatches = 4;
 constexpr char kPreamble = 'Y';
 /// How often a full socket is tried again when there is no descriptor left to observe it with.
 constexpr auto kRoomPolling = 5 * kj::MILLISECONDS;
+
+/// After so many messages in one go, replies are sent: that is else done at the end of the loop's
+/// turn, which a peer that never pauses would put off for ever.
+constexpr std::size_t kMessagesInOneGo = 256;
+/// How often a backlog is looked at.
+constexpr auto kBacklogPolling = 50 * kj::MILLISECONDS;
 
 constexpr std::size_t kDescriptorSpace = CMSG_SPACE(sizeof(int) * kMaximumDescriptors);
 constexpr std::size_t kCredentialSpace = CMSG_SPACE(sizeof(ucred));
@@ -70,6 +77,14 @@ std::vector<std::uint32_t> makeHeader(kj::ArrayPtr<const kj::ArrayPtr<const word
   return header;
 }
 
+/// The loop thread's spare receive buffer, so that connections that are idle hold none.
+thread_local std::unique_ptr<std::byte[]> spareBuffer;
+
+std::unique_ptr<std::byte[]> borrowBuffer() {
+  if (spareBuffer) return std::move(spareBuffer);
+  return std::make_unique_for_overwrite<std::byte[]>(kBufferBytes);
+}
+
 iovec pieceOf(const void* data, std::size_t bytes) {
   return {.iov_base = const_cast<void*>(data), .iov_len = bytes};  // NOLINT: sending only reads
 }
@@ -82,6 +97,22 @@ void advancePieces(std::vector<iovec>& pieces, std::size_t& next, std::size_t by
   pieces[next].iov_len -= bytes;
 }
 
+/// What came with the message.
+std::vector<kj::AutoCloseFd> descriptorsOf(msghdr& message) {
+  std::vector<kj::AutoCloseFd> descriptors;
+  for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr;
+       header = CMSG_NXTHDR(&message, header)) {
+    if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
+    const std::size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (std::size_t i = 0; i < count; ++i) {
+      int descriptor = -1;
+      std::memcpy(&descriptor, CMSG_DATA(header) + i * sizeof descriptor, sizeof descriptor);
+      descriptors.emplace_back(descriptor);
+    }
+  }
+  return descriptors;
+}
+
 }  // namespace
 
 MessageStream::MessageStream(kj::UnixEventPort& port, UniqueFd socket, Handshake handshake,
@@ -90,8 +121,7 @@ MessageStream::MessageStream(kj::UnixEventPort& port, UniqueFd socket, Handshake
       onEnd_(std::move(onEnd)),
       port_(port),
       observer_(port, socket_.get(), kj::UnixEventPort::FdObserver::OBSERVE_READ),
-      verified_(handshake == Handshake::None),
-      buffer_(kBufferBytes) {}
+      verified_(handshake == Handshake::None) {}
 
 MessageStream::~MessageStream() = default;
 
@@ -128,7 +158,7 @@ void MessageStream::refusePeer(std::string text) {
   kj::throwFatalException(disconnected(text));
 }
 
-void MessageStream::verifyPeer() {
+MessageStream::Proof MessageStream::receiveCredentials(int socket, std::string& refusal) {
   char byte = 0;
   iovec piece{.iov_base = &byte, .iov_len = 1};
   alignas(cmsghdr) std::array<std::byte, kCredentialSpace + kDescriptorSpace> control{};
@@ -137,13 +167,13 @@ void MessageStream::verifyPeer() {
   message.msg_iovlen = 1;
   message.msg_control = control.data();
   message.msg_controllen = control.size();
-  const ssize_t count = ::recvmsg(socket_.get(), &message, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
+  const ssize_t count = ::recvmsg(socket, &message, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
   if (count != 1) {
-    if (count < 0 && (errno == EAGAIN || errno == EINTR)) return;
-    refusePeer("The peer went away before it proved its user.");
+    if (count < 0 && (errno == EAGAIN || errno == EINTR)) return Proof::NotYet;
+    refusal = "The peer went away before it proved its user.";
+    return Proof::PeerLeft;
   }
-  keepDescriptors(message);
-  batches_.clear();
+  (void)descriptorsOf(message);  // closed unseen
   ucred peer{};
   for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr;
        header = CMSG_NXTHDR(&message, header)) {
@@ -151,15 +181,26 @@ void MessageStream::verifyPeer() {
     std::memcpy(&peer, CMSG_DATA(header), sizeof peer);
   }
   // Without credentials the kernel fills in the overflow user and no process.
-  if (peer.pid == 0 || byte != kPreamble) refusePeer("The peer did not prove its user.");
+  if (peer.pid == 0 || byte != kPreamble) {
+    refusal = "The peer did not prove its user.";
+    return Proof::Refused;
+  }
   if (peer.uid != ::geteuid()) {
-    refusePeer("The peer, process " + std::to_string(peer.pid) + ", belongs to user " +
-               std::to_string(peer.uid) +
-               " and was refused: only the user's own processes may "
-               "connect.");
+    refusal = "The peer, process " + std::to_string(peer.pid) + ", belongs to user " +
+              std::to_string(peer.uid) +
+              " and was refused: only the user's own processes may connect.";
+    return Proof::Refused;
   }
   const int off = 0;
-  ::setsockopt(socket_.get(), SOL_SOCKET, SO_PASSCRED, &off, sizeof off);
+  ::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &off, sizeof off);
+  return Proof::Given;
+}
+
+void MessageStream::verifyPeer() {
+  std::string refusal;
+  const Proof proof = receiveCredentials(socket_.get(), refusal);
+  if (proof == Proof::NotYet) return;
+  if (proof != Proof::Given) refusePeer(std::move(refusal));
   verified_ = true;
   scheduleFlush();
 }
@@ -170,8 +211,19 @@ kj::Promise<kj::Maybe<capnp::MessageReaderAndFds>> MessageStream::tryReadMessage
     kj::ArrayPtr<kj::AutoCloseFd> fdSpace, capnp::ReaderOptions options,
     kj::ArrayPtr<word> scratchSpace) {
   using Result = kj::Maybe<capnp::MessageReaderAndFds>;
+  const auto again = [this, fdSpace, options, scratchSpace] {
+    return tryReadMessage(fdSpace, options, scratchSpace);
+  };
   for (;;) {
+    if (takenInOneGo_ == kMessagesInOneGo) {
+      takenInOneGo_ = 0;
+      flushOrWait();
+    }
+    if (hasTooMuchWaiting()) {
+      return port_.getTimer().afterDelay(kBacklogPolling).then(kj::cp(again));
+    }
     KJ_IF_MAYBE (words, takeMessage()) {
+      ++takenInOneGo_;
       auto fds = takeDescriptors(consumedOffset_, fdSpace);
       auto reader = kj::heap<capnp::FlatArrayMessageReader>(*words, options);
       return Result(capnp::MessageReaderAndFds{reader.attach(kj::mv(*words)), fds});
@@ -182,16 +234,15 @@ kj::Promise<kj::Maybe<capnp::MessageReaderAndFds>> MessageStream::tryReadMessage
       return Result(nullptr);
     }
     if (received == Received::Some) continue;
+    takenInOneGo_ = 0;
     kj::Promise<void> ready = kj::mv(*readable_);
     readable_.reset();
-    return ready.then([this, fdSpace, options, scratchSpace] {
-      return tryReadMessage(fdSpace, options, scratchSpace);
-    });
+    return ready.then(kj::cp(again));
   }
 }
 
 std::span<const std::byte> MessageStream::buffered() const {
-  return {buffer_.data() + begin_, end_ - begin_};
+  return {buffer_.get() + begin_, end_ - begin_};
 }
 
 kj::Maybe<kj::Array<word>> MessageStream::takeMessage() {
@@ -236,12 +287,18 @@ kj::ArrayPtr<kj::AutoCloseFd> MessageStream::takeDescriptors(std::uint64_t endOf
 }
 
 void MessageStream::makeRoom() {
+  if (!buffer_) buffer_ = borrowBuffer();
   if (begin_ == end_) {
     begin_ = end_ = 0;
   } else if (begin_ > kBufferBytes / 2 || end_ == kBufferBytes) {
-    std::memmove(buffer_.data(), buffer_.data() + begin_, end_ - begin_);
+    std::memmove(buffer_.get(), buffer_.get() + begin_, end_ - begin_);
     end_ -= std::exchange(begin_, 0);
   }
+}
+
+void MessageStream::giveBufferBack() {
+  begin_ = end_ = 0;
+  spareBuffer = std::move(buffer_);
 }
 
 MessageStream::Received MessageStream::receive() {
@@ -257,7 +314,7 @@ MessageStream::Received MessageStream::receive() {
     const auto bytes = large_->words.asBytes();
     pieces[count++] = pieceOf(bytes.begin() + large_->filled, bytes.size() - large_->filled);
   }
-  pieces[count++] = pieceOf(buffer_.data() + end_, kBufferBytes - end_);
+  pieces[count++] = pieceOf(buffer_.get() + end_, kBufferBytes - end_);
   alignas(cmsghdr) std::array<std::byte, kDescriptorSpace> control;
   msghdr message{};
   message.msg_iov = pieces.data();
@@ -272,7 +329,10 @@ MessageStream::Received MessageStream::receive() {
     return Received::Some;
   }
   if (received < 0 && errno == EINTR) return Received::Some;
-  if (received < 0 && errno == EAGAIN) return Received::Nothing;
+  if (received < 0 && errno == EAGAIN) {
+    if (begin_ == end_) giveBufferBack();
+    return Received::Nothing;
+  }
   // Whatever else it is (reset, usually), no more will come.
   return Received::EndOfStream;
 }
@@ -287,17 +347,7 @@ void MessageStream::advanceReceived(std::size_t count) {
 }
 
 void MessageStream::keepDescriptors(msghdr& message) {
-  DescriptorBatch batch{.endOffset = receivedOffset_, .descriptors = {}};
-  for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr;
-       header = CMSG_NXTHDR(&message, header)) {
-    if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
-    const std::size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (std::size_t i = 0; i < count; ++i) {
-      int descriptor = -1;
-      std::memcpy(&descriptor, CMSG_DATA(header) + i * sizeof descriptor, sizeof descriptor);
-      batch.descriptors.emplace_back(descriptor);
-    }
-  }
+  DescriptorBatch batch{.endOffset = receivedOffset_, .descriptors = descriptorsOf(message)};
   if (batch.descriptors.empty()) return;
   // Complete messages were taken before, so these all came with one that is not complete.
   if (batches_.size() == kMaximumBatches) refusePeer("The peer sent too many descriptors.");
@@ -365,6 +415,36 @@ void MessageStream::flushOrWait() {
   if (!verified_ || waitingForRoom_ || flush()) return;
   waitingForRoom_ = true;
   roomTask_ = waitAndFlush().eagerlyEvaluate(nullptr);
+  backlogTask_ = watchBacklog(sentBytes_, port_.getTimer().now()).eagerlyEvaluate(nullptr);
+}
+
+bool MessageStream::hasTooMuchWaiting() const {
+  if (!waitingForRoom_ || writingFailed_ || !measureBacklog_) return false;
+  const Backlog backlog = measureBacklog_();
+  return backlog.bytes > kMaximumBacklogBytes || backlog.messages > kMaximumBacklogMessages;
+}
+
+kj::Promise<void> MessageStream::watchBacklog(std::uint64_t sent, kj::TimePoint since) {
+  return port_.getTimer().afterDelay(kBacklogPolling).then([this, sent, since] {
+    if (!waitingForRoom_) return kj::Promise<void>(kj::READY_NOW);
+    const kj::TimePoint now = port_.getTimer().now();
+    if (sent != sentBytes_ || !hasTooMuchWaiting()) return watchBacklog(sentBytes_, now);
+    if (now - since < kBacklogPatience) return watchBacklog(sent, since);
+    giveUpPeer(measureBacklog_());
+    return kj::Promise<void>(kj::READY_NOW);
+  });
+}
+
+void MessageStream::giveUpPeer(const Backlog& backlog) {
+  const auto peer = peerCredentials(socket_.get());
+  log_error(defaultLog(),
+            "[ERROR] process %d takes in nothing while %zu bytes in %zu messages wait for it; its "
+            "connection is closed",
+            peer ? peer->pid : 0, backlog.bytes, backlog.messages);
+  failWriting(EPIPE);  // silent: the reason is ours
+  reportEnd(NSXPCConnectionInvalid,
+            "The peer takes in nothing of what was sent to it, and was disconnected.");
+  ::shutdown(socket_.get(), SHUT_RDWR);
 }
 
 kj::Promise<void> MessageStream::waitAndFlush() {
@@ -401,6 +481,7 @@ bool MessageStream::sendQueued() {
                                 queued_.size() - queuedSent_, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (sent >= 0) {
       queuedSent_ += static_cast<std::size_t>(sent);
+      sentBytes_ += static_cast<std::uint64_t>(sent);
     } else if (errno == EAGAIN) {
       return false;
     } else if (errno != EINTR) {
@@ -433,6 +514,7 @@ bool MessageStream::sendDirect() {
     const ssize_t sent = ::sendmsg(socket_.get(), &message, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (sent >= 0) {
       write.descriptors = nullptr;
+      sentBytes_ += static_cast<std::uint64_t>(sent);
       advancePieces(write.pieces, write.nextPiece, static_cast<std::size_t>(sent));
     } else if (errno == EAGAIN) {
       return false;

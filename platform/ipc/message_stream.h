@@ -9,8 +9,10 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <span>
+#include <string>
 #include <utility>
 #include <vector>
 
@@ -23,6 +25,13 @@ namespace yomber::ipc {
 inline constexpr std::uint64_t kMaximumMessageWords = 8 * 1024 * 1024;
 /// What the parameters of a call may hold, so that the message around them fits too.
 inline constexpr std::uint64_t kMaximumPayloadWords = kMaximumMessageWords - 1024;
+/// What may wait to be sent: two of the largest replies, so that one can be made while another is
+/// on its way; and so many small ones, each of which takes some 9 KiB until it is sent, and stack
+/// when all are dropped at once.
+inline constexpr std::size_t kMaximumBacklogBytes = 2 * kMaximumMessageWords * sizeof(capnp::word);
+inline constexpr std::size_t kMaximumBacklogMessages = 4096;
+/// Who reads at all takes something in much sooner.
+inline constexpr auto kBacklogPatience = 2 * kj::SECONDS;
 /// Descriptors that one message may bring; more are closed unseen.
 inline constexpr unsigned kMaximumDescriptors = 16;
 
@@ -34,7 +43,9 @@ inline constexpr unsigned kMaximumDescriptors = 16;
 /// message that begins in what one receive brought.
 ///
 /// Bounds: at most kMaximumMessageWords and 512 segments; memory for a message grows only with what
-/// arrives of it. Larger messages are refused by the layers above before they get here.
+/// arrives of it. Larger messages are refused by the layers above before they get here. While more
+/// than the maximum backlog waits for the peer, nothing more is read from it, and one that takes in
+/// nothing for kBacklogPatience is disconnected.
 ///
 /// Loop thread only.
 class MessageStream final : public capnp::MessageStream {
@@ -48,8 +59,19 @@ class MessageStream final : public capnp::MessageStream {
   MessageStream(kj::UnixEventPort& port, UniqueFd socket, Handshake handshake, OnEnd onEnd);
   ~MessageStream();
 
+  /// What waits behind this stream to be written to it, and is in it.
+  struct Backlog {
+    std::size_t bytes = 0;
+    std::size_t messages = 0;
+  };
+  /// To be called before anything is read. `measure` is called as long as this stream lives.
+  void limitBacklog(std::function<Backlog()> measure) { measureBacklog_ = std::move(measure); }
+
   /// Sends this process's half of the handshake. 0 or an errno value.
   static int sendCredentials(int socket);
+  enum class Proof : std::uint8_t { NotYet, Given, PeerLeft, Refused };
+  /// Takes the peer's half, and no more, without waiting for it; the last two say why in `refusal`.
+  static Proof receiveCredentials(int socket, std::string& refusal);
 
   /// Sends what is queued as far as the socket takes it at once.
   void flushNow();
@@ -97,6 +119,7 @@ class MessageStream final : public capnp::MessageStream {
   void advanceReceived(std::size_t count);
   [[nodiscard]] std::span<const std::byte> buffered() const;
   void makeRoom();
+  void giveBufferBack();
   [[noreturn]] void refusePeer(std::string text);
 
   // Sending.
@@ -110,6 +133,10 @@ class MessageStream final : public capnp::MessageStream {
   kj::Promise<void> waitAndFlush();
   kj::Promise<void> whenRoom();
   void failWriting(int number);
+  [[nodiscard]] bool hasTooMuchWaiting() const;
+  /// While the socket is full. `sent`: what the peer had taken in at `since`.
+  kj::Promise<void> watchBacklog(std::uint64_t sent, kj::TimePoint since);
+  void giveUpPeer(const Backlog& backlog);
 
   void reportEnd(std::int64_t code, std::string text);
 
@@ -129,7 +156,7 @@ class MessageStream final : public capnp::MessageStream {
   kj::UnixEventPort::FdObserver observer_;
   bool verified_;
 
-  std::vector<std::byte> buffer_;
+  std::unique_ptr<std::byte[]> buffer_;  ///< of kBufferBytes; none while nothing is in it
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
   std::optional<LargeMessage> large_;
@@ -138,7 +165,10 @@ class MessageStream final : public capnp::MessageStream {
   std::deque<DescriptorBatch> batches_;
   /// Set while an edge of readability is awaited; armed before each receive, so that none is lost.
   std::optional<kj::Promise<void>> readable_;
+  std::size_t takenInOneGo_ = 0;
 
+  std::function<Backlog()> measureBacklog_;
+  std::uint64_t sentBytes_ = 0;  ///< that the socket has taken
   std::vector<std::byte> queued_;
   std::size_t queuedSent_ = 0;
   std::optional<DirectWrite> direct_;
@@ -149,6 +179,7 @@ class MessageStream final : public capnp::MessageStream {
   std::optional<RoomObserver> roomObserver_;
   kj::Promise<void> flushTask_ = nullptr;
   kj::Promise<void> roomTask_ = nullptr;
+  kj::Promise<void> backlogTask_ = nullptr;
 };
 
 }  // namespace yomber::ipc

@@ -53,7 +53,7 @@ void PendingCall::run() {
   if (settled_) return;
   self_ = shared_from_this();
   try {
-    task_ = send().eagerlyEvaluate(nullptr);
+    task_ = send(makeRequest()).eagerlyEvaluate(nullptr);
   } catch (...) {
     EventLoop::shared().post([this, error = currentReplyError()] { giveUp(error); });
     return;
@@ -65,6 +65,15 @@ void PendingCall::run() {
           "The peer did not answer within " + std::to_string(options_.timeout.count()) + " ms."));
     });
   }
+}
+
+kj::Promise<void> PendingCall::send(AnyRequest request) {
+  return request->send().then(
+      [this](capnp::Response<capnp::AnyPointer>&& response) {
+        response_ = kj::mv(response);
+        finish(nullptr);
+      },
+      [this](kj::Exception&& exception) { finish(connectionError(exception)); });
 }
 
 void PendingCall::finish(NSErrorRef error) {
@@ -83,7 +92,11 @@ void PendingCall::giveUp(NSErrorRef error) {
 bool PendingCall::settle(NSErrorRef error) {
   if (std::exchange(settled_, true)) return false;
   deadline_.clear();
-  KJ_IF_MAYBE (exception, kj::runCatchingExceptions([&] { reply(std::move(error)); })) {
+  const AnyResults* results = nullptr;
+  KJ_IF_MAYBE (response, response_) {
+    if (!error) results = response;
+  }
+  KJ_IF_MAYBE (exception, kj::runCatchingExceptions([&] { reply(std::move(error), results); })) {
     log_error(defaultLog(), "A reply handler failed: %s", exception->getDescription().cStr());
   }
   release();

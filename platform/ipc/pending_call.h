@@ -61,19 +61,22 @@ class PendingCall : public std::enable_shared_from_this<PendingCall> {
 
  protected:
   explicit PendingCall(CallOptions options) : options_(options) {}
-  /// Sends the request; the promise is done when `finish` was called. May throw.
-  virtual kj::Promise<void> send() = 0;
-  /// Calls the reply handler with `error`, or with the results that were kept.
-  virtual void reply(NSErrorRef error) = 0;
+  using AnyRequest = kj::Own<capnp::RequestHook>;
+  using AnyResults = capnp::AnyPointer::Reader;
+  /// The request, filled in. May throw.
+  virtual AnyRequest makeRequest() = 0;
+  /// Calls the reply handler with `error`, or with the results.
+  virtual void reply(NSErrorRef error, const AnyResults* results) = 0;
   /// Lets go of the handlers and the remote.
   virtual void release() = 0;
 
-  /// To be called when the reply or the failure came.
-  void finish(NSErrorRef error);
   static void checkSize(capnp::MessageSize size);
 
  private:
   void run();
+  kj::Promise<void> send(AnyRequest request);
+  /// The reply or the failure came.
+  void finish(NSErrorRef error);
   /// False when the call is over already.
   bool settle(NSErrorRef error);
 
@@ -81,10 +84,11 @@ class PendingCall : public std::enable_shared_from_this<PendingCall> {
   bool settled_ = false;
   Deadlines::Entry deadline_;
   std::shared_ptr<PendingCall> self_;
+  kj::Maybe<capnp::Response<capnp::AnyPointer>> response_;
   kj::Maybe<kj::Promise<void>> task_;
 };
 
-/// The typed half of a call.
+/// The typed half of a call: as little as can be, since every call in the program has its own.
 template <typename Interface, typename Client, typename Params, typename Results, typename Fill,
           typename OnReply>
 class MethodCall final : public PendingCall {
@@ -100,26 +104,20 @@ class MethodCall final : public PendingCall {
         onReply_(std::move(onReply)) {}
 
  private:
-  kj::Promise<void> send() override {
+  AnyRequest makeRequest() override {
     if (!remote_) throw noConnectionError();
     typename Interface::Client& client = remote_.client();
     auto request = (client.*method_)(nullptr);
     (*fill_)(static_cast<typename Params::Builder&>(request));
     checkSize(request.totalSize());
-    return request.send().then(
-        [this](capnp::Response<Results>&& response) {
-          response_ = std::move(response);
-          finish(nullptr);
-        },
-        [this](kj::Exception&& exception) { finish(connectionError(exception)); });
+    return capnp::RequestHook::from(kj::mv(request));
   }
 
-  void reply(NSErrorRef error) override {
-    const typename Results::Reader* results = nullptr;
-    KJ_IF_MAYBE (response, response_) {
-      if (!error) results = response;
-    }
-    (*onReply_)(std::move(error), results);
+  void reply(NSErrorRef error, const AnyResults* results) override {
+    typename Results::Reader typed;
+    if (results != nullptr) typed = results->template getAs<Results>();
+    const typename Results::Reader* const given = results != nullptr ? &typed : nullptr;
+    (*onReply_)(std::move(error), given);
   }
 
   void release() override {
@@ -132,7 +130,6 @@ class MethodCall final : public PendingCall {
   Method method_;
   std::optional<Fill> fill_;
   std::optional<OnReply> onReply_;
-  kj::Maybe<capnp::Response<Results>> response_;
 };
 
 }  // namespace detail

@@ -1,5 +1,7 @@
 #include "platform/ipc/unix_socket.h"
 
+#include "platform/foundation/descriptor_path.h"
+
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/socket.h>
@@ -53,7 +55,7 @@ class SocketAddress {
     result.name_ = path.substr(slash + 1);
     std::string text = path;
     if (text.size() >= sizeof result.address_.sun_path) {
-      text = "/proc/self/fd/" + std::to_string(result.directory_.get()) + "/" + result.name_;
+      text = pathOfDescriptor(result.directory_.get()) + "/" + result.name_;
     }
     if (text.size() >= sizeof result.address_.sun_path) {
       storeError(error, socketError(ENAMETOOLONG, path,

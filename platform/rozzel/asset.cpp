@@ -1,24 +1,15 @@
 #include "platform/rozzel/asset.h"
 
+#include <span>
+
+#include "platform/foundation/hexadecimal.h"
+
 namespace yomber {
 
-namespace {
-
-constexpr std::string_view kDigits = "0123456789abcdef";
-
-}  // namespace
-
-std::string RZAsset::hexHash() const {
-  std::string text;
-  text.reserve(hash.size() * 2);
-  for (const std::uint8_t byte : hash) {
-    text += kDigits[byte >> 4U];
-    text += kDigits[byte & 15U];
-  }
-  return text;
-}
+std::string RZAsset::hexHash() const { return hexadecimal(std::as_bytes(std::span(hash))); }
 
 std::optional<RZAsset> RZAsset::fromHexHash(std::string_view hexHash, std::uint64_t size) {
+  constexpr std::string_view kDigits = "0123456789abcdef";
   RZAsset asset;
   asset.size = size;
   if (hexHash.size() != asset.hash.size() * 2) return std::nullopt;

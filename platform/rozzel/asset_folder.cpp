@@ -7,15 +7,16 @@
 
 #include <cerrno>
 #include <filesystem>
+#include <span>
 #include <utility>
 
+#include "platform/foundation/file_time.h"
+#include "platform/foundation/hexadecimal.h"
 #include "platform/rozzel/store_failure.h"
 
 namespace yomber {
 
 namespace {
-
-constexpr std::string_view kDigits = "0123456789abcdef";
 
 void makeFolder(const std::string& path) {
   if (mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) throwErrno("cannot make " + path);
@@ -41,7 +42,7 @@ void requireSize(const RZAsset& asset, const struct stat& status) {
 AssetFolder::AssetFolder(std::string storeFolder) : storeFolder_(std::move(storeFolder)) {}
 
 std::string AssetFolder::folderFor(std::uint8_t firstByte) const {
-  return storeFolder_ + "/assets/" + kDigits[firstByte >> 4U] + kDigits[firstByte & 15U];
+  return storeFolder_ + "/assets/" + hexadecimal(std::as_bytes(std::span(&firstByte, 1)));
 }
 
 std::string AssetFolder::pathFor(const RZAsset& asset) const {
@@ -98,8 +99,7 @@ AssetLock::AssetLock(const AssetFolder& folder, Kind kind)
 }
 
 void setModificationTime(const std::string& path, NSDate date) {
-  const auto seconds = date.nanoseconds() / 1'000'000'000;
-  const timespec time{.tv_sec = seconds, .tv_nsec = date.nanoseconds() - seconds * 1'000'000'000};
+  const timespec time = timespecOf(date.nanoseconds());
   const timespec times[2] = {time, time};
   if (utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
     throwErrno("cannot set the times of " + path);

@@ -2,7 +2,18 @@
 
 #include <utility>
 
+#include "platform/rozzel/fetch_records_operation.h"
+
 namespace yomber {
+namespace {
+
+/// Never destroyed: operations may still run while the process ends.
+AtomicCell<std::function<RZContainer::Session()>>& sessionSource() {
+  static auto& source = *new AtomicCell<std::function<RZContainer::Session()>>;
+  return source;
+}
+
+}  // namespace
 
 RZDatabase::RZDatabase(RZEngineRef engine, RZDatabaseID databaseID)
     : engine_(std::move(engine)), databaseID_(std::move(databaseID)) {}
@@ -49,9 +60,36 @@ NSErrorRef RZDatabase::queryRecords(const RZQuery& query, const std::string& cur
   return engine_->queryRecords(databaseID_, query, cursor, limit, page);
 }
 
+NSErrorRef RZDatabase::saveShare(const RZShare& share, RZShareRef& saved) {
+  return engine_->saveShare(databaseID_, share, saved);
+}
+
+NSErrorRef RZDatabase::destroyShare(const RZShare& share) {
+  return engine_->destroyShare(databaseID_, share);
+}
+
+NSErrorRef RZDatabase::fetchShare(const RZRecordZoneID& zoneID, RZShareRef& share) {
+  return engine_->fetchShare(databaseID_, zoneID, share);
+}
+
+void RZDatabase::addOperation(const std::shared_ptr<RZFetchRecordsOperation>& operation) {
+  operation->prepare(engine_, databaseID_);
+  operations_.addOperation(operation);
+}
+
 std::string RZDatabase::description() const {
   const char* const scope = databaseID_.scope == RZDatabaseScope::Private ? "private" : "shared";
   return std::string(scope) + " database of " + databaseID_.containerIdentifier;
+}
+
+void RZContainer::setSessionSource(std::function<Session()> source) {
+  sessionSource().store(std::move(source));
+}
+
+std::shared_ptr<RZContainer> RZContainer::containerWithIdentifier(const std::string& identifier) {
+  const auto source = sessionSource().load();
+  Session session = source ? source() : Session{};
+  return std::make_shared<RZContainer>(session.engine, identifier, std::move(session.accountName));
 }
 
 RZContainer::RZContainer(const RZEngineRef& engine, std::string containerIdentifier,
@@ -67,6 +105,10 @@ const RZDatabaseRef& RZContainer::databaseForZone(const RZRecordZoneID& zoneID) 
   const bool own =
       zoneID.ownerName() == RZCurrentUserDefaultName || zoneID.ownerName() == accountName_;
   return own ? private_ : shared_;
+}
+
+NSErrorRef RZContainer::acceptShare(const std::string& url, RZShareRef& share) const {
+  return private_->engine()->acceptShare(containerIdentifier_, accountName_, url, share);
 }
 
 std::string RZContainer::description() const { return "container " + containerIdentifier_; }

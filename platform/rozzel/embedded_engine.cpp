@@ -16,7 +16,10 @@
 #include "platform/rozzel/record_batch.h"
 #include "platform/rozzel/record_rows.h"
 #include "platform/rozzel/sha256.h"
+#include "platform/rozzel/share_rows.h"
 #include "platform/rozzel/sparse_file.h"
+#include "platform/rozzel/stream_hasher.h"
+#include "platform/rozzel/verified_copy.h"
 #include "platform/rozzel/zone_rows.h"
 
 namespace yomber {
@@ -28,6 +31,7 @@ using Kind = RecordsTransaction::Kind;
 FaultPoint whenBegun("rozzel.batch.begun");
 FaultPoint whenWritten("rozzel.batch.written");
 FaultPoint whenCommitted("rozzel.batch.committed");
+FaultPoint whenShareWritten("rozzel.share.written");
 
 void pass(FaultPoint& point) {
   if (point.hit()) throwErrno("saving records was told to fail", ENOSPC);
@@ -37,6 +41,18 @@ void requireOwner(const RZDatabaseID& database) {
   if (database.scope != RZDatabaseScope::Private) {
     throwFailure(RZErrorPermissionFailure, "only a zone's owner may do that");
   }
+}
+
+bool isReadable(int descriptor) {
+  const int flags = fcntl(descriptor, F_GETFL);
+  return flags >= 0 && (flags & O_ACCMODE) == O_RDWR;
+}
+
+NSErrorRef writtenToMeanwhile() {
+  return NSError::errorWithDomain(
+      NSPOSIXErrorDomain, EAGAIN,
+      {{NSLocalizedDescriptionKey,
+        std::string("somebody else wrote to the file while it was filled; try again")}});
 }
 
 std::string parentOf(const std::string& folder) {
@@ -49,6 +65,15 @@ void makeDatabase(const std::string& folder) {
                                kBusyMilliseconds);
   createRecordsSchema(connection);
   prepareRecordsSchema(connection);
+}
+
+/// `store` is a template because the store's class is private to the engine.
+template <typename Store>
+BatchWriter::Surroundings surroundings(Store& store, RecordsConnection& connection) {
+  return {.connection = connection,
+          .assets = store.assets(),
+          .now = store.now(),
+          .maximumTombstones = store.options().maximumTombstones};
 }
 
 }  // namespace
@@ -111,11 +136,7 @@ NSErrorRef EmbeddedEngine::modifyRecords(const RZDatabaseID& database, const RZR
   return store_->withConnection([&](RecordsConnection& connection) {
     RecordsTransaction transaction(connection, Kind::Write);
     pass(whenBegun);
-    BatchWriter writer({.connection = connection,
-                        .assets = store_->assets(),
-                        .now = store_->now(),
-                        .maximumTombstones = store_->options().maximumTombstones},
-                       database);
+    BatchWriter writer(surroundings(*store_, connection), database);
     std::vector<RZRecordRef> records = writer.write(batch);
     pass(whenWritten);
     transaction.commit();
@@ -166,6 +187,50 @@ NSErrorRef EmbeddedEngine::fetchMembers(const RZDatabaseID& database, const RZRe
   });
 }
 
+NSErrorRef EmbeddedEngine::saveShare(const RZDatabaseID& database, const RZShare& share,
+                                     RZShareRef& saved) {
+  return store_->withConnection([&](RecordsConnection& connection) {
+    requireOwner(database);
+    RecordsTransaction transaction(connection, Kind::Write);
+    RZShareRef stored = ShareWriter(surroundings(*store_, connection)).save(database, share);
+    pass(whenShareWritten);
+    transaction.commit();
+    saved = std::move(stored);
+  });
+}
+
+NSErrorRef EmbeddedEngine::destroyShare(const RZDatabaseID& database, const RZShare& share) {
+  return store_->withTransaction(Kind::Write, [&](RecordsConnection& connection) {
+    ShareWriter writer(surroundings(*store_, connection));
+    if (database.scope == RZDatabaseScope::Private) {
+      writer.destroy(database, share);
+    } else {
+      writer.leave(database, share.recordID().zoneID());
+    }
+    pass(whenShareWritten);
+  });
+}
+
+NSErrorRef EmbeddedEngine::fetchShare(const RZDatabaseID& database, const RZRecordZoneID& zoneID,
+                                      RZShareRef& share) {
+  return store_->withTransaction(Kind::Read, [&](RecordsConnection& connection) {
+    share = readShare(connection, requireZone(connection, database, zoneID));
+  });
+}
+
+NSErrorRef EmbeddedEngine::acceptShare(const std::string& containerIdentifier,
+                                       const std::string& accountName, const std::string& url,
+                                       RZShareRef& share) {
+  return store_->withConnection([&](RecordsConnection& connection) {
+    RecordsTransaction transaction(connection, Kind::Write);
+    RZShareRef accepted = ShareWriter(surroundings(*store_, connection))
+                              .accept(containerIdentifier, accountName, url);
+    pass(whenShareWritten);
+    transaction.commit();
+    share = std::move(accepted);
+  });
+}
+
 NSErrorRef EmbeddedEngine::setQuota(const std::string& accountName,
                                     std::optional<std::uint64_t> limit) {
   return store_->withTransaction(Kind::Write, [&](RecordsConnection& connection) {
@@ -199,15 +264,28 @@ NSErrorRef EmbeddedEngine::openAsset(const RZAsset& asset, FileDescriptor& descr
   });
 }
 
+NSErrorRef EmbeddedEngine::localFile(const RZAsset& asset, std::string& path) {
+  return catchingFailures([&] {
+    store_->assets().require(asset);
+    path = store_->assets().pathFor(asset);
+  });
+}
+
 NSErrorRef EmbeddedEngine::copyAsset(const RZAsset& asset, int descriptor,
                                      const RZTransfer& transfer) {
   FileDescriptor source;
   if (NSErrorRef error = openAsset(asset, source)) return error;
+  const bool isLarge = asset.size > StreamHasher::kBufferBytes && isReadable(descriptor);
+  const auto copy = isLarge ? rz_copyAndHashTarget : rz_copyAndHashFile;
   RZAsset copied;
-  if (NSErrorRef error = rz_copyAndHashFile(source.get(), descriptor, transfer, copied)) {
-    return error;
+  if (NSErrorRef error = copy(source.get(), descriptor, transfer, copied)) return error;
+  if (copied == asset) return nullptr;
+  RZAsset found = copied;
+  if (isLarge) {
+    if (NSErrorRef error = rz_hashFile(source.get(), {}, found)) return error;
   }
-  return catchingFailures([&] { AssetFolder::requireSame(asset, copied); });
+  return found == asset ? writtenToMeanwhile()
+                        : catchingFailures([&] { AssetFolder::requireSame(asset, found); });
 }
 
 NSErrorRef EmbeddedEngine::readAsset(const RZAsset& asset, std::uint64_t maximumSize,

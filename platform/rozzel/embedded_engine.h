@@ -67,11 +67,21 @@ class EmbeddedEngine final : public RZEngine {
                                         const std::string& accountName) override;
   [[nodiscard]] NSErrorRef fetchMembers(const RZDatabaseID& database, const RZRecordZoneID& zoneID,
                                         std::vector<RZZoneMember>& members) override;
+  [[nodiscard]] NSErrorRef saveShare(const RZDatabaseID& database, const RZShare& share,
+                                     RZShareRef& saved) override;
+  [[nodiscard]] NSErrorRef destroyShare(const RZDatabaseID& database,
+                                        const RZShare& share) override;
+  [[nodiscard]] NSErrorRef fetchShare(const RZDatabaseID& database, const RZRecordZoneID& zoneID,
+                                      RZShareRef& share) override;
+  [[nodiscard]] NSErrorRef acceptShare(const std::string& containerIdentifier,
+                                       const std::string& accountName, const std::string& url,
+                                       RZShareRef& share) override;
   [[nodiscard]] NSErrorRef setQuota(const std::string& accountName,
                                     std::optional<std::uint64_t> limit) override;
   [[nodiscard]] NSErrorRef fetchQuota(const std::string& accountName, RZQuota& quota) override;
   [[nodiscard]] std::unique_ptr<RZAssetGroup> newAssetGroup(NSErrorRef* error) override;
   [[nodiscard]] NSErrorRef openAsset(const RZAsset& asset, FileDescriptor& descriptor) override;
+  [[nodiscard]] NSErrorRef localFile(const RZAsset& asset, std::string& path) override;
   [[nodiscard]] NSErrorRef copyAsset(const RZAsset& asset, int descriptor,
                                      const RZTransfer& transfer) override;
   [[nodiscard]] NSErrorRef readAsset(const RZAsset& asset, std::uint64_t maximumSize,

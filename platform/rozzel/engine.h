@@ -14,14 +14,16 @@
 #include "platform/rozzel/errors.h"
 #include "platform/rozzel/identifiers.h"
 #include "platform/rozzel/record.h"
+#include "platform/rozzel/share.h"
 
 namespace yomber {
 
 /// What every engine takes at least; beyond it a call may fail with RZErrorLimitExceeded.
 inline constexpr std::size_t RZMaximumNameBytes = 255;  // zone, record and account names, keys
-inline constexpr std::size_t RZMaximumRecordBytes = 1 << 20;  // all keys and values; not assets
-inline constexpr std::size_t RZMaximumBatchRecords = 2000;    // saves and deletions together
-inline constexpr std::size_t RZMaximumPageRecords = 1000;     // larger limits are read as this
+inline constexpr std::size_t RZMaximumRecordBytes = 1 << 20;     // all keys and values; not assets
+inline constexpr std::size_t RZMaximumBatchRecords = 2000;       // saves and deletions together
+inline constexpr std::size_t RZMaximumPageRecords = 1000;        // larger limits are read as this
+inline constexpr std::size_t RZMaximumShareParticipants = 1000;  // the owner among them
 
 enum class RZZonePermission { ReadOnly, ReadWrite };
 
@@ -226,7 +228,9 @@ class RZEngine {
   /// in the order of `recordsToSave`. Fails with the first refused record's error (see
   /// `rz_failedRecords` for all of them), among others RZErrorServerRecordChanged,
   /// RZErrorZoneNotFound, RZErrorQuotaExceeded, RZErrorAssetMissing (an asset was not committed
-  /// before) and RZErrorPermissionFailure.
+  /// before) and RZErrorPermissionFailure. A record that is damaged in the store, so that reading
+  /// it is RZErrorStoreDamaged, is saved over as one without values, and deleted as any other.
+  /// Shares are not changed by this.
   [[nodiscard]] virtual NSErrorRef modifyRecords(const RZDatabaseID& database,
                                                  const RZRecordBatch& batch,
                                                  std::vector<RZRecordRef>& saved) = 0;
@@ -260,6 +264,44 @@ class RZEngine {
                                                 const RZRecordZoneID& zoneID,
                                                 std::vector<RZZoneMember>& members) = 0;
 
+  // Shares: records that say who sees a zone. They are read and told of as any other record, and
+  // changed by these calls alone. A share's members are the members of its zone: whoever has
+  // accepted it and has a permission. Membership follows in the same step.
+
+  /// Saves the share of one of the account's own zones, which is made if it is not there. `saved`
+  /// is the share as the store has it now.
+  ///
+  /// Fails with RZErrorServerRecordChanged (`rz_serverRecord` is then the share as it is) when its
+  /// change tag is not the store's, RZErrorUnknownItem when it was destroyed,
+  /// RZErrorInvalidArguments or RZErrorLimitExceeded for participants that no share can have,
+  /// RZErrorPermissionFailure in the shared database. The owner is always the first participant.
+  ///
+  /// What participants have agreed to is not the saver's to say: somebody new is Pending, whoever
+  /// has accepted stays Accepted until he is left out, Removed or given no permission; whoever was
+  /// Removed is asked again when he is saved as anything else. Whoever came by the link has the
+  /// public permission as long as nobody gives him another.
+  [[nodiscard]] virtual NSErrorRef saveShare(const RZDatabaseID& database, const RZShare& share,
+                                             RZShareRef& saved) = 0;
+  /// The owner's (private database): the share and all membership end, its URL leads nowhere any
+  /// more; the zone and its other records stay. RZErrorServerRecordChanged when somebody saved the
+  /// share meanwhile. A participant's (shared database): he leaves, and is Removed.
+  /// When there is nothing to destroy, or to leave, that is no error.
+  [[nodiscard]] virtual NSErrorRef destroyShare(const RZDatabaseID& database,
+                                                const RZShare& share) = 0;
+  /// The share of a zone. RZErrorUnknownItem: it has none; RZErrorZoneNotFound: it is not there, or
+  /// the account may not see it.
+  [[nodiscard]] virtual NSErrorRef fetchShare(const RZDatabaseID& database,
+                                              const RZRecordZoneID& zoneID, RZShareRef& share) = 0;
+  /// Makes the account a member of the zone whose share has that URL: somebody whom the owner added
+  /// with the permission that he was given, anybody else with the public permission. Doing so again
+  /// is no error. `share` is as the account sees it.
+  ///
+  /// RZErrorUnknownItem: there is no such share (any more). RZErrorPermissionFailure: it is not for
+  /// this account.
+  [[nodiscard]] virtual NSErrorRef acceptShare(const std::string& containerIdentifier,
+                                               const std::string& accountName,
+                                               const std::string& url, RZShareRef& share) = 0;
+
   // Quota of an account.
 
   [[nodiscard]] virtual NSErrorRef setQuota(const std::string& accountName,
@@ -273,10 +315,16 @@ class RZEngine {
   /// A descriptor for reading the content from its start. Only presence and size are checked: who
   /// needs certainty hashes what it reads, or uses `copyAsset`.
   [[nodiscard]] virtual NSErrorRef openAsset(const RZAsset& asset, FileDescriptor& descriptor) = 0;
-  /// Writes the content into `descriptor` (a regular file open for writing) at the same offsets,
-  /// and verifies it on the way. The asset's holes are not written, so the file must read as zeros
-  /// there; its size is not set. On RZErrorAssetDamaged wrong bytes have been written: the caller
-  /// must not let anyone read them.
+  /// Where the content can be read on this machine, in place of a copy: a file that is never
+  /// written to, and stays while a committed record refers to the asset. Presence and size are
+  /// checked, as above.
+  [[nodiscard]] virtual NSErrorRef localFile(const RZAsset& asset, std::string& path) = 0;
+  /// Writes the content into `descriptor` (a regular file open for writing; quicker when it is open
+  /// for reading too) at the same offsets, and verifies it on the way. The asset's holes are not
+  /// written, so the file must read as zeros there; its size is not set. On RZErrorAssetDamaged
+  /// wrong bytes have been written: the caller must not let anyone read them. So it is with
+  /// NSPOSIXErrorDomain EAGAIN, when somebody else wrote to the file meanwhile and that was
+  /// noticed.
   [[nodiscard]] virtual NSErrorRef copyAsset(const RZAsset& asset, int descriptor,
                                              const RZTransfer& transfer) = 0;
   /// The verified content of a small asset in memory; larger than `maximumSize`:

@@ -24,6 +24,8 @@ enum RZErrorCode : std::int64_t {
   RZErrorInvalidArguments = 1,
   /// Later. The store is out of reach. Nothing is known about what it holds.
   RZErrorNetworkUnavailable = 2,
+  /// Nobody is signed in, so there is no account to ask for.
+  RZErrorNotAuthenticated = 9,
   /// There is no such record (any more).
   RZErrorUnknownItem = 11,
   /// The account may not do that, e.g. write to a zone that is shared with it read-only.

@@ -32,12 +32,15 @@ class HashingPass {
     if (size > StreamHasher::kBufferBytes) {
       posix_fadvise(source_, 0, 0, POSIX_FADV_SEQUENTIAL);
     }
+    // One byte more tells that the file has grown.
+    hasher_.emplace(
+        static_cast<std::size_t>(std::min<std::uint64_t>(size + 1, StreamHasher::kBufferBytes)));
     if (static_cast<std::uint64_t>(status.st_blocks) * 512 < size) {
       passSparse();
     } else {
       passData(std::numeric_limits<std::uint64_t>::max());
     }
-    return hasher_.finish();
+    return hasher_->finish();
   }
 
  private:
@@ -59,7 +62,7 @@ class HashingPass {
   void passHole(std::uint64_t end) {
     while (offset_ < end) {
       const std::uint64_t step = std::min(end - offset_, kZeroStep);
-      hasher_.submitZeros(step);
+      hasher_->submitZeros(step);
       advance(step);
     }
   }
@@ -67,12 +70,12 @@ class HashingPass {
   /// False at the end of the file.
   bool passData(std::uint64_t end) {
     while (offset_ < end) {
-      const auto buffer = hasher_.buffer();
+      const auto buffer = hasher_->buffer();
       const auto wanted =
           static_cast<std::size_t>(std::min<std::uint64_t>(buffer.size(), end - offset_));
       const std::size_t count = readFully(source_, buffer.first(wanted), offset_);
       if (count == 0) return false;
-      hasher_.submit(count);
+      hasher_->submit(count);
       if (target_) writeSparsely(*target_, buffer.first(count), offset_);
       advance(count);
       if (count < wanted) return false;
@@ -88,7 +91,7 @@ class HashingPass {
   const int source_;
   const std::optional<int> target_;
   const RZTransfer& transfer_;
-  StreamHasher hasher_;
+  std::optional<StreamHasher> hasher_;
   std::uint64_t offset_ = 0;
 };
 

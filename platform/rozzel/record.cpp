@@ -20,11 +20,13 @@ const RZValue* RZRecord::objectForKey(std::string_view key) const {
 
 void RZRecord::setObject(RZValue object, const std::string& key) {
   values_.insert_or_assign(key, std::move(object));
+  assetFiles_.erase(key);
   changedKeys_.insert(key);
 }
 
 void RZRecord::removeObjectForKey(const std::string& key) {
   values_.erase(key);
+  assetFiles_.erase(key);
   changedKeys_.insert(key);
 }
 
@@ -34,6 +36,15 @@ std::vector<RZAsset> RZRecord::assets() const {
     if (const auto* const asset = std::get_if<RZAsset>(&value)) result.push_back(*asset);
   }
   return result;
+}
+
+std::optional<std::string> RZRecord::assetFile(std::string_view key) const {
+  const auto found = assetFiles_.find(key);
+  return found != assetFiles_.end() ? std::optional(found->second) : std::nullopt;
+}
+
+void RZRecord::setAssetFile(std::string path, const std::string& key) {
+  assetFiles_.insert_or_assign(key, std::move(path));
 }
 
 std::string RZRecord::description() const {

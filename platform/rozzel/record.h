@@ -77,6 +77,12 @@ class RZRecord : public NSObject {
   void setObject(RZValue object, const std::string& key);
   void removeObjectForKey(const std::string& key);
 
+  /// The file on this machine that holds the asset under `key`, to be read and never written to.
+  /// Nil: its content is not here, or the record did not come from an RZFetchRecordsOperation.
+  [[nodiscard]] std::optional<std::string> assetFile(std::string_view key) const;
+  /// For what fetches records.
+  void setAssetFile(std::string path, const std::string& key);
+
   [[nodiscard]] const RZValues& values() const { return values_; }
   /// Keys set or removed since the record was made or came from the store.
   [[nodiscard]] const std::set<std::string>& changedKeys() const { return changedKeys_; }
@@ -91,6 +97,7 @@ class RZRecord : public NSObject {
   RZValues values_;
   std::set<std::string> changedKeys_;
   Stamp stamp_;
+  std::map<std::string, std::string, std::less<>> assetFiles_;
 };
 
 }  // namespace yomber

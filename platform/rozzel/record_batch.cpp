@@ -25,8 +25,14 @@ void checkRecordID(const RZDatabaseID& database, const RZRecordID& id, std::set<
   }
 }
 
+[[noreturn]] void refuseShare(const RZRecordID& id) {
+  throwFailure(RZErrorInvalidArguments,
+               id.description() + " is a share; save it, or destroy it, as one");
+}
+
 void checkRecord(const RZRecord& record) {
   checkName(record.recordType(), "the type of a record");
+  if (record.recordType() == RZShareRecordType) refuseShare(record.recordID());
   for (const auto& [key, value] : record.values()) checkName(key, "a key of a record");
 }
 
@@ -46,12 +52,6 @@ std::string encodeChecked(const RZRecord& record) {
                                            "; put large values into assets");
   }
   return body;
-}
-
-[[noreturn]] void throwChanged(const RZRecordRef& server) {
-  throw StoreFailure{rz_error(RZErrorServerRecordChanged,
-                              server->recordID().description() + " was changed by another",
-                              {{RZErrorServerRecordKey, NSObjectRef(server)}})};
 }
 
 /// The values after a save over `current`.
@@ -93,6 +93,7 @@ BatchWriter::BatchWriter(const Surroundings& surroundings, const RZDatabaseID& d
       assets_(surroundings.assets),
       now_(surroundings.now),
       maximumTombstones_(surroundings.maximumTombstones),
+      mayDeleteShares_(surroundings.mayDeleteShares),
       database_(database) {}
 
 std::vector<RZRecordRef> BatchWriter::write(const RZRecordBatch& batch) {
@@ -140,7 +141,7 @@ ZoneRow& BatchWriter::writableZone(const RZRecordZoneID& zoneID) {
 
 RZRecordRef BatchWriter::save(const RZRecord& record, RZRecordSavePolicy policy) {
   ZoneRow& zone = writableZone(record.recordID().zoneID());
-  const auto row = findRecord(connection_, zone, record.recordID().recordName(), std::nullopt);
+  const auto row = findRecordToChange(connection_, zone, record.recordID().recordName());
   const bool guarded = policy == RZRecordSavePolicy::IfServerRecordUnchanged;
   if (!row) {
     if (guarded && !record.changeTag().empty()) {
@@ -148,7 +149,7 @@ RZRecordRef BatchWriter::save(const RZRecord& record, RZRecordSavePolicy policy)
     }
     return insert(zone, record);
   }
-  if (guarded && record.changeTag() != row->record->changeTag()) throwChanged(row->record);
+  if (guarded && record.changeTag() != row->record->changeTag()) throwChanged(*row);
   return update(zone, *row, record, policy);
 }
 
@@ -194,10 +195,13 @@ RZRecordRef BatchWriter::update(ZoneRow& zone, const RecordRow& row, const RZRec
 
 void BatchWriter::remove(const RZRecordDeletion& deletion) {
   ZoneRow& zone = writableZone(deletion.recordID.zoneID());
-  const auto row = findRecord(connection_, zone, deletion.recordID.recordName(), std::nullopt);
+  const auto row = findRecordToChange(connection_, zone, deletion.recordID.recordName());
   if (!row) return;
+  if (row->record->recordType() == RZShareRecordType && !mayDeleteShares_) {
+    refuseShare(deletion.recordID);
+  }
   if (!deletion.changeTag.empty() && deletion.changeTag != row->record->changeTag()) {
-    throwChanged(row->record);
+    throwChanged(*row);
   }
   useAssets({}, row->record->assets());
   zone.charge -= row->charge;
@@ -265,6 +269,20 @@ void BatchWriter::checkQuotas() {
                                              "; delete something, or raise the quota");
     }
   }
+}
+
+void throwChanged(const RecordRow& row) {
+  const RZRecordRef& server = row.record;
+  if (row.isDamaged) {
+    // What it was changed to cannot be shown.
+    throwFailure(
+        RZErrorServerRecordChanged,
+        server->recordID().description() +
+            " was changed by another, and is damaged; save it with all keys, or delete it");
+  }
+  throw StoreFailure{rz_error(RZErrorServerRecordChanged,
+                              server->recordID().description() + " was changed by another",
+                              {{RZErrorServerRecordKey, NSObjectRef(server)}})};
 }
 
 void releaseAsset(RecordsConnection& connection, const RZAsset& asset, NSDate now) {

@@ -28,6 +28,8 @@ class BatchWriter {
     const AssetFolder& assets;
     NSDate now;
     std::size_t maximumTombstones;
+    /// Whether records that are shares may be deleted.
+    bool mayDeleteShares = false;
   };
 
   BatchWriter(const Surroundings& surroundings, const RZDatabaseID& database);
@@ -51,10 +53,14 @@ class BatchWriter {
   const AssetFolder& assets_;
   const NSDate now_;
   const std::size_t maximumTombstones_;
+  const bool mayDeleteShares_;
   const RZDatabaseID& database_;
   std::map<RZRecordZoneID, ZoneRow> zones_;
   std::map<std::string, std::int64_t> chargesBefore_;
 };
+
+/// What a save is refused with when the store has another version of the record.
+[[noreturn]] void throwChanged(const RecordRow& row);
 
 /// One use of an asset less. Shared with what clears deleted zones away.
 void releaseAsset(RecordsConnection& connection, const RZAsset& asset, NSDate now);

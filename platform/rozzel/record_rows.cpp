@@ -18,8 +18,10 @@ constexpr std::size_t kPageBytes = 8 << 20;
 /// What every statement that reads records selects, in this order.
 #define RECORD_COLUMNS "id, sequence, name, type, created, modified, charge, body"
 
-RecordRow recordFromRow(RecordsQuery& query, const ZoneRow& zone,
-                        const RZDesiredKeys& desiredKeys) {
+constexpr const char* kRecordByName =
+    "SELECT " RECORD_COLUMNS " FROM record WHERE zone=?1 AND name=?2";
+
+RecordRow recordFromRow(RecordsQuery& query, const ZoneRow& zone, RZValues values) {
   const std::int64_t sequence = query->integer(1);
   RZRecord::Stamp stamp{.changeTag = changeTagFor(zone.id, sequence),
                         .creationDate = NSDate::fromNanoseconds(query->integer(4)),
@@ -29,7 +31,12 @@ RecordRow recordFromRow(RecordsQuery& query, const ZoneRow& zone,
           .charge = query->integer(6),
           .record = std::make_shared<RZRecord>(
               std::string(query->bytes(3)), RZRecordID(std::string(query->bytes(2)), zone.zoneID),
-              decodeRecordValues(query->bytes(7), desiredKeys), std::move(stamp))};
+              std::move(values), std::move(stamp))};
+}
+
+RecordRow recordFromRow(RecordsQuery& query, const ZoneRow& zone,
+                        const RZDesiredKeys& desiredKeys) {
+  return recordFromRow(query, zone, decodeRecordValues(query->bytes(7), desiredKeys));
 }
 
 std::size_t bodyBytes(RecordsQuery& query) { return query->bytes(7).size(); }
@@ -149,11 +156,22 @@ RZQueryPage pageFromRows(RecordsQuery rows, const ZoneRow& zone, const RZDesired
 
 std::optional<RecordRow> findRecord(RecordsConnection& connection, const ZoneRow& zone,
                                     const std::string& name, const RZDesiredKeys& desiredKeys) {
-  RecordsQuery query(connection.prepared("SELECT " RECORD_COLUMNS " FROM record "
-                                         "WHERE zone=?1 AND name=?2"),
-                     zone.id, name);
+  RecordsQuery query(connection.prepared(kRecordByName), zone.id, name);
   if (!query.step()) return std::nullopt;
   return recordFromRow(query, zone, desiredKeys);
+}
+
+std::optional<RecordRow> findRecordToChange(RecordsConnection& connection, const ZoneRow& zone,
+                                            const std::string& name) {
+  RecordsQuery query(connection.prepared(kRecordByName), zone.id, name);
+  if (!query.step()) return std::nullopt;
+  RZValues values;
+  const NSErrorRef damage =
+      catchingFailures([&] { values = decodeRecordValues(query->bytes(7), std::nullopt); });
+  if (damage && !rz_isError(damage, RZErrorStoreDamaged)) throw StoreFailure{damage};
+  RecordRow row = recordFromRow(query, zone, damage ? RZValues() : std::move(values));
+  row.isDamaged = damage != nullptr;
+  return row;
 }
 
 std::vector<RZFetchedRecord> readRecords(RecordsConnection& connection,

@@ -18,6 +18,7 @@ struct RecordRow {
   std::int64_t sequence = 0;
   std::int64_t charge = 0;
   RZRecordRef record;
+  bool isDamaged = false;  ///< its values cannot be read: the record has none
 };
 
 // Failures are StoreFailure, here and below.
@@ -25,6 +26,11 @@ struct RecordRow {
 [[nodiscard]] std::optional<RecordRow> findRecord(RecordsConnection& connection,
                                                   const ZoneRow& zone, const std::string& name,
                                                   const RZDesiredKeys& desiredKeys);
+
+/// The same with all values, for changing it: a damaged one is found as well.
+[[nodiscard]] std::optional<RecordRow> findRecordToChange(RecordsConnection& connection,
+                                                          const ZoneRow& zone,
+                                                          const std::string& name);
 
 [[nodiscard]] std::vector<RZFetchedRecord> readRecords(RecordsConnection& connection,
                                                        const RZDatabaseID& database,

@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/rozzel/records_connection.h"
 #include "platform/rozzel/test_store.h"
 
 namespace yomber {
@@ -322,6 +323,60 @@ TEST(RecordStoreTest, LetsMembersWriteOnlyWhereTheyMay) {
   std::vector<RZZoneMember> members;
   ASSERT_EQ(engine.fetchMembers(ann->databaseID(), kZone, members), nullptr);
   EXPECT_EQ(members, (std::vector<RZZoneMember>{{"bob", RZZonePermission::ReadWrite}}));
+}
+
+/// Damages the stored values of the record.
+void damage(const TestStore& store, const std::string& name) {
+  RecordsConnection connection(store.folder() + "/records.db", RecordsConnection::Missing::Fail,
+                               1000);
+  const std::string sql =
+      "UPDATE record SET body=x'ff00ff' WHERE CAST(name AS TEXT)='" + name + "'";
+  connection.execute(sql.c_str());
+  ASSERT_EQ(connection.changes(), 1);
+}
+
+NSErrorRef whyNotRead(const TestStore& store, const std::string& name) {
+  NSErrorRef error;
+  EXPECT_EQ(store.database()->fetchRecord(recordID(name), &error), nullptr);
+  return error;
+}
+
+TEST(RecordStoreTest, ADamagedRecordIsReadByNobodyAndSavedOverByAnybody) {
+  TestStore store;
+  const auto database = store.database();
+  ASSERT_EQ(save(database, {newRecord("a", {{"x", "1"}, {"y", "2"}}), newRecord("b")}), nullptr);
+  const auto known = std::make_shared<RZRecord>(*fetch(database, "a"));
+  RZQuota before;
+  ASSERT_EQ(store.engine()->fetchQuota("ann", before), nullptr);
+  damage(store, "a");
+  EXPECT_TRUE(rz_isError(whyNotRead(store, "a"), RZErrorStoreDamaged));
+  EXPECT_NE(fetch(database, "b"), nullptr);
+
+  // One that knew it as it was may go on; one that did not is told what to do.
+  known->setObject("3", "x");
+  EXPECT_TRUE(rz_isError(save(database, {newRecord("a")}), RZErrorServerRecordChanged));
+  ASSERT_EQ(save(database, {known}), nullptr);
+  EXPECT_EQ(*fetch(database, "a")->valueForKey<std::string>("x"), "3");
+
+  damage(store, "a");
+  ASSERT_EQ(save(database, {newRecord("a", {{"x", "1"}, {"y", "2"}})}, RZRecordSavePolicy::AllKeys),
+            nullptr);
+  EXPECT_EQ(fetch(database, "a")->values(), newRecord("a", {{"x", "1"}, {"y", "2"}})->values());
+  RZQuota after;
+  ASSERT_EQ(store.engine()->fetchQuota("ann", after), nullptr);
+  EXPECT_EQ(after.used, before.used);
+}
+
+TEST(RecordStoreTest, ADamagedRecordCanBeDeleted) {
+  TestStore store;
+  const auto database = store.database();
+  ASSERT_EQ(save(database, {newRecord("a", {{"x", "1"}})}), nullptr);
+  damage(store, "a");
+  ASSERT_EQ(remove(database, recordID("a")), nullptr);
+  EXPECT_TRUE(rz_isError(whyNotRead(store, "a"), RZErrorUnknownItem));
+  RZQuota quota;
+  ASSERT_EQ(store.engine()->fetchQuota("ann", quota), nullptr);
+  EXPECT_EQ(quota.used, 0U);
 }
 
 TEST(RecordStoreTest, RefusesASaveBeyondTheQuotaAndChangesNothing) {

@@ -70,9 +70,15 @@ constexpr const char* kMembers = R"sql(
   CREATE INDEX member_account ON member(account);
 )sql";
 
+/// From 2 to 3: the tokens of shares' URLs, and which zones they lead to.
+constexpr const char* kShares = R"sql(
+  CREATE TABLE share(zone INTEGER PRIMARY KEY, token BLOB NOT NULL);
+  CREATE UNIQUE INDEX share_token ON share(token);
+)sql";
+
 /// What leads from one version to the next. Never changed once it was in use; a new store goes
 /// the same way.
-constexpr std::array kMigrations = {kMembers};
+constexpr std::array kMigrations = {kMembers, kShares};
 
 constexpr std::int64_t kCurrentVersion = 1 + static_cast<std::int64_t>(kMigrations.size());
 

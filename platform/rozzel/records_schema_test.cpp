@@ -123,6 +123,23 @@ TEST(RecordsSchemaTest, AddsMembersToAStoreOfVersion1) {
             nullptr);
 }
 
+TEST(RecordsSchemaTest, AddsSharesToAStoreOfVersion2AndKeepsItsMembers) {
+  OldStore store;
+  store.close();
+  runSql(databaseOf(store), kVersion2Additions);
+  ASSERT_EQ(versionOf(databaseOf(store)), 2);
+  store.reopen();
+  const RZRecordZoneID asBobSeesIt("documents", "ann");
+  EXPECT_NE(fetch(store.sharedDatabase("bob"), "root", asBobSeesIt), nullptr);
+  EXPECT_EQ(versionOf(databaseOf(store)), recordsSchemaVersion());
+  const RZRecordZoneID zone("pictures");
+  const RZShare share(recordID("root", zone), RZShareTypeFolder, "Pictures", "ann");
+  RZShareRef saved;
+  ASSERT_EQ(store.database()->saveShare(share, saved), nullptr);
+  EXPECT_TRUE(saved->URL());
+  EXPECT_NE(fetch(store.sharedDatabase("bob"), "root", asBobSeesIt), nullptr);
+}
+
 TEST(RecordsSchemaTest, GivesMigratedAndNewStoresTheSameTables) {
   OldStore old;
   TestStore fresh;

@@ -14,6 +14,7 @@ namespace yomber {
 /// hash itself is the thread's while buffers wait, and the caller's while none does.
 class StreamHasher::Worker {
  public:
+  explicit Worker(std::size_t bufferBytes) : bufferBytes_(bufferBytes) {}
   ~Worker() {
     {
       LockGuard guard(mutex_);
@@ -25,9 +26,9 @@ class StreamHasher::Worker {
 
   std::span<std::byte> buffer() {
     auto& slot = buffers_[filled_ % kBuffers];
-    if (!slot) slot = std::make_unique_for_overwrite<std::byte[]>(kBufferBytes);
+    if (!slot) slot = std::make_unique_for_overwrite<std::byte[]>(bufferBytes_);
     waitUntilWaiting(kBuffers - 1);
-    return {slot.get(), kBufferBytes};
+    return {slot.get(), bufferBytes_};
   }
 
   void submit(std::size_t count) {
@@ -89,6 +90,7 @@ class StreamHasher::Worker {
     }
   }
 
+  const std::size_t bufferBytes_;
   Mutex mutex_;
   Condition changed_;
   std::uint64_t submitted_ GUARDED_BY(mutex_) = 0;
@@ -105,7 +107,8 @@ class StreamHasher::Worker {
   std::thread thread_;
 };
 
-StreamHasher::StreamHasher() : worker_(std::make_unique<Worker>()) {}
+StreamHasher::StreamHasher(std::size_t bufferBytes)
+    : worker_(std::make_unique<Worker>(bufferBytes)) {}
 StreamHasher::~StreamHasher() = default;
 std::span<std::byte> StreamHasher::buffer() { return worker_->buffer(); }
 void StreamHasher::submit(std::size_t count) { worker_->submit(count); }

@@ -21,12 +21,13 @@ class StreamHasher {
   static constexpr std::size_t kBufferBytes = 256 << 10;
   static constexpr std::size_t kBuffers = 4;
 
-  StreamHasher();
+  /// Buffers may be made smaller for a stream that is known to be short.
+  explicit StreamHasher(std::size_t bufferBytes = kBufferBytes);
   ~StreamHasher();
   StreamHasher(const StreamHasher&) = delete;
   StreamHasher& operator=(const StreamHasher&) = delete;
 
-  /// A buffer of kBufferBytes to fill, the same one until it is submitted; waits while all are
+  /// A buffer to fill, the same one until it is submitted; waits while all are
   /// being hashed.
   [[nodiscard]] std::span<std::byte> buffer();
   /// Hashes the first `count` bytes of the current buffer.

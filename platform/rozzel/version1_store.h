@@ -70,6 +70,20 @@ PRAGMA application_id=1381659508;
 PRAGMA user_version=1;
 )sql";
 
+/// What makes a store of version 2 of it, in which bob reads ann's documents. Never changed either.
+inline constexpr const char* kVersion2Additions = R"sql(
+BEGIN TRANSACTION;
+CREATE TABLE member(
+    zone INTEGER NOT NULL,
+    account BLOB NOT NULL,
+    permission INTEGER NOT NULL,
+    PRIMARY KEY(zone, account)) WITHOUT ROWID;
+INSERT INTO member VALUES(1,X'626f62',0);
+CREATE INDEX member_account ON member(account);
+COMMIT;
+PRAGMA user_version=2;
+)sql";
+
 /// The change token that a reader of its zone "documents" had kept, in hexadecimal.
 inline constexpr const char* kVersion1Token = "010f158a363ac19f54010404e1eb20126bbf3aad";
 

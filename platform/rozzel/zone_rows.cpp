@@ -128,7 +128,8 @@ void insertZone(RecordsConnection& connection, const RZDatabaseID& database,
 
 void killZone(RecordsConnection& connection, const ZoneRow& zone) {
   RecordsQuery(connection.prepared("UPDATE zone SET dead=1 WHERE id=?1"), zone.id).run();
-  RecordsQuery(connection.prepared("DELETE FROM member WHERE zone=?1"), zone.id).run();
+  deleteMembers(connection, zone);
+  RecordsQuery(connection.prepared("DELETE FROM share WHERE zone=?1"), zone.id).run();
 }
 
 void updateZone(RecordsConnection& connection, const ZoneRow& zone) {
@@ -155,6 +156,10 @@ void deleteMember(RecordsConnection& connection, const ZoneRow& zone,
   RecordsQuery(connection.prepared("DELETE FROM member WHERE zone=?1 AND account=?2"), zone.id,
                accountName)
       .run();
+}
+
+void deleteMembers(RecordsConnection& connection, const ZoneRow& zone) {
+  RecordsQuery(connection.prepared("DELETE FROM member WHERE zone=?1"), zone.id).run();
 }
 
 std::vector<RZZoneMember> listMembers(RecordsConnection& connection, const ZoneRow& zone) {

@@ -52,6 +52,7 @@ void updateZone(RecordsConnection& connection, const ZoneRow& zone);
 void insertMember(RecordsConnection& connection, const ZoneRow& zone, const RZZoneMember& member);
 void deleteMember(RecordsConnection& connection, const ZoneRow& zone,
                   const std::string& accountName);
+void deleteMembers(RecordsConnection& connection, const ZoneRow& zone);
 [[nodiscard]] std::vector<RZZoneMember> listMembers(RecordsConnection& connection,
                                                     const ZoneRow& zone);
 

@@ -62,6 +62,12 @@ interface Content {
   # What is under way at the moment, at most 1000; how many jobs wait; how many have ended since zarn
   # started.
 
+  startDownloading @14 (paths :List(Data), options :UInt64) -> (failure :Common.OptionalError);
+  # Has the content of items brought here, and answers as soon as that has begun: nobody waits for it,
+  # and it is not taken back. What is here already stays as it is. Fails, having begun nothing, when
+  # there is nothing at one of the locations. Option 4: it is not the user who asked; the others are
+  # reserved. At most 1000 locations.
+
   struct LocationResult {
     union {
       path @0 :Data;

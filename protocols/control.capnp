@@ -9,6 +9,8 @@ using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
 using Common = import "common.capnp";
 using Changes = import "changes.capnp".Changes;
+using Services = import "services.capnp";
+using ThumbnailReceiver = import "thumbnails.capnp".ThumbnailReceiver;
 
 interface Control {
   item @0 (identifier :Text) -> (result :ItemResult);
@@ -42,6 +44,25 @@ interface Control {
   movingItem @10 (path :Data, destination :Data)
       -> (requiresProviding :Bool, failure :Common.OptionalError);
   # Whether the content has to be here before the item is moved.
+
+  # --- Thumbnails.
+
+  fetchThumbnails @11 (identifiers :List(Text), width :Float64, height :Float64,
+                       receiver :ThumbnailReceiver) -> (failure :Common.OptionalError);
+  # Tells of each of the items once, as soon as its thumbnail is known, or that it has none. The size
+  # is in points. Answered when the receiver took the last one; a failure is the last of several, and
+  # of an item that it befell the receiver was told as well. Dropping the call ends it. At most
+  # 100,000 items.
+
+  # --- Services of an item.
+
+  services @12 (identifier :Text)
+      -> (services :List(Services.Service), failure :Common.OptionalError);
+  # What programs can ask of the item beyond this protocol: each service with an endpoint, over which
+  # the client talks to the extension directly. An item without services is no failure.
+  service @13 (identifier :Text, name :Text)
+      -> (endpoint :Services.ServiceEndpoint, failure :Common.OptionalError);
+  # One of them. NSCocoaErrorDomain 3328 when the item does not have it.
 
   struct ItemResult {
     union {

@@ -19,6 +19,8 @@ using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
 using Common = import "common.capnp";
 using Content = import "content.capnp".Content;
+using Sharing = import "sharing.capnp".Sharing;
+using TreeObserver = import "tree.capnp".TreeObserver;
 
 interface Daemon {
   describe @0 () -> (home :Data, root :Data, program :Text, bootID :Text, pid :UInt32);
@@ -36,7 +38,7 @@ interface Daemon {
 
   itemAtLocation @3 (path :Data, fakeFSEvent :Bool) -> (result :ItemResult);
   # [account] The item at a location. With `fakeFSEvent` the location is scanned first, and the answer is given
-  # after its row is right.
+  # after its row is right. Without it, only a location that has no row, but something on disk, is scanned.
 
   containers @4 () -> (containers :List(Container), generation :UInt64);
   # The drive's own first. `generation` grows with every change of the list.
@@ -84,6 +86,21 @@ interface Daemon {
   # --- The content of items, and what else is done with items.
 
   content @17 () -> (content :Content);
+
+  # --- The tree on disk.
+
+  observeTree @18 (observer :TreeObserver) -> (registration :Registration);
+  # Active when the call arrives. A standing registration, as those above.
+
+  # --- Where the store has the content of documents.
+
+  contentRecords @19 (objects :List(ObjectID)) -> (result :ContentRecordsResult);
+  # [account] The records of those documents whose content the store has, in no particular order.
+  # Others are left out. At most 200,000 objects.
+
+  # --- Sharing.
+
+  sharing @20 () -> (sharing :Sharing);
 
   enum ObjectKind {
     document @0;
@@ -135,6 +152,24 @@ interface Daemon {
     union {
       sender @0 :ItemSender;
       error @1 :Common.Error;
+    }
+  }
+  struct ContentRecord {
+    object @0 :ObjectID;
+    record @1 :Text;
+    zone @2 :UInt32;                # of the zones in the result
+  }
+  struct RecordZone {
+    name @0 :Text;
+    owner @1 :Text;
+  }
+  struct ContentRecordsResult {
+    union {
+      found :group {
+        records @0 :List(ContentRecord);
+        zones @1 :List(RecordZone);
+      }
+      error @2 :Common.Error;
     }
   }
   struct AccountResult {

@@ -10,6 +10,8 @@ using Cxx = import "/capnp/c++.capnp";
 $Cxx.namespace("yomber::protocol");
 using Common = import "common.capnp";
 using Changes = import "changes.capnp".Changes;
+using Services = import "services.capnp";
+using ThumbnailReceiver = import "thumbnails.capnp".ThumbnailReceiver;
 
 interface Extension {
   urlForItem @0 (identifier :Text) -> (path :Common.OptionalData);
@@ -31,6 +33,23 @@ interface Extension {
   movingItem @8 (path :Data, destination :Data)
       -> (requiresProviding :Bool, failure :Common.OptionalError);
   # Whether the content has to be here before the item is moved.
+
+  # --- Thumbnails.
+
+  fetchThumbnails @9 (identifiers :List(Text), width :Float64, height :Float64,
+                      receiver :ThumbnailReceiver) -> (failure :Common.OptionalError);
+  # Each thumbnail is told as soon as it is known; answered when the receiver took the last one. An
+  # item may be told of more than once, or not at all when nothing is known of it. Dropping the call
+  # cancels what is left.
+
+  # --- Services of an item.
+
+  services @10 (identifier :Text, client :UInt32)
+      -> (services :List(Services.Service), failure :Common.OptionalError);
+  # Each with an endpoint of its own; none is no failure. An endpoint that nobody keeps is gone.
+  # `client`: a number for whoever asks the host; each may have only a part of those that wait.
+  service @11 (identifier :Text, name :Text, client :UInt32)
+      -> (endpoint :Services.ServiceEndpoint, failure :Common.OptionalError);
 
   struct ItemResult {
     union {

@@ -98,8 +98,9 @@ class NotingExtension final : public NSFileProviderExtension {
     asked = what;
     if (forgets) return;
     if (failure != nullptr) return handler(nullptr, failure);
+    const bool again = answersTwice;  // read before the test goes on
     handler(answersNothing ? nullptr : itemNamed("done"), nullptr);
-    if (answersTwice) handler(nullptr, fileProviderErrorForUnsupportedFeature("two answers"));
+    if (again) handler(nullptr, fileProviderErrorForUnsupportedFeature("two answers"));
   }
 };
 

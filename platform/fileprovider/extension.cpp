@@ -138,6 +138,34 @@ void NSFileProviderExtension::setFavoriteRank(
   answerUnsupported(completionHandler, "favourites");
 }
 
+NSProgressRef NSFileProviderExtension::fetchThumbnailsForItemIdentifiers(
+    const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+    TypedThumbnailHandler perThumbnailCompletionHandlerWithType, ErrorHandler completionHandler) {
+  ThumbnailHandler handler;
+  if (perThumbnailCompletionHandlerWithType) {
+    handler = [typed = std::move(perThumbnailCompletionHandlerWithType)](
+                  const NSFileProviderItemIdentifier& identifier, NSDataRef imageData,
+                  NSErrorRef error) {
+      typed(identifier, std::move(imageData), std::nullopt, std::move(error));
+    };
+  }
+  return fetchThumbnailsForItemIdentifiers(identifiers, requestedSize, std::move(handler),
+                                           std::move(completionHandler));
+}
+
+NSProgressRef NSFileProviderExtension::fetchThumbnailsForItemIdentifiers(
+    const std::vector<NSFileProviderItemIdentifier>& /*identifiers*/, CGSize /*requestedSize*/,
+    ThumbnailHandler /*perThumbnailCompletionHandler*/, ErrorHandler completionHandler) {
+  answerUnsupported(completionHandler, "thumbnails");
+  return NSProgress::progressWithTotalUnitCount(0);
+}
+
+std::vector<NSFileProviderServiceSourceRef>
+NSFileProviderExtension::supportedServiceSourcesForItemIdentifier(
+    const NSFileProviderItemIdentifier& /*identifier*/, NSErrorRef* /*error*/) {
+  return {};
+}
+
 void NSFileProviderExtension::_defaultApplicationContainerForBundleIdentifier(
     const std::optional<std::string>& /*bundleIdentifier*/, ItemHandler completionHandler) {
   answerUnsupported(completionHandler, "applications' folders");

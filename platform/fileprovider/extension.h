@@ -5,13 +5,17 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/enumerator.h"
 #include "platform/fileprovider/item.h"
+#include "platform/fileprovider/service_source.h"
 #include "platform/foundation/data.h"
 #include "platform/foundation/date.h"
 #include "platform/foundation/error.h"
+#include "platform/foundation/progress.h"
+#include "platform/foundation/size.h"
 #include "platform/foundation/url.h"
 
 namespace yomber {
@@ -20,6 +24,15 @@ using ErrorHandler = std::function<void(NSErrorRef error)>;
 using ItemHandler = std::function<void(NSFileProviderItemRef item, NSErrorRef error)>;
 using MoveHandler = std::function<void(bool requiresProviding, NSErrorRef error)>;
 using URLHandler = std::function<void(NSURLRef url, NSErrorRef error)>;
+
+/// Takes the thumbnail of one item: an image, nothing where the item has none, or an error.
+using ThumbnailHandler = std::function<void(const NSFileProviderItemIdentifier& identifier,
+                                            NSDataRef imageData, NSErrorRef error)>;
+/// The same with the image's type, for images that are not to be shown as they are; nothing for
+/// those that are.
+using TypedThumbnailHandler =
+    std::function<void(const NSFileProviderItemIdentifier& identifier, NSDataRef imageData,
+                       const std::optional<std::string>& contentType, NSErrorRef error)>;
 
 /// How the content is going to be read: Foundation's file-coordination reading options, a bit set.
 using NSFileCoordinatorReadingOptions = std::uint64_t;
@@ -98,6 +111,22 @@ class NSFileProviderExtension {
   virtual void setFavoriteRank(const std::optional<std::int64_t>& rank,
                                const NSFileProviderItemIdentifier& forItemIdentifier,
                                ItemHandler completionHandler);
+
+  // Thumbnails, in points. Each is handed over as soon as it is known, on any thread, which the
+  // handler may hold up; then comes the completion. Cancelling the progress that is answered ends
+  // the request early. The framework asks for the typed form.
+
+  /// Forwards to the form without types, for an extension that knows none.
+  virtual NSProgressRef fetchThumbnailsForItemIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+      TypedThumbnailHandler perThumbnailCompletionHandlerWithType, ErrorHandler completionHandler);
+  virtual NSProgressRef fetchThumbnailsForItemIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+      ThumbnailHandler perThumbnailCompletionHandler, ErrorHandler completionHandler);
+
+  /// What vends the services of an item, each made for this call. The default is none.
+  virtual std::vector<NSFileProviderServiceSourceRef> supportedServiceSourcesForItemIdentifier(
+      const NSFileProviderItemIdentifier& identifier, NSErrorRef* error = nullptr);
 
   /// An application's default folder; without a bundle, that of the drive itself.
   virtual void _defaultApplicationContainerForBundleIdentifier(

@@ -16,6 +16,7 @@
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/manager.h"
 #include "platform/fileprovider/wire_item.h"
+#include "platform/foundation/descriptor_limit.h"
 #include "platform/foundation/drive_paths.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
@@ -85,6 +86,7 @@ int NSExtensionMain(
   if (socket < 0) return refuse(program);
   (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
   (void)std::signal(SIGPIPE, SIG_IGN);
+  raiseDescriptorLimit();
   openLog("qs-fileprovider", DrivePaths::forDefaultHome());
   registerItemsInErrors();
 

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cerrno>
 #include <climits>
+#include <cmath>
 #include <optional>
 #include <string>
 #include <utility>
@@ -12,9 +13,12 @@
 #include "platform/fileprovider/extension_code.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/reply_observers.h"
+#include "platform/fileprovider/service_requests.h"
+#include "platform/fileprovider/thumbnail_request.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/loop_reply.h"
 #include "platform/ipc/server_call.h"
+#include "platform/xpc/endpoint_wire.h"
 
 namespace yomber {
 namespace {
@@ -314,7 +318,66 @@ class ExtensionServer final : public protocol::Extension::Server {
     });
   }
 
+  kj::Promise<void> fetchThumbnails(FetchThumbnailsContext context) override {
+    context.allowCancellation();
+    const auto params = context.getParams();
+    const CGSize size{.width = params.getWidth(), .height = params.getHeight()};
+    const bool isSize = std::isfinite(size.width) && std::isfinite(size.height) && size.width > 0 &&
+                        size.height > 0;
+    if (!isSize || !params.hasReceiver()) {
+      ipc::encodeOptional(invalid("thumbnails need a receiver and a size of at least one point"),
+                          context.getResults().initFailure());
+      return kj::READY_NOW;
+    }
+    std::vector<NSFileProviderItemIdentifier> identifiers;
+    identifiers.reserve(params.getIdentifiers().size());
+    for (const auto each : params.getIdentifiers()) identifiers.push_back(stringFromWire(each));
+    ipc::Remote<protocol::ThumbnailReceiver> receiver(params.getReceiver());
+    context.releaseParams();
+    return requestThumbnails(extension_, std::move(identifiers), size, std::move(receiver))
+        .then([context](const NSErrorRef& error) mutable {
+          ipc::encodeOptional(error, context.getResults().initFailure());
+        });
+  }
+
+  kj::Promise<void> services(ServicesContext context) override {
+    const std::uint32_t client = context.getParams().getClient();
+    auto identifier = takeIdentifier(context, context.getParams().getIdentifier());
+    return ipc::onPool([extension = extension_, identifier, client](const CancelFlag&) {
+             return vendServices(*extension, identifier, std::nullopt, client);
+           })
+        .then([context](VendedServices vended) mutable {
+          auto results = context.getResults();
+          ipc::encodeOptional(vended.error, results.initFailure());
+          auto services = results.initServices(static_cast<unsigned>(vended.services.size()));
+          for (unsigned i = 0; i < services.size(); ++i) {
+            services[i].setName(wireText(vended.services[i].name));
+            services[i].setEndpoint(serveEndpoint(std::move(vended.services[i].endpoint)));
+          }
+        });
+  }
+
+  kj::Promise<void> service(ServiceContext context) override {
+    const std::uint32_t client = context.getParams().getClient();
+    auto name = stringFromWire(context.getParams().getName());
+    auto identifier = takeIdentifier(context, context.getParams().getIdentifier());
+    return ipc::onPool([extension = extension_, identifier, name, client](const CancelFlag&) {
+             return vendServices(*extension, identifier, name, client);
+           })
+        .then([context](VendedServices vended) mutable {
+          auto results = context.getResults();
+          ipc::encodeOptional(vended.error, results.initFailure());
+          if (vended.services.empty()) return;
+          results.setEndpoint(serveEndpoint(std::move(vended.services.front().endpoint)));
+        });
+  }
+
  private:
+  static NSErrorRef invalid(const char* description) {
+    return NSError::errorWithDomain(NSPOSIXErrorDomain, EINVAL,
+                                    {{NSLocalizedDescriptionKey, std::string(description)}});
+  }
+
   /// Nil for what is no location.
   static NSURLRef locationOf(capnp::Data::Reader path) {
     return path.size() > PATH_MAX ? nullptr : NSURL::fileURLWithPath(stringFromWire(path));
@@ -329,10 +392,8 @@ class ExtensionServer final : public protocol::Extension::Server {
 
   template <typename Context>
   static kj::Promise<void> refuse(Context& context) {
-    const auto error = NSError::errorWithDomain(
-        NSPOSIXErrorDomain, EINVAL,
-        {{NSLocalizedDescriptionKey, std::string("a location has to be an absolute path")}});
-    ipc::encodeOptional(error, context.getResults().initFailure());
+    ipc::encodeOptional(invalid("a location has to be an absolute path"),
+                        context.getResults().initFailure());
     return kj::READY_NOW;
   }
 

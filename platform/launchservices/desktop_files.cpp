@@ -6,11 +6,11 @@
 #include <unistd.h>
 
 #include <array>
-#include <cstdlib>
 #include <map>
 #include <set>
 #include <string_view>
 
+#include "platform/foundation/data_directories.h"
 #include "platform/foundation/file_descriptor.h"
 
 namespace yomber {
@@ -19,11 +19,6 @@ namespace {
 constexpr std::size_t kMaximumFileSize = 256 * std::size_t{1024};
 constexpr std::string_view kSuffix = ".desktop";
 constexpr int kMaximumDepth = 4;
-
-std::string environmentOr(const char* name, const std::string& otherwise) {
-  const char* const value = std::getenv(name);
-  return value != nullptr && *value != '\0' ? value : otherwise;
-}
 
 void collectFiles(const std::string& directory, const std::string& prefix, int depth,
                   std::map<std::string, std::string>& pathsByID) {
@@ -44,21 +39,7 @@ void collectFiles(const std::string& directory, const std::string& prefix, int d
 
 }  // namespace
 
-std::vector<std::string> applicationDirectories() {
-  std::vector<std::string> result;
-  const std::string home = environmentOr("HOME", "");
-  std::string list = environmentOr("XDG_DATA_HOME", home.empty() ? "" : home + "/.local/share");
-  list += ":" + environmentOr("XDG_DATA_DIRS", "/usr/local/share:/usr/share");
-  std::string_view rest = list;
-  while (!rest.empty()) {
-    const auto colon = rest.find(':');
-    const std::string directory(rest.substr(0, colon));
-    rest = colon == std::string_view::npos ? std::string_view{} : rest.substr(colon + 1);
-    // Relative ones are to be ignored.
-    if (directory.starts_with('/')) result.push_back(directory + "/applications");
-  }
-  return result;
-}
+std::vector<std::string> applicationDirectories() { return dataDirectories("applications"); }
 
 std::vector<DesktopFile> desktopFiles(const std::vector<std::string>& directories) {
   std::vector<DesktopFile> result;

@@ -1,8 +1,10 @@
 #include "platform/ostrell/container.h"
 
+#include <algorithm>
 #include <utility>
 
 #include "platform/fileprovider/item_codec.h"
+#include "platform/launchservices/application_icon.h"
 #include "platform/ostrell/daemon_link.h"
 #include "platform/ostrell/errors.h"
 
@@ -50,6 +52,14 @@ DaemonLink::ContainerMap snapshot() {
 }
 
 }  // namespace
+
+NSDataRef QSContainer::bestFittingImageDataForSize(CGSize size,
+                                                   bool* shouldTransformToAppIcon) const {
+  if (iconName().empty()) return nullptr;
+  const auto icon = bestFittingIcon(iconName(), std::min(size.width, size.height));
+  if (shouldTransformToAppIcon != nullptr) *shouldTransformToAppIcon = icon && icon->isBare;
+  return icon ? icon->data : nullptr;
+}
 
 std::map<std::string, QSContainerRef> QSContainer::allContainersByContainerID() {
   const auto containers = snapshot();

@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/foundation/data.h"
+#include "platform/foundation/size.h"
 #include "platform/foundation/url.h"
 
 namespace yomber {
@@ -35,6 +37,12 @@ class QSContainer {
   [[nodiscard]] const std::string& iconName() const { return fields_.iconName; }
   /// The location of its Documents folder.
   [[nodiscard]] const NSURLRef& documentsURL() const { return fields_.documentsURL; }
+
+  /// A picture of it for a square of that size, in points: the nearest to its smaller side that is
+  /// no smaller. Nil when there is none. `shouldTransformToAppIcon` (may be null) says whether it
+  /// is a bare drawing that whoever shows it has to make an application's icon of. Reads files.
+  [[nodiscard]] NSDataRef bestFittingImageDataForSize(CGSize size,
+                                                      bool* shouldTransformToAppIcon) const;
 
   /// Empty when the daemon cannot be asked. Also starts observing the list.
   static std::map<std::string, QSContainerRef> allContainersByContainerID();

@@ -17,11 +17,25 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
  public:
   using DaemonCalls<Base, Invoker>::DaemonCalls;
 
+  void startDownloadingItemsAtURLs(const std::vector<NSURLRef>& urls, std::uint64_t options,
+                                   QSErrorReply reply) override {
+    std::vector<std::string> paths;
+    for (const NSURLRef& url : urls) paths.push_back(pathOf(url));
+    callForFailure(
+        &Wire::Client::startDownloadingRequest,
+        [paths = std::move(paths), options](Wire::StartDownloadingParams::Builder params) {
+          auto list = params.initPaths(static_cast<unsigned>(paths.size()));
+          for (unsigned i = 0; i < list.size(); ++i) list.set(i, wireData(paths[i]));
+          params.setOptions(options);
+        },
+        std::move(reply));
+  }
+
   void evictItemAtURL(const NSURLRef& url, QSErrorReply reply) override {
     callForFailure(
         &Wire::Client::evictRequest,
         [path = pathOf(url)](Wire::EvictParams::Builder params) { params.setPath(wireData(path)); },
-        std::move(reply));
+        std::move(reply), Limit::None);
   }
 
   void setPinned(bool pinned, const NSURLRef& onItemAtURL, QSErrorReply reply) override {
@@ -178,7 +192,7 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
 
   /// A call whose results are a failure or nothing.
   template <typename Method, typename Fill>
-  void callForFailure(Method method, Fill fill, QSErrorReply reply) {
+  void callForFailure(Method method, Fill fill, QSErrorReply reply, Limit limit = Limit::Links) {
     this->invoker().invoke(
         method, std::move(fill),
         [](const DaemonSessionRef&, const auto& results) {
@@ -186,7 +200,8 @@ class ContentCalls : public DaemonCalls<Base, Invoker> {
         },
         [reply = std::move(reply)](const NSErrorRef& failure) {
           if (reply) reply(failure);
-        });
+        },
+        limit);
   }
 
   /// A call whose results are a location or a failure.

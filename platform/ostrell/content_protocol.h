@@ -60,6 +60,9 @@ class QSContentProtocol {
  public:
   virtual ~QSContentProtocol() = default;
 
+  /// Replies when the downloads have begun; see `QSStartDownloadForItemsWithOptions`.
+  virtual void startDownloadingItemsAtURLs(const std::vector<NSURLRef>& urls, std::uint64_t options,
+                                           QSErrorReply reply) = 0;
   /// Gives up the local content. QSOstrellErrorCannotEvict says why that cannot be.
   virtual void evictItemAtURL(const NSURLRef& url, QSErrorReply reply) = 0;
   virtual void setPinned(bool pinned, const NSURLRef& onItemAtURL, QSErrorReply reply) = 0;

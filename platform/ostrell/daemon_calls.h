@@ -108,6 +108,28 @@ class DaemonCalls : public Base {
         });
   }
 
+  void resolveFileObjectIDsToContentRecordIDs(
+      const std::vector<QSFileObjectIDRef>& fileObjectIDs,
+      std::function<void(QSContentRecordIDsRef recordIDs, NSErrorRef)> reply) override {
+    using Result = std::pair<QSContentRecordIDsRef, NSErrorRef>;
+    invoker_.invoke(
+        &Wire::Client::contentRecordsRequest,
+        [fileObjectIDs](Wire::ContentRecordsParams::Builder params) {
+          auto objects = params.initObjects(static_cast<unsigned>(fileObjectIDs.size()));
+          for (unsigned i = 0; i < objects.size(); ++i) {
+            encodeObjectID(*fileObjectIDs[i], objects[i]);
+          }
+        },
+        [](const DaemonSessionRef&, const auto& results) {
+          Result result;
+          result.first = decodeContentRecords(results.getResult(), &result.second);
+          return result;
+        },
+        [reply = std::move(reply)](const Result& result) {
+          if (reply) reply(result.first, result.second);
+        });
+  }
+
   void getItemUpdateSenderWithReceiver(
       std::shared_ptr<QSItemNotificationReceiving> receiver,
       std::function<void(QSItemUpdateSenderRef sender,

@@ -22,6 +22,15 @@ class DefaultConnection final : public QSDaemonConnection {
 
 }  // namespace
 
+std::string QSContentRecordIDs::description() const {
+  std::string text = "{";
+  for (const auto& [object, record] : recordIDs_) {
+    if (text.size() > 1) text += ", ";
+    text += object->asString() + " = " + record.description();
+  }
+  return text + "}";
+}
+
 QSDaemonConnection& QSDaemonConnection::defaultConnection() {
   static DefaultConnection connection;
   return connection;

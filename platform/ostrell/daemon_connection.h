@@ -5,6 +5,8 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "platform/foundation/data.h"
@@ -14,6 +16,8 @@
 #include "platform/ostrell/file_object_id.h"
 #include "platform/ostrell/item_notifications.h"
 #include "platform/ostrell/query_item.h"
+#include "platform/ostrell/sharing_protocol.h"
+#include "platform/rozzel/identifiers.h"
 
 namespace yomber {
 
@@ -24,9 +28,27 @@ inline constexpr std::uint8_t QSSortOrderByDate = 1;
 using QSPageHandler =
     std::function<void(const QSQueryItems& items, std::uint64_t nextOffset, NSErrorRef error)>;
 
+/// Where the store has the content of documents: the record of each one, by its id.
+///
+/// Ownership: shared, immutable.
+class QSContentRecordIDs final : public NSObject {
+ public:
+  using Map =
+      std::unordered_map<QSFileObjectIDRef, RZRecordID, QSFileObjectIDHash, QSFileObjectIDEqual>;
+  explicit QSContentRecordIDs(Map recordIDs) : recordIDs_(std::move(recordIDs)) {}
+
+  [[nodiscard]] const Map& recordIDs() const { return recordIDs_; }
+  /// "{d:5 = record in zone (owner), …}".
+  [[nodiscard]] std::string description() const override;
+
+ private:
+  const Map recordIDs_;
+};
+using QSContentRecordIDsRef = std::shared_ptr<const QSContentRecordIDs>;
+
 /// What the daemon does for its clients. Implemented by the asynchronous and the synchronous proxy.
 /// Each call either replies or fails its proxy, once.
-class QSDaemonProtocol : public QSContentProtocol {
+class QSDaemonProtocol : public QSContentProtocol, public QSSharingProtocol {
  public:
   virtual void getURLForItemIdentifier(const std::string& identifier,
                                        std::function<void(NSURLRef, NSErrorRef)> reply) = 0;
@@ -44,6 +66,11 @@ class QSDaemonProtocol : public QSContentProtocol {
       std::function<void(const QSQueryItems& updated, const std::vector<QSFileObjectIDRef>& deleted,
                          NSDataRef token, NSErrorRef)>
           completion) = 0;
+  /// Documents whose content the store does not have are left out of what is replied; nil when the
+  /// daemon cannot say.
+  virtual void resolveFileObjectIDsToContentRecordIDs(
+      const std::vector<QSFileObjectIDRef>& fileObjectIDs,
+      std::function<void(QSContentRecordIDsRef recordIDs, NSErrorRef)> reply) = 0;
   /// The receiver is held weakly; when it is gone, its subscription ends. The dictionary is
   /// reserved.
   virtual void getItemUpdateSenderWithReceiver(

@@ -5,6 +5,8 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -12,11 +14,13 @@
 #include <vector>
 
 #include "platform/foundation/drive_paths.h"
+#include "platform/foundation/file_manager.h"
 #include "platform/foundation/serial_queue.h"
 #include "platform/ipc/event_loop.h"
 #include "platform/ostrell/awaited.h"
 #include "platform/ostrell/constants.h"
 #include "platform/ostrell/daemon_link.h"
+#include "platform/ostrell/file_manager_additions.h"
 #include "platform/ostrell/query_item.h"
 #include "platform/ostrell/scripted_daemon.h"
 #include "platform/ostrell/url_additions.h"
@@ -384,29 +388,34 @@ TEST_F(StuckDaemonTest, WorkThatTakesLongIsWaitedForWhileTheDaemonAnswers) {
   const auto file = daemon->root() + "/five.txt";
   daemon->addItem(scriptedDocument(5, "five.txt"), file);
   const auto url = NSURL::fileURLWithPath(file);
-  for (const bool isScan : {true, false}) {
-    const std::string method = isScan ? "itemAtLocation" : "emptyTrash";
+  const auto scan = [&] {
+    NSErrorRef error;
+    EXPECT_TRUE(QSQueryItem::askDaemonQueryItemForURL(url, ForceScan::Yes, &error));
+    return error;
+  };
+  const auto emptyTrash = [] {
+    int answers = 0;
+    const auto proxy = QSDaemonConnection::defaultConnection().newSyncProxy();
+    proxy->emptyTrashWithReply([&](std::uint64_t, const NSErrorRef&) { ++answers; });
+    EXPECT_EQ(answers, 1);
+    return proxy->error();
+  };
+  const auto evict = [&] {
+    NSErrorRef error;
+    EXPECT_TRUE(evictUbiquitousItemAtURL(NSFileManager::defaultManager(), url, &error));
+    return error;
+  };
+  const std::map<std::string, std::function<NSErrorRef()>> works{
+      {"itemAtLocation", scan}, {"emptyTrash", emptyTrash}, {"evict", evict}};
+  for (const auto& [method, work] : works) {
     daemon->hold(method);
     daemon->forgetCalls();
-    std::thread worker([&] {
+    std::thread worker([&, name = method] {
       // So often it was asked whether it is stuck.
       EXPECT_TRUE(daemon->waitForCalls("describe", 5));
-      daemon->release(method);
+      daemon->release(name);
     });
-    if (isScan) {
-      NSErrorRef error;
-      EXPECT_TRUE(QSQueryItem::askDaemonQueryItemForURL(url, ForceScan::Yes, &error));
-      EXPECT_FALSE(error);
-    } else {
-      int answers = 0;
-      const auto proxy = QSDaemonConnection::defaultConnection().newSyncProxy();
-      proxy->emptyTrashWithReply([&](std::uint64_t, const NSErrorRef& error) {
-        ++answers;
-        EXPECT_FALSE(error);
-      });
-      EXPECT_EQ(answers, 1);
-      EXPECT_FALSE(proxy->error());
-    }
+    EXPECT_FALSE(work()) << method;
     worker.join();
   }
 }

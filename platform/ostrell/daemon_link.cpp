@@ -1,18 +1,17 @@
 #include "platform/ostrell/daemon_link.h"
 
 #include <algorithm>
-#include <charconv>
-#include <cstdlib>
-#include <string_view>
 
 #include "platform/fileprovider/file_operations.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/wire_item.h"
 #include "platform/foundation/drive_paths.h"
 #include "platform/ipc/gate.h"
+#include "platform/ostrell/daemon_question.h"
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
 #include "platform/ostrell/item_additions.h"
+#include "platform/ostrell/record_store.h"
 #include "platform/ostrell/trash_info.h"
 
 namespace yomber {
@@ -22,23 +21,6 @@ using std::chrono::milliseconds;
 
 constexpr milliseconds kFirstRetryDelay{20};
 constexpr milliseconds kLongestRetryDelay{2'000};
-constexpr milliseconds kDefaultTimeout{30'000};
-
-milliseconds configuredTimeout() {
-  const char* const text = std::getenv("YOMBER_DAEMON_TIMEOUT_MS");
-  if (text == nullptr) return kDefaultTimeout;
-  const std::string_view digits(text);
-  std::int64_t value = 0;
-  const auto [end, failure] = std::from_chars(digits.data(), digits.data() + digits.size(), value);
-  const bool isUsable = failure == std::errc() && end == digits.data() + digits.size() &&
-                        value > 0 && value <= milliseconds(std::chrono::hours(24)).count();
-  if (isUsable) return milliseconds(value);
-  log_error(
-      qsc_default_log(),
-      "[ERROR] YOMBER_DAEMON_TIMEOUT_MS is \"%s\": give it a number of milliseconds; using %lld",
-      digits, static_cast<long long>(kDefaultTimeout.count()));
-  return kDefaultTimeout;
-}
 
 NSErrorRef wrongHome(const std::string& socketPath, const std::string& theirs,
                      const std::string& ours) {
@@ -118,13 +100,14 @@ std::shared_ptr<DaemonLink> DaemonLink::create(const std::string& home) {
   setFormerNameResolver(trashedName);
   const DrivePaths paths = DrivePaths::forHome(home);
   setStagingFolder(paths.privateDirectory + "/copies");
+  installRecordStore(paths.store);
   return std::shared_ptr<DaemonLink>(new DaemonLink(paths.home, paths.daemonSocket));
 }
 
 DaemonLink::DaemonLink(const std::string& home, std::string socketPath)
     : locations_(home),
       socketPath_(std::move(socketPath)),
-      callOptions_{configuredTimeout()},
+      callOptions_{daemonTimeLimit()},
       replyQueue_(SerialQueue::create("qs-daemon-replies")),
       announcer_(std::make_shared<ChangeAnnouncer>()),
       retryDelay_(kFirstRetryDelay) {}

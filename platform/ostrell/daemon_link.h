@@ -43,16 +43,21 @@ class DaemonSession {
       : connection_(std::move(connection)),
         daemon_(std::move(daemon)),
         content_(ipc::Remote<protocol::Content>::Resolver(
-            [daemon = daemon_] { return daemon.client().contentRequest().send().getContent(); })) {}
+            [daemon = daemon_] { return daemon.client().contentRequest().send().getContent(); })),
+        sharing_(ipc::Remote<protocol::Sharing>::Resolver(
+            [daemon = daemon_] { return daemon.client().sharingRequest().send().getSharing(); })) {}
 
   [[nodiscard]] const ipc::Remote<protocol::Daemon>& daemon() const { return daemon_; }
   /// Asked for when it is first called, along with that call.
   [[nodiscard]] const ipc::Remote<protocol::Content>& content() const { return content_; }
-  /// The one of the two whose calls `Client` makes.
+  [[nodiscard]] const ipc::Remote<protocol::Sharing>& sharing() const { return sharing_; }
+  /// The one of the three whose calls `Client` makes.
   template <typename Client>
   [[nodiscard]] const auto& remote() const {
     if constexpr (std::is_same_v<Client, protocol::Content::Client>) {
       return content_;
+    } else if constexpr (std::is_same_v<Client, protocol::Sharing::Client>) {
+      return sharing_;
     } else {
       return daemon_;
     }
@@ -72,6 +77,7 @@ class DaemonSession {
   const ipc::Connection::Ref connection_;
   const ipc::Remote<protocol::Daemon> daemon_;
   const ipc::Remote<protocol::Content> content_;
+  const ipc::Remote<protocol::Sharing> sharing_;
   ipc::Remote<protocol::Registration> registration_;
   std::atomic<bool> isLost_ = false;
 
@@ -119,7 +125,7 @@ class DaemonLink : public std::enable_shared_from_this<DaemonLink> {
     NSErrorRef error;
     const auto session = waitForSession(&error);
     if (!session) return error;
-    error = ipc::callAndWait(session->daemon(), method, std::forward<Fill>(fill),
+    error = ipc::callAndWait(session->remote<Client>(), method, std::forward<Fill>(fill),
                              std::forward<Decode>(decode), callOptions_);
     if (error) noteFailure(session, error);
     return error;

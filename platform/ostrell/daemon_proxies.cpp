@@ -3,9 +3,9 @@
 #include <optional>
 #include <utility>
 
-#include "platform/ostrell/content_calls.h"
 #include "platform/ostrell/error_handler_slot.h"
 #include "platform/ostrell/patient_call.h"
+#include "platform/ostrell/sharing_calls.h"
 
 namespace yomber {
 namespace {
@@ -97,11 +97,11 @@ class SyncInvoker {
   const std::shared_ptr<DaemonLink> link_;
 };
 
-using DaemonProxy = ContentCalls<QSDaemonProtocol, AsyncInvoker>;
+using DaemonProxy = SharingCalls<QSDaemonProtocol, AsyncInvoker>;
 
-class DaemonSyncProxy final : public ContentCalls<QSDaemonSyncProxy, SyncInvoker> {
+class DaemonSyncProxy final : public SharingCalls<QSDaemonSyncProxy, SyncInvoker> {
  public:
-  using ContentCalls::ContentCalls;
+  using SharingCalls::SharingCalls;
 
   void setObjResult(NSObjectRef result, NSErrorRef error) override {
     result_ = std::move(result);

@@ -97,6 +97,30 @@ QSQueryItemRef decodeItemResult(Wire::ItemResult::Reader reader, NSErrorRef* err
   return nullptr;
 }
 
+QSContentRecordIDsRef decodeContentRecords(Wire::ContentRecordsResult::Reader reader,
+                                           NSErrorRef* error) {
+  if (reader.isError()) {
+    storeError(error, ipc::decodeError(reader.getError()));
+    return nullptr;
+  }
+  if (!reader.isFound()) {
+    storeError(error, unintelligibleReply("a list of records"));
+    return nullptr;
+  }
+  std::vector<RZRecordZoneID> zones;
+  for (const auto zone : reader.getFound().getZones()) {
+    zones.emplace_back(stringFromWire(zone.getName()), stringFromWire(zone.getOwner()));
+  }
+  QSContentRecordIDs::Map recordIDs;
+  for (const auto each : reader.getFound().getRecords()) {
+    auto object = decodeObjectID(each.getObject());
+    if (object == nullptr || each.getZone() >= zones.size()) continue;
+    recordIDs.insert_or_assign(std::move(object),
+                               RZRecordID(stringFromWire(each.getRecord()), zones[each.getZone()]));
+  }
+  return std::make_shared<const QSContentRecordIDs>(std::move(recordIDs));
+}
+
 NSErrorRef unintelligibleReply(const char* what) {
   return ipc::connectionError(
       NSXPCConnectionReplyInvalid,

@@ -5,6 +5,7 @@
 #include "platform/foundation/error.h"
 #include "platform/foundation/url.h"
 #include "platform/ipc/error_codec.h"
+#include "platform/ostrell/daemon_connection.h"
 #include "platform/ostrell/file_object_id.h"
 #include "platform/ostrell/query_item.h"
 #include "protocols/daemon.capnp.h"
@@ -27,6 +28,10 @@ void encodeObjectID(const QSFileObjectID& object, protocol::Daemon::ObjectID::Bu
                                       NSErrorRef* error);
 [[nodiscard]] QSQueryItemRef decodeItemResult(protocol::Daemon::ItemResult::Reader reader,
                                               NSErrorRef* error);
+
+/// Nil and an error when the daemon sent one. Leaves out what names no object or no zone.
+[[nodiscard]] QSContentRecordIDsRef decodeContentRecords(
+    protocol::Daemon::ContentRecordsResult::Reader reader, NSErrorRef* error);
 
 /// Runs `read`, which reads a message: answers nil, or the error for a message that cannot be read.
 /// Whoever waits for the message hears of it then.

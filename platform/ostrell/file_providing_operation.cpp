@@ -8,10 +8,12 @@
 #include "platform/foundation/thread_pool.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
+#include "platform/ostrell/cancellable_call.h"
 #include "platform/ostrell/daemon_link.h"
 #include "platform/ostrell/daemon_patience.h"
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
+#include "platform/ostrell/reading_options.h"
 
 namespace yomber {
 namespace {
@@ -46,43 +48,9 @@ NSErrorRef stuckWhileProviding(const NSErrorRef& reason, const std::string& path
 
 }  // namespace
 
-/// The call under way, which a cancellation may meet at any point.
-class QSFileProvidingOperation::Call {
- public:
-  /// Keeps the call, or gives it up when it was cancelled before it could be kept.
-  void keep(ipc::CallHandle handle) {
-    {
-      LockGuard guard(mutex_);
-      if (!isCancelled_) {
-        handle_ = std::move(handle);
-        return;
-      }
-    }
-    handle.cancel();
-  }
-  void cancel() {
-    ipc::CallHandle handle;
-    {
-      LockGuard guard(mutex_);
-      isCancelled_ = true;
-      handle = std::exchange(handle_, {});
-    }
-    handle.cancel();
-  }
-  bool isCancelled() {
-    LockGuard guard(mutex_);
-    return isCancelled_;
-  }
-
- private:
-  Mutex mutex_;
-  bool isCancelled_ GUARDED_BY(mutex_) = false;
-  ipc::CallHandle handle_ GUARDED_BY(mutex_);
-};
-
 QSFileProvidingOperation::QSFileProvidingOperation(const NSURLRef& url,
                                                    NSFileCoordinatorReadingOptions readingOptions)
-    : url_(url), readingOptions_(readingOptions), call_(std::make_unique<Call>()) {}
+    : url_(url), readingOptions_(readingOptions), call_(std::make_unique<CancellableCall>()) {}
 
 QSFileProvidingOperation::~QSFileProvidingOperation() = default;
 
@@ -100,6 +68,16 @@ void QSFileProvidingOperation::setFileProvidingCompletion(
     std::function<void(NSErrorRef)> completion) {
   LockGuard guard(mutex_);
   std::swap(completion_, completion);
+}
+
+void QSFileProvidingOperation::setWantsCurrentVersion(bool wantsCurrentVersion) {
+  LockGuard guard(mutex_);
+  wantsCurrentVersion_ = wantsCurrentVersion;
+}
+
+NSFileCoordinatorReadingOptions QSFileProvidingOperation::options() {
+  LockGuard guard(mutex_);
+  return readingOptions_ | (wantsCurrentVersion_ ? QSFileCoordinatorReadingForcesProviding : 0);
 }
 
 void QSFileProvidingOperation::cancel() {
@@ -126,11 +104,10 @@ void QSFileProvidingOperation::main() {
 
 void QSFileProvidingOperation::ask(const std::shared_ptr<DaemonLink>& link,
                                    const std::shared_ptr<DaemonSession>& session) {
-  const auto patience =
-      std::make_shared<DaemonPatience>(link, session, [self = self()](const NSErrorRef& error) {
-        self->settle(stuckWhileProviding(error, self->url_->path()));
-        self->call_->cancel();
-      });
+  const auto patience = daemonPatience(link, session, [self = self()](const NSErrorRef& error) {
+    self->settle(stuckWhileProviding(error, self->url_->path()));
+    self->call_->cancel();
+  });
   using Results = Wire::StartProvidingResults;
   auto onReply = [self = self(), link, session, patience](NSErrorRef failure,
                                                           const Results::Reader* results) {
@@ -150,7 +127,7 @@ void QSFileProvidingOperation::ask(const std::shared_ptr<DaemonLink>& link,
       session->content(), &Wire::Client::startProvidingRequest,
       [self = self(), patience](Wire::StartProvidingParams::Builder params) {
         params.setPath(wireData(self->url_->path()));
-        params.setOptions(self->readingOptions_);
+        params.setOptions(self->options());
         patience->begin();
       },
       std::move(onReply), ipc::CallOptions{std::chrono::milliseconds(0)}));

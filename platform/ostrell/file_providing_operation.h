@@ -12,6 +12,7 @@
 
 namespace yomber {
 
+class CancellableCall;
 class DaemonLink;
 class DaemonSession;
 
@@ -34,6 +35,9 @@ class QSFileProvidingOperation final : public NSOperation {
   /// Called once, on a pool thread, before an operation that was started is finished. Set before
   /// the start.
   void setFileProvidingCompletion(std::function<void(NSErrorRef error)> completion);
+  /// Whether the content must be what the daemon has when the operation ends: what is going on with
+  /// an item whose content is here is waited for. Set before the start.
+  void setWantsCurrentVersion(bool wantsCurrentVersion);
 
   void cancel() override;
   [[nodiscard]] bool isAsynchronous() const override { return true; }
@@ -42,20 +46,20 @@ class QSFileProvidingOperation final : public NSOperation {
   void main() override;
 
  private:
-  class Call;
-
   QSFileProvidingOperation(const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions);
   std::shared_ptr<QSFileProvidingOperation> self();
+  NSFileCoordinatorReadingOptions options();
   void ask(const std::shared_ptr<DaemonLink>& link, const std::shared_ptr<DaemonSession>& session);
   /// The first outcome counts; it is delivered elsewhere.
   void settle(const NSErrorRef& outcome);
 
   const NSURLRef url_;
   const NSFileCoordinatorReadingOptions readingOptions_;
-  const std::unique_ptr<Call> call_;
+  const std::unique_ptr<CancellableCall> call_;
 
   Mutex mutex_;
   bool isSettled_ GUARDED_BY(mutex_) = false;
+  bool wantsCurrentVersion_ GUARDED_BY(mutex_) = false;
   std::function<void(NSErrorRef)> completion_ GUARDED_BY(mutex_);
 };
 

@@ -52,6 +52,17 @@ TEST_F(FileProvidingOperationTest, AsksTheDaemonWithTheOptionsAndEndsWithNoError
             (ScriptedDaemon::Call{"startProviding", {url->path(), "131073"}}));
 }
 
+TEST_F(FileProvidingOperationTest, WaitsForWhatIsGoingOnWhenItWantsTheCurrentVersion) {
+  const auto operation = makeOperation();
+  operation->setWantsCurrentVersion(true);
+  queue.addOperation(operation);
+  EXPECT_EQ(outcomes->wait(), std::vector<NSErrorRef>{nullptr});
+  EXPECT_EQ(daemon.calls().back(),
+            (ScriptedDaemon::Call{
+                "startProviding",
+                {url->path(), std::to_string(QSFileCoordinatorReadingForcesProviding)}}));
+}
+
 TEST_F(FileProvidingOperationTest, EndsWithTheDaemonsError) {
   daemon.scriptContent([](ScriptedContentAnswers& answers) {
     answers.startProviding = [](const std::string&, std::uint64_t) {

@@ -14,7 +14,7 @@
 namespace yomber {
 
 // Calls that take as long as their work takes, however long, but end with NSXPCConnectionTimedOut
-// when the daemon is stuck (see DaemonPatience). For this room's sources only.
+// when the daemon is stuck (see ipc::Patience). For this room's sources only.
 
 /// Calls `method` with parameters from `fill`. Then calls, once and on the loop thread, either
 /// `take(results)` or, where that fails too, `fail(error)`. The daemon may go on with the work of a
@@ -30,7 +30,7 @@ void callPatiently(const std::shared_ptr<DaemonLink>& link, const DaemonSessionR
     link->noteFailure(session, failure);
     fail(failure);
   };
-  const auto patience = std::make_shared<DaemonPatience>(link, session, end);
+  const auto patience = daemonPatience(link, session, end);
   using Reader = typename Results::Reader;
   auto onReply = [patience, isOver, take, end](NSErrorRef failure, const Reader* results) {
     patience->end();

@@ -85,6 +85,7 @@ class ContentServer final : public Wire::Server {
   explicit ContentServer(std::shared_ptr<State> state) : state_(std::move(state)) {}
 
   kj::Promise<void> startProviding(StartProvidingContext context) override;
+  kj::Promise<void> startDownloading(StartDownloadingContext context) override;
   kj::Promise<void> evict(EvictContext context) override;
   kj::Promise<void> setPinned(SetPinnedContext context) override;
   kj::Promise<void> capabilityToMove(CapabilityToMoveContext context) override;
@@ -100,26 +101,8 @@ class ContentServer final : public Wire::Server {
   kj::Promise<void> transfers(TransfersContext context) override;
 
  private:
-  /// Says that a call was given up before its answer was sent.
-  kj::Promise<void> answeredUnlessDropped(const std::string& method,
-                                          std::vector<std::string> arguments);
-
   const std::shared_ptr<State> state_;
 };
-
-kj::Promise<void> ContentServer::answeredUnlessDropped(const std::string& method,
-                                                       std::vector<std::string> arguments) {
-  auto isSent = std::make_shared<bool>(false);
-  auto notice = kj::defer([state = state_, isSent, method, arguments] {
-    if (*isSent) return;
-    LockGuard guard(state->mutex);
-    state->calls.push_back({method + ".dropped", arguments});
-    state->didHappen();
-  });
-  return state_->answered(method, std::move(arguments))
-      .then([isSent] { *isSent = true; })
-      .attach(kj::mv(notice));
-}
 
 kj::Promise<void> ContentServer::startProviding(StartProvidingContext context) {
   context.allowCancellation();
@@ -127,7 +110,19 @@ kj::Promise<void> ContentServer::startProviding(StartProvidingContext context) {
   const auto options = context.getParams().getOptions();
   const auto answer = state_->currentContentAnswers().startProviding;
   ipc::encodeOptional(answer ? answer(path, options) : nullptr, context.getResults().initFailure());
-  return answeredUnlessDropped("startProviding", {path, std::to_string(options)});
+  return state_->answeredUnlessDropped("startProviding", {path, std::to_string(options)});
+}
+
+kj::Promise<void> ContentServer::startDownloading(StartDownloadingContext context) {
+  context.allowCancellation();
+  std::vector<std::string> paths;
+  for (const auto path : context.getParams().getPaths()) paths.push_back(stringFromWire(path));
+  const auto options = context.getParams().getOptions();
+  const auto answer = state_->currentContentAnswers().startDownloading;
+  ipc::encodeOptional(answer ? answer(paths, options) : nullptr,
+                      context.getResults().initFailure());
+  paths.push_back(std::to_string(options));
+  return state_->answered("startDownloading", std::move(paths));
 }
 
 kj::Promise<void> ContentServer::evict(EvictContext context) {

@@ -39,6 +39,8 @@ struct ScriptedContentAnswers {
 
   using Path = const std::string&;
   std::function<NSErrorRef(Path path, std::uint64_t options)> startProviding;
+  std::function<NSErrorRef(const std::vector<std::string>& paths, std::uint64_t options)>
+      startDownloading;
   std::function<NSErrorRef(Path path)> evict;
   std::function<NSErrorRef(Path path, bool pinned)> setPinned;
   std::function<Capability(Path source, Path destination)> capabilityToMove;

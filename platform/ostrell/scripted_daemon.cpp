@@ -128,6 +128,25 @@ ScriptedDaemon::Answers ScriptedDaemon::State::currentAnswers() {
   return answers;
 }
 
+kj::Promise<void> ScriptedDaemon::State::answeredUnlessDropped(const std::string& method,
+                                                               std::vector<std::string> arguments) {
+  auto isSent = std::make_shared<bool>(false);
+  auto notice = kj::defer([state = shared_from_this(), isSent, method, arguments] {
+    if (*isSent) return;
+    LockGuard guard(state->mutex);
+    state->calls.push_back({method + ".dropped", arguments});
+    state->didHappen();
+  });
+  return answered(method, std::move(arguments))
+      .then([isSent] { *isSent = true; })
+      .attach(kj::mv(notice));
+}
+
+ScriptedSharingAnswers ScriptedDaemon::State::currentSharingAnswers() {
+  LockGuard guard(mutex);
+  return sharingAnswers;
+}
+
 ScriptedContentAnswers ScriptedDaemon::State::currentContentAnswers() {
   LockGuard guard(mutex);
   return contentAnswers;
@@ -231,6 +250,12 @@ void ScriptedDaemon::scriptContent(
     const std::function<void(ScriptedContentAnswers& answers)>& change) {
   LockGuard guard(state_->mutex);
   change(state_->contentAnswers);
+}
+
+void ScriptedDaemon::scriptSharing(
+    const std::function<void(ScriptedSharingAnswers& answers)>& change) {
+  LockGuard guard(state_->mutex);
+  change(state_->sharingAnswers);
 }
 
 void ScriptedDaemon::addItem(const ItemFields& item, const std::string& path) {

@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -12,6 +13,8 @@
 #include "platform/foundation/error.h"
 #include "platform/ostrell/file_object_id.h"
 #include "platform/ostrell/scripted_content.h"
+#include "platform/ostrell/scripted_sharing.h"
+#include "platform/rozzel/identifiers.h"
 
 namespace yomber {
 
@@ -58,6 +61,11 @@ class ScriptedDaemon {
     std::string iconName;
   };
 
+  struct Records {
+    std::map<std::string, RZRecordID> records;  ///< by the object's string
+    NSErrorRef error;
+  };
+
   /// What is answered. Called on the loop thread: they may not block (see `hold`) and may not call
   /// the daemon. Those left alone answer from what `addItem` and `addContainer` put in.
   struct Answers {
@@ -79,12 +87,15 @@ class ScriptedDaemon {
     std::function<NSErrorRef()> getItemUpdateSender;
     std::function<NSErrorRef(const std::string& path, std::uint32_t options)> watchItem;
     std::function<Account()> account;
+    /// Left alone: the store has no document.
+    std::function<Records(const std::vector<std::string>& objects)> contentRecords;
   };
 
   /// A call that arrived and whose answer was made: the method as the protocol names it, and its
   /// parameters in their order, as text ("true", "200", "d:5"; the root folder and an absent token
   /// are ""). Of a sender's calls (boostPriority, watchItem, invalidate), the subscription's number
-  /// comes first. "startProviding.dropped" is one that the client gave up before it was answered.
+  /// comes first. "startProviding.dropped" is one that the client gave up before it was answered;
+  /// so it is with every call about a share.
   struct Call {
     std::string method;
     std::vector<std::string> arguments;
@@ -107,6 +118,8 @@ class ScriptedDaemon {
   void script(const std::function<void(Answers& answers)>& change);
   /// The same for what is answered about content.
   void scriptContent(const std::function<void(ScriptedContentAnswers& answers)>& change);
+  /// The same for what is answered about sharing.
+  void scriptSharing(const std::function<void(ScriptedSharingAnswers& answers)>& change);
   /// Makes the item known, at that location, to the answers that were left alone. Replaces an item
   /// of the same identifier. Makes no file.
   void addItem(const ItemFields& item, const std::string& path);

@@ -73,6 +73,27 @@ void encodeAccount(const ScriptedDaemon::Account& answer, Wire::AccountResult::B
   }
 }
 
+void encodeRecords(const ScriptedDaemon::Records& answer,
+                   Wire::ContentRecordsResult::Builder result) {
+  if (answer.error) {
+    ipc::encodeError(answer.error, result.initError());
+    return;
+  }
+  const auto count = static_cast<unsigned>(answer.records.size());
+  auto found = result.initFound();
+  auto records = found.initRecords(count);
+  auto zones = found.initZones(count);
+  unsigned i = 0;
+  for (const auto& [object, record] : answer.records) {
+    encodeObjectID(*QSFileObjectID::fileObjectIDWithString(object), records[i].initObject());
+    records[i].setRecord(wireText(record.recordName()));
+    records[i].setZone(i);
+    zones[i].setName(wireText(record.zoneID().zoneName()));
+    zones[i].setOwner(wireText(record.zoneID().ownerName()));
+    ++i;
+  }
+}
+
 class SenderServer final : public protocol::ItemSender::Server {
  public:
   SenderServer(std::shared_ptr<State> state, std::size_t number)
@@ -146,7 +167,9 @@ class DaemonServer final : public Wire::Server {
   kj::Promise<void> getItemUpdateSender(GetItemUpdateSenderContext context) override;
   kj::Promise<void> account(AccountContext context) override;
   kj::Promise<void> observe(ObserveContext context) override;
+  kj::Promise<void> contentRecords(ContentRecordsContext context) override;
   kj::Promise<void> content(ContentContext context) override;
+  kj::Promise<void> sharing(SharingContext context) override;
 
  private:
   const std::shared_ptr<State> state_;
@@ -314,8 +337,25 @@ kj::Promise<void> DaemonServer::observe(ObserveContext context) {
   return state_->answered("observe", {});
 }
 
+kj::Promise<void> DaemonServer::contentRecords(ContentRecordsContext context) {
+  context.allowCancellation();
+  std::vector<std::string> objects;
+  for (const auto each : context.getParams().getObjects()) {
+    if (const auto object = decodeObjectID(each)) objects.push_back(object->asString());
+  }
+  const auto answer = state_->currentAnswers().contentRecords;
+  encodeRecords(answer ? answer(objects) : ScriptedDaemon::Records(),
+                context.getResults().initResult());
+  return state_->answered("contentRecords", std::move(objects));
+}
+
 kj::Promise<void> DaemonServer::content(ContentContext context) {
   context.getResults().setContent(makeScriptedContent(state_));
+  return kj::READY_NOW;
+}
+
+kj::Promise<void> DaemonServer::sharing(SharingContext context) {
+  context.getResults().setSharing(makeScriptedSharing(state_));
   return kj::READY_NOW;
 }
 

@@ -32,6 +32,7 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
   std::uint64_t events GUARDED_BY(mutex) = 0;
   Answers answers GUARDED_BY(mutex);
   ScriptedContentAnswers contentAnswers GUARDED_BY(mutex);
+  ScriptedSharingAnswers sharingAnswers GUARDED_BY(mutex);
   std::vector<Call> calls GUARDED_BY(mutex);
   std::set<std::string> held GUARDED_BY(mutex);
   std::map<std::string, std::pair<ItemFields, std::string>> items GUARDED_BY(mutex);
@@ -57,8 +58,12 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
   }
   /// Records a call whose answer is made; done when the answer may be sent. Loop thread.
   kj::Promise<void> answered(const std::string& method, std::vector<std::string> arguments);
+  /// The same; records "….dropped" besides when the call was given up before its answer was sent.
+  kj::Promise<void> answeredUnlessDropped(const std::string& method,
+                                          std::vector<std::string> arguments);
   [[nodiscard]] Answers currentAnswers();
   [[nodiscard]] ScriptedContentAnswers currentContentAnswers();
+  [[nodiscard]] ScriptedSharingAnswers currentSharingAnswers();
 
   // What is answered where the test gave no answer.
   Location locationOf(const std::string& identifier);
@@ -72,6 +77,8 @@ struct ScriptedDaemon::State : std::enable_shared_from_this<ScriptedDaemon::Stat
 [[nodiscard]] protocol::Daemon::Client makeScriptedServer(
     std::shared_ptr<ScriptedDaemon::State> state);
 [[nodiscard]] protocol::Content::Client makeScriptedContent(
+    std::shared_ptr<ScriptedDaemon::State> state);
+[[nodiscard]] protocol::Sharing::Client makeScriptedSharing(
     std::shared_ptr<ScriptedDaemon::State> state);
 
 }  // namespace yomber

@@ -11,6 +11,8 @@
 #include <utility>
 
 #include "platform/foundation/file_descriptor.h"
+#include "platform/foundation/file_time.h"
+#include "platform/foundation/percent_encoding.h"
 
 namespace yomber {
 namespace {
@@ -21,6 +23,8 @@ constexpr std::string_view kDeletionDate = "DeletionDate";
 constexpr std::string_view kContainer = "X-Yomber-Container";
 constexpr std::string_view kPathInContainer = "X-Yomber-Path";
 constexpr std::string_view kKind = "X-Yomber-Kind";
+/// Besides letters and digits, what stands for itself in a value.
+constexpr std::string_view kPlain = "-._~/";
 
 /// Paths may be long, but not without end.
 constexpr std::size_t kLargestInfo = 1024 * 1024;
@@ -47,28 +51,6 @@ std::pair<std::string_view, std::string_view> splitPath(std::string_view path) {
   const std::size_t slash = path.rfind('/');
   if (slash == std::string_view::npos) return {{}, path};
   return {path.substr(0, slash), path.substr(slash + 1)};
-}
-
-bool isPlain(char c) {
-  const bool isLetter = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
-  return isLetter || (c >= '0' && c <= '9') || std::string_view("-._~/").contains(c);
-}
-
-std::string percentEncoded(std::string_view text) {
-  constexpr std::string_view kDigits = "0123456789ABCDEF";
-  std::string result;
-  result.reserve(text.size());
-  for (const char c : text) {
-    if (isPlain(c)) {
-      result += c;
-      continue;
-    }
-    const auto byte = static_cast<unsigned char>(c);
-    result += '%';
-    result += kDigits[byte >> 4U];
-    result += kDigits[byte & 15U];
-  }
-  return result;
 }
 
 int hexDigit(char c) {
@@ -142,10 +124,10 @@ std::string* fieldOf(TrashInfo& info, std::string_view key) {
 std::string trashInfoText(const TrashInfo& info) {
   std::string text(kGroup);
   text += '\n';
-  addLine(text, kPath, percentEncoded(info.path));
+  addLine(text, kPath, percentEncoded(info.path, kPlain));
   addLine(text, kDeletionDate, info.deletionDate);
-  addLine(text, kContainer, percentEncoded(info.containerID));
-  addLine(text, kPathInContainer, percentEncoded(info.pathInContainer));
+  addLine(text, kContainer, percentEncoded(info.containerID, kPlain));
+  addLine(text, kPathInContainer, percentEncoded(info.pathInContainer, kPlain));
   addLine(text, kKind, info.kind);
   return text;
 }
@@ -191,8 +173,7 @@ std::optional<std::string> trashedName(const std::string& path) {
 }
 
 std::string trashDeletionDate(NSDate date) {
-  constexpr std::int64_t kSecond = 1'000'000'000;
-  const auto seconds = static_cast<std::time_t>(date.nanoseconds() / kSecond);
+  const std::time_t seconds = timespecOf(date.nanoseconds()).tv_sec;
   std::tm local{};
   std::array<char, 32> text{};
   if (localtime_r(&seconds, &local) == nullptr) return {};

@@ -1,0 +1,28 @@
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "platform/fileprovider/constants.h"
+#include "platform/foundation/data.h"
+#include "platform/foundation/error.h"
+#include "protocols/thumbnails.capnp.h"
+
+namespace yomber {
+
+/// The thumbnail of one item, as it travels.
+struct ItemThumbnail {
+  NSFileProviderItemIdentifier identifier;
+  NSDataRef image;                         ///< nil: the item has none
+  std::optional<std::string> contentType;  ///< nothing: as the image's bytes say
+  NSErrorRef error;                        ///< why there is no image, where something went wrong
+};
+
+/// A larger image is refused by whoever would send it.
+inline constexpr std::size_t kMaximumThumbnailBytes = std::size_t{8} << 20U;
+
+// Loop thread only.
+void encodeThumbnail(const ItemThumbnail& thumbnail, protocol::Thumbnail::Builder builder);
+[[nodiscard]] ItemThumbnail decodeThumbnail(protocol::Thumbnail::Reader reader);
+
+}  // namespace yomber

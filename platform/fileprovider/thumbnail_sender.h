@@ -1,0 +1,57 @@
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <memory>
+#include <vector>
+
+#include "platform/fileprovider/thumbnail.h"
+#include "platform/foundation/lock.h"
+#include "platform/ipc/remote.h"
+
+namespace yomber {
+
+/// Tells a receiver of thumbnails as they come, several at a time, with at most two calls under
+/// way. Whoever delivers faster than the receiver takes is held up.
+///
+/// Ownership: shared; kept by its calls under way.
+/// Thread-safety: every operation may be called on any thread; `deliver` may block, so not on the
+/// loop thread.
+class ThumbnailSender : public std::enable_shared_from_this<ThumbnailSender> {
+ public:
+  explicit ThumbnailSender(ipc::Remote<protocol::ThumbnailReceiver> receiver)
+      : receiver_(std::move(receiver)) {}
+
+  /// Returns when there is room for the next one. After the end, or a failure of the receiver,
+  /// nothing is sent any more. An image that is too large becomes an error.
+  void deliver(ItemThumbnail thumbnail);
+  /// Calls `handler` once, when everything that was delivered has been taken: with nil, or with why
+  /// the receiver took no more. Nothing is delivered after it.
+  void finish(std::function<void(NSErrorRef)> handler);
+  /// Nobody waits any more: lets everybody go.
+  void end();
+
+ private:
+  using Thumbnails = std::vector<ItemThumbnail>;
+
+  void sendWhatWaits();
+  void send(std::shared_ptr<const Thumbnails> part, std::size_t bytes);
+  void didSend(std::size_t bytes, NSErrorRef error);
+  /// The next call's, and how many bytes it has.
+  [[nodiscard]] Thumbnails takePart(std::size_t& bytes) REQUIRES(mutex_);
+  /// The handler, when it is due.
+  [[nodiscard]] std::function<void(NSErrorRef)> takeHandler() REQUIRES(mutex_);
+
+  const ipc::Remote<protocol::ThumbnailReceiver> receiver_;
+
+  Mutex mutex_;
+  Condition room_;
+  Thumbnails waiting_ GUARDED_BY(mutex_);
+  std::size_t bytes_ GUARDED_BY(mutex_) = 0;  ///< that wait or are under way
+  int calls_ GUARDED_BY(mutex_) = 0;          ///< under way
+  bool isEnded_ GUARDED_BY(mutex_) = false;
+  NSErrorRef failure_ GUARDED_BY(mutex_);
+  std::function<void(NSErrorRef)> handler_ GUARDED_BY(mutex_);
+};
+
+}  // namespace yomber

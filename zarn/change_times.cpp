@@ -2,6 +2,7 @@
 
 #include <ctime>
 
+#include "platform/foundation/file_time.h"
 #include "zarn/folder_snapshot.h"
 
 namespace yomber {
@@ -18,13 +19,15 @@ bool isDescribedBy(const ItemRow& row, const ItemAttributes& attributes) {
   ItemExtra extra = row.extra ? *row.extra : ItemExtra{};
   extra.containerID.clear();
   const bool isShared = (row.flags & row_flag::kShared) != 0;
-  return attributes.id == row.id && attributes.isShared == isShared && attributes.extra == extra;
+  const bool isOnlyReadable = (row.flags & row_flag::kOnlyReadable) != 0;
+  return attributes.id == row.id && attributes.isShared == isShared &&
+         attributes.isOnlyReadable == isOnlyReadable && attributes.extra == extra;
 }
 
 std::int64_t coarseNow() {
   timespec now{};
   clock_gettime(CLOCK_REALTIME_COARSE, &now);
-  return static_cast<std::int64_t>(now.tv_sec) * 1'000'000'000 + now.tv_nsec;
+  return nanosecondsOf(now);
 }
 
 std::optional<std::int64_t> changeTimeAfterOwnWrite(int folder, const std::string& name,

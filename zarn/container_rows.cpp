@@ -6,6 +6,7 @@
 #include <cerrno>
 
 #include "platform/foundation/bounced_name.h"
+#include "platform/foundation/file_time.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/item_store.h"
 #include "zarn/row_queries.h"
@@ -21,7 +22,7 @@ int makeFolder(const std::string& path) {
 }
 
 std::int64_t nanoseconds(const struct statx_timestamp& time) {
-  return time.tv_sec * 1'000'000'000 + time.tv_nsec;
+  return nanosecondsOf(time.tv_sec, time.tv_nsec);
 }
 
 /// The row of a container's folder as the disk has it; the name comes later.

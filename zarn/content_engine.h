@@ -15,8 +15,10 @@
 namespace yomber {
 
 class ContentStore;
+class DocumentDrawer;
 class ItemStore;
 class Scanner;
+class Shares;
 
 /// Where an item's content is.
 struct ContentState {
@@ -100,7 +102,12 @@ class ContentEngine {
     std::chrono::milliseconds offlinePause{2'000};
     /// For how long marks of filled files gather before they are synced and taken off together.
     std::chrono::milliseconds settlePause{500};
-    Clock clock;  ///< when empty, the system's
+    /// For how long thumbnails of what is uploaded together may keep it; the rest get theirs later.
+    std::chrono::milliseconds drawingPatience{30'000};
+    /// How often is asked what others have changed in shares.
+    std::chrono::milliseconds sharesPause{3'000};
+    std::shared_ptr<DocumentDrawer> drawer = {};  ///< when null, one of its own
+    Clock clock = {};                             ///< when empty, the system's
   };
 
   /// Reading option: the answer waits until what is going on with the item has ended.
@@ -120,6 +127,12 @@ class ContentEngine {
   /// The store of the account that is signed in now, under the name that tells accounts apart; null
   /// when nobody is. Jobs belong to the account under which they were made, and wait for it.
   virtual void setStore(std::shared_ptr<ContentStore> contents, const std::string& account) = 0;
+
+  /// How items are moved to the drive's trash. To be called before `start`, at most once.
+  virtual void setTrash(std::function<NSErrorRef(const std::string& path)> /*trash*/) {}
+
+  /// What is shared with others; null where there is no record store.
+  [[nodiscard]] virtual std::shared_ptr<Shares> shares() { return nullptr; }
 
   /// Completes when the content can be read; at once for what is here, and for folders and links.
   [[nodiscard]] virtual std::unique_ptr<ContentWish> startProviding(std::string_view path,

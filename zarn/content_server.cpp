@@ -6,8 +6,10 @@
 #include <vector>
 
 #include "platform/fileprovider/item_codec.h"
+#include "platform/foundation/log.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/server_call.h"
+#include "zarn/daemon_errors.h"
 #include "zarn/pending_wish.h"
 
 namespace yomber {
@@ -17,6 +19,7 @@ namespace {
 using Wire = protocol::Content;
 
 constexpr std::size_t kMaximumTransfers = 1000;
+constexpr std::size_t kMaximumDownloads = 1000;
 
 /// What work on the pool answers: a value, or an error, or both.
 template <typename Value>
@@ -94,6 +97,18 @@ void encodeTransfer(const ContentTransfer& transfer, Wire::Transfer::Builder bui
   builder.setAttempts(transfer.attempts);
   ipc::encodeOptional(transfer.failure, builder.initFailure());
   if (transfer.nextAttempt) builder.initNextAttempt().setValue(*transfer.nextAttempt);
+}
+
+/// Wishes for an item's content until it is here or cannot be had.
+void wishForGood(const std::shared_ptr<ContentEngine>& engine, const std::string& path) {
+  PendingWish::start(engine,
+                     [path](ContentEngine& owner, ContentEngine::Completion completion) {
+                       return owner.startProviding(path, 0, std::move(completion));
+                     })
+      .then([path](const NSErrorRef& error) {
+        if (error) log_error(defaultLog(), "[ERROR] can't download %@: %@", path, error);
+      })
+      .detach([](kj::Exception&&) {});
 }
 
 }  // namespace
@@ -179,6 +194,33 @@ kj::Promise<void> ContentServer::startProviding(StartProvidingContext context) {
                           ContentEngine& engine, ContentEngine::Completion completion) {
                         return engine.startProviding(path, options, std::move(completion));
                       });
+}
+
+kj::Promise<void> ContentServer::startDownloading(StartDownloadingContext context) {
+  struct Found {
+    std::vector<std::string> paths;
+    NSErrorRef error;
+  };
+  const auto list = context.getParams().getPaths();
+  Found wanted;
+  if (list.size() > kMaximumDownloads) {
+    wanted.error = invalidParameterError("paths", std::to_string(list.size()));
+  } else {
+    for (const auto path : list) wanted.paths.push_back(stringFromWire(path));
+  }
+  return run(
+      context, SignedIn::Needed,
+      [engine = engine_, wanted = std::move(wanted)](const ipc::CancelFlag&) mutable {
+        for (const std::string& path : wanted.paths) {
+          if (!wanted.error) (void)engine->contentState(path, &wanted.error);
+        }
+        return std::move(wanted);
+      },
+      [engine = engine_](auto results, const Found& found) {
+        ipc::encodeOptional(found.error, results.initFailure());
+        if (found.error) return;
+        for (const std::string& path : found.paths) wishForGood(engine, path);
+      });
 }
 
 kj::Promise<void> ContentServer::evict(EvictContext context) {

@@ -18,6 +18,7 @@ class ContentServer final : public protocol::Content::Server {
   ContentServer(std::shared_ptr<Drive> drive, std::shared_ptr<ContentEngine> engine);
 
   kj::Promise<void> startProviding(StartProvidingContext context) override;
+  kj::Promise<void> startDownloading(StartDownloadingContext context) override;
   kj::Promise<void> evict(EvictContext context) override;
   kj::Promise<void> setPinned(SetPinnedContext context) override;
   kj::Promise<void> contentState(ContentStateContext context) override;

@@ -1,5 +1,6 @@
 #include "zarn/daemon_server.h"
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -11,10 +12,13 @@
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/server_call.h"
 #include "platform/ostrell/constants.h"
+#include "zarn/content_records.h"
 #include "zarn/content_server.h"
 #include "zarn/daemon_errors.h"
 #include "zarn/item_encoder.h"
 #include "zarn/item_sender_server.h"
+#include "zarn/journal_sender.h"
+#include "zarn/sharing_server.h"
 
 namespace yomber {
 
@@ -96,6 +100,12 @@ std::optional<std::string> locationOf(const ItemStore& store, std::uint64_t id, 
   return path;
 }
 
+/// Whether something that the drive may take for an item lies there. One look at the disk.
+bool isOnDisk(const TreeLayout& layout, const std::string& path) {
+  struct stat status{};
+  return layout.placeOf(path) && !layout.isExcluded(path) && lstat(path.c_str(), &status) == 0;
+}
+
 template <typename Context>
 void answerLocation(Context context, const std::optional<std::string>& path,
                     const NSErrorRef& failure) {
@@ -113,11 +123,10 @@ void answerLocation(Context context, const std::optional<std::string>& path,
 /// Ends what it stands for when the client drops it.
 class DaemonServer::RegistrationServer final : public protocol::Registration::Server {
  public:
-  explicit RegistrationServer(std::unique_ptr<Registrations::Token> token)
-      : token_(std::move(token)) {}
+  explicit RegistrationServer(std::shared_ptr<void> token) : token_(std::move(token)) {}
 
  private:
-  const std::unique_ptr<Registrations::Token> token_;
+  const std::shared_ptr<void> token_;
 };
 
 DaemonServer::DaemonServer(std::shared_ptr<Drive> drive)
@@ -192,6 +201,9 @@ kj::Promise<void> DaemonServer::itemAtLocation(ItemAtLocationContext context) {
     FoundItem found{.row = {}, .error = failure ? failure : drive_->accountError()};
     if (!found.error && scans) return scanAndAnswer(context, std::move(path));
     if (!found.error) found.row = drive_->store->itemAtPath(path, &found.error);
+    // What was made a moment ago may still wait for its turn, behind thousands of others.
+    const bool isUnseen = !found.row && !found.error && isOnDisk(drive_->layout, path);
+    if (isUnseen) return scanAndAnswer(context, std::move(path));
     answerItem(context, found, path);
     return kj::READY_NOW;
   });
@@ -379,6 +391,13 @@ kj::Promise<void> DaemonServer::registerHost(RegisterHostContext context) {
   return kj::READY_NOW;
 }
 
+kj::Promise<void> DaemonServer::observeTree(ObserveTreeContext context) {
+  auto observer = ipc::Remote<protocol::TreeObserver>(context.getParams().getObserver());
+  context.getResults().setRegistration(kj::heap<RegistrationServer>(
+      drive_->journal->subscribe(makeJournalSender(std::move(observer)))));
+  return kj::READY_NOW;
+}
+
 // --- Account.
 
 kj::Promise<void> DaemonServer::account(AccountContext context) {
@@ -440,8 +459,34 @@ kj::Promise<void> DaemonServer::status(StatusContext context) {
 
 // --- Content.
 
+kj::Promise<void> DaemonServer::contentRecords(ContentRecordsContext context) {
+  return whenScanned(context, [this, context](NSErrorRef failure) mutable {
+    const auto objects = context.getParams().getObjects();
+    if (!failure) failure = drive_->accountError();
+    if (!failure && objects.size() > ContentRecords::kMaximumObjects) {
+      failure = invalidParameterError("objects", std::to_string(objects.size()));
+    }
+    std::vector<std::uint64_t> documents;
+    if (!failure) documents = ContentRecords::documentsIn(objects);
+    context.releaseParams();
+    context.allowCancellation();
+    return ipc::onPool([drive = drive_, failure = std::move(failure),
+                        documents = std::move(documents)](const ipc::CancelFlag& cancelled) {
+             return ContentRecords::find(*drive, documents, failure, cancelled);
+           })
+        .then([context](const ContentRecords& found) mutable {
+          found.encode(context.getResults().initResult());
+        });
+  });
+}
+
 kj::Promise<void> DaemonServer::content(ContentContext context) {
   context.getResults().setContent(kj::heap<ContentServer>(drive_, drive_->engine));
+  return kj::READY_NOW;
+}
+
+kj::Promise<void> DaemonServer::sharing(SharingContext context) {
+  context.getResults().setSharing(kj::heap<SharingServer>(drive_));
   return kj::READY_NOW;
 }
 

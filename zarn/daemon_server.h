@@ -12,7 +12,8 @@ namespace yomber {
 /// What one connection sees of the daemon (protocols/daemon.capnp). Loop thread only.
 ///
 /// Lookups by id and by location are answered right here: they take some ten microseconds, and are
-/// what a file browser waits for. Everything else that reads or scans runs on the pool.
+/// what a file browser waits for. Everything else that reads or scans runs on the pool; so does the
+/// lookup of a location that has no row yet, but a file.
 class DaemonServer final : public protocol::Daemon::Server {
  public:
   explicit DaemonServer(std::shared_ptr<Drive> drive);
@@ -43,7 +44,11 @@ class DaemonServer final : public protocol::Daemon::Server {
 
   kj::Promise<void> status(StatusContext context) override;
 
+  kj::Promise<void> contentRecords(ContentRecordsContext context) override;
   kj::Promise<void> content(ContentContext context) override;
+  kj::Promise<void> sharing(SharingContext context) override;
+
+  kj::Promise<void> observeTree(ObserveTreeContext context) override;
 
  private:
   class RegistrationServer;

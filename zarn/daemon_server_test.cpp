@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include "platform/fileprovider/constants.h"
 #include "platform/ostrell/constants.h"
@@ -122,6 +123,27 @@ TEST_F(DaemonServerTest, AForcedScanSeesWhatWasJustMade) {
     const auto item = itemAt(root_ + "/" + name, true);
     ASSERT_TRUE(item) << name;
     EXPECT_EQ(item->filename, name);
+  }
+}
+
+TEST_F(DaemonServerTest, ALookupFindsWhatTheObserverHasNotComeToYet) {
+  write("known");
+  Drive::Options options;
+  options.observer.batchInterval = std::chrono::hours(1);  // it is busy with others
+  upSignedIn(options);
+  ASSERT_TRUE(itemAt(root_ + "/known", false));
+  write("made/a moment ago");
+  write("left alone.nosync");
+  ASSERT_EQ(mkfifo((root_ + "/pipe").c_str(), 0600), 0);
+
+  const auto item = itemAt(root_ + "/made/a moment ago", false);
+  ASSERT_TRUE(item);
+  EXPECT_EQ(locationOf(item->identifier), root_ + "/made/a moment ago");
+  for (const char* name : {"left alone.nosync", "pipe", "never made"}) {
+    NSErrorRef error;
+    EXPECT_FALSE(itemAt(root_ + "/" + name, false, &error)) << name;
+    ASSERT_TRUE(error) << name;
+    EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSFileNoSuchFileError)) << error->description();
   }
 }
 

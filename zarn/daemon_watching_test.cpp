@@ -6,13 +6,31 @@
 #include "platform/foundation/gate.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/test_daemon.h"
+#include "zarn/test_waiting.h"
 
 namespace yomber::test {
 namespace {
 
 using testing::ElementsAre;
 
-class DaemonWatchingTest : public DaemonTest {};
+/// That a document has been uploaded is a change like any other, and told. Its store is out of
+/// reach here, so that nothing is told but what a test does.
+class DaemonWatchingTest : public DaemonTest {
+ protected:
+  void upSignedIn(Drive::Options options = {}) {
+    up(std::move(options));
+    std::ofstream(paths_.store + "/offline").put('x');
+    ASSERT_EQ(signIn("ada"), nullptr);
+  }
+  void reachStore() {
+    fs::remove(paths_.store + "/offline");
+    drive_->engine->retryNow();
+  }
+  /// What could be uploaded has been.
+  [[nodiscard]] bool waitForUploads() {
+    return drive_->engine->waitUntilIdle(std::chrono::seconds(20));
+  }
+};
 
 TEST_F(DaemonWatchingTest, AWatcherSeesWhatHappensOnDisk) {
   write("stays");
@@ -118,10 +136,30 @@ TEST_F(DaemonWatchingTest, AWatchIsActiveBeforeAnyLaterCallOfItsConnectionAndBri
         &Wire::Client::describeRequest, [](auto) {},
         [&](auto) { active = drive_->watchers->count(); });
     EXPECT_EQ(active, static_cast<std::size_t>(round));
+    if (round == kRounds / 2) {
+      EXPECT_TRUE(waitForUploads());
+    }
   }
   EXPECT_TRUE(watched.wait(kRounds));
   write("folder/new");
-  for (const auto& each : subscribed) EXPECT_TRUE(each.watcher->waitForNames({"new"}));
+  for (const auto& each : subscribed) ASSERT_TRUE(each.watcher->waitForNames({"new"}));
+}
+
+TEST_F(DaemonWatchingTest, AWatchThatBeganBeforeADocumentWasUploadedIsToldOfThatAndMissesNothing) {
+  write("folder/there");
+  upSignedIn();
+  EXPECT_THAT(list(), ElementsAre("folder"));
+  const auto early = subscribe();
+  ASSERT_EQ(watch(early, root_ + "/folder"), nullptr);
+  ASSERT_TRUE(waitUntil([&] { return drive_->engine->transfers().isOffline; }));
+  EXPECT_TRUE(early.watcher->waitForNames({}));
+  reachStore();
+  EXPECT_TRUE(early.watcher->waitForNames({"there"}));
+  const auto late = subscribe();
+  ASSERT_EQ(watch(late, root_ + "/folder"), nullptr);
+  write("folder/new");
+  EXPECT_TRUE(early.watcher->waitForNames({"there", "new"}));
+  EXPECT_TRUE(late.watcher->waitForNames({"new"}));
 }
 
 TEST_F(DaemonWatchingTest, WithoutEnoughWatchesItSaysWhatToRaiseAndStillSeesChanges) {

@@ -373,7 +373,7 @@ void Database::State::storeRank(WriteTransaction& transaction) {
 }
 
 void Database::State::publish(const WriteTransaction& transaction) {
-  if (transaction.changes().empty()) return;
+  if (transaction.changes().empty() && transaction.touched().empty()) return;
   std::vector<std::shared_ptr<ChangeSink>> live;
   {
     LockGuard guard(sinksMutex);
@@ -384,7 +384,10 @@ void Database::State::publish(const WriteTransaction& transaction) {
       return false;
     });
   }
-  for (const auto& sink : live) sink->committed(transaction.changes());
+  for (const auto& sink : live) {
+    if (!transaction.changes().empty()) sink->committed(transaction.changes());
+    if (!transaction.touched().empty()) sink->touched(transaction.touched());
+  }
 }
 
 std::unique_ptr<Connection> Database::State::takeReader() {

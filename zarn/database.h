@@ -25,6 +25,8 @@ class ChangeSink {
  public:
   virtual ~ChangeSink() = default;
   virtual void committed(const std::vector<ItemChange>& changes) = 0;
+  /// After `committed`: rows that were changed in nothing that is shown of them, as they are now.
+  virtual void touched(const std::vector<ItemRow>& /*rows*/) {}
 };
 
 /// Stores something of its own together with every change of rows.

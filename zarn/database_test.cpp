@@ -237,22 +237,24 @@ TEST_F(DatabaseTest, SetsADamagedFileAside) {
 TEST_F(DatabaseTest, ChecksAFileThatWasFoundDamagedWhileInUse) {
   for (int i = 0; i < 200; ++i) ASSERT_EQ(insert("item " + std::to_string(i)), nullptr);
   close();
-  // Pages behind the first few are overwritten: the file opens, but its content is broken.
+  // The last pages are overwritten, which hold items and are not read on opening.
   const auto size = std::filesystem::file_size(layout.databasePath());
   std::fstream file(layout.databasePath(), std::ios::in | std::ios::out | std::ios::binary);
-  file.seekp(8192);
-  file << std::string(size - 8192, '\x5a');
+  const auto begin = size - size / 8;
+  file.seekp(static_cast<std::streamoff>(begin));
+  file << std::string(size - begin, '\x5a');
   file.close();
   NSErrorRef error;
   database = Database::open(layout.databasePath(), &error);
-  if (database) {
-    // What was damaged is only met on use.
-    store = std::make_shared<ItemStore>(database, layout);
-    NSErrorRef failure;
-    (void)store->itemByName(kRootID, "item 7", &failure);
-    EXPECT_NE(failure, nullptr);
-    close();
+  ASSERT_NE(database, nullptr) << error->description();
+  store = std::make_shared<ItemStore>(database, layout);
+  NSErrorRef failure;
+  for (int i = 0; i < 200 && failure == nullptr; ++i) {
+    (void)store->itemByName(kRootID, "item " + std::to_string(i), &failure);
   }
+  EXPECT_NE(failure, nullptr);
+  EXPECT_TRUE(damagedFiles().empty()) << "what is in use stays where it is";
+  close();
   open();
   EXPECT_EQ(damagedFiles().size(), 1U);
   EXPECT_EQ(insert("b"), nullptr);

@@ -151,6 +151,13 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
       feed(std::make_shared<ChangeFeed>(database)),
       observer(std::make_shared<TreeObserver>(options.observer)),
       scanner(std::make_shared<Scanner>(store, observer)),
+      journal(std::make_shared<TreeJournal>(
+          store,
+          [weak = std::weak_ptr(observer)](std::uint64_t folder) {
+            const auto strong = weak.lock();
+            return strong && strong->isWatched(folder);
+          },
+          options.journal)),
       watchers(Watchers::create(
           [itemStore = store](std::uint64_t id) { return itemStore->ancestors(id); },
           options.watchers)),
@@ -169,10 +176,17 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
                                                                  strong->workingSetDidChange();
                                                              })),
       records_(openStore(paths, options.engine)) {
+  observer->setEventSink(journal);
   database->addSink(observer);
+  database->addSink(journal);
   database->addSink(watchers);
   database->addSink(workingSetSignals_);
   database->addSink(trash);
+  engine->setTrash([owned = trash](const std::string& path) {
+    NSErrorRef error;
+    (void)owned->trash(path, [] { return false; }, &error);
+    return error;
+  });
 }
 
 Drive::~Drive() { stop(); }
@@ -229,9 +243,11 @@ NSErrorRef Drive::scanAll() {
               report.unreadable);
   }
   if (isFirst) {
+    // Nobody was told of what it found, and only now it is known how names are shown.
+    journal->didLoseTrack();
     workingSetSignals_->start();
-    firstScan->open();
     updateStore();
+    firstScan->open();
     engine->sweep();
   }
   return nullptr;

@@ -25,6 +25,7 @@
 #include "zarn/registrations.h"
 #include "zarn/scanner.h"
 #include "zarn/trash.h"
+#include "zarn/tree_journal.h"
 #include "zarn/tree_layout.h"
 #include "zarn/tree_observer.h"
 #include "zarn/watchers.h"
@@ -43,6 +44,7 @@ class Drive : public std::enable_shared_from_this<Drive> {
   struct Options {
     TreeObserver::Options observer;
     Watchers::Options watchers;
+    TreeJournal::Options journal;
     /// Where `.desktop` files are looked for.
     std::vector<std::string> applications = applicationDirectories();
     /// In the place of the drive's own, which then has no record store.
@@ -73,6 +75,7 @@ class Drive : public std::enable_shared_from_this<Drive> {
   const std::shared_ptr<ChangeFeed> feed;
   const std::shared_ptr<TreeObserver> observer;
   const std::shared_ptr<Scanner> scanner;
+  const std::shared_ptr<TreeJournal> journal;
   const std::shared_ptr<Watchers> watchers;
   const std::shared_ptr<Registrations> registrations;
   const std::shared_ptr<FirstScanGate> firstScan;

@@ -56,6 +56,7 @@ void FirstScan::fillRow(const FolderSnapshot& snapshot, const FolderEntry& entry
       attributes.extra.isEmpty() ? nullptr : std::make_shared<const ItemExtra>(attributes.extra);
   row.flags = attributes.isFault ? 0 : row_flag::kDownloaded;
   if (attributes.isShared) row.flags |= row_flag::kShared;
+  if (attributes.isOnlyReadable) row.flags |= row_flag::kOnlyReadable;
 }
 
 void FirstScan::addPlace(ItemRow row, std::uint64_t visit) {

@@ -10,6 +10,7 @@
 #include <cstddef>
 #include <limits>
 
+#include "platform/foundation/file_time.h"
 #include "zarn/change_times.h"
 #include "zarn/tree_layout.h"
 
@@ -18,12 +19,8 @@ namespace {
 
 constexpr std::size_t kReadBuffer = 128 * 1024;
 
-/// In nanoseconds, within what 64 bits hold whatever the disk says.
 std::int64_t nanoseconds(const statx_timestamp& time) {
-  constexpr std::int64_t kLargest = std::numeric_limits<std::int64_t>::max() / 1'000'000'000 - 1;
-  if (time.tv_sec > kLargest) return kLargest * 1'000'000'000;
-  if (time.tv_sec < -kLargest) return -kLargest * 1'000'000'000;
-  return time.tv_sec * 1'000'000'000 + time.tv_nsec;
+  return nanosecondsOf(time.tv_sec, time.tv_nsec);
 }
 
 bool typeOf(std::uint32_t mode, EntryType& type) {

@@ -10,6 +10,7 @@
 #include <limits>
 #include <vector>
 
+#include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
 #include "zarn/file_descriptor.h"
 #include "zarn/lent_mode.h"
@@ -43,7 +44,7 @@ std::optional<std::int64_t> readNumber(const char* path, const char* name) {
 }
 
 int writeValue(int file, const char* attribute, const std::optional<std::string>& value) {
-  const std::string path = "/proc/self/fd/" + std::to_string(file);
+  const std::string path = pathOfDescriptor(file);
   if (value) {
     return setxattr(path.c_str(), attribute, value->data(), value->size(), 0) == 0 ? 0 : errno;
   }
@@ -61,6 +62,8 @@ void readOne(const char* path, std::string_view name, ItemAttributes& out) {
     out.extra.lastUsed = readNumber(path, kLastUsedAttribute);
   } else if (name == kSharedAttribute) {
     out.isShared = true;
+  } else if (name == kOnlyReadableAttribute) {
+    out.isOnlyReadable = true;
   } else if (name == kTagsAttribute) {
     out.extra.tags = splitTags(readValue(path, kTagsAttribute).value_or(std::string()));
   } else if (name == kFaultAttribute) {
@@ -124,7 +127,7 @@ bool stampItem(int folder, const std::string& name, std::uint64_t inode, std::ui
 }
 
 std::string pathThroughDescriptor(int folder, std::string_view name) {
-  return "/proc/self/fd/" + std::to_string(folder) + "/" + std::string(name);
+  return pathOfDescriptor(folder) + "/" + std::string(name);
 }
 
 }  // namespace yomber

@@ -15,16 +15,21 @@ inline constexpr const char* kIDAttribute = "user.yomber.id";              ///< 
 inline constexpr const char* kFavoriteAttribute = "user.yomber.favorite";  ///< decimal rank
 inline constexpr const char* kLastUsedAttribute = "user.yomber.lastused";  ///< decimal ns
 inline constexpr const char* kSharedAttribute = "user.yomber.shared";      ///< by its presence
-inline constexpr const char* kTagsAttribute = "user.xdg.tags";             ///< separated by commas
+/// By its presence: in a share that this account may only read.
+inline constexpr const char* kOnlyReadableAttribute = "user.yomber.readonly";
+inline constexpr const char* kTagsAttribute = "user.xdg.tags";  ///< separated by commas
 
 /// What a file's attributes say.
 struct ItemAttributes {
   std::optional<std::uint64_t> id;
   bool isShared = false;
+  bool isOnlyReadable = false;
   bool isFault = false;  ///< its content is not here
   ItemExtra extra;       ///< without the container
 
-  [[nodiscard]] bool isEmpty() const { return !id && !isShared && !isFault && extra.isEmpty(); }
+  [[nodiscard]] bool isEmpty() const {
+    return !id && !isShared && !isOnlyReadable && !isFault && extra.isEmpty();
+  }
 };
 
 /// Reads them; none where the file is gone or has none. Values that make no sense count as absent.

@@ -5,7 +5,7 @@
 #include <charconv>
 #include <limits>
 
-#include "zarn/content_types.h"
+#include "platform/glimmet/content_types.h"
 
 namespace yomber {
 namespace {
@@ -60,7 +60,7 @@ std::uint32_t itemCapabilities(const ItemRow& row) {
                                        NSFileProviderItemCapabilitiesAllowsRenaming |
                                        NSFileProviderItemCapabilitiesAllowsTrashing |
                                        NSFileProviderItemCapabilitiesAllowsDeleting;
-  if (row.id == kTrashID) return kReading;
+  if (row.id == kTrashID || (row.flags & row_flag::kOnlyReadable) != 0) return kReading;
   const bool isPlace = row.id == kRootID || row.isContainerFolder();
   // A symbolic link's own mode says nothing; what the target allows is the target's.
   const bool isWritable = S_ISLNK(row.mode) || (row.mode & kOwnerWrite) != 0;

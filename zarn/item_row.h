@@ -32,6 +32,8 @@ inline constexpr std::uint32_t kHasExtra = 1U << 17U;  ///< there is an ItemExtr
 /// The row alone holds what else is known: the file cannot carry it (a symbolic link, several hard
 /// links). Whatever attributes the file has do not count.
 inline constexpr std::uint32_t kKeepsExtra = 1U << 18U;
+/// It lies in what somebody shares with this account for reading only.
+inline constexpr std::uint32_t kOnlyReadable = 1U << 19U;
 }  // namespace row_flag
 
 /// What few items have: kept apart so that rows stay slim.
@@ -96,9 +98,14 @@ struct ItemChange {
   bool isNew = false;
   std::uint64_t parentBefore = kNoParent;  ///< kNoParent when new
   std::string nameBefore;                  ///< empty when new
+  std::string diskNameBefore;              ///< as in `ItemRow`; empty when new
+  std::uint64_t inodeBefore = 0;           ///< 0 when new
 
   [[nodiscard]] bool isDead() const { return row.isDead(); }
   [[nodiscard]] bool hasMoved() const { return !isNew && parentBefore != row.parent; }
+  [[nodiscard]] const std::string& nameOnDiskBefore() const {
+    return diskNameBefore.empty() ? nameBefore : diskNameBefore;
+  }
 };
 
 }  // namespace yomber

@@ -148,6 +148,10 @@ std::optional<std::string> ItemStore::physicalPath(std::uint64_t id, NSErrorRef*
   });
 }
 
+std::string ItemStore::physicalPath(const ItemChain& chain) const {
+  return pathOfChain(layout_, chain, true);
+}
+
 ItemStore::Counts ItemStore::counts(NSErrorRef* error) const {
   // Looked at before counting: what is committed meanwhile makes the next call count again.
   Counted counted{

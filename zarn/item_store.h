@@ -16,6 +16,8 @@
 
 namespace yomber {
 
+struct ItemChain;
+
 /// A container that has a folder of its own in the root.
 struct ContainerFolder {
   std::string containerID;
@@ -52,6 +54,9 @@ class ItemStore {
                                                        NSErrorRef* error = nullptr) const;
   [[nodiscard]] std::optional<std::string> physicalPath(std::uint64_t id,
                                                         NSErrorRef* error = nullptr) const;
+
+  /// The same of an item whose chain was read already.
+  [[nodiscard]] std::string physicalPath(const ItemChain& chain) const;
 
   struct Located {
     ItemRow row;

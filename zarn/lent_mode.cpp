@@ -15,6 +15,7 @@
 #include <utility>
 
 #include "platform/foundation/atomic_cell.h"
+#include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/log.h"
@@ -31,8 +32,6 @@ AtomicCell<std::string>& notesFolder() {
   return *instance;
 }
 
-std::string throughDescriptor(int file) { return "/proc/self/fd/" + std::to_string(file); }
-
 std::string linkTarget(const std::string& path) {
   std::array<char, PATH_MAX + 64> target{};
   const ssize_t length = readlink(path.c_str(), target.data(), target.size());
@@ -45,8 +44,7 @@ std::string writeNote(int file, const struct stat& status) {
   if (folder.empty()) return {};
   static std::atomic<std::uint64_t> last{0};
   const std::string text = std::to_string(status.st_mode & kAllBits) + " " +
-                           std::to_string(status.st_ino) + " " +
-                           linkTarget(throughDescriptor(file));
+                           std::to_string(status.st_ino) + " " + linkTarget(pathOfDescriptor(file));
   for (;;) {
     std::string note = folder + "/" + std::to_string(++last);
     if (symlink(text.c_str(), note.c_str()) == 0) return note;
@@ -74,7 +72,7 @@ void restore(std::string_view note) {
   if (!file || fstat(file.get(), &status) != 0) return;
   const bool isAsLent =
       status.st_ino == inode && (status.st_mode & kAllBits) == ((mode | S_IWUSR) & kAllBits);
-  if (isAsLent) (void)chmod(throughDescriptor(file.get()).c_str(), mode & kAllBits);
+  if (isAsLent) (void)chmod(pathOfDescriptor(file.get()).c_str(), mode & kAllBits);
 }
 
 }  // namespace
@@ -94,7 +92,7 @@ std::optional<LentMode> LentMode::lend(int file) {
   result.own_ = status.st_mode & kAllBits;
   result.note_ = writeNote(file, status);
   const bool isNoted = !result.note_.empty() || notesFolder().load().empty();
-  if (!isNoted || chmod(throughDescriptor(file).c_str(), result.own_ | S_IWUSR) != 0) {
+  if (!isNoted || chmod(pathOfDescriptor(file).c_str(), result.own_ | S_IWUSR) != 0) {
     return std::nullopt;
   }
   (void)modeLent.hit();
@@ -112,7 +110,7 @@ LentMode::~LentMode() {
   struct stat status{};
   const bool isAsLent =
       fstat(file_, &status) == 0 && (status.st_mode & kAllBits) == (own_ | S_IWUSR);
-  if (isAsLent) (void)chmod(throughDescriptor(file_).c_str(), own_);
+  if (isAsLent) (void)chmod(pathOfDescriptor(file_).c_str(), own_);
   close(file_);
   if (!note_.empty()) (void)unlink(note_.c_str());
   errno = number;

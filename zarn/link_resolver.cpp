@@ -10,6 +10,7 @@
 #include <memory>
 #include <optional>
 
+#include "platform/foundation/descriptor_path.h"
 #include "zarn/file_descriptor.h"
 #include "zarn/item_attributes.h"
 
@@ -32,7 +33,7 @@ std::optional<std::string> readLink(int folder, const std::string& name) {
 
 /// Where a descriptor's file is; nothing where that is too deep to be said.
 std::optional<std::string> locationOf(int descriptor) {
-  auto path = readLink(AT_FDCWD, "/proc/self/fd/" + std::to_string(descriptor));
+  auto path = readLink(AT_FDCWD, pathOfDescriptor(descriptor));
   if (!path || path->front() != '/' || path->ends_with(" (deleted)")) return std::nullopt;
   return path;
 }

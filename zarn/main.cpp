@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "platform/foundation/drive_paths.h"
+#include "platform/foundation/ending_signals.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
 #include "platform/ipc/listener.h"
@@ -73,16 +74,6 @@ int fail(int code, const std::string& text) {
 int failLogged(int code, const NSErrorRef& error) {
   log_error(defaultLog(), "[ERROR] cannot start: %@", error);
   return fail(code, error->localizedDescription());
-}
-
-/// Blocks the signals that end the process, in every thread that is started from now on.
-sigset_t blockEndingSignals() {
-  sigset_t set;
-  sigemptyset(&set);
-  for (const int signal : {SIGTERM, SIGINT, SIGHUP}) sigaddset(&set, signal);
-  (void)pthread_sigmask(SIG_BLOCK, &set, nullptr);
-  (void)std::signal(SIGPIPE, SIG_IGN);
-  return set;
 }
 
 /// With a heap for nearly every thread, what one load has freed in its heap would help no other.

@@ -11,6 +11,7 @@
 #include "platform/ostrell/move_capability.h"
 #include "zarn/daemon_errors.h"
 #include "zarn/located_item.h"
+#include "zarn/share_doors.h"
 
 namespace yomber {
 namespace {
@@ -58,6 +59,10 @@ MoveCapabilities::Verdict MoveCapabilities::judge(std::string_view source,
             refusedError(EPERM, destination,
                          "this is the drive's own place; choose a folder among its items")};
   }
+  if (!layout.isExcluded(source)) {
+    if (NSErrorRef refused = refusedByShare(*store_, *row, source))
+      return {QSMoveCapabilityRefusedFixedItem, std::move(refused)};
+  }
   const bool isLeaving = !place || layout.isExcluded(destination);
   if (isLeaving) return {QSMoveCapabilityOutOfSync, nullptr};
   return judgeIntoFolder(*row, source, destination);
@@ -73,6 +78,8 @@ MoveCapabilities::Verdict MoveCapabilities::judgeIntoFolder(const ItemRow& row,
     return {QSMoveCapabilityRefusedLocation,
             refusedError(ENOTDIR, destination, "nothing can be moved into what is no folder")};
   }
+  if (NSErrorRef refused = refusedInFolder(*store_, *folder, destination))
+    return {QSMoveCapabilityRefusedLocation, std::move(refused)};
   const auto above = store_->ancestors(folder->id, &error);
   const bool isInto =
       folder->id == row.id || std::find(above.begin(), above.end(), row.id) != above.end();

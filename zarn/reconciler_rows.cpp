@@ -8,8 +8,9 @@
 namespace yomber {
 namespace {
 
-constexpr std::uint32_t kFromDisk =
-    row_flag::kShared | row_flag::kDownloaded | row_flag::kHasExtra | row_flag::kStamped;
+constexpr std::uint32_t kFromDisk = row_flag::kShared | row_flag::kOnlyReadable |
+                                    row_flag::kDownloaded | row_flag::kHasExtra |
+                                    row_flag::kStamped;
 
 bool isShownDifferently(const ItemRow& left, const ItemRow& right) {
   constexpr std::uint32_t kUnseen =
@@ -20,7 +21,7 @@ bool isShownDifferently(const ItemRow& left, const ItemRow& right) {
          left.diskName != right.diskName || left.kind != right.kind ||
          (left.flags & ~kUnseen) != (right.flags & ~kUnseen) || left.mode != right.mode ||
          left.size != right.size || left.mtime != right.mtime || left.btime != right.btime ||
-         !hasSameExtra;
+         (left.isFolder() && left.inode != right.inode) || !hasSameExtra;
 }
 
 /// Its content is being filled in or given up: what is stored of it stays.
@@ -66,6 +67,7 @@ void Reconciler::describe(const Candidate& candidate, ItemRow& row) const {
   row.extra = extra.isEmpty() ? nullptr : std::make_shared<const ItemExtra>(std::move(extra));
   row.flags &= ~kFromDisk;
   if (attributes.isShared) row.flags |= row_flag::kShared;
+  if (attributes.isOnlyReadable) row.flags |= row_flag::kOnlyReadable;
   if (!attributes.isFault) row.flags |= row_flag::kDownloaded;
   if (row.extra) row.flags |= row_flag::kHasExtra;
 }

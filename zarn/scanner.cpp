@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstring>
 #include <functional>
@@ -112,6 +113,7 @@ class Scanner::State {
   const std::weak_ptr<FolderVisitor> visitor;
   const LinkResolver links;
   Stamper stamper;
+  std::atomic<bool> hasScannedAll{false};
   Mutex wholeScan;  ///< held by a scan of the whole tree: two first scans would issue two ids each
 };
 
@@ -231,13 +233,17 @@ NSErrorRef Scanner::scanAll(ScanReport* report) {
   out = {};
   LockGuard guard(state_->wholeScan);
   try {
-    if (state_->store->database()->needsFirstScan()) return state_->firstScan(out);
-    return state_->reconcile(out);
+    const bool isFirst = state_->store->database()->needsFirstScan();
+    NSErrorRef error = isFirst ? state_->firstScan(out) : state_->reconcile(out);
+    if (!error) state_->hasScannedAll = true;
+    return error;
   } catch (const std::exception& exception) {
     return NSError::errorWithDomain(kDatabaseErrorDomain, kDatabaseFailure,
                                     {{NSLocalizedDescriptionKey, std::string(exception.what())}});
   }
 }
+
+bool Scanner::hasScannedAll() const { return state_->hasScannedAll; }
 
 NSErrorRef Scanner::scanFolders(const std::vector<std::uint64_t>& folders, ScanReport* report) {
   ScanReport own;

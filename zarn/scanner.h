@@ -57,6 +57,8 @@ class Scanner {
 
   /// The whole tree: the first scan where the database is empty, else a reconciling one.
   [[nodiscard]] NSErrorRef scanAll(ScanReport* report = nullptr);
+  /// Whether that has succeeded in this process: rows may be behind the disk until then.
+  [[nodiscard]] bool hasScannedAll() const;
 
   /// Folders by id, as one change: an item that moved between two of them keeps its id and is
   /// reported once. Folders that are new in them are scanned with all that they hold.

@@ -29,6 +29,20 @@ class ScannerTest : public TestDrive {
   }
 };
 
+TEST_F(ScannerTest, DatesOfOtherCenturiesKeepTheirSignAndAreNoChange) {
+  write("late");
+  write("early");
+  const timespec year2400[2] = {{13'569'465'600, 7}, {13'569'465'600, 7}};
+  const timespec year1800[2] = {{-5'364'662'400, 7}, {-5'364'662'400, 7}};
+  ASSERT_EQ(utimensat(AT_FDCWD, at("late").c_str(), year2400, 0), 0);
+  // Some file systems begin later; what they make of it is what there is to keep.
+  ASSERT_EQ(utimensat(AT_FDCWD, at("early").c_str(), year1800, 0), 0);
+  scan();
+  EXPECT_GT(row("late")->mtime, 9'000'000'000'000'000'000);
+  EXPECT_LT(row("early")->mtime, -2'000'000'000'000'000'000);
+  EXPECT_EQ(scan().changes, 0U);
+}
+
 TEST_F(ScannerTest, TheFirstScanFindsEverythingAndAskedAgainNothingNew) {
   populate();
   setAttribute("top.txt", kTagsAttribute, "red");

@@ -8,7 +8,7 @@
 namespace yomber {
 
 /// The version of the tables that this program reads and writes.
-inline constexpr std::int64_t kSchemaVersion = 2;
+inline constexpr std::int64_t kSchemaVersion = 6;
 
 /// Thrown by `prepareSchema` for a file that a newer program made.
 struct SchemaTooNew {
@@ -23,6 +23,9 @@ inline constexpr const char* kOldestRank = "oldestRank";    ///< see Database::o
 inline constexpr const char* kIsComplete = "isComplete";    ///< 1 once a whole scan is stored
 inline constexpr const char* kStampedUpTo = "stampedUpTo";  ///< see Scanner::stampSome
 inline constexpr const char* kSweptUpTo = "sweptUpTo";      ///< see ContentJobs::sweep
+inline constexpr const char* kThumbnailsSweptUpTo = "thumbnailsSweptUpTo";  ///< as above
+/// There was nobody to draw: all documents are looked at again at the next start.
+inline constexpr const char* kThumbnailsMissed = "thumbnailsMissed";
 inline constexpr const char* kLastAccount = "lastAccount";  ///< key of who was signed in last
 inline constexpr const char* kCollectedAt = "collectedAt";  ///< see StoreUpkeep; ns since the epoch
 }  // namespace meta

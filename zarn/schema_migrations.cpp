@@ -42,6 +42,45 @@ const char* const kContentTables = R"sql(
   CREATE INDEX content_pinned ON content(id) WHERE pinned=1;
 )sql";
 
+// Those that have failed are shown again and again, however many wait.
+const char* const kFailedJobsIndex =
+    "CREATE INDEX job_failed ON job(account, due, seq) WHERE state<>0";
+
+// What was drawn of some content; a hash of null: nothing can be. `version`: of what drew.
+const char* const kThumbnailTable =
+    "CREATE TABLE thumbnail(content BLOB PRIMARY KEY, version INTEGER NOT NULL, hash BLOB, "
+    "size INTEGER NOT NULL) WITHOUT ROWID";
+
+// `owner` of content is null where the zone is a container's. `share` has a row for each item of
+// the drive that is shared, its own or somebody else's.
+const char* const kShareTables = R"sql(
+  ALTER TABLE content ADD COLUMN owner BLOB;
+  CREATE INDEX content_shared ON content(zone, owner) WHERE owner IS NOT NULL;
+  CREATE TABLE share(
+    root INTEGER PRIMARY KEY,
+    account INTEGER NOT NULL,
+    zone BLOB NOT NULL,
+    owner BLOB NOT NULL,
+    state INTEGER NOT NULL,
+    writable INTEGER NOT NULL,
+    folder INTEGER NOT NULL,
+    title BLOB NOT NULL,
+    token BLOB NOT NULL,
+    zone_tag BLOB NOT NULL);
+  CREATE UNIQUE INDEX share_zone ON share(account, zone, owner);
+  CREATE TABLE share_waiting(
+    root INTEGER NOT NULL,
+    record INTEGER NOT NULL,
+    PRIMARY KEY(root, record)) WITHOUT ROWID;
+)sql";
+
+// When records that wait are asked for again: ns since the epoch.
+const char* const kShareWaitingTimes = R"sql(
+  ALTER TABLE share_waiting ADD COLUMN attempts INTEGER NOT NULL DEFAULT 0;
+  ALTER TABLE share_waiting ADD COLUMN due INTEGER NOT NULL DEFAULT 0;
+  CREATE INDEX share_waiting_due ON share_waiting(root, due);
+)sql";
+
 namespace {
 
 /// What turns version n, its place in the table plus one, into the next. Never changed once
@@ -54,6 +93,12 @@ struct Migration {
 constexpr std::array kMigrations{
     Migration{"jobs and content",
               [](Connection& connection) { connection.execute(kContentTables); }},
+    Migration{"an index of jobs that failed",
+              [](Connection& connection) { connection.execute(kFailedJobsIndex); }},
+    Migration{"thumbnails", [](Connection& connection) { connection.execute(kThumbnailTable); }},
+    Migration{"shares", [](Connection& connection) { connection.execute(kShareTables); }},
+    Migration{"when shared records are asked for again",
+              [](Connection& connection) { connection.execute(kShareWaitingTimes); }},
 };
 
 }  // namespace

@@ -59,12 +59,17 @@ class Watcher {
     }
     return true;
   }
-  bool waitForNames(const std::set<std::string>& expected) {
-    return waitUntil([&](const auto& names) {
-      std::set<std::string> values;
-      for (const auto& [identifier, name] : names) values.insert(name);
-      return values == expected;
+  /// A failure says what is held instead.
+  testing::AssertionResult waitForNames(const std::set<std::string>& expected) {
+    std::set<std::string> held;
+    const bool isHeld = waitUntil([&](const auto& names) {
+      held.clear();
+      for (const auto& [identifier, name] : names) held.insert(name);
+      return held == expected;
     });
+    if (isHeld) return testing::AssertionSuccess();
+    return testing::AssertionFailure() << "it holds " << testing::PrintToString(held) << " and not "
+                                       << testing::PrintToString(expected);
   }
   NSErrorRef waitForFailure() {
     const auto deadline = steady_clock::now() + std::chrono::seconds(20);

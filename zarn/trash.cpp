@@ -9,12 +9,14 @@
 #include <cstdlib>
 #include <utility>
 
+#include "platform/fileprovider/item_kind_name.h"
 #include "platform/foundation/date.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/daemon_errors.h"
 #include "zarn/located_item.h"
+#include "zarn/share_doors.h"
 #include "zarn/staged_removal.h"
 #include "zarn/tree_walker.h"
 
@@ -22,22 +24,6 @@ namespace yomber {
 namespace {
 
 constexpr std::string_view kStaging = "emptied-";
-
-const char* kindName(ItemKind kind) {
-  switch (kind) {
-    case ItemKind::Document:
-      return "document";
-    case ItemKind::Folder:
-      return "folder";
-    case ItemKind::Alias:
-      return "alias";
-    case ItemKind::Bookmark:
-      return "bookmark";
-    case ItemKind::Symlink:
-      return "symlink";
-  }
-  return "document";
-}
 
 /// Why an item cannot be trashed; nil when it can.
 NSErrorRef refusal(const ItemRow& row, std::string_view path) {
@@ -121,7 +107,7 @@ std::optional<TrashInfo> Trash::describe(const ItemRow& row, NSErrorRef* error) 
   info.deletionDate = trashDeletionDate(NSDate::now());
   info.containerID = place->containerID;
   info.pathInContainer = place->relative;
-  info.kind = kindName(row.kind);
+  info.kind = itemKindName(row.kind);
   return info;
 }
 
@@ -130,6 +116,7 @@ std::optional<std::string> Trash::trash(std::string_view path, const IsCancelled
   NSErrorRef failure = noSuchLocationError(std::string(path));
   const auto item = locateItem(*store_, *scanner_, path, &failure);
   if (item) failure = refusal(item->row, path);
+  if (item && !failure) failure = refusedByShare(*store_, item->row, path);
   std::optional<TrashInfo> info;
   if (item && !failure) {
     failure = noSuchLocationError(std::string(path));  // it may go meanwhile

@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <cstring>
 #include <iterator>
+#include <string_view>
 #include <thread>
 #include <unordered_map>
 #include <utility>
@@ -41,6 +42,8 @@ class TreeObserver::State {
         watches_(options.watchLimit),
         queueDescriptor_(watches_.descriptor()),
         dirty_(options.modifyInterval) {}
+
+  void setEventSink(std::weak_ptr<DiskEventSink> sink) { sink_ = std::move(sink); }
 
   void start(ObservedTree tree) {
     tree_ = std::move(tree);
@@ -75,9 +78,19 @@ class TreeObserver::State {
             .lastFailure = lastFailure_};
   }
 
-  void willReadFolder(std::uint64_t visit, int descriptor) {
+  bool isWatched(std::uint64_t folder) const {
     LockGuard guard(mutex_);
-    watches_.willRead(visit, descriptor);
+    return watches_.isWatched(folder);
+  }
+
+  void willReadFolder(std::uint64_t visit, int descriptor) {
+    std::uint64_t watched = 0;
+    {
+      LockGuard guard(mutex_);
+      watched = watches_.willRead(visit, descriptor);
+    }
+    if (watched == 0) return;
+    if (const auto sink = wantedSink()) sink->entriesDidChange({{.folder = watched, .name = {}}});
   }
 
   void didIdentifyFolder(std::uint64_t visit, std::uint64_t id) {
@@ -112,12 +125,23 @@ class TreeObserver::State {
   }
 
  private:
+  /// What the events of one reading say to those outside.
+  struct Seen {
+    std::vector<DiskEntry> entries;
+    bool lostTrack = false;
+  };
   /// A folder that has a row but was not read.
   struct Unread {
     unsigned attempts = 0;
     bool isDue = false;
     Clock::time_point due;
   };
+
+  /// Null while nobody wants to be told of events.
+  std::shared_ptr<DiskEventSink> wantedSink() const {
+    auto sink = sink_.lock();
+    return sink && sink->wantsEvents() ? sink : nullptr;
+  }
 
   // --- The reading thread.
 
@@ -141,16 +165,39 @@ class TreeObserver::State {
     for (;;) {
       const ssize_t length = read(queueDescriptor_, buffer.data(), buffer.size());
       if (length <= 0) return;
-      const auto now = Clock::now();
+      handleEvents({buffer.data(), static_cast<std::size_t>(length)});
+    }
+  }
+
+  void handleEvents(std::string_view events) {
+    const auto sink = wantedSink();
+    const auto now = Clock::now();
+    Seen seen;
+    {
       LockGuard guard(mutex_);
-      for (std::size_t at = 0; at < static_cast<std::size_t>(length);) {
+      for (std::size_t at = 0; at < events.size();) {
         inotify_event event;
-        std::memcpy(&event, buffer.data() + at, sizeof event);
-        handle(event, buffer.data() + at + sizeof event, now);
+        std::memcpy(&event, events.data() + at, sizeof event);
+        const char* const name = events.data() + at + sizeof event;
+        if (sink) note(event, name, seen);
+        handle(event, name, now);
         at += sizeof event + event.len;
       }
       changed_.notifyAll();
     }
+    if (!seen.entries.empty()) sink->entriesDidChange(seen.entries);
+    if (seen.lostTrack) sink->didLoseTrack();
+  }
+
+  /// What is told outside, by folders as the disk knows them: also of those that are not identified
+  /// yet, and of names that no scan looks at.
+  void note(const inotify_event& event, const char* name, Seen& seen) REQUIRES(mutex_) {
+    if ((event.mask & IN_Q_OVERFLOW) != 0) seen.lostTrack = true;
+    constexpr std::uint32_t kNoChange = IN_Q_OVERFLOW | IN_IGNORED | IN_UNMOUNT | IN_DELETE_SELF;
+    if ((event.mask & kNoChange) != 0) return;
+    const std::uint64_t inode = watches_.inodeOfEvent(event.wd);
+    if (inode == 0) return;
+    seen.entries.push_back({.folder = inode, .name = event.len == 0 ? "." : name});
   }
 
   void handle(const inotify_event& event, const char* name, Clock::time_point now)
@@ -367,7 +414,8 @@ class TreeObserver::State {
   }
 
   const Options options_;
-  ObservedTree tree_;  // constant once started
+  ObservedTree tree_;                  // constant once started
+  std::weak_ptr<DiskEventSink> sink_;  // constant once set
   const ipc::UniqueFd wakeReader_;
 
   mutable Mutex mutex_;
@@ -396,10 +444,14 @@ class TreeObserver::State {
 
 TreeObserver::TreeObserver(Options options) : state_(std::make_unique<State>(options)) {}
 TreeObserver::~TreeObserver() { stop(); }
+void TreeObserver::setEventSink(std::weak_ptr<DiskEventSink> sink) {
+  state_->setEventSink(std::move(sink));
+}
 void TreeObserver::start(ObservedTree tree) { state_->start(std::move(tree)); }
 void TreeObserver::stop() { state_->stop(); }
 void TreeObserver::requestFullScan() { state_->requestFullScan(); }
 TreeObserver::Status TreeObserver::status() const { return state_->status(); }
+bool TreeObserver::isWatched(std::uint64_t folder) const { return state_->isWatched(folder); }
 
 void TreeObserver::willReadFolder(std::uint64_t visit, int descriptor) {
   state_->willReadFolder(visit, descriptor);

@@ -12,6 +12,7 @@
 #include "platform/foundation/error.h"
 #include "zarn/database.h"
 #include "zarn/dirty_folders.h"
+#include "zarn/disk_entry.h"
 #include "zarn/scanner.h"
 
 namespace yomber {
@@ -71,6 +72,11 @@ class TreeObserver final : public FolderVisitor, public ChangeSink {
   TreeObserver(const TreeObserver&) = delete;
   TreeObserver& operator=(const TreeObserver&) = delete;
 
+  /// Has `sink`, which is held weakly, told of everything that is seen to happen, and of every
+  /// folder that is watched from now on: whatever came about in it before was not seen. To be
+  /// called before anything else.
+  void setEventSink(std::weak_ptr<DiskEventSink> sink);
+
   /// Starts the threads; the first thing done is a `scanAll`. Called once.
   void start(ObservedTree tree);
   /// Ends both threads; nothing of the tree is called any more. Idempotent.
@@ -78,6 +84,8 @@ class TreeObserver final : public FolderVisitor, public ChangeSink {
   /// Has the whole tree scanned soon.
   void requestFullScan();
   [[nodiscard]] Status status() const;
+  /// Whether what happens in the folder of that id is seen at once.
+  [[nodiscard]] bool isWatched(std::uint64_t folder) const;
 
   void willReadFolder(std::uint64_t visit, int descriptor) override;
   void didIdentifyFolder(std::uint64_t visit, std::uint64_t id) override;

@@ -5,14 +5,17 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <map>
 #include <set>
+#include <utility>
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/lock.h"
@@ -23,6 +26,34 @@ namespace {
 using std::chrono::milliseconds;
 using std::chrono::steady_clock;
 namespace fs = std::filesystem;
+
+/// What is told of events.
+class NotingSink final : public DiskEventSink {
+ public:
+  [[nodiscard]] bool wantsEvents() const override { return wantsEvents_; }
+  void entriesDidChange(const std::vector<DiskEntry>& entries) override {
+    LockGuard guard(mutex_);
+    entries_.insert(entries.begin(), entries.end());
+  }
+  void didLoseTrack() override { ++losses_; }
+
+  bool has(const DiskEntry& entry) {
+    LockGuard guard(mutex_);
+    return entries_.contains(entry);
+  }
+  std::set<DiskEntry> take() {
+    LockGuard guard(mutex_);
+    return std::exchange(entries_, {});
+  }
+  [[nodiscard]] int losses() const { return losses_; }
+  void setWanted(bool wanted) { wantsEvents_ = wanted; }
+
+ private:
+  std::atomic<bool> wantsEvents_{true};
+  std::atomic<int> losses_{0};
+  Mutex mutex_;
+  std::set<DiskEntry> entries_ GUARDED_BY(mutex_);
+};
 
 /// A real tree, and a scanner that keeps nothing but a picture of it: what it has seen, by path.
 class TreeObserverTest : public testing::Test {
@@ -42,6 +73,7 @@ class TreeObserverTest : public testing::Test {
 
   void start(TreeObserver::Options options = {}) {
     observer_ = std::make_shared<TreeObserver>(options);
+    observer_->setEventSink(seen_);
     observer_->start({.scanAll = [this] { return scanAll(); },
                       .scanDirty = [this](const auto& dirty, auto&) { return scanDirty(dirty); },
                       .didFinishFirstScan = {}});
@@ -156,8 +188,16 @@ class TreeObserverTest : public testing::Test {
     return status.st_ino;
   }
 
+  [[nodiscard]] DiskEntry entry(const std::string& folder, const std::string& name) const {
+    return {.folder = inodeOf(root_ + "/" + folder), .name = name};
+  }
+  bool waitUntilSeen(const DiskEntry& entry) {
+    return waitUntil([&] { return seen_->has(entry); });
+  }
+
   std::string base_;
   std::string root_;
+  std::shared_ptr<NotingSink> seen_ = std::make_shared<NotingSink>();
   std::shared_ptr<TreeObserver> observer_;
 
   Mutex mutex_;
@@ -268,6 +308,53 @@ TEST_F(TreeObserverTest, AnOverflowLeadsToAScanOfEverything) {
   std::ofstream(go).put('x');
   ASSERT_TRUE(waitUntilPictureIsRight());
   EXPECT_GE(fullScans(), 2);
+  EXPECT_GE(seen_->losses(), 1);
+}
+
+TEST_F(TreeObserverTest, WhateverHappensIsToldByTheFoldersInodeAndTheName) {
+  fs::create_directories(root_ + "/a/b");
+  write("a/x", "1");
+  start();
+  EXPECT_EQ(seen_->losses(), 0);
+  (void)seen_->take();
+  write("a/.~lock.x#", "made");
+  EXPECT_TRUE(waitUntilSeen(entry("a", ".~lock.x#")));
+  ASSERT_EQ(setxattr((root_ + "/a/x").c_str(), "user.of-somebody", "1", 1, 0), 0);
+  EXPECT_TRUE(waitUntilSeen(entry("a", "x")));
+  fs::rename(root_ + "/a/x", root_ + "/a/b/y");
+  EXPECT_TRUE(waitUntilSeen(entry("a/b", "y")));
+  fs::permissions(root_ + "/a/b", fs::perms::owner_all);
+  EXPECT_TRUE(waitUntilSeen(entry("a", "b")));
+  EXPECT_TRUE(waitUntilSeen(entry("a/b", ".")));
+  fs::permissions(root_, fs::perms::owner_all);
+  EXPECT_TRUE(waitUntilSeen(entry("", ".")));
+  ASSERT_TRUE(waitUntilPictureIsRight());
+}
+
+TEST_F(TreeObserverTest, AFolderThatIsWatchedFromNowOnIsToldAsAWhole) {
+  fs::create_directories(root_ + "/a");
+  start();
+  EXPECT_TRUE(seen_->has(entry("", "")));
+  EXPECT_TRUE(seen_->has(entry("a", "")));
+  (void)seen_->take();
+  fs::create_directories(root_ + "/a/b/c");
+  EXPECT_TRUE(waitUntilSeen(entry("a/b/c", "")));
+  EXPECT_TRUE(seen_->has(entry("a", "b")));
+  // Folders that were watched already are not, however often they are read.
+  observer_->requestFullScan();
+  ASSERT_TRUE(waitUntil([this]() NO_THREAD_SAFETY_ANALYSIS { return fullScans_ == 2; }));
+  write("last", "1");
+  ASSERT_TRUE(waitUntilSeen(entry("", "last")));
+  EXPECT_FALSE(seen_->has(entry("", "")));
+  EXPECT_TRUE(observer_->isWatched(kRootID));
+}
+
+TEST_F(TreeObserverTest, NothingIsToldWhileNobodyWantsIt) {
+  seen_->setWanted(false);
+  start();
+  write("x", "1");
+  ASSERT_TRUE(waitUntilPictureIsRight());
+  EXPECT_TRUE(seen_->take().empty());
 }
 
 TEST_F(TreeObserverTest, WithoutWatchesFoldersAreScannedFromTimeToTime) {

@@ -1,5 +1,7 @@
 #include "zarn/watch_table.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <bit>
 #include <cerrno>
@@ -25,6 +27,11 @@ std::uint64_t systemLimit(const char* name) {
   std::uint64_t value = 0;
   file >> value;
   return value;
+}
+
+std::uint64_t inodeOf(int descriptor) {
+  struct stat status{};
+  return fstat(descriptor, &status) == 0 ? status.st_ino : 0;
 }
 
 std::string raiseAdvice(const char* setting, std::uint64_t value) {
@@ -62,11 +69,17 @@ void WatchTable::setUnwatchedVisit(std::uint64_t visit) {
   unwatchedVisits_.insert(visit);
 }
 
-void WatchTable::willRead(std::uint64_t visit, int folderDescriptor) {
+std::uint64_t WatchTable::willRead(std::uint64_t visit, int folderDescriptor) {
   const int descriptor = add(folderDescriptor);
-  if (descriptor < 0) return setUnwatchedVisit(visit);
-  watches_[descriptor].visits.push_back(visit);
+  if (descriptor < 0) {
+    setUnwatchedVisit(visit);
+    return 0;
+  }
+  const auto [at, isNew] = watches_.try_emplace(descriptor);
+  at->second.visits.push_back(visit);
   byVisit_[visit] = descriptor;
+  if (!isNew) return 0;
+  return at->second.inode = inodeOf(folderDescriptor);
 }
 
 bool WatchTable::didIdentify(std::uint64_t visit, std::uint64_t id) {
@@ -119,6 +132,11 @@ std::optional<std::uint64_t> WatchTable::folderOfEvent(int descriptor) {
   if (found == watches_.end()) return std::nullopt;
   if (!found->second.visits.empty()) found->second.sawEvent = true;
   return found->second.id;
+}
+
+std::uint64_t WatchTable::inodeOfEvent(int descriptor) const {
+  const auto found = watches_.find(descriptor);
+  return found == watches_.end() ? 0 : found->second.inode;
 }
 
 void WatchTable::didDrop(int descriptor) {

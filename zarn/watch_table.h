@@ -28,7 +28,8 @@ class WatchTable {
   /// Of the event queue, non-blocking; -1 when the system grants none, and no folder is watched.
   [[nodiscard]] int descriptor() const { return queue_.get(); }
 
-  void willRead(std::uint64_t visit, int folderDescriptor);
+  /// The folder's inode number when it was not watched before, and is now; else 0.
+  std::uint64_t willRead(std::uint64_t visit, int folderDescriptor);
   /// True when something happened in the folder meanwhile.
   bool didIdentify(std::uint64_t visit, std::uint64_t id);
   /// The folder is gone: gives its watch back.
@@ -37,6 +38,10 @@ class WatchTable {
   /// The folder of an event. Nothing when it is not known (yet): the event is remembered if the
   /// folder may still be identified.
   [[nodiscard]] std::optional<std::uint64_t> folderOfEvent(int watch);
+  /// The inode number of the folder of an event, whether or not it is identified; 0 when there is
+  /// no such watch any more.
+  [[nodiscard]] std::uint64_t inodeOfEvent(int watch) const;
+  [[nodiscard]] bool isWatched(std::uint64_t id) const { return byID_.contains(id); }
   /// The system has dropped the watch.
   void didDrop(int watch);
 
@@ -50,6 +55,7 @@ class WatchTable {
     std::vector<std::uint64_t> visits;  // readings that have not been identified yet
     std::optional<std::uint64_t> id;
     bool sawEvent = false;  // since the first of those readings
+    std::uint64_t inode = 0;
   };
   enum class Shortage { None, Watches, Instances, OwnLimit };
 

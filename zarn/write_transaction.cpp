@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <limits>
+#include <utility>
 
 #include "zarn/change_feed.h"
 #include "zarn/name_collation.h"
@@ -13,6 +14,14 @@ namespace {
 
 void setFlag(ItemRow& row, std::uint32_t flag, bool on) {
   row.flags = on ? row.flags | flag : row.flags & ~flag;
+}
+
+ItemChange changeOf(const ItemRow& before, ItemRow after) {
+  return {.row = std::move(after),
+          .parentBefore = before.parent,
+          .nameBefore = before.name,
+          .diskNameBefore = before.diskName,
+          .inodeBefore = before.inode};
 }
 
 /// Whether an item could be in the working set at some time: only then its entry is looked for.
@@ -57,7 +66,7 @@ void WriteTransaction::insert(ItemRow& row) {
   statement->step();
   if (row.extra) writeExtra(connection_, row);
   keepWorkingSet(nullptr, row);
-  changes_.push_back({.row = row, .isNew = true, .nameBefore = {}});
+  changes_.push_back({.row = row, .isNew = true, .nameBefore = {}, .diskNameBefore = {}});
 }
 
 void WriteTransaction::store(const ItemRow& row) {
@@ -78,7 +87,7 @@ bool WriteTransaction::update(const ItemRow& before, ItemRow& after) {
   store(after);
   if (before.extra || after.extra) writeExtra(connection_, after);
   keepWorkingSet(&before, after);
-  changes_.push_back({.row = after, .parentBefore = before.parent, .nameBefore = before.name});
+  changes_.push_back(changeOf(before, after));
   if (after.isFolder() && before.isTrashed() != after.isTrashed()) {
     markBelow(after.id, after.isTrashed());
   }
@@ -93,7 +102,7 @@ void WriteTransaction::updateQuietly(const ItemRow& row) {
   statement->bindID(3, row.inode);
   statement->bindInteger(4, row.ctime);
   statement->step();
-  touched_.push_back(row.id);
+  touched_.push_back(row);
 }
 
 void WriteTransaction::remove(const ItemRow& row) {
@@ -134,7 +143,7 @@ void WriteTransaction::removeOne(const ItemRow& row) {
   dead.extra = nullptr;
   if (row.extra) writeExtra(connection_, dead);
   dead.extra = row.extra;
-  changes_.push_back({.row = std::move(dead), .parentBefore = row.parent, .nameBefore = row.name});
+  changes_.push_back(changeOf(row, std::move(dead)));
 }
 
 void WriteTransaction::markBelow(std::uint64_t folder, bool isTrashed) {
@@ -149,8 +158,7 @@ void WriteTransaction::markBelow(std::uint64_t folder, bool isTrashed) {
       store(marked);
       keepWorkingSet(&child, marked);
       if (marked.isFolder()) folders.push_back(marked.id);
-      changes_.push_back(
-          {.row = std::move(marked), .parentBefore = child.parent, .nameBefore = child.name});
+      changes_.push_back(changeOf(child, std::move(marked)));
     }
   }
 }

@@ -40,8 +40,8 @@ class WriteTransaction {
   [[nodiscard]] std::uint64_t rank() const { return rank_; }
   std::uint64_t nextRank() { return ++rank_; }
   [[nodiscard]] const std::vector<ItemChange>& changes() const { return changes_; }
-  /// Ids of rows that were changed quietly.
-  [[nodiscard]] const std::vector<std::uint64_t>& touched() const { return touched_; }
+  /// Rows that were changed quietly, as they are then.
+  [[nodiscard]] const std::vector<ItemRow>& touched() const { return touched_; }
   [[nodiscard]] std::int64_t now() const { return now_; }
   /// See BusyFiles.
   [[nodiscard]] bool isBusy(std::uint64_t inode) const { return busyFiles_.contains(inode); }
@@ -99,7 +99,7 @@ class WriteTransaction {
   RecentBackups& recentBackups_;
   RecentlyGone& recentlyGone_;
   std::vector<ItemChange> changes_;
-  std::vector<std::uint64_t> touched_;
+  std::vector<ItemRow> touched_;
 };
 
 }  // namespace yomber

@@ -9,27 +9,14 @@
 #include <charconv>
 #include <utility>
 
+#include "platform/foundation/descriptor_path.h"
+#include "platform/foundation/file_time.h"
 #include "zarn/content/fault_record.h"
 
 namespace yomber {
 namespace {
 
 constexpr int kOpening = O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
-constexpr std::int64_t kNanoseconds = 1'000'000'000;
-
-std::int64_t toNanoseconds(const std::timespec& time) {
-  return static_cast<std::int64_t>(time.tv_sec) * kNanoseconds + time.tv_nsec;
-}
-
-std::timespec toTimespec(std::int64_t nanoseconds) {
-  std::int64_t seconds = nanoseconds / kNanoseconds;
-  std::int64_t rest = nanoseconds % kNanoseconds;
-  if (rest < 0) {
-    rest += kNanoseconds;
-    --seconds;
-  }
-  return {.tv_sec = seconds, .tv_nsec = rest};
-}
 
 /// Opens a file that its owner may not write to, or not even read; `status` is from before.
 FileDescriptor openProtectedFile(const std::string& path, struct stat& status,
@@ -43,7 +30,7 @@ FileDescriptor openProtectedFile(const std::string& path, struct stat& status,
   auto taken = LentMode::lend(place.get());
   if (!taken) return {};
   lent.emplace(std::move(*taken));
-  const std::string again = "/proc/self/fd/" + std::to_string(place.get());
+  const std::string again = pathOfDescriptor(place.get());
   return FileDescriptor(open(again.c_str(), O_RDWR | O_NONBLOCK | O_CLOEXEC));
 }
 
@@ -82,8 +69,8 @@ NSErrorRef ChangedFile::failure(int number) const { return NSError::errorWithErr
 
 NSErrorRef ChangedFile::holdDate() {
   if (const auto earlier = heldDate(file_.get())) {
-    mtime_ = toTimespec(*earlier);
-  } else if (auto error = setAttribute(kHeldDateAttribute, std::to_string(toNanoseconds(mtime_)))) {
+    mtime_ = timespecOf(*earlier);
+  } else if (auto error = setAttribute(kHeldDateAttribute, std::to_string(nanosecondsOf(mtime_)))) {
     return error;
   }
   isHeld_ = true;

@@ -3,10 +3,12 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <unordered_map>
 #include <utility>
 
 #include "platform/foundation/date.h"
 #include "platform/foundation/log.h"
+#include "platform/ostrell/constants.h"
 #include "zarn/busy_files.h"
 #include "zarn/change_times.h"
 #include "zarn/row_queries.h"
@@ -24,6 +26,95 @@ ContentEngine::Options withClock(ContentEngine::Options options) {
   return options;
 }
 
+/// Reads what jobs need to know; of each folder only once.
+class SubjectReader {
+ public:
+  SubjectReader(const ItemStore& items, Connection& connection)
+      : items_(items),
+        connection_(connection),
+        mayBePinned_(hasPins(connection)),
+        isAnythingShared_(hasShares(connection)) {}
+
+  JobSubject read(const Job& job) {
+    if (std::exchange(account_, job.account) != job.account) folders_.clear();
+    JobSubject subject;
+    subject.job = job;
+    const auto stored = findJob(connection_, job.item, job.kind);
+    if (job.seq == 0 && stored) subject.job = *stored;
+    subject.isStale = job.seq != 0 && (!stored || stored->seq != job.seq);
+    subject.row = findByID(connection_, job.item);
+    subject.content = findContent(connection_, job.item);
+    if (subject.row) locate(subject);
+    return subject;
+  }
+
+ private:
+  struct Folder {
+    std::string path;     ///< empty when it is gone
+    RZRecordZoneID zone;  ///< of what is in it; none where that is to be found out from the item
+    std::optional<ShareRow> share;
+    bool isInTrash = false;
+    bool isPinned = false;
+  };
+
+  void locate(JobSubject& subject) {
+    const ItemRow& row = *subject.row;
+    const Folder& folder = folderOf(row.parent);
+    if (row.isContainerFolder()) {
+      subject.path = items_.layout().documents(row.extra->containerID);
+      subject.zone = RZRecordZoneID(row.extra->containerID);
+    } else {
+      if (!folder.path.empty()) subject.path = folder.path + '/' + row.nameOnDisk();
+      subject.zone = folder.zone;
+      subject.share = folder.share;
+    }
+    const auto own = isAnythingShared_ ? findShare(connection_, row.id) : std::nullopt;
+    if (own && givesItsZone(*own) && own->account == account_) {
+      subject.zone = own->zone;
+      subject.share = own;
+    }
+    const bool isKept = subject.content && !isSharedZone(subject.content->zone);
+    if (subject.zone.zoneName().empty() && folder.isInTrash && isKept)
+      subject.zone = subject.content->zone;
+    if (subject.zone.zoneName().empty())
+      subject.zone = RZRecordZoneID(QSUbiquitousDefaultContainerID);
+    subject.isPinned = folder.isPinned || (subject.content && subject.content->isPinned);
+  }
+
+  const Folder& folderOf(std::uint64_t id) {
+    const auto [found, isNew] = folders_.try_emplace(id);
+    Folder& folder = found->second;
+    const auto chain = isNew ? findChain(connection_, id) : std::nullopt;
+    if (!chain) return folder;
+    folder.path = items_.physicalPath(*chain);
+    folder.isInTrash = chain->place == kTrashID;
+    folder.isPinned = mayBePinned_ && isPinned(connection_, id);
+    bool mayBeShared = isAnythingShared_;
+    for (const ItemRow& row : chain->rows) {
+      auto share = mayBeShared ? findShare(connection_, row.id) : std::nullopt;
+      const bool isNearest = share && givesItsZone(*share);
+      if (isNearest) mayBeShared = false;
+      if (isNearest && share->account == account_) {
+        folder.zone = share->zone;
+        folder.share = std::move(share);
+      } else if (row.isContainerFolder()) {
+        folder.zone = RZRecordZoneID(row.extra->containerID);
+      } else {
+        continue;
+      }
+      break;
+    }
+    return folder;
+  }
+
+  const ItemStore& items_;
+  Connection& connection_;
+  const bool mayBePinned_;
+  const bool isAnythingShared_;
+  std::int64_t account_ = 0;  ///< of the job that is read: no other's shares are its business
+  std::unordered_map<std::uint64_t, Folder> folders_;
+};
+
 std::shared_ptr<JobQueue> makeQueue(const ItemStore& items, const ContentEngine::Options& given) {
   JobQueue::Options options;
   if (given.clock) options.tick = kTickOfForeignClocks;
@@ -39,7 +130,8 @@ ContentCore::ContentCore(std::shared_ptr<ItemStore> itemStore, std::shared_ptr<S
       scanner(std::move(itemScanner)),
       options(withClock(engineOptions)),
       queue(makeQueue(*items, engineOptions)),
-      participant(std::make_shared<ContentParticipant>(queue, options.clock)) {
+      participant(std::make_shared<ContentParticipant>(queue, options.clock)),
+      drawer(options.drawer ? options.drawer : std::make_shared<DocumentDrawer>()) {
   // Jobs of changes that come while nobody is signed in are those of who was last.
   (void)database().read([&](Connection& connection) {
     queue->setAccount(metaInteger(connection, meta::kLastAccount));
@@ -123,30 +215,12 @@ void ContentCore::probe() {
 
 NSErrorRef ContentCore::readSubjects(const std::vector<Job>& jobs,
                                      std::vector<JobSubject>& subjects) const {
-  std::vector<JobSubject> found;
-  NSErrorRef error = database().read([&](Connection& connection) {
-    const bool mayBePinned = hasPins(connection);
-    for (const Job& job : jobs) {
-      JobSubject& subject = found.emplace_back();
-      subject.job = job;
-      const auto stored = findJob(connection, job.item, job.kind);
-      if (job.seq == 0 && stored) subject.job = *stored;
-      subject.isStale = job.seq != 0 && (!stored || stored->seq != job.seq);
-      subject.row = findByID(connection, job.item);
-      subject.content = findContent(connection, job.item);
-      if (!subject.row) continue;
-      subject.zone =
-          zoneOf(connection, job.item, subject.content ? subject.content->zone : std::string());
-      subject.isPinned = mayBePinned && isPinned(connection, job.item);
-    }
+  subjects.clear();
+  return database().read([&](Connection& connection) {
+    const ReadTransaction transaction(connection);
+    SubjectReader reader(*items, connection);
+    for (const Job& job : jobs) subjects.push_back(reader.read(job));
   });
-  for (JobSubject& subject : found) {
-    if (!error && subject.row) {
-      subject.path = items->physicalPath(subject.job.item, &error).value_or(std::string());
-    }
-  }
-  subjects = std::move(found);
-  return error;
 }
 
 std::int64_t ContentCore::nextAttempt(std::uint32_t attempts) const {
@@ -163,6 +237,19 @@ void ContentCore::postpone(Connection& connection, Job job, const NSErrorRef& er
   job.due = nextAttempt(job.attempts);
   job.error = error;
   updateJob(connection, job);
+}
+
+void ContentCore::noteRefused(std::uint64_t item, const RZRecordZoneID& zone, bool isForbidden) {
+  {
+    LockGuard guard(mutex_);
+    (isForbidden ? refused_.forbidden : refused_.changed)[zone].insert(item);
+  }
+  if (didRefuse) didRefuse();
+}
+
+ContentCore::Refused ContentCore::takeRefused() {
+  LockGuard guard(mutex_);
+  return std::exchange(refused_, {});
 }
 
 NSErrorRef ContentCore::settleWritten(const std::string& path, const FaultExamination& found) {

@@ -6,6 +6,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -13,8 +14,10 @@
 #include "platform/foundation/lock.h"
 #include "zarn/content/content_participant.h"
 #include "zarn/content/content_store.h"
+#include "zarn/content/document_drawer.h"
 #include "zarn/content/fault_file.h"
 #include "zarn/content/job_queue.h"
+#include "zarn/content/share_rows.h"
 #include "zarn/content/wishes.h"
 #include "zarn/content_engine.h"
 #include "zarn/item_store.h"
@@ -27,8 +30,9 @@ struct JobSubject {
   Job job;
   std::optional<ItemRow> row;
   std::optional<ContentRow> content;
-  std::string path;  ///< on this disk; empty when the item is gone
-  std::string zone;  ///< where its record belongs now
+  std::string path;                    ///< on this disk; empty when the item is gone
+  RZRecordZoneID zone;                 ///< where its record belongs now
+  std::optional<ShareRow> share = {};  ///< whose zone that is, where it is not a container's
   bool isPinned = false;
   bool isStale = false;  ///< the job was ended, or replaced, before it was handed out
 };
@@ -71,6 +75,18 @@ class ContentCore {
   void noteStored(const NSErrorRef& error) { storingFailure_.store(error); }
   [[nodiscard]] NSErrorRef storingFailure() const { return storingFailure_.load(); }
 
+  /// An upload into a share was refused: `isForbidden`, or as others have changed the record.
+  void noteRefused(std::uint64_t item, const RZRecordZoneID& zone, bool isForbidden);
+  struct Refused {
+    std::map<RZRecordZoneID, std::set<std::uint64_t>> changed;
+    std::map<RZRecordZoneID, std::set<std::uint64_t>> forbidden;
+  };
+  [[nodiscard]] Refused takeRefused();
+  /// Called when there are some; on any thread, with no lock held. Set once, before jobs are done.
+  std::function<void()> didRefuse;
+  /// Moves an item to the drive's trash; empty where there is none. Set once, before jobs are done.
+  std::function<NSErrorRef(const std::string& path)> trash;
+
   /// Decides on a fault that somebody has written to: what they wrote over all of it counts, what
   /// they wrote into it is brought to a file of its own.
   NSErrorRef settleWritten(const std::string& path, const FaultExamination& found);
@@ -83,6 +99,7 @@ class ContentCore {
   const ContentEngine::Options options;
   const std::shared_ptr<JobQueue> queue;
   const std::shared_ptr<ContentParticipant> participant;
+  const std::shared_ptr<DocumentDrawer> drawer;
   Wishes wishes;     ///< for content to come
   Wishes evictions;  ///< for content to go; never taken back
   std::atomic<std::uint64_t> finished{0};
@@ -102,6 +119,7 @@ class ContentCore {
   std::int64_t storeKey_ GUARDED_BY(mutex_) = kNoAccount;  ///< the account's, as jobs have it
   std::atomic<bool> isOffline_{false};
   AtomicCell<NSErrorRef> storingFailure_;
+  Refused refused_ GUARDED_BY(mutex_);
 };
 
 /// Rows that are as they are while a file is filled or given up.
@@ -120,8 +138,23 @@ class BusyFile {
 /// Each does the jobs given, stores what came of them, and tells who waits.
 void doUploads(ContentCore& core, const std::vector<Job>& jobs);
 void doDownloads(ContentCore& core, const std::vector<Job>& jobs);
-void doEvictions(ContentCore& core, const std::vector<Job>& jobs);
+/// Tells nobody: what it returns does, to be called when the jobs count as running no longer.
+/// Otherwise whoever is told, and looks, would see an eviction still going on.
+[[nodiscard]] std::function<void()> doEvictions(ContentCore& core, const std::vector<Job>& jobs);
 void doSettling(ContentCore& core, const std::vector<Job>& jobs);
+void doSpreading(ContentCore& core, const std::vector<Job>& jobs);
+void doThumbnails(ContentCore& core, const std::vector<Job>& jobs);
+
+/// To be called before the first sweep of a process: where there was nobody to draw, that begins
+/// anew.
+void beginThumbnailSweep(WriteTransaction& transaction);
+/// Gives jobs to documents that were uploaded before there were thumbnails; a part of them at a
+/// time. True when there are no more.
+[[nodiscard]] bool sweepThumbnails(const ContentCore& core, WriteTransaction& transaction);
+
+/// Gives a document a download where it is pinned and not here, and takes the one away that was
+/// only for the sake of a pin and has not begun.
+void followPins(const ContentCore& core, Connection& connection, const ItemRow& row, bool isPinned);
 
 /// Stores in an item's row that its content is here or not, and as which file. Leaves alone what a
 /// scan has seen to be another file meanwhile.

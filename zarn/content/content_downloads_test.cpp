@@ -213,6 +213,30 @@ TEST_F(ContentDownloadsTest, WhatWasFilledInAnotherBootIsAFaultAgain) {
   EXPECT_TRUE(read("a") == text);
 }
 
+TEST_F(ContentDownloadsTest, FewAndManyFilledFilesLoseTheirMarksAndKeepTheirContent) {
+  for (const unsigned count : {2U, 16U, 17U, 40U}) {
+    const auto name = [&](unsigned i) { return std::to_string(count) + "-" + std::to_string(i); };
+    const auto isMarked = [&](unsigned i) {
+      return lgetxattr(at(name(i)).c_str(), kFaultAttribute, nullptr, 0) >= 0;
+    };
+    for (unsigned i = 0; i <= count; ++i) write(name(i), content(10'000, i + 1));
+    settle();
+    for (unsigned i = 0; i <= count; ++i) ASSERT_EQ(evict(name(i)), nullptr);
+    // While the first is settled, the others gather.
+    stopAt("zarn.settle.synced");
+    ASSERT_EQ(provide(name(0)), nullptr);
+    ASSERT_TRUE(isStopped());
+    for (unsigned i = 1; i <= count; ++i) ASSERT_EQ(provide(name(i)), nullptr);
+    for (unsigned i = 0; i <= count; ++i) EXPECT_TRUE(isMarked(i)) << name(i);
+    go();
+    for (unsigned i = 0; i <= count; ++i) {
+      EXPECT_TRUE(waitUntil([&] { return !isMarked(i); })) << name(i);
+      EXPECT_TRUE(read(name(i)) == content(10'000, i + 1)) << name(i);
+    }
+    FaultPoint::disarmAll();
+  }
+}
+
 TEST_F(ContentDownloadsTest, WhatSomebodyWritesOverAFaultCounts) {
   makeFault("a", content(300'000));
   const std::uint64_t item = id("a");

@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <limits>
 #include <thread>
 #include <utility>
 
@@ -11,16 +12,22 @@
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/content/content_core.h"
+#include "zarn/content/shares.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"
 
 namespace yomber {
 namespace {
 
-constexpr std::size_t kUploadsAtOnce = 256;
-constexpr std::size_t kDownloadsAtOnce = 32;
-constexpr std::size_t kEvictionsAtOnce = 128;
-constexpr std::size_t kSettlingAtOnce = 1024;
+// What is read together is synced and committed together.
+constexpr JobQueue::Portion kUploadsAtOnce{.jobs = 256, .bytes = 64 << 20};
+// What is stored and answered together should come together.
+constexpr JobQueue::Portion kDownloadsAtOnce{.jobs = 256, .bytes = 1 << 20};
+constexpr JobQueue::Portion kEvictionsAtOnce{.jobs = 128};
+constexpr JobQueue::Portion kSettlingAtOnce{.jobs = 1024};
+constexpr JobQueue::Portion kSpreadingAtOnce{.jobs = 16};
+// Whoever wants to read the document meanwhile waits for it.
+constexpr JobQueue::Portion kThumbnailsAtOnce{.jobs = 1};
 
 NSErrorRef cancelled() {
   return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
@@ -61,11 +68,23 @@ class WaitingWish final : public ContentWish {
   const std::uint64_t number_;
 };
 
+/// Returns what is to be called once the jobs count as running no longer.
+using Work = std::function<std::function<void()>(ContentCore&, const std::vector<Job>&)>;
+
+Work withNothingAfter(void (*work)(ContentCore&, const std::vector<Job>&)) {
+  return [work](ContentCore& core, const std::vector<Job>& jobs) {
+    work(core, jobs);
+    return [] {};
+  };
+}
+
 class Engine final : public ContentEngine {
  public:
   Engine(std::shared_ptr<ItemStore> items, std::shared_ptr<Scanner> scanner, Options options)
       : core_(std::make_shared<ContentCore>(std::move(items), std::move(scanner),
-                                            std::move(options))) {
+                                            std::move(options))),
+        shares_(std::make_shared<Shares>(core_,
+                                         Shares::Options{.interval = core_->options.sharesPause})) {
     core_->database().setParticipant(core_->participant);
   }
   ~Engine() override { end(); }
@@ -76,6 +95,10 @@ class Engine final : public ContentEngine {
     core_->setStore(std::move(contents), account);
   }
   void sweep() override;
+  void setTrash(std::function<NSErrorRef(const std::string& path)> trash) override {
+    core_->trash = std::move(trash);
+  }
+  [[nodiscard]] std::shared_ptr<Shares> shares() override { return shares_; }
 
   [[nodiscard]] std::unique_ptr<ContentWish> startProviding(std::string_view path,
                                                             std::uint64_t options,
@@ -91,29 +114,32 @@ class Engine final : public ContentEngine {
   }
 
  private:
-  using Work = void (*)(ContentCore&, const std::vector<Job>&);
-  void addWorkers(JobKind kind, std::size_t count, std::size_t atOnce, Work work);
+  void addWorkers(JobKind kind, std::size_t count, const JobQueue::Portion& atOnce,
+                  const Work& work);
   void watchStore();
   void end();
   std::optional<ItemRow> find(std::string_view path, NSErrorRef* error) const;
   [[nodiscard]] ContentTransfer describe(const Job& job) const;
 
   const std::shared_ptr<ContentCore> core_;
+  const std::shared_ptr<Shares> shares_;
   std::vector<std::thread> threads_;
   Mutex mutex_;
   Condition changed_;
   bool isEnding_ GUARDED_BY(mutex_) = false;
 };
 
-void Engine::addWorkers(JobKind kind, std::size_t count, std::size_t atOnce, Work work) {
+void Engine::addWorkers(JobKind kind, std::size_t count, const JobQueue::Portion& atOnce,
+                        const Work& work) {
   for (std::size_t i = 0; i < count; ++i) {
     threads_.emplace_back([core = core_, kind, atOnce, work] {
       for (;;) {
         const auto jobs = core->queue->take(kind, atOnce);
         if (jobs.empty()) return;
-        work(*core, jobs);
+        const auto after = work(*core, jobs);
         if (core->storingFailure()) core->queue->rest(core->options.offlinePause);
         core->queue->release(jobs);
+        after();
       }
     });
   }
@@ -121,11 +147,16 @@ void Engine::addWorkers(JobKind kind, std::size_t count, std::size_t atOnce, Wor
 
 void Engine::start() {
   const Options& options = core_->options;
-  addWorkers(JobKind::Upload, options.uploadWorkers, kUploadsAtOnce, doUploads);
-  addWorkers(JobKind::Download, options.downloadWorkers, kDownloadsAtOnce, doDownloads);
+  addWorkers(JobKind::Upload, options.uploadWorkers, kUploadsAtOnce, withNothingAfter(doUploads));
+  addWorkers(JobKind::Download, options.downloadWorkers, kDownloadsAtOnce,
+             withNothingAfter(doDownloads));
   addWorkers(JobKind::Evict, options.evictWorkers, kEvictionsAtOnce, doEvictions);
-  addWorkers(JobKind::Settle, 1, kSettlingAtOnce, doSettling);
+  addWorkers(JobKind::Settle, 1, kSettlingAtOnce, withNothingAfter(doSettling));
+  addWorkers(JobKind::Spread, 1, kSpreadingAtOnce, withNothingAfter(doSpreading));
+  // One: nobody waits for what it does.
+  addWorkers(JobKind::Thumbnail, 1, kThumbnailsAtOnce, withNothingAfter(doThumbnails));
   threads_.emplace_back([this] { watchStore(); });
+  shares_->start();
   if (!core_->database().needsFirstScan()) sweep();
 }
 
@@ -151,6 +182,7 @@ void Engine::end() {
     changed_.notifyAll();
   }
   core_->queue->end();
+  shares_->stop();
   for (std::thread& thread : threads_) thread.join();
   threads_.clear();
   for (Wishes* wishes : {&core_->wishes, &core_->evictions}) {
@@ -160,22 +192,36 @@ void Engine::end() {
   }
 }
 
+/// True when there is no more to sweep.
+using Sweep = std::function<bool(ContentCore&, WriteTransaction&)>;
+
 /// A part at a time, so that others get their turn.
-void sweepOn(const std::shared_ptr<ContentCore>& core) {
+void sweepOn(const std::shared_ptr<ContentCore>& core, JobKind kind, const Sweep& sweep) {
   const auto isDone = std::make_shared<bool>(true);
   core->database().writeLater(
-      [core, isDone](WriteTransaction& transaction) {
-        *isDone = core->participant->sweep(transaction);
+      [core, isDone, sweep](WriteTransaction& transaction) {
+        *isDone = sweep(*core, transaction);
         return NSErrorRef();
       },
-      [core, isDone](const NSErrorRef& error) {
+      [core, isDone, kind, sweep](const NSErrorRef& error) {
         if (error) log_error(defaultLog(), "[ERROR] documents get no jobs: %@", error);
-        core->queue->noteJobs(JobKind::Upload);
-        if (!error && !*isDone && !core->queue->isEnding()) sweepOn(core);
+        core->queue->noteJobs(kind);
+        if (!error && !*isDone && !core->queue->isEnding()) sweepOn(core, kind, sweep);
       });
 }
 
-void Engine::sweep() { sweepOn(core_); }
+void Engine::sweep() {
+  sweepOn(core_, JobKind::Upload, [](ContentCore& core, WriteTransaction& transaction) {
+    return core.participant->sweep(transaction);
+  });
+  core_->database().writeLater(
+      [](WriteTransaction& transaction) {
+        beginThumbnailSweep(transaction);
+        return NSErrorRef();
+      },
+      [](const NSErrorRef&) {});
+  sweepOn(core_, JobKind::Thumbnail, sweepThumbnails);
+}
 
 std::optional<ItemRow> Engine::find(std::string_view path, NSErrorRef* error) const {
   NSErrorRef failure;
@@ -200,7 +246,7 @@ std::unique_ptr<ContentWish> Engine::startProviding(std::string_view path, std::
       error = cancelled();
     } else if (isToCome) {
       auto wish = std::make_unique<WaitingWish>(core_, row->id, std::move(completion));
-      core_->queue->pushUrgent(row->id);
+      core_->queue->pushUrgent(row->id, row->size);
       return wish;
     }
   }
@@ -249,19 +295,15 @@ NSErrorRef Engine::setPinned(std::string_view path, bool isPinned) {
     if (const auto known = findContent(connection, row->id)) content = *known;
     content.isPinned = isPinned;
     storeContent(connection, content);
-    std::vector<ItemRow> below{*row};
     const std::int64_t now = core_->now();
-    while (isPinned && !below.empty()) {
-      const ItemRow item = below.back();
-      below.pop_back();
-      if (item.isFolder()) {
-        for (ItemRow& child : findChildren(connection, item.id)) below.push_back(std::move(child));
-      } else if (item.kind == ItemKind::Document && (item.flags & row_flag::kDownloaded) == 0) {
-        addJob(connection, item.id, JobKind::Download, content.account, now, now);
-      }
+    if (row->isFolder()) {
+      addJob(connection, row->id, JobKind::Spread, core_->queue->account(), now, now);
+    } else if (row->kind == ItemKind::Document) {
+      followPins(*core_, connection, *row, yomber::isPinned(connection, row->id));
     }
     return NSErrorRef();
   });
+  core_->queue->noteJobs(JobKind::Spread);
   core_->queue->noteJobs(JobKind::Download);
   return error;
 }
@@ -287,6 +329,7 @@ std::optional<ContentState> Engine::contentState(std::string_view path, NSErrorR
   if (running && running->job.kind == JobKind::Evict) state.local = ContentState::Local::Evicting;
   if (running && running->job.kind == JobKind::Download && state.local != ContentState::Local::Here)
     state.local = ContentState::Local::Downloading;
+  bool isBehind = false;
   failure = core_->database().read([&](Connection& connection) {
     state.isPinned = isPinned(connection, row->id);
     const auto upload = findJob(connection, row->id, JobKind::Upload);
@@ -296,11 +339,20 @@ std::optional<ContentState> Engine::contentState(std::string_view path, NSErrorR
     if (!state.lastFailure && (upload || download)) state.lastFailure = core_->storingFailure();
     if (!isDocument) return;
     const auto content = findContent(connection, row->id);
-    const bool isStored = content && !upload && isConfirmed(*row, *content);
+    // What was written a moment ago may not have been scanned yet.
+    const bool isAsOnDisk = running || state.local == ContentState::Local::Fault ||
+                            (content && content->stamp.hasSameContent(FileStamp::of(status)));
+    isBehind = content && !upload && !isAsOnDisk;
+    const bool isStored = isAsOnDisk && content && !upload && isConfirmed(*row, *content);
     state.upload = isStored ? ContentState::Upload::Confirmed : ContentState::Upload::Waiting;
   });
   if (running && running->job.kind == JobKind::Upload)
     state.upload = ContentState::Upload::Uploading;
+  // Not every change is told of.
+  constexpr std::int64_t kLongestTelling = 1'000'000'000;
+  if (isBehind && core_->now() - FileStamp::of(status).ctime > kLongestTelling) {
+    (void)core_->scanner->scanLocation(path);
+  }
   storeError(error, failure);
   if (failure) return std::nullopt;
   return state;
@@ -309,19 +361,22 @@ std::optional<ContentState> Engine::contentState(std::string_view path, NSErrorR
 ContentTransfer Engine::describe(const Job& job) const {
   ContentTransfer result;
   result.item = job.item;
-  result.path = core_->items->logicalPath(job.item).value_or(std::string());
   result.kind = static_cast<ContentTransfer::Kind>(job.kind);
   result.attempts = job.attempts;
   result.failure = job.error;
-  if (job.state != JobState::Waiting) result.nextAttempt = job.due;
-  if (const auto row = core_->items->itemByID(job.item)) result.total = row->size;
+  const bool isGivenUp = job.due == std::numeric_limits<std::int64_t>::max();
+  if (job.state != JobState::Waiting && !isGivenUp) result.nextAttempt = job.due;
+  if (auto found = core_->items->located(job.item)) {
+    result.path = std::move(found->path);
+    result.total = found->row.size;
+  }
   return result;
 }
 
 ContentTransfers Engine::transfers(std::size_t limit) const {
   ContentTransfers result;
   for (const JobQueue::Running& running : core_->queue->allRunning()) {
-    if (running.job.kind == JobKind::Settle || result.transfers.size() >= limit) continue;
+    if (running.job.kind >= JobKind::Settle || result.transfers.size() >= limit) continue;
     ContentTransfer transfer = describe(running.job);
     transfer.isRunning = true;
     transfer.nextAttempt.reset();

@@ -57,6 +57,36 @@ TEST_F(ContentEvictionsTest, AChangeOfAttributesAloneIsNone) {
   EXPECT_TRUE(isFault("a"));
 }
 
+TEST_F(ContentEvictionsTest, WhoIsToldThatContentWentSeesItGone) {
+  write("a", content(100'000));
+  settle();
+  Answer answer;
+  ContentState seen;
+  engine->evict(at("a"), [&, told = answer.take()](const NSErrorRef& error) {
+    seen = state("a");
+    told(error);
+  });
+  ASSERT_EQ(answer.get(), nullptr);
+  EXPECT_EQ(seen.local, ContentState::Local::Fault);
+}
+
+TEST_F(ContentEvictionsTest, ADateOfAnotherCenturyIsTheFilesOwnAlsoAfterwards) {
+  const std::string text = content(100'000);
+  for (const std::int64_t seconds : {13'569'465'600, -5'364'662'400}) {  // 2400 and 1800
+    const timespec times[2] = {{seconds, 0}, {seconds, 0}};
+    write("a", text);
+    ASSERT_EQ(utimensat(AT_FDCWD, at("a").c_str(), times, 0), 0);
+    const auto date = status("a").st_mtim.tv_sec;
+    settle();
+    ASSERT_EQ(evict("a"), nullptr);
+    EXPECT_EQ(status("a").st_mtim.tv_sec, date);
+    settle();
+    ASSERT_EQ(provide("a"), nullptr);
+    EXPECT_EQ(status("a").st_mtim.tv_sec, date);
+    EXPECT_TRUE(read("a") == text);
+  }
+}
+
 TEST_F(ContentEvictionsTest, WhatIsOpenSomewhereStays) {
   write("a", content(100'000));
   settle();

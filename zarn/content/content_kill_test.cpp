@@ -1,6 +1,7 @@
 #include <sys/wait.h>
 
 #include "zarn/content/test_content.h"
+#include "zarn/write_transaction.h"
 
 namespace yomber {
 namespace {
@@ -11,6 +12,10 @@ class ContentKillTest : public ContentDrive, public testing::WithParamInterface<
   /// Runs `work` with a drive of its own in a child that ends at the fault point. Threads are not
   /// carried across a fork: everything of ours is closed before.
   void dieDuring(const std::string& point, const std::function<void()>& work) {
+    // What was begun at the start (looking through the documents) holds the database until it is
+    // written; two turns, since what ends with the first may still be let go.
+    for (int turn = 0; turn < 2; ++turn)
+      EXPECT_EQ(store->database()->write([](WriteTransaction&) { return NSErrorRef(); }), nullptr);
     engine->stop();
     engine.reset();
     records.reset();
@@ -110,6 +115,37 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, DownloadKillTest,
                                          "zarn.fill.dated", "zarn.fill.filled",
                                          "zarn.download.filled", "zarn.settle.synced",
                                          "zarn.settle.unmarked"));
+
+class ThumbnailKillTest : public ContentKillTest {};
+
+TEST_P(ThumbnailKillTest, TheNextProcessMakesTheThumbnail) {
+  std::filesystem::copy_file(YOMBER_PICTURES "/quarters.jpg", at("photo.jpg"));
+  // Not made at upload, so that the job for it is killed.
+  options.drawingPatience = std::chrono::milliseconds(-1);
+  dieDuring(GetParam(), [&] { scan(); });
+  const auto isMade = [&] {
+    const auto found = record(id("photo.jpg"));
+    return found && found->objectForKey(kQSRecordKeyThumbnail1024x1024) != nullptr;
+  };
+  EXPECT_TRUE(waitUntil(isMade));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(state("photo.jpg").upload, ContentState::Upload::Confirmed);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, ThumbnailKillTest,
+                         testing::Values("zarn.upload.committed", "zarn.thumbnail.drawn",
+                                         "zarn.thumbnail.saved", "drawing.sent"));
+
+TEST_F(ContentKillTest, TheNextProcessFollowsAPinToTheEnd) {
+  makeFolder("top");
+  makeFolder("top/one");
+  write("top/one/a", content(20'000));
+  settle();
+  ASSERT_EQ(evict("top/one/a"), nullptr);
+  dieDuring("zarn.spread.stored", [&] { (void)engine->setPinned(at("top"), true); });
+  EXPECT_FALSE(isFault("top/one/a"));
+  EXPECT_TRUE(read("top/one/a") == content(20'000));
+}
 
 class MoveKillTest : public ContentKillTest {};
 

@@ -2,6 +2,7 @@
 
 #include <vector>
 
+#include "zarn/content/share_rows.h"
 #include "zarn/row_queries.h"
 #include "zarn/schema.h"
 #include "zarn/write_transaction.h"
@@ -21,6 +22,30 @@ bool isSameFileContent(const ItemRow& row, const FileStamp& stamp) {
 bool isConfirmed(const ItemRow& row, const ContentRow& content) {
   return content.content && isSameFileContent(row, content.stamp) && row.name == content.name &&
          row.parent == content.parent;
+}
+
+std::optional<std::int64_t> whoseFolderIsBehind(Connection& connection, const ItemRow& row) {
+  if (row.isContainerFolder() || row.id < kFirstIssuedID) return std::nullopt;
+  const auto share = findShareAbove(connection, row.id);
+  const auto content = findContent(connection, row.id);
+  const bool isRecorded = content && content->isRecorded();
+  const bool isShared = share && givesItsZone(*share);
+  // It goes first, by whoever has made it.
+  if (isRecorded && (!isShared || content->account != share->account)) return content->account;
+  if (!isShared) return std::nullopt;
+  const bool isPlacedByEach = !share->isOwn() && share->root == row.id;
+  if (isPlacedByEach) return std::nullopt;
+  const bool isBehind = !isRecorded || content->zone != share->zone || content->name != row.name ||
+                        content->parent != row.parent;
+  return isBehind ? std::optional(share->account) : std::nullopt;
+}
+
+void ContentParticipant::noteFolder(Connection& connection, const ItemRow& row, Made& made) const {
+  const auto account = whoseFolderIsBehind(connection, row);
+  if (!account) return;
+  const std::int64_t now = clock_();
+  addJob(connection, row.id, JobKind::Upload, *account, now, now);
+  made.hasUploads = true;
 }
 
 void ContentParticipant::noteDocument(Connection& connection, const ItemRow& row, Made& made) {
@@ -43,40 +68,43 @@ void ContentParticipant::noteDocument(Connection& connection, const ItemRow& row
   }
 }
 
+/// Whether an item's record stays with others, although the item has gone from here.
+bool ContentParticipant::isLeft(Connection& connection, const ContentRow& content) {
+  if (content.zone.ownerName() == RZCurrentUserDefaultName) return false;
+  const auto share = findShareOfZone(connection, content.account, content.zone);
+  if (!share || share->isLeaving() || share->root == content.id) return true;
+  // With the shared item goes what is in it: that is leaving the share.
+  return !findByID(connection, share->root);
+}
+
 void ContentParticipant::noteRemoval(Connection& connection, std::uint64_t id, Made& made) {
   removeJobsOf(connection, id);
   const auto content = findContent(connection, id);
   if (!content) return;
-  if (!content->content) return removeContent(connection, id);
+  if (!content->isRecorded() || isLeft(connection, *content)) return removeContent(connection, id);
   const std::int64_t now = clock_();
   addJob(connection, id, JobKind::Upload, content->account, now, now);
   made.hasUploads = true;
 }
 
+/// What is below may be very much: it is seen to in parts, later.
 void ContentParticipant::noteMovedFolder(Connection& connection, const ItemChange& change,
                                          Made& made) {
-  const bool isElsewhere =
-      zoneOf(connection, change.parentBefore, {}) != zoneOf(connection, change.row.parent, {});
+  const bool isElsewhere = zoneOf(connection, change.parentBefore, {}, {}) !=
+                               zoneOf(connection, change.row.parent, {}, {}) &&
+                           !findShare(connection, change.row.id);
   if (!isElsewhere && !hasPins(connection)) return;
-  std::vector<std::uint64_t> folders{change.row.id};
-  while (!folders.empty()) {
-    const std::uint64_t folder = folders.back();
-    folders.pop_back();
-    for (const ItemRow& child : findChildren(connection, folder)) {
-      if (child.isFolder()) folders.push_back(child.id);
-      if (child.kind != ItemKind::Document) continue;
-      ItemRow unconfirmed = child;
-      if (isElsewhere) unconfirmed.flags &= ~row_flag::kUploaded;
-      noteDocument(connection, unconfirmed, made);
-    }
-  }
+  const std::int64_t now = clock_();
+  addJob(connection, change.row.id, JobKind::Spread, queue_->account(), now, now);
+  made.hasSpreads = true;
 }
 
 std::function<void()> ContentParticipant::announcement(const Made& made) const {
-  if (!made.hasUploads && !made.hasDownloads) return {};
+  if (!made.hasUploads && !made.hasDownloads && !made.hasSpreads) return {};
   return [queue = queue_, made] {
     if (made.hasUploads) queue->noteJobs(JobKind::Upload);
     if (made.hasDownloads) queue->noteJobs(JobKind::Download);
+    if (made.hasSpreads) queue->noteJobs(JobKind::Spread);
   };
 }
 
@@ -88,14 +116,15 @@ std::function<void()> ContentParticipant::willCommit(WriteTransaction& transacti
       noteRemoval(connection, change.row.id, made);
     } else if (change.row.isFolder()) {
       if (change.hasMoved()) noteMovedFolder(connection, change, made);
+      if (const auto row = findByID(connection, change.row.id)) noteFolder(connection, *row, made);
     } else if (change.row.kind == ItemKind::Document) {
       // As it is now: it may have changed several times.
       const auto row = findByID(connection, change.row.id);
       if (row) noteDocument(connection, *row, made);
     }
   }
-  for (const std::uint64_t id : transaction.touched()) {
-    const auto row = findByID(connection, id);
+  for (const ItemRow& touched : transaction.touched()) {
+    const auto row = findByID(connection, touched.id);
     if (row && row->kind == ItemKind::Document) noteDocument(connection, *row, made);
   }
   return announcement(made);

@@ -2,6 +2,7 @@
 
 #include <functional>
 #include <memory>
+#include <optional>
 
 #include "zarn/content/content_rows.h"
 #include "zarn/content/job_queue.h"
@@ -27,8 +28,11 @@ class ContentParticipant : public CommitParticipant {
   struct Made {
     bool hasUploads = false;
     bool hasDownloads = false;
+    bool hasSpreads = false;
   };
   void noteDocument(Connection& connection, const ItemRow& row, Made& made);
+  void noteFolder(Connection& connection, const ItemRow& row, Made& made) const;
+  [[nodiscard]] static bool isLeft(Connection& connection, const ContentRow& content);
   void noteRemoval(Connection& connection, std::uint64_t id, Made& made);
   void noteMovedFolder(Connection& connection, const ItemChange& change, Made& made);
   [[nodiscard]] std::function<void()> announcement(const Made& made) const;
@@ -39,5 +43,10 @@ class ContentParticipant : public CommitParticipant {
 
 /// Whether the store's record says what the row does, and has its content.
 [[nodiscard]] bool isConfirmed(const ItemRow& row, const ContentRow& content);
+/// The account whose record of a folder has to be made, changed or removed; nothing when it need
+/// not. Only in shares do folders have one, and only of the account that takes part in the share,
+/// whoever is signed in.
+[[nodiscard]] std::optional<std::int64_t> whoseFolderIsBehind(Connection& connection,
+                                                              const ItemRow& row);
 
 }  // namespace yomber

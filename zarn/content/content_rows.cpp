@@ -4,12 +4,14 @@
 #include <charconv>
 
 #include "platform/ostrell/constants.h"
+#include "zarn/content/share_rows.h"
 #include "zarn/row_queries.h"
 
 namespace yomber {
 namespace {
 
 #define YOMBER_JOB_COLUMNS "seq,item,kind,account,state,attempts,due,created,error"
+constexpr int kJobColumns = 9;
 
 Job readJob(const Statement& statement) {
   Job job;
@@ -34,6 +36,12 @@ std::vector<Job> readJobs(Statement& statement) {
 std::string_view hashBytes(const RZAsset& asset) {
   // Bytes are bytes, whatever their sign.
   return {reinterpret_cast<const char*>(asset.hash.data()), asset.hash.size()};
+}
+
+RZRecordZoneID readZone(const Statement& statement, int name, int owner) {
+  std::string zone(statement.bytes(name));
+  if (statement.isNull(owner)) return RZRecordZoneID(std::move(zone));
+  return RZRecordZoneID(std::move(zone), std::string(statement.bytes(owner)));
 }
 
 RZAsset readAsset(std::string_view hash, std::uint64_t size) {
@@ -101,12 +109,16 @@ std::vector<Job> dueJobs(Connection& connection, std::int64_t account, JobKind k
                          std::int64_t now, std::size_t limit) {
   StatementUse statement(connection.prepared(
       "SELECT " YOMBER_JOB_COLUMNS
+      ",(SELECT size FROM item WHERE item.id=job.item)"
       " FROM job WHERE account=?1 AND kind=?2 AND due<=?3 ORDER BY due,seq LIMIT ?4"));
   statement->bindInteger(1, account);
   statement->bindInteger(2, static_cast<std::int64_t>(kind));
   statement->bindInteger(3, now);
   statement->bindInteger(4, static_cast<std::int64_t>(limit));
-  return readJobs(*statement);
+  std::vector<Job> jobs;
+  while (statement->step())
+    jobs.emplace_back(readJob(*statement)).size = statement->id(kJobColumns);
+  return jobs;
 }
 
 std::optional<std::int64_t> nextDue(Connection& connection, std::int64_t account, JobKind kind,
@@ -121,9 +133,10 @@ std::optional<std::int64_t> nextDue(Connection& connection, std::int64_t account
 }
 
 std::vector<Job> failedJobs(Connection& connection, std::int64_t account, std::size_t limit) {
+  // The plus keeps the planner from an index of all jobs.
   StatementUse statement(connection.prepared(
       "SELECT " YOMBER_JOB_COLUMNS
-      " FROM job WHERE account=?1 AND state<>0 AND kind<3 ORDER BY due,seq LIMIT ?2"));
+      " FROM job WHERE account=?1 AND state<>0 AND +kind<3 ORDER BY due,seq LIMIT ?2"));
   statement->bindInteger(1, account);
   statement->bindInteger(2, static_cast<std::int64_t>(limit));
   return readJobs(*statement);
@@ -146,7 +159,7 @@ void makeAllDue(Connection& connection, std::int64_t account, std::int64_t now) 
 
 std::optional<ContentRow> findContent(Connection& connection, std::uint64_t id) {
   StatementUse statement(connection.prepared(
-      "SELECT account,pinned,zone,parent,name,hash,tag,size,inode,mtime,ctime FROM content "
+      "SELECT account,pinned,zone,parent,name,hash,tag,size,inode,mtime,ctime,owner FROM content "
       "WHERE id=?1"));
   statement->bindID(1, id);
   if (!statement->step()) return std::nullopt;
@@ -154,7 +167,7 @@ std::optional<ContentRow> findContent(Connection& connection, std::uint64_t id) 
   row.id = id;
   row.account = statement->integer(0);
   row.isPinned = statement->integer(1) != 0;
-  row.zone = statement->bytes(2);
+  row.zone = readZone(*statement, 2, 11);
   row.parent = statement->id(3);
   row.name = statement->bytes(4);
   row.stamp.size = statement->id(7);
@@ -166,14 +179,25 @@ std::optional<ContentRow> findContent(Connection& connection, std::uint64_t id) 
   return row;
 }
 
+std::optional<RZRecordZoneID> findRecordZone(Connection& connection, std::uint64_t id,
+                                             const std::string& account) {
+  StatementUse statement(connection.prepared(
+      "SELECT content.zone,content.owner FROM content JOIN account ON account.key=content.account "
+      "WHERE content.id=?1 AND content.hash IS NOT NULL AND content.tag<>x'' AND account.name=?2"));
+  statement->bindID(1, id);
+  statement->bindBytes(2, account);
+  if (!statement->step()) return std::nullopt;
+  return readZone(*statement, 0, 1);
+}
+
 void storeContent(Connection& connection, const ContentRow& row) {
   StatementUse statement(connection.prepared(
       "INSERT OR REPLACE INTO content(id,account,pinned,zone,parent,name,hash,tag,size,inode,mtime,"
-      "ctime) VALUES(?1,?2,?3,?4,?5,?6,?7,?8,?9,?10,?11,?12)"));
+      "ctime,owner) VALUES(?1,?2,?3,?4,?5,?6,?7,?8,?9,?10,?11,?12,?13)"));
   statement->bindID(1, row.id);
   statement->bindInteger(2, row.account);
   statement->bindInteger(3, row.isPinned ? 1 : 0);
-  statement->bindBytes(4, row.zone);
+  statement->bindBytes(4, row.zone.zoneName());
   statement->bindID(5, row.parent);
   statement->bindBytes(6, row.name);
   if (row.content) {
@@ -186,6 +210,11 @@ void storeContent(Connection& connection, const ContentRow& row) {
   statement->bindID(10, row.stamp.inode);
   statement->bindInteger(11, row.stamp.mtime);
   statement->bindInteger(12, row.stamp.ctime);
+  if (isSharedZone(row.zone)) {
+    statement->bindBytes(13, row.zone.ownerName());
+  } else {
+    statement->bindNull(13);
+  }
   statement->step();
 }
 
@@ -193,6 +222,14 @@ void removeContent(Connection& connection, std::uint64_t id) {
   StatementUse statement(connection.prepared("DELETE FROM content WHERE id=?1"));
   statement->bindID(1, id);
   statement->step();
+}
+
+std::vector<std::uint64_t> findChildIDs(Connection& connection, std::uint64_t folder) {
+  StatementUse statement(connection.prepared("SELECT id FROM item WHERE parent=?1"));
+  statement->bindID(1, folder);
+  std::vector<std::uint64_t> ids;
+  while (statement->step()) ids.push_back(statement->id(0));
+  return ids;
 }
 
 bool hasPins(Connection& connection) {
@@ -213,15 +250,23 @@ bool isPinned(Connection& connection, std::uint64_t id) {
          isRowPinned(chain->place);
 }
 
-std::string zoneOf(Connection& connection, std::uint64_t id, const std::string& before) {
+RZRecordZoneID zoneOf(Connection& connection, std::uint64_t id, const RZRecordZoneID& before,
+                      std::optional<std::int64_t> account) {
   const auto chain = findChain(connection, id);
   if (chain) {
+    bool mayBeShared = hasShares(connection);
     for (const ItemRow& row : chain->rows) {
-      if (row.isContainerFolder()) return row.extra->containerID;
+      const auto share = mayBeShared ? findShare(connection, row.id) : std::nullopt;
+      if (share && givesItsZone(*share)) {
+        if (!account || share->account == *account) return share->zone;
+        mayBeShared = false;  // the nearest one decides
+      }
+      if (row.isContainerFolder()) return RZRecordZoneID(row.extra->containerID);
     }
-    if (chain->place == kTrashID && !before.empty()) return before;
+    const bool isKept = !before.zoneName().empty() && !isSharedZone(before);
+    if (chain->place == kTrashID && isKept) return before;
   }
-  return QSUbiquitousDefaultContainerID;
+  return RZRecordZoneID(QSUbiquitousDefaultContainerID);
 }
 
 std::int64_t accountKey(Connection& connection, const std::string& account) {

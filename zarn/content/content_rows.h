@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "platform/foundation/error.h"
+#include "platform/rozzel/identifiers.h"
 #include "zarn/connection.h"
 #include "zarn/content/fault_record.h"
 
@@ -18,9 +19,11 @@ enum class JobKind : std::uint8_t {
   Upload,  ///< makes the store's record what the item is, or removes it
   Download,
   Evict,
-  Settle,  ///< syncs a filled file, then takes its marks off
+  Settle,     ///< syncs a filled file, then takes its marks off
+  Spread,     ///< of a folder: sees to what its pins and its container mean for what is in it
+  Thumbnail,  ///< gives the store's record the thumbnail that it was saved without
 };
-inline constexpr std::size_t kJobKinds = 4;
+inline constexpr std::size_t kJobKinds = 6;
 
 enum class JobState : std::uint8_t { Waiting, Retrying, OverQuota };
 
@@ -33,7 +36,8 @@ struct Job {
   std::uint32_t attempts = 0;  ///< that failed
   std::int64_t due = 0;        ///< ns since the epoch
   std::int64_t created = 0;    ///< ns since the epoch
-  NSErrorRef error;            ///< of the last attempt
+  std::uint64_t size = 0;  ///< of the document as its row has it; only where jobs are handed out
+  NSErrorRef error;        ///< of the last attempt
 };
 
 /// Replaces the item's job of that kind.
@@ -45,7 +49,7 @@ void removeJob(Connection& connection, const Job& job);
 void updateJob(Connection& connection, const Job& job);
 void removeJobsOf(Connection& connection, std::uint64_t item);
 [[nodiscard]] std::optional<Job> findJob(Connection& connection, std::uint64_t item, JobKind kind);
-/// Those due at `now`, in the order in which they fell due.
+/// Those due at `now`, in the order in which they fell due, with the sizes of their documents.
 [[nodiscard]] std::vector<Job> dueJobs(Connection& connection, std::int64_t account, JobKind kind,
                                        std::int64_t now, std::size_t limit);
 [[nodiscard]] std::optional<std::int64_t> nextDue(Connection& connection, std::int64_t account,
@@ -62,23 +66,35 @@ struct ContentRow {
   std::uint64_t id = 0;
   std::int64_t account = 0;
   bool isPinned = false;
-  std::string zone;                ///< of the store's record
+  RZRecordZoneID zone;             ///< of the store's record; without a name: there is none
   std::uint64_t parent = 0;        ///< as the record has it
   std::string name;                ///< as the record has it
   std::optional<RZAsset> content;  ///< that the store has; nothing: none yet
   std::string tag;                 ///< of the record
   FileStamp stamp;                 ///< of the file when that was its content
+
+  /// Whether the store has a record of it.
+  [[nodiscard]] bool isRecorded() const { return content.has_value() || !tag.empty(); }
 };
 
+/// The zone of an account's record of a document whose content the store has; nothing for any other
+/// item.
+[[nodiscard]] std::optional<RZRecordZoneID> findRecordZone(Connection& connection, std::uint64_t id,
+                                                           const std::string& account);
 [[nodiscard]] std::optional<ContentRow> findContent(Connection& connection, std::uint64_t id);
 void storeContent(Connection& connection, const ContentRow& row);
 void removeContent(Connection& connection, std::uint64_t id);
+/// The ids of what is in a folder.
+[[nodiscard]] std::vector<std::uint64_t> findChildIDs(Connection& connection, std::uint64_t folder);
 [[nodiscard]] bool hasPins(Connection& connection);
 /// Whether an item or a folder above it is pinned.
 [[nodiscard]] bool isPinned(Connection& connection, std::uint64_t id);
-/// The container that an item belongs to; `before` for what is in the trash.
-[[nodiscard]] std::string zoneOf(Connection& connection, std::uint64_t id,
-                                 const std::string& before);
+/// The zone that an account's record of an item belongs to: that of the share that it is in, when
+/// the account takes part in it, else that of its container; `before`, unless others see that, for
+/// what is in the trash. Of no account: of whichever takes part in the share.
+[[nodiscard]] RZRecordZoneID zoneOf(Connection& connection, std::uint64_t id,
+                                    const RZRecordZoneID& before,
+                                    std::optional<std::int64_t> account);
 
 /// The number that stands for an account in the tables; makes one where there is none.
 [[nodiscard]] std::int64_t accountKey(Connection& connection, const std::string& account);

@@ -131,6 +131,55 @@ TEST_F(ContentUploadsTest, OverQuotaTheJobWaitsAndOthersGoOn) {
   ASSERT_TRUE(waitUntil([&] { return state("large").upload == ContentState::Upload::Confirmed; }));
 }
 
+TEST_F(ContentUploadsTest, WhatDoesNotFitIsNotCopiedToTheStoreAgain) {
+  const auto attempts = [&] {
+    const auto transfers = engine->transfers().transfers;
+    return transfers.empty() ? 0U : transfers.front().attempts;
+  };
+  ASSERT_EQ(records->setQuota("ann", 100'000), nullptr);
+  write("large", content(200'000));
+  scan();
+  ASSERT_TRUE(waitUntil([&] { return attempts() >= 1; }));
+  stopAt("zarn.upload.staged");
+  const auto before = attempts();
+  ASSERT_TRUE(waitUntil([&] { return attempts() >= before + 3; }));
+  EXPECT_FALSE(std::filesystem::exists(gate_ + ".reached"));
+  EXPECT_TRUE(state("large").lastFailure->is(NSCocoaErrorDomain,
+                                             NSUbiquitousFileNotUploadedDueToQuotaError));
+  ASSERT_EQ(records->setQuota("ann", 300'000), nullptr);
+  EXPECT_TRUE(isStopped());
+  go();
+  ASSERT_TRUE(waitUntil([&] { return state("large").upload == ContentState::Upload::Confirmed; }));
+  // In place of itself it needs no more than it has.
+  write("large", content(200'000, 2));
+  settle();
+  EXPECT_EQ(state("large").upload, ContentState::Upload::Confirmed);
+}
+
+TEST_F(ContentUploadsTest, WhatWasWrittenSinceIsNotConfirmedAlsoBeforeItIsScanned) {
+  write("a", "text");
+  settle();
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Confirmed);
+  write("a", "longer text");
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Waiting);
+  settle();
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Confirmed);
+  EXPECT_EQ(evict("a"), nullptr);
+  EXPECT_EQ(state("a").upload, ContentState::Upload::Confirmed);
+}
+
+TEST_F(ContentUploadsTest, WhatNobodyToldOfIsScannedWhenItsStateIsAskedFor) {
+  write("a", "text");
+  settle();
+  engine->stop();
+  // It was written long ago, and still nobody has scanned it.
+  options.clock = [] { return NSDate::now().nanoseconds() + 60'000'000'000; };
+  startEngine();
+  write("a", "longer text");
+  EXPECT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
+  EXPECT_EQ(contentInStore(id("a")), "longer text");
+}
+
 TEST_F(ContentUploadsTest, AJobThatFailsIsTriedAgainAndSaysHowOften) {
   ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
   write("a", "text");

@@ -21,8 +21,6 @@ FaultPoint downloadFilled("zarn.download.filled");
 FaultPoint settleSynced("zarn.settle.synced");
 
 constexpr int kAttempts = 3;
-/// Downloads of so much together are stored and answered at once.
-constexpr std::uint64_t kBytesTogether = 1 << 20;
 
 NSErrorRef noSuchFile(const std::string& path) {
   return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileNoSuchFileError,
@@ -69,19 +67,11 @@ class DownloadBatch {
       core_.noteStored(error);
       return;
     }
-    std::uint64_t bytes = 0;
     for (std::size_t i = 0; i < subjects.size(); ++i) {
       if (subjects[i].isStale) continue;
       const bool isByItself = jobs[i].seq != 0 || subjects[i].isPinned;
       // Asked for once more than there were wishes, or taken back.
       if (!isByItself && !core_.wishes.isWanted(subjects[i].job.item)) continue;
-      const std::uint64_t size = subjects[i].row ? subjects[i].row->size : 0;
-      // Nobody is to wait for what others have wished for, unless it takes no time.
-      if (bytes + size >= kBytesTogether) {
-        runTogether();
-        bytes = 0;
-      }
-      bytes += size;
       Download& download = downloads_.emplace_back();
       download.subject = std::move(subjects[i]);
       download.isByItself = isByItself;
@@ -223,7 +213,7 @@ class DownloadBatch {
     FileStamp before = download.after;
     before.inode = download.inode;
     storeLocalState(transaction, job.item, before, download.after, true);
-    removeJob(connection, job);
+    if (job.seq != 0) removeJob(connection, job);
     const std::int64_t now = core_.now();
     const std::int64_t pause = std::chrono::nanoseconds(core_.options.settlePause).count();
     addJob(connection, job.item, JobKind::Settle, job.account, now + pause, now);
@@ -248,7 +238,8 @@ class DownloadBatch {
         download.error && download.error->is(NSCocoaErrorDomain, NSUserCancelledError);
     // Given up, and wished for again meanwhile.
     if (isCancelled && !core_.queue->isEnding() && core_.wishes.isWanted(item)) {
-      return core_.queue->pushUrgent(item);
+      const auto& row = download.subject.row;
+      return core_.queue->pushUrgent(item, row ? row->size : 0);
     }
     answer(item, download.error);
   }
@@ -296,6 +287,37 @@ bool isFilled(Settling& settling) {
   return settling.isHere && readFaultRecord(file.get(), isDamaged);
 }
 
+/// Up to so many are synced one by one. A sync of the file system waits for what all others have
+/// written as well; for few files that costs more than it saves.
+constexpr std::size_t kFewFilled = 16;
+
+int syncOne(const Settling& settling) {
+  const FileDescriptor file(open(settling.subject.path.c_str(),
+                                 O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  struct stat status{};
+  if (!file || fstat(file.get(), &status) != 0) return errno;
+  if (status.st_ino != settling.before.inode) return ESTALE;
+  return fdatasync(file.get()) == 0 ? 0 : errno;
+}
+
+/// What was written to them is on the disk then; where it is not, that is left for later.
+void syncFilled(const ContentCore& core, const std::vector<Settling*>& filled) {
+  if (filled.size() > kFewFilled) {
+    const FileDescriptor tree(
+        open(core.items->layout().tree().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (tree && syncfs(tree.get()) == 0) return;
+    log_error(defaultLog(), "[ERROR] filled files cannot be synced: errno %d", errno);
+    for (Settling* settling : filled) settling->isLater = true;
+    return;
+  }
+  for (Settling* settling : filled) {
+    const int number = syncOne(*settling);
+    settling->isLater = number != 0;
+    if (number == 0 || number == ENOENT || number == ESTALE) continue;
+    log_error(defaultLog(), "[ERROR] a filled file cannot be synced: errno %d", number);
+  }
+}
+
 }  // namespace
 
 void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
@@ -306,22 +328,19 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
     return;
   }
   std::vector<Settling> all;
-  std::vector<std::size_t> filled;
+  all.reserve(subjects.size());
+  std::vector<Settling*> filled;
   for (JobSubject& subject : subjects) {
     if (subject.isStale) continue;
     all.push_back({.subject = std::move(subject), .before = {}, .after = {}});
-    if (isFilled(all.back())) filled.push_back(all.size() - 1);
+    if (isFilled(all.back())) filled.push_back(&all.back());
   }
-  // One sync for all: what was written to them is on the disk when it returns.
-  const FileDescriptor tree(
-      open(core.items->layout().tree().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  const bool isSynced = filled.empty() || (tree && syncfs(tree.get()) == 0);
-  if (!isSynced) log_error(defaultLog(), "[ERROR] filled files cannot be synced: errno %d", errno);
+  syncFilled(core, filled);
   (void)settleSynced.hit();
-  for (const std::size_t index : filled) {
-    Settling& settling = all[index];
-    settling.isLater = !isSynced || removeFaultMarks(settling.subject.path, settling.before.inode,
-                                                     settling.after) != nullptr;
+  for (Settling* settling : filled) {
+    settling->isLater =
+        settling->isLater || removeFaultMarks(settling->subject.path, settling->before.inode,
+                                              settling->after) != nullptr;
   }
   const NSErrorRef error = core.database().write([&](WriteTransaction& transaction) {
     for (const Settling& settling : all) {

@@ -5,8 +5,11 @@
 
 #include <cerrno>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <thread>
+#include <utility>
+#include <vector>
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
@@ -133,7 +136,8 @@ class EvictionBatch {
  public:
   explicit EvictionBatch(ContentCore& core) : core_(core) {}
 
-  void run(std::vector<JobSubject> subjects) {
+  /// Returns what tells who waits.
+  [[nodiscard]] std::function<void()> run(std::vector<JobSubject> subjects) {
     std::vector<BusyFile> busy;
     for (JobSubject& subject : subjects) {
       if (subject.isStale) continue;
@@ -159,8 +163,9 @@ class EvictionBatch {
       if (departure.isFault) {
         core_.lookAgain(departure.subject, departure.after);
       }
-      answer(departure);
+      if (!departure.error) core_.finished.fetch_add(1);
     }
+    return answers();
   }
 
  private:
@@ -239,11 +244,18 @@ class EvictionBatch {
     }
   }
 
-  void answer(const Departure& departure) {
-    if (!departure.error) core_.finished.fetch_add(1);
-    for (auto& completion : core_.evictions.take(departure.subject.job.item)) {
-      if (completion) completion(departure.error);
+  [[nodiscard]] std::function<void()> answers() const {
+    std::vector<std::pair<std::uint64_t, NSErrorRef>> results;
+    for (const Departure& departure : departures_) {
+      results.emplace_back(departure.subject.job.item, departure.error);
     }
+    return [&core = core_, results = std::move(results)] {
+      for (const auto& [item, error] : results) {
+        for (auto& completion : core.evictions.take(item)) {
+          if (completion) completion(error);
+        }
+      }
+    };
   }
 
   ContentCore& core_;
@@ -252,14 +264,14 @@ class EvictionBatch {
 
 }  // namespace
 
-void doEvictions(ContentCore& core, const std::vector<Job>& jobs) {
+std::function<void()> doEvictions(ContentCore& core, const std::vector<Job>& jobs) {
   std::vector<JobSubject> subjects;
   if (NSErrorRef error = core.readSubjects(jobs, subjects)) {
     log_error(defaultLog(), "[ERROR] what is to be evicted cannot be read: %@", error);
     core.noteStored(error);
-    return;
+    return [] {};
   }
-  EvictionBatch(core).run(std::move(subjects));
+  return EvictionBatch(core).run(std::move(subjects));
 }
 
 }  // namespace yomber

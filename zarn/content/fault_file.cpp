@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <string_view>
 
+#include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/ostrell/constants.h"
@@ -146,11 +147,11 @@ FaultCondition conditionOfSmall(int file, const FaultExamination& found) {
 FaultExamination examineFault(int file) {
   FaultExamination result;
   result.stamp = stampOf(file);
-  if (!isUnfilledFault(file)) return result;
   bool isDamaged = false;
   const auto record = readFaultRecord(file, isDamaged);
+  if ((!record && !isDamaged) || isFilledInThisBoot(file)) return result;
   if (!record) {
-    result.condition = isDamaged ? FaultCondition::Damaged : FaultCondition::NoFault;
+    result.condition = FaultCondition::Damaged;
     return result;
   }
   result.record = *record;
@@ -165,7 +166,7 @@ NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode, FileSt
   struct stat status{};
   if (!file || fstat(file.get(), &status) != 0) return NSError::errorWithErrno(errno, path);
   if (status.st_ino != inode) return NSError::errorWithErrno(ESTALE, path);
-  const std::string self = "/proc/self/fd/" + std::to_string(file.get());
+  const std::string self = pathOfDescriptor(file.get());
   // The fault first: without it the others mean nothing.
   for (const char* name : {kFaultAttribute, kFilledAttribute, kHeldDateAttribute}) {
     const int number = withWritePermission(file.get(), [&] {

@@ -1,5 +1,7 @@
 // Filling faults in their places.
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -78,13 +80,20 @@ class Filling {
     const auto watch = [&](std::uint64_t done) {
       if (fillCopying.hit()) return false;
       if (isAlone_ && !keepsOthersOut()) return false;
+      // A writer may take it for his own: it is no fault any more, or has another size.
+      if (!isAlone_ && !isStillTheFault()) mayBeWritten_ = true;
       // Blocks where we have not been: somebody else's.
-      if (!isAlone_ && done < record_.content.size && done > kKeptBytes) {
+      if (!isAlone_ && !mayBeWritten_ && done < record_.content.size && done > kKeptBytes) {
         mayBeWritten_ = hasDataFrom(file_.get(), done);
       }
       return !mayBeWritten_ && (!goesOn || goesOn(done));
     };
     return source_.copy(record_, file_.get(), watch);
+  }
+
+  [[nodiscard]] bool isStillTheFault() const {
+    return stampOf(file_.get()).size == record_.content.size &&
+           fgetxattr(file_.get(), kFaultAttribute, nullptr, 0) >= 0;
   }
 
   /// Who wants the file waits for its content, as long as the system lets them. False: a writer
@@ -150,6 +159,34 @@ class Filling {
   bool mayBeWritten_ = false;  ///< by somebody else: nothing of it may be taken back
 };
 
+/// A small fault has kept all its content, which only needs to be verified. False, with nothing
+/// done, where that is not all.
+bool fillSmallFault(const std::string& path, const std::function<bool(std::uint64_t)>& goesOn,
+                    FileStamp& after, NSErrorRef& error) {
+  constexpr int kOpening = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+  const FileDescriptor file(open(path.c_str(), kOpening));
+  struct stat status{};
+  const bool isSmall = file && fstat(file.get(), &status) == 0 && S_ISREG(status.st_mode) &&
+                       status.st_size <= static_cast<off_t>(kKeptBytes);
+  if (!isSmall) return false;
+  const FaultExamination found = examineFault(file.get());
+  if (found.condition != FaultCondition::Pristine) return false;
+  if (goesOn && !goesOn(0)) {
+    error = cancellation();
+    return true;
+  }
+  if (!hasContentOf(file.get(), found.record)) return false;
+  if (fillVerified.hit()) {
+    error = NSError::errorWithErrno(EIO, path);
+    return true;
+  }
+  const std::string& boot = bootIdentifier();
+  if (fsetxattr(file.get(), kFilledAttribute, boot.data(), boot.size(), 0) != 0) return false;
+  (void)fillFilled.hit();
+  after = stampOf(file.get());
+  return true;
+}
+
 }  // namespace
 
 NSErrorRef fillFault(const std::string& path, const FaultSource& source,
@@ -157,6 +194,7 @@ NSErrorRef fillFault(const std::string& path, const FaultSource& source,
                      bool& isMixed) {
   isMixed = false;
   NSErrorRef error;
+  if (fillSmallFault(path, goesOn, after, error)) return error;
   const bool isWritten = isOpenForWriting(path);
   ChangedFile file = ChangedFile::open(path, &error);
   if (!file.isValid()) return error;

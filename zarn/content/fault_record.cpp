@@ -8,9 +8,12 @@
 #include <cerrno>
 #include <charconv>
 #include <ctime>
+#include <span>
 #include <vector>
 
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/file_time.h"
+#include "platform/foundation/hexadecimal.h"
 #include "zarn/change_times.h"
 
 namespace yomber {
@@ -22,15 +25,7 @@ constexpr std::size_t kLongestRecord = 2048;
 constexpr const char* kNothing = "-";
 
 std::string toHex(std::string_view bytes) {
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  if (bytes.empty()) return kNothing;
-  std::string result;
-  for (const char byte : bytes) {
-    const auto value = static_cast<unsigned char>(byte);
-    result += kDigits[value >> 4U];
-    result += kDigits[value & 15U];
-  }
-  return result;
+  return bytes.empty() ? kNothing : hexadecimal(std::as_bytes(std::span(bytes)));
 }
 
 std::optional<std::string> fromHex(std::string_view text) {
@@ -64,17 +59,13 @@ std::vector<std::string_view> fieldsOf(std::string_view text) {
   return fields;
 }
 
-std::int64_t nanoseconds(const std::timespec& time) {
-  return static_cast<std::int64_t>(time.tv_sec) * 1'000'000'000 + time.tv_nsec;
-}
-
 }  // namespace
 
 FileStamp FileStamp::of(const struct stat& status) {
   return {.inode = status.st_ino,
           .size = static_cast<std::uint64_t>(status.st_size),
-          .mtime = nanoseconds(status.st_mtim),
-          .ctime = nanoseconds(status.st_ctim)};
+          .mtime = nanosecondsOf(status.st_mtim),
+          .ctime = nanosecondsOf(status.st_ctim)};
 }
 
 std::string FaultRecord::encoded() const {
@@ -137,12 +128,15 @@ std::optional<FaultRecord> readFaultRecord(int file, bool& isDamaged) {
   return record;
 }
 
-bool isUnfilledFault(int file) {
-  if (fgetxattr(file, kFaultAttribute, nullptr, 0) < 0) return false;
+bool isFilledInThisBoot(int file) {
   std::array<char, 64> boot{};
   const ssize_t length = fgetxattr(file, kFilledAttribute, boot.data(), boot.size());
-  if (length <= 0 || bootIdentifier().empty()) return true;
-  return std::string_view(boot.data(), static_cast<std::size_t>(length)) != bootIdentifier();
+  if (length <= 0 || bootIdentifier().empty()) return false;
+  return std::string_view(boot.data(), static_cast<std::size_t>(length)) == bootIdentifier();
+}
+
+bool isUnfilledFault(int file) {
+  return fgetxattr(file, kFaultAttribute, nullptr, 0) >= 0 && !isFilledInThisBoot(file);
 }
 
 }  // namespace yomber

@@ -7,16 +7,10 @@
 #include <string>
 #include <string_view>
 
+#include "platform/foundation/fault_attributes.h"
 #include "platform/rozzel/asset.h"
 
 namespace yomber {
-
-/// How much of a fault's content stays in its file: one block, which it costs anyway.
-inline constexpr std::uint64_t kKeptBytes = 4096;
-
-/// While a file is filled in or given up: its modification date, decimal ns, which it gets back
-/// when that has ended.
-inline constexpr const char* kHeldDateAttribute = "user.yomber.mtime";
 
 /// Which file, and as which it was when it was looked at.
 struct FileStamp {
@@ -69,6 +63,8 @@ struct FaultRecord {
 /// The record of the file open as `file`. Nothing when it is no fault; with `isDamaged` set when it
 /// is one that cannot be understood.
 [[nodiscard]] std::optional<FaultRecord> readFaultRecord(int file, bool& isDamaged);
+/// Whether a fault that is open was filled in this boot.
+[[nodiscard]] bool isFilledInThisBoot(int file);
 /// Whether the open file is a fault whose content cannot be read; as isFaultAtPath.
 [[nodiscard]] bool isUnfilledFault(int file);
 

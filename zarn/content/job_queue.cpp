@@ -24,7 +24,7 @@ void JobQueue::setAccount(std::int64_t account) {
     lane.mayHaveMore = true;
     ++lane.notes;
   }
-  changed_.notifyAll();
+  wakeAll();
 }
 
 std::int64_t JobQueue::account() const {
@@ -35,61 +35,90 @@ std::int64_t JobQueue::account() const {
 void JobQueue::setStoreOpen(bool isOpen) {
   LockGuard guard(mutex_);
   isStoreOpen_ = isOpen;
-  changed_.notifyAll();
+  wakeAll();
+}
+
+void JobQueue::wakeAll() {
+  for (Lane& lane : lanes_) lane.changed.notifyAll();
 }
 
 void JobQueue::noteJobs(JobKind kind) {
   LockGuard guard(mutex_);
   lane(kind).mayHaveMore = true;
   ++lane(kind).notes;
-  changed_.notifyAll();
+  lane(kind).changed.notifyOne();
 }
 
-void JobQueue::pushUrgent(std::uint64_t item) {
+void JobQueue::pushUrgent(std::uint64_t item, std::uint64_t size) {
   LockGuard guard(mutex_);
-  if (std::find(urgent_.begin(), urgent_.end(), item) == urgent_.end()) urgent_.push_back(item);
-  changed_.notifyAll();
+  if (!urgentItems_.insert(item).second) return;
+  Job& job = urgent_.emplace_back();
+  job.item = item;
+  job.kind = JobKind::Download;
+  job.size = size;
+  lane(JobKind::Download).changed.notifyOne();
 }
 
 bool JobQueue::isOpen(JobKind kind) const {
-  return isStoreOpen_ || (kind != JobKind::Upload && kind != JobKind::Download);
+  const bool needsStore =
+      kind == JobKind::Upload || kind == JobKind::Download || kind == JobKind::Thumbnail;
+  return isStoreOpen_ || !needsStore;
 }
 
-void JobQueue::claim(const Job& job, std::vector<Job>& taken) {
-  running_.emplace(job.item, Running{job, NSProgress::progressWithTotalUnitCount(0)});
-  taken.push_back(job);
-}
+/// What one worker is about to get.
+class JobQueue::Taking {
+ public:
+  explicit Taking(const Portion& portion) : portion_(portion) {}
 
-std::vector<Job> JobQueue::pick(JobKind kind, std::size_t limit) {
-  std::vector<Job> taken;
-  if (kind == JobKind::Download) {
-    for (auto item = urgent_.begin(); item != urgent_.end() && taken.size() < limit;) {
-      if (running_.contains(*item)) {
-        ++item;
-        continue;
-      }
-      Job job;
-      job.item = *item;
-      job.kind = JobKind::Download;
-      job.account = account_;
-      claim(job, taken);
-      item = urgent_.erase(item);
-    }
-    if (!taken.empty()) return taken;
+  [[nodiscard]] bool hasRoomFor(const Job& job) const {
+    if (jobs_.empty()) return true;
+    return jobs_.size() < portion_.jobs && job.size <= portion_.bytes - bytes_;
   }
-  if (!isOpen(kind)) return taken;
+  void add(Job job) {
+    bytes_ += std::min(job.size, portion_.bytes - bytes_);
+    jobs_.push_back(std::move(job));
+  }
+  [[nodiscard]] bool isEmpty() const { return jobs_.empty(); }
+  std::vector<Job> finish() { return std::move(jobs_); }
+
+ private:
+  const Portion portion_;
+  std::vector<Job> jobs_;
+  std::uint64_t bytes_ = 0;
+};
+
+void JobQueue::pickUrgent(Taking& taking) {
+  for (auto job = urgent_.begin(); job != urgent_.end() && taking.hasRoomFor(*job);) {
+    if (running_.contains(job->item)) {
+      ++job;
+      continue;
+    }
+    job->account = account_;
+    urgentItems_.erase(job->item);
+    running_.emplace(job->item, Running{*job, NSProgress::progressWithTotalUnitCount(0)});
+    taking.add(std::move(*job));
+    job = urgent_.erase(job);
+  }
+}
+
+std::vector<Job> JobQueue::pick(JobKind kind, const Portion& portion) {
+  Taking taking(portion);
+  if (kind == JobKind::Download) pickUrgent(taking);
+  if (!taking.isEmpty() || !isOpen(kind)) return taking.finish();
   auto& window = lane(kind).window;
-  for (auto job = window.begin(); job != window.end() && taken.size() < limit;) {
+  while (!window.empty() && taking.hasRoomFor(window.front())) {
+    Job& job = window.front();
     // Who is being worked on comes again with the next page.
-    if (!running_.contains(job->item)) {
-      claim(*job, taken);
+    if (!running_.contains(job.item)) {
+      running_.emplace(job.item, Running{job, NSProgress::progressWithTotalUnitCount(0)});
+      taking.add(std::move(job));
     } else {
       lane(kind).mayHaveMore = true;
       lane(kind).blockedAt = releases_;
     }
-    job = window.erase(job);
+    window.pop_front();
   }
-  return taken;
+  return taking.finish();
 }
 
 void JobQueue::refill(JobKind kind) {
@@ -126,7 +155,7 @@ void JobQueue::refill(JobKind kind) {
     }
     if (!its.window.empty() || notes != its.notes) its.blockedAt = ~0ULL;
   }
-  changed_.notifyAll();
+  its.changed.notifyOne();
 }
 
 bool JobQueue::hasWork(JobKind kind) const {
@@ -143,7 +172,7 @@ void JobQueue::waitForWork(JobKind kind) {
         std::chrono::duration_cast<std::chrono::milliseconds>(left) + std::chrono::milliseconds(1);
     wait = std::clamp(rounded, std::chrono::milliseconds(0), wait);
   }
-  (void)changed_.waitUntil(mutex_, std::chrono::steady_clock::now() + wait);
+  (void)lane(kind).changed.waitUntil(mutex_, std::chrono::steady_clock::now() + wait);
   if (const auto due = lane(kind).nextDue; due && *due <= options_.clock()) {
     lane(kind).nextDue.reset();
     lane(kind).mayHaveMore = true;
@@ -151,13 +180,16 @@ void JobQueue::waitForWork(JobKind kind) {
   }
 }
 
-std::vector<Job> JobQueue::take(JobKind kind, std::size_t limit) {
+std::vector<Job> JobQueue::take(JobKind kind, const Portion& portion) {
   for (;;) {
     {
       LockGuard guard(mutex_);
       if (isEnding_) return {};
-      auto taken = pick(kind, limit);
-      if (!taken.empty()) return taken;
+      auto taken = pick(kind, portion);
+      if (!taken.empty()) {
+        if (hasWork(kind)) lane(kind).changed.notifyOne();
+        return taken;
+      }
       const Lane& its = lane(kind);
       const bool isWorthReading = isOpen(kind) && its.mayHaveMore && !its.isReading &&
                                   its.window.empty() && its.blockedAt != releases_;
@@ -179,7 +211,10 @@ void JobQueue::release(const std::vector<Job>& jobs) {
     ++lane(job.kind).notes;
   }
   ++releases_;
-  changed_.notifyAll();
+  for (std::size_t kind = 0; kind < kJobKinds; ++kind) {
+    if (hasWork(static_cast<JobKind>(kind))) lanes_[kind].changed.notifyOne();
+  }
+  released_.notifyAll();
 }
 
 std::optional<JobQueue::Running> JobQueue::running(std::uint64_t item) const {
@@ -200,14 +235,16 @@ std::vector<JobQueue::Running> JobQueue::allRunning() const {
 void JobQueue::rest(std::chrono::milliseconds length) {
   const auto until = std::chrono::steady_clock::now() + length;
   LockGuard guard(mutex_);
-  while (!isEnding_ && changed_.waitUntil(mutex_, until)) {
+  while (!isEnding_ && ended_.waitUntil(mutex_, until)) {
   }
 }
 
 void JobQueue::end() {
   LockGuard guard(mutex_);
   isEnding_ = true;
-  changed_.notifyAll();
+  wakeAll();
+  ended_.notifyAll();
+  released_.notifyAll();
 }
 
 bool JobQueue::isEnding() const {
@@ -221,12 +258,13 @@ bool JobQueue::waitUntilIdle(std::chrono::steady_clock::time_point deadline) {
   const auto isIdle = [&]() REQUIRES(mutex_) {
     if (!running_.empty() || !urgent_.empty()) return false;
     // Marks that wait to be taken off are nothing to wait for.
-    return !hasWork(JobKind::Upload) && !hasWork(JobKind::Download) && !hasWork(JobKind::Evict);
+    return !hasWork(JobKind::Upload) && !hasWork(JobKind::Download) && !hasWork(JobKind::Evict) &&
+           !hasWork(JobKind::Spread) && !hasWork(JobKind::Thumbnail);
   };
   while (!isIdle()) {
     const auto now = std::chrono::steady_clock::now();
     if (now >= deadline) return false;
-    (void)changed_.waitUntil(mutex_, std::min(deadline, now + kLook));
+    (void)released_.waitUntil(mutex_, std::min(deadline, now + kLook));
   }
   return true;
 }

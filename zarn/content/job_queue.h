@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
+#include <limits>
 #include <memory>
 #include <optional>
 #include <unordered_map>
@@ -39,12 +40,19 @@ class JobQueue {
   /// Rows of that kind may have been added or become due.
   void noteJobs(JobKind kind);
   /// An item that somebody waits for: handed out as a download before all others, in any case; its
-  /// `seq` is 0.
-  void pushUrgent(std::uint64_t item);
+  /// `seq` is 0. `size` is that of its content.
+  void pushUrgent(std::uint64_t item, std::uint64_t size);
 
-  /// Waits for up to `limit` jobs of a kind, which nobody else gets until they are released. Empty
-  /// once the queue ends.
-  [[nodiscard]] std::vector<Job> take(JobKind kind, std::size_t limit);
+  /// How much is handed to one worker at a time. No more than it does together: what is claimed
+  /// waits for it, although others may have nothing to do.
+  struct Portion {
+    std::size_t jobs = 1;
+    /// Of their documents together; a larger one comes alone.
+    std::uint64_t bytes = std::numeric_limits<std::uint64_t>::max();
+  };
+  /// Waits for jobs of a kind, the next ones in their order, which nobody else gets until they are
+  /// released. Empty once the queue ends.
+  [[nodiscard]] std::vector<Job> take(JobKind kind, const Portion& portion);
   void release(const std::vector<Job>& jobs);
   /// Waits that long, or until the queue ends.
   void rest(std::chrono::milliseconds length);
@@ -64,6 +72,7 @@ class JobQueue {
 
  private:
   struct Lane {
+    Condition changed;  ///< whoever takes some wakes the next while there are more
     std::deque<Job> window;
     bool mayHaveMore = true;
     bool isReading = false;
@@ -74,8 +83,10 @@ class JobQueue {
 
   [[nodiscard]] bool isOpen(JobKind kind) const REQUIRES(mutex_);
   [[nodiscard]] bool hasWork(JobKind kind) const REQUIRES(mutex_);
-  std::vector<Job> pick(JobKind kind, std::size_t limit) REQUIRES(mutex_);
-  void claim(const Job& job, std::vector<Job>& taken) REQUIRES(mutex_);
+  class Taking;
+  std::vector<Job> pick(JobKind kind, const Portion& portion) REQUIRES(mutex_);
+  void pickUrgent(Taking& taking) REQUIRES(mutex_);
+  void wakeAll() REQUIRES(mutex_);
   void refill(JobKind kind);
   void waitForWork(JobKind kind) REQUIRES(mutex_);
   [[nodiscard]] Lane& lane(JobKind kind) REQUIRES(mutex_) {
@@ -85,9 +96,11 @@ class JobQueue {
   const std::shared_ptr<Database> database_;
   const Options options_;
   mutable Mutex mutex_;
-  Condition changed_;
+  Condition released_;
+  Condition ended_;
   std::array<Lane, kJobKinds> lanes_ GUARDED_BY(mutex_);
-  std::deque<std::uint64_t> urgent_ GUARDED_BY(mutex_);
+  std::deque<Job> urgent_ GUARDED_BY(mutex_);
+  std::unordered_set<std::uint64_t> urgentItems_ GUARDED_BY(mutex_);  ///< those in `urgent_`
   std::unordered_map<std::uint64_t, Running> running_ GUARDED_BY(mutex_);
   std::uint64_t releases_ GUARDED_BY(mutex_) = 0;
   std::int64_t account_ GUARDED_BY(mutex_) = 0;

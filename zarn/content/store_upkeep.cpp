@@ -4,6 +4,7 @@
 
 #include "platform/foundation/date.h"
 #include "platform/foundation/log.h"
+#include "zarn/content/thumbnail_rows.h"
 #include "zarn/schema.h"
 #include "zarn/write_transaction.h"
 
@@ -46,6 +47,7 @@ bool StoreUpkeep::runIfDue() {
   }
   const NSErrorRef error = database_->write([&](WriteTransaction& transaction) {
     setMetaInteger(transaction.connection(), meta::kCollectedAt, begun);
+    removeUnusedThumbnails(transaction.connection());
     return NSErrorRef();
   });
   if (error) log_error(defaultLog(), "[ERROR] it cannot be noted when it did so: %@", error);

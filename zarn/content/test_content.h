@@ -25,6 +25,7 @@
 #include "zarn/content/fault_file.h"
 #include "zarn/content_engine.h"
 #include "zarn/test_drive.h"
+#include "zarn/test_waiting.h"
 
 namespace yomber {
 
@@ -163,15 +164,6 @@ class ContentDrive : public TestDrive {
       if (each.is_regular_file()) result.push_back(each.path());
     }
     return result;
-  }
-  template <typename Condition>
-  static bool waitUntil(const Condition& condition) {
-    const auto deadline = std::chrono::steady_clock::now() + kPatience;
-    while (!condition()) {
-      if (std::chrono::steady_clock::now() > deadline) return false;
-      std::this_thread::yield();
-    }
-    return true;
   }
 
   /// A document whose content is in the store only.

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <limits>
 #include <memory>
 #include <utility>
 #include <vector>
@@ -12,6 +13,8 @@
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "zarn/content/content_core.h"
+#include "zarn/content/thumbnail_maker.h"
+#include "zarn/content/thumbnail_rows.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"
 
@@ -19,6 +22,7 @@ namespace yomber {
 namespace {
 
 FaultPoint uploadRead("zarn.upload.read");
+FaultPoint uploadReading("zarn.upload.reading");
 FaultPoint uploadStaged("zarn.upload.staged");
 FaultPoint uploadSynced("zarn.upload.synced");
 FaultPoint uploadCommitted("zarn.upload.committed");
@@ -30,14 +34,22 @@ constexpr int kReadings = 3;
 /// Up to so many are synced one by one, more by syncing the file system.
 constexpr std::size_t kFewFiles = 4;
 
+bool isContentGone(const NSErrorRef& error) {
+  return rz_isError(error->underlyingError(), RZErrorAssetMissing);
+}
+
 /// One document on its way.
 struct Upload {
   JobSubject subject;
   enum class Kind { Save, Remove, Nothing, Failed } kind = Kind::Failed;
   ContentRow confirmed;  ///< what will be so when the store has it
-  std::string previousZone;
-  std::string owner;        ///< another account, whose content it is
-  bool isToSettle = false;  ///< it is here, and still marked
+  std::optional<RZRecordZoneID> previousZone;
+  std::string owner;                        ///< another account, whose content it is
+  std::optional<std::int64_t> recordOwner;  ///< another account, whose record it is
+  bool isFault = false;                     ///< only the store can have its content
+  bool isToSettle = false;                  ///< it is here, and still marked
+  bool isPreviousLeft = false;              ///< its removal from there was refused
+  ThumbnailSubject thumbnail;
   NSErrorRef error;
 };
 
@@ -56,6 +68,7 @@ class UploadGroup {
   void finish() {
     NSErrorRef error = syncDocuments();
     if (!error) error = commitAssets();
+    if (!error) makeThumbnails();
     if (!error) error = saveRecords();
     confirm(error);
     uploads_.clear();
@@ -70,10 +83,11 @@ class UploadGroup {
     upload.confirmed.account = subject.job.account;
     if (subject.content) upload.confirmed = *subject.content;
     if (!subject.row) {
-      upload.kind = subject.content && subject.content->content ? Upload::Kind::Remove
-                                                                : Upload::Kind::Nothing;
+      upload.kind = subject.content && subject.content->isRecorded() ? Upload::Kind::Remove
+                                                                     : Upload::Kind::Nothing;
       return;
     }
+    if (subject.row->isFolder()) return prepareFolder(upload);
     if (subject.row->kind != ItemKind::Document || subject.path.empty()) {
       upload.kind = Upload::Kind::Nothing;
       return;
@@ -84,11 +98,30 @@ class UploadGroup {
     if (isNothing) upload.kind = Upload::Kind::Nothing;
   }
 
+  /// Only in shares folders have records.
+  static void prepareFolder(Upload& upload) {
+    const JobSubject& subject = upload.subject;
+    const bool isRecorded = subject.content && subject.content->isRecorded();
+    const auto& share = subject.share;
+    upload.kind = Upload::Kind::Nothing;
+    if (isRecorded && subject.content->account != subject.job.account) {
+      upload.recordOwner = subject.content->account;
+      return;
+    }
+    if (!share) {
+      if (isRecorded && isSharedZone(subject.content->zone)) upload.kind = Upload::Kind::Remove;
+      return;
+    }
+    if (!share->isOwn() && share->root == subject.row->id) return;
+    if (!isInStore(upload)) upload.kind = Upload::Kind::Save;
+  }
+
   /// Whether the store's record needs no change.
   static bool isInStore(Upload& upload) {
     const auto& before = upload.subject.content;
     ContentRow& after = upload.confirmed;
-    if (before && before->zone != upload.subject.zone) upload.previousZone = before->zone;
+    const bool isElsewhere = before && before->isRecorded() && before->zone != upload.subject.zone;
+    if (isElsewhere) upload.previousZone = before->zone;
     after.zone = upload.subject.zone;
     after.parent = upload.subject.row->parent;
     after.name = upload.subject.row->name;
@@ -154,6 +187,7 @@ class UploadGroup {
       upload.owner = account;
       return nullptr;
     }
+    upload.isFault = true;
     upload.confirmed.content = found.record.content;
     upload.confirmed.stamp = found.stamp;
     return nullptr;
@@ -202,8 +236,16 @@ class UploadGroup {
     return take(upload, file, look);
   }
 
+  /// What the store has refused for want of room is not copied there only to hear it again.
+  [[nodiscard]] NSErrorRef askForRoom(const Upload& upload, std::uint64_t size) const {
+    if (upload.subject.job.state != JobState::OverQuota) return nullptr;
+    const auto& before = upload.subject.content;
+    return store_->checkRoom(size, before && before->content ? before->content->size : 0);
+  }
+
   NSErrorRef take(Upload& upload, int file, StampedLook look) {
-    NSErrorRef error;
+    NSErrorRef error = askForRoom(upload, look.stamp.size);
+    if (error) return error;
     if (!group_) group_ = store_->newGroup(&error);
     if (!group_) return error;
     const auto running = core_.queue->running(upload.subject.job.item);
@@ -211,6 +253,7 @@ class UploadGroup {
     bool isSame = true;
     const auto goesOn = [&](std::uint64_t done) {
       if (running) running->progress->setCompletedUnitCount(static_cast<std::int64_t>(done));
+      if (done < look.stamp.size && uploadReading.hit()) return false;
       isSame = lookAtStamp(file).stamp == look.stamp;  // or else all of it is for nothing
       return isSame && !core_.queue->isEnding();
     };
@@ -237,6 +280,49 @@ class UploadGroup {
     return error;
   }
 
+  void makeThumbnails() {
+    ThumbnailMaker maker(core_, store_);
+    std::vector<Upload*> candidates;
+    std::vector<ThumbnailSubject> subjects;
+    for (Upload& upload : uploads_) {
+      const ContentRow& confirmed = upload.confirmed;
+      if (upload.kind != Upload::Kind::Save || !confirmed.content) continue;
+      if (!maker.isCandidate(confirmed.name, *confirmed.content)) continue;
+      candidates.push_back(&upload);
+      subjects.push_back({.name = confirmed.name, .content = *confirmed.content});
+    }
+    maker.make(subjects, core_.options.drawingPatience);
+    for (std::size_t i = 0; i < candidates.size(); ++i)
+      candidates[i]->thumbnail = std::move(subjects[i]);
+  }
+
+  /// Of a record that others may have changed.
+  static std::string knownTag(const std::optional<ContentRow>& content) {
+    return content && isSharedZone(content->zone) ? content->tag : std::string();
+  }
+
+  static StoredDocument documentOf(const Upload& upload) {
+    const ContentRow& confirmed = upload.confirmed;
+    const auto& share = upload.subject.share;
+    const auto& before = upload.subject.content;
+    StoredDocument document{.item = confirmed.id,
+                            .zone = confirmed.zone,
+                            .previousZone = upload.previousZone,
+                            .parent = confirmed.parent,
+                            .name = confirmed.name,
+                            .mtime = confirmed.stamp.mtime,
+                            .btime = upload.subject.row->btime,
+                            .content = confirmed.content.value_or(RZAsset()),
+                            .thumbnail = upload.thumbnail.thumbnail};
+    document.isFolder = upload.subject.row->isFolder();
+    if (document.isFolder) document.mtime = upload.subject.row->mtime;
+    if (upload.previousZone) document.previousTag = knownTag(before);
+    if (!share) return document;
+    document.isPlacedByEach = !share->isOwn() && share->root == confirmed.id;
+    if (before && before->zone == confirmed.zone) document.tag = before->tag;
+    return document;
+  }
+
   NSErrorRef saveRecords() {
     std::vector<StoredDocument> documents;
     std::vector<RemovedDocument> removed;
@@ -245,17 +331,11 @@ class UploadGroup {
     for (Upload& upload : uploads_) {
       if (upload.kind == Upload::Kind::Remove) {
         removing.push_back(&upload);
-        removed.push_back({upload.subject.job.item, upload.confirmed.zone});
+        removed.push_back(
+            {upload.subject.job.item, upload.confirmed.zone, knownTag(upload.subject.content)});
       } else if (upload.kind == Upload::Kind::Save) {
         saving.push_back(&upload);
-        documents.push_back({.item = upload.confirmed.id,
-                             .zone = upload.confirmed.zone,
-                             .previousZone = upload.previousZone,
-                             .parent = upload.confirmed.parent,
-                             .name = upload.confirmed.name,
-                             .mtime = upload.confirmed.stamp.mtime,
-                             .btime = upload.subject.row->btime,
-                             .content = *upload.confirmed.content});
+        documents.push_back(documentOf(upload));
       }
     }
     std::vector<ContentStore::Saved> saved;
@@ -266,6 +346,7 @@ class UploadGroup {
     for (std::size_t i = 0; i < saving.size(); ++i) {
       saving[i]->confirmed.tag = saved[i].tag;
       saving[i]->error = saved[i].error;
+      saving[i]->isPreviousLeft = saved[i].isPreviousLeft;
       if (saved[i].error) saving[i]->kind = Upload::Kind::Failed;
     }
     return uploadCommitted.hit() ? NSError::errorWithErrno(EIO) : nullptr;
@@ -290,6 +371,7 @@ class UploadGroup {
     core_.noteStored(error);
     if (isAway) core_.noteOutOfReach();
     if (std::exchange(hasSettling_, false)) core_.queue->noteJobs(JobKind::Settle);
+    if (std::exchange(hasThumbnails_, false)) core_.queue->noteJobs(JobKind::Thumbnail);
     (void)uploadConfirmed.hit();
   }
 
@@ -299,23 +381,82 @@ class UploadGroup {
     if (isOutOfReach(upload.error)) return core_.noteOutOfReach();
     if (upload.error) {
       if (upload.error->is(NSCocoaErrorDomain, NSUserCancelledError)) return;  // we are ending
+      noteRefused(upload);
+      if (upload.isFault && isContentGone(upload.error)) return giveUp(connection, upload);
       return core_.postpone(connection, job, upload.error);
     }
     core_.finished.fetch_add(1);
     removeJob(connection, job);
-    if (!upload.owner.empty()) return leaveToOwner(connection, upload);
+    if (!upload.owner.empty())
+      return leaveTo(connection, upload, accountKey(connection, upload.owner));
+    if (upload.recordOwner) return leaveTo(connection, upload, *upload.recordOwner);
     if (upload.isToSettle && !findJob(connection, job.item, JobKind::Settle)) {
       addJob(connection, job.item, JobKind::Settle, job.account, core_.now(), core_.now());
       hasSettling_ = true;
     }
     if (!upload.subject.row) return removeContent(connection, job.item);
+    if (upload.subject.row->isFolder()) return storeFolder(connection, upload);
     if (upload.subject.row->kind != ItemKind::Document || !upload.confirmed.content) return;
+    noteThumbnail(connection, upload);
     if (!storeConfirmed(transaction, upload.confirmed)) behind_.push_back(upload.subject.path);
   }
 
-  /// A copy of another account's fault: no content of ours.
-  void leaveToOwner(Connection& connection, const Upload& upload) const {
-    const std::int64_t owner = accountKey(connection, upload.owner);
+  /// A document without content whose content nobody has: trying again changes nothing.
+  static void giveUp(Connection& connection, const Upload& upload) {
+    Job job = upload.subject.job;
+    ++job.attempts;
+    job.state = JobState::Retrying;
+    job.due = std::numeric_limits<std::int64_t>::max();
+    job.error = NSError::errorWithDomain(
+        NSCocoaErrorDomain, NSFileReadCorruptFileError,
+        {{NSLocalizedDescriptionKey,
+          "the content of \"" + upload.subject.row->name +
+              "\" is neither here nor in the store any more; ask whoever shared it to share it "
+              "again, then remove this one"},
+         {NSUnderlyingErrorKey, upload.error}});
+    updateJob(connection, job);
+    log_error(defaultLog(), "[ERROR] given up: %@", job.error);
+  }
+
+  void noteRefused(const Upload& upload) const {
+    const RZRecordZoneID& zone =
+        upload.isPreviousLeft ? *upload.previousZone : upload.confirmed.zone;
+    const bool isForbidden = rz_isError(upload.error, RZErrorPermissionFailure);
+    const bool isChanged = rz_isError(upload.error, RZErrorServerRecordChanged) ||
+                           rz_isError(upload.error, RZErrorUnknownItem) ||
+                           rz_isError(upload.error, RZErrorZoneNotFound);
+    if (isSharedZone(zone) && (isForbidden || isChanged))
+      core_.noteRefused(upload.subject.job.item, zone, isForbidden);
+  }
+
+  void storeFolder(Connection& connection, const Upload& upload) const {
+    if (upload.kind == Upload::Kind::Nothing) return;
+    ContentRow folder;
+    if (upload.kind == Upload::Kind::Save) folder = upload.confirmed;
+    folder.id = upload.subject.job.item;
+    folder.account = upload.subject.job.account;
+    const auto now = findContent(connection, folder.id);
+    folder.isPinned = now && now->isPinned;
+    storeContent(connection, folder);
+    const auto row = findByID(connection, folder.id);
+    // Removed, renamed or moved meanwhile.
+    const auto account = row ? whoseFolderIsBehind(connection, *row) : folder.account;
+    if (account) addJob(connection, folder.id, JobKind::Upload, *account, core_.now(), core_.now());
+  }
+
+  void noteThumbnail(Connection& connection, const Upload& upload) {
+    const ThumbnailSubject& made = upload.thumbnail;
+    if (made.isNew) storeThumbnail(connection, {made.content, made.thumbnail});
+    if (made.outcome == ThumbnailSubject::Outcome::None ||
+        made.outcome == ThumbnailSubject::Outcome::Ready)
+      return;
+    addJob(connection, upload.subject.job.item, JobKind::Thumbnail, upload.subject.job.account,
+           core_.now(), core_.now());
+    hasThumbnails_ = true;
+  }
+
+  /// A copy of another account's fault, or its folder: nothing of ours.
+  void leaveTo(Connection& connection, const Upload& upload, std::int64_t owner) const {
     const std::int64_t now = core_.now();
     addJob(connection, upload.subject.job.item, JobKind::Upload, owner, now, now);
   }
@@ -330,6 +471,12 @@ class UploadGroup {
       const std::int64_t now = core_.now();
       addJob(connection, confirmed.id, JobKind::Upload, confirmed.account, now, now);
       return true;
+    }
+    // It came into a share, or out of one, while it was on its way.
+    if (zoneOf(connection, row->id, confirmed.zone, confirmed.account) != confirmed.zone) {
+      const std::int64_t now = core_.now();
+      addJob(connection, confirmed.id, JobKind::Upload, confirmed.account, now, now);
+      core_.queue->noteJobs(JobKind::Upload);
     }
     ItemRow after = *row;
     if (isConfirmed(after, confirmed)) after.flags |= row_flag::kUploaded;
@@ -352,6 +499,7 @@ class UploadGroup {
   std::vector<std::string> behind_;  ///< documents whose rows are
   std::uint64_t bytes_ = 0;
   bool hasSettling_ = false;
+  bool hasThumbnails_ = false;
 };
 
 }  // namespace

@@ -1,0 +1,99 @@
+#include "zarn/content/shares.h"
+#include "zarn/content/test_sharing.h"
+
+namespace yomber {
+namespace {
+
+using Names = std::vector<std::string>;
+
+/// One home, on which several accounts sign in one after the other.
+class ShareAccountsTest : public TwoDrives {
+ protected:
+  void signIn(const SharingDrive& drive, const std::string& account) const {
+    drive.engine->setStore(std::make_shared<ContentStore>(records, account), account);
+  }
+  /// The owners of the zones, as the account sees them, that have a record of the item.
+  [[nodiscard]] Names zonesWith(const std::string& account, std::uint64_t id) const {
+    Names names;
+    for (const RZDatabaseScope scope : {RZDatabaseScope::Private, RZDatabaseScope::Shared}) {
+      RZDatabaseID database{QSUbiquitousRozzelContainerIdentifier, account};
+      database.scope = scope;
+      std::vector<RZRecordZone> zones;
+      EXPECT_EQ(records->fetchZones(database, zones), nullptr);
+      for (const RZRecordZone& zone : zones) {
+        std::vector<RZFetchedRecord> found;
+        EXPECT_EQ(records->fetchRecords(database, {RZRecordID(std::to_string(id), zone.zoneID)},
+                                        std::nullopt, found),
+                  nullptr);
+        if (found.at(0).record) names.push_back(zone.zoneID.zoneName());
+      }
+    }
+    return names;
+  }
+};
+
+TEST_F(ShareAccountsTest, WhatAnotherAccountPutsIntoASharedFolderIsItsOwn) {
+  shareFolder(editor("bob"));
+  signIn(*bob, "carol");
+  bob->write("Plans/carols.txt", "by carol");
+  bob->settle();
+  EXPECT_EQ(zonesWith("carol", bob->id("Plans/carols.txt")), Names{QSUbiquitousDefaultContainerID});
+  signIn(*bob, "bob");
+  bob->settle();
+  ASSERT_EQ(bob->follow(), nullptr);
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"})) << "carol has shared it with nobody";
+  EXPECT_EQ(bob->read("Plans/carols.txt"), "by carol");
+}
+
+TEST_F(ShareAccountsTest, AParticipantsFoldersAreSavedUnderHisAccountOnly) {
+  shareFolder(editor("bob"));
+  ann->share("Plans", {editor("bob"), editor("carol")});
+  signIn(*bob, "carol");
+  RZShareRef accepted;
+  const RZDatabaseID database{QSUbiquitousRozzelContainerIdentifier, "carol"};
+  ASSERT_EQ(records->acceptShare(database.containerIdentifier, "carol", share->URL().value_or(""),
+                                 accepted),
+            nullptr);
+  bob->rename("Plans/Old", "Plans/Older");
+  bob->makeFolder("Plans/New");
+  bob->settle();
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"})) << "carol does not follow it here";
+  signIn(*bob, "bob");
+  bob->settle();
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->names("Plans"), (Names{"New", "Older", "a.txt"}));
+}
+
+TEST_F(ShareAccountsTest, NobodySharesWhatAnotherAccountShares) {
+  shareFolder(editor("bob"));
+  signIn(*ann, "carol");
+  RZShareRef made;
+  for (const char* path : {"Plans", "Plans/Old"}) {
+    const NSErrorRef error = ann->shares().newShare(ann->at(path), made);
+    ASSERT_NE(error, nullptr) << path;
+    EXPECT_NE(error->localizedDescription().find("\"ann\"; sign in to that one"), std::string::npos)
+        << error->description();
+  }
+  const RZShare own(share->recordID(), share->type(), "Plans", "carol");
+  EXPECT_NE(ann->shares().save(own, made), nullptr);
+  ASSERT_EQ(ann->follow(), nullptr);
+  signIn(*ann, "ann");
+  ann->write("Plans/more.txt", "more");
+  ann->settle();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->readWhole("Plans/more.txt"), "more");
+}
+
+TEST_F(ShareAccountsTest, AFolderThatHoldsAnotherAccountsShareIsNotShared) {
+  ann->makeFolder("Top");
+  ann->makeFolder("Top/Plans");
+  ann->settle();
+  ASSERT_NE(ann->share("Top/Plans", {viewer("bob")}), nullptr);
+  signIn(*ann, "carol");
+  EXPECT_NE(ann->shares().checkShareable(ann->id("Top")), nullptr);
+}
+
+}  // namespace
+}  // namespace yomber

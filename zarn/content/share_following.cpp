@@ -1,0 +1,301 @@
+// Shares: following what others change.
+#include <algorithm>
+#include <cerrno>
+#include <utility>
+
+#include "platform/foundation/log.h"
+#include "zarn/content/share_errors.h"
+#include "zarn/content/share_leaving.h"
+#include "zarn/content/share_pull.h"
+#include "zarn/content/shares.h"
+#include "zarn/row_queries.h"
+#include "zarn/tree_layout.h"
+#include "zarn/write_transaction.h"
+
+namespace yomber {
+namespace {
+
+const RZRecordZone* findZone(const std::vector<RZRecordZone>& zones, const RZRecordZoneID& id) {
+  const auto found = std::find_if(zones.begin(), zones.end(),
+                                  [&](const RZRecordZone& zone) { return zone.zoneID == id; });
+  return found == zones.end() ? nullptr : &*found;
+}
+
+/// Under which name what is shared can be put into the drive.
+std::string nameFor(const RZShare& share) {
+  for (const std::string& name : {share.title(), share.ownerName()}) {
+    if (isPossibleName(name) && !isExcludedName(name)) return name;
+  }
+  return "Shared item";
+}
+
+/// What came to be recorded elsewhere, while nobody knew that it is shared, says nothing of whether
+/// the share has it.
+void forgetRecordsElsewhere(Connection& connection, const ShareRow& share) {
+  std::vector<std::uint64_t> rest{share.root};
+  while (!rest.empty()) {
+    const std::uint64_t id = rest.back();
+    rest.pop_back();
+    for (const std::uint64_t child : findChildIDs(connection, id)) rest.push_back(child);
+    auto content = findContent(connection, id);
+    if (!content || !content->content || content->zone == share.zone) continue;
+    content->content.reset();
+    storeContent(connection, *content);
+  }
+}
+
+}  // namespace
+
+Shares::Shares(std::shared_ptr<ContentCore> core, Options options)
+    : core_(std::move(core)), options_(options) {
+  core_->didRefuse = [this] { poke(); };
+}
+
+Shares::~Shares() { stop(); }
+
+void Shares::start() {
+  if (!thread_.joinable()) thread_ = std::thread([this] { work(); });
+}
+
+void Shares::stop() {
+  {
+    LockGuard guard(mutex_);
+    isEnding_ = true;
+    changed_.notifyAll();
+  }
+  if (thread_.joinable()) thread_.join();
+}
+
+void Shares::poke() {
+  LockGuard guard(mutex_);
+  isPoked_ = true;
+  changed_.notifyAll();
+}
+
+void Shares::work() {
+  NSErrorRef last;
+  for (;;) {
+    {
+      LockGuard guard(mutex_);
+      const auto next = std::chrono::steady_clock::now() + options_.interval;
+      while (!isEnding_ && !isPoked_) {
+        if (!changed_.waitUntil(mutex_, next)) break;
+      }
+      if (isEnding_) return;
+      isPoked_ = false;
+    }
+    NSErrorRef error;
+    {
+      LockGuard working(working_);
+      error = pass();
+    }
+    if (error && !isOutOfReach(error) && (!last || last->description() != error->description()))
+      log_error(defaultLog(), "[ERROR] shares cannot be followed: %@", error);
+    last = std::move(error);
+  }
+}
+
+NSErrorRef Shares::pass() {
+  Session session;
+  // What was done while no process ran must not be taken for something else.
+  if (open(session) || !core_->scanner->hasScannedAll()) return nullptr;
+  if (!isRecovered_) SharedTree(*core_, *session.store).recover();
+  NSErrorRef error = isRecovered_ ? nullptr : askForWaitingAgain(session.account);
+  isRecovered_ = true;
+  if (!error) error = followZones(session);
+  if (error) return error;
+  const ContentCore::Refused refused = core_->takeRefused();
+  for (const bool isForbidden : {false, true}) {
+    for (const auto& [zone, items] : isForbidden ? refused.forbidden : refused.changed) {
+      std::optional<ShareRow> share;
+      error = core_->database().read([&](Connection& connection) {
+        share = findShareOfZone(connection, session.account, zone);
+      });
+      if (!error && share && !share->isLeaving())
+        error = SharePull(*core_, session.store, *share).takeOver(items, isForbidden);
+      if (error) return error;  // the jobs are tried again, and refused again
+    }
+  }
+  return nullptr;
+}
+
+/// Whatever came of it before: there may be room now, or another program that knows more.
+NSErrorRef Shares::askForWaitingAgain(std::int64_t account) const {
+  bool isAnyPostponed = false;
+  NSErrorRef error = core_->database().read(
+      [&](Connection& connection) { isAnyPostponed = hasPostponedRecords(connection, account); });
+  if (error || !isAnyPostponed) return error;
+  return core_->database().write([&](WriteTransaction& transaction) {
+    makeAllWaitingRecordsDue(transaction.connection(), account);
+    return NSErrorRef();
+  });
+}
+
+NSErrorRef Shares::followZones(const Session& session) {
+  const ContentStore& store = *session.store;
+  Zones own;
+  Zones foreign;
+  NSErrorRef error =
+      contentError(store.engine()->fetchZones(store.databaseOf(RZDatabaseScope::Private), own));
+  if (!error)
+    error = contentError(
+        store.engine()->fetchZones(store.databaseOf(RZDatabaseScope::Shared), foreign));
+  if (error) return error;
+  std::vector<ShareRow> shares;
+  const auto read = [&](Connection& connection) {
+    shares = findShares(connection, session.account);
+  };
+  error = core_->database().read(read);
+  const auto isKnown = [&](const RZRecordZoneID& zone) {
+    return std::any_of(shares.begin(), shares.end(),
+                       [&](const ShareRow& share) { return share.zone == zone; });
+  };
+  bool mayHaveAdopted = false;
+  for (const Zones* const zones : {&own, &foreign}) {
+    for (const RZRecordZone& zone : *zones) {
+      if (error || !isSharedZone(zone.zoneID) || isKnown(zone.zoneID)) continue;
+      error = adopt(session, zone);
+      mayHaveAdopted = true;
+    }
+  }
+  if (!error && mayHaveAdopted) error = core_->database().read(read);
+  if (error) return error;
+  NSErrorRef result;
+  for (const ShareRow& share : shares) {
+    error = follow(session.store, share, share.isOwn() ? own : foreign);
+    if (isOutOfReach(error) || core_->queue->isEnding()) return error;
+    if (error) result = error;  // that must not keep the others
+  }
+  return result;
+}
+
+NSErrorRef Shares::adopt(const Session& session, const RZRecordZone& zone) {
+  RZShareRef share;
+  NSErrorRef error = session.store->fetchShare(zone.zoneID, share);
+  if (error) return isNoShare(error) ? nullptr : error;
+  const auto root = itemOfRecord(share->rootRecordID().recordName());
+  if (!root) return nullptr;
+  ShareRow row;
+  row.root = *root;
+  row.account = session.account;
+  row.zone = zone.zoneID;
+  if (row.isOwn()) return adoptOwn(std::move(row), *share);
+  row.mayWrite = zone.permission == RZZonePermission::ReadWrite;
+  return adoptForeign(std::move(row), *share);
+}
+
+/// One that was accepted, here before the process ended, or by this account elsewhere.
+NSErrorRef Shares::adoptForeign(ShareRow row, const RZShare& share) {
+  row.isFolder = share.type() == RZShareTypeFolder;
+  row.title = nameFor(share);
+  bool isPossible = false;
+  NSErrorRef error = core_->database().read(
+      [&](Connection& connection) { isPossible = canBecome(connection, row); });
+  if (error) return error;
+  if (!isPossible) {
+    if (refused_.insert(row.zone).second)
+      log_error(defaultLog(), "[ERROR] \"%@\" cannot be followed: another item has its identifier",
+                row.title);
+    return nullptr;
+  }
+  refused_.erase(row.zone);
+  return core_->database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    if (!canBecome(connection, row)) return NSErrorRef();
+    forgetRecordsElsewhere(connection, row);
+    storeShare(connection, row);
+    return NSErrorRef();
+  });
+}
+
+bool Shares::canBecome(Connection& connection, const ShareRow& row) {
+  if (findShare(connection, row.root)) return false;
+  const auto item = findByID(connection, row.root);
+  if (!item) return true;
+  // Of a database that was lost, the files still carry it.
+  const bool isMarked = (item->flags & row_flag::kShared) != 0;
+  const bool isSameKind = row.isFolder ? item->isFolder() : item->kind == ItemKind::Document;
+  return isMarked && isSameKind && !findShareAbove(connection, row.root);
+}
+
+/// One that was saved just before the process ended, or before the database was lost.
+NSErrorRef Shares::adoptOwn(ShareRow row, const RZShare& share) const {
+  NSErrorRef error;
+  const auto item = core_->items->itemByID(row.root, &error);
+  if (!item) return error;
+  bool isOthers = false;
+  error = core_->database().read([&](Connection& connection) {
+    const auto known = findShare(connection, row.root);
+    isOthers = known && known->account != row.account;
+  });
+  if (error || isOthers) return error;
+  row.isFolder = item->isFolder();
+  row.title = share.title();
+  return beginOwn(std::move(row));
+}
+
+void Shares::followPermission(const ContentStore& store, ShareRow& share) const {
+  const SharedTree tree(*core_, store);
+  const auto root = core_->items->itemByID(share.root);
+  std::vector<ItemRow> rest;
+  if (root) rest.push_back(*root);
+  while (!rest.empty()) {
+    const ItemRow row = std::move(rest.back());
+    rest.pop_back();
+    const auto path = core_->items->physicalPath(row.id);
+    if (!path) continue;
+    tree.setWritable(*path, share.mayWrite);
+    if (row.id == share.root) (void)tree.markShared(*path, true);
+    (void)core_->scanner->scanLocation(*path, nullptr);
+    if (!row.isFolder()) continue;
+    for (ItemRow& child : core_->items->children(row.id)) rest.push_back(std::move(child));
+  }
+}
+
+NSErrorRef Shares::follow(const std::shared_ptr<ContentStore>& store, ShareRow share,
+                          const Zones& zones) {
+  if (share.isLeaving()) return leaveShare(*core_, store, share);
+  NSErrorRef error;
+  const RZRecordZone* const zone = findZone(zones, share.zone);
+  const auto root = core_->items->itemByID(share.root, &error);
+  if (error) return error;
+  const bool wasHere = share.isOwn() || !share.zoneTag.empty();
+  const bool isMissing = wasHere && (!root || (!share.isOwn() && root->isTrashed()));
+  if (!isMissing) missing_.erase(share.root);
+  const bool hasGone = isMissing && !missing_.insert(share.root).second;
+  bool isShared = zone != nullptr;
+  RZShareRef record;
+  if (zone != nullptr && (hasGone || zone->changeTag != share.zoneTag)) {
+    error = store->fetchShare(share.zone, record);
+    // What others share is left when its zone has gone as well.
+    if (share.isOwn() && rz_isError(error, RZErrorUnknownItem)) isShared = false;
+    if (error && isShared) return error;
+  }
+  if (isShared && hasGone) {  // the item was removed here
+    error = contentError(store->engine()->destroyShare(store->databaseOf(share.zone), *record));
+    if (error) return error;
+    isShared = false;
+  }
+  if (!isShared) {
+    const auto last = zone != nullptr ? LastSaves::InZone : LastSaves::Gone;
+    return endShare(*core_, store, std::move(share), last);
+  }
+  const bool mayWrite = share.isOwn() || zone->permission == RZZonePermission::ReadWrite;
+  const bool isOtherwise = std::exchange(share.mayWrite, mayWrite) != mayWrite;
+  if (isOtherwise) followPermission(*store, share);
+  bool hasWaiting = false;
+  error = core_->database().read([&](Connection& connection) {
+    hasWaiting = !findWaitingRecords(connection, share.root, core_->now(), 1).empty();
+  });
+  const bool isBehind = zone->changeTag != share.zoneTag;
+  if (!error && (isBehind || hasWaiting)) error = SharePull(*core_, store, share).run();
+  if (error || (!isBehind && !isOtherwise)) return error;
+  if (!core_->items->itemByID(share.root)) return nullptr;  // on its way
+  share.zoneTag = zone->changeTag;
+  return core_->database().write([&](WriteTransaction& transaction) {
+    storeShare(transaction.connection(), share);
+    return NSErrorRef();
+  });
+}
+
+}  // namespace yomber

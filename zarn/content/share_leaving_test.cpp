@@ -1,0 +1,243 @@
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include "zarn/content/test_sharing.h"
+
+namespace yomber {
+namespace {
+
+using Names = std::vector<std::string>;
+
+class ShareLeavingTest : public TwoDrives {
+ protected:
+  /// Whether the item has a record in one of the account's own zones.
+  [[nodiscard]] bool hasOwnRecord(const std::string& account, std::uint64_t id) const {
+    const RZDatabaseID database{QSUbiquitousRozzelContainerIdentifier, account};
+    std::vector<RZRecordZone> zones;
+    EXPECT_EQ(records->fetchZones(database, zones), nullptr);
+    for (const RZRecordZone& zone : zones) {
+      std::vector<RZFetchedRecord> found;
+      EXPECT_EQ(records->fetchRecords(database, {RZRecordID(std::to_string(id), zone.zoneID)},
+                                      std::nullopt, found),
+                nullptr);
+      if (found.at(0).record) return true;
+    }
+    return false;
+  }
+  /// Takes over what others have changed, while jobs may fail still.
+  [[nodiscard]] NSErrorRef refresh(const SharingDrive& drive) const {
+    return drive.shares().refresh(std::string(NSFileProviderRootContainerItemIdentifier));
+  }
+};
+
+TEST_F(ShareLeavingTest, WhatAParticipantMovedIntoItBeforeHeHeardStaysHis) {
+  bob->write("thesis.doc", kLong);
+  bob->makeFolder("Letters");
+  bob->write("Letters/one.txt", "dear Ann");
+  bob->settle();
+  const std::uint64_t thesis = bob->id("thesis.doc");
+  const std::uint64_t letter = bob->id("Letters/one.txt");
+  shareFolder(editor("bob"));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  bob->rename("thesis.doc", "Plans/Old/thesis.doc");
+  bob->rename("Letters", "Plans/Letters");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), (Names{"Letters", "thesis.doc"}));
+  EXPECT_EQ(bob->read("thesis.doc"), kLong);
+  EXPECT_EQ(bob->read("Letters/one.txt"), "dear Ann");
+  EXPECT_EQ(bob->id("thesis.doc"), thesis);
+  EXPECT_EQ(bob->id("Letters/one.txt"), letter);
+  EXPECT_TRUE(hasOwnRecord("bob", thesis));
+  EXPECT_TRUE(hasOwnRecord("bob", letter));
+}
+
+TEST_F(ShareLeavingTest, WhatAParticipantSharesHimselfStaysShared) {
+  bob->makeFolder("Mine");
+  bob->write("Mine/m.txt", "mine");
+  bob->settle();
+  ASSERT_NE(bob->share("Mine", {viewer("ann")}), nullptr);
+  shareFolder(editor("bob"));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  bob->rename("Mine", "Plans/Mine");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), Names{"Mine"});
+  EXPECT_EQ(bob->read("Mine/m.txt"), "mine");
+  Shares::Copied copied;
+  EXPECT_EQ(bob->shares().copyShare(bob->at("Mine"), copied), nullptr);
+}
+
+TEST_F(ShareLeavingTest, WhatNoRowKnowsIsKept) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  bob->write("Plans/cache.nosync", "never synced");
+  bob->makeFolder("Plans/Old/build.nosync");
+  bob->write("Plans/Old/build.nosync/object", "nor this");
+  bob->write("Plans/unseen.txt", "not scanned yet");
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), Names{"Plans (kept copy)"});
+  EXPECT_EQ(bob->names("Plans (kept copy)"), (Names{"build.nosync", "cache.nosync", "unseen.txt"}));
+  EXPECT_EQ(bob->read("Plans (kept copy)/cache.nosync"), "never synced");
+  EXPECT_EQ(bob->read("Plans (kept copy)/build.nosync/object"), "nor this");
+  EXPECT_EQ(bob->read("Plans (kept copy)/unseen.txt"), "not scanned yet");
+}
+
+TEST_F(ShareLeavingTest, WhatIsWrittenWhileTheItemGoesIsKept) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  const std::string gate = storePath + "-go";
+  ASSERT_EQ(FaultPoint::arm("zarn.leave.kept=pause-until-file:" + gate), nullptr);
+  NSErrorRef error;
+  std::thread following([&] { error = bob->follow(); });
+  EXPECT_TRUE(waitUntil([&] { return std::filesystem::exists(gate + ".reached"); }));
+  bob->write("Plans/late.txt", "late");
+  bob->write("Plans/a.txt", "changed late");
+  std::ofstream(gate).put('x');
+  following.join();
+  ASSERT_EQ(error, nullptr);
+  EXPECT_EQ(bob->names(), (Names{"Plans (kept copy)", "a (kept copy).txt"}));
+  EXPECT_EQ(bob->read("Plans (kept copy)/late.txt"), "late");
+  EXPECT_EQ(bob->read("a (kept copy).txt"), "changed late");
+}
+
+TEST_F(ShareLeavingTest, WhatIsWrittenLaterIntoADocumentThatWasOpenIsKept) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ASSERT_EQ(bob->readWhole("Plans/Old/b.txt"), "short");
+  ASSERT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
+  const FileDescriptor writer(open(bob->at("Plans/a.txt").c_str(), O_WRONLY | O_CLOEXEC));
+  const FileDescriptor reader(open(bob->at("Plans/Old/b.txt").c_str(), O_RDONLY | O_CLOEXEC));
+  ASSERT_TRUE(writer && reader);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  ASSERT_EQ(pwrite(writer.get(), "edited", 6, 0), 6);
+  EXPECT_EQ(bob->names(), Names{"a (kept copy).txt"}) << "nothing is lost of what is only read";
+  EXPECT_EQ(bob->read("a (kept copy).txt"), "edited" + kLong.substr(6));
+}
+
+TEST_F(ShareLeavingTest, ALinkInItIsNoObstacle) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(symlink("a.txt", bob->at("Plans/link").c_str()), 0);
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), Names{"link"});
+}
+
+TEST_F(ShareLeavingTest, WhatWasMovedOutBeforeIsTheParticipantsOwn) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ASSERT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  bob->rename("Plans/a.txt", "mine.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(refresh(*bob), nullptr);
+  EXPECT_FALSE(hasOwnRecord("bob", bob->id("mine.txt")));
+  FaultPoint::disarmAll();
+  // Nobody looks at the file again.
+  EXPECT_TRUE(waitUntil([&] { return hasOwnRecord("bob", bob->id("mine.txt")); }));
+  EXPECT_EQ(bob->names(), Names{"mine.txt"});
+  EXPECT_EQ(bob->read("mine.txt"), kLong);
+}
+
+TEST_F(ShareLeavingTest, WhatWasMovedOutAndHasNoContentAnywhereIsGivenUpWithAReason) {
+  shareFolder(editor("bob"));
+  ASSERT_TRUE(bob->isFault("Plans/a.txt"));
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  bob->rename("Plans/a.txt", "mine.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ann->remove("Plans/a.txt");
+  ann->settle();
+  ASSERT_EQ(refresh(*bob), nullptr);
+  EmbeddedEngine collector(storePath, {.assetGraceSeconds = 0});
+  RZGarbageReport report;
+  ASSERT_EQ(collector.collectGarbage(report), nullptr);
+  FaultPoint::disarmAll();
+  bob->engine->retryNow();
+  std::optional<ContentTransfer> ended;
+  EXPECT_TRUE(waitUntil([&] {
+    for (const ContentTransfer& each : bob->engine->transfers().transfers) {
+      if (each.item == bob->id("mine.txt") && !each.isRunning && !each.nextAttempt) ended = each;
+    }
+    return ended.has_value();
+  }));
+  ASSERT_TRUE(ended);
+  ASSERT_NE(ended->failure, nullptr);
+  EXPECT_NE(ended->failure->localizedDescription().find("\"mine.txt\" is neither here nor"),
+            std::string::npos)
+      << ended->failure->description();
+  EXPECT_NE(bob->provide("mine.txt"), nullptr);
+  EXPECT_TRUE(bob->isFault("mine.txt")) << "it is the user's to remove";
+  bob->write("other.txt", "goes on");
+  bob->settle();
+  const auto after = bob->engine->transfers().transfers;
+  ASSERT_EQ(after.size(), 1U);
+  EXPECT_FALSE(after[0].nextAttempt) << "the scan has it tried once more, and no more";
+}
+
+class ShareEndingTest : public ShareLeavingTest {
+ protected:
+  [[nodiscard]] std::size_t countZones(const std::string& account) const {
+    std::vector<RZRecordZone> zones;
+    EXPECT_EQ(records->fetchZones({QSUbiquitousRozzelContainerIdentifier, account}, zones),
+              nullptr);
+    return zones.size();
+  }
+};
+
+TEST_F(ShareEndingTest, WhatParticipantsHaveSavedIsTakenOverBefore) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  bob->write("Plans/a.txt", "by bob");
+  bob->write("Plans/new.txt", "new by bob");
+  bob->settle();
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt", "new.txt"}));
+  EXPECT_EQ(ann->readWhole("Plans/a.txt"), "by bob");
+  EXPECT_EQ(ann->readWhole("Plans/new.txt"), "new by bob");
+  EXPECT_TRUE(hasOwnRecord("ann", ann->id("Plans/new.txt")));
+  EXPECT_EQ(countZones("ann"), 1U) << "the share's zone is gone";
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), Names{});
+}
+
+TEST_F(ShareEndingTest, ADocumentThatIsOpenIsWaitedFor) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  bob->write("Plans/a.txt", "by bob");
+  bob->settle();
+  {
+    const std::ifstream open(ann->at("Plans/a.txt"));
+    ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+    ASSERT_EQ(refresh(*ann), nullptr);
+    EXPECT_EQ(countZones("ann"), 2U);
+    EXPECT_EQ(ann->read("Plans/a.txt"), kLong);
+  }
+  ASSERT_EQ(ann->follow(), nullptr);
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->readWhole("Plans/a.txt"), "by bob");
+  EXPECT_EQ(countZones("ann"), 1U);
+}
+
+TEST_F(ShareEndingTest, AZoneIsNotDeletedWithARecordThatWasNotTakenOver) {
+  shareFolder(editor("bob"));
+  const RZRecordZoneID zone = share->recordID().zoneID();
+  RZRecordBatch batch;
+  batch.recordsToSave.push_back(std::make_shared<RZRecord>("Other", RZRecordID("other", zone)));
+  std::vector<RZRecordRef> saved;
+  ASSERT_EQ(records->modifyRecords({QSUbiquitousRozzelContainerIdentifier, "ann"}, batch, saved),
+            nullptr);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(countZones("ann"), 2U);
+  EXPECT_TRUE(hasOwnRecord("ann", ann->id("Plans/a.txt")));
+}
+
+}  // namespace
+}  // namespace yomber

@@ -1,0 +1,240 @@
+#include "zarn/content/share_pull.h"
+
+#include <fcntl.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include "zarn/content/test_sharing.h"
+#include "zarn/item_attributes.h"
+
+namespace yomber {
+namespace {
+
+using Names = std::vector<std::string>;
+
+class SharePullTest : public TwoDrives {
+ protected:
+  void followBoth() {
+    for (int turn = 0; turn < 3; ++turn) {
+      ASSERT_EQ(bob->follow(), nullptr);
+      ASSERT_EQ(ann->follow(), nullptr);
+    }
+  }
+  /// Has Bob do something at a fault point of his taking over.
+  void meanwhile(const std::string& point, const std::function<void()>& work) {
+    const std::string gate = storePath + "-go";
+    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate), nullptr);
+    std::thread following([&] { (void)bob->follow(); });
+    const bool isReached = waitUntil([&] { return std::filesystem::exists(gate + ".reached"); });
+    if (isReached) work();
+    std::ofstream(gate).put('x');
+    following.join();
+    FaultPoint::disarmAll();
+    ASSERT_TRUE(isReached);
+  }
+};
+
+TEST_F(SharePullTest, ANameThatLeadsElsewhereIsRefused) {
+  ann->makeFolder("Folder");
+  ann->write("mine.txt", "mine");
+  const ContentCore core(ann->store, ann->scanner, ContentEngine::Options());
+  const ContentStore documents(records, "ann");
+  const SharedTree tree(core, documents);
+  for (const std::string& name : {std::string("../out.txt"), std::string(".."), std::string("."),
+                                  std::string(), std::string("a\0b", 3), std::string(256, 'x')}) {
+    std::string wanted = name;
+    EXPECT_NE(tree.place(ann->at("mine.txt"), ann->at("Folder"), wanted), nullptr) << name;
+  }
+  EXPECT_EQ(ann->names(), (Names{"Folder", "mine.txt"}));
+  EXPECT_EQ(ann->names("Folder"), Names{});
+}
+
+TEST_F(SharePullTest, WhatIsSavedWhileAChangeIsTakenOverIsUploaded) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ann->write("Plans/a.txt", "by ann");
+  ann->settle();
+  // Or else his drive would be done with it before the page is.
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  meanwhile("zarn.pull.placed", [&] {
+    bob->write("saving", "by bob");  // as long as Ann's: a stamp alone tells the two apart
+    // As an editor that takes attributes along.
+    const std::string id = std::to_string(bob->id("Plans/a.txt"));
+    ASSERT_EQ(setxattr(bob->at("saving").c_str(), kIDAttribute, id.data(), id.size(), 0), 0);
+    bob->rename("saving", "Plans/a.txt");
+    // As a scan at the same time: nothing is left to be written to the file.
+    EXPECT_NE(bob->scanner->scanLocation(bob->at("Plans/a.txt")), std::nullopt);
+  });
+  bob->settle();
+  EXPECT_TRUE(waitUntil(
+      [&] { return ann->follow() == nullptr && ann->readWhole("Plans/a.txt") == "by bob"; }));
+  followBoth();
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), "by bob");
+}
+
+TEST_F(SharePullTest, WhatIsAddedToAFolderThatAnotherDeletesStays) {
+  shareFolder(editor("bob"));
+  bob->write("Plans/Old/new.txt", "new");
+  bob->makeFolder("Plans/Old/Sub");
+  bob->write("Plans/Old/Sub/deep.txt", "deep");
+  bob->settle();
+  bob->write("Plans/Old/mine.nosync", "never scanned");
+  ann->remove("Plans/Old");
+  ann->settle();
+  followBoth();
+  EXPECT_EQ(bob->names("Plans"), (Names{"Sub", "a.txt", "mine.nosync", "new.txt"}));
+  EXPECT_EQ(ann->names("Plans"), (Names{"Sub", "a.txt", "new.txt"}));
+  for (const auto* drive : {ann.get(), bob.get()}) {
+    EXPECT_EQ(drive->readWhole("Plans/new.txt"), "new");
+    EXPECT_EQ(drive->readWhole("Plans/Sub/deep.txt"), "deep");
+  }
+}
+
+TEST_F(SharePullTest, AFolderThatAnotherDeletesGoesWithAllThatWasInIt) {
+  shareFolder(editor("bob"));
+  ann->makeFolder("Plans/Old/Sub");
+  ann->write("Plans/Old/Sub/c.txt", "c");
+  ann->settle();
+  followBoth();
+  ASSERT_EQ(bob->names("Plans/Old"), (Names{"Sub", "b.txt"}));
+  ann->remove("Plans/Old");
+  ann->settle();
+  followBoth();
+  EXPECT_EQ(bob->names("Plans"), Names{"a.txt"});
+  EXPECT_EQ(ann->names("Plans"), Names{"a.txt"});
+}
+
+TEST_F(SharePullTest, WhatAnotherHasChangedIsNotDeleted) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/a.txt", "second");
+  ann->settle();
+  bob->remove("Plans/a.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
+  EXPECT_TRUE(waitUntil([&] { return bob->follow() == nullptr && bob->exists("Plans/a.txt"); }));
+  followBoth();
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), "second");
+  EXPECT_EQ(ann->readWhole("Plans/a.txt"), "second");
+}
+
+TEST_F(SharePullTest, WhatIsMovedOutTakesAlongWhatAnotherHasChanged) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/a.txt", "second");
+  ann->settle();
+  bob->rename("Plans/a.txt", "mine.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
+  EXPECT_TRUE(waitUntil(
+      [&] { return bob->follow() == nullptr && bob->readWhole("mine.txt") == "second"; }));
+  EXPECT_TRUE(waitUntil([&] { return ann->follow() == nullptr && !ann->exists("Plans/a.txt"); }));
+  followBoth();
+  EXPECT_EQ(bob->names("Plans"), Names{"Old"});
+  EXPECT_EQ(bob->readWhole("mine.txt"), "second");
+}
+
+TEST_F(SharePullTest, WhatIsOpenIsNotRemoved) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ann->remove("Plans/a.txt");
+  ann->settle();
+  {
+    const FileDescriptor file(open(bob->at("Plans/a.txt").c_str(), O_WRONLY | O_CLOEXEC));
+    ASSERT_TRUE(file);
+    ASSERT_EQ(bob->follow(), nullptr);
+    EXPECT_TRUE(bob->exists("Plans/a.txt")) << "it waits";
+    ASSERT_EQ(pwrite(file.get(), "edited", 6, 0), 6);
+  }
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  EXPECT_TRUE(waitUntil(
+      [&] { return bob->follow() == nullptr && bob->exists("Plans/a (kept copy).txt"); }));
+  followBoth();
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a (kept copy).txt"}));
+  EXPECT_EQ(ann->readWhole("Plans/a (kept copy).txt"), "edited" + kLong.substr(6));
+}
+
+TEST_F(SharePullTest, ALinkIsKeptWhenSharingStops) {
+  shareFolder(editor("bob"));
+  std::filesystem::create_symlink("a.txt", bob->at("Plans/link"));
+  bob->settle();
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), Names{"link"});
+}
+
+TEST_F(SharePullTest, WhatAViewerMovesOutComesBack) {
+  shareFolder(viewer("bob"));
+  ASSERT_EQ(chmod(bob->at("Plans").c_str(), 0700), 0);
+  bob->rename("Plans/a.txt", "taken.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  EXPECT_TRUE(waitUntil([&] { return bob->follow() == nullptr && bob->exists("Plans/a.txt"); }));
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), Names{"Plans"});
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->id("Plans/a.txt"), ann->id("Plans/a.txt"));
+}
+
+TEST_F(SharePullTest, OneThatIsCutShortByTheEndGoesOnWithTheNextProcess) {
+  shareFolder(editor("bob"));
+  constexpr std::uint64_t kFolders = 1'200;  // more than a page
+  constexpr std::uint64_t kFirst = 4'000'000'000;
+  const RZRecordZoneID zone = share->recordID().zoneID();
+  const auto parent = static_cast<std::int64_t>(ann->id("Plans"));
+  for (std::uint64_t done = 0; done < kFolders;) {
+    RZRecordBatch batch;
+    for (int i = 0; i < 200; ++i, ++done) {
+      auto record = std::make_shared<RZRecord>(kQSRecordTypeFolder,
+                                               RZRecordID(std::to_string(kFirst + done), zone));
+      record->setObject("f" + std::to_string(done), kQSRecordKeyName);
+      record->setObject(parent, kQSRecordKeyParent);
+      batch.recordsToSave.push_back(std::move(record));
+    }
+    std::vector<RZRecordRef> saved;
+    ASSERT_EQ(records->modifyRecords({QSUbiquitousRozzelContainerIdentifier, "ann"}, batch, saved),
+              nullptr);
+  }
+  const std::string gate = storePath + "-go";
+  ASSERT_EQ(FaultPoint::arm("zarn.pull.placed=pause-until-file:" + gate), nullptr);
+  NSErrorRef error;
+  std::thread following([&] {
+    error = bob->shares().refresh(std::string(NSFileProviderRootContainerItemIdentifier));
+  });
+  EXPECT_TRUE(waitUntil([&] { return std::filesystem::exists(gate + ".reached"); }));
+  std::thread ending([&] { bob->engine->stop(); });
+  EXPECT_TRUE(waitUntil([&] {
+    const NSErrorRef refused = bob->provide("Plans/a.txt");
+    return refused && refused->is(NSCocoaErrorDomain, NSUserCancelledError);
+  })) << "it is about to end";
+  std::ofstream(gate).put('x');
+  following.join();
+  ending.join();
+  FaultPoint::disarmAll();
+  ASSERT_NE(error, nullptr) << "what is missing must not count as known";
+  EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSUserCancelledError)) << error->description();
+  EXPECT_LT(bob->names("Plans").size(), kFolders);
+  bob->restart();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names("Plans").size(), kFolders + 2);
+}
+
+TEST_F(SharePullTest, NothingIsFollowedBeforeTheTreeWasScanned) {
+  shareFolder(editor("bob"));
+  bob->engine->stop();
+  bob->engine.reset();
+  bob->scanner.reset();
+  bob->store.reset();
+  bob->database.reset();
+  ann->write("Plans/new.txt", "new");
+  ann->settle();
+  bob->open();
+  bob->start();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_FALSE(bob->exists("Plans/new.txt")) << "what was moved meanwhile is not known yet";
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->readWhole("Plans/new.txt"), "new");
+}
+
+}  // namespace
+}  // namespace yomber

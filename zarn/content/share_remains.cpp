@@ -1,0 +1,224 @@
+#include "zarn/content/share_remains.h"
+
+#include <dirent.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+
+#include <cerrno>
+#include <memory>
+#include <set>
+#include <string_view>
+#include <utility>
+
+#include "platform/foundation/bounced_name.h"
+#include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/log.h"
+#include "zarn/content/file_lease.h"
+#include "zarn/content/share_rows.h"
+#include "zarn/content/shared_item.h"
+#include "zarn/item_attributes.h"
+#include "zarn/row_queries.h"
+
+namespace yomber {
+namespace {
+
+using Fate = GoingItems::Fate;
+
+struct Found {
+  ItemRow row;
+  std::optional<ContentRow> content;
+  bool isOtherShare = false;
+};
+
+/// Those above before those below; not into other shares.
+std::vector<Found> findAll(Connection& connection, const ItemRow& root) {
+  std::vector<Found> all;
+  std::vector<ItemRow> rest{root};
+  while (!rest.empty()) {
+    Found found;
+    found.row = std::move(rest.back());
+    rest.pop_back();
+    found.content = findContent(connection, found.row.id);
+    found.isOtherShare = found.row.id != root.id && findShare(connection, found.row.id);
+    if (found.row.isFolder() && !found.isOtherShare) {
+      for (ItemRow& child : findChildren(connection, found.row.id))
+        rest.push_back(std::move(child));
+    }
+    all.push_back(std::move(found));
+  }
+  return all;
+}
+
+/// The items that have a record in the zone, and the folders above them.
+std::set<std::uint64_t> findShared(const std::vector<Found>& all, const RZRecordZoneID& zone) {
+  std::set<std::uint64_t> shared;
+  for (auto found = all.rbegin(); found != all.rend(); ++found) {
+    const auto& content = found->content;
+    const bool isRecorded = content && content->isRecorded() && content->zone == zone;
+    if (!isRecorded && !shared.contains(found->row.id)) continue;
+    if (found->isOtherShare) continue;
+    shared.insert(found->row.id);
+    shared.insert(found->row.parent);
+  }
+  return shared;
+}
+
+Fate fateOf(const Found& found, const RZRecordZoneID& zone, bool isShared) {
+  if (found.isOtherShare) return Fate::Stays;
+  if (found.row.isFolder()) return isShared ? Fate::Opened : Fate::Stays;
+  if (found.row.kind != ItemKind::Document) return Fate::Stays;
+  const bool isElsewhere =
+      found.content && found.content->isRecorded() && found.content->zone != zone;
+  return isElsewhere ? Fate::Stays : Fate::Goes;
+}
+
+std::string lastOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+
+NSErrorRef listFolder(const std::string& path, std::vector<std::string>& entries) {
+  const std::unique_ptr<DIR, int (*)(DIR*)> stream(opendir(path.c_str()), closedir);
+  if (!stream) return NSError::errorWithErrno(errno, path);
+  for (;;) {
+    errno = 0;
+    const dirent* const entry = readdir(stream.get());
+    if (entry == nullptr) return errno == 0 ? nullptr : NSError::errorWithErrno(errno, path);
+    const std::string_view name = entry->d_name;
+    if (name != "." && name != "..") entries.push_back(path + '/' + std::string(name));
+  }
+}
+
+/// Whether somebody has a document open for writing: what is yet to be written through that
+/// descriptor would go with the file. One without content is open to be filled.
+bool isBeingWritten(const std::string& path) {
+  return !isFaultAtPath(path) && isOpenForWriting(path);
+}
+
+/// Takes away the marks of a share that could only be read.
+void makeWritable(const SharedTree& tree, const std::string& top) {
+  std::vector<std::string> rest{top};
+  while (!rest.empty()) {
+    const std::string path = std::move(rest.back());
+    rest.pop_back();
+    struct stat status{};
+    if (lstat(path.c_str(), &status) != 0) continue;
+    if (lgetxattr(path.c_str(), kOnlyReadableAttribute, nullptr, 0) >= 0)
+      tree.setWritable(path, true);
+    if (S_ISDIR(status.st_mode)) (void)listFolder(path, rest);
+  }
+}
+
+}  // namespace
+
+NSErrorRef GoingItems::read(const ContentCore& core, const ItemRow& root,
+                            const RZRecordZoneID& zone, GoingItems& items) {
+  items = {};
+  return core.database().read([&](Connection& connection) {
+    const ReadTransaction transaction(connection);
+    const std::vector<Found> all = findAll(connection, root);
+    std::set<std::uint64_t> shared = findShared(all, zone);
+    shared.insert(root.id);
+    std::set<std::uint64_t> staying;
+    for (const Found& found : all) {
+      const ItemRow& row = found.row;
+      if (staying.contains(row.parent)) {
+        staying.insert(row.id);
+        continue;
+      }
+      Fate fate = fateOf(found, zone, shared.contains(row.id));
+      std::optional<ContentRow> content = found.content;
+      if (row.id == root.id && fate == Fate::Stays) {  // a document with its record elsewhere
+        fate = Fate::Goes;
+        content.reset();
+      }
+      if (fate == Fate::Stays) staying.insert(row.id);
+      if (fate == Fate::Goes) items.documents.push_back(row.id);
+      items.byInode[row.inode] = {.id = row.id,
+                                  .parent = row.parent,
+                                  .fate = fate,
+                                  .isOtherShare = found.isOtherShare,
+                                  .content = std::move(content)};
+    }
+  });
+}
+
+std::vector<std::uint64_t> GoingItems::foldersOfStaying() const {
+  std::set<std::uint64_t> folders;
+  for (const auto& [inode, item] : byInode) {
+    if (item.fate == Fate::Stays) folders.insert(item.parent);
+  }
+  return {folders.begin(), folders.end()};
+}
+
+NSErrorRef ShareRemains::keep(const std::string& top) {
+  std::vector<std::string> rest{top};
+  while (!rest.empty()) {
+    const std::string path = std::move(rest.back());
+    rest.pop_back();
+    if (NSErrorRef error = keepOne(path, path == top, rest)) return error;
+  }
+  return nullptr;
+}
+
+NSErrorRef ShareRemains::keepOne(const std::string& path, bool isTop,
+                                 std::vector<std::string>& rest) {
+  struct stat status{};
+  if (lstat(path.c_str(), &status) != 0)
+    return errno == ENOENT ? nullptr : NSError::errorWithErrno(errno, path);
+  const auto known = items_.byInode.find(status.st_ino);
+  const bool isKnown = known != items_.byInode.end();
+  if (!isKnown && !isTop) return keepUnknown(path);
+  const bool isFolder = S_ISDIR(status.st_mode);
+  if (isKnown && !isTop && known->second.fate == Fate::Stays) return keepOwn(path, known->second);
+  if (isFolder) return listFolder(path, rest);
+  const std::optional<ContentRow> content = isKnown ? known->second.content : std::nullopt;
+  if (!isUnsaved(path, content) && !isBeingWritten(path)) return nullptr;
+  return keepCopy(path, isTop ? name_ : lastOf(path));
+}
+
+NSErrorRef ShareRemains::keepCopy(const std::string& path, const std::string& name) const {
+  std::string taken;
+  std::string kept;
+  NSErrorRef error = tree_.takeAway(path, SharedTree::Kept::Yes, taken);
+  if (!error) (void)core_.scanner->scanLocation(path, nullptr);
+  if (!error) error = tree_.keepCopy(taken, folder_, name, kept);
+  if (!error) (void)core_.scanner->scanLocation(kept, nullptr);
+  return error;
+}
+
+NSErrorRef ShareRemains::keepOwn(const std::string& path, const GoingItems::Item& item) const {
+  const auto folder = core_.items->itemAtPath(folder_);
+  if (!folder) return NSError::errorWithErrno(EAGAIN, folder_);
+  std::string name = lastOf(path);
+  if (NSErrorRef error = tree_.place(path, folder_, name)) return error;
+  const std::string place = folder_ + '/' + name;
+  if (!item.isOtherShare) makeWritable(tree_, place);
+  log_default(defaultLog(), "[NOTICE] what was this account's own is now %@", place);
+  // Both ends as one change: it is the same item.
+  std::vector<DirtyFolder> dirty(2);
+  dirty[0].id = item.parent;
+  dirty[0].names = {lastOf(path)};
+  dirty[1].id = folder->id;
+  dirty[1].names = {name};
+  std::vector<DirtyFolder> notFound;
+  return core_.scanner->scanDirty(dirty, notFound);
+}
+
+NSErrorRef ShareRemains::keepUnknown(const std::string& path) {
+  if (unknownFolder_.empty()) {
+    int number = 0;
+    const std::string made = bouncedName(keptCopyName(name_), [&](const std::string& each) {
+      number = mkdir((folder_ + '/' + each).c_str(), 0700) == 0 ? 0 : errno;
+      return number == EEXIST;
+    });
+    if (number != 0) return NSError::errorWithErrno(number, folder_ + '/' + made);
+    unknownFolder_ = folder_ + '/' + made;
+  }
+  std::string name = lastOf(path);
+  if (NSErrorRef error = tree_.place(path, unknownFolder_, name)) return error;
+  log_default(defaultLog(), "[NOTICE] what was never saved in the store is kept in %@",
+              unknownFolder_);
+  (void)core_.scanner->scanLocation(path, nullptr);
+  (void)core_.scanner->scanLocation(unknownFolder_ + '/' + name, nullptr);
+  return nullptr;
+}
+
+}  // namespace yomber

@@ -1,0 +1,112 @@
+#include <sys/stat.h>
+
+#include "platform/rozzel/record.h"
+#include "zarn/content/share_rows.h"
+#include "zarn/content/test_sharing.h"
+
+namespace yomber {
+namespace {
+
+using Names = std::vector<std::string>;
+
+class ShareRemovalsTest : public TwoDrives {
+ protected:
+  void followBoth() {
+    for (int turn = 0; turn < 3; ++turn) {
+      ASSERT_EQ(bob->follow(), nullptr);
+      ASSERT_EQ(ann->follow(), nullptr);
+    }
+  }
+  /// A record of a document, as Ann saves it, in a folder that need not be there.
+  void saveRecord(std::uint64_t id, std::uint64_t parent, const char* type) const {
+    const auto record = std::make_shared<RZRecord>(
+        type, RZRecordID(std::to_string(id), share->recordID().zoneID()));
+    record->setObject(std::string("Late"), kQSRecordKeyName);
+    record->setObject(static_cast<std::int64_t>(parent), kQSRecordKeyParent);
+    RZRecordBatch batch;
+    batch.recordsToSave.push_back(record);
+    std::vector<RZRecordRef> saved;
+    ASSERT_EQ(records->modifyRecords({QSUbiquitousRozzelContainerIdentifier, "ann"}, batch, saved),
+              nullptr);
+  }
+  [[nodiscard]] std::int64_t attemptsOf(std::uint64_t record) const {
+    std::int64_t attempts = -1;
+    EXPECT_EQ(bob->database->read([&](Connection& connection) {
+      Statement statement(connection.database(),
+                          "SELECT attempts FROM share_waiting WHERE record=?1");
+      statement.bindID(1, record);
+      if (statement.step()) attempts = statement.integer(0);
+    }),
+              nullptr);
+    return attempts;
+  }
+};
+
+TEST_F(ShareRemovalsTest, WhatAViewerDeletesByForceComesBack) {
+  shareFolder(viewer("bob"));
+  EXPECT_EQ(unlink(bob->at("Plans/a.txt").c_str()) == 0 ? 0 : errno, geteuid() == 0 ? 0 : EACCES);
+  ASSERT_EQ(chmod(bob->at("Plans").c_str(), 0700), 0);
+  ASSERT_EQ(chmod(bob->at("Plans/Old").c_str(), 0700), 0);
+  bob->remove("Plans/a.txt");
+  bob->remove("Plans/Old");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  EXPECT_TRUE(waitUntil([&] {
+    return bob->follow() == nullptr && bob->exists("Plans/a.txt") && bob->exists("Plans/Old/b.txt");
+  }));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Plans/Old/b.txt"), "short");
+  EXPECT_EQ(bob->id("Plans/a.txt"), ann->id("Plans/a.txt"));
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
+}
+
+TEST_F(ShareRemovalsTest, UnsavedWorkInAFolderThatItsOwnerDeletesIsKept) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/Old/b.txt"), "short");
+  ann->remove("Plans/Old");
+  ann->settle();
+  bob->write("Plans/Old/b.txt", "unsaved by bob");
+  ASSERT_EQ(bob->follow(), nullptr);
+  bob->settle();
+  followBoth();
+  EXPECT_EQ(bob->names("Plans"), (Names{"a.txt", "b (kept copy).txt"}));
+  EXPECT_EQ(bob->read("Plans/b (kept copy).txt"), "unsaved by bob");
+  EXPECT_EQ(ann->readWhole("Plans/b (kept copy).txt"), "unsaved by bob");
+}
+
+TEST_F(ShareRemovalsTest, WhatAViewerHasInAFolderThatItsOwnerDeletesIsKeptBesideTheShare) {
+  shareFolder(viewer("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/Old/b.txt"), "short");
+  for (const char* path : {"Plans/Old", "Plans/Old/b.txt"})
+    ASSERT_EQ(chmod(bob->at(path).c_str(), 0700), 0);
+  bob->write("Plans/Old/b.txt", "unsaved by bob");
+  bob->write("Plans/Old/own.nosync", "never synced");
+  ann->remove("Plans/Old");
+  ann->settle();
+  followBoth();
+  EXPECT_EQ(bob->names("Plans"), Names{"a.txt"});
+  EXPECT_EQ(bob->names(), (Names{"Plans", "b (kept copy).txt", "own.nosync"}));
+  EXPECT_EQ(bob->read("b (kept copy).txt"), "unsaved by bob");
+  EXPECT_EQ(bob->read("own.nosync"), "never synced");
+}
+
+TEST_F(ShareRemovalsTest, ARecordWhoseFolderIsNotKnownIsAskedForLaterUnlessSomebodyAsks) {
+  shareFolder(editor("bob"));
+  const std::uint64_t folder = 4'000'000'001;
+  const std::uint64_t inIt = 4'000'000'002;
+  saveRecord(inIt, folder, kQSRecordTypeFolder);
+  ASSERT_EQ(bob->follow(), nullptr);
+  const std::int64_t first = attemptsOf(inIt);
+  ASSERT_GE(first, 1);
+  ASSERT_EQ(bob->accept(share), nullptr);
+  EXPECT_EQ(attemptsOf(inIt), first) << "a pass that nobody asks for";
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(attemptsOf(inIt), first + 1);
+  saveRecord(folder, ann->id("Plans"), kQSRecordTypeFolder);
+  ASSERT_EQ(bob->accept(share), nullptr);
+  EXPECT_TRUE(bob->exists("Plans/Late/Late")) << "its folder has come";
+  EXPECT_EQ(attemptsOf(inIt), -1);
+}
+
+}  // namespace
+}  // namespace yomber

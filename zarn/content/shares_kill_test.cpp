@@ -1,0 +1,149 @@
+#include <sys/wait.h>
+
+#include <functional>
+
+#include "zarn/content/test_sharing.h"
+
+namespace yomber {
+namespace {
+
+using Names = std::vector<std::string>;
+
+/// What a process that dies at a fault point has begun is finished by the next one.
+class SharesKillTest : public TwoDrives, public testing::WithParamInterface<const char*> {
+ protected:
+  /// Runs `work` with the drive of that account in a child that ends at the fault point. Threads
+  /// are not carried across a fork: everything of ours is closed before.
+  void dieDuring(const std::string& account, const std::string& point,
+                 const std::function<void(SharingDrive&)>& work) {
+    const std::string annsHome = ann->layout.home();
+    const std::string bobsHome = bob->layout.home();
+    ann.reset();
+    bob.reset();
+    records.reset();
+    const pid_t child = fork();
+    if (child == 0) {
+      SharingDrive drive(account == "ann" ? annsHome : bobsHome,
+                         std::make_shared<EmbeddedEngine>(storePath), account);
+      if (FaultPoint::arm(point + "=abort")) _exit(1);
+      work(drive);
+      _exit(0);
+    }
+    int ending = 0;
+    ASSERT_EQ(waitpid(child, &ending, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(ending)) << point << " was not reached";
+    records = std::make_shared<EmbeddedEngine>(storePath);
+    ann = std::make_unique<SharingDrive>(annsHome, records, "ann");
+    bob = std::make_unique<SharingDrive>(bobsHome, records, "bob");
+    for (int turn = 0; turn < 3; ++turn) {
+      ASSERT_EQ(bob->follow(), nullptr);
+      ASSERT_EQ(ann->follow(), nullptr);
+    }
+  }
+  void expectSame() const {
+    EXPECT_EQ(bob->names("Plans"), ann->names("Plans"));
+    EXPECT_EQ(bob->readWhole("Plans/a.txt"), ann->readWhole("Plans/a.txt"));
+    EXPECT_EQ(bob->id("Plans/a.txt"), ann->id("Plans/a.txt"));
+  }
+};
+
+class ShareSaveKillTest : public SharesKillTest {};
+class SharePullKillTest : public SharesKillTest {};
+class ShareLeaveKillTest : public SharesKillTest {};
+class ShareEndKillTest : public SharesKillTest {};
+
+TEST_P(ShareSaveKillTest, TheShareIsOneAfterTheNextStart) {
+  ann->makeFolder("Plans");
+  ann->write("Plans/a.txt", kLong);
+  ann->settle();
+  dieDuring("ann", GetParam(), [](SharingDrive& drive) { drive.share("Plans", {editor("bob")}); });
+  Shares::Copied copied;
+  ASSERT_EQ(ann->shares().copyShare(ann->at("Plans"), copied), nullptr);
+  ASSERT_EQ(bob->accept(copied.share), nullptr);
+  EXPECT_EQ(bob->names("Plans"), Names{"a.txt"});
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareSaveKillTest,
+                         testing::Values("zarn.share.saved", "zarn.share.noted",
+                                         "zarn.upload.committed", "zarn.spread.stored"));
+
+TEST_P(SharePullKillTest, WhatIsAcceptedAppearsWithTheNextStart) {
+  ann->makeFolder("Plans");
+  ann->write("Plans/a.txt", kLong);
+  ann->settle();
+  share = ann->share("Plans", {editor("bob")});
+  dieDuring("bob", GetParam(), [&](SharingDrive& drive) { (void)drive.accept(share); });
+  expectSame();
+  EXPECT_EQ(bob->names(), Names{"Plans"});
+  EXPECT_EQ(bob->names("Plans"), Names{"a.txt"});
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, SharePullKillTest,
+                         testing::Values("zarn.share.accepted", "zarn.pull.fetched",
+                                         "zarn.pull.placed", "zarn.pull.stored"));
+
+class ShareConflictKillTest : public SharesKillTest {};
+
+TEST_P(ShareConflictKillTest, WhatBothWroteIsThereAfterTheNextStart) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ann->write("Plans/a.txt", "by ann");
+  ann->settle();
+  dieDuring("bob", GetParam(), [](SharingDrive& drive) {
+    drive.write("Plans/a.txt", "by bob, longer");
+    (void)drive.scanner->scanAll();
+    for (int turn = 0; turn < 100; ++turn) (void)drive.follow();
+  });
+  expectSame();
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), "by ann");
+  bool isFound = false;
+  for (const std::string& folder : {std::string(), std::string("Plans/")}) {
+    for (const std::string& name : bob->names(folder))
+      isFound = isFound || (!std::filesystem::is_directory(bob->at(folder + name)) &&
+                            bob->readWhole(folder + name) == "by bob, longer");
+  }
+  EXPECT_TRUE(isFound) << "what Bob wrote is lost";
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareConflictKillTest,
+                         testing::Values("zarn.pull.displaced", "zarn.pull.placed",
+                                         "zarn.pull.stored"));
+
+TEST_P(ShareLeaveKillTest, WhatIsSharedNoLongerGoesWithTheNextStart) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  dieDuring("bob", GetParam(), [](SharingDrive& drive) {
+    drive.write("Plans/new.txt", "unsaved");
+    (void)drive.scanner->scanAll();
+    (void)drive.follow();
+  });
+  EXPECT_EQ(bob->names(), Names{"new (kept copy).txt"});
+  EXPECT_EQ(bob->readWhole("new (kept copy).txt"), "unsaved");
+  EXPECT_EQ(ann->readWhole("Plans/a.txt"), kLong);
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareLeaveKillTest,
+                         testing::Values("zarn.leave.noted", "zarn.leave.kept", "zarn.leave.gone"));
+
+TEST_P(ShareEndKillTest, TheOwnersRecordsComeBackWithTheNextStart) {
+  shareFolder(viewer("bob"));
+  dieDuring("ann", GetParam(), [](SharingDrive& drive) { (void)drive.stopSharing("Plans"); });
+  Shares::Copied copied;
+  EXPECT_TRUE(ann->shares()
+                  .copyShare(ann->at("Plans"), copied)
+                  ->is(QSOstrellErrorDomain, QSOstrellErrorNotShared));
+  std::vector<RZRecordZone> zones;
+  ASSERT_EQ(records->fetchZones({QSUbiquitousRozzelContainerIdentifier, "ann"}, zones), nullptr);
+  EXPECT_EQ(zones.size(), 1U) << "the share's zone is gone";
+  EXPECT_EQ(bob->names(), Names{});
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
+}
+
+INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareEndKillTest,
+                         testing::Values("zarn.share.destroyed", "zarn.leave.noted",
+                                         "zarn.upload.committed"));
+
+}  // namespace
+}  // namespace yomber

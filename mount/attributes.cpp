@@ -1,0 +1,192 @@
+// Attributes of files and folders, extended ones too.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <climits>
+#include <string_view>
+#include <vector>
+
+#include "mount/file_system.h"
+#include "platform/foundation/descriptor_path.h"
+#include "platform/foundation/fault_attributes.h"
+
+namespace yomber {
+namespace {
+
+/// The drive's own attributes are nobody else's business.
+constexpr std::string_view kOwnPrefix = "user.yomber.";
+/// Permissions are checked by the kernel, which does not ask for these.
+constexpr std::string_view kAccessListPrefix = "system.posix_acl_";
+
+bool isOwn(std::string_view name) { return name.starts_with(kOwnPrefix); }
+bool isAccessList(std::string_view name) { return name.starts_with(kAccessListPrefix); }
+
+timespec timeFrom(const struct stat& wanted, int which, int set, int setNow, bool isAccess) {
+  if ((which & setNow) != 0) return {.tv_sec = 0, .tv_nsec = UTIME_NOW};
+  if ((which & set) == 0) return {.tv_sec = 0, .tv_nsec = UTIME_OMIT};
+  return isAccess ? wanted.st_atim : wanted.st_mtim;
+}
+
+/// Names end with a zero each.
+std::vector<char> withoutOwn(const std::vector<char>& names) {
+  std::vector<char> result;
+  for (std::size_t start = 0; start < names.size();) {
+    const std::string_view name(names.data() + start);
+    if (!isOwn(name) && !isAccessList(name)) {
+      result.insert(result.end(), name.begin(), name.end());
+      result.push_back(0);
+    }
+    start += name.size() + 1;
+  }
+  return result;
+}
+
+}  // namespace
+
+void FileSystem::getattr(fuse_req_t request, Node& node, fuse_file_info* /*info*/) {
+  struct statx status{};
+  const int failure = statusOf(node, status);
+  if (failure == 0) return answerAttributes(request, node, status);
+  (void)fuse_reply_err(request, failure);
+}
+
+void FileSystem::setattr(fuse_req_t request, Node& node, struct stat* wanted, int which,
+                         fuse_file_info* info) {
+  const struct stat others = *wanted;
+  const auto finish = [this, request, use = std::make_shared<NodeUse>(nodes_.use(node)), others,
+                       which](int failure) {
+    Descriptor descriptor;
+    if (failure == 0) failure = descriptorOf(*use->get(), descriptor);
+    if (failure == 0) failure = setOthers(descriptor.number, others, which);
+    struct statx status{};
+    if (failure == 0) failure = lookAt(descriptor.number, "", status);
+    if (failure == 0) putRight(descriptor.number, "", status);
+    if (failure == 0) return answerAttributes(request, *use->get(), status);
+    (void)fuse_reply_err(request, failure);
+  };
+  if ((which & FUSE_SET_ATTR_SIZE) == 0) return finish(0);
+  truncate(request, node, wanted->st_size, info, finish);
+}
+
+int FileSystem::setOthers(int descriptor, const struct stat& wanted, int which) const {
+  const std::string path = pathOfDescriptor(descriptor);
+  constexpr int kTimes =
+      FUSE_SET_ATTR_ATIME | FUSE_SET_ATTR_MTIME | FUSE_SET_ATTR_ATIME_NOW | FUSE_SET_ATTR_MTIME_NOW;
+  // A change of owner that leaves both as they are changes nothing but the date of change.
+  const bool isOwnerKept = (which & (FUSE_SET_ATTR_MODE | FUSE_SET_ATTR_SIZE | kTimes)) == 0;
+  if (isOwnerKept || (which & (FUSE_SET_ATTR_UID | FUSE_SET_ATTR_GID)) != 0) {
+    const uid_t user = (which & FUSE_SET_ATTR_UID) != 0 ? wanted.st_uid : static_cast<uid_t>(-1);
+    const gid_t group = (which & FUSE_SET_ATTR_GID) != 0 ? wanted.st_gid : static_cast<gid_t>(-1);
+    if (fchownat(descriptor, "", user, group, AT_EMPTY_PATH) != 0) return errno;
+  }
+  // After the owner, whose change takes set-id bits away.
+  if ((which & FUSE_SET_ATTR_MODE) != 0 && chmod(path.c_str(), wanted.st_mode & ALLPERMS) != 0) {
+    return errno;
+  }
+  if ((which & kTimes) == 0) return 0;
+  const std::array<timespec, 2> times{
+      timeFrom(wanted, which, FUSE_SET_ATTR_ATIME, FUSE_SET_ATTR_ATIME_NOW, true),
+      timeFrom(wanted, which, FUSE_SET_ATTR_MTIME, FUSE_SET_ATTR_MTIME_NOW, false)};
+  return utimensat(descriptor, "", times.data(), AT_EMPTY_PATH) == 0 ? 0 : errno;
+}
+
+void FileSystem::readlink(fuse_req_t request, Node& node) {
+  Descriptor descriptor;
+  const int failure = descriptorOf(node, descriptor);
+  if (failure != 0) {
+    (void)fuse_reply_err(request, failure);
+    return;
+  }
+  std::array<char, PATH_MAX + 1> target{};
+  const ssize_t length = readlinkat(descriptor.number, "", target.data(), PATH_MAX);
+  if (length < 0) {
+    (void)fuse_reply_err(request, errno);
+    return;
+  }
+  (void)fuse_reply_readlink(request, target.data());
+}
+
+void FileSystem::statfs(fuse_req_t request, Node& /*node*/) {
+  struct statvfs status{};
+  if (fstatvfs(places_->base(Places::kRoot).folder.get(), &status) != 0) {
+    (void)fuse_reply_err(request, errno);
+    return;
+  }
+  (void)fuse_reply_statfs(request, &status);
+}
+
+void FileSystem::setxattr(fuse_req_t request, Node& node, const char* name, const char* value,
+                          std::size_t size, int flags) {
+  Descriptor descriptor;
+  int failure = isOwn(name) ? EPERM : 0;
+  if (isAccessList(name)) failure = EOPNOTSUPP;
+  if (failure == 0) failure = descriptorOf(node, descriptor);
+  if (failure == 0 &&
+      ::setxattr(pathOfDescriptor(descriptor.number).c_str(), name, value, size, flags) != 0) {
+    failure = errno;
+  }
+  nodes_.noteTold(node, 0);
+  (void)fuse_reply_err(request, failure);
+}
+
+void FileSystem::getxattr(fuse_req_t request, Node& node, const char* name, std::size_t size) {
+  Descriptor descriptor;
+  int failure = isOwn(name) ? ENODATA : 0;
+  if (isAccessList(name)) failure = EOPNOTSUPP;
+  if (failure == 0) failure = descriptorOf(node, descriptor);
+  std::vector<char> value(size);
+  ssize_t length = 0;
+  if (failure == 0) {
+    length = ::getxattr(pathOfDescriptor(descriptor.number).c_str(), name, value.data(), size);
+    if (length < 0) failure = errno;
+  }
+  if (failure != 0) {
+    (void)fuse_reply_err(request, failure);
+  } else if (size == 0) {
+    (void)fuse_reply_xattr(request, static_cast<std::size_t>(length));
+  } else {
+    (void)fuse_reply_buf(request, value.data(), static_cast<std::size_t>(length));
+  }
+}
+
+void FileSystem::listxattr(fuse_req_t request, Node& node, std::size_t size) {
+  Descriptor descriptor;
+  int failure = descriptorOf(node, descriptor);
+  std::vector<char> names(XATTR_LIST_MAX);
+  if (failure == 0) {
+    const ssize_t length =
+        ::listxattr(pathOfDescriptor(descriptor.number).c_str(), names.data(), names.size());
+    if (length < 0) failure = errno;
+    names.resize(static_cast<std::size_t>(std::max<ssize_t>(length, 0)));
+  }
+  if (failure != 0) {
+    (void)fuse_reply_err(request, failure);
+    return;
+  }
+  const std::vector<char> shown = withoutOwn(names);
+  if (size == 0) {
+    (void)fuse_reply_xattr(request, shown.size());
+  } else if (shown.size() > size) {
+    (void)fuse_reply_err(request, ERANGE);
+  } else {
+    (void)fuse_reply_buf(request, shown.data(), shown.size());
+  }
+}
+
+void FileSystem::removexattr(fuse_req_t request, Node& node, const char* name) {
+  Descriptor descriptor;
+  int failure = isOwn(name) ? ENODATA : 0;
+  if (isAccessList(name)) failure = EOPNOTSUPP;
+  if (failure == 0) failure = descriptorOf(node, descriptor);
+  if (failure == 0 && ::removexattr(pathOfDescriptor(descriptor.number).c_str(), name) != 0)
+    failure = errno;
+  nodes_.noteTold(node, 0);
+  (void)fuse_reply_err(request, failure);
+}
+
+}  // namespace yomber

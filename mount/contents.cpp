@@ -1,0 +1,220 @@
+// Reading and writing.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/uio.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <memory>
+#include <thread>
+#include <utility>
+
+#include "mount/file_system.h"
+
+#include "platform/foundation/descriptor_path.h"
+#include "platform/foundation/fault_attributes.h"
+
+namespace yomber {
+namespace {
+
+/// Between two attempts to open content that is here but held by whoever brought it.
+constexpr std::chrono::milliseconds kPause{10};
+
+void answerRead(fuse_req_t request, int descriptor, std::size_t size, off_t offset) {
+  const auto bytes = std::make_unique_for_overwrite<char[]>(size);
+  const ssize_t count = pread(descriptor, bytes.get(), size, offset);
+  if (count < 0) {
+    (void)fuse_reply_err(request, errno);
+  } else {
+    (void)fuse_reply_buf(request, bytes.get(), static_cast<std::size_t>(count));
+  }
+}
+
+/// Root may change such a file without taking the bits away, others may not; for the disk all
+/// changes are root's.
+void takeSetIDAway(fuse_req_t request, int file) {
+  struct stat status{};
+  if (fuse_req_ctx(request)->uid == 0 || fstat(file, &status) != 0) return;
+  const bool isGroups = (status.st_mode & S_IXGRP) != 0;
+  const mode_t taken = status.st_mode & (S_ISUID | (isGroups ? S_ISGID : 0));
+  if (taken != 0) (void)fchmod(file, status.st_mode & ALLPERMS & ~taken);
+}
+
+void answerWrite(fuse_req_t request, OpenFile& file, const char* bytes, std::size_t size,
+                 off_t offset, bool isAppended) {
+  takeSetIDAway(request, file.content());
+  iovec part{.iov_base = const_cast<char*>(bytes), .iov_len = size};
+  // Where the end is, only the disk knows: others may have written there.
+  const ssize_t count = pwritev2(file.content(), &part, 1, offset, isAppended ? RWF_APPEND : 0);
+  if (count < 0) {
+    (void)fuse_reply_err(request, errno);
+    return;
+  }
+  (void)fuse_reply_write(request, static_cast<std::size_t>(count));
+}
+
+}  // namespace
+
+void FileSystem::withContent(fuse_req_t request, const std::shared_ptr<OpenFile>& file,
+                             std::function<void(int failure)> then, int attempts) {
+  const int failure = file->openContent();
+  if (failure != EAGAIN) return then(failure);
+  const auto path = locationOf(file->node());
+  if (!path || attempts == 0) return then(path ? EIO : ENOENT);
+  waits_.wait(request, nodes_.use(file->node()), *path,
+              [this, request, file, then = std::move(then), attempts](int waited) {
+                // Busy: somebody has it open for writing at this moment.
+                if (waited != 0 && (waited != EBUSY || attempts == 0)) return then(waited);
+                if (space_ != nullptr) space_->noteGrowth();
+                if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
+                withContent(request, file, then, attempts - 1);
+              });
+}
+
+void FileSystem::read(fuse_req_t request, Node& /*node*/, std::size_t size, off_t offset,
+                      fuse_file_info* info) {
+  OpenFile& file = fileOf(info);
+  if (file.content() >= 0) return answerRead(request, file.content(), size, offset);
+  // Whoever only wants to know what it is gets that from what is kept.
+  char kept[4096];
+  const ssize_t count = file.readKept(kept, size, offset);
+  if (count >= 0) {
+    (void)fuse_reply_buf(request, kept, static_cast<std::size_t>(count));
+    return;
+  }
+  const auto shared = openFiles_.shared(file);
+  withContent(request, shared, [request, shared, size, offset](int failure) {
+    if (failure == 0) return answerRead(request, shared->content(), size, offset);
+    (void)fuse_reply_err(request, failure);
+  });
+}
+
+void FileSystem::write(fuse_req_t request, Node& node, const char* bytes, std::size_t size,
+                       off_t offset, fuse_file_info* info) {
+  OpenFile& file = fileOf(info);
+  nodes_.noteTold(node, 0);
+  const bool isAppended = (info->flags & O_APPEND) != 0 && info->writepage == 0;
+  if (file.content() >= 0) return answerWrite(request, file, bytes, size, offset, isAppended);
+  const auto shared = openFiles_.shared(file);
+  auto kept = std::make_shared<std::string>(bytes, size);
+  withContent(request, shared, [request, shared, kept, offset, isAppended](int failure) {
+    if (failure == 0) {
+      return answerWrite(request, *shared, kept->data(), kept->size(), offset, isAppended);
+    }
+    (void)fuse_reply_err(request, failure);
+  });
+}
+
+void FileSystem::fsync(fuse_req_t request, Node& node, int isDataOnly, fuse_file_info* info) {
+  // What was written through another descriptor counts as well.
+  auto file = openFiles_.shared(fileOf(info));
+  if (file->content() < 0) {
+    if (auto other = openFiles_.of(node)) file = std::move(other);
+  }
+  FileDescriptor opened;
+  if (file->content() < 0) {
+    const std::string path = pathOfDescriptor(file->any());
+    opened = FileDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  }
+  const int descriptor = opened ? opened.get() : file->content();
+  int result = 0;  // who is filling it, or gives it up, syncs it himself
+  if (descriptor >= 0) result = isDataOnly != 0 ? fdatasync(descriptor) : ::fsync(descriptor);
+  (void)fuse_reply_err(request, result == 0 ? 0 : errno);
+}
+
+void FileSystem::fallocate(fuse_req_t request, Node& node, int mode, off_t offset, off_t length,
+                           fuse_file_info* info) {
+  const auto file = openFiles_.shared(fileOf(info));
+  nodes_.noteTold(node, 0);
+  withContent(request, file, [request, file, mode, offset, length](int failure) {
+    if (failure == 0) takeSetIDAway(request, file->content());
+    if (failure == 0 && ::fallocate(file->content(), mode, offset, length) != 0) failure = errno;
+    (void)fuse_reply_err(request, failure);
+  });
+}
+
+void FileSystem::lseek(fuse_req_t request, Node& /*node*/, off_t offset, int whence,
+                       fuse_file_info* info) {
+  const OpenFile& file = fileOf(info);
+  off_t result = -1;
+  if (file.content() >= 0) {
+    result = ::lseek(file.content(), offset, whence);
+  } else {
+    // What is away is all data.
+    struct stat status{};
+    const bool isInside = fstat(file.any(), &status) == 0 && offset >= 0 && offset < status.st_size;
+    if (isInside) result = whence == SEEK_HOLE ? status.st_size : offset;
+    if (!isInside) errno = ENXIO;
+  }
+  if (result < 0) {
+    (void)fuse_reply_err(request, errno);
+  } else {
+    (void)fuse_reply_lseek(request, result);
+  }
+}
+
+void FileSystem::copyFileRange(fuse_req_t request, Node& /*source*/, off_t sourceOffset,
+                               fuse_file_info* sourceInfo, fuse_ino_t target, off_t targetOffset,
+                               fuse_file_info* targetInfo, std::size_t length, int flags) {
+  const auto from = openFiles_.shared(fileOf(sourceInfo));
+  const auto to = openFiles_.shared(fileOf(targetInfo));
+  nodes_.noteTold(nodeOf(target), 0);
+  const auto copy = [request, from, to, sourceOffset, targetOffset, length, flags](int failure) {
+    loff_t read = sourceOffset;
+    loff_t written = targetOffset;
+    ssize_t count = -1;
+    if (failure == 0) {
+      takeSetIDAway(request, to->content());
+      count = copy_file_range(from->content(), &read, to->content(), &written, length,
+                              static_cast<unsigned>(flags));
+      if (count < 0) failure = errno;
+    }
+    if (failure != 0) {
+      (void)fuse_reply_err(request, failure);
+    } else {
+      (void)fuse_reply_write(request, static_cast<std::size_t>(count));
+    }
+  };
+  withContent(request, from, [this, request, to, copy](int failure) {
+    if (failure != 0) return copy(failure);
+    withContent(request, to, copy);
+  });
+}
+
+void FileSystem::truncate(fuse_req_t request, Node& node, off_t size, fuse_file_info* info,
+                          std::function<void(int failure)> then, int attempts) {
+  const int held = info != nullptr ? fileOf(info).content() : -1;
+  if (held >= 0) {
+    takeSetIDAway(request, held);
+    return then(ftruncate(held, size) == 0 ? 0 : errno);
+  }
+  Descriptor place;
+  int failure = descriptorOf(node, place);
+  if (failure != 0) return then(failure);
+  const std::string path = pathOfDescriptor(place.number);
+  FileDescriptor opened(::open(path.c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  if (!opened && errno != EWOULDBLOCK) return then(errno);
+  const bool isHere = opened && !isFault(opened.get());
+  if (isHere || (opened && size == 0)) {
+    // Nothing of what is away is wanted any more when nothing stays.
+    takeSetIDAway(request, opened.get());
+    failure = isHere ? settleForWriting(opened.get()) : 0;
+    if (failure == 0 && ftruncate(opened.get(), size) != 0) failure = errno;
+    if (failure == 0 && !isHere) takeMarksOff(opened.get());
+    return then(failure);
+  }
+  // A part of it stays: that has to be here.
+  const auto wanted = locationOf(node);
+  if (!wanted || attempts == 0) return then(wanted ? EIO : ENOENT);
+  opened = FileDescriptor();
+  auto use = std::make_shared<NodeUse>(nodes_.use(node));
+  waits_.wait(request, nodes_.use(node), *wanted,
+              [this, request, use, size, then = std::move(then), attempts](int waited) {
+                if (waited != 0) return then(waited);
+                if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
+                truncate(request, *use->get(), size, nullptr, then, attempts - 1);
+              });
+}
+
+}  // namespace yomber

@@ -1,0 +1,113 @@
+#include "mount/kernel_updates.h"
+
+#include <utility>
+
+namespace yomber {
+
+void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOnDisk) {
+  files_.noteChangedEntry(folder, nameOnDisk);
+  NodeTable& nodes = files_.nodes();
+  const NodeUse above = nodes.byInode(folder);
+  if (!above) return;
+  files_.gate().change(folder);
+  int failure = 0;
+  const SharedDescriptor descriptor = files_.folders().open(*above.get(), failure);
+  if (!descriptor) return entryMayHaveChanged(*above.get(), nameOnDisk);
+  struct statx status{};
+  const bool isThere = lookAt(descriptor->get(), nameOnDisk.c_str(), status) == 0;
+  const std::string shown = files_.places().shownName(folder, nameOnDisk);
+  const NodeUse known = nodes.inPlace(*above.get(), nameOnDisk);
+  if (known && isThere && known->identity == FileIdentity::of(status)) {
+    nodeChanged(*known.get(), nanoseconds(status.stx_ctime));
+  } else if (known) {
+    nodes.removed(*above.get(), nameOnDisk);
+    session_.entryIsOther(*above.get(), shown);
+  } else {
+    // That there was nothing, or another name of a file that has several.
+    session_.entryMayBeOther(*above.get(), shown);
+    const NodeUse same = isThere ? nodes.byInode(status.stx_ino) : NodeUse();
+    if (same && same->identity == FileIdentity::of(status)) {
+      nodeChanged(*same.get(), nanoseconds(status.stx_ctime));
+    }
+  }
+}
+
+/// The folder is not where it was, so the entry cannot be looked at.
+void KernelUpdates::entryMayHaveChanged(Node& folder, const std::string& nameOnDisk) {
+  session_.entryMayBeOther(folder, files_.places().shownName(folder.identity.inode, nameOnDisk));
+  if (const NodeUse node = files_.nodes().inPlace(folder, nameOnDisk)) {
+    session_.attributesAreOther(*node.get());
+  }
+}
+
+void KernelUpdates::folderChanged(std::uint64_t folder) {
+  if (files_.thumbnails() != nullptr) files_.thumbnails()->forget(folder);
+  NodeTable& nodes = files_.nodes();
+  const NodeUse above = nodes.byInode(folder);
+  if (!above) return;
+  files_.gate().change(folder);
+  for (const NodeUse& node : nodes.all()) {
+    const auto place = nodes.placeOf(*node.get());
+    if (place && place->folder.get() == above.get()) entryChanged(folder, place->name);
+  }
+  nodes.noteTold(*above.get(), 0);
+  session_.contentIsOther(*above.get());
+}
+
+void KernelUpdates::attributesChanged(std::uint64_t folder) {
+  const NodeUse node = files_.nodes().byInode(folder);
+  if (!node) return;
+  int failure = 0;
+  const SharedDescriptor descriptor = files_.folders().open(*node.get(), failure);
+  struct statx status{};
+  if (!descriptor || lookAt(descriptor->get(), "", status) != 0) return;
+  nodeChanged(*node.get(), nanoseconds(status.stx_ctime));
+}
+
+void KernelUpdates::nodeChanged(Node& node, std::int64_t change) {
+  const std::int64_t told = files_.nodes().told(node);
+  if (told == change) return;
+  files_.nodes().noteTold(node, 0);
+  session_.attributesAreOther(node);
+}
+
+void KernelUpdates::anythingChanged() {
+  files_.gate().changeAll();
+  NodeTable& nodes = files_.nodes();
+  for (const NodeUse& node : nodes.all()) {
+    nodes.noteTold(*node.get(), 0);
+    session_.contentIsOther(*node.get());
+    const auto place = nodes.placeOf(*node.get());
+    if (!place) continue;
+    const std::uint64_t folder = place->folder->identity.inode;
+    session_.entryMayBeOther(*place->folder.get(), files_.places().shownName(folder, place->name));
+  }
+}
+
+void KernelUpdates::showName(std::uint64_t folder, const std::string& nameOnDisk,
+                             const std::string& name) {
+  const std::string before = files_.places().shownName(folder, nameOnDisk);
+  files_.places().showName(folder, nameOnDisk, name);
+  const std::string after = files_.places().shownName(folder, nameOnDisk);
+  const NodeUse above = files_.nodes().byInode(folder);
+  if (!above || before == after) return;
+  files_.gate().change(folder);
+  session_.entryIsOther(*above.get(), before);
+  session_.entryIsOther(*above.get(), after);
+  session_.contentIsOther(*above.get());
+}
+
+void KernelUpdates::showContainer(const std::string& location, const std::string& name) {
+  const auto before = files_.places().shownBases();
+  files_.places().showContainer(location, name);
+  Node& root = files_.root();
+  files_.gate().change(root.identity.inode);
+  for (const auto& shown : before) {
+    const auto now = files_.places().shownBase(shown.name);
+    if (now != shown.base) session_.entryIsOther(root, shown.name);
+  }
+  if (!name.empty()) session_.entryMayBeOther(root, name);
+  session_.contentIsOther(root);
+}
+
+}  // namespace yomber

@@ -1,0 +1,40 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+#include "mount/file_system.h"
+
+namespace yomber {
+
+/// Tells the kernel what it keeps that no longer holds, and nothing else: what came through the
+/// mount itself it knows already.
+///
+/// For one thread at a time, and none that answers requests.
+class KernelUpdates {
+ public:
+  KernelUpdates(FileSystem& files, KernelSession& session) : files_(files), session_(session) {}
+
+  /// The entry of the folder with that inode has appeared, changed or gone.
+  void entryChanged(std::uint64_t folder, const std::string& nameOnDisk);
+  /// Any entry of the folder may have.
+  void folderChanged(std::uint64_t folder);
+  /// The folder's own attributes have.
+  void attributesChanged(std::uint64_t folder);
+  /// Anything may have.
+  void anythingChanged();
+
+  /// As the functions of Places of these names.
+  void showName(std::uint64_t folder, const std::string& nameOnDisk, const std::string& name);
+  void showContainer(const std::string& location, const std::string& name);
+  void forgetShown() { files_.places().forgetShown(); }
+
+ private:
+  void entryMayHaveChanged(Node& folder, const std::string& nameOnDisk);
+  void nodeChanged(Node& node, std::int64_t change);
+
+  FileSystem& files_;
+  KernelSession& session_;
+};
+
+}  // namespace yomber

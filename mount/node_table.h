@@ -1,0 +1,196 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <shared_mutex>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+#include "mount/file_identity.h"
+#include "platform/foundation/file_descriptor.h"
+#include "platform/foundation/lock.h"
+
+namespace yomber {
+
+class NodeFiles;
+
+using SharedDescriptor = std::shared_ptr<const FileDescriptor>;
+
+/// A file or folder that the kernel knows. Its fields belong to the NodeTable, except where they
+/// say otherwise.
+class Node {
+ public:
+  Node(FileIdentity itsIdentity, std::uint32_t itsType);
+  Node(const Node&) = delete;
+  Node& operator=(const Node&) = delete;
+  ~Node();
+
+  [[nodiscard]] bool isFolder() const { return (type & S_IFMT) == S_IFDIR; }
+
+  const FileIdentity identity;
+  const std::uint32_t type;  ///< S_IFMT bits
+  /// Of a folder that is shown in the root although it lies elsewhere, and of the root: the number
+  /// of its place among `Places`.
+  std::optional<std::uint32_t> base;
+  /// A folder in which nobody sees changes.
+  std::atomic<bool> isUnwatched = false;
+  /// The content may be away: it had holes when it was last looked at.
+  std::atomic<bool> mayBeAway = false;
+
+ private:
+  friend class NodeTable;
+  friend class OpenFiles;
+  Node* parent_ = nullptr;  ///< null: a base, or removed
+  std::string name_;        ///< on this disk
+  std::uint64_t lookups_ = 0;
+  std::uint32_t uses_ = 0;  ///< children, open files and whoever holds a NodeUse
+  std::int64_t toldChange_ = 0;
+  SharedDescriptor remains_;
+  std::unique_ptr<NodeFiles> files_;  ///< OpenFiles' own
+};
+
+class NodeTable;
+
+/// Keeps a node although the kernel may forget it. Thread-safety: that of the table.
+class NodeUse {
+ public:
+  NodeUse() = default;
+  NodeUse(NodeUse&& other) noexcept;
+  NodeUse& operator=(NodeUse&& other) noexcept;
+  ~NodeUse();
+  [[nodiscard]] Node* get() const { return node_; }
+  [[nodiscard]] Node* operator->() const { return node_; }
+  explicit operator bool() const { return node_ != nullptr; }
+
+ private:
+  friend class NodeTable;
+  /// Takes over a use that was counted.
+  NodeUse(NodeTable& table, Node& node) : table_(&table), node_(&node) {}
+
+  NodeTable* table_ = nullptr;
+  Node* node_ = nullptr;
+};
+
+/// What the kernel knows, and where it is: one node for each file, by its place (the folder and the
+/// name on this disk under which it was last seen). No node has a descriptor.
+///
+/// A node lives while the kernel has not forgotten it, while it has children or open files, and
+/// while a NodeUse keeps it. Thread-safety: every operation may be called on any thread. Operations
+/// on a node need it to be alive: one that the kernel has named in a request that is not answered,
+/// or one that is in use.
+class NodeTable {
+ public:
+  NodeTable();
+  ~NodeTable();
+  NodeTable(const NodeTable&) = delete;
+  NodeTable& operator=(const NodeTable&) = delete;
+
+  /// The node of a base (the root, a container's folder, the trash), made when it is new.
+  /// It never goes.
+  Node& addBase(std::uint32_t base, FileIdentity identity);
+
+  /// The kernel is told of the file that was found in that place: one lookup more. `toldChange` is
+  /// its ctime, ns.
+  Node& found(Node& folder, std::string_view name, const struct statx& status);
+  /// The kernel gives lookups back.
+  void forget(Node& node, std::uint64_t lookups);
+
+  /// The kernel was told of attributes with that ctime; 0: it has dropped what it was told.
+  void noteTold(Node& node, std::int64_t change);
+  [[nodiscard]] std::int64_t told(const Node& node) const;
+
+  /// The file in the place has another place now. With `isExchange` the two have changed places;
+  /// else what was in the other place was removed.
+  void moved(Node& folder, std::string_view name, Node& newFolder, std::string_view newName,
+             bool isExchange, SharedDescriptor remains = nullptr);
+  /// The file is nowhere any more. The kernel may have it for a while still: `remains`, a
+  /// descriptor of the file (O_PATH), if given, is kept for as long, and its inode number with it.
+  void removed(Node& folder, std::string_view name, SharedDescriptor remains = nullptr);
+  /// What is left of a node that was removed; nil when that is nothing.
+  [[nodiscard]] SharedDescriptor remains(const Node& node) const;
+
+  /// To be held from before an entry is moved or removed on the disk until that is told here.
+  class Moving {
+   public:
+    explicit Moving(NodeTable& table) : lock_(table.moving_) {}
+
+   private:
+    std::shared_lock<std::shared_mutex> lock_;
+  };
+  /// Returns when whatever is being moved now has been told here. Not while moving.
+  void waitForMoves() { const std::unique_lock<std::shared_mutex> wait(moving_); }
+
+  [[nodiscard]] NodeUse use(Node& node);
+  [[nodiscard]] NodeUse byInode(std::uint64_t inode);
+  [[nodiscard]] NodeUse inPlace(Node& folder, std::string_view name);
+  /// Every node that has a place, or is a base.
+  [[nodiscard]] std::vector<NodeUse> all();
+
+  /// The way to a node: the base that it is below, and the names from there on, each with the inode
+  /// of its folder. Nothing when the node was removed.
+  struct Step {
+    std::uint64_t folder = 0;
+    std::string name;
+  };
+  struct Way {
+    std::uint32_t base = 0;
+    std::vector<Step> steps;
+  };
+  [[nodiscard]] std::optional<Way> wayTo(const Node& node) const;
+  /// Where a node is: nothing for bases and for what was removed.
+  struct Place {
+    NodeUse folder;
+    std::string name;
+  };
+  [[nodiscard]] std::optional<Place> placeOf(const Node& node);
+  [[nodiscard]] std::size_t size() const;
+
+ private:
+  friend class NodeUse;
+  NodeUse startUse(Node& node) REQUIRES(mutex_);
+  struct PlaceKey {
+    const Node* folder;
+    std::string_view name;
+  };
+  struct HashPlace {
+    using is_transparent = void;
+    std::size_t operator()(const Node* node) const {
+      return (*this)(PlaceKey{node->parent_, node->name_});
+    }
+    std::size_t operator()(const PlaceKey& key) const {
+      return std::hash<std::string_view>()(key.name) * 31 + std::hash<const void*>()(key.folder);
+    }
+  };
+  struct SamePlace {
+    using is_transparent = void;
+    bool operator()(const Node* a, const Node* b) const { return a == b; }
+    bool operator()(const PlaceKey& key, const Node* node) const {
+      return node->parent_ == key.folder && node->name_ == key.name;
+    }
+    bool operator()(const Node* node, const PlaceKey& key) const { return (*this)(key, node); }
+  };
+
+  Node* at(const Node& folder, std::string_view name) const REQUIRES(mutex_);
+  void place(Node& node, Node& folder, std::string_view name) REQUIRES(mutex_);
+  void unplace(Node& node) REQUIRES(mutex_);
+  void remove(Node& node, SharedDescriptor remains) REQUIRES(mutex_);
+  void breakCycle(const Node& node, Node& folder) REQUIRES(mutex_);
+  void endUse(Node& node) REQUIRES(mutex_);
+  void dropIfUnused(Node& node) REQUIRES(mutex_);
+  void stopUse(Node& node);
+
+  std::shared_mutex moving_;
+  mutable Mutex mutex_;
+  std::unordered_map<std::uint64_t, Node*> byInode_ GUARDED_BY(mutex_);
+  std::unordered_set<Node*, HashPlace, SamePlace> byPlace_ GUARDED_BY(mutex_);
+  std::unordered_set<Node*> unplaced_ GUARDED_BY(mutex_);  ///< bases, and what was removed
+  /// Of nodes that are gone. Closing them may free what they took on the disk: not under the lock.
+  std::vector<SharedDescriptor> ended_ GUARDED_BY(mutex_);
+};
+
+}  // namespace yomber

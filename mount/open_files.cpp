@@ -1,0 +1,175 @@
+#include "mount/open_files.h"
+
+#include <fcntl.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <string>
+#include <utility>
+
+#include "platform/foundation/descriptor_path.h"
+#include "platform/foundation/fault_attributes.h"
+
+namespace yomber {
+namespace {
+
+/// What is left to us to open again with.
+constexpr int kKeptFlags = O_ACCMODE | O_SYNC | O_DSYNC;
+/// Never waits for a lease: who holds one is filling the file, or giving its content up.
+constexpr int kOwnFlags = O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+
+bool isLeased(int failure) { return failure == EWOULDBLOCK; }
+
+}  // namespace
+
+int settleForWriting(int descriptor) {
+  if (fgetxattr(descriptor, kFaultAttribute, nullptr, 0) < 0) return 0;
+  if (fdatasync(descriptor) != 0) return errno;
+  takeMarksOff(descriptor);
+  return 0;
+}
+
+void takeMarksOff(int descriptor) {
+  // The fault first: the others mean nothing without it.
+  for (const char* mark : {kFaultAttribute, kFilledAttribute, kHeldDateAttribute}) {
+    (void)fremovexattr(descriptor, mark);
+  }
+}
+
+OpenFile::OpenFile(NodeUse node, int flags, FileDescriptor content, FileDescriptor place)
+    : node_(std::move(node)),
+      flags_(flags & kKeptFlags),
+      content_(content.release()),
+      place_(std::move(place)) {}
+
+OpenFile::~OpenFile() {
+  if (content() >= 0) close(content());
+}
+
+bool OpenFile::isWritable() const { return (flags_ & O_ACCMODE) != O_RDONLY; }
+
+int OpenFile::openContent() {
+  LockGuard guard(mutex_);
+  if (content() >= 0) return 0;
+  const int flags = O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+  FileDescriptor opened(::open(pathOfDescriptor(place_.get()).c_str(), flags_ | flags));
+  if (!opened) return errno;  // EAGAIN: leased
+  if (isFault(opened.get())) return EAGAIN;
+  if (const int failure = isWritable() ? settleForWriting(opened.get()) : 0; failure != 0)
+    return failure;
+  content_.store(opened.release(), std::memory_order_release);
+  return 0;
+}
+
+ssize_t OpenFile::readKept(void* bytes, std::size_t size, off_t offset) const {
+  struct stat status{};
+  if (fstat(place_.get(), &status) != 0) return -1;
+  if (offset >= status.st_size) return 0;
+  const auto start = static_cast<std::uint64_t>(offset);
+  const auto whole = static_cast<std::uint64_t>(status.st_size);
+  const std::uint64_t kept = std::min(whole, kKeptBytes);
+  if (std::min(start + size, whole) > kept) {
+    errno = EAGAIN;
+    return -1;
+  }
+  const FileDescriptor opened(
+      ::open(pathOfDescriptor(place_.get()).c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  if (!opened) return -1;
+  return pread(opened.get(), bytes, std::min<std::uint64_t>(size, kept - start), offset);
+}
+
+namespace {
+
+int openEither(int folder, const char* name, int flags, int ownFlags, FileDescriptor& content,
+               FileDescriptor& place) {
+  const bool isForWriting = (flags & O_ACCMODE) != O_RDONLY;
+  content = FileDescriptor(openat(folder, name, (flags & kKeptFlags) | ownFlags));
+  if (content && !isFault(content.get())) return isForWriting ? settleForWriting(content.get()) : 0;
+  if (!content && !isLeased(errno)) return errno;
+  content = FileDescriptor();
+  place = FileDescriptor(openat(folder, name, O_PATH | (ownFlags & O_NOFOLLOW) | O_CLOEXEC));
+  return place ? 0 : errno;
+}
+
+}  // namespace
+
+int openInPlace(int folder, const char* name, int flags, bool mayBeAway, FileDescriptor& content,
+                FileDescriptor& place) {
+  // Whoever is filling it is to be alone with it.
+  if (mayBeAway && isFaultAtPath(pathOfDescriptor(folder) + "/" + name)) {
+    place = FileDescriptor(openat(folder, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    return place ? 0 : errno;
+  }
+  return openEither(folder, name, flags, kOwnFlags, content, place);
+}
+
+int openAgain(int descriptor, int flags, FileDescriptor& content, FileDescriptor& place) {
+  return openEither(AT_FDCWD, pathOfDescriptor(descriptor).c_str(), flags, kOwnFlags & ~O_NOFOLLOW,
+                    content, place);
+}
+
+std::shared_ptr<OpenFile> OpenFiles::add(NodeTable& nodes, Node& node, int flags,
+                                         FileDescriptor content, FileDescriptor place,
+                                         OpenFile::Way wanted) {
+  auto file =
+      std::make_shared<OpenFile>(nodes.use(node), flags, std::move(content), std::move(place));
+  LockGuard guard(mutex_);
+  if (!node.files_) node.files_ = std::make_unique<NodeFiles>();
+  auto& files = node.files_->files;
+  const bool isDirect = std::any_of(files.begin(), files.end(), [](const auto& other) {
+    return other->way == OpenFile::Way::Direct;
+  });
+  const bool isBacked = node.files_->backing != 0;
+  file->way = isDirect && !isBacked ? OpenFile::Way::Direct : wanted;
+  if (isBacked) file->way = OpenFile::Way::PassThrough;
+  if (file->content() < 0) file->way = OpenFile::Way::Direct;
+  if (file->way == OpenFile::Way::PassThrough && !isBacked) {
+    node.files_->backing = backing_.open(file->content());
+    if (node.files_->backing == 0) file->way = OpenFile::Way::Direct;
+  }
+  files.push_back(file);
+  return file;
+}
+
+void OpenFiles::remove(OpenFile& file) {
+  std::shared_ptr<OpenFile> removed;  // ends after the lock: it lets go of its node
+  LockGuard guard(mutex_);
+  auto& files = file.node().files_->files;
+  const auto found = std::find_if(files.begin(), files.end(),
+                                  [&](const auto& other) { return other.get() == &file; });
+  if (found == files.end()) return;
+  removed = std::move(*found);
+  files.erase(found);
+  NodeFiles& all = *file.node().files_;
+  const bool isBacked = std::any_of(files.begin(), files.end(), [](const auto& other) {
+    return other->way == OpenFile::Way::PassThrough;
+  });
+  if (!isBacked && all.backing != 0) backing_.close(std::exchange(all.backing, 0));
+  if (files.empty()) file.node().files_.reset();
+}
+
+int OpenFiles::backingOf(const Node& node) const {
+  LockGuard guard(mutex_);
+  return node.files_ ? node.files_->backing : 0;
+}
+
+std::shared_ptr<OpenFile> OpenFiles::of(const Node& node) const {
+  LockGuard guard(mutex_);
+  if (!node.files_) return nullptr;
+  const auto& files = node.files_->files;
+  const auto found = std::find_if(files.begin(), files.end(),
+                                  [](const auto& file) { return file->content() >= 0; });
+  return found != files.end() ? *found : files.front();
+}
+
+std::shared_ptr<OpenFile> OpenFiles::shared(const OpenFile& file) const {
+  LockGuard guard(mutex_);
+  for (const auto& other : file.node().files_->files) {
+    if (other.get() == &file) return other;
+  }
+  return nullptr;
+}
+
+}  // namespace yomber

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -13,10 +14,17 @@
 #include "platform/foundation/lock.h"
 #include "platform/foundation/operation.h"
 #include "platform/foundation/serial_queue.h"
+#include "platform/ostrell/container.h"
+#include "platform/ostrell/file_object_id.h"
 #include "platform/ostrell/file_providing_operation.h"
 #include "platform/ostrell/query_item.h"
+#include "platform/rozzel/identifiers.h"
+#include "platform/rozzel/record.h"
 
 namespace yomber {
+
+class RZContainer;
+class RZFetchRecordsOperation;
 
 /// Whether a bookmark's location is replaced by its target's.
 enum class ResolveAliases : bool { No = false, Yes = true };
@@ -31,8 +39,8 @@ enum class AttachPhysical : bool { No = false, Yes = true };
 /// Thread-safety: every operation may be called on any thread, concurrently. The lookups block
 /// their thread for the daemon's replies. Errors: each `error` may be null and is written only on
 /// failure. Completion handlers may be empty, unless it is said otherwise, and are called once.
-class QSFileProviderExtension final : public NSFileProviderExtension,
-                                      public std::enable_shared_from_this<QSFileProviderExtension> {
+class QSFileProviderExtension : public NSFileProviderExtension,
+                                public std::enable_shared_from_this<QSFileProviderExtension> {
  public:
   /// Never nil. From now on an account change signals the root's enumerator.
   static std::shared_ptr<QSFileProviderExtension> init();
@@ -97,6 +105,53 @@ class QSFileProviderExtension final : public NSFileProviderExtension,
                        const NSFileProviderItemIdentifier& forItemIdentifier,
                        ItemHandler completionHandler) override;
 
+  // Thumbnails: file_thumbnails.cpp, thumbnail_fetches.cpp and container_thumbnails.cpp. Images are
+  // those that the record store has; none is drawn here.
+
+  /// Blocks its thread for the daemon's replies. The progress counts nothing; cancelling it cancels
+  /// every fetch of the request. The last failure of a fetch is the completion's.
+  NSProgressRef fetchThumbnailsForItemIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+      TypedThumbnailHandler perThumbnailCompletionHandlerWithType,
+      ErrorHandler completionHandler) override;
+  /// Sends itself again, with the handler wrapped: only a subclass ends that.
+  NSProgressRef fetchThumbnailsForItemIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+      ThumbnailHandler perThumbnailCompletionHandler, ErrorHandler completionHandler) override;
+
+  /// Hands over the ids in batches of what a fetch takes at most; none are left.
+  void batchRecordIDsToFetchThumbnails(
+      std::vector<RZRecordID>& recordIDs,
+      const std::function<void(const std::vector<RZRecordID>& batch)>& perBatchExecutionBlock);
+
+  using ThumbnailOperations =
+      std::shared_ptr<std::vector<std::shared_ptr<RZFetchRecordsOperation>>>;
+  using ThumbnailZones = std::shared_ptr<std::vector<RZRecordZoneID>>;
+  /// Runs the operations one after the other, each in the database that has its zone; they are
+  /// taken from the arrays. The completion gets the last error.
+  void launchNewFetchThumbnailOperationFrom(const ThumbnailOperations& operations,
+                                            const ThumbnailZones& withZoneIDs,
+                                            const std::shared_ptr<RZContainer>& inContainer,
+                                            const NSErrorRef& previousError,
+                                            const ErrorHandler& completionHandler);
+
+  /// The largest square in both the size and what containers' icons are shown at.
+  [[nodiscard]] CGSize _properSizeForContainerThumbnail(CGSize size);
+  /// Answers with the container's own icon, on the calling thread.
+  void _fetchThumbnailForContainerID(
+      const std::string& containerID,
+      const NSFileProviderItemIdentifier& representedByItemWithIdentifer, CGSize size,
+      const std::map<std::string, QSContainerRef>& knownContainers,
+      const TypedThumbnailHandler& perThumbnailCompletionHandler);
+
+  // Services: service_selection.cpp.
+
+  /// Collaboration and sharing of a document that is no bookmark, sharing of a folder that the
+  /// daemon says can be shared, and nothing else. Never fails; the error is never written. Blocks
+  /// its thread for the daemon's replies.
+  std::vector<NSFileProviderServiceSourceRef> supportedServiceSourcesForItemIdentifier(
+      const NSFileProviderItemIdentifier& identifier, NSErrorRef* error = nullptr) override;
+
   // An application's folder: default_application_container.cpp.
 
   /// Without a bundle, and for the drive's own files browser, the Documents folder of the root.
@@ -114,11 +169,13 @@ class QSFileProviderExtension final : public NSFileProviderExtension,
   /// The item's location, or nil: bookmarks resolved, no physical mark.
   NSURLRef URLForItemWithPersistentIdentifier(
       const NSFileProviderItemIdentifier& identifier) override;
+  // NOLINTBEGIN(clang-diagnostic-reserved-identifier): given, and a member's
   NSURLRef _URLForItemWithPersistentIdentifier(const NSFileProviderItemIdentifier& identifier,
                                                ResolveAliases resolvingQSAliases);
   NSURLRef _URLForItemWithPersistentIdentifier(const NSFileProviderItemIdentifier& identifier,
                                                ResolveAliases resolvingQSAliases,
                                                AttachPhysical attachPhysical);
+  // NOLINTEND(clang-diagnostic-reserved-identifier)
   std::optional<NSFileProviderItemIdentifier> persistentIdentifierForItemAtURL(
       const NSURLRef& url) override;
   /// Nobody being signed in is NSFileProviderErrorNotAuthenticated.
@@ -144,8 +201,23 @@ class QSFileProviderExtension final : public NSFileProviderExtension,
   /// Signals the root's enumerator, and nothing else.
   void _accountDidChange();
 
- private:
+ protected:
+  /// For a subclass, which observes no account.
   QSFileProviderExtension();
+
+ private:
+  struct ThumbnailRequest;
+  /// The documents among the identifiers; the others are answered at once.
+  std::vector<QSFileObjectIDRef> _answerOtherThumbnails(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+      const TypedThumbnailHandler& handler);
+  /// The fetches of the request, one for each batch.
+  void _addThumbnailFetches(const std::shared_ptr<ThumbnailRequest>& request,
+                            const ThumbnailOperations& operations, const ThumbnailZones& zoneIDs);
+  void _didFetchThumbnailRecord(const ThumbnailRequest& request, const RZRecordRef& record,
+                                const RZRecordID& recordID, const NSErrorRef& error);
+  /// Downloads the file when this machine could draw it.
+  void _downloadForThumbnail(const std::optional<NSFileProviderItemIdentifier>& identifier);
 
   void _provideItemAtURL(const NSURLRef& url, NSFileCoordinatorReadingOptions readingOptions,
                          std::uint64_t section, ErrorHandler completionHandler);

@@ -1,6 +1,8 @@
 #include "fileproviderd/control_server.h"
 
 #include <climits>
+#include <cmath>
+#include <string>
 #include <utility>
 
 #include "fileproviderd/change_forwarder.h"
@@ -8,6 +10,7 @@
 #include "fileproviderd/listing.h"
 #include "fileproviderd/outcome.h"
 #include "fileproviderd/remote_watcher.h"
+#include "fileproviderd/thumbnail_fetch.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/foundation/process_usage.h"
 #include "platform/foundation/url.h"
@@ -20,6 +23,7 @@ using protocol::Control;
 
 /// No identifier is longer.
 constexpr std::size_t kMaximumIdentifierLength = 1'024;
+constexpr std::size_t kMaximumThumbnails = 100'000;
 
 /// Keeps a watch for as long as its client holds it.
 class WatchServer final : public protocol::Watch::Server {
@@ -50,6 +54,31 @@ NSErrorRef noLocationError() {
   return invalidRequestError("a location has to be an absolute path");
 }
 
+/// Why it cannot be carried out, or nil.
+NSErrorRef thumbnailRequestOf(Control::FetchThumbnailsParams::Reader params,
+                              ThumbnailFetch::Request& request) {
+  request.width = params.getWidth();
+  request.height = params.getHeight();
+  const auto isSide = [](double side) { return std::isfinite(side) && side >= 1; };
+  if (!isSide(request.width) || !isSide(request.height)) {
+    return invalidRequestError("a thumbnail is at least one point wide and high");
+  }
+  if (!params.hasReceiver()) return invalidRequestError("somebody has to receive the thumbnails");
+  const auto identifiers = params.getIdentifiers();
+  if (identifiers.size() > kMaximumThumbnails) {
+    return invalidRequestError("at most " + std::to_string(kMaximumThumbnails) +
+                               " thumbnails can be asked for at a time");
+  }
+  request.identifiers.reserve(identifiers.size());
+  for (const auto each : identifiers) {
+    if (each.size() > kMaximumIdentifierLength) {
+      return invalidRequestError("the identifier is too long");
+    }
+    request.identifiers.push_back(stringFromWire(each));
+  }
+  return nullptr;
+}
+
 /// The promise of the error that `start` hands to its handler.
 template <typename Start>
 kj::Promise<NSErrorRef> failureOf(Start start) {
@@ -61,7 +90,8 @@ kj::Promise<NSErrorRef> failureOf(Start start) {
 
 class ControlServer final : public Control::Server {
  public:
-  explicit ControlServer(std::shared_ptr<Host> host) : host_(std::move(host)) {}
+  ControlServer(std::shared_ptr<Host> host, std::uint32_t client)
+      : host_(std::move(host)), client_(client) {}
 
  protected:
   kj::Promise<void> item(ItemContext context) override {
@@ -209,7 +239,68 @@ class ControlServer final : public Control::Server {
         });
   }
 
+  kj::Promise<void> fetchThumbnails(FetchThumbnailsContext context) override {
+    context.allowCancellation();
+    const auto params = context.getParams();
+    ThumbnailFetch::Request request;
+    if (const NSErrorRef error = thumbnailRequestOf(params, request)) return fail(context, error);
+    ipc::Remote<protocol::ThumbnailReceiver> receiver(params.getReceiver());
+    context.releaseParams();
+    auto fetch = host_->thumbnailFetch(std::move(request), std::move(receiver));
+    if (fetch == nullptr) {
+      return fail(context, invalidRequestError("too many thumbnails are asked for at a time"));
+    }
+    return failureOf([&](ThumbnailFetch::Handler handler) { fetch->start(std::move(handler)); })
+        .then([context, fetch](const NSErrorRef& error) mutable {
+          ipc::encodeOptional(error, context.getResults().initFailure());
+        });
+  }
+
+  kj::Promise<void> services(ServicesContext context) override {
+    context.allowCancellation();
+    const auto given = context.getParams().getIdentifier();
+    if (given.size() > kMaximumIdentifierLength) return fail(context, tooLongError());
+    return vended(stringFromWire(given), std::nullopt).then([context](Vended outcome) mutable {
+      auto results = context.getResults();
+      ipc::encodeOptional(outcome.error, results.initFailure());
+      if (!outcome.value) return;
+      auto services = results.initServices(static_cast<unsigned>(outcome.value->size()));
+      for (unsigned i = 0; i < services.size(); ++i) {
+        services[i].setName(wireText((*outcome.value)[i].name));
+        services[i].setEndpoint((*outcome.value)[i].endpoint.client());
+      }
+    });
+  }
+
+  kj::Promise<void> service(ServiceContext context) override {
+    context.allowCancellation();
+    const auto params = context.getParams();
+    if (params.getIdentifier().size() > kMaximumIdentifierLength ||
+        params.getName().size() > kMaximumIdentifierLength) {
+      return fail(context, tooLongError());
+    }
+    return vended(stringFromWire(params.getIdentifier()), stringFromWire(params.getName()))
+        .then([context](Vended outcome) mutable {
+          auto results = context.getResults();
+          ipc::encodeOptional(outcome.error, results.initFailure());
+          if (!outcome.value || outcome.value->empty()) return;
+          results.setEndpoint(outcome.value->front().endpoint.client());
+        });
+  }
+
  private:
+  using Vended = Outcome<std::vector<VendedService>>;
+
+  kj::Promise<Vended> vended(const std::string& identifier,
+                             const std::optional<std::string>& name) {
+    return outcomeOf<std::vector<VendedService>>(
+        [&](auto handler) { host_->services({identifier, name, client_}, std::move(handler)); });
+  }
+
+  static NSErrorRef tooLongError() {
+    return invalidRequestError("the identifier or the service's name is too long");
+  }
+
   template <typename Context>
   static kj::Promise<void> fail(Context& context, const NSErrorRef& error) {
     ipc::encodeOptional(error, context.getResults().initFailure());
@@ -224,12 +315,13 @@ class ControlServer final : public Control::Server {
   }
 
   const std::shared_ptr<Host> host_;
+  const std::uint32_t client_;
 };
 
 }  // namespace
 
-Control::Client makeControlServer(std::shared_ptr<Host> host) {
-  return kj::heap<ControlServer>(std::move(host));
+Control::Client makeControlServer(std::shared_ptr<Host> host, std::uint32_t client) {
+  return kj::heap<ControlServer>(std::move(host), client);
 }
 
 }  // namespace yomber

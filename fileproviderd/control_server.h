@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <memory>
 
 #include "fileproviderd/host.h"
@@ -7,7 +8,8 @@
 
 namespace yomber {
 
-/// What a client of the control socket gets. Loop thread only.
-[[nodiscard]] protocol::Control::Client makeControlServer(std::shared_ptr<Host> host);
+/// What a client of the control socket gets; `client`: its process. Loop thread only.
+[[nodiscard]] protocol::Control::Client makeControlServer(std::shared_ptr<Host> host,
+                                                          std::uint32_t client = 0);
 
 }  // namespace yomber

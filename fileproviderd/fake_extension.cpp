@@ -8,7 +8,15 @@
 //   die-on-page exists: the process ends when a page is asked for
 //   commands    a pipe that takes "signal CONTAINER" lines
 //   slow        exists: content is not provided until it is stopped, or "slow" goes
-//   die-on-content, die-on-rename  exists: the process ends in the middle of that
+//   die-on-content, die-on-rename, die-on-thumbnails
+//               exists: the process ends in the middle of that
+//   die-on-service
+//               exists: the process ends when it is asked for services
+//   large-thumbnails
+//               exists: they have a MiB each
+//
+// Items whose identifier begins with "none" have no thumbnail and are not spoken of; of others that
+// are no item, there is an error. A thumbnail is told of twice; the second has another picture.
 //
 // What is done to content is noted in <home>/fake/journal, a line each.
 //
@@ -31,6 +39,7 @@
 #include "platform/fileprovider/manager.h"
 #include "platform/fileprovider/wire_item.h"
 #include "platform/foundation/lock.h"
+#include "platform/xpc/test_workshop.h"
 
 namespace yomber {
 namespace {
@@ -164,6 +173,22 @@ class FileEnumerator final : public NSFileProviderChangeEnumerator {
   std::map<std::string, std::uint64_t> told_ GUARDED_BY(mutex_);
 };
 
+/// Each endpoint has a workshop behind it.
+class WorkshopSource final : public NSFileProviderServiceSource {
+ public:
+  [[nodiscard]] NSFileProviderServiceName serviceName() const override { return "test.workshop"; }
+  NSXPCListenerEndpointRef makeListenerEndpointAndReturnError(NSErrorRef* /*error*/) override {
+    listener_ = NSXPCListener::anonymousListener();
+    listener_->setDelegate(vendor_);
+    listener_->resume();
+    return listener_->endpoint();
+  }
+
+ private:
+  const std::shared_ptr<test::WorkshopVendor> vendor_ = std::make_shared<test::WorkshopVendor>();
+  NSXPCListenerRef listener_;
+};
+
 class FakeExtension final : public NSFileProviderExtension {
  public:
   NSURLRef URLForItemWithPersistentIdentifier(
@@ -213,6 +238,16 @@ class FakeExtension final : public NSFileProviderExtension {
     return std::make_shared<FileEnumerator>();
   }
 
+  std::vector<NSFileProviderServiceSourceRef> supportedServiceSourcesForItemIdentifier(
+      const NSFileProviderItemIdentifier& identifier, NSErrorRef* /*error*/) override {
+    if (isCommanded("die-on-service")) {
+      std::filesystem::remove(fakePath("die-on-service"));
+      _exit(3);
+    }
+    if (!readItems().contains(identifier)) return {};
+    return {std::make_shared<WorkshopSource>()};
+  }
+
   using NSFileProviderExtension::startProvidingItemAtURL;
   void startProvidingItemAtURL(const NSURLRef& url, NSFileCoordinatorReadingOptions options,
                                ErrorHandler completionHandler) override {
@@ -255,6 +290,36 @@ class FakeExtension final : public NSFileProviderExtension {
       _exit(3);
     }
     completionHandler(makeItem(identifier, 2), nullptr);
+  }
+
+  using NSFileProviderExtension::fetchThumbnailsForItemIdentifiers;
+  NSProgressRef fetchThumbnailsForItemIdentifiers(
+      const std::vector<NSFileProviderItemIdentifier>& identifiers, CGSize requestedSize,
+      TypedThumbnailHandler handler, ErrorHandler completionHandler) override {
+    note("thumbnails " + std::to_string(identifiers.size()));
+    const auto progress = NSProgress::progressWithTotalUnitCount(0);
+    progress->setCancellationHandler([this] { note("thumbnails cancelled"); });
+    const auto items = readItems();
+    NSErrorRef failure;
+    const std::string picture = isCommanded("large-thumbnails") ? std::string(1 << 20, 'x')
+                                : requestedSize.width > requestedSize.height ? "wide"
+                                                                             : "high";
+    for (const auto& identifier : identifiers) {
+      if (identifier.starts_with("none")) continue;
+      if (!items.contains(identifier)) {
+        failure = fileProviderErrorForNonExistentItemWithIdentifier(identifier);
+        handler(identifier, nullptr, std::nullopt, failure);
+        continue;
+      }
+      handler(identifier, NSData::dataWithString(picture + " of " + identifier), "x/fake", nullptr);
+      handler(identifier, NSData::dataWithString("again"), std::nullopt, nullptr);
+      if (isCommanded("die-on-thumbnails")) {
+        std::filesystem::remove(fakePath("die-on-thumbnails"));
+        _exit(3);
+      }
+    }
+    completionHandler(failure);
+    return progress;
   }
 
  private:

@@ -107,6 +107,22 @@ std::shared_ptr<ContainerWatch> Host::watch(const std::string& container,
   return watch;
 }
 
+std::shared_ptr<ThumbnailFetch> Host::thumbnailFetch(
+    ThumbnailFetch::Request request, ipc::Remote<protocol::ThumbnailReceiver> receiver) {
+  std::erase_if(thumbnailFetches_, [](const auto& fetch) { return fetch.expired(); });
+  if (thumbnailFetches_.size() >= options_.maximumThumbnailFetches) return nullptr;
+  const auto explainError = [weak = weak_from_this()](const NSErrorRef& error,
+                                                      std::function<void(NSErrorRef)> handler) {
+    const auto self = weak.lock();
+    if (self == nullptr) return handler(error);
+    self->explain(error, std::move(handler));
+  };
+  auto fetch = std::make_shared<ThumbnailFetch>(*supervisor_, explainError, std::move(request),
+                                                std::move(receiver));
+  thumbnailFetches_.push_back(fetch);
+  return fetch;
+}
+
 void Host::enumerator(const std::string& container, EnumeratorHandler handler) {
   supervisor_->acquire([container, handler = std::move(handler)](const ExtensionSessionRef& session,
                                                                  const NSErrorRef& error) {
@@ -177,6 +193,21 @@ void Host::identify(const std::string& path, TextHandler handler) {
         });
       },
       std::move(handler), kAttempts);
+}
+
+void Host::services(const ServicesRequest& request, ServicesHandler handler) {
+  const auto answer = [weak = weak_from_this(), handler = std::move(handler)](
+                          std::optional<std::vector<VendedService>> services, NSErrorRef error) {
+    const auto self = weak.lock();
+    const bool isStuck = error != nullptr && error->is(NSCocoaErrorDomain, NSXPCConnectionTimedOut);
+    if (self != nullptr && isStuck) self->supervisor_->suspect();
+    handler(std::move(services), std::move(error));
+  };
+  ask<std::vector<VendedService>>(
+      [request, limit = options_.callLimit](ExtensionSession& session, ServicesHandler each) {
+        askForServices(session, request, limit, std::move(each));
+      },
+      answer, kAttempts);
 }
 
 void Host::explain(const NSErrorRef& error, std::function<void(NSErrorRef)> handler) {

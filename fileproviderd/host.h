@@ -11,9 +11,11 @@
 #include "fileproviderd/container_watch.h"
 #include "fileproviderd/content_needs.h"
 #include "fileproviderd/extension_content.h"
+#include "fileproviderd/extension_services.h"
 #include "fileproviderd/extension_supervisor.h"
 #include "fileproviderd/host_clock.h"
 #include "fileproviderd/remote_session.h"
+#include "fileproviderd/thumbnail_fetch.h"
 #include "fileproviderd/zarn_link.h"
 #include "platform/foundation/drive_paths.h"
 
@@ -33,6 +35,7 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
     ContainerWatch::Limits watching;
     ContentNeeds::Limits needs;
     std::size_t maximumWatches = 4'096;
+    std::size_t maximumThumbnailFetches = 32;
   };
   static std::shared_ptr<Host> create(Options options);
 
@@ -49,10 +52,16 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
   void item(const std::string& identifier, ItemHandler handler);
   void locate(const std::string& identifier, TextHandler handler);
   void identify(const std::string& path, TextHandler handler);
+  /// Asking twice does no harm: an endpoint that nobody connects to goes away.
+  void services(const ServicesRequest& request, ServicesHandler handler);
 
   /// Null when there are too many watches already. The watch ends when the caller lets go of it.
   std::shared_ptr<ContainerWatch> watch(const std::string& container,
                                         std::shared_ptr<ContainerWatcher> watcher);
+
+  /// Null when there are too many already. The fetch ends when the caller lets go of it.
+  std::shared_ptr<ThumbnailFetch> thumbnailFetch(ThumbnailFetch::Request request,
+                                                 ipc::Remote<protocol::ThumbnailReceiver> receiver);
 
   /// Puts an error into words: one that comes from zarn not being there says so.
   void explain(const NSErrorRef& error, std::function<void(NSErrorRef)> handler);
@@ -85,6 +94,7 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
   std::shared_ptr<ExtensionContent> content_;  ///< made when it is first asked for
   std::shared_ptr<ContentNeeds> needs_;
   std::vector<std::weak_ptr<ContainerWatch>> watches_;
+  std::vector<std::weak_ptr<ThumbnailFetch>> thumbnailFetches_;
 };
 
 }  // namespace yomber

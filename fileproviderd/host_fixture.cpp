@@ -182,8 +182,8 @@ void HostTest::startHost(const std::function<void(Host::Options&)>& change) {
   NSErrorRef error;
   control = ipc::Listener::listen(
       paths.controlSocket,
-      [weak = std::weak_ptr(host)](const ipc::PeerCredentials&) -> capnp::Capability::Client {
-        return makeControlServer(weak.lock());
+      [weak = std::weak_ptr(host)](const ipc::PeerCredentials& peer) -> capnp::Capability::Client {
+        return makeControlServer(weak.lock(), static_cast<std::uint32_t>(peer.pid));
       },
       &error);
   require(error);

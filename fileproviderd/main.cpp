@@ -14,7 +14,9 @@
 #include "fileproviderd/control_server.h"
 #include "fileproviderd/host.h"
 #include "platform/fileprovider/wire_item.h"
+#include "platform/foundation/descriptor_limit.h"
 #include "platform/foundation/drive_paths.h"
+#include "platform/foundation/ending_signals.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
 #include "platform/ipc/event_loop.h"
@@ -72,16 +74,6 @@ ipc::UniqueFd lockDrive(const std::string& path) {
   return file;
 }
 
-/// Blocks the signals that end the process, in every thread that is started from now on.
-sigset_t blockEndingSignals() {
-  sigset_t set;
-  sigemptyset(&set);
-  for (const int signal : {SIGTERM, SIGINT, SIGHUP}) sigaddset(&set, signal);
-  (void)pthread_sigmask(SIG_BLOCK, &set, nullptr);
-  (void)std::signal(SIGPIPE, SIG_IGN);
-  return set;
-}
-
 int serve(const DrivePaths& paths, const std::string& extension, const sigset_t& endingSignals) {
   auto& loop = ipc::EventLoop::shared();
   auto host = loop.runAndWait([&] {
@@ -94,7 +86,10 @@ int serve(const DrivePaths& paths, const std::string& extension, const sigset_t&
   });
   NSErrorRef error;
   auto listener = ipc::Listener::listen(
-      paths.controlSocket, [host](const ipc::PeerCredentials&) { return makeControlServer(host); },
+      paths.controlSocket,
+      [host](const ipc::PeerCredentials& peer) {
+        return makeControlServer(host, static_cast<std::uint32_t>(peer.pid));
+      },
       &error);
   if (listener != nullptr) {
     log_info(defaultLog(), "[INFO] serving %s", paths.controlSocket.c_str());
@@ -124,6 +119,7 @@ int run(const std::vector<std::string>& given) {
     const auto error = NSError::errorWithErrno(errno, paths.home + "/fileproviderd.lock");
     return fail(kCannotStart, error->localizedDescription());
   }
+  raiseDescriptorLimit();
   openLog("fileproviderd", paths);
   registerItemsInErrors();
   return serve(paths, arguments->extension, endingSignals);

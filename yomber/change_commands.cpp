@@ -40,7 +40,6 @@ struct ChangeOptions {
   bool list = false;
   bool empty = false;
 };
-using Options = std::shared_ptr<ChangeOptions>;
 
 /// What a command on items needs; prints what comes of each.
 struct ChangeRun {
@@ -296,16 +295,6 @@ void runRemove(CommandContext& context, const ChangeOptions& options) {
   if (!run.isReady()) return;
   run.forEach(options.arguments,
               [&](const std::string& identifier) { return run.changes->remove(identifier); });
-}
-
-constexpr const char* itemHelp =
-    "A path from the drive's root, a location in its tree, or an identifier";
-
-CLI::App* addCommand(CLI::App& app, CommandContext& context, const char* name, const char* what,
-                     void (*run)(CommandContext&, const ChangeOptions&), const Options& options) {
-  CLI::App* command = app.add_subcommand(name, what);
-  command->callback([&context, run, options] { run(context, *options); });
-  return command;
 }
 
 void addMoves(CLI::App& app, CommandContext& context) {

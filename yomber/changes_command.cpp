@@ -1,11 +1,13 @@
 #include <iostream>
 #include <memory>
+#include <span>
 #include <string>
 #include <vector>
 
 #include <nlohmann/json.hpp>
 
 #include "platform/fileprovider/item_codec.h"
+#include "platform/foundation/hexadecimal.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "yomber/command.h"
@@ -56,17 +58,6 @@ NSErrorRef nextBatch(const ipc::Remote<Daemon>& daemon, const std::string& since
   return transport ? transport : failure;
 }
 
-std::string hexadecimal(const std::string& bytes) {
-  constexpr std::string_view digits = "0123456789abcdef";
-  std::string out;
-  for (const char byte : bytes) {
-    const auto value = static_cast<unsigned char>(byte);
-    out += digits[value >> 4U];
-    out += digits[value & 0xFU];
-  }
-  return out;
-}
-
 /// Nothing for what is no token's text.
 std::optional<std::string> bytesOf(const std::string& text) {
   constexpr std::string_view digits = "0123456789abcdef";
@@ -115,11 +106,8 @@ void runChanges(CommandContext& context, const std::string& since) {
     token = batch.token;
   }
   if (error) return context.fail(error);
-  if (context.json) {
-    std::cout << nlohmann::ordered_json{{"token", hexadecimal(*token)}}.dump() << std::endl;
-  } else {
-    std::cout << "token    " << hexadecimal(*token) << std::endl;
-  }
+  const std::string text = hexadecimal(std::as_bytes(std::span(*token)));
+  context.print({{"token", text}}, "token    " + text);
 }
 
 }  // namespace

@@ -13,6 +13,15 @@ DrivePaths CommandContext::paths() const {
   return home.empty() ? DrivePaths::forDefaultHome() : DrivePaths::forHome(home);
 }
 
+void CommandContext::print(const nlohmann::ordered_json& answer, const std::string& text) const {
+  if (json) {
+    std::cout << answer.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+  } else {
+    std::cout << text;
+  }
+  std::cout << std::endl;
+}
+
 void CommandContext::fail(const NSErrorRef& error) {
   exitCode = exitCodeFor(error);
   if (json) {

@@ -1,6 +1,5 @@
 #include "yomber/drive_changes.h"
 
-#include <chrono>
 #include <memory>
 #include <utility>
 
@@ -9,14 +8,13 @@
 #include "platform/fileprovider/wire_item.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
+#include "yomber/patient_call.h"
 
 namespace yomber {
 
 namespace {
 
 using protocol::Changes;
-
-constexpr ipc::CallOptions asLongAsItTakes{.timeout = std::chrono::milliseconds::zero()};
 
 }  // namespace
 
@@ -32,19 +30,19 @@ std::optional<DriveChanges> DriveChanges::open(DriveClient& client, NSErrorRef* 
     storeError(error, std::move(failure));
     return std::nullopt;
   }
-  return DriveChanges(std::move(changes));
+  return DriveChanges(control, std::move(changes));
 }
 
 template <typename Method, typename Fill>
 ChangeResult DriveChanges::change(Method method, const Fill& fill) const {
   ChangeResult result;
-  NSErrorRef transport = ipc::callAndWait(
+  NSErrorRef transport = callPatiently(
       remote_, method, fill,
       [&](auto changed) {
         if (changed.isItem()) result.item = decodeItem(changed.getItem());
         if (changed.isError()) result.error = ipc::decodeError(changed.getError());
       },
-      asLongAsItTakes);
+      questionForHost(control_));
   if (transport) result.error = std::move(transport);
   return result;
 }

@@ -19,7 +19,8 @@ struct ChangeResult {
   NSErrorRef error;
 };
 
-/// Changes of items, through the host. Each waits for as long as the change takes.
+/// Changes of items, through the host. Each waits for as long as the change takes, unless the host
+/// answers nothing at all.
 ///
 /// Thread-safety: any number of threads at a time.
 class DriveChanges {
@@ -50,10 +51,12 @@ class DriveChanges {
   [[nodiscard]] ChangeResult defaultApplicationContainer(const std::string& bundle) const;
 
  private:
-  explicit DriveChanges(ipc::Remote<protocol::Changes> remote) : remote_(std::move(remote)) {}
+  DriveChanges(ipc::Remote<protocol::Control> control, ipc::Remote<protocol::Changes> remote)
+      : control_(std::move(control)), remote_(std::move(remote)) {}
   template <typename Method, typename Fill>
   ChangeResult change(Method method, const Fill& fill) const;
 
+  ipc::Remote<protocol::Control> control_;
   ipc::Remote<protocol::Changes> remote_;
 };
 

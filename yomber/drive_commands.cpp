@@ -1,28 +1,20 @@
 #include <chrono>
-#include <csignal>
-#include <filesystem>
 #include <iostream>
 
-#include <fcntl.h>
 #include <poll.h>
-#include <sys/syscall.h>
-#include <sys/wait.h>
 #include <unistd.h>
-
-extern "C" {
-#include <sys/pidfd.h>  // Debian 12's does not say extern "C" itself
-}
 
 #include <nlohmann/json.hpp>
 
-#include "platform/foundation/log_sinks.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "yomber/command.h"
 #include "yomber/drive_client.h"
+#include "yomber/drive_mount.h"
 #include "yomber/drive_status.h"
 #include "yomber/item_output.h"
 #include "yomber/supervisor.h"
+#include "yomber/supervisor_process.h"
 #include "yomber/transfer_view.h"
 
 namespace yomber {
@@ -34,50 +26,14 @@ using std::chrono::steady_clock;
 /// How long `up` and `down` wait before they say that something is wrong.
 constexpr std::chrono::seconds patience{30};
 
-std::string programPath(const std::string& name) {
-  std::error_code failure;
-  const auto self = std::filesystem::read_symlink("/proc/self/exe", failure);
-  return (self.parent_path() / name).string();
-}
-
 std::string supervisorLock(const DrivePaths& paths) { return paths.home + "/supervisor.lock"; }
 
-/// Waits until the process has ended; false at the deadline.
-bool waitForEnd(int pidDescriptor, steady_clock::time_point deadline) {
-  pollfd waiting{pidDescriptor, POLLIN, 0};
-  const auto left =
-      std::chrono::ceil<std::chrono::milliseconds>(deadline - steady_clock::now()).count();
-  return poll(&waiting, 1, static_cast<int>(std::max<long long>(left, 0))) == 1;
-}
-
-void closeInheritedDescriptors() {
-  const int null = open("/dev/null", O_RDWR | O_CLOEXEC);
-  for (const int standard : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) dup2(null, standard);
-  close_range(STDERR_FILENO + 1, ~0U, 0);
-}
-
-NSErrorRef superviseHere(const DrivePaths& paths) {
-  Supervisor supervisor(supervisorLock(paths),
-                        {
-                            {"zarn", {programPath("zarn"), "--home", paths.home}},
-                            {"fileproviderd", {programPath("fileproviderd"), "--home", paths.home}},
-                        });
-  if (NSErrorRef error = supervisor.takeLock()) return error;
-  openLog("supervisor", paths);
-  supervisor.run();
-  return nullptr;
-}
-
-/// Starts the supervisor as a session of its own, which no terminal's end takes down.
-void startSupervisorProcess(const DrivePaths& paths) {
-  const pid_t first = fork();
-  if (first == 0) {
-    setsid();
-    if (fork() != 0) _exit(0);
-    closeInheritedDescriptors();
-    _exit(superviseHere(paths) ? 1 : 0);
-  }
-  waitpid(first, nullptr, 0);
+Supervision supervisionOf(const DrivePaths& paths) {
+  return {.paths = paths,
+          .logName = "supervisor",
+          .lockPath = supervisorLock(paths),
+          .programs = {{"zarn", {programPath("zarn"), "--home", paths.home}},
+                       {"fileproviderd", {programPath("fileproviderd"), "--home", paths.home}}}};
 }
 
 /// Whether zarn and the host answer, and the extension knows the root.
@@ -112,10 +68,10 @@ void runUp(CommandContext& context, bool foreground) {
     if (already)
       return context.fail(ExitCode::CannotCreate,
                           "the drive is up already; take it down with 'yomber down'");
-    if (NSErrorRef error = superviseHere(paths)) context.fail(error);
+    if (NSErrorRef error = superviseHere(supervisionOf(paths))) context.fail(error);
     return;
   }
-  if (!already) startSupervisorProcess(paths);
+  if (!already) superviseApart(supervisionOf(paths));
   if (NSErrorRef error = waitUntilUp(paths)) {
     context.fail(error);
     std::cerr << "yomber: the drive did not come up; see 'yomber log'" << std::endl;
@@ -134,18 +90,10 @@ void runUp(CommandContext& context, bool foreground) {
 
 void runDown(CommandContext& context) {
   const DrivePaths paths = context.paths();
-  const std::optional<pid_t> pid = Supervisor::runningPid(supervisorLock(paths));
-  const int pidDescriptor = pid ? pidfd_open(*pid, 0) : -1;
-  if (pidDescriptor >= 0) {
-    pidfd_send_signal(pidDescriptor, SIGTERM, nullptr, 0);
-    const bool ended = waitForEnd(pidDescriptor, steady_clock::now() + patience);
-    close(pidDescriptor);
-    if (!ended) {
-      return context.fail(ExitCode::Failure,
-                          "the drive's supervisor (pid " + std::to_string(*pid) + ") did not end");
-    }
-  }
-  const bool wasUp = pidDescriptor >= 0;
+  bool wasMounted = false;
+  if (NSErrorRef error = unmountDrive(paths, wasMounted)) return context.fail(error);
+  bool wasUp = false;
+  if (NSErrorRef error = endSupervision(supervisorLock(paths), wasUp)) return context.fail(error);
   if (context.json) {
     std::cout
         << nlohmann::ordered_json{{"home", paths.home}, {"up", false}, {"was_up", wasUp}}.dump()

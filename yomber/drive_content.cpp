@@ -1,11 +1,12 @@
 #include "yomber/drive_content.h"
 
-#include <chrono>
 #include <utility>
 
 #include "platform/fileprovider/item_codec.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
+#include "platform/ostrell/daemon_question.h"
+#include "yomber/patient_call.h"
 
 namespace yomber {
 
@@ -14,24 +15,25 @@ namespace {
 using protocol::Content;
 using protocol::Control;
 
-constexpr ipc::CallOptions asLongAsItTakes{.timeout = std::chrono::milliseconds::zero()};
-
 ipc::Remote<Content> contentOf(const ipc::Remote<protocol::Daemon>& daemon, NSErrorRef* error) {
   ipc::Remote<Content> content;
   NSErrorRef failure = ipc::callAndWait(
       daemon, &protocol::Daemon::Client::contentRequest, [](auto) {},
-      [&](auto results) { content = ipc::Remote<Content>(results.getContent()); });
+      [&](auto results) { content = ipc::Remote<Content>(results.getContent()); },
+      {.timeout = daemonTimeLimit()});
   if (failure) storeError(error, std::move(failure));
   return content;
 }
 
 /// A call whose results are a failure or nothing.
 template <typename Interface, typename Method, typename Fill>
-NSErrorRef attempt(const ipc::Remote<Interface>& remote, Method method, const Fill& fill) {
+NSErrorRef attempt(const ipc::Remote<Interface>& remote, Method method, const Fill& fill,
+                   ipc::Patience::Question question) {
   NSErrorRef failure;
-  NSErrorRef transport = ipc::callAndWait(
+  NSErrorRef transport = callPatiently(
       remote, method, fill,
-      [&](auto results) { failure = ipc::decodeOptional(results.getFailure()); }, asLongAsItTakes);
+      [&](auto results) { failure = ipc::decodeOptional(results.getFailure()); },
+      std::move(question));
   return transport ? transport : failure;
 }
 
@@ -58,7 +60,7 @@ std::optional<DriveContent> DriveContent::open(DriveClient& client, NSErrorRef* 
   if (!daemon) return std::nullopt;
   auto content = contentOf(daemon, error);
   if (!content) return std::nullopt;
-  return DriveContent(std::move(control), std::move(content));
+  return DriveContent(std::move(control), daemon, std::move(content));
 }
 
 NSErrorRef DriveContent::transfers(const ipc::Remote<protocol::Daemon>& daemon,
@@ -79,7 +81,7 @@ NSErrorRef DriveContent::transfers(const ipc::Remote<protocol::Daemon>& daemon,
 
 NSErrorRef DriveContent::provide(const std::string& path, ipc::Remote<protocol::Need>* need) const {
   NSErrorRef failure;
-  NSErrorRef transport = ipc::callAndWait(
+  NSErrorRef transport = callPatiently(
       control_, &Control::Client::startProvidingRequest,
       [&](auto params) { params.setPath(wireData(path)); },
       [&](auto results) {
@@ -88,13 +90,14 @@ NSErrorRef DriveContent::provide(const std::string& path, ipc::Remote<protocol::
           *need = ipc::Remote<protocol::Need>(results.getNeed());
         }
       },
-      asLongAsItTakes);
+      questionForHost(control_));
   return transport ? transport : failure;
 }
 
 NSErrorRef DriveContent::stopProviding(const std::string& path) const {
-  return attempt(control_, &Control::Client::stopProvidingRequest,
-                 [&](auto params) { params.setPath(wireData(path)); });
+  return attempt(
+      control_, &Control::Client::stopProvidingRequest,
+      [&](auto params) { params.setPath(wireData(path)); }, questionForHost(control_));
 }
 
 NSErrorRef DriveContent::state(const std::string& path, ContentState& state) const {
@@ -116,26 +119,30 @@ NSErrorRef DriveContent::state(const std::string& path, ContentState& state) con
 }
 
 NSErrorRef DriveContent::evict(const std::string& path) const {
-  return attempt(content_, &Content::Client::evictRequest,
-                 [&](auto params) { params.setPath(wireData(path)); });
+  return attempt(
+      content_, &Content::Client::evictRequest,
+      [&](auto params) { params.setPath(wireData(path)); }, questionForDaemon(daemon_));
 }
 
 NSErrorRef DriveContent::setPinned(const std::string& path, bool pinned) const {
-  return attempt(content_, &Content::Client::setPinnedRequest, [&](auto params) {
-    params.setPath(wireData(path));
-    params.setPinned(pinned);
-  });
+  return attempt(
+      content_, &Content::Client::setPinnedRequest,
+      [&](auto params) {
+        params.setPath(wireData(path));
+        params.setPinned(pinned);
+      },
+      questionForDaemon(daemon_));
 }
 
 NSErrorRef DriveContent::emptyTrash(std::uint64_t& removed) const {
   NSErrorRef failure;
-  NSErrorRef transport = ipc::callAndWait(
+  NSErrorRef transport = callPatiently(
       content_, &Content::Client::emptyTrashRequest, [](auto) {},
       [&](auto results) {
         removed = results.getRemoved();
         failure = ipc::decodeOptional(results.getFailure());
       },
-      asLongAsItTakes);
+      questionForDaemon(daemon_));
   return transport ? transport : failure;
 }
 

@@ -9,6 +9,7 @@
 #include "platform/ipc/remote.h"
 #include "protocols/content.capnp.h"
 #include "protocols/control.capnp.h"
+#include "protocols/daemon.capnp.h"
 #include "yomber/drive_client.h"
 
 namespace yomber {
@@ -42,7 +43,8 @@ struct Transfers {
   std::uint64_t finished = 0;
 };
 
-/// The content of items: asked for through the host, looked at in the daemon.
+/// The content of items: asked for through the host, looked at in the daemon. What is asked for
+/// takes as long as it takes, but ends when host or daemon answer nothing at all.
 ///
 /// Thread-safety: any number of threads at a time.
 class DriveContent {
@@ -66,10 +68,12 @@ class DriveContent {
   NSErrorRef physicalLocation(const std::string& path, std::string& physical) const;
 
  private:
-  DriveContent(ipc::Remote<protocol::Control> control, ipc::Remote<protocol::Content> content)
-      : control_(std::move(control)), content_(std::move(content)) {}
+  DriveContent(ipc::Remote<protocol::Control> control, ipc::Remote<protocol::Daemon> daemon,
+               ipc::Remote<protocol::Content> content)
+      : control_(std::move(control)), daemon_(std::move(daemon)), content_(std::move(content)) {}
 
   ipc::Remote<protocol::Control> control_;
+  ipc::Remote<protocol::Daemon> daemon_;
   ipc::Remote<protocol::Content> content_;
 };
 

@@ -11,6 +11,7 @@
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "yomber/drive_client.h"
+#include "yomber/drive_mount.h"
 #include "yomber/failure_text.h"
 #include "yomber/item_output.h"
 #include "yomber/transfer_view.h"
@@ -105,6 +106,7 @@ DriveStatus readDriveStatus(const DrivePaths& paths, std::optional<pid_t> superv
   DriveStatus status;
   status.home = paths.home;
   status.supervisor = supervisor;
+  status.mountPoint = mountPointOf(paths);
   DriveClient client(paths);
   if (const auto daemon = client.daemon(nullptr)) {
     status.daemon = askDaemon(daemon);
@@ -119,6 +121,7 @@ DriveStatus readDriveStatus(const DrivePaths& paths, std::optional<pid_t> superv
 std::string statusText(const DriveStatus& status) {
   std::ostringstream out;
   out << "drive          " << status.home << "\n";
+  if (status.mountPoint) out << "shown in       " << *status.mountPoint << "\n";
   out << "account        " << status.account.value_or("nobody is signed in") << "\n";
   if (status.daemon) {
     describeDaemon(out, *status.daemon);
@@ -169,6 +172,7 @@ nlohmann::ordered_json transfersJson(const Transfers& transfers) {
 nlohmann::ordered_json statusJson(const DriveStatus& status) {
   nlohmann::ordered_json json{{"home", status.home}, {"up", status.daemon && status.host}};
   if (status.supervisor) json["supervisor"] = {{"pid", *status.supervisor}};
+  if (status.mountPoint) json["mount"] = *status.mountPoint;
   if (status.account) json["account"] = *status.account;
   if (status.daemon) {
     json["zarn"] = {{"pid", status.daemon->pid},

@@ -42,6 +42,7 @@ struct DriveStatus {
 
   std::string home;
   std::optional<pid_t> supervisor;
+  std::optional<std::string> mountPoint;
   std::optional<std::string> account;
   std::optional<Daemon> daemon;
   std::optional<Host> host;

@@ -5,6 +5,7 @@
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/file_operations.h"
 #include "platform/ostrell/constants.h"
+#include "platform/rozzel/errors.h"
 
 namespace yomber {
 
@@ -15,6 +16,15 @@ bool isConnectionError(const NSError& error) {
   if (error.domain() != NSCocoaErrorDomain) return false;
   return error.code() == NSXPCConnectionInterrupted || error.code() == NSXPCConnectionInvalid ||
          error.code() == NSXPCConnectionReplyInvalid || error.code() == NSXPCConnectionTimedOut;
+}
+
+/// What a share does not allow this account, or is no share any more.
+ExitCode exitCodeForShare(const NSError& error) {
+  if (error.is(RZErrorDomain, RZErrorPermissionFailure)) return ExitCode::NotPermitted;
+  if (error.is(RZErrorDomain, RZErrorUnknownItem) ||
+      error.is(QSOstrellErrorDomain, QSOstrellErrorNotShared))
+    return ExitCode::NoSuchItem;
+  return ExitCode::Failure;
 }
 
 /// What a file or its content could not be had for; Failure when it is nothing of the kind.
@@ -63,7 +73,8 @@ ExitCode exitCodeFor(const NSErrorRef& error) {
   if (error->is(NSFileProviderErrorDomain, NSFileProviderErrorServerUnreachable)) {
     return exitCodeForUnreachable(*error);
   }
-  return exitCodeForFile(*error);
+  const ExitCode code = exitCodeForFile(*error);
+  return code == ExitCode::Failure ? exitCodeForShare(*error) : code;
 }
 
 }  // namespace yomber

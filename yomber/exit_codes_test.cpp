@@ -7,6 +7,7 @@
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/file_operations.h"
 #include "platform/ostrell/constants.h"
+#include "platform/rozzel/errors.h"
 
 namespace yomber {
 namespace {
@@ -21,6 +22,13 @@ TEST(ExitCodes, NobodySignedInIsSaidApartFromOtherFailuresInBothDomains) {
   EXPECT_EQ(codeOf(NSFileProviderErrorDomain, NSFileProviderErrorNotAuthenticated),
             ExitCode::NotSignedIn);
   EXPECT_EQ(codeOf(QSOstrellErrorDomain, QSOstrellErrorLoggedOut), ExitCode::NotSignedIn);
+}
+
+TEST(ExitCodes, WhatAShareDoesNotAllowIsSaidApartFromWhatADiskRefuses) {
+  EXPECT_EQ(codeOf(RZErrorDomain, RZErrorPermissionFailure), ExitCode::NotPermitted);
+  EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSFileWriteNoPermissionError), ExitCode::Failure);
+  EXPECT_EQ(codeOf(RZErrorDomain, RZErrorUnknownItem), ExitCode::NoSuchItem);
+  EXPECT_EQ(codeOf(QSOstrellErrorDomain, QSOstrellErrorNotShared), ExitCode::NoSuchItem);
 }
 
 TEST(ExitCodes, AMissingItemIsTheSameWhicheverLayerFoundItMissing) {

@@ -6,7 +6,6 @@
 #include <cerrno>
 #include <cstdio>
 #include <filesystem>
-#include <iostream>
 #include <memory>
 #include <string>
 #include <system_error>
@@ -173,13 +172,7 @@ void runGet(CommandContext& context, const GetOptions& options) {
   DriveClient client(context.paths());
   std::string placed;
   if (const NSErrorRef error = get(client, options, placed)) return context.fail(error);
-  if (context.json) {
-    std::cout << nlohmann::ordered_json{{"path", placed}}.dump(
-        -1, ' ', false, nlohmann::json::error_handler_t::replace);
-  } else {
-    std::cout << printableName(placed);
-  }
-  std::cout << std::endl;
+  context.print({{"path", placed}}, printableName(placed));
 }
 
 }  // namespace
@@ -187,10 +180,7 @@ void runGet(CommandContext& context, const GetOptions& options) {
 void addGetCommand(CLI::App& app, CommandContext& context) {
   auto options = std::make_shared<GetOptions>();
   CLI::App* command = app.add_subcommand("get", "Copy an item out of the drive");
-  command
-      ->add_option("item", options->item,
-                   "A path from the drive's root, a location in its tree, or an identifier")
-      ->required();
+  command->add_option("item", options->item, itemHelp)->required();
   command->add_option("path", options->destination,
                       "A folder of this machine, or the copy's name; the working directory by "
                       "default");

@@ -10,16 +10,6 @@ namespace yomber {
 
 namespace {
 
-void printAnswer(const CommandContext& context, const char* key, const std::string& answer) {
-  if (context.json) {
-    std::cout << nlohmann::ordered_json{{key, answer}}.dump(
-        -1, ' ', false, nlohmann::json::error_handler_t::replace);
-  } else {
-    std::cout << answer;
-  }
-  std::cout << std::endl;
-}
-
 void runStat(CommandContext& context, const std::string& argument) {
   DriveClient client(context.paths());
   NSFileProviderItemIdentifier identifier;
@@ -44,7 +34,7 @@ void runIdentifier(CommandContext& context, const std::string& argument) {
   DriveClient client(context.paths());
   NSFileProviderItemIdentifier identifier;
   if (NSErrorRef error = client.identifierFor(argument, identifier)) return context.fail(error);
-  printAnswer(context, "id", identifier);
+  context.print({{"id", identifier}}, identifier);
 }
 
 void runLocation(CommandContext& context, const std::string& argument) {
@@ -54,7 +44,7 @@ void runLocation(CommandContext& context, const std::string& argument) {
   NSErrorRef error = client.identifierFor(argument, identifier);
   if (!error) error = client.location(identifier, path);
   if (error) return context.fail(error);
-  printAnswer(context, "location", path);
+  context.print({{"location", path}}, path);
 }
 
 /// Adds a command that takes one item.
@@ -62,10 +52,7 @@ void addItemCommand(CLI::App& app, CommandContext& context, const char* name, co
                     void (*run)(CommandContext&, const std::string&)) {
   CLI::App* command = app.add_subcommand(name, what);
   auto argument = std::make_shared<std::string>();
-  command
-      ->add_option("item", *argument,
-                   "A path from the drive's root, a location in its tree, or an identifier")
-      ->required();
+  command->add_option("item", *argument, itemHelp)->required();
   command->callback([&context, argument, run] { run(context, *argument); });
 }
 

@@ -8,28 +8,14 @@
 #include <unicode/utf8.h>
 #include <nlohmann/json.hpp>
 
+#include "platform/fileprovider/item_kind_name.h"
+#include "platform/foundation/file_time.h"
 #include "protocols/common.capnp.h"
 #include "yomber/failure_text.h"
 
 namespace yomber {
 
 namespace {
-
-const char* kindName(ItemKind kind) {
-  switch (kind) {
-    case ItemKind::Document:
-      return "document";
-    case ItemKind::Folder:
-      return "folder";
-    case ItemKind::Alias:
-      return "alias";
-    case ItemKind::Bookmark:
-      return "bookmark";
-    case ItemKind::Symlink:
-      return "symlink";
-  }
-  return "unknown";
-}
 
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wconversion"  // within ICU's macro
@@ -65,7 +51,7 @@ void appendEscaped(std::string& out, unsigned char byte) {
 }
 
 std::string localTime(NSDate date) {
-  const std::time_t seconds = date.nanoseconds() / 1'000'000'000;
+  const std::time_t seconds = timespecOf(date.nanoseconds()).tv_sec;
   std::tm parts{};
   localtime_r(&seconds, &parts);
   std::array<char, 32> text{};
@@ -75,7 +61,7 @@ std::string localTime(NSDate date) {
 
 std::string longLine(const ItemFields& item) {
   std::array<char, 96> head{};
-  std::snprintf(head.data(), head.size(), "%-8s  %9s  %s  ", kindName(item.kind),
+  std::snprintf(head.data(), head.size(), "%-8s  %9s  %s  ", itemKindName(item.kind),
                 item.kind == ItemKind::Folder ? "-" : readableSize(item.size).c_str(),
                 localTime(item.modificationDate).c_str());
   std::string line = head.data();
@@ -129,7 +115,7 @@ nlohmann::ordered_json itemJson(const ItemFields& item) {
   } else {
     json["name_base64"] = base64(item.filename);
   }
-  json["kind"] = kindName(item.kind);
+  json["kind"] = itemKindName(item.kind);
   json["type"] = item.contentType;
   json["size"] = item.size;
   json["created"] = item.creationDate.description();

@@ -55,8 +55,7 @@ void addListingOptions(CLI::App& command, const std::shared_ptr<ListingOptions>&
 void addListingCommands(CLI::App& app, CommandContext& context) {
   CLI::App* list = app.add_subcommand("ls", "List a folder of the drive");
   auto listOptions = std::make_shared<ListingOptions>();
-  list->add_option("item", listOptions->where,
-                   "A path from the drive's root, a location in its tree, or an identifier");
+  list->add_option("item", listOptions->where, itemHelp);
   addListingOptions(*list, listOptions);
   list->callback([&context, listOptions] { runList(context, *listOptions); });
 

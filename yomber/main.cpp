@@ -28,9 +28,13 @@ int main(int argc, char** argv) {
   addChangeCommands(app, context);
   addGetCommand(app, context);
   addContentCommands(app, context);
+  addThumbnailCommand(app, context);
   addMarkCommands(app, context);
+  addShareCommands(app, context);
+  addCollabCommands(app, context);
   addChangesCommand(app, context);
   addWatchCommands(app, context);
+  addMountCommands(app, context);
   addLogCommand(app, context);
   addCompletionCommand(app, context);
 

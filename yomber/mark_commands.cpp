@@ -17,9 +17,6 @@ namespace yomber {
 
 namespace {
 
-constexpr const char* itemHelp =
-    "A path from the drive's root, a location in its tree, or an identifier";
-
 struct MarkOptions {
   std::string item;
   std::vector<std::string> labels;
@@ -29,7 +26,6 @@ struct MarkOptions {
   std::int64_t rank = 1;
   std::string date;
 };
-using Options = std::shared_ptr<MarkOptions>;
 
 /// Prints the item as it is after the change.
 void report(CommandContext& context, const ChangeResult& result) {
@@ -101,8 +97,7 @@ std::optional<NSDate> parseDate(const std::string& text) {
     const char* const rest = strptime(text.c_str(), form, &parts);
     const bool isUtc = rest != nullptr && std::string(rest) == "Z";
     if (rest == nullptr || (*rest != '\0' && !isUtc)) continue;
-    constexpr std::int64_t kSecond = 1'000'000'000;
-    return NSDate::fromNanoseconds((isUtc ? timegm(&parts) : mktime(&parts)) * kSecond);
+    return NSDate::fromTimespec({.tv_sec = isUtc ? timegm(&parts) : mktime(&parts), .tv_nsec = 0});
   }
   return std::nullopt;
 }
@@ -124,13 +119,6 @@ void runAppFolder(CommandContext& context, const MarkOptions& options) {
   const auto changes = DriveChanges::open(client, &error);
   if (!changes) return context.fail(error);
   report(context, changes->defaultApplicationContainer(options.item));
-}
-
-CLI::App* addCommand(CLI::App& app, CommandContext& context, const char* name, const char* what,
-                     void (*run)(CommandContext&, const MarkOptions&), const Options& options) {
-  CLI::App* command = app.add_subcommand(name, what);
-  command->callback([&context, run, options] { run(context, *options); });
-  return command;
 }
 
 }  // namespace

@@ -94,14 +94,13 @@ std::optional<pid_t> Supervisor::runningPid(const std::string& lockPath) {
 void Supervisor::run() {
   const sigset_t signals = handledSignals();
   const int signalDescriptor = signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK);
-  bool ending = false;
-  while (!ending) {
+  while (!isEnding_) {
     startDue();
     pollfd waiting{signalDescriptor, POLLIN, 0};
     poll(&waiting, 1, millisecondsUntilNextStart());
     signalfd_siginfo info;
     while (read(signalDescriptor, &info, sizeof info) == static_cast<ssize_t>(sizeof info)) {
-      ending = ending || info.ssi_signo == SIGTERM || info.ssi_signo == SIGINT;
+      isEnding_ = isEnding_ || info.ssi_signo == SIGTERM || info.ssi_signo == SIGINT;
     }
     reap();
   }
@@ -144,7 +143,10 @@ void Supervisor::reap() {
   int status = 0;
   for (pid_t pid = waitpid(-1, &status, WNOHANG); pid > 0; pid = waitpid(-1, &status, WNOHANG)) {
     const auto child = std::ranges::find(children_, pid, &Child::pid);
-    if (child != children_.end()) scheduleRestart(*child, status);
+    if (child == children_.end()) continue;
+    const bool hasSucceeded = WIFEXITED(status) && WEXITSTATUS(status) == 0;
+    isEnding_ = isEnding_ || (hasSucceeded && child->program.mayEnd);
+    scheduleRestart(*child, status);
   }
 }
 

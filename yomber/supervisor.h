@@ -15,6 +15,7 @@ namespace yomber {
 struct SupervisedProgram {
   std::string name;
   std::vector<std::string> arguments;  ///< the first is the executable's path
+  bool mayEnd = false;  ///< when it ends with success, all are ended rather than it started again
 };
 
 /// Keeps a drive's programs running: starts them, starts again whichever ends, and ends them all
@@ -30,8 +31,8 @@ class Supervisor {
 
   /// Takes the lock; fails with EWOULDBLOCK when another supervisor holds it.
   [[nodiscard]] NSErrorRef takeLock();
-  /// Returns after SIGTERM or SIGINT, when every program has ended. REQUIRES: `takeLock` succeeded
-  /// in this very process (record locks are not inherited).
+  /// Returns after SIGTERM or SIGINT, or the end of one that may end, when every program has ended.
+  /// REQUIRES: `takeLock` succeeded in this very process (record locks are not inherited).
   void run();
 
   /// The pid of the supervisor that holds the lock.
@@ -56,6 +57,7 @@ class Supervisor {
   const std::string lockPath_;
   std::vector<Child> children_;
   int lockDescriptor_ = -1;
+  bool isEnding_ = false;
 };
 
 }  // namespace yomber

@@ -17,7 +17,7 @@ namespace yomber {
 namespace {
 
 constexpr std::size_t longestList = 10;
-constexpr int redrawMilliseconds = 150;
+constexpr int redrawMilliseconds = 300;
 
 const char* kindName(Transfer::Kind kind) {
   switch (kind) {

@@ -1,11 +1,4 @@
-#include <csignal>
 #include <iostream>
-#include <map>
-#include <mutex>
-
-#include <unistd.h>
-
-#include <nlohmann/json.hpp>
 
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/item_codec.h"
@@ -13,138 +6,69 @@
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/event_loop.h"
+#include "yomber/change_printer.h"
 #include "yomber/command.h"
 #include "yomber/drive_client.h"
-#include "yomber/failure_text.h"
-#include "yomber/item_output.h"
 
 namespace yomber {
 
 namespace {
 
-struct WatchOptions {
-  bool listFirst = false;  ///< print what is there at the start as well
-  bool once = false;       ///< end after the first listing
-};
-
-/// Prints each change as it comes. Lives on the loop thread, as all of its calls do.
-class ChangePrinter {
+/// A watch under way: prints what the host tells, on the loop thread, and ends for whoever waits.
+class RunningWatch {
  public:
-  ChangePrinter(bool json, WatchOptions options) : json_(json), options_(options) {}
-
-  void listed(const std::vector<ItemFields>& items, bool last) {
-    for (const ItemFields& item : items) {
-      names_[item.identifier] = item.filename;
-      if (options_.listFirst) printItem("present", item);
-    }
-    if (last && !options_.listFirst && !json_)
-      std::cerr << "watching " << names_.size() << " items" << std::endl;
-    std::cout << std::flush;
-    if (last && options_.once) finish(nullptr);
-  }
-
-  void updated(const std::vector<ItemFields>& items) {
-    for (const ItemFields& item : items) {
-      const auto [known, isNew] = names_.insert_or_assign(item.identifier, item.filename);
-      printItem(isNew ? "added" : "changed", item);
-    }
-    std::cout << std::flush;
-  }
-
-  void deleted(const std::vector<std::string>& identifiers) {
-    for (const std::string& identifier : identifiers) {
-      const auto known = names_.find(identifier);
-      printRemoval(identifier, known == names_.end() ? identifier : known->second);
-      if (known != names_.end()) names_.erase(known);
-    }
-    std::cout << std::flush;
-  }
-
-  void paused(const NSErrorRef& error) {
-    if (json_) {
-      std::cout << nlohmann::ordered_json{{"event", "paused"}, {"error", errorJson(error)}}.dump()
-                << std::endl;
-    } else {
-      std::cerr << "waiting: " << failureText(error) << std::endl;
-    }
-  }
-
-  void resumed() {
-    if (json_) {
-      std::cout << nlohmann::ordered_json{{"event", "resumed"}}.dump() << std::endl;
-    } else {
-      std::cerr << "watching again" << std::endl;
-    }
-  }
+  explicit RunningWatch(const ChangePrinter::Options& options)
+      : printer(std::cout, std::cerr, options) {}
 
   void finish(NSErrorRef error) {
     LockGuard guard(mutex_);
-    finished_ = true;
+    isFinished_ = true;
     error_ = std::move(error);
     ended_.notifyAll();
   }
-
   NSErrorRef waitUntilFinished() {
     LockGuard guard(mutex_);
-    while (!finished_) ended_.wait(mutex_);
+    while (!isFinished_) ended_.wait(mutex_);
     return error_;
   }
 
+  ChangePrinter printer;  // loop thread
+
  private:
-  void printItem(const char* event, const ItemFields& item) {
-    if (json_) {
-      const nlohmann::ordered_json line{{"event", event}, {"item", itemJson(item)}};
-      std::cout << line.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace) << "\n";
-    } else {
-      std::cout << event << std::string(9 - std::string(event).size(), ' ')
-                << itemLine(item, OutputForm::Short) << "\n";
-    }
-  }
-
-  void printRemoval(const std::string& identifier, const std::string& name) {
-    if (json_) {
-      std::cout << nlohmann::ordered_json{{"event", "removed"}, {"id", identifier}}.dump() << "\n";
-    } else {
-      std::cout << "removed  " << printableName(name) << "\n";
-    }
-  }
-
-  const bool json_;
-  const WatchOptions options_;
-  std::map<NSFileProviderItemIdentifier, std::string> names_;  // loop thread
-
   Mutex mutex_;
   Condition ended_;
-  bool finished_ GUARDED_BY(mutex_) = false;
+  bool isFinished_ GUARDED_BY(mutex_) = false;
   NSErrorRef error_ GUARDED_BY(mutex_);
 };
 
-/// The capability that the host calls; hands everything to the printer.
+/// The capability that the host calls; hands everything to the watch.
 class WatcherServer final : public protocol::Watcher::Server {
  public:
-  explicit WatcherServer(std::shared_ptr<ChangePrinter> printer) : printer_(std::move(printer)) {}
+  explicit WatcherServer(std::shared_ptr<RunningWatch> watch) : watch_(std::move(watch)) {}
 
   kj::Promise<void> didList(DidListContext context) override {
-    printer_->listed(decoded(context.getParams().getItems()), context.getParams().getLast());
+    const auto params = context.getParams();
+    const bool isAll = watch_->printer.listed(decoded(params.getItems()), params.getLast());
+    if (isAll) watch_->finish(nullptr);
     return kj::READY_NOW;
   }
   kj::Promise<void> didUpdate(DidUpdateContext context) override {
-    printer_->updated(decoded(context.getParams().getItems()));
+    watch_->printer.updated(decoded(context.getParams().getItems()));
     return kj::READY_NOW;
   }
   kj::Promise<void> didDelete(DidDeleteContext context) override {
     std::vector<std::string> identifiers;
     for (const auto identifier : context.getParams().getIdentifiers())
       identifiers.emplace_back(identifier.cStr());
-    printer_->deleted(identifiers);
+    watch_->printer.deleted(identifiers);
     return kj::READY_NOW;
   }
   kj::Promise<void> didPause(DidPauseContext context) override {
-    printer_->paused(ipc::decodeError(context.getParams().getError()));
+    watch_->printer.paused(ipc::decodeError(context.getParams().getError()));
     return kj::READY_NOW;
   }
   kj::Promise<void> didResume(DidResumeContext) override {
-    printer_->resumed();
+    watch_->printer.resumed();
     return kj::READY_NOW;
   }
 
@@ -156,18 +80,18 @@ class WatcherServer final : public protocol::Watcher::Server {
     return fields;
   }
 
-  const std::shared_ptr<ChangePrinter> printer_;
+  const std::shared_ptr<RunningWatch> watch_;
 };
 
 NSErrorRef startWatch(const ipc::Remote<protocol::Control>& control,
                       const NSFileProviderItemIdentifier& container,
-                      const std::shared_ptr<ChangePrinter>& printer,
+                      const std::shared_ptr<RunningWatch>& watch,
                       ipc::Remote<protocol::Watch>& registration) {
   return ipc::callAndWait(
       control, &protocol::Control::Client::watchRequest,
       [&](auto params) {
         params.setContainer(container);
-        params.setWatcher(kj::heap<WatcherServer>(printer));
+        params.setWatcher(kj::heap<WatcherServer>(watch));
       },
       [&](auto results) {
         registration = ipc::Remote<protocol::Watch>(results.getRegistration());
@@ -176,17 +100,18 @@ NSErrorRef startWatch(const ipc::Remote<protocol::Control>& control,
 
 /// Watches until the host is lost or the user interrupts; the signal's default action ends us.
 void watchContainer(CommandContext& context, const NSFileProviderItemIdentifier& container,
-                    const WatchOptions& options) {
+                    ChangePrinter::Options options) {
   DriveClient client(context.paths());
   NSErrorRef error;
   const auto control = client.control(&error);
   if (error) return context.fail(error);
-  auto printer = std::make_shared<ChangePrinter>(context.json, options);
+  options.json = context.json;
+  const auto watch = std::make_shared<RunningWatch>(options);
   client.controlConnection()->onDisconnect(
-      [printer](NSErrorRef failure) { printer->finish(std::move(failure)); });
+      [watch](NSErrorRef failure) { watch->finish(std::move(failure)); });
   ipc::Remote<protocol::Watch> registration;
-  error = startWatch(control, container, printer, registration);
-  if (!error) error = printer->waitUntilFinished();
+  error = startWatch(control, container, watch, registration);
+  if (!error) error = watch->waitUntilFinished();
   if (error) context.fail(error);
 }
 

@@ -1,0 +1,28 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+#include "platform/foundation/drive_paths.h"
+#include "platform/foundation/error.h"
+
+namespace yomber {
+
+/// The mount of a drive: there is at most one. Used on the main thread.
+
+/// Where the drive is mounted; nothing when it is not.
+[[nodiscard]] std::optional<std::string> mountPointOf(const DrivePaths& paths);
+
+struct MountOptions {
+  std::string folder;  ///< absolute
+  bool allowOthers = false;
+  std::optional<std::uint64_t> keep;  ///< bytes of content on this disk, at most; nothing: any
+};
+/// Returns when the mount can be used. Fails with what to do; the drive is then not mounted.
+[[nodiscard]] NSErrorRef mountDrive(const DrivePaths& paths, const MountOptions& options);
+/// Files that are open through the mount stay as they are on the disk, but cannot be used through
+/// it any more.
+[[nodiscard]] NSErrorRef unmountDrive(const DrivePaths& paths, bool& wasMounted);
+
+}  // namespace yomber

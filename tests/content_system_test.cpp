@@ -17,6 +17,7 @@
 
 #include "platform/ostrell/constants.h"
 #include "tests/harness/content_client.h"
+#include "tests/harness/file_contents.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -40,11 +41,6 @@ struct Look {
 
   friend bool operator==(const Look&, const Look&) = default;
 };
-
-std::string contentOf(const std::string& path) {
-  std::ifstream file(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(file), {}};
-}
 
 std::map<std::string, std::string> attributesOf(const std::string& path) {
   std::map<std::string, std::string> result;
@@ -71,22 +67,6 @@ Look lookAt(const std::string& path) {
           .mode = status.stx_mode,
           .modified = status.stx_mtime.tv_sec * 1'000'000'000 + status.stx_mtime.tv_nsec,
           .created = status.stx_btime.tv_sec * 1'000'000'000 + status.stx_btime.tv_nsec};
-}
-
-std::uint64_t bytesOnDisk(const std::string& path) {
-  struct stat status{};
-  EXPECT_EQ(lstat(path.c_str(), &status), 0) << path;
-  return static_cast<std::uint64_t>(status.st_blocks) * 512;
-}
-
-/// Bytes that no other seed gives.
-std::string someContent(std::size_t size, std::uint32_t seed) {
-  std::string content(size, '\0');
-  for (char& byte : content) {
-    seed = seed * 1664525U + 1013904223U;
-    byte = static_cast<char>(seed >> 24U);
-  }
-  return content;
 }
 
 class ContentSystem : public ::testing::Test {

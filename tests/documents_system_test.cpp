@@ -13,6 +13,7 @@
 
 #include "platform/ostrell/constants.h"
 #include "tests/harness/content_client.h"
+#include "tests/harness/file_contents.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -21,20 +22,6 @@ namespace {
 namespace fs = std::filesystem;
 using Local = ContentClient::Local;
 using Upload = ContentClient::Upload;
-
-std::string contentOf(const std::string& path) {
-  std::ifstream file(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(file), {}};
-}
-
-std::string someContent(std::size_t size, std::uint32_t seed) {
-  std::string content(size, '\0');
-  for (char& byte : content) {
-    seed = seed * 1664525U + 1013904223U;
-    byte = static_cast<char>(seed >> 24U);
-  }
-  return content;
-}
 
 /// Written as editors do: made anew, or emptied, then written and synced.
 void writeFile(const std::string& path, const std::string& content, int flags) {

@@ -11,6 +11,7 @@
 #include <gtest/gtest.h>
 
 #include "tests/harness/content_client.h"
+#include "tests/harness/file_contents.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -23,20 +24,6 @@ using Upload = ContentClient::Upload;
 constexpr std::uintmax_t kDiskSize = 48 << 20;
 constexpr std::size_t kSize = 3 << 20;
 constexpr int kNoRoom = 28;
-
-std::string someContent(std::size_t size, std::uint32_t seed) {
-  std::string content(size, '\0');
-  for (char& byte : content) {
-    seed = seed * 1664525U + 1013904223U;
-    byte = static_cast<char>(seed >> 24U);
-  }
-  return content;
-}
-
-std::string contentOf(const std::string& path) {
-  std::ifstream file(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(file), {}};
-}
 
 class FullDiskSystem : public ::testing::Test {
  protected:

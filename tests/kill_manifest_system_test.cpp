@@ -11,6 +11,7 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/foundation/sanitized.h"
 #include "tests/harness/test_drive.h"
 #include "tests/manifest/manifest_check.h"
 
@@ -19,13 +20,9 @@ namespace {
 
 using Process = TestDrive::Process;
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr std::uint64_t kShort = 5;
-constexpr const char* kWhyShort = " (fewer under a sanitizer, where everything takes longer)";
-#else
-constexpr std::uint64_t kShort = 25;
-constexpr const char* kWhyShort = "";
-#endif
+constexpr std::uint64_t kShort = kIsSanitized ? 5 : 25;
+constexpr const char* kWhyShort =
+    kIsSanitized ? " (fewer under a sanitizer, where everything takes longer)" : "";
 
 std::uint64_t numberFromEnvironment(const char* name, std::uint64_t otherwise) {
   const char* const text = std::getenv(name);

@@ -14,6 +14,7 @@
 #include <gtest/gtest.h>
 
 #include "platform/foundation/file_descriptor.h"
+#include "platform/foundation/sanitized.h"
 #include "tests/harness/watch_process.h"
 
 namespace yomber::testing {
@@ -21,18 +22,12 @@ namespace {
 
 namespace fs = std::filesystem;
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool isSanitized = true;
-#else
-constexpr bool isSanitized = false;
-#endif
-
 /// For what takes some seconds on a machine that has nothing else to do.
 constexpr std::chrono::minutes kLongPatience{3};
 
 /// How many of something a test makes: fewer under sanitizers, which it says.
 int scaled(int full, int sanitized) {
-  if (!isSanitized) return full;
+  if (!kIsSanitized) return full;
   std::cout << "sanitizers are slow: " << sanitized << " instead of " << full << std::endl;
   return sanitized;
 }
@@ -183,7 +178,7 @@ TEST_F(Limits, TheDaemonKeepsNothingOfAHundredClientsThatWereKilled) {
   for (int round = 0; round < 100; ++round) visitAndDie(round % 2 == 0);
   nlohmann::json late = settled();
   EXPECT_LE(late["open_descriptors"].get<int>(), early["open_descriptors"].get<int>() + 2);
-  const long growth = (isSanitized ? 32 : 4) * 1'000'000L;
+  const long growth = (kIsSanitized ? 32 : 4) * 1'000'000L;
   EXPECT_LE(late["resident_bytes"].get<long>(), early["resident_bytes"].get<long>() + growth);
 }
 

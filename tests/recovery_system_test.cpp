@@ -82,6 +82,9 @@ TEST_F(Recovery, AStoppedDaemonIsNoDisconnectAndGoesOnAfterwards) {
   EXPECT_FALSE(stuck.timedOut);
   EXPECT_NE(stuck.exitCode, 0);
   EXPECT_FALSE(stuck.errors.empty());
+  // Without the host in between.
+  const ProcessResult emptying = drive_.yomber({"trash", "--empty"});
+  EXPECT_EQ(emptying.exitCode, 69) << emptying.errors;
   kill(daemon, SIGCONT);
   EXPECT_TRUE(eventually([&] { return drive_.yomber({"ls"}).output == "kept\n"; }));
 }

@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/foundation/sanitized.h"
 #include "tests/harness/content_client.h"
 #include "tests/harness/odd_files.h"
 #include "tests/harness/test_drive.h"
@@ -19,12 +20,6 @@ namespace fs = std::filesystem;
 using Local = ContentClient::Local;
 using Upload = ContentClient::Upload;
 using Looks = std::map<std::string, FileLook>;
-
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool kIsSanitized = true;
-#else
-constexpr bool kIsSanitized = false;
-#endif
 
 constexpr std::chrono::minutes kLongPatience{15};
 constexpr std::uint64_t kLargestFault = 8192;

@@ -16,7 +16,8 @@ inline constexpr std::uint8_t kDeaf = 4;     ///< replies are not read
 inline constexpr std::uint8_t kPatient = 8;  ///< the server has time to answer before the end
 inline constexpr std::uint8_t kNoProof =
     16;  ///< on a pair: the bytes come in place of the handshake
-inline constexpr std::uint8_t kDroplets = 32;  ///< a few bytes at a time
+inline constexpr std::uint8_t kDroplets = 32;      ///< a few bytes at a time
+inline constexpr std::uint8_t kSecondServer = 64;  ///< to the second of a target's two servers
 
 /// Bytes of a framed input that make one message: behind their number, in 16 bits.
 struct Chunk {

@@ -21,6 +21,7 @@
 #include "protocols/control.capnp.h"
 #include "protocols/daemon.capnp.h"
 #include "protocols/extension.capnp.h"
+#include "protocols/services.capnp.h"
 #include "tests/fuzz/expect.h"
 #include "tests/fuzz/fixed_home.h"
 #include "tests/fuzz/hostile_input.h"
@@ -41,7 +42,9 @@ struct Call {
 
 class Corpus {
  public:
-  Corpus(const std::string& directory, const char* target) : folder_(directory + "/" + target) {
+  /// `mode` is added to how each script is sent.
+  Corpus(const std::string& directory, const char* target, std::uint8_t mode = 0)
+      : folder_(directory + "/" + target), mode_(mode) {
     std::filesystem::create_directories(folder_);
   }
 
@@ -52,8 +55,9 @@ class Corpus {
     expect(file.good(), "a seed was written");
   }
   void add(const std::string& name, const RpcScript& script) const {
-    add(name, script.input(kPatient));
-    add(name + "-framed", script.input(kFramed | kPatient));
+    const auto mode = static_cast<std::uint8_t>(mode_ | kPatient);
+    add(name, script.input(mode));
+    add(name + "-framed", script.input(static_cast<std::uint8_t>(mode | kFramed)));
   }
   /// One input for each call, and one with all of them.
   void addCalls(capnp::InterfaceSchema interface, const std::vector<Call>& calls) const {
@@ -91,6 +95,7 @@ class Corpus {
   }
 
   const std::string folder_;
+  const std::uint8_t mode_;
 };
 
 /// What is done with items, by identifier; the same for extension and host.
@@ -221,6 +226,48 @@ void addExtensionSeeds(const Corpus& corpus) {
   }
 }
 
+void addServiceSeeds(const Corpus& sharing, const Corpus& collaboration) {
+  const std::string share =
+      "(call = 1, share = (share = (zoneName = \"share-1\", zoneOwner = \"ada\", rootRecord = "
+      "\"2001\", changeTag = \"1\", type = \"document\", title = \"a document\", ownerName = "
+      "\"ada\", participants = [(userName = \"ada\", role = 1, permission = 3, acceptanceStatus = "
+      "2), (userName = \"bob\", role = 3, permission = 2, acceptanceStatus = 1)], "
+      "publicPermission = 2, url = (value = \"yomber-share:abc\"))))";
+  sharing.addCalls(Schema::from<protocol::SharingService>(),
+                   {{"fetchSharingInfo", "()"},
+                    {"preflight", "(call = 1)"},
+                    {"participants", "(call = 2)"},
+                    {"startPreparing", "(forcing = true)"},
+                    {"fetchShare", "(call = 3)"},
+                    {"fetchShareUrl", "(call = 4)"},
+                    {"saveShare", share},
+                    {"unshare", "(call = 5)"}});
+  collaboration.addCalls(Schema::from<protocol::CollaborationService>(),
+                         {{"fetchVersionAndCapabilities", "()"},
+                          {"setEnvironmentType", "(type = 1)"},
+                          {"fetchCollaborationToken", "(call = 1)"},
+                          {"fetchLatestRevision", "(call = 2)"},
+                          {"refreshSharingState", "(call = 3)"},
+                          {"fetchPrivacyState", "(call = 4)"},
+                          {"documentIsInUse", "(timeout = 2.5)"},
+                          {"fetchFileProviderIdentifier", "()"},
+                          {"fetchUrlForSharingFile", "()"},
+                          {"fetchFolderSharingState", "(call = 5)"},
+                          {"fetchSharedFolderInfo", "(call = 6)"}});
+  const auto peer = Schema::from<protocol::ServicePeer>();
+  sharing.addCalls(peer, {{"progressed", "(call = 1, totalUnits = 2, completedUnits = 1)"},
+                          {"cancel", "(call = 1)"},
+                          {"goodbye", "()"}});
+  RpcScript cancelling;
+  const auto server = cancelling.bootstrap();
+  cancelling.call(server, Schema::from<protocol::SharingService>(), "fetchShare", "(call = 1)");
+  cancelling.call(server, peer, "cancel", "(call = 1)");
+  cancelling.call(server, Schema::from<protocol::SharingService>(), "unshare", "(call = 2)");
+  cancelling.call(server, peer, "cancel", "(call = 2)");
+  cancelling.call(server, peer, "goodbye");
+  sharing.add("cancelling", cancelling);
+}
+
 template <typename Root, typename Fill>
 void addMessage(const Corpus& corpus, const char* name, Fill fill) {
   capnp::MallocMessageBuilder message;
@@ -276,6 +323,8 @@ int main(int argc, char** argv) {
   addDaemonSeeds(Corpus(directory, "daemon_socket"));
   addControlSeeds(Corpus(directory, "control_socket"));
   addExtensionSeeds(Corpus(directory, "extension_socket"));
+  addServiceSeeds(Corpus(directory, "service_socket"),
+                  Corpus(directory, "service_socket", kSecondServer));
   addMessageSeeds(Corpus(directory, "wire_items"));
   return 0;
 }

@@ -102,7 +102,7 @@ void TestDrive::up(const std::vector<std::string>& command) {
 }
 
 void TestDrive::signIn() {
-  const ProcessResult signedIn = yomber({"account", "sign-in", "ada"});
+  const ProcessResult signedIn = yomber({"account", "sign-in", account_});
   require(signedIn.exitCode == 0, signedIn.errors);
 }
 
@@ -181,8 +181,9 @@ pid_t TestDrive::pidOf(Process process) const {
     }
     return found.has_value();
   });
-  EXPECT_TRUE(found.has_value()) << "the process is not there";
-  return found.value_or(-1);
+  // No number stands for "none" here: a test may kill what it gets.
+  require(found.has_value(), "the process is not there");
+  return *found;
 }
 
 void TestDrive::kill(Process process) const {

@@ -29,6 +29,8 @@ class TestDrive {
   /// kill -9 of all its processes at once, as when the machine stops. Returns when they are gone.
   void crash();
   void signIn();
+  /// Who signs in; set before `up`.
+  void setAccount(const std::string& name) { account_ = name; }
 
   [[nodiscard]] const std::string& home() const { return home_; }
   /// The root folder on disk. Exists from the start, so that a test can fill it before `up`.
@@ -63,6 +65,7 @@ class TestDrive {
   std::string home_;
   std::string root_;
   Environment environment_;
+  std::string account_ = "ada";
   bool up_ = false;
   pid_t supervisor_ = -1;
 };

@@ -22,8 +22,12 @@ void Load::start() {
   }
 }
 
-void Load::stop() {
+void Load::requestStop() {
   for (std::jthread& thread : threads_) thread.request_stop();
+}
+
+void Load::stop() {
+  requestStop();
   threads_.clear();
 }
 

@@ -17,6 +17,8 @@ class Load {
 
   void begin();
   void start();
+  /// Nobody begins anything new.
+  void requestStop();
   /// Returns when everybody has finished what they were doing.
   void stop();
   /// Waits until so many more things were done; false when nobody gets on.

@@ -1,0 +1,88 @@
+#include "tests/harness/mounted_drive.h"
+
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <optional>
+#include <stdexcept>
+
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace yomber::testing {
+
+namespace fs = std::filesystem;
+
+namespace {
+
+/// A process's words, each with a zero behind it; empty when it has ended.
+std::string commandLineOf(const fs::path& process) {
+  std::string words;
+  std::FILE* const file = std::fopen((process / "cmdline").c_str(), "r");
+  if (file == nullptr) return words;
+  for (int byte = std::fgetc(file); byte != EOF; byte = std::fgetc(file)) {
+    words += static_cast<char>(byte);
+  }
+  (void)std::fclose(file);
+  return words;
+}
+
+/// The process of that name among whose arguments is `argument`.
+std::optional<pid_t> processWith(const std::string& name, const std::string& argument) {
+  const std::string wanted = std::string(1, '\0') + argument + std::string(1, '\0');
+  for (const auto& process : fs::directory_iterator("/proc")) {
+    const std::string words = commandLineOf(process.path());
+    const std::string program = fs::path(words.c_str()).filename();
+    if (program == name && words.find(wanted) != std::string::npos) {
+      return std::stoi(process.path().filename());
+    }
+  }
+  return std::nullopt;
+}
+
+}  // namespace
+
+MountedDrive::MountedDrive() {
+  std::string pattern = (fs::temp_directory_path() / "yomber-mount-XXXXXX").string();
+  if (mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("no folder to mount in");
+  folder_ = pattern;
+  chmod(folder_.c_str(), 0755);
+  drive_.up();
+  mount();
+}
+
+MountedDrive::~MountedDrive() {
+  unmount();
+  (void)umount2(folder_.c_str(), MNT_DETACH);
+  std::error_code failure;
+  fs::remove(folder_, failure);
+}
+
+std::string MountedDrive::onDisk(const std::string& path) const {
+  return drive_.root() + "/" + path;
+}
+
+void MountedDrive::mount(const std::vector<std::string>& options) {
+  std::vector<std::string> command{"mount", folder_};
+  command.insert(command.end(), options.begin(), options.end());
+  const ProcessResult result = drive_.yomber(command);
+  if (result.exitCode != 0) {
+    throw std::runtime_error("the drive cannot be mounted: " + result.errors);
+  }
+}
+
+void MountedDrive::unmount() { (void)drive_.yomber({"unmount"}); }
+
+pid_t MountedDrive::pid() const {
+  std::optional<pid_t> found;
+  (void)eventually([&] {
+    found = processWith("yomber-mount", folder_);
+    return found.has_value();
+  });
+  // No number stands for "none" here: a test may kill what it gets.
+  if (!found) throw std::runtime_error("the drive's mount has no process");
+  return *found;
+}
+
+}  // namespace yomber::testing

@@ -54,6 +54,25 @@ TEST_F(ShareLeavingTest, WhatAParticipantMovedIntoItBeforeHeHeardStaysHis) {
   EXPECT_TRUE(hasOwnRecord("bob", letter));
 }
 
+TEST_F(ShareLeavingTest, WhatAParticipantMovedIntoItBeforeAnybodySawStaysHis) {
+  bob->write("thesis.doc", kLong);
+  bob->makeFolder("Letters");
+  bob->write("Letters/one.txt", "dear Ann");
+  bob->settle();
+  const std::uint64_t thesis = bob->id("thesis.doc");
+  const std::uint64_t letter = bob->id("Letters/one.txt");
+  shareFolder(editor("bob"));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  bob->rename("thesis.doc", "Plans/Old/draft.doc");
+  bob->rename("Letters", "Plans/Post");
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), (Names{"Post", "draft.doc"}));
+  EXPECT_EQ(bob->read("draft.doc"), kLong);
+  EXPECT_EQ(bob->read("Post/one.txt"), "dear Ann");
+  EXPECT_EQ(bob->id("draft.doc"), thesis);
+  EXPECT_EQ(bob->id("Post/one.txt"), letter);
+}
+
 TEST_F(ShareLeavingTest, WhatAParticipantSharesHimselfStaysShared) {
   bob->makeFolder("Mine");
   bob->write("Mine/m.txt", "mine");

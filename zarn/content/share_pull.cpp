@@ -162,6 +162,7 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
   hasFolders_ = false;
   settled_.clear();
   forgotten_.clear();
+  placed_.clear();
   dirty_.clear();
   inside_.clear();
   if (NSErrorRef error = read(items)) return error;
@@ -171,7 +172,8 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
   if (!error && pullPlaced.hit()) error = NSError::errorWithErrno(EIO);
   if (!error) error = storeContents(items, token, Step::Done);
   for (const auto& [id, path] : staged_) tree_.drop(path);
-  const NSErrorRef failure = scan();
+  NSErrorRef failure = scan();
+  if (!failure) failure = noteUnseenRemovals();
   return error ? error : failure;
 }
 
@@ -323,9 +325,10 @@ void SharePull::placeNew(SharedItem& item, const std::string& folder) {
     const auto parent = core_.items->itemAtPath(folder);
     if (parent) noteDirty(parent->id, item.path);
     rootPath_ = item.path;
-  } else if (!newFolders_.contains(item.record->parent)) {
-    noteDirty(item.record->parent, item.path);
+    return;
   }
+  placed_[item.id] = item.path;
+  if (!newFolders_.contains(item.record->parent)) noteDirty(item.record->parent, item.path);
 }
 
 // --- Known ones.
@@ -518,6 +521,7 @@ NSErrorRef SharePull::scan() {
   if (folders.empty()) return nullptr;
   std::vector<DirtyFolder> notFound;
   NSErrorRef error = core_.scanner->scanDirty(folders, notFound);
+  if (!notFound.empty()) placed_.clear();  // what is not there may be on its way
   // Others may look at the same time, and leave it to each other.
   const std::string root = std::exchange(rootPath_, {});
   if (!error && !root.empty() && !core_.items->itemByID(share_.root))

@@ -61,6 +61,7 @@ class SharePull {
   void moveOut(SharedItem& item);
   [[nodiscard]] std::string folderForCopies(const SharedItem& item) const;
   NSErrorRef clearOut(const SharedItem& item);
+  NSErrorRef noteUnseenRemovals();
 
   enum class Step : bool { Prepared, Done };
   NSErrorRef storeContents(const Items& items, const RZChangeToken* token, Step step);
@@ -80,6 +81,8 @@ class SharePull {
   std::set<std::uint64_t> busy_;                               ///< of these, those in use
   std::set<std::uint64_t> settled_;                            ///< were taken over, or need not be
   std::set<std::uint64_t> forgotten_;                          ///< have no record any more
+  std::unordered_map<std::uint64_t, std::string>
+      placed_;               ///< new on this page, where they were put
   std::string rootPath_;     ///< where the shared item was put on this page
   bool isAtEnd_ = false;     ///< there are no more changes
   bool hasFolders_ = false;  ///< this page has brought some

@@ -6,6 +6,7 @@
 #include "platform/foundation/log.h"
 #include "zarn/content/share_pull.h"
 #include "zarn/row_queries.h"
+#include "zarn/write_transaction.h"
 
 namespace yomber {
 namespace {
@@ -115,6 +116,30 @@ NSErrorRef SharePull::clearOut(const SharedItem& item) {
     if (parent) noteDirty(parent->id, folder + '/' + name);
   }
   return nullptr;
+}
+
+/// What somebody has removed between the moment in which it was put here and the first look at it
+/// has never had a row, whose end would tell the store.
+NSErrorRef SharePull::noteUnseenRemovals() {
+  std::vector<std::uint64_t> gone;
+  struct stat status{};
+  for (const auto& [id, path] : placed_) {
+    if (lstat(path.c_str(), &status) != 0 && errno == ENOENT) gone.push_back(id);
+  }
+  if (gone.empty()) return nullptr;
+  NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    const std::int64_t now = core_.now();
+    for (const std::uint64_t id : gone) {
+      const auto content = findContent(connection, id);
+      const bool isKnown = findByID(connection, id) || findJob(connection, id, JobKind::Upload);
+      if (!content || content->zone != share_.zone || isKnown) continue;
+      addJob(connection, id, JobKind::Upload, content->account, now, now);
+    }
+    return NSErrorRef();
+  });
+  core_.queue->noteJobs(JobKind::Upload);
+  return error;
 }
 
 }  // namespace yomber

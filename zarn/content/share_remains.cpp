@@ -165,9 +165,12 @@ NSErrorRef ShareRemains::keepOne(const std::string& path, bool isTop,
     return errno == ENOENT ? nullptr : NSError::errorWithErrno(errno, path);
   const auto known = items_.byInode.find(status.st_ino);
   const bool isKnown = known != items_.byInode.end();
-  if (!isKnown && !isTop) return keepUnknown(path);
+  if (!isKnown && !isTop) return keepUnseen(path, status);
   const bool isFolder = S_ISDIR(status.st_mode);
-  if (isKnown && !isTop && known->second.fate == Fate::Stays) return keepOwn(path, known->second);
+  if (isKnown && !isTop && known->second.fate == Fate::Stays) {
+    const GoingItems::Item& own = known->second;
+    return keepOwn(path, own.parent, lastOf(path), own.isOtherShare);
+  }
   if (isFolder) return listFolder(path, rest);
   const std::optional<ContentRow> content = isKnown ? known->second.content : std::nullopt;
   if (!isUnsaved(path, content) && !isBeingWritten(path)) return nullptr;
@@ -184,22 +187,39 @@ NSErrorRef ShareRemains::keepCopy(const std::string& path, const std::string& na
   return error;
 }
 
-NSErrorRef ShareRemains::keepOwn(const std::string& path, const GoingItems::Item& item) const {
+NSErrorRef ShareRemains::keepOwn(const std::string& path, std::uint64_t parent,
+                                 const std::string& nameThere, bool isOtherShare) const {
   const auto folder = core_.items->itemAtPath(folder_);
   if (!folder) return NSError::errorWithErrno(EAGAIN, folder_);
   std::string name = lastOf(path);
   if (NSErrorRef error = tree_.place(path, folder_, name)) return error;
   const std::string place = folder_ + '/' + name;
-  if (!item.isOtherShare) makeWritable(tree_, place);
+  if (!isOtherShare) makeWritable(tree_, place);
   log_default(defaultLog(), "[NOTICE] what was this account's own is now %@", place);
   // Both ends as one change: it is the same item.
   std::vector<DirtyFolder> dirty(2);
-  dirty[0].id = item.parent;
-  dirty[0].names = {lastOf(path)};
+  dirty[0].id = parent;
+  dirty[0].names = {nameThere};
   dirty[1].id = folder->id;
   dirty[1].names = {name};
   std::vector<DirtyFolder> notFound;
   return core_.scanner->scanDirty(dirty, notFound);
+}
+
+/// What was moved in before anybody saw that has its row where it was.
+NSErrorRef ShareRemains::keepUnseen(const std::string& path, const struct stat& status) {
+  std::optional<ItemRow> elsewhere;
+  bool isOtherShare = false;
+  NSErrorRef error = core_.database().read([&](Connection& connection) {
+    for (ItemRow& row : findByInode(connection, status.st_ino)) {
+      if (row.isFolder() != S_ISDIR(status.st_mode)) continue;
+      isOtherShare = findShare(connection, row.id).has_value();
+      elsewhere = std::move(row);
+    }
+  });
+  if (error) return error;
+  if (!elsewhere) return keepUnknown(path);
+  return keepOwn(path, elsewhere->parent, elsewhere->nameOnDisk(), isOtherShare);
 }
 
 NSErrorRef ShareRemains::keepUnknown(const std::string& path) {

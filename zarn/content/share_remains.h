@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/stat.h>
+
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -57,7 +59,10 @@ class ShareRemains {
  private:
   NSErrorRef keepOne(const std::string& path, bool isTop, std::vector<std::string>& rest);
   NSErrorRef keepCopy(const std::string& path, const std::string& name) const;
-  NSErrorRef keepOwn(const std::string& path, const GoingItems::Item& item) const;
+  /// `parent`, `nameThere`: the place of its row.
+  NSErrorRef keepOwn(const std::string& path, std::uint64_t parent, const std::string& nameThere,
+                     bool isOtherShare) const;
+  NSErrorRef keepUnseen(const std::string& path, const struct stat& status);
   NSErrorRef keepUnknown(const std::string& path);
 
   const ContentCore& core_;

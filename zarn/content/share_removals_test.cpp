@@ -1,5 +1,7 @@
 #include <sys/stat.h>
 
+#include <thread>
+
 #include "platform/rozzel/record.h"
 #include "zarn/content/share_rows.h"
 #include "zarn/content/test_sharing.h"
@@ -106,6 +108,29 @@ TEST_F(ShareRemovalsTest, ARecordWhoseFolderIsNotKnownIsAskedForLaterUnlessSomeb
   ASSERT_EQ(bob->accept(share), nullptr);
   EXPECT_TRUE(bob->exists("Plans/Late/Late")) << "its folder has come";
   EXPECT_EQ(attemptsOf(inIt), -1);
+}
+
+TEST_F(ShareRemovalsTest, WhatIsRemovedBeforeItWasLookedAtIsRemovedForAll) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->makeFolder("Plans/Folder");
+  ann->write("Plans/Folder/in.txt", "in it");
+  ann->write("Plans/stays.txt", "stays");
+  ann->settle();
+  const std::string gate = storePath + "-go";
+  ASSERT_EQ(FaultPoint::arm("zarn.pull.placed=pause-until-file:" + gate), nullptr);
+  NSErrorRef error;
+  std::thread following([&] { error = bob->follow(); });
+  EXPECT_TRUE(waitUntil([&] { return std::filesystem::exists(gate + ".reached"); }));
+  FaultPoint::disarmAll();
+  bob->remove("Plans/new.txt");
+  bob->remove("Plans/Folder");
+  std::ofstream(gate).put('x');
+  following.join();
+  ASSERT_EQ(error, nullptr);
+  followBoth();
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt", "stays.txt"}));
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt", "stays.txt"}));
 }
 
 }  // namespace

@@ -70,7 +70,11 @@ TEST_F(ShareRemovalsTest, UnsavedWorkInAFolderThatItsOwnerDeletesIsKept) {
   bob->write("Plans/Old/b.txt", "unsaved by bob");
   ASSERT_EQ(bob->follow(), nullptr);
   bob->settle();
-  followBoth();
+  // An upload that was refused, as its folder had just gone, is tried again a moment later.
+  EXPECT_TRUE(waitUntil([&] {
+    followBoth();
+    return ann->exists("Plans/b (kept copy).txt");
+  }));
   EXPECT_EQ(bob->names("Plans"), (Names{"a.txt", "b (kept copy).txt"}));
   EXPECT_EQ(bob->read("Plans/b (kept copy).txt"), "unsaved by bob");
   EXPECT_EQ(ann->readWhole("Plans/b (kept copy).txt"), "unsaved by bob");

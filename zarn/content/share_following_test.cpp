@@ -45,7 +45,36 @@ TEST_F(ShareFollowingTest, WhatWasWrittenBeforeTheDatabaseWasLostIsKept) {
   bob->write("Plans/a.txt", "unsaved by bob");
   loseBobsDatabase();
   ASSERT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
-  ASSERT_EQ(bob->follow(), nullptr);
+  // What is still being looked at, as after every start, waits for the next pass.
+  EXPECT_TRUE(waitUntil(
+      [&] { return bob->follow() == nullptr && bob->exists("Plans/a (kept copy).txt"); }));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Plans/a (kept copy).txt"), "unsaved by bob");
+}
+
+TEST_F(ShareFollowingTest, WhatWasOnItsWayToTheOwnZoneWhenTheShareWasFoundIsKept) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  bob->write("Plans/a.txt", "unsaved by bob");
+  const std::uint64_t id = bob->id("Plans/a.txt");
+  const std::string uploading = storePath + "-upload";
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.committed=pause-until-file:" + uploading), nullptr);
+  loseBobsDatabase();
+  ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(uploading + ".reached"); }));
+  meanwhile("zarn.pull.fetched", [&] {
+    std::ofstream(uploading).put('x');
+    EXPECT_TRUE(waitUntil([&] {
+      bool isConfirmed = false;
+      EXPECT_EQ(bob->database->read([&](Connection& connection) {
+        const auto content = findContent(connection, id);
+        isConfirmed = content && content->content;
+      }),
+                nullptr);
+      return isConfirmed;
+    }));
+  });
+  EXPECT_TRUE(waitUntil(
+      [&] { return bob->follow() == nullptr && bob->exists("Plans/a (kept copy).txt"); }));
   EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
   EXPECT_EQ(bob->readWhole("Plans/a (kept copy).txt"), "unsaved by bob");
 }

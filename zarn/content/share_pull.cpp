@@ -377,7 +377,9 @@ void SharePull::applyContent(SharedItem& item) {
   // They came to the same, or it came here before it was noted.
   item.isFresh = !isUnsaved(item.path, wanted, &item.stamp);
   if (item.isFresh) return;
-  const bool isHeld = isUnsaved(item.path, item.content);
+  // What the account has elsewhere in the store goes from there when the item is of the share.
+  const bool isOfZone = item.content && item.content->zone == share_.zone;
+  const bool isHeld = isUnsaved(item.path, isOfZone ? item.content : std::nullopt);
   std::string staged;
   std::string displaced;
   const auto keep = [](bool isKept) {

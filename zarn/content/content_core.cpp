@@ -50,9 +50,8 @@ class SubjectReader {
 
  private:
   struct Folder {
-    std::string path;     ///< empty when it is gone
-    RZRecordZoneID zone;  ///< of what is in it; none where that is to be found out from the item
-    std::optional<ShareRow> share;
+    std::string path;   ///< empty when it is gone
+    ZoneSource source;  ///< of what is in it
     bool isInTrash = false;
     bool isPinned = false;
   };
@@ -65,8 +64,8 @@ class SubjectReader {
       subject.zone = RZRecordZoneID(row.extra->containerID);
     } else {
       if (!folder.path.empty()) subject.path = folder.path + '/' + row.nameOnDisk();
-      subject.zone = folder.zone;
-      subject.share = folder.share;
+      subject.zone = folder.source.zone;
+      subject.share = folder.source.share;
     }
     const auto own = isAnythingShared_ ? findShare(connection_, row.id) : std::nullopt;
     if (own && givesItsZone(*own) && own->account == account_) {
@@ -89,21 +88,7 @@ class SubjectReader {
     folder.path = items_.physicalPath(*chain);
     folder.isInTrash = chain->place == kTrashID;
     folder.isPinned = mayBePinned_ && isPinned(connection_, id);
-    bool mayBeShared = isAnythingShared_;
-    for (const ItemRow& row : chain->rows) {
-      auto share = mayBeShared ? findShare(connection_, row.id) : std::nullopt;
-      const bool isNearest = share && givesItsZone(*share);
-      if (isNearest) mayBeShared = false;
-      if (isNearest && share->account == account_) {
-        folder.zone = share->zone;
-        folder.share = std::move(share);
-      } else if (row.isContainerFolder()) {
-        folder.zone = RZRecordZoneID(row.extra->containerID);
-      } else {
-        continue;
-      }
-      break;
-    }
+    folder.source = findZoneSource(connection_, chain->rows, account_);
     return folder;
   }
 

@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 
 #include <algorithm>
-#include <limits>
 #include <thread>
 #include <utility>
 
@@ -364,7 +363,7 @@ ContentTransfer Engine::describe(const Job& job) const {
   result.kind = static_cast<ContentTransfer::Kind>(job.kind);
   result.attempts = job.attempts;
   result.failure = job.error;
-  const bool isGivenUp = job.due == std::numeric_limits<std::int64_t>::max();
+  const bool isGivenUp = job.due == kNeverDue;
   if (job.state != JobState::Waiting && !isGivenUp) result.nextAttempt = job.due;
   if (auto found = core_->items->located(job.item)) {
     result.path = std::move(found->path);

@@ -254,15 +254,8 @@ RZRecordZoneID zoneOf(Connection& connection, std::uint64_t id, const RZRecordZo
                       std::optional<std::int64_t> account) {
   const auto chain = findChain(connection, id);
   if (chain) {
-    bool mayBeShared = hasShares(connection);
-    for (const ItemRow& row : chain->rows) {
-      const auto share = mayBeShared ? findShare(connection, row.id) : std::nullopt;
-      if (share && givesItsZone(*share)) {
-        if (!account || share->account == *account) return share->zone;
-        mayBeShared = false;  // the nearest one decides
-      }
-      if (row.isContainerFolder()) return RZRecordZoneID(row.extra->containerID);
-    }
+    ZoneSource source = findZoneSource(connection, chain->rows, account);
+    if (!source.zone.zoneName().empty()) return std::move(source.zone);
     const bool isKept = !before.zoneName().empty() && !isSharedZone(before);
     if (chain->place == kTrashID && isKept) return before;
   }

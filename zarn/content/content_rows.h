@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <limits>
 #include <optional>
 #include <string>
 #include <vector>
@@ -27,6 +28,9 @@ inline constexpr std::size_t kJobKinds = 6;
 
 enum class JobState : std::uint8_t { Waiting, Retrying, OverQuota };
 
+/// When that is due which nothing but somebody's asking brings about any more.
+inline constexpr std::int64_t kNeverDue = std::numeric_limits<std::int64_t>::max();
+
 struct Job {
   std::int64_t seq = 0;
   std::uint64_t item = 0;
@@ -34,7 +38,7 @@ struct Job {
   std::int64_t account = 0;
   JobState state = JobState::Waiting;
   std::uint32_t attempts = 0;  ///< that failed
-  std::int64_t due = 0;        ///< ns since the epoch
+  std::int64_t due = 0;        ///< ns since the epoch, or kNeverDue: given up
   std::int64_t created = 0;    ///< ns since the epoch
   std::uint64_t size = 0;  ///< of the document as its row has it; only where jobs are handed out
   NSErrorRef error;        ///< of the last attempt

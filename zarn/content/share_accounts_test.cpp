@@ -12,24 +12,6 @@ class ShareAccountsTest : public TwoDrives {
   void signIn(const SharingDrive& drive, const std::string& account) const {
     drive.engine->setStore(std::make_shared<ContentStore>(records, account), account);
   }
-  /// The owners of the zones, as the account sees them, that have a record of the item.
-  [[nodiscard]] Names zonesWith(const std::string& account, std::uint64_t id) const {
-    Names names;
-    for (const RZDatabaseScope scope : {RZDatabaseScope::Private, RZDatabaseScope::Shared}) {
-      RZDatabaseID database{QSUbiquitousRozzelContainerIdentifier, account};
-      database.scope = scope;
-      std::vector<RZRecordZone> zones;
-      EXPECT_EQ(records->fetchZones(database, zones), nullptr);
-      for (const RZRecordZone& zone : zones) {
-        std::vector<RZFetchedRecord> found;
-        EXPECT_EQ(records->fetchRecords(database, {RZRecordID(std::to_string(id), zone.zoneID)},
-                                        std::nullopt, found),
-                  nullptr);
-        if (found.at(0).record) names.push_back(zone.zoneID.zoneName());
-      }
-    }
-    return names;
-  }
 };
 
 TEST_F(ShareAccountsTest, WhatAnotherAccountPutsIntoASharedFolderIsItsOwn) {
@@ -37,7 +19,9 @@ TEST_F(ShareAccountsTest, WhatAnotherAccountPutsIntoASharedFolderIsItsOwn) {
   signIn(*bob, "carol");
   bob->write("Plans/carols.txt", "by carol");
   bob->settle();
-  EXPECT_EQ(zonesWith("carol", bob->id("Plans/carols.txt")), Names{QSUbiquitousDefaultContainerID});
+  const std::uint64_t carols = bob->id("Plans/carols.txt");
+  EXPECT_EQ(zonesWith("carol", carols), Names{QSUbiquitousDefaultContainerID});
+  EXPECT_EQ(zonesWith("carol", carols, RZDatabaseScope::Shared), Names{});
   signIn(*bob, "bob");
   bob->settle();
   ASSERT_EQ(bob->follow(), nullptr);

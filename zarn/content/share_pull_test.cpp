@@ -14,27 +14,7 @@ namespace {
 
 using Names = std::vector<std::string>;
 
-class SharePullTest : public TwoDrives {
- protected:
-  void followBoth() {
-    for (int turn = 0; turn < 3; ++turn) {
-      ASSERT_EQ(bob->follow(), nullptr);
-      ASSERT_EQ(ann->follow(), nullptr);
-    }
-  }
-  /// Has Bob do something at a fault point of his taking over.
-  void meanwhile(const std::string& point, const std::function<void()>& work) {
-    const std::string gate = storePath + "-go";
-    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate), nullptr);
-    std::thread following([&] { (void)bob->follow(); });
-    const bool isReached = waitUntil([&] { return std::filesystem::exists(gate + ".reached"); });
-    if (isReached) work();
-    std::ofstream(gate).put('x');
-    following.join();
-    FaultPoint::disarmAll();
-    ASSERT_TRUE(isReached);
-  }
-};
+using SharePullTest = TwoDrives;
 
 TEST_F(SharePullTest, ANameThatLeadsElsewhereIsRefused) {
   ann->makeFolder("Folder");

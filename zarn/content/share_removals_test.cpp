@@ -1,7 +1,5 @@
 #include <sys/stat.h>
 
-#include <thread>
-
 #include "platform/rozzel/record.h"
 #include "zarn/content/share_rows.h"
 #include "zarn/content/test_sharing.h"
@@ -13,12 +11,6 @@ using Names = std::vector<std::string>;
 
 class ShareRemovalsTest : public TwoDrives {
  protected:
-  void followBoth() {
-    for (int turn = 0; turn < 3; ++turn) {
-      ASSERT_EQ(bob->follow(), nullptr);
-      ASSERT_EQ(ann->follow(), nullptr);
-    }
-  }
   /// A record of a document, as Ann saves it, in a folder that need not be there.
   void saveRecord(std::uint64_t id, std::uint64_t parent, const char* type) const {
     const auto record = std::make_shared<RZRecord>(
@@ -121,17 +113,10 @@ TEST_F(ShareRemovalsTest, WhatIsRemovedBeforeItWasLookedAtIsRemovedForAll) {
   ann->write("Plans/Folder/in.txt", "in it");
   ann->write("Plans/stays.txt", "stays");
   ann->settle();
-  const std::string gate = storePath + "-go";
-  ASSERT_EQ(FaultPoint::arm("zarn.pull.placed=pause-until-file:" + gate), nullptr);
-  NSErrorRef error;
-  std::thread following([&] { error = bob->follow(); });
-  EXPECT_TRUE(waitUntil([&] { return std::filesystem::exists(gate + ".reached"); }));
-  FaultPoint::disarmAll();
-  bob->remove("Plans/new.txt");
-  bob->remove("Plans/Folder");
-  std::ofstream(gate).put('x');
-  following.join();
-  ASSERT_EQ(error, nullptr);
+  meanwhile("zarn.pull.placed", [&] {
+    bob->remove("Plans/new.txt");
+    bob->remove("Plans/Folder");
+  });
   followBoth();
   EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt", "stays.txt"}));
   EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt", "stays.txt"}));

@@ -1,9 +1,10 @@
 #include "zarn/content/share_rows.h"
 
 #include <algorithm>
-#include <limits>
+#include <utility>
 
 #include "platform/rozzel/share.h"
+#include "zarn/content/content_rows.h"
 #include "zarn/row_queries.h"
 
 namespace yomber {
@@ -85,6 +86,22 @@ std::optional<ShareRow> findShareAbove(Connection& connection, std::uint64_t id)
   return std::nullopt;
 }
 
+ZoneSource findZoneSource(Connection& connection, const std::vector<ItemRow>& rows,
+                          std::optional<std::int64_t> account) {
+  bool mayBeShared = hasShares(connection);
+  for (const ItemRow& row : rows) {
+    auto share = mayBeShared ? findShare(connection, row.id) : std::nullopt;
+    if (share && givesItsZone(*share)) {
+      if (!account || share->account == *account)
+        return {.zone = share->zone, .share = std::move(share)};
+      mayBeShared = false;  // the nearest one decides
+    }
+    if (row.isContainerFolder())
+      return {.zone = RZRecordZoneID(row.extra->containerID), .share = std::nullopt};
+  }
+  return {};
+}
+
 void storeShare(Connection& connection, const ShareRow& row) {
   StatementUse statement(connection.prepared("INSERT OR REPLACE INTO share(" YOMBER_SHARE_COLUMNS
                                              ") VALUES(?1,?2,?3,?4,?5,?6,?7,?8,?9,?10)"));
@@ -159,7 +176,7 @@ void postponeWaitingRecord(Connection& connection, std::uint64_t root, std::uint
   statement->bindID(1, root);
   statement->bindID(2, record);
   statement->bindInteger(3, isLast ? attempts : attempts + 1);
-  statement->bindInteger(4, isLast ? std::numeric_limits<std::int64_t>::max() : now + pause);
+  statement->bindInteger(4, isLast ? kNeverDue : now + pause);
   statement->step();
 }
 

@@ -8,6 +8,7 @@
 
 #include "platform/rozzel/identifiers.h"
 #include "zarn/connection.h"
+#include "zarn/item_row.h"
 
 namespace yomber {
 
@@ -52,6 +53,14 @@ struct ShareRow {
 [[nodiscard]] std::vector<ShareRow> findShares(Connection& connection);
 /// The share that an item belongs to: its own, or that of the nearest folder above it; whosever.
 [[nodiscard]] std::optional<ShareRow> findShareAbove(Connection& connection, std::uint64_t id);
+/// What the rows from an item upwards say about the zone of an account's record. Of no account:
+/// what they say to whichever takes part in the share.
+struct ZoneSource {
+  RZRecordZoneID zone;            ///< without a name: neither a share nor a container
+  std::optional<ShareRow> share;  ///< whose zone it is
+};
+[[nodiscard]] ZoneSource findZoneSource(Connection& connection, const std::vector<ItemRow>& rows,
+                                        std::optional<std::int64_t> account);
 void storeShare(Connection& connection, const ShareRow& row);
 /// With the records that wait in it.
 void removeShare(Connection& connection, std::uint64_t root);

@@ -6,9 +6,11 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/foundation/fault_attributes.h"
@@ -208,6 +210,43 @@ class TwoDrives : public testing::Test {
     ASSERT_NE(share, nullptr);
     const NSErrorRef error = bob->accept(share);
     ASSERT_EQ(error, nullptr) << error->description();
+  }
+  /// Both take over, again and again, what the other has changed.
+  void followBoth() const {
+    for (int turn = 0; turn < 3; ++turn) {
+      ASSERT_EQ(bob->follow(), nullptr);
+      ASSERT_EQ(ann->follow(), nullptr);
+    }
+  }
+  /// Has something done at a fault point of Bob's taking over.
+  void meanwhile(const std::string& point, const std::function<void()>& work) const {
+    const std::string gate = storePath + "-go";
+    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate), nullptr);
+    std::thread following([&] { (void)bob->follow(); });
+    const bool isReached = waitUntil([&] { return std::filesystem::exists(gate + ".reached"); });
+    if (isReached) work();
+    std::ofstream(gate).put('x');
+    following.join();
+    FaultPoint::disarmAll();
+    ASSERT_TRUE(isReached);
+  }
+  /// The zones with a record of the item, among those that the account has or that it is shown.
+  [[nodiscard]] std::vector<std::string> zonesWith(
+      const std::string& account, std::uint64_t id,
+      RZDatabaseScope scope = RZDatabaseScope::Private) const {
+    RZDatabaseID database{QSUbiquitousRozzelContainerIdentifier, account};
+    database.scope = scope;
+    std::vector<RZRecordZone> zones;
+    EXPECT_EQ(records->fetchZones(database, zones), nullptr);
+    std::vector<std::string> names;
+    for (const RZRecordZone& zone : zones) {
+      std::vector<RZFetchedRecord> found;
+      EXPECT_EQ(records->fetchRecords(database, {RZRecordID(std::to_string(id), zone.zoneID)},
+                                      std::nullopt, found),
+                nullptr);
+      if (found.at(0).record) names.push_back(zone.zoneID.zoneName());
+    }
+    return names;
   }
   void goOffline() const { std::ofstream(storePath + "/offline").put('x'); }
   void comeBack() const { std::filesystem::remove(storePath + "/offline"); }

@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <limits>
 #include <memory>
 #include <utility>
 #include <vector>
@@ -406,7 +405,7 @@ class UploadGroup {
     Job job = upload.subject.job;
     ++job.attempts;
     job.state = JobState::Retrying;
-    job.due = std::numeric_limits<std::int64_t>::max();
+    job.due = kNeverDue;
     job.error = NSError::errorWithDomain(
         NSCocoaErrorDomain, NSFileReadCorruptFileError,
         {{NSLocalizedDescriptionKey,

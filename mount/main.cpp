@@ -1,7 +1,5 @@
 // yomber-mount, the drive as a folder: every application's way in.
 #include <fcntl.h>
-#include <malloc.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -23,10 +21,12 @@
 #include "mount/local_space.h"
 #include "mount/tree_changes.h"
 #include "platform/foundation/data_directories.h"
+#include "platform/foundation/descriptor_limit.h"
 #include "platform/foundation/drive_paths.h"
 #include "platform/foundation/ending_signals.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
+#include "platform/foundation/shared_heaps.h"
 #include "platform/ostrell/constants.h"
 
 namespace yomber {
@@ -87,18 +87,6 @@ int fail(const std::string& text) {
   (void)std::fprintf(stderr, "yomber-mount: %s\n", text.c_str());
   return kCannotStart;
 }
-
-/// Every file that an application has open is one of ours too.
-void allowManyFiles() {
-  rlimit limit{};
-  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
-  limit.rlim_cur = limit.rlim_max;
-  (void)setrlimit(RLIMIT_NOFILE, &limit);
-}
-
-/// What is kept for each file that the kernel knows is not to be spread over a heap for each
-/// thread.
-void shareHeaps() { (void)mallopt(M_ARENA_MAX, 2); }
 
 bool isBelow(const std::string& path, const std::string& folder) {
   return path == folder || path.starts_with(folder + "/");
@@ -174,7 +162,7 @@ int run(const std::vector<std::string>& given) {
   }
   const auto endingSignals = blockEndingSignals();
   umask(0);
-  allowManyFiles();
+  raiseDescriptorLimit();  // every file that an application has open is one of ours too
   shareHeaps();
   const auto paths =
       arguments->home ? DrivePaths::forHome(*arguments->home) : DrivePaths::forDefaultHome();

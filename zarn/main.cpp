@@ -20,6 +20,7 @@
 #include "platform/foundation/ending_signals.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
+#include "platform/foundation/shared_heaps.h"
 #include "platform/ipc/listener.h"
 #include "platform/ipc/unix_socket.h"
 #include "zarn/daemon_server.h"
@@ -76,11 +77,9 @@ int failLogged(int code, const NSErrorRef& error) {
   return fail(code, error->localizedDescription());
 }
 
-/// With a heap for nearly every thread, what one load has freed in its heap would help no other.
-void shareHeaps() {
-  constexpr int kHeaps = 2;
-  constexpr int kLargeBlock = 128 * 1024;  // given back as soon as it is free; fixed, not growing
-  (void)mallopt(M_ARENA_MAX, kHeaps);
+/// Large blocks are given back as soon as they are free, however many there were.
+void giveBackLargeBlocks() {
+  constexpr int kLargeBlock = 128 * 1024;
   (void)mallopt(M_MMAP_THRESHOLD, kLargeBlock);
 }
 
@@ -165,6 +164,7 @@ int run(const std::vector<std::string>& given) {
     return arguments ? 0 : kUsage;
   }
   shareHeaps();
+  giveBackLargeBlocks();
   const auto endingSignals = blockEndingSignals();
   closeStandardInput();
   const auto paths =

@@ -20,6 +20,7 @@
 #include "platform/foundation/drive_paths.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
+#include "platform/foundation/shared_heaps.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/connection.h"
 #include "platform/ipc/error_codec.h"
@@ -87,6 +88,7 @@ int NSExtensionMain(
   (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
   (void)std::signal(SIGPIPE, SIG_IGN);
   raiseDescriptorLimit();
+  shareHeaps();
   openLog("qs-fileprovider", DrivePaths::forDefaultHome());
   registerItemsInErrors();
 

@@ -1,5 +1,6 @@
 #include "platform/foundation/thread_pool.h"
 
+#include <malloc.h>
 #include <pthread.h>
 
 #include <algorithm>
@@ -85,9 +86,12 @@ class PoolThreads {
       }
     }
     --state.threads;
+    const bool isBurstOver = !state.closing && state.idle <= state.limits.keptIdleThreads;
     state.threadEnded.notifyAll();
     if (state.closing) state.stallPossible.notifyAll();
     state.mutex.unlock();
+    // What many at once have freed lies between what is still in use, and would stay with us.
+    if (isBurstOver) (void)malloc_trim(0);
   }
 
   static void runNext(State& state) REQUIRES(state.mutex) {

@@ -1,15 +1,20 @@
 #include "platform/foundation/thread_pool.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <atomic>
+#include <fstream>
 #include <memory>
+#include <string>
 #include <thread>
 #include <vector>
 
 #include "platform/foundation/gate.h"
 #include "platform/foundation/log.h"
+#include "platform/foundation/sanitized.h"
 
 namespace yomber {
 namespace {
@@ -87,6 +92,40 @@ TEST(ThreadPoolTest, LetsIdleThreadsEndDownToTheNumberKept) {
   Gate again;
   pool.async([&] { again.open(); });
   EXPECT_TRUE(again.wait());
+}
+
+/// In MiB.
+double residentMemory() {
+  std::size_t size = 0;
+  std::size_t resident = 0;
+  std::ifstream("/proc/self/statm") >> size >> resident;
+  return static_cast<double>(resident) * static_cast<double>(sysconf(_SC_PAGESIZE)) / (1 << 20);
+}
+
+TEST(ThreadPoolTest, GivesMemoryBackWhenABurstIsOver) {
+  if (kIsSanitized) GTEST_SKIP() << "a sanitizer's heap keeps what was freed";
+  constexpr int kBlocked = 8;
+  constexpr std::size_t kBlocks = 8'192;
+  std::array<std::vector<std::unique_ptr<std::string>>, kBlocked> blocks;
+  Gate arrived;
+  Gate released;
+  ThreadPool pool({.promptThreads = kBlocked, .keptIdleThreads = 2, .idleTime = 20ms});
+  for (auto& own : blocks) {
+    pool.async([&] {
+      for (std::size_t i = 0; i < kBlocks; ++i)
+        own.push_back(std::make_unique<std::string>(1'000, 'x'));
+      arrived.open();
+      EXPECT_TRUE(released.wait());
+      // What is left is at the end of the heap, and keeps it from shrinking by itself.
+      own.erase(own.begin(), own.end() - 1);
+    });
+  }
+  ASSERT_TRUE(arrived.wait(kBlocked));
+  const double full = residentMemory();
+  released.open();
+  constexpr double kFreed = 1'000.0 * kBlocks * kBlocked / (1 << 20);
+  EXPECT_TRUE(eventually([&] { return residentMemory() < full - kFreed / 2; }))
+      << residentMemory() << " of " << full;
 }
 
 TEST(ThreadPoolTest, StopsAtItsHardBoundSaysSoAndGoesOnWhenAThreadIsFree) {

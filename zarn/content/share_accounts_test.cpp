@@ -79,5 +79,17 @@ TEST_F(ShareAccountsTest, AFolderThatHoldsAnotherAccountsShareIsNotShared) {
   EXPECT_NE(ann->shares().checkShareable(ann->id("Top")), nullptr);
 }
 
+TEST_F(ShareAccountsTest, WhatArrivesWhileAnotherAccountSignsInIsTheParticipants) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->settle();
+  meanwhile("zarn.pull.fetched", [&] { signIn(*bob, "carol"); });
+  ASSERT_TRUE(bob->exists("Plans/new.txt"));
+  signIn(*bob, "bob");
+  bob->settle();
+  EXPECT_EQ(bob->readWhole("Plans/new.txt"), kLong);
+  EXPECT_EQ(zonesWith("carol", bob->id("Plans/new.txt")), Names{});
+}
+
 }  // namespace
 }  // namespace yomber

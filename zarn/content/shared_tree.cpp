@@ -123,7 +123,7 @@ NSErrorRef SharedTree::stage(const SharedDocument& document, std::string& staged
                      .content = document.content,
                      .mtime = document.mtime,
                      .tag = document.tag,
-                     .account = core_.account()};
+                     .account = store_.account()};
   std::string kept;
   if (NSErrorRef error = readKept(store_, document.content, kept)) return error;
   if (document.content.size > kKeptBytes) record.head = headChecksum(kept);

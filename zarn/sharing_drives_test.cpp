@@ -157,6 +157,25 @@ TEST_F(SharingDrivesTest, WhatAnEditorDeletesIsInItsOwnersTrash) {
   ASSERT_TRUE(waitUntil([&] { return bob->read("Plans/a.txt") == text; })) << "shared again";
 }
 
+TEST_F(SharingDrivesTest, WhatAnEditorMovesOutAndBackIsWithItsOwnerAgain) {
+  const std::string text = std::string(10'000, 'x') + "end";
+  fs::create_directory(ann->at("Plans"));
+  ann->write("Plans/a.txt", text);
+  const auto saved = share("Plans", RZShareParticipantPermission::ReadWrite);
+  std::string identifier;
+  ASSERT_EQ(bob->shares().accept(*saved->URL(), identifier), nullptr);
+  ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
+  EXPECT_EQ(bob->read("Plans/a.txt"), text);
+  ASSERT_EQ(::rename(bob->at("Plans/a.txt").c_str(), bob->at("a.txt").c_str()), 0);
+  const std::string trashed = ann->drive->layout.trashFiles() + "/a.txt";
+  ASSERT_TRUE(waitUntil([&] { return fs::exists(trashed); }));
+  ASSERT_EQ(::rename(bob->at("a.txt").c_str(), bob->at("Plans/b.txt").c_str()), 0);
+  ASSERT_TRUE(waitUntil([&] { return ann->has("Plans/b.txt"); }));
+  EXPECT_EQ(ann->read("Plans/b.txt"), text);
+  EXPECT_FALSE(fs::exists(trashed)) << "it is the same document";
+  EXPECT_TRUE(bob->has("Plans/b.txt"));
+}
+
 TEST_F(SharingDrivesTest, AViewerIsRefusedAtEveryDoor) {
   fs::create_directory(ann->at("Plans"));
   ann->write("Plans/a.txt", "text");

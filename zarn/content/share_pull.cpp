@@ -351,18 +351,35 @@ void SharePull::applyAll(Items& items) {
 }
 
 void SharePull::applyKnown(SharedItem& item) {
-  const bool isOurs = item.isInside || (item.content && item.content->zone == share_.zone);
+  const bool isOfZone = item.content && item.content->zone == share_.zone;
+  const bool isBack = share_.isOwn() && item.row->isTrashed() && !isOfZone;
+  const bool isOurs = item.isInside || isOfZone || isBack;
   const bool isSameKind = item.row->isFolder() == item.record->isFolder;
   if (!isOurs || !isSameKind) return;  // an id that is another item's
+  if (isBack) {
+    if (NSErrorRef error = removeRecordElsewhere(item)) return wait(item, error);
+  }
   settled_.insert(item.id);
   if (!item.record->isFolder) applyContent(item);
   // It takes along what others have changed; the store is about to be told that it has moved out.
-  const bool isMovedOut = !item.isInside && !item.isRefused;
+  const bool isMovedOut = !item.isInside && !item.isRefused && !isBack;
   if (!isMovedOut && !item.isRoot(share_) && !waiting_.contains(item.id)) applyPlace(item);
 }
 
+/// What others had removed went to the owner's trash, and with it to a zone of his own.
+NSErrorRef SharePull::removeRecordElsewhere(SharedItem& item) const {
+  std::vector<NSErrorRef> refused;
+  const bool isRecorded = item.content && item.content->isRecorded();
+  NSErrorRef error =
+      isRecorded ? store_->remove({{item.id, item.content->zone, {}}}, refused) : nullptr;
+  if (!error && !refused.empty()) error = refused.front();
+  if (!error) item.content.reset();
+  return error;
+}
+
 std::string SharePull::folderForCopies(const SharedItem& item) const {
-  if (!share_.mayWrite || item.isRoot(share_)) return folderBesideShare(core_, share_);
+  if (!share_.mayWrite || item.isRoot(share_) || item.row->isTrashed())
+    return folderBesideShare(core_, share_);
   return parentOf(item.path);
 }
 

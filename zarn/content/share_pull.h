@@ -55,6 +55,7 @@ class SharePull {
   void applyKnown(SharedItem& item);
   void applyContent(SharedItem& item);
   void applyPlace(SharedItem& item);
+  NSErrorRef removeRecordElsewhere(SharedItem& item) const;
   void applyRemoval(SharedItem& item);
   void moveToTrash(const SharedItem& item, const FileStamp& seen);
   void removeFolder(SharedItem& item);

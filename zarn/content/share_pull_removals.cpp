@@ -11,6 +11,8 @@
 namespace yomber {
 namespace {
 
+constexpr std::int64_t kTimeToMove = 1'000'000'000;
+
 std::string lastOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 
 FileStamp stampAt(const std::string& path) {
@@ -119,7 +121,8 @@ NSErrorRef SharePull::clearOut(const SharedItem& item) {
 }
 
 /// What somebody has removed between the moment in which it was put here and the first look at it
-/// has never had a row, whose end would tell the store.
+/// has never had a row, whose end would tell the store. It may have moved as well: then it gets a
+/// row elsewhere before its job is due, which finds that.
 NSErrorRef SharePull::noteUnseenRemovals() {
   std::vector<std::uint64_t> gone;
   struct stat status{};
@@ -134,7 +137,7 @@ NSErrorRef SharePull::noteUnseenRemovals() {
       const auto content = findContent(connection, id);
       const bool isKnown = findByID(connection, id) || findJob(connection, id, JobKind::Upload);
       if (!content || content->zone != share_.zone || isKnown) continue;
-      addJob(connection, id, JobKind::Upload, content->account, now, now);
+      addJob(connection, id, JobKind::Upload, content->account, now + kTimeToMove, now);
     }
     return NSErrorRef();
   });

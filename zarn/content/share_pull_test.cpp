@@ -218,5 +218,54 @@ TEST_F(SharePullTest, NothingIsFollowedBeforeTheTreeWasScanned) {
   EXPECT_EQ(bob->readWhole("Plans/new.txt"), "new");
 }
 
+/// Has something done while an upload of Bob's is in the store, but not yet confirmed here.
+class ShareConfirmingTest : public TwoDrives {
+ protected:
+  void beforeConfirming(const std::function<void()>& work) const {
+    const std::string gate = storePath + "-confirm";
+    ASSERT_EQ(FaultPoint::arm("zarn.upload.committed=pause-until-file:" + gate), nullptr);
+    ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+    const bool isReached = waitUntil([&] { return std::filesystem::exists(gate + ".reached"); });
+    FaultPoint::disarmAll();  // who waits already goes on waiting
+    if (isReached) work();
+    std::ofstream(gate).put('x');
+    ASSERT_TRUE(isReached);
+  }
+};
+
+TEST_F(ShareConfirmingTest, AFolderThatComesBackWhileItIsRemovedHasItsRecordAgain) {
+  shareFolder(editor("bob"));
+  bob->makeFolder("Plans/Empty");
+  bob->settle();
+  ASSERT_EQ(ann->follow(), nullptr);
+  const std::uint64_t id = bob->id("Plans/Empty");
+  const std::string away = bob->layout.home() + "/away";
+  ASSERT_EQ(::rename(bob->at("Plans/Empty").c_str(), away.c_str()), 0);
+  beforeConfirming([&] {
+    ASSERT_EQ(::rename(away.c_str(), bob->at("Plans/Empty").c_str()), 0);
+    ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  });
+  EXPECT_TRUE(waitUntil([&] { return !zonesWith("ann", id).empty(); }));
+  followBoth();
+  EXPECT_TRUE(ann->exists("Plans/Empty"));
+  EXPECT_TRUE(bob->exists("Plans/Empty"));
+}
+
+TEST_F(ShareConfirmingTest, ANameThatAnotherGivesMeanwhileIsTheSameForBothInTheEnd) {
+  shareFolder(editor("bob"));
+  bob->rename("Plans/a.txt", "Plans/bobs.txt");
+  beforeConfirming([&] {
+    ASSERT_EQ(ann->follow(), nullptr);
+    ann->rename("Plans/bobs.txt", "Plans/anns.txt");
+    ann->settle();
+    EXPECT_EQ(bob->shares().refresh(std::string(NSFileProviderRootContainerItemIdentifier)),
+              nullptr);
+  });
+  EXPECT_TRUE(waitUntil([&] {
+    followBoth();
+    return bob->names("Plans") == ann->names("Plans");
+  }));
+}
+
 }  // namespace
 }  // namespace yomber

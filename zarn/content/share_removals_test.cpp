@@ -117,9 +117,12 @@ TEST_F(ShareRemovalsTest, WhatIsRemovedBeforeItWasLookedAtIsRemovedForAll) {
     bob->remove("Plans/new.txt");
     bob->remove("Plans/Folder");
   });
-  followBoth();
-  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt", "stays.txt"}));
-  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt", "stays.txt"}));
+  const Names expected{"Old", "a.txt", "stays.txt"};
+  EXPECT_TRUE(waitUntil([&] {
+    followBoth();
+    return ann->names("Plans") == expected;
+  }));
+  EXPECT_EQ(bob->names("Plans"), expected);
 }
 
 }  // namespace

@@ -393,11 +393,28 @@ class UploadGroup {
       addJob(connection, job.item, JobKind::Settle, job.account, core_.now(), core_.now());
       hasSettling_ = true;
     }
-    if (!upload.subject.row) return removeContent(connection, job.item);
+    if (!upload.subject.row) return storeRemoved(connection, job);
     if (upload.subject.row->isFolder()) return storeFolder(connection, upload);
     if (upload.subject.row->kind != ItemKind::Document || !upload.confirmed.content) return;
     noteThumbnail(connection, upload);
-    if (!storeConfirmed(transaction, upload.confirmed)) behind_.push_back(upload.subject.path);
+    if (!storeConfirmed(transaction, upload)) behind_.push_back(upload.subject.path);
+  }
+
+  /// A folder that came back meanwhile has no other job: its row is as it was.
+  void storeRemoved(Connection& connection, const Job& job) const {
+    removeContent(connection, job.item);
+    const auto row = findByID(connection, job.item);
+    if (!row) return;
+    const auto account =
+        row->isFolder() ? whoseFolderIsBehind(connection, *row) : std::optional(job.account);
+    if (account) addJob(connection, job.item, JobKind::Upload, *account, core_.now(), core_.now());
+  }
+
+  /// Whether what others have saved since was taken over before this was confirmed: that counts.
+  static bool isOvertaken(const Upload& upload, const std::optional<ContentRow>& now) {
+    const auto& before = upload.subject.content;
+    return now && isSharedZone(now->zone) && now->tag != upload.confirmed.tag &&
+           (!before || now->tag != before->tag);
   }
 
   /// A document without content whose content nobody has: trying again changes nothing.
@@ -436,7 +453,7 @@ class UploadGroup {
     folder.account = upload.subject.job.account;
     const auto now = findContent(connection, folder.id);
     folder.isPinned = now && now->isPinned;
-    storeContent(connection, folder);
+    if (!isOvertaken(upload, now)) storeContent(connection, folder);
     const auto row = findByID(connection, folder.id);
     // Removed, renamed or moved meanwhile.
     const auto account = row ? whoseFolderIsBehind(connection, *row) : folder.account;
@@ -461,19 +478,24 @@ class UploadGroup {
   }
 
   /// False when the row is behind the disk.
-  bool storeConfirmed(WriteTransaction& transaction, ContentRow confirmed) {
+  bool storeConfirmed(WriteTransaction& transaction, const Upload& upload) {
     Connection& connection = transaction.connection();
-    if (const auto now = findContent(connection, confirmed.id)) confirmed.isPinned = now->isPinned;
+    ContentRow confirmed = upload.confirmed;
+    const std::int64_t now = core_.now();
+    const auto known = findContent(connection, confirmed.id);
+    if (isOvertaken(upload, known)) {
+      addJob(connection, confirmed.id, JobKind::Upload, known->account, now, now);
+      return true;
+    }
+    if (known) confirmed.isPinned = known->isPinned;
     storeContent(connection, confirmed);
     const auto row = findByID(connection, confirmed.id);
     if (!row) {  // removed meanwhile
-      const std::int64_t now = core_.now();
       addJob(connection, confirmed.id, JobKind::Upload, confirmed.account, now, now);
       return true;
     }
     // It came into a share, or out of one, while it was on its way.
     if (zoneOf(connection, row->id, confirmed.zone, confirmed.account) != confirmed.zone) {
-      const std::int64_t now = core_.now();
       addJob(connection, confirmed.id, JobKind::Upload, confirmed.account, now, now);
       core_.queue->noteJobs(JobKind::Upload);
     }

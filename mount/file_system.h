@@ -164,6 +164,7 @@ class FileSystem {
   bool askBeforeMove(fuse_req_t request, Node& folder, const std::string& name, Node& newFolder,
                      const std::string& newName, unsigned flags);
 
+  void makeLink(fuse_req_t request, Node& node, Node& target, const char* name);
   /// Opens a file for whoever asks: as `openInPlace`.
   [[nodiscard]] int openNode(Node& node, int flags, FileDescriptor& content, FileDescriptor& place);
   /// With the entry, for what was made.

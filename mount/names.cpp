@@ -5,11 +5,14 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include "mount/file_system.h"
 #include "platform/foundation/descriptor_path.h"
+#include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/thread_pool.h"
 
 namespace yomber {
@@ -42,6 +45,21 @@ void FileSystem::symlink(fuse_req_t request, const char* target, fuse_ino_t fold
 }
 
 void FileSystem::link(fuse_req_t request, Node& node, fuse_ino_t folder, const char* name) {
+  const auto path = locationOf(node);
+  if (!path || !isFaultAtPath(*path)) return makeLink(request, node, nodeOf(folder), name);
+  // We know one name of each file: without that, nobody could say whose content is to come. What
+  // has several names is not given up, so that it stays.
+  auto source = std::make_shared<NodeUse>(nodes_.use(node));
+  auto target = std::make_shared<NodeUse>(nodes_.use(nodeOf(folder)));
+  waits_.wait(request, nodes_.use(node), *path,
+              [this, request, source, target, entry = std::string(name)](int waited) {
+                if (waited == 0 || waited == EBUSY)
+                  return makeLink(request, *source->get(), *target->get(), entry.c_str());
+                (void)fuse_reply_err(request, waited);
+              });
+}
+
+void FileSystem::makeLink(fuse_req_t request, Node& node, Node& target, const char* name) {
   Descriptor source;
   const int failure = descriptorOf(node, source);
   if (failure != 0) {
@@ -50,7 +68,6 @@ void FileSystem::link(fuse_req_t request, Node& node, fuse_ino_t folder, const c
   }
   const std::string path = pathOfDescriptor(source.number);
   int descriptor = 0;
-  Node& target = nodeOf(folder);
   const SharedDescriptor opened = folders_.open(target, descriptor);
   if (!opened || isShownBase(target, name)) {
     (void)fuse_reply_err(request, opened ? EEXIST : descriptor);

@@ -168,6 +168,14 @@ TEST_F(Mount, WritingIntoWhatIsAwayKeepsTheRestOfIt) {
   EXPECT_EQ(contentOf(at("report")), content);
 }
 
+TEST_F(Mount, WhatGetsASecondNameHasItsContentUnderEither) {
+  const std::string content = someContent(50'000, 9);
+  makeAway("older", content);
+  ASSERT_EQ(link(at("older").c_str(), at("newer").c_str()), 0);
+  ASSERT_EQ(unlink(at("newer").c_str()), 0);
+  EXPECT_EQ(contentOf(at("older")), content);
+}
+
 TEST_F(Mount, AMapOfWhatIsAwayHasTheContent) {
   const std::string content = someContent(50'000, 5);
   makeAway("report", content);

@@ -96,7 +96,9 @@ void DesktopThumbnails::noteEverything() {
 
 bool DesktopThumbnails::mayBePicture(const std::string& name) {
   const std::string& type = ContentTypes::system().typeForName(name);
-  return isDrawableType(type) || InstalledThumbnailers::system().canDraw(type);
+  // What a name does not tell, the desktop looks up in the file, whose start is always here.
+  return isDrawableType(type) || type == ContentTypes::kUnknown ||
+         InstalledThumbnailers::system().canDraw(type);
 }
 
 void DesktopThumbnails::noteLooked(std::uint64_t folder) {

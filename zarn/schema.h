@@ -26,6 +26,8 @@ inline constexpr const char* kSweptUpTo = "sweptUpTo";      ///< see ContentJobs
 inline constexpr const char* kThumbnailsSweptUpTo = "thumbnailsSweptUpTo";  ///< as above
 /// There was nobody to draw: all documents are looked at again at the next start.
 inline constexpr const char* kThumbnailsMissed = "thumbnailsMissed";
+/// See DocumentDrawer::abilities; of when the documents were last looked through.
+inline constexpr const char* kThumbnailAbilities = "thumbnailAbilities";
 inline constexpr const char* kLastAccount = "lastAccount";  ///< key of who was signed in last
 inline constexpr const char* kCollectedAt = "collectedAt";  ///< see StoreUpkeep; ns since the epoch
 }  // namespace meta

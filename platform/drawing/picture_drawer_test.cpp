@@ -386,5 +386,18 @@ TEST(DrawableTypesTest, PicturesAreDrawnAndOtherFilesAreNotOpened) {
   EXPECT_FALSE(isDrawableType(""));
 }
 
+TEST(DrawableTypesTest, EveryKindOfPictureIsKnownByItsStart) {
+  const std::vector<std::string> samples = {"quarters.avif", "quarters.heic", "quarters.jpg",
+                                            "quarters.pdf",  "quarters.png",  "quarters.svg",
+                                            "quarters.webp", "two-pages.gif", "two-pages.tif"};
+  for (const std::string& name : samples)
+    EXPECT_TRUE(isDrawableStart(sample(name).substr(0, kDrawableStart))) << name;
+  EXPECT_FALSE(isDrawableStart(sample("green.mp4")));
+  EXPECT_FALSE(isDrawableStart("RIFF\x24\x08\x01\x02WAVEfmt "));
+  EXPECT_FALSE(isDrawableStart("<?xml version=\"1.0\"?><feed/>"));
+  EXPECT_FALSE(isDrawableStart("\xff\xd8"));
+  EXPECT_FALSE(isDrawableStart(""));
+}
+
 }  // namespace
 }  // namespace yomber

@@ -106,6 +106,18 @@ std::vector<std::string> InstalledThumbnailers::commandFor(std::string_view type
   return first == candidates.end() ? std::vector<std::string>() : first->command;
 }
 
+std::vector<std::string> InstalledThumbnailers::types() {
+  const LockGuard lock(mutex_);
+  if (isChanged()) readAll();
+  std::vector<std::string> all;
+  for (const auto& [type, candidates] : thumbnailers_) {
+    const auto isThere = [](const Thumbnailer& each) { return isInstalled(each.program); };
+    if (std::ranges::any_of(candidates, isThere)) all.push_back(type);
+  }
+  std::ranges::sort(all);
+  return all;
+}
+
 InstalledThumbnailers::Stamp InstalledThumbnailers::stampOf(const std::string& path) {
   struct stat status{};
   if (stat(path.c_str(), &status) != 0) return {};

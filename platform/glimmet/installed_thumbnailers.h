@@ -34,6 +34,8 @@ class InstalledThumbnailers {
   /// "%i",
   /// "%u", "%o" and "%s" for the file, its URL, the result and its size. Empty: none.
   [[nodiscard]] std::vector<std::string> commandFor(std::string_view type);
+  /// All types that one draws whose program is there, sorted.
+  [[nodiscard]] std::vector<std::string> types();
 
  private:
   /// What tells that a file or folder was changed; nothing for what is not there.

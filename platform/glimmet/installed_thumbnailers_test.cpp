@@ -117,5 +117,12 @@ TEST_F(InstalledThumbnailersTest, TheFirstWhoseProgramIsThereCounts) {
   EXPECT_EQ(thumbnailers_.commandFor("video/mp4"), (std::vector<std::string>{"film", "%o"}));
 }
 
+TEST_F(InstalledThumbnailersTest, TheTypesAreThoseOfProgramsThatAreThere) {
+  EXPECT_EQ(thumbnailers_.types(), std::vector<std::string>());
+  write(own_ + "/a.thumbnailer", entry("video/webm;", "/nowhere/film"));
+  write(machine_ + "/b.thumbnailer", entry("video/mp4;audio/flac;", "/bin/sh"));
+  EXPECT_EQ(thumbnailers_.types(), (std::vector<std::string>{"audio/flac", "video/mp4"}));
+}
+
 }  // namespace
 }  // namespace yomber

@@ -145,9 +145,9 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs);
 void doSpreading(ContentCore& core, const std::vector<Job>& jobs);
 void doThumbnails(ContentCore& core, const std::vector<Job>& jobs);
 
-/// To be called before the first sweep of a process: where there was nobody to draw, that begins
-/// anew.
-void beginThumbnailSweep(WriteTransaction& transaction);
+/// To be called before the first sweep of a process: where there was nobody to draw, or others than
+/// now, that begins anew.
+void beginThumbnailSweep(const ContentCore& core, WriteTransaction& transaction);
 /// Gives jobs to documents that were uploaded before there were thumbnails; a part of them at a
 /// time. True when there are no more.
 [[nodiscard]] bool sweepThumbnails(const ContentCore& core, WriteTransaction& transaction);

@@ -214,8 +214,8 @@ void Engine::sweep() {
     return core.participant->sweep(transaction);
   });
   core_->database().writeLater(
-      [](WriteTransaction& transaction) {
-        beginThumbnailSweep(transaction);
+      [core = core_](WriteTransaction& transaction) {
+        beginThumbnailSweep(*core, transaction);
         return NSErrorRef();
       },
       [](const NSErrorRef&) {});

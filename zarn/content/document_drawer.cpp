@@ -1,9 +1,12 @@
 #include "zarn/content/document_drawer.h"
 
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <array>
 #include <cerrno>
 #include <filesystem>
+#include <functional>
 #include <string_view>
 
 #include "platform/drawing/drawable_types.h"
@@ -18,6 +21,10 @@ std::string_view typeOf(const std::string& name) {
   return ContentTypes::system().typeForName(name);
 }
 
+bool isOfPicture(std::string_view type) {
+  return isDrawableType(type) || type == ContentTypes::kUnknown;
+}
+
 }  // namespace
 
 DocumentDrawer::DocumentDrawer(const Options& options)
@@ -26,15 +33,30 @@ DocumentDrawer::DocumentDrawer(const Options& options)
       ownThumbnailers_(options.thumbnailers),
       thumbnailers_(ownThumbnailers_ ? *ownThumbnailers_ : InstalledThumbnailers::system()) {}
 
-bool DocumentDrawer::draws(const std::string& name) const {
+bool DocumentDrawer::mayDraw(const std::string& name) const {
   const std::string_view type = typeOf(name);
-  return isDrawableType(type) || (programs_.isAvailable() && thumbnailers_.canDraw(type));
+  return isOfPicture(type) || (programs_.isAvailable() && thumbnailers_.canDraw(type));
+}
+
+bool DocumentDrawer::mayDraw(const std::string& name, int file) const {
+  if (typeOf(name) != ContentTypes::kUnknown) return mayDraw(name);
+  std::array<char, kDrawableStart> start{};
+  const ssize_t length = pread(file, start.data(), start.size(), 0);
+  return length > 0 && isDrawableStart({start.data(), static_cast<std::size_t>(length)});
+}
+
+std::int64_t DocumentDrawer::abilities() const {
+  std::string all = "unknown names, ";
+  if (programs_.isAvailable()) {
+    for (const std::string& type : thumbnailers_.types()) all += type + ";";
+  }
+  // Another standard library's numbers would cost another look at each document, no more.
+  return static_cast<std::int64_t>(std::hash<std::string>()(all));
 }
 
 std::optional<DrawnPicture> DocumentDrawer::draw(const std::string& name, int file,
                                                  std::uint32_t side, NSErrorRef* error) {
-  if (isDrawableType(typeOf(name)))
-    return pictures_.draw(file, side, drawing::Form::Smallest, error);
+  if (isOfPicture(typeOf(name))) return pictures_.draw(file, side, drawing::Form::Smallest, error);
   const FileDescriptor drawn = drawnByProgram(name, file, side, error);
   if (!drawn) return std::nullopt;
   return pictures_.draw(drawn.get(), side, drawing::Form::Smallest, error);

@@ -14,8 +14,8 @@ namespace yomber {
 class InstalledThumbnailers;
 
 /// Draws documents' content: pictures itself, and what a thumbnailer of this machine draws, such as
-/// videos, by way of that. Only files of types that are drawn are looked at, and the type is that
-/// of the name.
+/// videos, by way of that. Only files of types that are drawn are looked at. The type is that of
+/// the name; where that tells nothing, a picture is known by its start.
 ///
 /// Thread-safety: every operation may be called on any thread; `draw` blocks.
 class DocumentDrawer {
@@ -30,7 +30,12 @@ class DocumentDrawer {
   explicit DocumentDrawer(const Options& options);
 
   /// Whether a document of that name may have a thumbnail. Opens no document.
-  [[nodiscard]] bool draws(const std::string& name) const;
+  [[nodiscard]] bool mayDraw(const std::string& name) const;
+  /// The same of a document that is open.
+  [[nodiscard]] bool mayDraw(const std::string& name, int file) const;
+
+  /// Another number when other types can be drawn than before: a thumbnailer came or went.
+  [[nodiscard]] std::int64_t abilities() const;
 
   /// As PictureDrawer::draw and, for what is drawn by programs, ProgramDrawer::draw. `file` is a
   /// file that has a path, for as long as it is drawn.

@@ -114,9 +114,12 @@ void doThumbnails(ContentCore& core, const std::vector<Job>& jobs) {
   batch.run();
 }
 
-void beginThumbnailSweep(WriteTransaction& transaction) {
+void beginThumbnailSweep(const ContentCore& core, WriteTransaction& transaction) {
   Connection& connection = transaction.connection();
-  if (metaInteger(connection, meta::kThumbnailsMissed) == 0) return;
+  const std::int64_t abilities = core.drawer->abilities();
+  const bool isAsBefore = metaInteger(connection, meta::kThumbnailAbilities) == abilities;
+  if (isAsBefore && metaInteger(connection, meta::kThumbnailsMissed) == 0) return;
+  setMetaInteger(connection, meta::kThumbnailAbilities, abilities);
   setMetaInteger(connection, meta::kThumbnailsMissed, 0);
   setMetaInteger(connection, meta::kThumbnailsSweptUpTo, 0);
 }
@@ -136,7 +139,7 @@ bool sweepThumbnails(const ContentCore& core, WriteTransaction& transaction) {
       last = statement->integer(0);
       const bool isDocument =
           statement->integer(2) == static_cast<std::int64_t>(ItemKind::Document);
-      if (isDocument && core.drawer->draws(std::string(statement->bytes(3))))
+      if (isDocument && core.drawer->mayDraw(std::string(statement->bytes(3))))
         documents.push_back(statement->id(1));
     }
   }

@@ -36,7 +36,7 @@ void noteStoreFailed(ThumbnailSubject& subject, const NSErrorRef& error) {
 }  // namespace
 
 bool ThumbnailMaker::isCandidate(const std::string& name, const RZAsset& content) const {
-  return content.size > 0 && core_.drawer->draws(name);
+  return content.size > 0 && core_.drawer->mayDraw(name);
 }
 
 bool ThumbnailMaker::isKnown(ThumbnailSubject& subject) const {
@@ -68,6 +68,8 @@ void ThumbnailMaker::draw(ThumbnailSubject& subject) {
   FileDescriptor original;
   NSErrorRef error = store_->open(subject.content, original);
   if (error) return noteStoreFailed(subject, error);
+  // Nothing is remembered of the content: under another name it may be drawn.
+  if (!core_.drawer->mayDraw(subject.name, original.get())) return;
   const auto picture = core_.drawer->draw(subject.name, original.get(), kSide, &error);
   if (!picture) {
     subject.outcome = outcomeOf(error);

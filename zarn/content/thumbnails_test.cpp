@@ -80,6 +80,31 @@ TEST_F(ThumbnailsTest, AVideoIsDrawnByTheThumbnailerThatIsInstalled) {
   EXPECT_TRUE(thumbnailBytes("after.mp4").starts_with("\xff\xd8\xff"));
 }
 
+TEST_F(ThumbnailsTest, WhatWasUploadedBeforeAThumbnailerWasInstalledIsDrawnAfterTheNextStart) {
+  write("film.mp4", sample("green.mp4"));
+  settle();
+  installThumbnailer("ffmpegthumbnailer -i %i -o %o -s %s");
+  restartEngine();
+  ASSERT_TRUE(waitUntil([&] { return thumbnail("film.mp4").has_value(); }));
+  EXPECT_TRUE(thumbnailBytes("film.mp4").starts_with("\xff\xd8\xff"));
+}
+
+TEST_F(ThumbnailsTest, APictureIsKnownByItsStartWhereItsNameTellsNothing) {
+  write("photo", sample("quarters.jpg"));
+  write("drawing", sample("quarters.svg"));
+  write("film", sample("green.mp4"));
+  write("noise", std::string(5000, '\xee'));
+  settle();
+  EXPECT_TRUE(thumbnailBytes("photo").starts_with("\xff\xd8\xff"));
+  EXPECT_TRUE(thumbnail("drawing"));
+  EXPECT_FALSE(thumbnail("film"));
+  EXPECT_FALSE(thumbnail("noise"));
+  installThumbnailer("ffmpegthumbnailer -i %i -o %o -s %s");
+  rename("film", "film.mp4");
+  settle();
+  EXPECT_TRUE(thumbnail("film.mp4"));
+}
+
 TEST_F(ThumbnailsTest, AThumbnailerThatFailsOrDrawsRubbishCostsTheThumbnailOnly) {
   installThumbnailer("false");
   write("first.mp4", sample("green.mp4"));
@@ -131,11 +156,11 @@ TEST_F(ThumbnailsTest, TheSameContentIsDrawnOnce) {
 
 TEST_F(ThumbnailsTest, ARenamedPictureKeepsItsThumbnailAndADocumentCanBecomeOne) {
   write("photo.jpg", sample("quarters.jpg"));
-  write("data", sample("quarters.png"));
+  write("data.txt", sample("quarters.png"));
   settle();
-  EXPECT_FALSE(thumbnail("data"));
+  EXPECT_FALSE(thumbnail("data.txt"));
   rename("photo.jpg", "beach.jpg");
-  rename("data", "data.png");
+  rename("data.txt", "data.png");
   settle();
   EXPECT_TRUE(thumbnail("beach.jpg"));
   EXPECT_TRUE(thumbnail("data.png"));

@@ -30,8 +30,7 @@ class ShareCommands : public ::testing::Test {
   void SetUp() override {
     ann_.setAccount("ann");
     bob_.setAccount("bob");
-    for (TestDrive* const drive : {&ann_, &bob_})
-      drive->environment()["YOMBER_STORE"] = store_ / "store";
+    for (TestDrive* const drive : {&ann_, &bob_}) drive->setStore(store_ / "store");
     ann_.write("report.txt", "first");
     ann_.makeFolder("Plans");
     ann_.write("Plans/one.txt", "one");
@@ -135,6 +134,19 @@ TEST_F(ShareCommands, WhoeverIsRemovedLosesTheItemAndWhoeverLeavesItToo) {
   ASSERT_EQ(ann_.yomber({"share", "remove", "report.txt", "bob"}).exitCode, 0);
   EXPECT_TRUE(eventually([&] { return bob_.names().empty(); }));
   EXPECT_EQ(ann_.yomber({"share", "remove", "report.txt", "bob"}).exitCode, kNoSuchItem);
+}
+
+TEST_F(ShareCommands, ADriveKeepsTheStoreThatItJoinedAndJoinsNoOther) {
+  bob_.down();
+  const ProcessResult other = bob_.yomber({"up", "--store", store_ / "other"});
+  EXPECT_NE(other.exitCode, 0);
+  EXPECT_THAT(other.errors, HasSubstr(store_ / "store"));
+  bob_.setStore({});
+  bob_.up();
+  ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "bob"}).exitCode, 0);
+  const std::string id = acceptedByBob(linkOf("report.txt"));
+  ASSERT_NE(id, "");
+  EXPECT_EQ(got(bob_, id), "first");
 }
 
 TEST_F(ShareCommands, WhatIsSaidWronglyIsToldSo) {

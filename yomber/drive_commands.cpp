@@ -56,15 +56,28 @@ NSErrorRef waitUntilUp(const DrivePaths& paths) {
   return error;
 }
 
-void runUp(CommandContext& context, bool foreground) {
-  const DrivePaths paths = context.paths();
-  if (NSErrorRef error = paths.create()) {
+struct UpOptions {
+  bool foreground = false;
+  std::string store = {};
+};
+
+/// Makes the drive's places where they are missing.
+NSErrorRef provideDrive(DrivePaths& paths, const std::string& store) {
+  if (!store.empty()) {
+    if (NSErrorRef error = paths.joinStore(store)) return error;
+  }
+  return paths.create();
+}
+
+void runUp(CommandContext& context, const UpOptions& options) {
+  DrivePaths paths = context.paths();
+  if (NSErrorRef error = provideDrive(paths, options.store)) {
     context.fail(error);
     context.exitCode = ExitCode::CannotCreate;
     return;
   }
   const bool already = Supervisor::runningPid(supervisorLock(paths)).has_value();
-  if (foreground) {
+  if (options.foreground) {
     if (already)
       return context.fail(ExitCode::CannotCreate,
                           "the drive is up already; take it down with 'yomber down'");
@@ -135,9 +148,14 @@ void runStatus(CommandContext& context, bool once) {
 
 void addDriveCommands(CLI::App& app, CommandContext& context) {
   CLI::App* up = app.add_subcommand("up", "Start the drive and keep it running");
-  auto foreground = std::make_shared<bool>(false);
-  up->add_flag("--foreground", *foreground, "Stay, and end the drive when this command ends");
-  up->callback([&context, foreground] { runUp(context, *foreground); });
+  auto options = std::make_shared<UpOptions>();
+  up->add_flag("--foreground", options->foreground,
+               "Stay, and end the drive when this command ends");
+  up->add_option(
+        "--store", options->store,
+        "Keep the records in this folder, from now on; drives that share have one together")
+      ->type_name("FOLDER");
+  up->callback([&context, options] { runUp(context, *options); });
 
   CLI::App* down = app.add_subcommand("down", "End the drive; its files stay");
   down->callback([&context] { runDown(context); });

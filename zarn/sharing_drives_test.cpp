@@ -23,8 +23,9 @@ namespace fs = std::filesystem;
 
 class OneDrive {
  public:
-  OneDrive(const std::string& home, const std::string& account) {
-    const DrivePaths paths = DrivePaths::forHome(home);
+  OneDrive(const std::string& home, const std::string& store, const std::string& account) {
+    DrivePaths paths = DrivePaths::forHome(home);
+    EXPECT_EQ(paths.joinStore(store), nullptr);
     EXPECT_EQ(paths.create(), nullptr);
     NSErrorRef error;
     Drive::Options options;
@@ -74,17 +75,15 @@ class OneDrive {
 class SharingDrivesTest : public testing::Test {
  protected:
   SharingDrivesTest() {
-    setenv("YOMBER_STORE", (directory_.path() + "/store").c_str(), 1);
     setenv("XDG_RUNTIME_DIR", (directory_.path() + "/run").c_str(), 1);
     fs::create_directory(directory_.path() + "/run");
     fs::permissions(directory_.path() + "/run", fs::perms::owner_all);
-    ann = std::make_unique<OneDrive>(directory_.path() + "/ann", "ann");
-    bob = std::make_unique<OneDrive>(directory_.path() + "/bob", "bob");
+    ann = std::make_unique<OneDrive>(directory_.path() + "/ann", directory_ / "store", "ann");
+    bob = std::make_unique<OneDrive>(directory_.path() + "/bob", directory_ / "store", "bob");
   }
   ~SharingDrivesTest() override {
     ann.reset();
     bob.reset();
-    unsetenv("YOMBER_STORE");
   }
 
   RZShareRef share(const std::string& path, RZShareParticipantPermission permission) const {

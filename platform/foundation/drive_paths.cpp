@@ -107,6 +107,11 @@ NSErrorRef provideParents(const std::string& path, Missing missing) {
   return nullptr;
 }
 
+NSErrorRef provideWithParents(const std::string& path) {
+  if (auto error = provideParents(path, Missing::Make)) return error;
+  return provide(path, Missing::Make);
+}
+
 NSErrorRef checkSocketPath(const std::string& path) {
   if (path.size() < kSocketPathRoom) return nullptr;
   return failure(ENAMETOOLONG, path,
@@ -124,13 +129,37 @@ NSErrorRef checkSessionDirectory(const std::string& path) {
                  "to keep sockets in the drive's home");
 }
 
+std::string ownStore(const std::string& home) { return home + "/store"; }
+
+/// A drive that has joined another store has a link in place of its own.
+std::string storeOf(const std::string& home) {
+  std::error_code isNoLink;
+  const fs::path target = fs::read_symlink(ownStore(home), isNoLink);
+  return isNoLink || !target.is_absolute() ? ownStore(home) : target.string();
+}
+
+/// Never made anew: it may be on a disk that is away, and an empty one would pass for a store that
+/// has lost everything.
+NSErrorRef checkJoinedStore(const std::string& path) {
+  struct stat status{};
+  if (lstat(path.c_str(), &status) != 0 && errno == ENOENT)
+    return failure(ENOENT, path,
+                   "is where the drive's record store is, and nothing is there; "
+                   "mount the disk that it is on");
+  return checkOwnDirectory(path);
+}
+
 NSErrorRef provideAll(const DrivePaths& paths, Missing missing) {
   for (const auto& socket : {paths.daemonSocket, paths.controlSocket}) {
     if (auto error = checkSocketPath(socket)) return error;
   }
   if (auto error = provideParents(paths.home, missing)) return error;
-  std::vector<std::string> directories{paths.home, paths.tree, paths.privateDirectory, paths.store,
-                                       paths.log};
+  std::vector<std::string> directories{paths.home, paths.tree, paths.privateDirectory, paths.log};
+  if (paths.store == ownStore(paths.home)) {
+    directories.push_back(paths.store);
+  } else if (auto error = checkJoinedStore(paths.store)) {
+    return error;
+  }
   const auto session = absoluteFromEnvironment("XDG_RUNTIME_DIR");
   if (!paths.runtimeDirectory.starts_with(paths.home + "/")) {
     if (auto error = checkSessionDirectory(session)) return error;
@@ -152,8 +181,7 @@ DrivePaths DrivePaths::forHome(std::string_view home) {
   paths.tree = paths.home + "/tree";
   paths.privateDirectory = paths.home + "/private";
   paths.database = paths.home + "/zarn.db";
-  const auto shared = absoluteFromEnvironment("YOMBER_STORE");
-  paths.store = shared.empty() ? paths.home + "/store" : canonical(shared);
+  paths.store = storeOf(paths.home);
   paths.log = paths.home + "/log";
   const auto session = absoluteFromEnvironment("XDG_RUNTIME_DIR");
   paths.runtimeDirectory =
@@ -174,5 +202,19 @@ DrivePaths DrivePaths::forDefaultHome() {
 NSErrorRef DrivePaths::create() const { return provideAll(*this, Missing::Make); }
 
 NSErrorRef DrivePaths::check() const { return provideAll(*this, Missing::Refuse); }
+
+NSErrorRef DrivePaths::joinStore(std::string_view directory) {
+  const std::string joined = canonical(directory);
+  if (joined == store) return checkJoinedStore(store);
+  if (const auto error = provideWithParents(joined)) return error;
+  if (const auto error = provideWithParents(home)) return error;
+  const std::string own = ownStore(home);
+  if (store != own || (rmdir(own.c_str()) != 0 && errno != ENOENT))
+    return failure(EEXIST, store,
+                   "is the drive's record store already; a drive keeps the one that it began with");
+  if (symlink(joined.c_str(), own.c_str()) != 0) return systemFailure(own);
+  store = joined;
+  return nullptr;
+}
 
 }  // namespace yomber

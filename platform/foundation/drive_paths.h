@@ -10,15 +10,15 @@ namespace yomber {
 /// The places of a drive, all computed from its home.
 ///
 /// Value type. Every process of a drive computes the same places, as long as they see the same
-/// environment.
+/// environment and the drive was not given another store meanwhile.
 struct DrivePaths {
   std::string home;              ///< absolute, symbolic links resolved
   std::string homeHash;          ///< 16 hexadecimal digits that name the drive on this machine
   std::string tree;              ///< the synced tree
   std::string privateDirectory;  ///< staging, on the tree's file system
   std::string database;          ///< the daemon's database file
-  std::string store;  ///< the embedded record store; $YOMBER_STORE where drives have one together
-  std::string log;    ///< log files, where there is no journal
+  std::string store;             ///< the embedded record store; elsewhere after `joinStore`
+  std::string log;               ///< log files, where there is no journal
   std::string runtimeDirectory;  ///< sockets and the log level, gone with the session
   std::string daemonSocket;      ///< where zarn listens
   std::string controlSocket;     ///< where the host listens
@@ -36,6 +36,11 @@ struct DrivePaths {
   [[nodiscard]] NSErrorRef create() const;
   /// The same without making anything.
   [[nodiscard]] NSErrorRef check() const;
+
+  /// Makes `directory`, which is made where it is missing, the drive's record store from now on;
+  /// drives that share things have one together. For a drive that is not up. Refused with
+  /// NSPOSIXErrorDomain EEXIST for a drive that has another store already.
+  [[nodiscard]] NSErrorRef joinStore(std::string_view directory);
 };
 
 }  // namespace yomber

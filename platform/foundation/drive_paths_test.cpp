@@ -176,5 +176,51 @@ TEST_F(DrivePathsTest, RefusesAHomeWhoseSocketsWouldHaveTooLongNames) {
   EXPECT_FALSE(std::filesystem::exists(paths.home));
 }
 
+TEST_F(DrivePathsTest, AStoreThatWasJoinedIsTheDrivesFromThenOn) {
+  const std::string store = directory_ / "shared/store";
+  auto paths = DrivePaths::forHome(directory_ / "home");
+  ASSERT_EQ(paths.create(), nullptr) << "an own store without anything in it may be left";
+  ASSERT_EQ(paths.joinStore(store), nullptr);
+  EXPECT_EQ(paths.store, store);
+  EXPECT_EQ(modeOf(store), 0700U);
+  EXPECT_EQ(DrivePaths::forHome(paths.home).store, store);
+  EXPECT_EQ(DrivePaths::forHome(paths.home).create(), nullptr);
+  EXPECT_EQ(DrivePaths::forHome(paths.home).joinStore(store + "/"), nullptr);
+}
+
+TEST_F(DrivePathsTest, ANewDriveCanJoinAStoreAtOnce) {
+  auto paths = DrivePaths::forHome(directory_ / "new/home");
+  ASSERT_EQ(paths.joinStore(directory_ / "store"), nullptr);
+  EXPECT_EQ(paths.create(), nullptr);
+  EXPECT_EQ(DrivePaths::forHome(paths.home).store, directory_ / "store");
+}
+
+TEST_F(DrivePathsTest, ADriveKeepsTheStoreThatItBeganWith) {
+  auto own = DrivePaths::forHome(directory_ / "own");
+  ASSERT_EQ(own.create(), nullptr);
+  std::ofstream(own.store + "/records") << "of all documents";
+  auto error = own.joinStore(directory_ / "store");
+  ASSERT_NE(error, nullptr);
+  EXPECT_TRUE(error->is(NSPOSIXErrorDomain, EEXIST)) << error->description();
+  EXPECT_EQ(DrivePaths::forHome(own.home).store, own.home + "/store");
+  EXPECT_TRUE(std::filesystem::exists(own.store + "/records"));
+
+  auto joined = DrivePaths::forHome(directory_ / "joined");
+  ASSERT_EQ(joined.joinStore(directory_ / "store"), nullptr);
+  error = joined.joinStore(directory_ / "another");
+  ASSERT_NE(error, nullptr);
+  EXPECT_NE(error->localizedDescription().find(directory_ / "store"), std::string::npos);
+}
+
+TEST_F(DrivePathsTest, AJoinedStoreThatIsAwayIsNotMadeAnew) {
+  auto paths = DrivePaths::forHome(directory_ / "home");
+  ASSERT_EQ(paths.joinStore(directory_ / "disk/store"), nullptr);
+  std::filesystem::remove_all(directory_ / "disk");
+  const auto error = DrivePaths::forHome(paths.home).create();
+  ASSERT_NE(error, nullptr);
+  EXPECT_NE(error->localizedDescription().find("mount the disk"), std::string::npos);
+  EXPECT_FALSE(std::filesystem::exists(directory_ / "disk"));
+}
+
 }  // namespace
 }  // namespace yomber

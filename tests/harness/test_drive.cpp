@@ -95,6 +95,7 @@ void TestDrive::up(const std::vector<std::string>& command) {
   up_ = true;
   std::vector<std::string> words = command;
   for (std::string& word : commandLine({"up"})) words.push_back(std::move(word));
+  if (!store_.empty()) words.insert(words.end(), {"--store", store_});
   const ProcessResult started = runProcess(words, environment_);
   require(started.exitCode == 0, started.errors);
   supervisor_ = status()["supervisor"]["pid"];

@@ -31,6 +31,8 @@ class TestDrive {
   void signIn();
   /// Who signs in; set before `up`.
   void setAccount(const std::string& name) { account_ = name; }
+  /// A record store that it has together with other drives; set before `up`.
+  void setStore(const std::string& directory) { store_ = directory; }
 
   [[nodiscard]] const std::string& home() const { return home_; }
   /// The root folder on disk. Exists from the start, so that a test can fill it before `up`.
@@ -66,6 +68,7 @@ class TestDrive {
   std::string root_;
   Environment environment_;
   std::string account_ = "ada";
+  std::string store_;  ///< empty: its own
   bool up_ = false;
   pid_t supervisor_ = -1;
 };

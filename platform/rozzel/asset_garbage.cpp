@@ -97,22 +97,32 @@ class AssetDropper {
   void drop() {
     if (candidates_.empty()) return;
     pass(whenChosen);
-    std::vector<std::string> away;
+    MovedAssets away;
     {
       const AssetLock lock(folder_, AssetLock::Kind::Dropping);
       RecordsTransaction transaction(connection_, RecordsTransaction::Kind::Write);
       for (const RZAsset& asset : candidates_) {
-        if (!isUsed(asset)) moveAway(asset, away);
+        if (!isUsed(asset)) moveAway(asset, away.paths);
       }
       pass(whenMovedAway);
       transaction.commit();
     }
-    // Large files take long to go, so nobody waits for this.
-    for (const std::string& path : away) unlink(path.c_str());
     candidates_.clear();
   }
 
  private:
+  /// Large files take long to go, so nobody waits for this. They go as well when the rows cannot be
+  /// stored: on a full disk it is they that make room.
+  struct MovedAssets {
+    std::vector<std::string> paths;
+    MovedAssets() = default;
+    MovedAssets(const MovedAssets&) = delete;
+    MovedAssets& operator=(const MovedAssets&) = delete;
+    ~MovedAssets() {
+      for (const std::string& path : paths) unlink(path.c_str());
+    }
+  };
+
   bool isUsed(const RZAsset& asset) {
     RecordsQuery row(connection_.prepared("SELECT uses, released FROM asset WHERE hash=?1"),
                      hashBytes(asset));

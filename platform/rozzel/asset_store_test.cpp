@@ -419,6 +419,19 @@ TEST_F(AssetGarbageTest, DropsTheAssetsOfADeletedZone) {
   EXPECT_EQ(filesBelow(store_.folder() + "/assets"), 0U);
 }
 
+TEST_F(AssetGarbageTest, MakesRoomAlsoWhereItCannotBeNoted) {
+  const RZAsset asset = storeText(*store_.engine(), "content");
+  now_ += 2 * kDay;
+  ASSERT_EQ(FaultPoint::arm("rozzel.garbage.moved=error"), nullptr);
+  RZGarbageReport report;
+  EXPECT_NE(store_.engine()->collectGarbage(report), nullptr);
+  FaultPoint::disarmAll();
+  EXPECT_FALSE(isThere(asset));
+  EXPECT_EQ(filesBelow(store_.folder() + "/staging"), 1U) << "the engine's own file";
+  collect();
+  EXPECT_EQ(store_.engine()->verifyAsset(storeText(*store_.engine(), "content"), {}), nullptr);
+}
+
 TEST_F(AssetGarbageTest, LeavesFilesAloneThatAreNoAssets) {
   storeText(*store_.engine(), "content");
   const std::string stray = store_.folder() + "/assets/00/notes.txt";

@@ -40,7 +40,6 @@ TEST_F(ContentEvictionsTest, WhatHasChangedSinceStays) {
 TEST_F(ContentEvictionsTest, AChangeThatKeepsSizeAndDateCountsAsOne) {
   write("a", content(100'000));
   settle();
-  goOffline();
   const struct stat before = status("a");
   write("a", content(100'000, 2));
   const timespec times[2] = {before.st_atim, before.st_mtim};
@@ -51,8 +50,20 @@ TEST_F(ContentEvictionsTest, AChangeThatKeepsSizeAndDateCountsAsOne) {
 TEST_F(ContentEvictionsTest, AChangeOfAttributesAloneIsNone) {
   write("a", content(100'000));
   settle();
-  goOffline();
   setAttribute("a", "user.note", "text");
+  EXPECT_EQ(evict("a"), nullptr);
+  EXPECT_TRUE(isFault("a"));
+}
+
+TEST_F(ContentEvictionsTest, NothingIsGivenUpWhileTheStoreIsOutOfReach) {
+  write("a", content(100'000));
+  settle();
+  goOffline();
+  const NSErrorRef error = evict("a");
+  ASSERT_NE(error, nullptr);
+  EXPECT_TRUE(isOutOfReach(error)) << error->description();
+  EXPECT_FALSE(isFault("a"));
+  comeBack();
   EXPECT_EQ(evict("a"), nullptr);
   EXPECT_TRUE(isFault("a"));
 }

@@ -62,14 +62,16 @@ NSErrorRef reasonInRows(const ContentCore& core, const JobSubject& subject) {
 NSErrorRef compareContent(const ContentCore& core, Departure& departure, int file) {
   ContentRow& content = *departure.subject.content;
   if (isOpenForWriting(departure.subject.path)) return refusal("it is open somewhere");
+  const bool mayBeSame = content.stamp.hasSameContent(departure.before);
   const auto store = core.storeOf(content.account);
   FileDescriptor stored;
-  const NSErrorRef error = store ? store->open(*content.content, stored) : nullptr;
-  if (error && !isOutOfReach(error)) {
+  const NSErrorRef error = store && mayBeSame ? store->open(*content.content, stored) : nullptr;
+  // Nobody knows then whether it will be there when it is back.
+  if (isOutOfReach(error)) return error;
+  if (error) {
     departure.doubt = Departure::Doubt::Lost;
     return refusal("the store has lost its content; it is sent there again");
   }
-  const bool mayBeSame = content.stamp.hasSameContent(departure.before);
   const auto hashed =
       mayBeSame ? hashUnchanged(file, departure.before, nullptr) : std::optional<RZAsset>();
   if (!hashed || *hashed != *content.content) {

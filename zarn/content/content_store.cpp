@@ -98,9 +98,12 @@ NSErrorRef ContentStore::checkReachability() const {
   return contentError(engine_->checkReachability());
 }
 
-NSErrorRef ContentStore::checkRoom(std::uint64_t size, std::uint64_t replaced) const {
+NSErrorRef ContentStore::checkRoom(const RZRecordZoneID& zone, std::uint64_t size,
+                                   std::uint64_t replaced) const {
+  const bool isOwn = zone.ownerName() == RZCurrentUserDefaultName;
   RZQuota quota;
-  if (NSErrorRef error = engine_->fetchQuota(database_.accountName, quota)) {
+  if (NSErrorRef error =
+          engine_->fetchQuota(isOwn ? database_.accountName : zone.ownerName(), quota)) {
     return contentError(std::move(error));
   }
   const std::uint64_t growth = size > replaced ? size - replaced : 0;
@@ -233,8 +236,10 @@ NSErrorRef ContentStore::saveBatch(const Part& part, std::size_t begin, std::siz
 
 /// What becomes of a document that was refused with `error`.
 NSErrorRef ContentStore::saveAlone(const StoredDocument& document, NSErrorRef error, Saved& saved) {
-  const bool mayBeSaved =
-      rz_isError(error, RZErrorServerRecordChanged) || rz_isError(error, RZErrorPermissionFailure);
+  // The zone may be the one that it comes from: a share that has ended.
+  const bool mayBeSaved = rz_isError(error, RZErrorServerRecordChanged) ||
+                          rz_isError(error, RZErrorPermissionFailure) ||
+                          rz_isError(error, RZErrorZoneNotFound);
   if (mayBeSaved) {
     std::vector<RZFetchedRecord> found;
     const NSErrorRef failure = contentError(

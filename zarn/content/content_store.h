@@ -70,9 +70,10 @@ class ContentStore {
   /// Nil when the store can be reached now. Cheap.
   [[nodiscard]] NSErrorRef checkReachability() const;
 
-  /// NSCocoaErrorDomain 4355 when the account's quota has no room for content of `size` bytes in
-  /// place of content of `replaced` bytes. A save may be refused all the same.
-  [[nodiscard]] NSErrorRef checkRoom(std::uint64_t size, std::uint64_t replaced) const;
+  /// NSCocoaErrorDomain 4355 when the quota of the zone's owner has no room for content of `size`
+  /// bytes in place of content of `replaced` bytes. A save may be refused all the same.
+  [[nodiscard]] NSErrorRef checkRoom(const RZRecordZoneID& zone, std::uint64_t size,
+                                     std::uint64_t replaced) const;
 
   /// Assets that become durable together, with `commit`; null with an error.
   [[nodiscard]] std::unique_ptr<RZAssetGroup> newGroup(NSErrorRef* error) const;

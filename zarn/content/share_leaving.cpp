@@ -164,6 +164,8 @@ NSErrorRef finishOwn(ContentCore& core, const ContentStore& store, const ShareRo
     error = lookForRecords(store, share.zone, isEmpty);
     if (!isEmpty) return error;
   }
+  // The rows must not be back in a zone that is gone after a loss of power.
+  if (!error) error = core.database().makeDurable();
   if (error) return error;
   error = contentError(store.engine()->deleteZone(store.databaseOf(share.zone), share.zone));
   if (error) return error;

@@ -34,7 +34,8 @@ constexpr int kReadings = 3;
 constexpr std::size_t kFewFiles = 4;
 
 bool isContentGone(const NSErrorRef& error) {
-  return rz_isError(error->underlyingError(), RZErrorAssetMissing);
+  return rz_isError(error->underlyingError(), RZErrorAssetMissing) ||
+         rz_isError(error->underlyingError(), RZErrorAssetDamaged);
 }
 
 /// One document on its way.
@@ -239,7 +240,8 @@ class UploadGroup {
   [[nodiscard]] NSErrorRef askForRoom(const Upload& upload, std::uint64_t size) const {
     if (upload.subject.job.state != JobState::OverQuota) return nullptr;
     const auto& before = upload.subject.content;
-    return store_->checkRoom(size, before && before->content ? before->content->size : 0);
+    return store_->checkRoom(upload.subject.zone, size,
+                             before && before->content ? before->content->size : 0);
   }
 
   NSErrorRef take(Upload& upload, int file, StampedLook look) {
@@ -381,7 +383,10 @@ class UploadGroup {
     if (upload.error) {
       if (upload.error->is(NSCocoaErrorDomain, NSUserCancelledError)) return;  // we are ending
       noteRefused(upload);
-      if (upload.isFault && isContentGone(upload.error)) return giveUp(connection, upload);
+      if (isContentGone(upload.error)) {
+        if (upload.isFault) return giveUp(connection, upload);
+        readAnewNextTime(connection, job.item);
+      }
       return core_.postpone(connection, job, upload.error);
     }
     core_.finished.fetch_add(1);
@@ -415,6 +420,14 @@ class UploadGroup {
     const auto& before = upload.subject.content;
     return now && isSharedZone(now->zone) && now->tag != upload.confirmed.tag &&
            (!before || now->tag != before->tag);
+  }
+
+  /// The store has lost what is confirmed there, and this disk still has it.
+  static void readAnewNextTime(Connection& connection, std::uint64_t item) {
+    auto content = findContent(connection, item);
+    if (!content || !content->content) return;
+    content->content.reset();
+    storeContent(connection, *content);
   }
 
   /// A document without content whose content nobody has: trying again changes nothing.

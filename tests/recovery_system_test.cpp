@@ -227,7 +227,9 @@ TEST_F(Recovery, AHundredKillsLeaveNothingHangingAndListsRight) {
     clients.emplace_back([&] {
       while (!stop) {
         LineProcess watch(drive_.commandLine({"--json", "watch", "--list"}), drive_.environment());
-        watch.readUntil([&](const std::string&) { return stop.load(); }, std::chrono::seconds(2));
+        const auto enough = std::chrono::steady_clock::now() + std::chrono::seconds(2);
+        while (!stop && watch.nextLine(enough)) {
+        }
       }
     });
   }

@@ -137,8 +137,7 @@ std::optional<std::string> LineProcess::nextLine(steady_clock::time_point deadli
 
 bool LineProcess::readUntil(const std::function<bool(const std::string&)>& wanted,
                             milliseconds limit) {
-  const auto deadline = steady_clock::now() + limit;
-  while (const auto line = nextLine(deadline)) {
+  while (const auto line = nextLine(steady_clock::now() + limit)) {
     if (wanted(*line)) return true;
   }
   return false;

@@ -38,7 +38,8 @@ class LineProcess {
   [[nodiscard]] pid_t pid() const { return pid_; }
   /// The next line of standard output; nothing at the deadline or when the program has ended.
   std::optional<std::string> nextLine(std::chrono::steady_clock::time_point deadline);
-  /// Reads lines until one for which `wanted` holds; false at the deadline or at the end.
+  /// Reads lines until one for which `wanted` holds; false at the end, or when none has come for
+  /// `limit`: however slow the machine, what goes on is waited for.
   bool readUntil(const std::function<bool(const std::string& line)>& wanted,
                  std::chrono::milliseconds limit = patience);
   /// Waits for the end; nothing at the deadline.

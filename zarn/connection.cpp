@@ -3,6 +3,10 @@
 #include <SQLiteCpp/Exception.h>
 #include <sqlite3.h>
 
+#include <cstdint>
+#include <filesystem>
+#include <system_error>
+
 namespace yomber {
 namespace {
 
@@ -22,11 +26,22 @@ int openFlags(Connection::Mode mode) {
   return access | SQLite::OPEN_NOMUTEX;
 }
 
-const char* pragmas(Connection::Mode mode) {
+/// Smaller files are not mapped for reading: each of the readers that stay open has a mapping of
+/// its own, which counts as memory of this process, and a small file is read as fast without.
+constexpr std::uintmax_t kSmallFile = 32 << 20;
+
+const char* pragmasOfReader(const std::string& path) {
+  std::error_code isMissing;
+  const std::uintmax_t size = std::filesystem::file_size(path, isMissing);
+  if (isMissing || size < kSmallFile) return "PRAGMA cache_size=-512; PRAGMA query_only=1;";
+  // What is not in the log is read where it is mapped.
+  return "PRAGMA mmap_size=2147418112; PRAGMA cache_size=-512; PRAGMA query_only=1;";
+}
+
+const char* pragmas(const std::string& path, Connection::Mode mode) {
   switch (mode) {
     case Connection::Mode::Read:
-      // What is not in the log is read where it is mapped; several of these stay open.
-      return "PRAGMA mmap_size=2147418112; PRAGMA cache_size=-512; PRAGMA query_only=1;";
+      return pragmasOfReader(path);
     case Connection::Mode::Write:
       return "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA mmap_size=2147418112;"
              "PRAGMA cache_size=-8192; PRAGMA temp_store=MEMORY; PRAGMA secure_delete=0;"
@@ -116,7 +131,7 @@ ReadTransaction::~ReadTransaction() {
 
 Connection::Connection(const std::string& path, Mode mode)
     : database_(path, openFlags(mode), kBusyMilliseconds) {
-  database_.exec(pragmas(mode));
+  database_.exec(pragmas(path, mode));
 }
 
 Statement& Connection::prepared(const char* sql) {

@@ -54,6 +54,24 @@ void answerWrite(fuse_req_t request, OpenFile& file, const char* bytes, std::siz
   (void)fuse_reply_write(request, static_cast<std::size_t>(count));
 }
 
+/// EAGAIN when the content has to come first, or is coming. `mayWait`: rather than disturb whoever
+/// is filling it.
+int truncateNow(fuse_req_t request, int place, off_t size, bool mayWait) {
+  const bool isBeingChanged = readAttribute(place, kHeldDateAttribute, nullptr, 0) >= 0;
+  if (isFault(place) && (size != 0 || (mayWait && isBeingChanged))) return EAGAIN;
+  const FileDescriptor file(
+      ::open(pathOfDescriptor(place).c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  if (!file) return errno;  // EAGAIN: leased
+  const bool isHere = !isFault(file.get());
+  if (!isHere && size != 0) return EAGAIN;
+  takeSetIDAway(request, file.get());
+  int failure = isHere ? settleForWriting(file.get()) : 0;
+  if (failure == 0 && ftruncate(file.get(), size) != 0) failure = errno;
+  // Nothing of what is away is wanted any more when nothing stays.
+  if (failure == 0 && !isHere) takeMarksOff(file.get());
+  return failure;
+}
+
 }  // namespace
 
 void FileSystem::withContent(fuse_req_t request, const std::shared_ptr<OpenFile>& file,
@@ -191,27 +209,17 @@ void FileSystem::truncate(fuse_req_t request, Node& node, off_t size, fuse_file_
   }
   Descriptor place;
   int failure = descriptorOf(node, place);
-  if (failure != 0) return then(failure);
-  const std::string path = pathOfDescriptor(place.number);
-  FileDescriptor opened(::open(path.c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
-  if (!opened && errno != EWOULDBLOCK) return then(errno);
-  const bool isHere = opened && !isFault(opened.get());
-  if (isHere || (opened && size == 0)) {
-    // Nothing of what is away is wanted any more when nothing stays.
-    takeSetIDAway(request, opened.get());
-    failure = isHere ? settleForWriting(opened.get()) : 0;
-    if (failure == 0 && ftruncate(opened.get(), size) != 0) failure = errno;
-    if (failure == 0 && !isHere) takeMarksOff(opened.get());
-    return then(failure);
-  }
-  // A part of it stays: that has to be here.
+  if (failure == 0) failure = truncateNow(request, place.number, size, attempts == kAttempts);
+  if (failure != EAGAIN) return then(failure);
   const auto wanted = locationOf(node);
   if (!wanted || attempts == 0) return then(wanted ? EIO : ENOENT);
-  opened = FileDescriptor();
   auto use = std::make_shared<NodeUse>(nodes_.use(node));
   waits_.wait(request, nodes_.use(node), *wanted,
               [this, request, use, size, then = std::move(then), attempts](int waited) {
-                if (waited != 0) return then(waited);
+                // Busy: somebody has it open for writing at this moment. Where nothing stays,
+                // nobody needs what could not be had.
+                const bool goesOn = waited == EBUSY || (size == 0 && waited != EINTR);
+                if (waited != 0 && !goesOn) return then(waited);
                 if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
                 truncate(request, *use->get(), size, nullptr, then, attempts - 1);
               });

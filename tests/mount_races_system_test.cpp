@@ -1,0 +1,166 @@
+// What meets in the mount: applications, whoever fills a file, and what is told of changes.
+#include <atomic>
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <optional>
+#include <thread>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "tests/harness/file_contents.h"
+#include "tests/harness/mount_fixture.h"
+
+namespace yomber::testing {
+namespace {
+
+namespace fs = std::filesystem;
+
+/// A system call beside the test, which may wait for the mount.
+class Aside {
+ public:
+  explicit Aside(std::function<int()> call)
+      : thread_([this, call = std::move(call)] {
+          thread = gettid();
+          result_ = call() < 0 ? errno : 0;
+          isDone_ = true;
+        }) {}
+  ~Aside() {
+    if (thread_.joinable()) thread_.join();
+  }
+  Aside(const Aside&) = delete;
+  Aside& operator=(const Aside&) = delete;
+
+  /// Its errno, or 0, when it is done.
+  [[nodiscard]] int result() {
+    thread_.join();
+    return result_;
+  }
+  /// Whether it is done, or waits for an answer.
+  [[nodiscard]] bool isAsked() const {
+    std::ifstream stack("/proc/self/task/" + std::to_string(thread) + "/wchan");
+    std::string where;
+    stack >> where;
+    return isDone_ || where.find("fuse") != std::string::npos ||
+           where.find("request") != std::string::npos;
+  }
+
+ private:
+  std::atomic<pid_t> thread = 0;
+  int result_ = -1;
+  std::atomic<bool> isDone_ = false;
+  std::thread thread_;
+};
+
+constexpr std::size_t kLarge = 3'000'000;
+constexpr off_t kFarInside = 2'000'000;
+
+constexpr const char* kCopying = "zarn.fill.copying";
+/// Whoever fills a file comes there when somebody else wants to open it.
+constexpr const char* kWanted = "zarn.fill.waited";
+
+/// A file of which a reader wants the content, which is about to be copied into it.
+class FilledFile : public MountFixture {
+ protected:
+  FilledFile(const std::vector<std::string>& gates, const std::vector<std::string>& failing)
+      : MountFixture(gates, failing) {}
+
+  void beginFilling() {
+    makeAway("report", content_);
+    reader_.emplace([this] {
+      const OpenedFile file(at("report"), O_RDONLY);
+      read_ = file.read(1, kFarInside);
+      return 0;
+    });
+    EXPECT_TRUE(eventually([&] { return mounted_.isReached(kCopying); }));
+  }
+  void finishFilling() { mounted_.openGate(kCopying); }
+  [[nodiscard]] std::string whatWasRead() {
+    (void)reader_->result();
+    return read_;
+  }
+
+  const std::string content_ = someContent(kLarge, 1);
+
+ private:
+  std::string read_;
+  std::optional<Aside> reader_;
+};
+
+class WhileAFileIsFilled : public FilledFile {
+ protected:
+  WhileAFileIsFilled() : FilledFile({kCopying, kWanted}, {}) { mounted_.openGate(kWanted); }
+
+  /// `change` waits for the content, and whoever fills the file is alone with it.
+  void expectUndisturbed(const std::function<int()>& change) {
+    beginFilling();
+    Aside changing(change);
+    EXPECT_TRUE(eventually([&] { return changing.isAsked(); }));
+    finishFilling();
+    EXPECT_EQ(changing.result(), 0);
+    EXPECT_EQ(whatWasRead(), content_.substr(kFarInside, 1));
+    EXPECT_FALSE(mounted_.isReached(kWanted));
+  }
+};
+
+TEST_F(WhileAFileIsFilled, WhoEmptiesItWaits) {
+  expectUndisturbed([this] { return truncate(at("report").c_str(), 0); });
+  EXPECT_EQ(fs::file_size(onDisk("report")), 0U);
+  EXPECT_TRUE(isConfirmed("report"));
+}
+
+TEST_F(WhileAFileIsFilled, WhoOpensItToWriteItAnewWaits) {
+  expectUndisturbed([this] {
+    const OpenedFile file(at("report"), O_WRONLY | O_TRUNC);
+    return file.get() < 0 ? -1 : static_cast<int>(write(file.get(), "anew", 4));
+  });
+  EXPECT_EQ(contentOf(onDisk("report")), "anew");
+}
+
+TEST_F(WhileAFileIsFilled, WhoWritesIntoItWaits) {
+  expectUndisturbed([this] {
+    const OpenedFile file(at("report"), O_WRONLY);
+    return static_cast<int>(pwrite(file.get(), "new", 3, kFarInside + 10));
+  });
+  EXPECT_EQ(contentOf(onDisk("report")), std::string(content_).replace(kFarInside + 10, 3, "new"));
+}
+
+TEST_F(WhileAFileIsFilled, WhoCutsItShortWaits) {
+  expectUndisturbed([this] { return truncate(at("report").c_str(), kFarInside + 10); });
+  EXPECT_EQ(contentOf(onDisk("report")), content_.substr(0, kFarInside + 10));
+}
+
+/// Whoever fills gives way at once when somebody around the mount wants to write.
+class WhileAFillingIsGivenUp : public FilledFile {
+ protected:
+  WhileAFillingIsGivenUp() : FilledFile({kCopying}, {kWanted}) {}
+
+  [[nodiscard]] int afterIt(const std::function<int()>& change) {
+    beginFilling();
+    Aside changing(change);
+    EXPECT_TRUE(eventually([&] { return changing.isAsked(); }));
+    const OpenedFile writer(onDisk("report"), O_WRONLY | O_NONBLOCK);
+    EXPECT_LT(writer.get(), 0);
+    finishFilling();
+    return changing.result();
+  }
+};
+
+TEST_F(WhileAFillingIsGivenUp, WhoCutsTheFileShortTriesAgain) {
+  EXPECT_EQ(afterIt([this] { return truncate(at("report").c_str(), kFarInside + 10); }), 0);
+  EXPECT_EQ(contentOf(onDisk("report")), content_.substr(0, kFarInside + 10));
+}
+
+TEST_F(WhileAFillingIsGivenUp, WhoEmptiesTheFileNeedsNoContent) {
+  EXPECT_EQ(afterIt([this] { return truncate(at("report").c_str(), 0); }), 0);
+  EXPECT_EQ(fs::file_size(onDisk("report")), 0U);
+  EXPECT_TRUE(isConfirmed("report"));
+}
+
+}  // namespace
+}  // namespace yomber::testing

@@ -1,4 +1,5 @@
 // What meets in the mount: applications, whoever fills a file, and what is told of changes.
+#include <array>
 #include <atomic>
 #include <cerrno>
 #include <filesystem>
@@ -13,8 +14,11 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/foundation/file_time.h"
+#include "platform/ostrell/constants.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
+#include "tests/harness/stored_thumbnails.h"
 
 namespace yomber::testing {
 namespace {
@@ -134,6 +138,47 @@ TEST_F(WhileAFileIsFilled, WhoCutsItShortWaits) {
   expectUndisturbed([this] { return truncate(at("report").c_str(), kFarInside + 10); });
   EXPECT_EQ(contentOf(onDisk("report")), content_.substr(0, kFarInside + 10));
 }
+
+/// The dates of a file that is filled belong to whoever sets them.
+class WhileDatesArePutBack : public FilledFile, public ::testing::WithParamInterface<const char*> {
+ protected:
+  WhileDatesArePutBack() : FilledFile({kCopying, GetParam()}, {}) {}
+
+  [[nodiscard]] static std::int64_t dateOf(const std::string& path) {
+    struct stat status{};
+    EXPECT_EQ(stat(path.c_str(), &status), 0) << path;
+    return nanosecondsOf(status.st_mtim);
+  }
+  [[nodiscard]] std::int64_t dateInStore() {
+    const StoredThumbnails store(mounted_.drive());
+    const auto record = store.recordOf(client_.identifierAt(onDisk("report")));
+    const auto* const date = record->valueForKey<NSDate>(kQSRecordKeyModified);
+    return date != nullptr ? date->nanoseconds() : 0;
+  }
+};
+
+TEST_P(WhileDatesArePutBack, ADateThatIsSetStays) {
+  constexpr std::int64_t kDate = 981'173'106'123'456'789;  // 2001
+  if (GetParam() != std::string(kCopying)) mounted_.openGate(kCopying);
+  beginFilling();
+  EXPECT_TRUE(eventually([&] { return mounted_.isReached(GetParam()); }));
+  const std::array<timespec, 2> times{timespecOf(kDate), timespecOf(kDate)};
+  EXPECT_EQ(utimensat(AT_FDCWD, at("report").c_str(), times.data(), 0), 0);
+  EXPECT_EQ(dateOf(at("report")), kDate);
+  mounted_.openGate(GetParam());
+  EXPECT_EQ(whatWasRead(), content_.substr(kFarInside, 1));
+  EXPECT_EQ(dateOf(onDisk("report")), kDate);
+  EXPECT_EQ(dateOf(at("report")), kDate);
+  EXPECT_TRUE(isConfirmed("report"));
+  EXPECT_EQ(dateInStore(), kDate);
+}
+
+INSTANTIATE_TEST_SUITE_P(Filling, WhileDatesArePutBack,
+                         ::testing::Values(kCopying, "zarn.fill.verified", "zarn.fill.dated"),
+                         [](const auto& point) {
+                           const std::string name(point.param);
+                           return name.substr(name.rfind('.') + 1);
+                         });
 
 /// Whoever fills gives way at once when somebody around the mount wants to write.
 class WhileAFillingIsGivenUp : public FilledFile {

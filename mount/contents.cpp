@@ -41,12 +41,20 @@ void takeSetIDAway(fuse_req_t request, int file) {
   if (taken != 0) (void)fchmod(file, status.st_mode & ALLPERMS & ~taken);
 }
 
+/// How one write is to be done: the kernel tells with each.
+int writeFlags(const fuse_file_info* info) {
+  // Where the end is, only the disk knows: others may have written there.
+  int flags = (info->flags & O_APPEND) != 0 && info->writepage == 0 ? RWF_APPEND : 0;
+  if ((info->flags & O_DSYNC) != 0) flags |= RWF_DSYNC;
+  if ((info->flags & O_SYNC) == O_SYNC) flags |= RWF_SYNC;
+  return flags;
+}
+
 void answerWrite(fuse_req_t request, OpenFile& file, const char* bytes, std::size_t size,
-                 off_t offset, bool isAppended) {
+                 off_t offset, int flags) {
   takeSetIDAway(request, file.content());
   iovec part{.iov_base = const_cast<char*>(bytes), .iov_len = size};
-  // Where the end is, only the disk knows: others may have written there.
-  const ssize_t count = pwritev2(file.content(), &part, 1, offset, isAppended ? RWF_APPEND : 0);
+  const ssize_t count = pwritev2(file.content(), &part, 1, offset, flags);
   if (count < 0) {
     (void)fuse_reply_err(request, errno);
     return;
@@ -112,13 +120,13 @@ void FileSystem::write(fuse_req_t request, Node& node, const char* bytes, std::s
                        off_t offset, fuse_file_info* info) {
   OpenFile& file = fileOf(info);
   nodes_.noteTold(node, 0);
-  const bool isAppended = (info->flags & O_APPEND) != 0 && info->writepage == 0;
-  if (file.content() >= 0) return answerWrite(request, file, bytes, size, offset, isAppended);
+  const int flags = writeFlags(info);
+  if (file.content() >= 0) return answerWrite(request, file, bytes, size, offset, flags);
   const auto shared = openFiles_.shared(file);
   auto kept = std::make_shared<std::string>(bytes, size);
-  withContent(request, shared, [request, shared, kept, offset, isAppended](int failure) {
+  withContent(request, shared, [request, shared, kept, offset, flags](int failure) {
     if (failure == 0) {
-      return answerWrite(request, *shared, kept->data(), kept->size(), offset, isAppended);
+      return answerWrite(request, *shared, kept->data(), kept->size(), offset, flags);
     }
     (void)fuse_reply_err(request, failure);
   });

@@ -1,12 +1,8 @@
-// What meets in the mount: applications, whoever fills a file, and what is told of changes.
+// What meets in the mount: applications, and whoever fills a file that they use.
 #include <array>
-#include <atomic>
-#include <cerrno>
 #include <filesystem>
-#include <fstream>
 #include <functional>
 #include <optional>
-#include <thread>
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -16,6 +12,7 @@
 
 #include "platform/foundation/file_time.h"
 #include "platform/ostrell/constants.h"
+#include "tests/harness/aside.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
 #include "tests/harness/stored_thumbnails.h"
@@ -24,42 +21,6 @@ namespace yomber::testing {
 namespace {
 
 namespace fs = std::filesystem;
-
-/// A system call beside the test, which may wait for the mount.
-class Aside {
- public:
-  explicit Aside(std::function<int()> call)
-      : thread_([this, call = std::move(call)] {
-          thread = gettid();
-          result_ = call() < 0 ? errno : 0;
-          isDone_ = true;
-        }) {}
-  ~Aside() {
-    if (thread_.joinable()) thread_.join();
-  }
-  Aside(const Aside&) = delete;
-  Aside& operator=(const Aside&) = delete;
-
-  /// Its errno, or 0, when it is done.
-  [[nodiscard]] int result() {
-    thread_.join();
-    return result_;
-  }
-  /// Whether it is done, or waits for an answer.
-  [[nodiscard]] bool isAsked() const {
-    std::ifstream stack("/proc/self/task/" + std::to_string(thread) + "/wchan");
-    std::string where;
-    stack >> where;
-    return isDone_ || where.find("fuse") != std::string::npos ||
-           where.find("request") != std::string::npos;
-  }
-
- private:
-  std::atomic<pid_t> thread = 0;
-  int result_ = -1;
-  std::atomic<bool> isDone_ = false;
-  std::thread thread_;
-};
 
 constexpr std::size_t kLarge = 3'000'000;
 constexpr off_t kFarInside = 2'000'000;

@@ -85,24 +85,27 @@ std::vector<char> withoutOwn(const std::vector<char>& names) {
 }  // namespace
 
 void FileSystem::getattr(fuse_req_t request, Node& node, fuse_file_info* /*info*/) {
+  const EntryGate::Moment begun = gate_.now(node.identity.inode);
   struct statx status{};
   const int failure = statusOf(node, status);
-  if (failure == 0) return answerAttributes(request, node, status);
+  if (failure == 0) return answerAttributes(request, node, status, begun);
   (void)fuse_reply_err(request, failure);
 }
 
 void FileSystem::setattr(fuse_req_t request, Node& node, struct stat* wanted, int which,
                          fuse_file_info* info) {
+  nodes_.noteTold(node, 0);
   const struct stat others = *wanted;
   const auto finish = [this, request, use = std::make_shared<NodeUse>(nodes_.use(node)), others,
                        which](int failure) {
     Descriptor descriptor;
     if (failure == 0) failure = descriptorOf(*use->get(), descriptor);
     if (failure == 0) failure = setOthers(descriptor.number, others, which);
+    const EntryGate::Moment begun = gate_.now(use->get()->identity.inode);
     struct statx status{};
     if (failure == 0) failure = lookAt(descriptor.number, "", status);
     if (failure == 0) putRight(descriptor.number, "", status);
-    if (failure == 0) return answerAttributes(request, *use->get(), status);
+    if (failure == 0) return answerAttributes(request, *use->get(), status, begun);
     (void)fuse_reply_err(request, failure);
   };
   if ((which & FUSE_SET_ATTR_SIZE) == 0) return finish(0);

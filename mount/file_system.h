@@ -141,7 +141,9 @@ class FileSystem {
   [[nodiscard]] double longestTime(const Node& folder) const;
   [[nodiscard]] fuse_entry_param entryOf(const Node& folder, const Node& node,
                                          const struct statx& status, bool holds) const;
-  void answerAttributes(fuse_req_t request, Node& node, struct statx status);
+  /// Answers with what was looked at since `begun`.
+  void answerAttributes(fuse_req_t request, Node& node, struct statx status,
+                        EntryGate::Moment begun);
   /// Answers with an entry that was looked at since `begun`; the kernel knows it from then on.
   void answerFound(fuse_req_t request, Node& folder, const std::string& name,
                    const struct statx& status, EntryGate::Moment begun);

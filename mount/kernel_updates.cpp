@@ -65,8 +65,8 @@ void KernelUpdates::attributesChanged(std::uint64_t folder) {
 }
 
 void KernelUpdates::nodeChanged(Node& node, std::int64_t change) {
-  const std::int64_t told = files_.nodes().told(node);
-  if (told == change) return;
+  files_.gate().change(node.identity.inode);
+  if (files_.nodes().told(node) == change) return;
   files_.nodes().noteTold(node, 0);
   session_.attributesAreOther(node);
 }

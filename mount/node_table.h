@@ -102,6 +102,7 @@ class NodeTable {
 
   /// The kernel was told of attributes with that ctime; 0: it has dropped what it was told.
   void noteTold(Node& node, std::int64_t change);
+  /// The ctime that the kernel knows; none that a file has when it may know another one.
   [[nodiscard]] std::int64_t told(const Node& node) const;
 
   /// The file in the place has another place now. With `isExchange` the two have changed places;
@@ -179,6 +180,7 @@ class NodeTable {
   void place(Node& node, Node& folder, std::string_view name) REQUIRES(mutex_);
   void unplace(Node& node) REQUIRES(mutex_);
   void remove(Node& node, SharedDescriptor remains) REQUIRES(mutex_);
+  static void note(Node& node, std::int64_t change);
   void breakCycle(const Node& node, Node& folder) REQUIRES(mutex_);
   void endUse(Node& node) REQUIRES(mutex_);
   void dropIfUnused(Node& node) REQUIRES(mutex_);

@@ -2,7 +2,14 @@
 
 #include <utility>
 
+#include "platform/foundation/fault_points.h"
+
 namespace yomber {
+namespace {
+
+FaultPoint changeLooked("mount.change.looked");
+
+}  // namespace
 
 void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOnDisk) {
   files_.noteChangedEntry(folder, nameOnDisk);
@@ -13,23 +20,35 @@ void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOn
   int failure = 0;
   const SharedDescriptor descriptor = files_.folders().open(*above.get(), failure);
   if (!descriptor) return entryMayHaveChanged(*above.get(), nameOnDisk);
-  struct statx status{};
-  const bool isThere = lookAt(descriptor->get(), nameOnDisk.c_str(), status) == 0;
+  const Found found = lookAgain(*above.get(), descriptor->get(), nameOnDisk);
   const std::string shown = files_.places().shownName(folder, nameOnDisk);
-  const NodeUse known = nodes.inPlace(*above.get(), nameOnDisk);
-  if (known && isThere && known->identity == FileIdentity::of(status)) {
-    nodeChanged(*known.get(), nanoseconds(status.stx_ctime));
-  } else if (known) {
-    nodes.removed(*above.get(), nameOnDisk);
+  const std::int64_t change = nanoseconds(found.status.stx_ctime);
+  if (found.isOther) {
     session_.entryIsOther(*above.get(), shown);
+  } else if (found.known) {
+    nodeChanged(*found.known.get(), change);
   } else {
     // That there was nothing, or another name of a file that has several.
     session_.entryMayBeOther(*above.get(), shown);
-    const NodeUse same = isThere ? nodes.byInode(status.stx_ino) : NodeUse();
-    if (same && same->identity == FileIdentity::of(status)) {
-      nodeChanged(*same.get(), nanoseconds(status.stx_ctime));
-    }
+    const NodeUse same = found.isThere ? nodes.byInode(found.status.stx_ino) : NodeUse();
+    if (same && same->identity == FileIdentity::of(found.status)) nodeChanged(*same.get(), change);
   }
+}
+
+KernelUpdates::Found KernelUpdates::lookAgain(Node& folder, int descriptor,
+                                              const std::string& nameOnDisk) {
+  NodeTable& nodes = files_.nodes();
+  Found found;
+  // What is being moved through us is on the disk already, and not here yet.
+  const NodeTable::Standstill standstill(nodes);
+  found.isThere = lookAt(descriptor, nameOnDisk.c_str(), found.status) == 0;
+  (void)changeLooked.hit();
+  found.known = nodes.inPlace(folder, nameOnDisk);
+  const bool isSame =
+      found.known && found.isThere && found.known->identity == FileIdentity::of(found.status);
+  found.isOther = found.known && !isSame;
+  if (found.isOther) nodes.removed(folder, nameOnDisk);
+  return found;
 }
 
 /// The folder is not where it was, so the entry cannot be looked at.

@@ -31,6 +31,14 @@ class KernelUpdates {
 
  private:
   void entryMayHaveChanged(Node& folder, const std::string& nameOnDisk);
+  /// What is known in a place, when that is not what is there any more.
+  struct Found {
+    NodeUse known;
+    bool isOther = false;
+    struct statx status{};
+    bool isThere = false;
+  };
+  Found lookAgain(Node& folder, int descriptor, const std::string& nameOnDisk);
   void nodeChanged(Node& node, std::int64_t change);
 
   FileSystem& files_;

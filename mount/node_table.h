@@ -123,8 +123,17 @@ class NodeTable {
    private:
     std::shared_lock<std::shared_mutex> lock_;
   };
+  /// To be held while what is on the disk is compared with what is known here: nothing is being
+  /// moved meanwhile. Waits for whatever is; not while moving.
+  class Standstill {
+   public:
+    explicit Standstill(NodeTable& table) : lock_(table.moving_) {}
+
+   private:
+    std::unique_lock<std::shared_mutex> lock_;
+  };
   /// Returns when whatever is being moved now has been told here. Not while moving.
-  void waitForMoves() { const std::unique_lock<std::shared_mutex> wait(moving_); }
+  void waitForMoves() { const Standstill wait(*this); }
 
   [[nodiscard]] NodeUse use(Node& node);
   [[nodiscard]] NodeUse byInode(std::uint64_t inode);

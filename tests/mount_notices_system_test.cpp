@@ -6,12 +6,15 @@
 #include <vector>
 
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/syscall.h>
 #include <sys/uio.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
+#include "tests/harness/aside.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
 
@@ -19,6 +22,12 @@ namespace yomber::testing {
 namespace {
 
 namespace fs = std::filesystem;
+
+struct stat statusOf(const std::string& path) {
+  struct stat status{};
+  EXPECT_EQ(stat(path.c_str(), &status), 0) << path;
+  return status;
+}
 
 class MountNotices : public MountFixture {
  protected:
@@ -39,6 +48,33 @@ class MountNotices : public MountFixture {
     EXPECT_EQ(fs::file_size(at("witness")), 1U);
   }
 };
+
+constexpr const char* kLooked = "mount.change.looked";
+
+class WhileANoticeIsApplied : public MountNotices {
+ protected:
+  WhileANoticeIsApplied() : MountNotices({kLooked}) {}
+};
+
+TEST_F(WhileANoticeIsApplied, WhatIsMovedThereKeepsItsPlace) {
+  std::ofstream(at("report")) << "old";
+  EXPECT_TRUE(eventually([&] { return mounted_.isReached(kLooked); }));
+  std::ofstream(at("draft")) << "new";
+  const OpenedFile place(at("draft"), O_PATH);
+  Aside moving([&] { return rename(at("draft").c_str(), at("report").c_str()); });
+  EXPECT_TRUE(eventually([&] { return moving.isAsked(); }));
+  // The rename has gone as far as it can when the mount has answered others.
+  struct statvfs space{};
+  for (int i = 0; i < 1000; ++i) EXPECT_EQ(statvfs(mounted_.folder().c_str(), &space), 0);
+  mounted_.openGate(kLooked);
+  EXPECT_EQ(moving.result(), 0);
+  makeWitness();
+  waitForNotices();
+  // Nobody has looked it up since.
+  const std::string self = "/proc/self/fd/" + std::to_string(place.get());
+  EXPECT_EQ(chmod(self.c_str(), 0600), 0);
+  EXPECT_EQ(statusOf(onDisk("report")).st_mode & ALLPERMS, 0600U);
+}
 
 /// Pages of a part of a file that are not on the disk yet; nothing where the system does not tell.
 std::optional<std::uint64_t> unwrittenPages(const std::string& path, off_t offset,

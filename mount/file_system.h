@@ -54,6 +54,10 @@ class FileSystem {
   [[nodiscard]] ContentWaits& contentWaits() { return waits_; }
   [[nodiscard]] Node& root() const { return *root_; }
   [[nodiscard]] Node& nodeOf(fuse_ino_t number) const;
+  /// Whether a read of the node may be waiting for content.
+  [[nodiscard]] bool mayWaitForContent(const Node& node) const {
+    return openFiles_.mayWaitForContent(node);
+  }
   /// The node of something that the root shows although it lies elsewhere.
   [[nodiscard]] Node& nodeOfBase(std::uint32_t base);
 

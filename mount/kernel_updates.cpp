@@ -1,8 +1,10 @@
 #include "mount/kernel_updates.h"
 
+#include <memory>
 #include <utility>
 
 #include "platform/foundation/fault_points.h"
+#include "platform/foundation/thread_pool.h"
 
 namespace yomber {
 namespace {
@@ -55,7 +57,8 @@ KernelUpdates::Found KernelUpdates::lookAgain(Node& folder, int descriptor,
 void KernelUpdates::entryMayHaveChanged(Node& folder, const std::string& nameOnDisk) {
   session_.entryMayBeOther(folder, files_.places().shownName(folder.identity.inode, nameOnDisk));
   if (const NodeUse node = files_.nodes().inPlace(folder, nameOnDisk)) {
-    session_.attributesAreOther(*node.get());
+    files_.nodes().noteTold(*node.get(), 0);
+    nodeIsOther(*node.get());
   }
 }
 
@@ -87,7 +90,19 @@ void KernelUpdates::nodeChanged(Node& node, std::int64_t change) {
   files_.gate().change(node.identity.inode);
   if (files_.nodes().told(node) == change) return;
   files_.nodes().noteTold(node, 0);
+  nodeIsOther(node);
+}
+
+/// All of it: the kernel drops content by itself only when the date is another one, which whoever
+/// changes it may put back.
+void KernelUpdates::nodeIsOther(Node& node) {
+  if (!files_.mayWaitForContent(node)) return session_.contentIsOther(node);
   session_.attributesAreOther(node);
+  // The kernel drops no page that is being read, and waits: maybe for as long as content takes.
+  ThreadPool::shared().async(
+      [&session = session_, use = std::make_shared<NodeUse>(files_.nodes().use(node))] {
+        session.contentIsOther(*use->get());
+      });
 }
 
 void KernelUpdates::anythingChanged() {
@@ -95,7 +110,7 @@ void KernelUpdates::anythingChanged() {
   NodeTable& nodes = files_.nodes();
   for (const NodeUse& node : nodes.all()) {
     nodes.noteTold(*node.get(), 0);
-    session_.contentIsOther(*node.get());
+    nodeIsOther(*node.get());
     const auto place = nodes.placeOf(*node.get());
     if (!place) continue;
     const std::uint64_t folder = place->folder->identity.inode;

@@ -40,6 +40,8 @@ class KernelUpdates {
   };
   Found lookAgain(Node& folder, int descriptor, const std::string& nameOnDisk);
   void nodeChanged(Node& node, std::int64_t change);
+  /// Content and attributes.
+  void nodeIsOther(Node& node);
 
   FileSystem& files_;
   KernelSession& session_;

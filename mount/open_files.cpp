@@ -169,6 +169,14 @@ std::shared_ptr<OpenFile> OpenFiles::of(const Node& node) const {
   return found != files.end() ? *found : files.front();
 }
 
+bool OpenFiles::mayWaitForContent(const Node& node) const {
+  LockGuard guard(mutex_);
+  if (!node.files_) return false;
+  const auto& files = node.files_->files;
+  return std::any_of(files.begin(), files.end(),
+                     [](const auto& file) { return file->content() < 0; });
+}
+
 std::shared_ptr<OpenFile> OpenFiles::shared(const OpenFile& file) const {
   LockGuard guard(mutex_);
   for (const auto& other : file.node().files_->files) {

@@ -1,7 +1,9 @@
 // What the mount is told of changes while applications use what has changed.
+#include <array>
 #include <filesystem>
 #include <fstream>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -29,6 +31,12 @@ struct stat statusOf(const std::string& path) {
   return status;
 }
 
+/// Gives a file or folder the dates that it had.
+void putDatesBack(const std::string& path, const struct stat& before) {
+  const std::array<timespec, 2> times{before.st_atim, before.st_mtim};
+  ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times.data(), 0), 0);
+}
+
 class MountNotices : public MountFixture {
  protected:
   explicit MountNotices(std::vector<std::string> gates = {}) : MountFixture(std::move(gates)) {}
@@ -48,6 +56,45 @@ class MountNotices : public MountFixture {
     EXPECT_EQ(fs::file_size(at("witness")), 1U);
   }
 };
+
+TEST_F(MountNotices, AFolderWhoseDateWasPutBackIsListedAnew) {
+  fs::create_directory(at("d"));
+  std::ofstream(at("d/old")) << "x";
+  ASSERT_TRUE(isConfirmed("d/old"));
+  const auto names = [&] {
+    std::set<std::string> result;
+    for (const auto& entry : fs::directory_iterator(at("d"))) {
+      result.insert(entry.path().filename());
+    }
+    return result;
+  };
+  EXPECT_EQ(names(), std::set<std::string>{"old"});
+  EXPECT_EQ(names(), std::set<std::string>{"old"});
+  const struct stat before = statusOf(onDisk("d"));
+  std::ofstream(onDisk("d/new")) << "x";
+  putDatesBack(onDisk("d"), before);
+  EXPECT_TRUE(eventually([&] { return names() == std::set<std::string>{"new", "old"}; }));
+}
+
+TEST_F(MountNotices, ContentWhoseDateWasPutBackIsReadAnew) {
+  mounted_.unmount();
+  const LineProcess mount({programPath("yomber-mount"), "--home", mounted_.drive().home(),
+                           "--no-pass-through", mounted_.folder()},
+                          mounted_.drive().environment());
+  std::ofstream(onDisk("report")) << "before";
+  ASSERT_TRUE(isConfirmed("report"));
+  ASSERT_TRUE(eventually([&] { return contentOf(at("report")) == "before"; }));
+  const OpenedFile reader(at("report"), O_RDONLY);
+  EXPECT_EQ(reader.read(6, 0), "before");
+  const struct stat before = statusOf(onDisk("report"));
+  {
+    const OpenedFile writer(onDisk("report"), O_WRONLY);
+    ASSERT_EQ(pwrite(writer.get(), "AFTER!", 6, 0), 6);
+  }
+  putDatesBack(onDisk("report"), before);
+  EXPECT_TRUE(eventually([&] { return reader.read(6, 0) == "AFTER!"; }));
+  EXPECT_EQ(contentOf(at("report")), "AFTER!");
+}
 
 constexpr const char* kLooked = "mount.change.looked";
 

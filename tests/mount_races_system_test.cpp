@@ -1,10 +1,12 @@
 // What meets in the mount: applications, and whoever fills a file that they use.
 #include <array>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <optional>
 
 #include <fcntl.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -93,6 +95,35 @@ TEST_F(WhileAFileIsFilled, WhoWritesIntoItWaits) {
     return static_cast<int>(pwrite(file.get(), "new", 3, kFarInside + 10));
   });
   EXPECT_EQ(contentOf(onDisk("report")), std::string(content_).replace(kFarInside + 10, 3, "new"));
+}
+
+TEST_F(WhileAFileIsFilled, WhatIsMappedHoldsUpNoNewsOfOtherFiles) {
+  std::ofstream(at("other")) << "before";
+  EXPECT_TRUE(isConfirmed("other"));
+  beginFilling();
+  const OpenedFile file(at("report"), O_RDONLY);
+  void* const bytes = mmap(nullptr, content_.size(), PROT_READ, MAP_SHARED, file.get(), 0);
+  ASSERT_NE(bytes, MAP_FAILED);
+  char byte = 0;
+  Aside reading([&] {
+    byte = static_cast<const char*>(bytes)[kFarInside];
+    return 0;
+  });
+  EXPECT_TRUE(eventually([&] { return reading.isAsked(); }));
+  EXPECT_EQ(fs::file_size(at("other")), 6U);
+  // The kernel holds the page that is read until its content comes.
+  EXPECT_EQ(chmod(onDisk("report").c_str(), 0600), 0);
+  EXPECT_TRUE(eventually([&] {
+    return (fs::status(at("report")).permissions() & fs::perms::all) == fs::perms(0600);
+  }));
+  std::ofstream(onDisk("other")) << "and after";
+  EXPECT_TRUE(eventually([&] { return fs::file_size(at("other")) == 9U; }));
+  EXPECT_FALSE(reading.isDone());
+  finishFilling();
+  EXPECT_EQ(reading.result(), 0);
+  EXPECT_EQ(byte, content_[kFarInside]);
+  munmap(bytes, content_.size());
+  EXPECT_EQ(whatWasRead(), content_.substr(kFarInside, 1));
 }
 
 TEST_F(WhileAFileIsFilled, WhoCutsItShortWaits) {

@@ -220,7 +220,7 @@ void FileSystem::truncate(fuse_req_t request, Node& node, off_t size, fuse_file_
   if (failure == 0) failure = truncateNow(request, place.number, size, attempts == kAttempts);
   if (failure != EAGAIN) return then(failure);
   const auto wanted = locationOf(node);
-  if (!wanted || attempts == 0) return then(wanted ? EIO : ENOENT);
+  if (!wanted || attempts == 0) return then(wanted ? EBUSY : ENOENT);
   auto use = std::make_shared<NodeUse>(nodes_.use(node));
   waits_.wait(request, nodes_.use(node), *wanted,
               [this, request, use, size, then = std::move(then), attempts](int waited) {

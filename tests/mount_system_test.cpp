@@ -163,6 +163,13 @@ TEST_F(Mount, CuttingShortWhatIsAwayKeepsItsBeginning) {
   EXPECT_EQ(contentOf(at("report")), content.substr(0, 30'000));
 }
 
+TEST_F(Mount, WhatSomebodyWritesToAroundTheMountCannotBeCutShort) {
+  makeAway("report", someContent(50'000, 7));
+  const OpenedFile writer(onDisk("report"), O_WRONLY);
+  EXPECT_EQ(truncate(at("report").c_str(), 30'000), -1);
+  EXPECT_EQ(errno, EBUSY);
+}
+
 TEST_F(Mount, WhatIsAwayIsAllData) {
   const std::string content = someContent(50'000, 8);
   makeAway("report", content);

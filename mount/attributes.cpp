@@ -8,12 +8,15 @@
 #include <array>
 #include <cerrno>
 #include <climits>
+#include <ctime>
+#include <string>
 #include <string_view>
 #include <vector>
 
 #include "mount/file_system.h"
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/file_time.h"
 
 namespace yomber {
 namespace {
@@ -30,6 +33,39 @@ timespec timeFrom(const struct stat& wanted, int which, int set, int setNow, boo
   if ((which & setNow) != 0) return {.tv_sec = 0, .tv_nsec = UTIME_NOW};
   if ((which & set) == 0) return {.tv_sec = 0, .tv_nsec = UTIME_OMIT};
   return isAccess ? wanted.st_atim : wanted.st_mtim;
+}
+
+/// Who is filling the file, or giving it up, puts the date back that is noted in it: ours is noted
+/// instead. Whether there was a note.
+bool noteDate(const std::string& path, const timespec& date) {
+  if (date.tv_nsec == UTIME_OMIT) return false;
+  if (::getxattr(path.c_str(), kHeldDateAttribute, nullptr, 0) < 0) return false;
+  timespec noted = date;
+  if (date.tv_nsec == UTIME_NOW) (void)clock_gettime(CLOCK_REALTIME, &noted);
+  const std::string text = std::to_string(nanosecondsOf(noted));
+  return ::setxattr(path.c_str(), kHeldDateAttribute, text.data(), text.size(), XATTR_REPLACE) == 0;
+}
+
+/// Whether nobody is about to put another date back, or has.
+bool isKept(int descriptor, const std::string& path, const timespec& date) {
+  struct statx status{};
+  if (::getxattr(path.c_str(), kHeldDateAttribute, nullptr, 0) >= 0) return false;
+  return date.tv_nsec == UTIME_NOW || lookAt(descriptor, "", status) != 0 ||
+         nanoseconds(status.stx_mtime) == nanosecondsOf(date);
+}
+
+/// 0 or an errno. `times` as of utimensat.
+int setDates(int descriptor, const std::array<timespec, 2>& times) {
+  constexpr int kAttempts = 8;  // as often as a change may begin or end meanwhile
+  const std::string path = pathOfDescriptor(descriptor);
+  const timespec& date = times[1];
+  for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    // The note first: who puts a date back looks for another note afterwards.
+    const bool isNoted = noteDate(path, date);
+    if (utimensat(descriptor, "", times.data(), AT_EMPTY_PATH) != 0) return errno;
+    if (isNoted || date.tv_nsec == UTIME_OMIT || isKept(descriptor, path, date)) break;
+  }
+  return 0;
 }
 
 /// Names end with a zero each.
@@ -49,24 +85,27 @@ std::vector<char> withoutOwn(const std::vector<char>& names) {
 }  // namespace
 
 void FileSystem::getattr(fuse_req_t request, Node& node, fuse_file_info* /*info*/) {
+  const EntryGate::Moment begun = gate_.now(node.identity.inode);
   struct statx status{};
   const int failure = statusOf(node, status);
-  if (failure == 0) return answerAttributes(request, node, status);
+  if (failure == 0) return answerAttributes(request, node, status, begun);
   (void)fuse_reply_err(request, failure);
 }
 
 void FileSystem::setattr(fuse_req_t request, Node& node, struct stat* wanted, int which,
                          fuse_file_info* info) {
+  nodes_.noteTold(node, 0);
   const struct stat others = *wanted;
   const auto finish = [this, request, use = std::make_shared<NodeUse>(nodes_.use(node)), others,
                        which](int failure) {
     Descriptor descriptor;
     if (failure == 0) failure = descriptorOf(*use->get(), descriptor);
     if (failure == 0) failure = setOthers(descriptor.number, others, which);
+    const EntryGate::Moment begun = gate_.now(use->get()->identity.inode);
     struct statx status{};
     if (failure == 0) failure = lookAt(descriptor.number, "", status);
     if (failure == 0) putRight(descriptor.number, "", status);
-    if (failure == 0) return answerAttributes(request, *use->get(), status);
+    if (failure == 0) return answerAttributes(request, *use->get(), status, begun);
     (void)fuse_reply_err(request, failure);
   };
   if ((which & FUSE_SET_ATTR_SIZE) == 0) return finish(0);
@@ -92,7 +131,7 @@ int FileSystem::setOthers(int descriptor, const struct stat& wanted, int which) 
   const std::array<timespec, 2> times{
       timeFrom(wanted, which, FUSE_SET_ATTR_ATIME, FUSE_SET_ATTR_ATIME_NOW, true),
       timeFrom(wanted, which, FUSE_SET_ATTR_MTIME, FUSE_SET_ATTR_MTIME_NOW, false)};
-  return utimensat(descriptor, "", times.data(), AT_EMPTY_PATH) == 0 ? 0 : errno;
+  return setDates(descriptor, times);
 }
 
 void FileSystem::readlink(fuse_req_t request, Node& node) {

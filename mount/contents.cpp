@@ -41,17 +41,43 @@ void takeSetIDAway(fuse_req_t request, int file) {
   if (taken != 0) (void)fchmod(file, status.st_mode & ALLPERMS & ~taken);
 }
 
+/// How one write is to be done: the kernel tells with each.
+int writeFlags(const fuse_file_info* info) {
+  // Where the end is, only the disk knows: others may have written there.
+  int flags = (info->flags & O_APPEND) != 0 && info->writepage == 0 ? RWF_APPEND : 0;
+  if ((info->flags & O_DSYNC) != 0) flags |= RWF_DSYNC;
+  if ((info->flags & O_SYNC) == O_SYNC) flags |= RWF_SYNC;
+  return flags;
+}
+
 void answerWrite(fuse_req_t request, OpenFile& file, const char* bytes, std::size_t size,
-                 off_t offset, bool isAppended) {
+                 off_t offset, int flags) {
   takeSetIDAway(request, file.content());
   iovec part{.iov_base = const_cast<char*>(bytes), .iov_len = size};
-  // Where the end is, only the disk knows: others may have written there.
-  const ssize_t count = pwritev2(file.content(), &part, 1, offset, isAppended ? RWF_APPEND : 0);
+  const ssize_t count = pwritev2(file.content(), &part, 1, offset, flags);
   if (count < 0) {
     (void)fuse_reply_err(request, errno);
     return;
   }
   (void)fuse_reply_write(request, static_cast<std::size_t>(count));
+}
+
+/// EAGAIN when the content has to come first, or is coming. `mayWait`: rather than disturb whoever
+/// is filling it.
+int truncateNow(fuse_req_t request, int place, off_t size, bool mayWait) {
+  const bool isBeingChanged = readAttribute(place, kHeldDateAttribute, nullptr, 0) >= 0;
+  if (isFault(place) && (size != 0 || (mayWait && isBeingChanged))) return EAGAIN;
+  const FileDescriptor file(
+      ::open(pathOfDescriptor(place).c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  if (!file) return errno;  // EAGAIN: leased
+  const bool isHere = !isFault(file.get());
+  if (!isHere && size != 0) return EAGAIN;
+  takeSetIDAway(request, file.get());
+  int failure = isHere ? settleForWriting(file.get()) : 0;
+  if (failure == 0 && ftruncate(file.get(), size) != 0) failure = errno;
+  // Nothing of what is away is wanted any more when nothing stays.
+  if (failure == 0 && !isHere) takeMarksOff(file.get());
+  return failure;
 }
 
 }  // namespace
@@ -94,13 +120,13 @@ void FileSystem::write(fuse_req_t request, Node& node, const char* bytes, std::s
                        off_t offset, fuse_file_info* info) {
   OpenFile& file = fileOf(info);
   nodes_.noteTold(node, 0);
-  const bool isAppended = (info->flags & O_APPEND) != 0 && info->writepage == 0;
-  if (file.content() >= 0) return answerWrite(request, file, bytes, size, offset, isAppended);
+  const int flags = writeFlags(info);
+  if (file.content() >= 0) return answerWrite(request, file, bytes, size, offset, flags);
   const auto shared = openFiles_.shared(file);
   auto kept = std::make_shared<std::string>(bytes, size);
-  withContent(request, shared, [request, shared, kept, offset, isAppended](int failure) {
+  withContent(request, shared, [request, shared, kept, offset, flags](int failure) {
     if (failure == 0) {
-      return answerWrite(request, *shared, kept->data(), kept->size(), offset, isAppended);
+      return answerWrite(request, *shared, kept->data(), kept->size(), offset, flags);
     }
     (void)fuse_reply_err(request, failure);
   });
@@ -191,27 +217,17 @@ void FileSystem::truncate(fuse_req_t request, Node& node, off_t size, fuse_file_
   }
   Descriptor place;
   int failure = descriptorOf(node, place);
-  if (failure != 0) return then(failure);
-  const std::string path = pathOfDescriptor(place.number);
-  FileDescriptor opened(::open(path.c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
-  if (!opened && errno != EWOULDBLOCK) return then(errno);
-  const bool isHere = opened && !isFault(opened.get());
-  if (isHere || (opened && size == 0)) {
-    // Nothing of what is away is wanted any more when nothing stays.
-    takeSetIDAway(request, opened.get());
-    failure = isHere ? settleForWriting(opened.get()) : 0;
-    if (failure == 0 && ftruncate(opened.get(), size) != 0) failure = errno;
-    if (failure == 0 && !isHere) takeMarksOff(opened.get());
-    return then(failure);
-  }
-  // A part of it stays: that has to be here.
+  if (failure == 0) failure = truncateNow(request, place.number, size, attempts == kAttempts);
+  if (failure != EAGAIN) return then(failure);
   const auto wanted = locationOf(node);
-  if (!wanted || attempts == 0) return then(wanted ? EIO : ENOENT);
-  opened = FileDescriptor();
+  if (!wanted || attempts == 0) return then(wanted ? EBUSY : ENOENT);
   auto use = std::make_shared<NodeUse>(nodes_.use(node));
   waits_.wait(request, nodes_.use(node), *wanted,
               [this, request, use, size, then = std::move(then), attempts](int waited) {
-                if (waited != 0) return then(waited);
+                // Busy: somebody has it open for writing at this moment. Where nothing stays,
+                // nobody needs what could not be had.
+                const bool goesOn = waited == EBUSY || (size == 0 && waited != EINTR);
+                if (waited != 0 && !goesOn) return then(waited);
                 if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
                 truncate(request, *use->get(), size, nullptr, then, attempts - 1);
               });

@@ -7,8 +7,8 @@
 
 namespace yomber {
 
-/// Keeps entries from being told for good that were looked at before a change of which the kernel
-/// has been told already.
+/// Keeps entries and attributes from being told for good that were looked at before a change of
+/// which the kernel has been told already.
 ///
 /// Who tells an entry asks `now` before it looks, and tells while it holds a Telling. Who learns of
 /// a change calls `change` before it tells the kernel. Thread-safety: any threads.
@@ -16,9 +16,11 @@ class EntryGate {
  public:
   using Moment = std::uint64_t;
 
+  /// Of a folder's entries, or of what has that inode itself.
   [[nodiscard]] Moment now(std::uint64_t folder) const { return shard(folder).changes.load(); }
 
-  /// An entry of the folder with that inode has changed. Waits for those who are telling.
+  /// An entry of the folder with that inode, or what has it, has changed. Waits for those who are
+  /// telling.
   void change(std::uint64_t folder) { change(shard(folder)); }
   /// Anything may have changed.
   void changeAll() {

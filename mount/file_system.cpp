@@ -200,13 +200,16 @@ fuse_entry_param FileSystem::entryOf(const Node& folder, const Node& node,
   return entry;
 }
 
-void FileSystem::answerAttributes(fuse_req_t request, Node& node, struct statx status) {
+void FileSystem::answerAttributes(fuse_req_t request, Node& node, struct statx status,
+                                  EntryGate::Moment begun) {
+  const EntryGate::Telling telling(gate_, node.identity.inode, begun);
   nodes_.noteTold(node, nanoseconds(status.stx_ctime));
   node.mayBeAway = mayHaveHoles(status);
   const struct stat attributes = statOf(status);
   const auto place = nodes_.placeOf(node);
   const double inFolder = longestTime(place ? *place->folder.get() : node);
-  (void)fuse_reply_attr(request, &attributes, std::min(inFolder, longestTime(node)));
+  const double longest = std::min(inFolder, longestTime(node));
+  (void)fuse_reply_attr(request, &attributes, telling.holds() ? longest : 0);
 }
 
 void FileSystem::answerBase(fuse_req_t request, std::uint32_t base) {

@@ -54,6 +54,10 @@ class FileSystem {
   [[nodiscard]] ContentWaits& contentWaits() { return waits_; }
   [[nodiscard]] Node& root() const { return *root_; }
   [[nodiscard]] Node& nodeOf(fuse_ino_t number) const;
+  /// Whether a read of the node may be waiting for content.
+  [[nodiscard]] bool mayWaitForContent(const Node& node) const {
+    return openFiles_.mayWaitForContent(node);
+  }
   /// The node of something that the root shows although it lies elsewhere.
   [[nodiscard]] Node& nodeOfBase(std::uint32_t base);
 
@@ -141,7 +145,9 @@ class FileSystem {
   [[nodiscard]] double longestTime(const Node& folder) const;
   [[nodiscard]] fuse_entry_param entryOf(const Node& folder, const Node& node,
                                          const struct statx& status, bool holds) const;
-  void answerAttributes(fuse_req_t request, Node& node, struct statx status);
+  /// Answers with what was looked at since `begun`.
+  void answerAttributes(fuse_req_t request, Node& node, struct statx status,
+                        EntryGate::Moment begun);
   /// Answers with an entry that was looked at since `begun`; the kernel knows it from then on.
   void answerFound(fuse_req_t request, Node& folder, const std::string& name,
                    const struct statx& status, EntryGate::Moment begun);

@@ -1,8 +1,17 @@
 #include "mount/kernel_updates.h"
 
+#include <memory>
 #include <utility>
 
+#include "platform/foundation/fault_points.h"
+#include "platform/foundation/thread_pool.h"
+
 namespace yomber {
+namespace {
+
+FaultPoint changeLooked("mount.change.looked");
+
+}  // namespace
 
 void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOnDisk) {
   files_.noteChangedEntry(folder, nameOnDisk);
@@ -13,30 +22,43 @@ void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOn
   int failure = 0;
   const SharedDescriptor descriptor = files_.folders().open(*above.get(), failure);
   if (!descriptor) return entryMayHaveChanged(*above.get(), nameOnDisk);
-  struct statx status{};
-  const bool isThere = lookAt(descriptor->get(), nameOnDisk.c_str(), status) == 0;
+  const Found found = lookAgain(*above.get(), descriptor->get(), nameOnDisk);
   const std::string shown = files_.places().shownName(folder, nameOnDisk);
-  const NodeUse known = nodes.inPlace(*above.get(), nameOnDisk);
-  if (known && isThere && known->identity == FileIdentity::of(status)) {
-    nodeChanged(*known.get(), nanoseconds(status.stx_ctime));
-  } else if (known) {
-    nodes.removed(*above.get(), nameOnDisk);
+  const std::int64_t change = nanoseconds(found.status.stx_ctime);
+  if (found.isOther) {
     session_.entryIsOther(*above.get(), shown);
+  } else if (found.known) {
+    nodeChanged(*found.known.get(), change);
   } else {
     // That there was nothing, or another name of a file that has several.
     session_.entryMayBeOther(*above.get(), shown);
-    const NodeUse same = isThere ? nodes.byInode(status.stx_ino) : NodeUse();
-    if (same && same->identity == FileIdentity::of(status)) {
-      nodeChanged(*same.get(), nanoseconds(status.stx_ctime));
-    }
+    const NodeUse same = found.isThere ? nodes.byInode(found.status.stx_ino) : NodeUse();
+    if (same && same->identity == FileIdentity::of(found.status)) nodeChanged(*same.get(), change);
   }
+}
+
+KernelUpdates::Found KernelUpdates::lookAgain(Node& folder, int descriptor,
+                                              const std::string& nameOnDisk) {
+  NodeTable& nodes = files_.nodes();
+  Found found;
+  // What is being moved through us is on the disk already, and not here yet.
+  const NodeTable::Standstill standstill(nodes);
+  found.isThere = lookAt(descriptor, nameOnDisk.c_str(), found.status) == 0;
+  (void)changeLooked.hit();
+  found.known = nodes.inPlace(folder, nameOnDisk);
+  const bool isSame =
+      found.known && found.isThere && found.known->identity == FileIdentity::of(found.status);
+  found.isOther = found.known && !isSame;
+  if (found.isOther) nodes.removed(folder, nameOnDisk);
+  return found;
 }
 
 /// The folder is not where it was, so the entry cannot be looked at.
 void KernelUpdates::entryMayHaveChanged(Node& folder, const std::string& nameOnDisk) {
   session_.entryMayBeOther(folder, files_.places().shownName(folder.identity.inode, nameOnDisk));
   if (const NodeUse node = files_.nodes().inPlace(folder, nameOnDisk)) {
-    session_.attributesAreOther(*node.get());
+    files_.nodes().noteTold(*node.get(), 0);
+    nodeIsOther(*node.get());
   }
 }
 
@@ -65,10 +87,22 @@ void KernelUpdates::attributesChanged(std::uint64_t folder) {
 }
 
 void KernelUpdates::nodeChanged(Node& node, std::int64_t change) {
-  const std::int64_t told = files_.nodes().told(node);
-  if (told == change) return;
+  files_.gate().change(node.identity.inode);
+  if (files_.nodes().told(node) == change) return;
   files_.nodes().noteTold(node, 0);
+  nodeIsOther(node);
+}
+
+/// All of it: the kernel drops content by itself only when the date is another one, which whoever
+/// changes it may put back.
+void KernelUpdates::nodeIsOther(Node& node) {
+  if (!files_.mayWaitForContent(node)) return session_.contentIsOther(node);
   session_.attributesAreOther(node);
+  // The kernel drops no page that is being read, and waits: maybe for as long as content takes.
+  ThreadPool::shared().async(
+      [&session = session_, use = std::make_shared<NodeUse>(files_.nodes().use(node))] {
+        session.contentIsOther(*use->get());
+      });
 }
 
 void KernelUpdates::anythingChanged() {
@@ -76,7 +110,7 @@ void KernelUpdates::anythingChanged() {
   NodeTable& nodes = files_.nodes();
   for (const NodeUse& node : nodes.all()) {
     nodes.noteTold(*node.get(), 0);
-    session_.contentIsOther(*node.get());
+    nodeIsOther(*node.get());
     const auto place = nodes.placeOf(*node.get());
     if (!place) continue;
     const std::uint64_t folder = place->folder->identity.inode;

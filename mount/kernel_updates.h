@@ -31,7 +31,17 @@ class KernelUpdates {
 
  private:
   void entryMayHaveChanged(Node& folder, const std::string& nameOnDisk);
+  /// What is known in a place, when that is not what is there any more.
+  struct Found {
+    NodeUse known;
+    bool isOther = false;
+    struct statx status{};
+    bool isThere = false;
+  };
+  Found lookAgain(Node& folder, int descriptor, const std::string& nameOnDisk);
   void nodeChanged(Node& node, std::int64_t change);
+  /// Content and attributes.
+  void nodeIsOther(Node& node);
 
   FileSystem& files_;
   KernelSession& session_;

@@ -78,6 +78,7 @@ void FileSystem::makeLink(fuse_req_t request, Node& node, Node& target, const ch
     return;
   }
   nodes_.noteTold(target, 0);
+  nodes_.noteTold(node, 0);
   answerMade(request, target, opened->get(), name);
 }
 

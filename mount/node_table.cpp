@@ -1,6 +1,7 @@
 #include "mount/node_table.h"
 
 #include <algorithm>
+#include <limits>
 #include <utility>
 
 #include "mount/open_files.h"
@@ -14,6 +15,9 @@ bool isUnwatchedFolder(const Node& folder, std::string_view name) {
   return folder.isUnwatched || name.ends_with(".nosync") ||
          (folder.base == Places::kTrash && name == "info");
 }
+
+/// What of several ctimes the kernel knows. Other than 0, it stays until what it knows is dropped.
+constexpr std::int64_t kUnknownChange = std::numeric_limits<std::int64_t>::min();
 
 }  // namespace
 
@@ -69,7 +73,7 @@ Node& NodeTable::found(Node& folder, std::string_view name, const struct statx& 
   ++node.lookups_;
   node.mayBeAway = mayHaveHoles(status);
   if (!node.base && (node.parent_ != &folder || node.name_ != name)) place(node, folder, name);
-  node.toldChange_ = nanoseconds(status.stx_ctime);
+  note(node, nanoseconds(status.stx_ctime));
   return node;
 }
 
@@ -83,7 +87,13 @@ void NodeTable::forget(Node& node, std::uint64_t lookups) {
 
 void NodeTable::noteTold(Node& node, std::int64_t change) {
   LockGuard guard(mutex_);
-  node.toldChange_ = change;
+  note(node, change);
+}
+
+/// Of two answers to requests that met, the kernel takes the one that it sees first.
+void NodeTable::note(Node& node, std::int64_t change) {
+  const bool isOther = change != 0 && node.toldChange_ != 0 && node.toldChange_ != change;
+  node.toldChange_ = isOther ? kUnknownChange : change;
 }
 
 std::int64_t NodeTable::told(const Node& node) const {

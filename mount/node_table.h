@@ -102,6 +102,7 @@ class NodeTable {
 
   /// The kernel was told of attributes with that ctime; 0: it has dropped what it was told.
   void noteTold(Node& node, std::int64_t change);
+  /// The ctime that the kernel knows; none that a file has when it may know another one.
   [[nodiscard]] std::int64_t told(const Node& node) const;
 
   /// The file in the place has another place now. With `isExchange` the two have changed places;
@@ -122,8 +123,17 @@ class NodeTable {
    private:
     std::shared_lock<std::shared_mutex> lock_;
   };
+  /// To be held while what is on the disk is compared with what is known here: nothing is being
+  /// moved meanwhile. Waits for whatever is; not while moving.
+  class Standstill {
+   public:
+    explicit Standstill(NodeTable& table) : lock_(table.moving_) {}
+
+   private:
+    std::unique_lock<std::shared_mutex> lock_;
+  };
   /// Returns when whatever is being moved now has been told here. Not while moving.
-  void waitForMoves() { const std::unique_lock<std::shared_mutex> wait(moving_); }
+  void waitForMoves() { const Standstill wait(*this); }
 
   [[nodiscard]] NodeUse use(Node& node);
   [[nodiscard]] NodeUse byInode(std::uint64_t inode);
@@ -179,6 +189,7 @@ class NodeTable {
   void place(Node& node, Node& folder, std::string_view name) REQUIRES(mutex_);
   void unplace(Node& node) REQUIRES(mutex_);
   void remove(Node& node, SharedDescriptor remains) REQUIRES(mutex_);
+  static void note(Node& node, std::int64_t change);
   void breakCycle(const Node& node, Node& folder) REQUIRES(mutex_);
   void endUse(Node& node) REQUIRES(mutex_);
   void dropIfUnused(Node& node) REQUIRES(mutex_);

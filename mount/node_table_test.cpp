@@ -57,6 +57,22 @@ TEST_F(NodeTableTest, AnInodeNumberThatIsGivenAgainIsAnotherNode) {
   EXPECT_EQ(nodes_.byInode(10).get(), &second);
 }
 
+TEST_F(NodeTableTest, OfTwoAnswersThatMetTheKernelMayHaveEither) {
+  Node& node = file(root_, "a", 10);
+  nodes_.noteTold(node, 0);
+  nodes_.noteTold(node, 7);
+  nodes_.noteTold(node, 7);
+  EXPECT_EQ(nodes_.told(node), 7);
+  nodes_.noteTold(node, 8);
+  EXPECT_NE(nodes_.told(node), 7);
+  EXPECT_NE(nodes_.told(node), 8);
+  nodes_.noteTold(node, 8);
+  EXPECT_NE(nodes_.told(node), 8);
+  nodes_.noteTold(node, 0);
+  nodes_.noteTold(node, 8);
+  EXPECT_EQ(nodes_.told(node), 8);
+}
+
 TEST_F(NodeTableTest, AFolderStaysWhileTheKernelKnowsWhatIsInIt) {
   Node& d = folder(root_, "d", 10);
   Node& a = file(d, "a", 11);

@@ -53,6 +53,7 @@ bool OpenFile::isWritable() const { return (flags_ & O_ACCMODE) != O_RDONLY; }
 int OpenFile::openContent() {
   LockGuard guard(mutex_);
   if (content() >= 0) return 0;
+  if (isFault(place_.get())) return EAGAIN;  // whoever is filling it is to be alone with it
   const int flags = O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
   FileDescriptor opened(::open(pathOfDescriptor(place_.get()).c_str(), flags_ | flags));
   if (!opened) return errno;  // EAGAIN: leased
@@ -106,8 +107,12 @@ int openInPlace(int folder, const char* name, int flags, bool mayBeAway, FileDes
 }
 
 int openAgain(int descriptor, int flags, FileDescriptor& content, FileDescriptor& place) {
-  return openEither(AT_FDCWD, pathOfDescriptor(descriptor).c_str(), flags, kOwnFlags & ~O_NOFOLLOW,
-                    content, place);
+  const std::string path = pathOfDescriptor(descriptor);
+  if (isFault(descriptor)) {
+    place = FileDescriptor(::open(path.c_str(), O_PATH | O_CLOEXEC));
+    return place ? 0 : errno;
+  }
+  return openEither(AT_FDCWD, path.c_str(), flags, kOwnFlags & ~O_NOFOLLOW, content, place);
 }
 
 std::shared_ptr<OpenFile> OpenFiles::add(NodeTable& nodes, Node& node, int flags,
@@ -162,6 +167,14 @@ std::shared_ptr<OpenFile> OpenFiles::of(const Node& node) const {
   const auto found = std::find_if(files.begin(), files.end(),
                                   [](const auto& file) { return file->content() >= 0; });
   return found != files.end() ? *found : files.front();
+}
+
+bool OpenFiles::mayWaitForContent(const Node& node) const {
+  LockGuard guard(mutex_);
+  if (!node.files_) return false;
+  const auto& files = node.files_->files;
+  return std::any_of(files.begin(), files.end(),
+                     [](const auto& file) { return file->content() < 0; });
 }
 
 std::shared_ptr<OpenFile> OpenFiles::shared(const OpenFile& file) const {

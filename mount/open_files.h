@@ -92,6 +92,8 @@ class OpenFiles {
   [[nodiscard]] int backingOf(const Node& node) const;
   /// Any open file of the node, one with content first; nil when there is none.
   [[nodiscard]] std::shared_ptr<OpenFile> of(const Node& node) const;
+  /// Whether anybody has the node open whose reads may wait for content.
+  [[nodiscard]] bool mayWaitForContent(const Node& node) const;
   [[nodiscard]] std::shared_ptr<OpenFile> shared(const OpenFile& file) const;
 
  private:

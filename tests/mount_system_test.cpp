@@ -20,38 +20,15 @@
 
 #include <gtest/gtest.h>
 
-#include "tests/harness/content_client.h"
 #include "tests/harness/file_contents.h"
-#include "tests/harness/mounted_drive.h"
+#include "tests/harness/mount_fixture.h"
 
 namespace yomber::testing {
 namespace {
 
 namespace fs = std::filesystem;
-using Local = ContentClient::Local;
-using Upload = ContentClient::Upload;
 
 constexpr std::size_t kKept = 4096;
-
-class OpenedFile {
- public:
-  OpenedFile(const std::string& path, int flags) : file_(open(path.c_str(), flags | O_CLOEXEC)) {}
-  ~OpenedFile() {
-    if (file_ >= 0) close(file_);
-  }
-  OpenedFile(const OpenedFile&) = delete;
-  OpenedFile& operator=(const OpenedFile&) = delete;
-  [[nodiscard]] int get() const { return file_; }
-  [[nodiscard]] std::string read(std::size_t size, off_t offset) const {
-    std::string bytes(size, '\0');
-    const ssize_t count = pread(file_, bytes.data(), size, offset);
-    bytes.resize(static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
-    return bytes;
-  }
-
- private:
-  const int file_;
-};
 
 /// A shell command's output; the test fails when it does.
 std::string shell(const std::string& command) {
@@ -60,33 +37,7 @@ std::string shell(const std::string& command) {
   return result.output;
 }
 
-class Mount : public ::testing::Test {
- protected:
-  Mount() : client_(mounted_.drive().home()) {}
-
-  [[nodiscard]] std::string at(const std::string& name) const { return mounted_.at(name); }
-  [[nodiscard]] std::string onDisk(const std::string& name) const { return mounted_.onDisk(name); }
-
-  bool isConfirmed(const std::string& name) {
-    return eventually([&] { return client_.state(onDisk(name)).upload == Upload::CONFIRMED; });
-  }
-  bool isAway(const std::string& name) { return client_.state(onDisk(name)).local == Local::FAULT; }
-  /// A document that the store has and this disk has not.
-  void makeAway(const std::string& name, const std::string& content) {
-    std::ofstream(at(name), std::ios::binary) << content;
-    evict(name);
-  }
-  void evict(const std::string& name) {
-    ASSERT_TRUE(isConfirmed(name)) << name;
-    ASSERT_TRUE(eventually([&] { return client_.evict(onDisk(name)) == nullptr; })) << name;
-    ASSERT_TRUE(isAway(name)) << name;
-  }
-  void goOffline() { std::ofstream(mounted_.drive().home() + "/store/offline").put('x'); }
-  void goOnline() { fs::remove(mounted_.drive().home() + "/store/offline"); }
-
-  MountedDrive mounted_;
-  ContentClient client_;
-};
+class Mount : public MountFixture {};
 
 TEST_F(Mount, ContentThatIsAwayComesWithTheFirstRead) {
   const std::string content = someContent(3'000'000, 1);
@@ -210,6 +161,13 @@ TEST_F(Mount, CuttingShortWhatIsAwayKeepsItsBeginning) {
   makeAway("report", content);
   EXPECT_EQ(truncate(at("report").c_str(), 30'000), 0);
   EXPECT_EQ(contentOf(at("report")), content.substr(0, 30'000));
+}
+
+TEST_F(Mount, WhatSomebodyWritesToAroundTheMountCannotBeCutShort) {
+  makeAway("report", someContent(50'000, 7));
+  const OpenedFile writer(onDisk("report"), O_WRONLY);
+  EXPECT_EQ(truncate(at("report").c_str(), 30'000), -1);
+  EXPECT_EQ(errno, EBUSY);
 }
 
 TEST_F(Mount, WhatIsAwayIsAllData) {

@@ -3,7 +3,10 @@
 #include <sys/xattr.h>
 
 #include <array>
+#include <cerrno>
 #include <fstream>
+
+#include "platform/foundation/descriptor_path.h"
 
 namespace yomber {
 
@@ -34,11 +37,17 @@ bool isFaultAtPath(const std::string& path) {
       filled, lgetxattr(path.c_str(), kFilledAttribute, filled.data(), filled.size()));
 }
 
+ssize_t readAttribute(int descriptor, const char* name, void* value, std::size_t size) {
+  const ssize_t length = fgetxattr(descriptor, name, value, size);
+  if (length >= 0 || errno != EBADF) return length;
+  return getxattr(pathOfDescriptor(descriptor).c_str(), name, value, size);
+}
+
 bool isFault(int descriptor) {
-  if (fgetxattr(descriptor, kFaultAttribute, nullptr, 0) < 0) return false;
+  if (readAttribute(descriptor, kFaultAttribute, nullptr, 0) < 0) return false;
   std::array<char, 64> filled{};
-  return !isFilledInThisBoot(filled,
-                             fgetxattr(descriptor, kFilledAttribute, filled.data(), filled.size()));
+  return !isFilledInThisBoot(
+      filled, readAttribute(descriptor, kFilledAttribute, filled.data(), filled.size()));
 }
 
 }  // namespace yomber

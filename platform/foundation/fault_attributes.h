@@ -1,5 +1,8 @@
 #pragma once
 
+#include <sys/types.h>
+
+#include <cstddef>
 #include <cstdint>
 #include <string>
 #include <string_view>
@@ -24,7 +27,10 @@ inline constexpr std::uint64_t kKeptBytes = 4096;
 
 /// Whether `path` (a final symbolic link is not followed) is a fault whose content cannot be read.
 [[nodiscard]] bool isFaultAtPath(const std::string& path);
-/// The same of an open file.
+/// The same of an open file, or of one that is open as a place only (O_PATH).
 [[nodiscard]] bool isFault(int descriptor);
+/// An extended attribute of either; as getxattr(2).
+[[nodiscard]] ssize_t readAttribute(int descriptor, const char* name, void* value,
+                                    std::size_t size);
 
 }  // namespace yomber

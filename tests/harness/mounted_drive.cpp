@@ -3,8 +3,10 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <optional>
 #include <stdexcept>
+#include <utility>
 
 #include <sys/mount.h>
 #include <sys/stat.h>
@@ -43,21 +45,37 @@ std::optional<pid_t> processWith(const std::string& name, const std::string& arg
 
 }  // namespace
 
-MountedDrive::MountedDrive() {
+MountedDrive::MountedDrive(std::vector<std::string> gates, const std::vector<std::string>& failing)
+    : gates_(std::move(gates)) {
   std::string pattern = (fs::temp_directory_path() / "yomber-mount-XXXXXX").string();
   if (mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("no folder to mount in");
   folder_ = pattern;
+  std::string faults;
+  for (const std::string& gate : gates_) faults += gate + "=pause-until-file:" + fileOf(gate) + ",";
+  for (const std::string& point : failing) faults += point + "=error,";
+  if (!faults.empty()) drive_.environment()["YOMBER_FAULTS"] = faults;
   chmod(folder_.c_str(), 0755);
   drive_.up();
   mount();
 }
 
 MountedDrive::~MountedDrive() {
+  for (const std::string& gate : gates_) openGate(gate);
   unmount();
   (void)umount2(folder_.c_str(), MNT_DETACH);
   std::error_code failure;
   fs::remove(folder_, failure);
 }
+
+std::string MountedDrive::fileOf(const std::string& gate) const {
+  return drive_.home() + "/gate." + gate;
+}
+
+bool MountedDrive::isReached(const std::string& gate) const {
+  return fs::exists(fileOf(gate) + ".reached");
+}
+
+void MountedDrive::openGate(const std::string& gate) const { std::ofstream(fileOf(gate)).put('x'); }
 
 std::string MountedDrive::onDisk(const std::string& path) const {
   return drive_.root() + "/" + path;

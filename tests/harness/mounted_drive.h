@@ -11,7 +11,10 @@ namespace yomber::testing {
 /// goes.
 class MountedDrive {
  public:
-  MountedDrive();
+  /// `gates` are fault points (platform/foundation/fault_points.h) that hold up whoever comes there
+  /// until they are opened, `failing` such where whatever is done there fails.
+  explicit MountedDrive(std::vector<std::string> gates = {},
+                        const std::vector<std::string>& failing = {});
   ~MountedDrive();
   MountedDrive(const MountedDrive&) = delete;
   MountedDrive& operator=(const MountedDrive&) = delete;
@@ -23,12 +26,20 @@ class MountedDrive {
   /// The same place in the tree on the disk.
   [[nodiscard]] std::string onDisk(const std::string& path) const;
 
+  /// Whether anybody has come to a gate.
+  [[nodiscard]] bool isReached(const std::string& gate) const;
+  /// Lets everybody through, now and later.
+  void openGate(const std::string& gate) const;
+
   void mount(const std::vector<std::string>& options = {});
   void unmount();
   /// The pid of yomber-mount, waiting until there is one; throws when none comes.
   [[nodiscard]] pid_t pid() const;
 
  private:
+  [[nodiscard]] std::string fileOf(const std::string& gate) const;
+
+  const std::vector<std::string> gates_;
   TestDrive drive_;
   std::string folder_;
 };

@@ -10,7 +10,7 @@
 
 namespace yomber::testing {
 
-/// Thumbnails in the record store of a drive, put there without anybody drawing them.
+/// The record store of a drive, and thumbnails put there without anybody drawing them.
 class StoredThumbnails {
  public:
   /// Of the account that is signed in.
@@ -22,10 +22,10 @@ class StoredThumbnails {
            const std::function<std::string(std::size_t index)>& picture) const;
   /// The file of the store that holds the thumbnail.
   [[nodiscard]] std::string fileOf(const std::string& identifier) const;
-
- private:
+  /// What the store has of a document.
   [[nodiscard]] RZRecordRef recordOf(const std::string& identifier) const;
 
+ private:
   RZEngineRef engine_;
   std::shared_ptr<RZContainer> container_;
 };

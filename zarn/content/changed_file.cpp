@@ -70,16 +70,32 @@ NSErrorRef ChangedFile::failure(int number) const { return NSError::errorWithErr
 NSErrorRef ChangedFile::holdDate() {
   if (const auto earlier = heldDate(file_.get())) {
     mtime_ = timespecOf(*earlier);
-  } else if (auto error = setAttribute(kHeldDateAttribute, std::to_string(nanosecondsOf(mtime_)))) {
-    return error;
+    isHeld_ = true;
   }
-  isHeld_ = true;
+  while (!isHeld_) {
+    if (NSErrorRef error = setAttribute(kHeldDateAttribute, std::to_string(nanosecondsOf(mtime_))))
+      return error;
+    // Who sets a date looks for a note after it; we look for a date after the note.
+    struct stat now{};
+    if (fstat(file_.get(), &now) != 0) return failure(errno);
+    isHeld_ = nanosecondsOf(now.st_mtim) == nanosecondsOf(mtime_);
+    if (!isHeld_) mtime_ = now.st_mtim;
+  }
   return nullptr;
 }
 
 NSErrorRef ChangedFile::putDatesBack() {
-  const std::array<std::timespec, 2> times{status_.st_atim, mtime_};
-  if (futimens(file_.get(), times.data()) != 0) return failure(errno);
+  std::array<std::timespec, 2> times{status_.st_atim, mtime_};
+  std::optional<std::int64_t> noted;
+  do {
+    noted = isHeld_ ? heldDate(file_.get()) : std::nullopt;
+    // Somebody has set both since. A date beyond those that can be noted is still our own.
+    if (noted && *noted != nanosecondsOf(mtime_)) {
+      mtime_ = timespecOf(*noted);
+      times = {std::timespec{.tv_sec = 0, .tv_nsec = UTIME_OMIT}, mtime_};
+    }
+    if (futimens(file_.get(), times.data()) != 0) return failure(errno);
+  } while (isHeld_ && heldDate(file_.get()) != noted);
   return std::exchange(isHeld_, false) ? removeAttribute(kHeldDateAttribute) : nullptr;
 }
 

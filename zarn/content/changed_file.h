@@ -32,7 +32,8 @@ class ChangedFile {
   [[nodiscard]] const struct stat& status() const { return status_; }
 
   /// Notes the modification date in the file, so that it is not lost should we end before
-  /// `putDatesBack`. A note of an earlier time stays, and counts.
+  /// `putDatesBack`. A note of an earlier time stays, and counts; so does what somebody who sets
+  /// another date meanwhile notes instead.
   [[nodiscard]] NSErrorRef holdDate();
   [[nodiscard]] NSErrorRef putDatesBack();
   /// Gives up the blocks behind the kept bytes.

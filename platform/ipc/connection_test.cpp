@@ -3,15 +3,19 @@
 #include <capnp/message.h>
 #include <capnp/rpc.capnp.h>
 #include <capnp/serialize.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstring>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "platform/ipc/call.h"
 #include "platform/ipc/listener.h"
@@ -52,13 +56,52 @@ Connection::Bootstrap echoes(const test::EchoStateRef& state) {
 
 TEST(Connection, ConnectingToNothingNamesThePathAndSaysWhatToDo) {
   test::TemporaryDirectory directory;
-  for (const std::string& path : {directory.file("nothing"), directory.file("no/directory")}) {
+  ASSERT_TRUE(UniqueFd(::creat(directory.file("file").c_str(), 0600)));
+  for (const std::string& path :
+       {directory.file("nothing"), directory.file("no/directory"), directory.file("file/s")}) {
     NSErrorRef error;
     EXPECT_EQ(Connection::connect(path, &error), nullptr);
     ASSERT_NE(error, nullptr);
     EXPECT_NE(error->localizedDescription().find(path), std::string::npos);
     EXPECT_NE(error->localizedDescription().find("yomber up"), std::string::npos);
   }
+}
+
+/// This process opens nothing more for so long.
+class NoMoreDescriptors {
+ public:
+  NoMoreDescriptors() {
+    EXPECT_EQ(::getrlimit(RLIMIT_NOFILE, &before_), 0);
+    const UniqueFd lowestFree = duplicateDescriptor(STDERR_FILENO);
+    EXPECT_TRUE(lowestFree);
+    rlimit lowered = before_;
+    lowered.rlim_cur = static_cast<rlim_t>(lowestFree.get());
+    EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &lowered), 0);
+  }
+  ~NoMoreDescriptors() { EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &before_), 0); }
+  NoMoreDescriptors(const NoMoreDescriptors&) = delete;
+  NoMoreDescriptors& operator=(const NoMoreDescriptors&) = delete;
+
+ private:
+  rlimit before_{};
+};
+
+TEST(Connection, WhoHasNoDescriptorLeftIsNotToldThatNothingListens) {
+  test::TemporaryDirectory directory;
+  const auto state = std::make_shared<test::EchoState>();
+  const auto listener = Listener::listen(
+      directory.file("s"), [&](const PeerCredentials&) { return test::makeEcho(state); });
+  ASSERT_NE(listener, nullptr);
+  NSErrorRef error;
+  {
+    const NoMoreDescriptors shortage;
+    EXPECT_EQ(Connection::connect(directory.file("s"), &error), nullptr);
+  }
+  ASSERT_NE(error, nullptr);
+  EXPECT_TRUE(error->is(NSPOSIXErrorDomain, EMFILE)) << error->description();
+  EXPECT_NE(error->localizedDescription().find("open files"), std::string::npos)
+      << error->localizedDescription();
+  EXPECT_NE(Connection::connect(directory.file("s"), &error), nullptr);
 }
 
 TEST(Connection, ConnectAsyncAnswersOnAnotherThread) {

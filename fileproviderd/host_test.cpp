@@ -175,6 +175,22 @@ TEST_F(HostTest, AKilledExtensionIsReplacedAndReaped) {
   EXPECT_EQ(errno, ESRCH);
 }
 
+TEST_F(HostTest, AnExtensionThatLostZarnIsNotTakenForLostItself) {
+  startZarn();
+  startHost();
+  ASSERT_EQ(item("a"), nullptr);
+  const auto healthy = status().extension;
+  command("zarn-lost");
+  for (const auto& error : {item("a"), locate("nothing"), identify("/root/nothing")}) {
+    ASSERT_NE(error, nullptr);
+    EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted)) << error->description();
+  }
+  EXPECT_EQ(status().starts, 1U);
+  EXPECT_EQ(status().extension, healthy);
+  countermand("zarn-lost");
+  EXPECT_EQ(item("a"), nullptr);
+}
+
 TEST_F(HostTest, AListingIsWholeForWhoCallsAgainAfterCancelling) {
   startZarn();
   countermand("root");

@@ -70,6 +70,8 @@ class ContentNeeds : public std::enable_shared_from_this<ContentNeeds> {
     std::map<WishID, Wish> waiting;
     std::set<WishID> asked;   ///< those among them that the request under way is for
     bool wasStopped = false;  ///< the request under way was given up
+    bool isGivingUp = false;  ///< and that has not been answered yet
+    bool isOver = false;      ///< the request itself has been answered
     int rounds = 0;           ///< of that request
     std::list<Handler> stops;
   };
@@ -81,6 +83,7 @@ class ContentNeeds : public std::enable_shared_from_this<ContentNeeds> {
   void advance(const std::string& path);
   void provide(const std::string& path, Entry& entry);
   void giveUp(const std::string& path, Entry& entry);
+  void didGiveUp(const std::string& path);
   void didProvide(const std::string& path, const NSErrorRef& error);
   void didLook(const std::string& path, bool isGone);
   void didStop(const std::string& path, const Handler& handler, const NSErrorRef& error);

@@ -139,13 +139,42 @@ TEST_F(ContentNeedsTest, WhoComesAfterItWasGivenUpIsNotCancelledWithIt) {
   early = nullptr;
   const auto late = needs_->need("/a", 0, answers.handler());
   EXPECT_EQ(source_.takeCalls(), (Calls{"start /a", "stop /a"}));
+  source_.answerStop();
   source_.answerStart(cancelled());
   EXPECT_EQ(answers.count, 0);
   EXPECT_EQ(source_.takeCalls(), Calls{"start /a"});
-  source_.answerStop();
   source_.grant();
   EXPECT_EQ(answers.count, 1);
   EXPECT_EQ(answers.error, nullptr);
+}
+
+TEST_F(ContentNeedsTest, WhoComesAfterItWasGivenUpTooLateWaitsUntilItIsGone) {
+  Answers answers;
+  auto early = needs_->need("/a", 0, answers.handler());
+  early = nullptr;
+  const auto late = needs_->need("/a", 0, answers.handler());
+  EXPECT_EQ(source_.takeCalls(), (Calls{"start /a", "stop /a"}));
+  source_.answerStart();
+  EXPECT_TRUE(source_.takeCalls().empty()) << "the stop would take what is brought now";
+  source_.answerStop();
+  EXPECT_EQ(source_.takeCalls(), Calls{"start /a"});
+  source_.grant();
+  EXPECT_EQ(answers.count, 1);
+  EXPECT_EQ(answers.error, nullptr);
+}
+
+TEST_F(ContentNeedsTest, WhoComesAfterItWasGivenUpBeforeTheLookWaitsUntilItIsGone) {
+  Answers answers;
+  auto early = needs_->need("/a", 0, answers.handler());
+  source_.answerStart();
+  early = nullptr;
+  const auto late = needs_->need("/a", 0, answers.handler());
+  source_.answerLook(false);
+  EXPECT_EQ(source_.takeCalls(), (Calls{"start /a", "stop /a"}));
+  source_.answerStop();
+  EXPECT_EQ(source_.takeCalls(), Calls{"start /a"});
+  source_.grant();
+  EXPECT_EQ(answers.count, 1);
 }
 
 TEST_F(ContentNeedsTest, WhoComesDuringAStopWaitsForItsEnd) {

@@ -111,12 +111,17 @@ void ContentNeeds::provide(const std::string& path, Entry& entry) {
   entry.state = Entry::State::Providing;
   entry.wasStopped = false;
   entry.isOver = false;
-  std::uint64_t options = 0;
+  ContentSource::Request request;
+  request.path = path;
   for (const auto& [wish, wanted] : entry.waiting) {
-    options |= wanted.options;
+    request.options |= wanted.options;
     entry.asked.insert(wish);
   }
-  source_.startProviding(path, options, [weak = weak_from_this(), path](const NSErrorRef& error) {
+  request.isWanted = [weak = weak_from_this(), path] {
+    const auto self = weak.lock();
+    return self != nullptr && !self->entries_.at(path).wasStopped;
+  };
+  source_.startProviding(request, [weak = weak_from_this(), path](const NSErrorRef& error) {
     if (const auto self = weak.lock()) self->didProvide(path, error);
   });
 }

@@ -18,9 +18,17 @@ namespace yomber {
 class ContentSource {
  public:
   using Handler = std::function<void(NSErrorRef error)>;
+  struct Request {
+    std::string path;
+    std::uint64_t options = 0;
+    /// Whether anybody still wants it; to be looked at each time before it is begun, and not after
+    /// it was answered.
+    std::function<bool()> isWanted;
+  };
   virtual ~ContentSource() = default;
-  /// Answered when the content can be read, or could not be had.
-  virtual void startProviding(const std::string& path, std::uint64_t options, Handler handler) = 0;
+  /// Answered when the content can be read, or could not be had; NSUserCancelledError when nobody
+  /// wanted it any more.
+  virtual void startProviding(const Request& request, Handler handler) = 0;
   virtual void stopProviding(const std::string& path, Handler handler) = 0;
   /// Whether the content is not here, whatever was said of it.
   virtual void isGone(const std::string& path, std::function<void(bool)> handler) = 0;

@@ -9,7 +9,7 @@
 //   die-on-page exists: the process ends when a page is asked for
 //   commands    a pipe that takes "signal CONTAINER" lines
 //   slow        exists: content is not provided until it is stopped, or "slow" goes
-//   die-on-content, die-on-rename, die-on-thumbnails
+//   die-on-content, die-on-stop, die-on-rename, die-on-thumbnails
 //               exists: the process ends in the middle of that
 //   die-on-service
 //               exists: the process ends when it is asked for services
@@ -279,6 +279,10 @@ class FakeExtension final : public NSFileProviderExtension {
 
   void stopProvidingItemAtURL(const NSURLRef& url) override {
     note("stop " + url->path());
+    if (isCommanded("die-on-stop")) {
+      std::filesystem::remove(fakePath("die-on-stop"));
+      _exit(3);
+    }
     ErrorHandler held;
     {
       LockGuard guard(mutex_);

@@ -60,7 +60,16 @@ void ContentNeeds::drop(const std::string& path, WishID wish) {
 
 void ContentNeeds::giveUp(const std::string& path, Entry& entry) {
   if (std::exchange(entry.wasStopped, true)) return;
-  source_.stopProviding(path, [](const NSErrorRef&) {});
+  entry.isGivingUp = true;
+  source_.stopProviding(path, [weak = weak_from_this(), path](const NSErrorRef&) {
+    if (const auto self = weak.lock()) self->didGiveUp(path);
+  });
+}
+
+void ContentNeeds::didGiveUp(const std::string& path) {
+  Entry& entry = entries_.at(path);
+  entry.isGivingUp = false;
+  if (entry.isOver) finish(path, nullptr);
 }
 
 void ContentNeeds::stop(const std::string& path, Handler handler) {
@@ -101,12 +110,18 @@ void ContentNeeds::didStop(const std::string& path, const Handler& handler,
 void ContentNeeds::provide(const std::string& path, Entry& entry) {
   entry.state = Entry::State::Providing;
   entry.wasStopped = false;
-  std::uint64_t options = 0;
+  entry.isOver = false;
+  ContentSource::Request request;
+  request.path = path;
   for (const auto& [wish, wanted] : entry.waiting) {
-    options |= wanted.options;
+    request.options |= wanted.options;
     entry.asked.insert(wish);
   }
-  source_.startProviding(path, options, [weak = weak_from_this(), path](const NSErrorRef& error) {
+  request.isWanted = [weak = weak_from_this(), path] {
+    const auto self = weak.lock();
+    return self != nullptr && !self->entries_.at(path).wasStopped;
+  };
+  source_.startProviding(request, [weak = weak_from_this(), path](const NSErrorRef& error) {
     if (const auto self = weak.lock()) self->didProvide(path, error);
   });
 }
@@ -129,6 +144,10 @@ void ContentNeeds::didLook(const std::string& path, bool isGone) {
 
 void ContentNeeds::finish(const std::string& path, const NSErrorRef& error) {
   Entry& entry = entries_.at(path);
+  entry.isOver = true;
+  // Until then, whoever is granted the content next would lose it again. Nobody waits for this
+  // request any more.
+  if (entry.isGivingUp) return;
   std::vector<Handler> handlers;
   for (const WishID wish : std::exchange(entry.asked, {})) {
     const auto found = entry.waiting.find(wish);

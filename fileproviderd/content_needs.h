@@ -18,9 +18,17 @@ namespace yomber {
 class ContentSource {
  public:
   using Handler = std::function<void(NSErrorRef error)>;
+  struct Request {
+    std::string path;
+    std::uint64_t options = 0;
+    /// Whether anybody still wants it; to be looked at each time before it is begun, and not after
+    /// it was answered.
+    std::function<bool()> isWanted;
+  };
   virtual ~ContentSource() = default;
-  /// Answered when the content can be read, or could not be had.
-  virtual void startProviding(const std::string& path, std::uint64_t options, Handler handler) = 0;
+  /// Answered when the content can be read, or could not be had; NSUserCancelledError when nobody
+  /// wanted it any more.
+  virtual void startProviding(const Request& request, Handler handler) = 0;
   virtual void stopProviding(const std::string& path, Handler handler) = 0;
   /// Whether the content is not here, whatever was said of it.
   virtual void isGone(const std::string& path, std::function<void(bool)> handler) = 0;
@@ -70,6 +78,8 @@ class ContentNeeds : public std::enable_shared_from_this<ContentNeeds> {
     std::map<WishID, Wish> waiting;
     std::set<WishID> asked;   ///< those among them that the request under way is for
     bool wasStopped = false;  ///< the request under way was given up
+    bool isGivingUp = false;  ///< and that has not been answered yet
+    bool isOver = false;      ///< the request itself has been answered
     int rounds = 0;           ///< of that request
     std::list<Handler> stops;
   };
@@ -81,6 +91,7 @@ class ContentNeeds : public std::enable_shared_from_this<ContentNeeds> {
   void advance(const std::string& path);
   void provide(const std::string& path, Entry& entry);
   void giveUp(const std::string& path, Entry& entry);
+  void didGiveUp(const std::string& path);
   void didProvide(const std::string& path, const NSErrorRef& error);
   void didLook(const std::string& path, bool isGone);
   void didStop(const std::string& path, const Handler& handler, const NSErrorRef& error);

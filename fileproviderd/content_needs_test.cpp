@@ -15,8 +15,10 @@ namespace {
 /// An extension that answers when the test says so.
 class FakeSource final : public ContentSource {
  public:
-  void startProviding(const std::string& path, std::uint64_t options, Handler handler) override {
-    calls.push_back("start " + path + (options != 0 ? " " + std::to_string(options) : ""));
+  void startProviding(const Request& request, Handler handler) override {
+    calls.push_back("start " + request.path +
+                    (request.options != 0 ? " " + std::to_string(request.options) : ""));
+    isWanted = request.isWanted;
     starts.push_back(std::move(handler));
   }
   void stopProviding(const std::string& path, Handler handler) override {
@@ -37,6 +39,7 @@ class FakeSource final : public ContentSource {
   [[nodiscard]] std::vector<std::string> takeCalls() { return std::exchange(calls, {}); }
 
   std::vector<std::string> calls;
+  std::function<bool()> isWanted;  ///< what was asked for last
   std::deque<Handler> starts;
   std::deque<Handler> stops;
   std::deque<std::function<void(bool)>> looks;
@@ -133,19 +136,63 @@ TEST_F(ContentNeedsTest, TheLastOneToLeaveEndsWhatIsUnderWay) {
   EXPECT_EQ(needs_->count(), 0U);
 }
 
+TEST_F(ContentNeedsTest, WhatWasGivenUpIsNotWantedAlsoWhenSomebodyElseComes) {
+  Answers answers;
+  auto one = needs_->need("/a", 0, answers.handler());
+  auto two = needs_->need("/a", 0, answers.handler());
+  one = nullptr;
+  EXPECT_TRUE(source_.isWanted());
+  two = nullptr;
+  EXPECT_FALSE(source_.isWanted());
+  const auto late = needs_->need("/a", 0, answers.handler());
+  EXPECT_FALSE(source_.isWanted()) << "the late one gets a request of its own";
+  source_.answerStart(cancelled());
+  source_.answerStop();
+  EXPECT_TRUE(source_.isWanted());
+}
+
 TEST_F(ContentNeedsTest, WhoComesAfterItWasGivenUpIsNotCancelledWithIt) {
   Answers answers;
   auto early = needs_->need("/a", 0, answers.handler());
   early = nullptr;
   const auto late = needs_->need("/a", 0, answers.handler());
   EXPECT_EQ(source_.takeCalls(), (Calls{"start /a", "stop /a"}));
+  source_.answerStop();
   source_.answerStart(cancelled());
   EXPECT_EQ(answers.count, 0);
   EXPECT_EQ(source_.takeCalls(), Calls{"start /a"});
-  source_.answerStop();
   source_.grant();
   EXPECT_EQ(answers.count, 1);
   EXPECT_EQ(answers.error, nullptr);
+}
+
+TEST_F(ContentNeedsTest, WhoComesAfterItWasGivenUpTooLateWaitsUntilItIsGone) {
+  Answers answers;
+  auto early = needs_->need("/a", 0, answers.handler());
+  early = nullptr;
+  const auto late = needs_->need("/a", 0, answers.handler());
+  EXPECT_EQ(source_.takeCalls(), (Calls{"start /a", "stop /a"}));
+  source_.answerStart();
+  EXPECT_TRUE(source_.takeCalls().empty()) << "the stop would take what is brought now";
+  source_.answerStop();
+  EXPECT_EQ(source_.takeCalls(), Calls{"start /a"});
+  source_.grant();
+  EXPECT_EQ(answers.count, 1);
+  EXPECT_EQ(answers.error, nullptr);
+}
+
+TEST_F(ContentNeedsTest, WhoComesAfterItWasGivenUpBeforeTheLookWaitsUntilItIsGone) {
+  Answers answers;
+  auto early = needs_->need("/a", 0, answers.handler());
+  source_.answerStart();
+  early = nullptr;
+  const auto late = needs_->need("/a", 0, answers.handler());
+  source_.answerLook(false);
+  EXPECT_EQ(source_.takeCalls(), (Calls{"start /a", "stop /a"}));
+  source_.answerStop();
+  EXPECT_EQ(source_.takeCalls(), Calls{"start /a"});
+  source_.grant();
+  EXPECT_EQ(answers.count, 1);
 }
 
 TEST_F(ContentNeedsTest, WhoComesDuringAStopWaitsForItsEnd) {

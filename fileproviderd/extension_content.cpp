@@ -20,6 +20,10 @@ using protocol::Extension;
 constexpr int kAttempts = 4;
 constexpr ipc::CallOptions kUnlimited{.timeout = std::chrono::milliseconds::zero()};
 
+NSErrorRef givenUpError() {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
+}
+
 }  // namespace
 
 void ExtensionContent::withExtension(std::function<void(const ExtensionSessionRef& session)> work,
@@ -37,35 +41,43 @@ void ExtensionContent::fail(const ExtensionSessionRef& session, const NSErrorRef
   explain_(error, std::move(handler));
 }
 
-void ExtensionContent::startProviding(const std::string& path, std::uint64_t options,
-                                      Handler handler) {
-  start(path, options, std::move(handler), kAttempts);
+void ExtensionContent::startProviding(const Request& request, Handler handler) {
+  start(request, std::move(handler), kAttempts);
 }
 
-void ExtensionContent::start(const std::string& path, std::uint64_t options, Handler handler,
-                             int attempts) {
-  const auto ask = [weak = weak_from_this(), path, options, handler,
+void ExtensionContent::start(const Request& request, Handler handler, int attempts) {
+  const auto ask = [weak = weak_from_this(), request, handler,
                     attempts](const ExtensionSessionRef& session) {
-    const auto fill = [path, options](Extension::StartProvidingParams::Builder params) {
-      params.setPath(wireData(path));
-      params.setOptions(options);
-    };
-    const auto reply = [weak, session, path, options, handler, attempts](
-                           NSErrorRef error,
-                           const Extension::StartProvidingResults::Reader* results) {
-      const auto self = weak.lock();
-      if (self == nullptr) return;
-      if (results != nullptr) error = ipc::decodeOptional(results->getFailure());
-      if (error == nullptr) return handler(nullptr);
-      if (results != nullptr) return self->explain_(error, handler);
-      if (attempts == 1 || !isConnectionError(error)) return self->fail(session, error, handler);
-      self->supervisor_.sessionWasLost(session, error);
-      self->start(path, options, handler, attempts - 1);
-    };
-    (void)ipc::call(session->remote(), &Extension::Client::startProvidingRequest, fill, reply,
-                    kUnlimited);
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    // It may have been given up while there was no extension; nobody would stop what begins now.
+    if (!request.isWanted()) return handler(givenUpError());
+    self->startOn(session, request, handler, attempts);
   };
   withExtension(ask, handler);
+}
+
+void ExtensionContent::startOn(const ExtensionSessionRef& session, const Request& request,
+                               Handler handler, int attempts) {
+  const auto fill = [request](Extension::StartProvidingParams::Builder params) {
+    params.setPath(wireData(request.path));
+    params.setOptions(request.options);
+  };
+  const auto reply = [weak = weak_from_this(), session, request, handler = std::move(handler),
+                      attempts](NSErrorRef error,
+                                const Extension::StartProvidingResults::Reader* results) {
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    if (results != nullptr) error = ipc::decodeOptional(results->getFailure());
+    if (error == nullptr) return handler(nullptr);
+    if (results != nullptr) return self->explain_(error, handler);
+    const bool mayRepeat = attempts > 1 && isConnectionError(error) && request.isWanted();
+    if (!mayRepeat) return self->fail(session, error, handler);
+    self->supervisor_.sessionWasLost(session, error);
+    self->start(request, handler, attempts - 1);
+  };
+  (void)ipc::call(session->remote(), &Extension::Client::startProvidingRequest, fill, reply,
+                  kUnlimited);
 }
 
 void ExtensionContent::stopProviding(const std::string& path, Handler handler) {

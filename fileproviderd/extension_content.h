@@ -28,14 +28,16 @@ class ExtensionContent final : public ContentSource,
   ExtensionContent(ExtensionSupervisor& supervisor, ErrorExplainer explain)
       : supervisor_(supervisor), explain_(std::move(explain)) {}
 
-  void startProviding(const std::string& path, std::uint64_t options, Handler handler) override;
+  void startProviding(const Request& request, Handler handler) override;
   void stopProviding(const std::string& path, Handler handler) override;
   void isGone(const std::string& path, std::function<void(bool)> handler) override;
   void itemChanged(const std::string& path, Handler handler);
   void movingItem(const std::string& path, const std::string& destination, MoveHandler handler);
 
  private:
-  void start(const std::string& path, std::uint64_t options, Handler handler, int attempts);
+  void start(const Request& request, Handler handler, int attempts);
+  void startOn(const ExtensionSessionRef& session, const Request& request, Handler handler,
+               int attempts);
   /// Calls `work` with the extension, or `missing` with why there is none.
   void withExtension(std::function<void(const ExtensionSessionRef& session)> work,
                      std::function<void(NSErrorRef error)> missing);

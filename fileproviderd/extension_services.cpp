@@ -23,13 +23,15 @@ void askForAll(ExtensionSession& session, const ServicesRequest& request,
       [handler = std::move(handler)](NSErrorRef error,
                                      const Extension::ServicesResults::Reader* results) {
         if (results != nullptr) error = ipc::decodeOptional(results->getFailure());
-        if (error != nullptr) return handler(std::nullopt, std::move(error));
+        if (error != nullptr) {
+          return handler(std::nullopt, std::move(error), results == nullptr);
+        }
         std::vector<VendedService> services;
         services.reserve(results->getServices().size());
         for (const auto each : results->getServices()) {
           services.push_back({stringFromWire(each.getName()), Endpoint(each.getEndpoint())});
         }
-        handler(std::move(services), nullptr);
+        handler(std::move(services), nullptr, false);
       },
       {.timeout = limit});
 }
@@ -46,8 +48,11 @@ void askForOne(ExtensionSession& session, const ServicesRequest& request, const 
       [name, handler = std::move(handler)](NSErrorRef error,
                                            const Extension::ServiceResults::Reader* results) {
         if (results != nullptr) error = ipc::decodeOptional(results->getFailure());
-        if (error != nullptr) return handler(std::nullopt, std::move(error));
-        handler(std::vector<VendedService>{{name, Endpoint(results->getEndpoint())}}, nullptr);
+        if (error != nullptr) {
+          return handler(std::nullopt, std::move(error), results == nullptr);
+        }
+        handler(std::vector<VendedService>{{name, Endpoint(results->getEndpoint())}}, nullptr,
+                false);
       },
       {.timeout = limit});
 }

@@ -19,7 +19,7 @@ struct VendedService {
   ipc::Remote<protocol::ServiceEndpoint> endpoint;
 };
 
-using ServicesHandler = std::function<void(std::optional<std::vector<VendedService>>, NSErrorRef)>;
+using ServicesHandler = AnswerHandler<std::vector<VendedService>>;
 
 /// What is asked for: an item's services, or the one of that name.
 struct ServicesRequest {

@@ -16,11 +16,16 @@
 
 namespace yomber {
 
+/// Takes what came of a request. `isUnanswered`: the error, a connection error, says why the
+/// extension gave no answer; else the error is what it answered, which may look the same.
+template <typename Answer>
+using AnswerHandler =
+    std::function<void(std::optional<Answer>, NSErrorRef error, bool isUnanswered)>;
+
 /// One life of the extension: its process and everything that was got from it. When it ends, all
 /// its enumerators end with it.
 ///
-/// Handlers are called once each. The error they are given is a connection error when the extension
-/// could not be asked, else its own.
+/// Handlers are called once each.
 /// Thread-safety: loop thread only.
 /// Ownership: shared; whoever drops the last reference ends the process.
 class ExtensionSession {
@@ -33,11 +38,9 @@ class ExtensionSession {
 
   /// The location of an item; nothing without an error when the extension knows none.
   virtual void locate(const std::string& identifier, std::chrono::milliseconds limit,
-                      std::function<void(std::optional<std::string>, NSErrorRef)> handler) = 0;
-  virtual void identify(const std::string& path,
-                        std::function<void(std::optional<std::string>, NSErrorRef)> handler) = 0;
-  virtual void item(const std::string& identifier,
-                    std::function<void(std::optional<ItemFields>, NSErrorRef)> handler) = 0;
+                      AnswerHandler<std::string> handler) = 0;
+  virtual void identify(const std::string& path, AnswerHandler<std::string> handler) = 0;
+  virtual void item(const std::string& identifier, AnswerHandler<ItemFields> handler) = 0;
   virtual void enumerator(const std::string& container, EnumeratorHandler handler) = 0;
   /// The enumerator itself, for listings that pass pages on unread.
   virtual void openEnumerator(

@@ -82,13 +82,13 @@ void ExtensionSupervisor::launch() {
   }
   ++startCount_;
   state_ = State::Starting;
-  starting_->locate(
-      NSFileProviderRootContainerItemIdentifier, limits_.answer,
-      [weak, life](const std::optional<std::string>& root, const NSErrorRef& failure) {
-        const auto self = weak.lock();
-        if (self == nullptr || self->life_ != life) return;
-        self->didLocateRoot(root.has_value(), failure);
-      });
+  starting_->locate(NSFileProviderRootContainerItemIdentifier, limits_.answer,
+                    [weak, life](const std::optional<std::string>& root, const NSErrorRef& failure,
+                                 bool /*isUnanswered*/) {
+                      const auto self = weak.lock();
+                      if (self == nullptr || self->life_ != life) return;
+                      self->didLocateRoot(root.has_value(), failure);
+                    });
 }
 
 void ExtensionSupervisor::didLocateRoot(bool isKnown, const NSErrorRef& error) {
@@ -146,17 +146,18 @@ void ExtensionSupervisor::schedulePing() {
 
 void ExtensionSupervisor::ping() {
   if (state_ != State::Running || std::exchange(isPinging_, true)) return;
-  running_->locate(NSFileProviderRootContainerItemIdentifier, limits_.answer,
-                   [weak = weak_from_this(), life = life_](const std::optional<std::string>& root,
-                                                           const NSErrorRef& error) {
-                     const auto self = weak.lock();
-                     if (self == nullptr || self->life_ != life) return;
-                     if (error == nullptr && root.has_value()) {
-                       self->isPinging_ = false;
-                       return self->schedulePing();
-                     }
-                     self->giveUpOn(extensionUnavailableError("does not answer", error));
-                   });
+  running_->locate(
+      NSFileProviderRootContainerItemIdentifier, limits_.answer,
+      [weak = weak_from_this(), life = life_](const std::optional<std::string>& root,
+                                              const NSErrorRef& error, bool /*isUnanswered*/) {
+        const auto self = weak.lock();
+        if (self == nullptr || self->life_ != life) return;
+        if (error == nullptr && root.has_value()) {
+          self->isPinging_ = false;
+          return self->schedulePing();
+        }
+        self->giveUpOn(extensionUnavailableError("does not answer", error));
+      });
 }
 
 void ExtensionSupervisor::answerWaiters(const ExtensionSessionRef& session,

@@ -29,21 +29,20 @@ class FakeSession final : public ExtensionSession {
   [[nodiscard]] pid_t pid() const override { return pid_; }
   [[nodiscard]] std::size_t enumeratorCount() const override { return 0; }
   void locate(const std::string& identifier, std::chrono::milliseconds /*limit*/,
-              std::function<void(std::optional<std::string>, NSErrorRef)> handler) override {
+              AnswerHandler<std::string> handler) override {
     EXPECT_EQ(identifier, NSFileProviderRootContainerItemIdentifier);
     ++rootsAsked;
     executor_.post([handler = std::move(handler), script = script_] {
       if (!script.answers) {
         return handler(std::nullopt,
-                       NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionTimedOut));
+                       NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionTimedOut), true);
       }
-      handler(script.knowsRoot ? std::optional<std::string>("/root") : std::nullopt, nullptr);
+      handler(script.knowsRoot ? std::optional<std::string>("/root") : std::nullopt, nullptr,
+              false);
     });
   }
-  void identify(const std::string&,
-                std::function<void(std::optional<std::string>, NSErrorRef)>) override {}
-  void item(const std::string&,
-            std::function<void(std::optional<ItemFields>, NSErrorRef)>) override {}
+  void identify(const std::string&, AnswerHandler<std::string>) override {}
+  void item(const std::string&, AnswerHandler<ItemFields>) override {}
   void enumerator(const std::string&, EnumeratorHandler) override {}
   void openEnumerator(const std::string&,
                       std::function<void(ipc::Remote<protocol::Enumerator>, NSErrorRef)>) override {

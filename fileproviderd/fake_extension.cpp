@@ -5,10 +5,11 @@
 //   hang        exists: what is asked now is never answered
 //   signed-out  exists: items, enumerators and pages fail with -1000; paths have no identifier,
 //               and but the root no item has a location
+//   zarn-lost   exists: items and services fail as when zarn ends in the middle of a lookup
 //   die-on-page exists: the process ends when a page is asked for
 //   commands    a pipe that takes "signal CONTAINER" lines
 //   slow        exists: content is not provided until it is stopped, or "slow" goes
-//   die-on-content, die-on-rename, die-on-thumbnails
+//   die-on-content, die-on-stop, die-on-rename, die-on-thumbnails
 //               exists: the process ends in the middle of that
 //   die-on-service
 //               exists: the process ends when it is asked for services
@@ -56,6 +57,10 @@ void hangIfCommanded() {
 
 NSErrorRef signedOut() {
   return NSError::errorWithDomain(NSFileProviderErrorDomain, NSFileProviderErrorNotAuthenticated);
+}
+
+NSErrorRef interruption() {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
 }
 
 std::map<std::string, std::uint64_t> readItems() {
@@ -213,6 +218,10 @@ class FakeExtension final : public NSFileProviderExtension {
                                           NSErrorRef* error) override {
     hangIfCommanded();
     if (identifier == "self") return describeSelf();
+    if (isCommanded("zarn-lost")) {
+      storeError(error, interruption());
+      return nullptr;
+    }
     if (isCommanded("signed-out")) {
       storeError(error, signedOut());
       return nullptr;
@@ -239,7 +248,11 @@ class FakeExtension final : public NSFileProviderExtension {
   }
 
   std::vector<NSFileProviderServiceSourceRef> supportedServiceSourcesForItemIdentifier(
-      const NSFileProviderItemIdentifier& identifier, NSErrorRef* /*error*/) override {
+      const NSFileProviderItemIdentifier& identifier, NSErrorRef* error) override {
+    if (isCommanded("zarn-lost")) {
+      storeError(error, interruption());
+      return {};
+    }
     if (isCommanded("die-on-service")) {
       std::filesystem::remove(fakePath("die-on-service"));
       _exit(3);
@@ -266,6 +279,10 @@ class FakeExtension final : public NSFileProviderExtension {
 
   void stopProvidingItemAtURL(const NSURLRef& url) override {
     note("stop " + url->path());
+    if (isCommanded("die-on-stop")) {
+      std::filesystem::remove(fakePath("die-on-stop"));
+      _exit(3);
+    }
     ErrorHandler held;
     {
       LockGuard guard(mutex_);

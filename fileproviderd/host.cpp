@@ -15,14 +15,14 @@ constexpr int kAttempts = 2;
 
 /// Why the extension answered nil: what was asked for is missing, unless the root says that nothing
 /// can be had at all (nobody is signed in, say). `session` must live until the answer.
-void explainNil(ExtensionSession& session, NSErrorRef missing,
-                std::function<void(NSErrorRef)> handler) {
-  session.item(NSFileProviderRootContainerItemIdentifier,
-               [missing = std::move(missing), handler = std::move(handler)](
-                   const std::optional<ItemFields>& /*root*/, const NSErrorRef& error) {
-                 const bool isRootKnown = error == nullptr || isNoSuchItemError(error);
-                 handler(isRootKnown ? missing : error);
-               });
+void explainNil(ExtensionSession& session, NSErrorRef missing, AnswerHandler<std::string> handler) {
+  session.item(
+      NSFileProviderRootContainerItemIdentifier,
+      [missing = std::move(missing), handler = std::move(handler)](
+          const std::optional<ItemFields>& /*root*/, const NSErrorRef& error, bool isUnanswered) {
+        const bool isRootKnown = error == nullptr || isNoSuchItemError(error);
+        handler(std::nullopt, isRootKnown ? missing : error, isUnanswered);
+      });
 }
 
 NSErrorRef noItemAtPathError(const std::string& path) {
@@ -32,7 +32,7 @@ NSErrorRef noItemAtPathError(const std::string& path) {
        {NSLocalizedDescriptionKey, "the drive has no item at " + path}});
 }
 
-bool wasLost(const NSErrorRef& error) {
+bool isInterruption(const NSErrorRef& error) {
   return error != nullptr && error->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
 }
 
@@ -142,39 +142,44 @@ void Host::ask(Ask ask, std::function<void(std::optional<Answer>, NSErrorRef)> h
                            const ExtensionSessionRef& session, const NSErrorRef& error) {
     if (session == nullptr) return handler(std::nullopt, error);
     // The answer's handler keeps the session.
-    ask(*session,
-        [weak, ask, handler, attempts, session](std::optional<Answer> answer, NSErrorRef failure) {
-          const auto self = weak.lock();
-          if (self == nullptr) return handler(std::nullopt, failure);
-          if (wasLost(failure)) {
-            self->supervisor_->sessionWasLost(session, failure);
-            if (attempts > 1) return self->ask<Answer>(ask, handler, attempts - 1);
-          }
-          if (failure == nullptr) return handler(std::move(answer), nullptr);
-          self->explain(failure, [handler](NSErrorRef explained) {
-            handler(std::nullopt, std::move(explained));
-          });
-        });
+    ask(*session, [weak, ask, handler, attempts, session](std::optional<Answer> answer,
+                                                          NSErrorRef failure, bool isUnanswered) {
+      const auto self = weak.lock();
+      if (self == nullptr) return handler(std::nullopt, failure);
+      const bool wasLost = isUnanswered && isInterruption(failure);
+      if (wasLost) {
+        self->supervisor_->sessionWasLost(session, failure);
+        if (attempts > 1) return self->ask<Answer>(ask, handler, attempts - 1);
+      }
+      if (failure == nullptr) return handler(std::move(answer), nullptr);
+      self->explain(failure, wasLost, [handler](NSErrorRef explained) {
+        handler(std::nullopt, std::move(explained));
+      });
+    });
   });
 }
 
 void Host::item(const std::string& identifier, ItemHandler handler) {
-  ask<ItemFields>([identifier](ExtensionSession& session,
-                               ItemHandler answer) { session.item(identifier, std::move(answer)); },
-                  std::move(handler), kAttempts);
+  ask<ItemFields>(
+      [identifier](ExtensionSession& session, AnswerHandler<ItemFields> answer) {
+        session.item(identifier, std::move(answer));
+      },
+      std::move(handler), kAttempts);
 }
 
 void Host::locate(const std::string& identifier, TextHandler handler) {
   ask<std::string>(
-      [identifier, limit = options_.callLimit](ExtensionSession& session, TextHandler answer) {
+      [identifier, limit = options_.callLimit](ExtensionSession& session,
+                                               AnswerHandler<std::string> answer) {
         session.locate(identifier, limit,
                        [identifier, &session, answer = std::move(answer)](
-                           std::optional<std::string> path, NSErrorRef error) {
-                         if (path || error != nullptr)
-                           return answer(std::move(path), std::move(error));
-                         explainNil(
-                             session, fileProviderErrorForNonExistentItemWithIdentifier(identifier),
-                             [answer](NSErrorRef why) { answer(std::nullopt, std::move(why)); });
+                           std::optional<std::string> path, NSErrorRef error, bool isUnanswered) {
+                         if (path || error != nullptr) {
+                           return answer(std::move(path), std::move(error), isUnanswered);
+                         }
+                         explainNil(session,
+                                    fileProviderErrorForNonExistentItemWithIdentifier(identifier),
+                                    answer);
                        });
       },
       std::move(handler), kAttempts);
@@ -182,20 +187,20 @@ void Host::locate(const std::string& identifier, TextHandler handler) {
 
 void Host::identify(const std::string& path, TextHandler handler) {
   ask<std::string>(
-      [path](ExtensionSession& session, TextHandler answer) {
-        session.identify(path, [path, &session, answer = std::move(answer)](
-                                   std::optional<std::string> identifier, NSErrorRef error) {
-          if (identifier || error != nullptr) {
-            return answer(std::move(identifier), std::move(error));
-          }
-          explainNil(session, noItemAtPathError(path),
-                     [answer](NSErrorRef why) { answer(std::nullopt, std::move(why)); });
-        });
+      [path](ExtensionSession& session, AnswerHandler<std::string> answer) {
+        session.identify(
+            path, [path, &session, answer = std::move(answer)](
+                      std::optional<std::string> identifier, NSErrorRef error, bool isUnanswered) {
+              if (identifier || error != nullptr) {
+                return answer(std::move(identifier), std::move(error), isUnanswered);
+              }
+              explainNil(session, noItemAtPathError(path), answer);
+            });
       },
       std::move(handler), kAttempts);
 }
 
-void Host::services(const ServicesRequest& request, ServicesHandler handler) {
+void Host::services(const ServicesRequest& request, VendedServicesHandler handler) {
   const auto answer = [weak = weak_from_this(), handler = std::move(handler)](
                           std::optional<std::vector<VendedService>> services, NSErrorRef error) {
     const auto self = weak.lock();
@@ -211,11 +216,15 @@ void Host::services(const ServicesRequest& request, ServicesHandler handler) {
 }
 
 void Host::explain(const NSErrorRef& error, std::function<void(NSErrorRef)> handler) {
+  explain(error, isInterruption(error), std::move(handler));
+}
+
+void Host::explain(const NSErrorRef& error, bool wasLost, std::function<void(NSErrorRef)> handler) {
   // The extension cannot tell a missing item from a missing zarn.
   if (!isConnectionError(error) && !isNoSuchItemError(error)) return handler(error);
-  zarn_->probe([error, handler = std::move(handler)](const NSErrorRef& missing) {
+  zarn_->probe([error, wasLost, handler = std::move(handler)](const NSErrorRef& missing) {
     if (missing != nullptr) return handler(zarnNotRunningError(error));
-    if (!wasLost(error)) return handler(error);
+    if (!wasLost) return handler(error);
     handler(extensionUnavailableError("ended in the middle of the request", error));
   });
 }

@@ -52,8 +52,10 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
   void item(const std::string& identifier, ItemHandler handler);
   void locate(const std::string& identifier, TextHandler handler);
   void identify(const std::string& path, TextHandler handler);
+  using VendedServicesHandler =
+      std::function<void(std::optional<std::vector<VendedService>>, NSErrorRef)>;
   /// Asking twice does no harm: an endpoint that nobody connects to goes away.
-  void services(const ServicesRequest& request, ServicesHandler handler);
+  void services(const ServicesRequest& request, VendedServicesHandler handler);
 
   /// Null when there are too many watches already. The watch ends when the caller lets go of it.
   std::shared_ptr<ContainerWatch> watch(const std::string& container,
@@ -79,6 +81,8 @@ class Host final : public EnumeratorSource, public std::enable_shared_from_this<
   explicit Host(Options options);
   void wire();
   void didSignal(const std::string& container);
+  /// `wasLost`: the error says that the extension was.
+  void explain(const NSErrorRef& error, bool wasLost, std::function<void(NSErrorRef)> handler);
   /// Every watch that lives.
   [[nodiscard]] std::vector<std::shared_ptr<ContainerWatch>> watches();
 

@@ -159,6 +159,31 @@ TEST_F(HostContentTest, AsksTheNextExtensionWhenOneEndsUnderARequest) {
   EXPECT_EQ(status().starts, 2U);
 }
 
+TEST_F(HostContentTest, AsksNobodyElseForWhatWasGivenUp) {
+  command("slow");
+  const auto request = ask(remote, "/root/a");
+  EXPECT_EQ(waitForJournal(1), Lines{"start /root/a 0"});
+  const auto first = status().extension;
+  command("die-on-stop");
+  request.call.cancel();
+  ASSERT_TRUE(waitForStatus([&](const Status& now) { return now.extension != first; }));
+  countermand("slow");
+  EXPECT_EQ(provide("/root/b").error, nullptr);
+  EXPECT_EQ(journal(), (Lines{"start /root/a 0", "stop /root/a", "start /root/b 0"}));
+}
+
+TEST_F(HostContentTest, NeverBeginsWhatWasGivenUpBeforeThereWasAnExtension) {
+  countermand("root");
+  {
+    const auto request = ask(remote, "/root/a");
+    request.call.cancel();
+    (void)status();  // it follows the cancellation
+  }
+  command("root");
+  EXPECT_EQ(provide("/root/b").error, nullptr);
+  EXPECT_THAT(journal(), testing::Not(testing::Contains("start /root/a 0")));
+}
+
 TEST_F(HostContentTest, AsksAgainForContentThatIsGoneAgain) {
   const std::string file = home + "/file";
   std::ofstream(file) << "x";

@@ -55,6 +55,10 @@ struct Client {
   const std::shared_ptr<HandlerNotes> answers = std::make_shared<HandlerNotes>();
 };
 
+NSErrorRef interruption() {
+  return NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionInterrupted);
+}
+
 class HostServicesTest : public HostTest {
  protected:
   HostServicesTest() {
@@ -108,6 +112,19 @@ TEST_F(HostServicesTest, ANameThatIsTooLongIsRefused) {
   EXPECT_EQ(services.serviceForItemIdentifier("item", std::string(5'000, 'n'), &error), nullptr);
   ASSERT_NE(error, nullptr);
   EXPECT_NE(error->localizedDescription().find("too long"), std::string::npos);
+}
+
+TEST_F(HostServicesTest, ConnectionsOutliveARequestThatLostZarn) {
+  Client talker(*service());
+  EXPECT_EQ(talker.addOne(1), "2");
+  command("zarn-lost");
+  NSErrorRef error;
+  EXPECT_TRUE(services.servicesForItemIdentifier("item", &error).empty());
+  EXPECT_EQ(test::domainAndCode(error), test::domainAndCode(interruption()));
+  EXPECT_EQ(services.serviceForItemIdentifier("item", kService, &error), nullptr);
+  EXPECT_EQ(test::domainAndCode(error), test::domainAndCode(interruption()));
+  EXPECT_EQ(status().starts, 1U);
+  EXPECT_EQ(talker.addOne(2), "3");
 }
 
 TEST_F(HostServicesTest, EachFurtherConnectionOfAServiceAsksTheHost) {

@@ -6,9 +6,12 @@
 
 #include <cerrno>
 #include <chrono>
+#include <future>
+#include <memory>
 
 #include "fileproviderd/host_fixture.h"
 #include "platform/fileprovider/constants.h"
+#include "platform/ipc/call.h"
 
 namespace yomber {
 namespace {
@@ -26,6 +29,20 @@ auto holds(const Versions& versions) {
   return [versions](const WatchedPicture& picture) {
     return picture.isListed && picture.versions == versions;
   };
+}
+
+/// Asks for a page, and takes that back before one came.
+void callNextAndCancel(const ipc::Remote<protocol::Listing>& listing) {
+  auto ended = std::make_shared<std::promise<NSErrorRef>>();
+  const auto handle = ipc::call(
+      listing, &protocol::Listing::Client::nextRequest, [](auto) {},
+      [ended](const NSErrorRef& error, const protocol::Listing::NextResults::Reader*) {
+        ended->set_value(error);
+      });
+  handle.cancel();
+  const NSErrorRef error = ended->get_future().get();
+  ASSERT_NE(error, nullptr) << "a page has come before";
+  EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSUserCancelledError));
 }
 
 TEST_F(HostTest, AnswersLookupsThroughTheExtension) {
@@ -156,6 +173,54 @@ TEST_F(HostTest, AKilledExtensionIsReplacedAndReaped) {
   EXPECT_NE(status().extension, first);
   EXPECT_EQ(kill(first, 0), -1) << "a zombie";
   EXPECT_EQ(errno, ESRCH);
+}
+
+TEST_F(HostTest, AnExtensionThatLostZarnIsNotTakenForLostItself) {
+  startZarn();
+  startHost();
+  ASSERT_EQ(item("a"), nullptr);
+  const auto healthy = status().extension;
+  command("zarn-lost");
+  for (const auto& error : {item("a"), locate("nothing"), identify("/root/nothing")}) {
+    ASSERT_NE(error, nullptr);
+    EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSXPCConnectionInterrupted)) << error->description();
+  }
+  EXPECT_EQ(status().starts, 1U);
+  EXPECT_EQ(status().extension, healthy);
+  countermand("zarn-lost");
+  EXPECT_EQ(item("a"), nullptr);
+}
+
+TEST_F(HostTest, AListingIsWholeForWhoCallsAgainAfterCancelling) {
+  startZarn();
+  countermand("root");
+  startHost();
+  const auto items = manyItems(450);
+  setItems(items);
+  const auto listing = list("i:1");
+  for (int i = 0; i < 2; ++i) callNextAndCancel(listing);
+  (void)status();  // it follows the last cancellation
+  command("root");
+  std::vector<std::string> listed;
+  bool more = true;
+  while (more) ASSERT_EQ(next(listing, &listed, &more), nullptr);
+  std::vector<std::string> expected;
+  for (const auto& [identifier, version] : items) expected.push_back(identifier);
+  EXPECT_EQ(listed, expected);
+}
+
+TEST_F(HostTest, CancelledCallsForPagesTakeNobodysPlace) {
+  startZarn();
+  countermand("root");
+  startHost();
+  const auto listing = list("i:1");
+  constexpr int kMoreThanMayWait = 40;
+  for (int i = 0; i < kMoreThanMayWait; ++i) callNextAndCancel(listing);
+  (void)status();  // it follows the last cancellation
+  command("root");
+  std::vector<std::string> listed;
+  EXPECT_EQ(next(listing, &listed), nullptr);
+  EXPECT_EQ(listed, (std::vector<std::string>{"a", "b", "c"}));
 }
 
 TEST_F(HostTest, AnExtensionThatDiesInMidListingEndsTheListingClearly) {

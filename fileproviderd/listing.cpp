@@ -24,8 +24,13 @@ constexpr std::size_t kMaximumWaiting = 16;
 /// The listing itself; the capability holds it, and answers that come when it is gone are dropped.
 class ListingState : public std::enable_shared_from_this<ListingState> {
  public:
-  /// Writes a page or an error as the answer of one `next`.
-  using Answer = std::function<void(const PageResponse* page, const NSErrorRef& error)>;
+  /// One `next`.
+  struct Call {
+    /// False when the client has taken it back.
+    std::function<bool()> isWanted;
+    /// Writes a page or an error as its answer; to be called while it is wanted.
+    std::function<void(const PageResponse* page, const NSErrorRef& error)> answer;
+  };
 
   ListingState(ExtensionSupervisor& supervisor, ErrorExplainer explain, std::string container,
                protocol::SortOrder order, std::chrono::milliseconds pageLimit)
@@ -35,12 +40,15 @@ class ListingState : public std::enable_shared_from_this<ListingState> {
         order_(order),
         pageLimit_(pageLimit) {}
 
-  void next(Answer answer) {
-    waiting_.push_back(std::move(answer));
+  /// False when too many wait already.
+  [[nodiscard]] bool next(Call call) {
+    dropUnwanted();
+    if (waiting_.size() >= kMaximumWaiting) return false;
+    waiting_.push_back(std::move(call));
     if (!hasStarted_) open();
     serve();
+    return true;
   }
-  [[nodiscard]] bool isFull() const { return waiting_.size() >= kMaximumWaiting; }
 
  private:
   void open();
@@ -49,6 +57,9 @@ class ListingState : public std::enable_shared_from_this<ListingState> {
   void didNotGetPage(const kj::Exception& exception);
   void fail(const NSErrorRef& error);
   void serve();
+  void dropUnwanted() {
+    std::erase_if(waiting_, [](const Call& call) { return !call.isWanted(); });
+  }
 
   ExtensionSupervisor& supervisor_;
   const ErrorExplainer explain_;
@@ -63,7 +74,7 @@ class ListingState : public std::enable_shared_from_this<ListingState> {
   ipc::Remote<Enumerator> enumerator_;
   kj::Maybe<PageResponse> ready_;
   kj::Promise<void> request_ = nullptr;
-  std::deque<Answer> waiting_;
+  std::deque<Call> waiting_;
 };
 
 void ListingState::open() {
@@ -141,9 +152,11 @@ void ListingState::fail(const NSErrorRef& error) {
 }
 
 void ListingState::serve() {
+  // A page goes to whoever still waits: nobody asks for the same one again.
+  dropUnwanted();
   KJ_IF_MAYBE (page, ready_) {
     if (waiting_.empty()) return;
-    const auto answer = std::move(waiting_.front());
+    const auto call = std::move(waiting_.front());
     waiting_.pop_front();
     const PageResponse response = kj::mv(*page);
     ready_ = nullptr;
@@ -156,11 +169,11 @@ void ListingState::serve() {
         if (const auto self = weak.lock()) self->requestPage();
       });
     }
-    answer(&response, nullptr);
+    call.answer(&response, nullptr);
     if (!isComplete_) return;
   }
   if (failure_ == nullptr && !(isComplete_ && ready_ == nullptr)) return;
-  for (const auto& answer : std::exchange(waiting_, {})) answer(nullptr, failure_);
+  for (const auto& call : std::exchange(waiting_, {})) call.answer(nullptr, failure_);
 }
 
 class ListingServer final : public Listing::Server {
@@ -170,24 +183,22 @@ class ListingServer final : public Listing::Server {
  protected:
   kj::Promise<void> next(NextContext context) override {
     context.allowCancellation();
-    if (state_->isFull()) {
-      const auto error = invalidRequestError("too many pages were asked for at a time");
-      ipc::encodeError(error, context.getResults().initResult().initError());
-      return kj::READY_NOW;
-    }
     auto pair = kj::newPromiseAndFulfiller<void>();
     struct Pending {
       NextContext context;
       kj::Own<kj::PromiseFulfiller<void>> fulfiller;
     };
     auto pending = std::make_shared<Pending>(Pending{context, kj::mv(pair.fulfiller)});
-    state_->next([pending](const PageResponse* page, const NSErrorRef& error) {
-      // The context lives only while somebody waits for the answer.
-      if (!pending->fulfiller->isWaiting()) return;
+    const auto answer = [pending](const PageResponse* page, const NSErrorRef& error) {
       write(page, error, pending->context);
       pending->fulfiller->fulfill();
-    });
-    return kj::mv(pair.promise);
+    };
+    // The context lives only while somebody waits for the answer.
+    const auto isWanted = [pending] { return pending->fulfiller->isWaiting(); };
+    if (state_->next({.isWanted = isWanted, .answer = answer})) return kj::mv(pair.promise);
+    const auto error = invalidRequestError("too many pages were asked for at a time");
+    ipc::encodeError(error, context.getResults().initResult().initError());
+    return kj::READY_NOW;
   }
 
  private:

@@ -55,11 +55,9 @@ class RemoteSession final : public ExtensionSession,
   }
 
   void locate(const std::string& identifier, std::chrono::milliseconds limit,
-              std::function<void(std::optional<std::string>, NSErrorRef)> handler) override;
-  void identify(const std::string& path,
-                std::function<void(std::optional<std::string>, NSErrorRef)> handler) override;
-  void item(const std::string& identifier,
-            std::function<void(std::optional<ItemFields>, NSErrorRef)> handler) override;
+              AnswerHandler<std::string> handler) override;
+  void identify(const std::string& path, AnswerHandler<std::string> handler) override;
+  void item(const std::string& identifier, AnswerHandler<ItemFields> handler) override;
   void enumerator(const std::string& container, EnumeratorHandler handler) override;
   void openEnumerator(
       const std::string& container,
@@ -116,7 +114,7 @@ void RemoteSession::didEnd(const std::string& how, const NSErrorRef& underlying)
 }
 
 void RemoteSession::locate(const std::string& identifier, std::chrono::milliseconds limit,
-                           std::function<void(std::optional<std::string>, NSErrorRef)> handler) {
+                           AnswerHandler<std::string> handler) {
   (void)ipc::call(
       extension_, &Extension::Client::urlForItemRequest,
       [identifier](Extension::UrlForItemParams::Builder params) {
@@ -129,13 +127,12 @@ void RemoteSession::locate(const std::string& identifier, std::chrono::milliseco
         if (results != nullptr && results->getPath().isValue()) {
           path = stringFromWire(results->getPath().getValue());
         }
-        handler(std::move(path), std::move(error));
+        handler(std::move(path), std::move(error), results == nullptr);
       },
       {.timeout = limit});
 }
 
-void RemoteSession::identify(const std::string& path,
-                             std::function<void(std::optional<std::string>, NSErrorRef)> handler) {
+void RemoteSession::identify(const std::string& path, AnswerHandler<std::string> handler) {
   (void)ipc::call(
       extension_, &Extension::Client::identifierForPathRequest,
       [path](Extension::IdentifierForPathParams::Builder params) {
@@ -148,13 +145,12 @@ void RemoteSession::identify(const std::string& path,
         if (results != nullptr && results->getFound()) {
           identifier = stringFromWire(results->getIdentifier());
         }
-        handler(std::move(identifier), std::move(error));
+        handler(std::move(identifier), std::move(error), results == nullptr);
       },
       {.timeout = callLimit_});
 }
 
-void RemoteSession::item(const std::string& identifier,
-                         std::function<void(std::optional<ItemFields>, NSErrorRef)> handler) {
+void RemoteSession::item(const std::string& identifier, AnswerHandler<ItemFields> handler) {
   (void)ipc::call(
       extension_, &Extension::Client::itemForIdentifierRequest,
       [identifier](Extension::ItemForIdentifierParams::Builder params) {
@@ -172,7 +168,7 @@ void RemoteSession::item(const std::string& identifier,
             error = ipc::decodeError(result.getError());
           }
         }
-        handler(std::move(item), std::move(error));
+        handler(std::move(item), std::move(error), results == nullptr);
       },
       {.timeout = callLimit_});
 }

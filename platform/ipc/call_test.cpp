@@ -5,6 +5,7 @@
 #include <atomic>
 #include <csignal>
 #include <cstring>
+#include <memory>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -118,6 +119,28 @@ TEST(Call, NilRemoteIsAnErrorAtOnce) {
   ASSERT_TRUE(outcome.replies.waitFor(1));
   EXPECT_TRUE(test::isCocoaError(outcome.error, NSXPCConnectionInvalid));
   EXPECT_FALSE(outcome.hadResults);
+}
+
+/// Overwrites memory that the calling thread freed a moment ago, whatever its size.
+void overwriteFreedMemory() {
+  constexpr std::size_t kStep = 16;
+  std::vector<std::unique_ptr<char[]>> taken;
+  for (std::size_t size = kStep; size <= 64 * kStep; size += kStep) {
+    for (int i = 0; i < 8; ++i) taken.push_back(std::make_unique<char[]>(size));
+  }
+}
+
+TEST(Call, CancellingACallOfNilRightAwayEndsItOnce) {
+  Gate closed;
+  EventLoop::shared().post([&] { closed.wait(); });
+  Outcome outcome;
+  hang(nullptr, outcome).cancel();
+  EventLoop::shared().post(overwriteFreedMemory);
+  closed.open();
+  ASSERT_TRUE(outcome.replies.waitFor(1));
+  settle();
+  EXPECT_EQ(outcome.replies.value(), 1U);
+  EXPECT_NE(outcome.error, nullptr);
 }
 
 TEST(Call, OnTheLoopThreadTheReplyComesAfterTheReturn) {

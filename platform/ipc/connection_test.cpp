@@ -3,15 +3,24 @@
 #include <capnp/message.h>
 #include <capnp/rpc.capnp.h>
 #include <capnp/serialize.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <string>
 #include <thread>
+#include <utility>
+#include <vector>
 
 #include "platform/ipc/call.h"
 #include "platform/ipc/listener.h"
@@ -52,13 +61,52 @@ Connection::Bootstrap echoes(const test::EchoStateRef& state) {
 
 TEST(Connection, ConnectingToNothingNamesThePathAndSaysWhatToDo) {
   test::TemporaryDirectory directory;
-  for (const std::string& path : {directory.file("nothing"), directory.file("no/directory")}) {
+  ASSERT_TRUE(UniqueFd(::creat(directory.file("file").c_str(), 0600)));
+  for (const std::string& path :
+       {directory.file("nothing"), directory.file("no/directory"), directory.file("file/s")}) {
     NSErrorRef error;
     EXPECT_EQ(Connection::connect(path, &error), nullptr);
     ASSERT_NE(error, nullptr);
     EXPECT_NE(error->localizedDescription().find(path), std::string::npos);
     EXPECT_NE(error->localizedDescription().find("yomber up"), std::string::npos);
   }
+}
+
+/// This process opens nothing more for so long.
+class NoMoreDescriptors {
+ public:
+  NoMoreDescriptors() {
+    EXPECT_EQ(::getrlimit(RLIMIT_NOFILE, &before_), 0);
+    const UniqueFd lowestFree = duplicateDescriptor(STDERR_FILENO);
+    EXPECT_TRUE(lowestFree);
+    rlimit lowered = before_;
+    lowered.rlim_cur = static_cast<rlim_t>(lowestFree.get());
+    EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &lowered), 0);
+  }
+  ~NoMoreDescriptors() { EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &before_), 0); }
+  NoMoreDescriptors(const NoMoreDescriptors&) = delete;
+  NoMoreDescriptors& operator=(const NoMoreDescriptors&) = delete;
+
+ private:
+  rlimit before_{};
+};
+
+TEST(Connection, WhoHasNoDescriptorLeftIsNotToldThatNothingListens) {
+  test::TemporaryDirectory directory;
+  const auto state = std::make_shared<test::EchoState>();
+  const auto listener = Listener::listen(
+      directory.file("s"), [&](const PeerCredentials&) { return test::makeEcho(state); });
+  ASSERT_NE(listener, nullptr);
+  NSErrorRef error;
+  {
+    const NoMoreDescriptors shortage;
+    EXPECT_EQ(Connection::connect(directory.file("s"), &error), nullptr);
+  }
+  ASSERT_NE(error, nullptr);
+  EXPECT_TRUE(error->is(NSPOSIXErrorDomain, EMFILE)) << error->description();
+  EXPECT_NE(error->localizedDescription().find("open files"), std::string::npos)
+      << error->localizedDescription();
+  EXPECT_NE(Connection::connect(directory.file("s"), &error), nullptr);
 }
 
 TEST(Connection, ConnectAsyncAnswersOnAnotherThread) {
@@ -365,6 +413,108 @@ TEST(Connection, APeerThatReadsLateGetsEverything) {
   for (; bytes <= kMaximumBacklogBytes; bytes += kLargeReply) peer.askForLarge(kLargeReply);
   EXPECT_GE(peer.read(bytes), bytes);
   EXPECT_TRUE(peer.connection->isConnected());
+}
+
+/// A peer that makes one call after the other without waiting for replies, which it takes in as
+/// they come. It ends by itself after very many calls.
+class FloodingPeer {
+ public:
+  FloodingPeer() {
+    UniqueFd theirs;
+    EXPECT_TRUE(makeSocketPair(socket_, theirs));
+    EXPECT_EQ(MessageStream::sendCredentials(socket_.get()), 0);
+    connection_ = Connection::adopt(theirs.release(), echoes(state_));
+    reader_ = std::thread([this] { readReplies(); });
+    writer_ = std::thread([this] { writeCalls(); });
+  }
+  ~FloodingPeer() {
+    ::shutdown(socket_.get(), SHUT_RDWR);
+    writer_.join();
+    reader_.join();
+  }
+  FloodingPeer(const FloodingPeer&) = delete;
+  FloodingPeer& operator=(const FloodingPeer&) = delete;
+
+  void awaitReplies() { replies_.wait(); }
+  [[nodiscard]] bool hasEnded() const { return hasEnded_; }
+
+ private:
+  static constexpr std::uint32_t kCalls = 100'000;
+  static constexpr std::uint32_t kCallsInOneGo = 500;
+  static constexpr std::size_t kManyBytes = 1 << 17;
+
+  void readReplies() {
+    std::vector<char> buffer(1 << 16);
+    std::size_t total = 0;
+    for (ssize_t count = 0; (count = ::recv(socket_.get(), buffer.data(), buffer.size(), 0)) > 0;) {
+      const bool wereFew = total < kManyBytes;
+      total += static_cast<std::size_t>(count);
+      if (wereFew && total >= kManyBytes) replies_.open();
+    }
+    if (total < kManyBytes) replies_.open();
+  }
+
+  void writeCalls() {
+    std::string bytes;
+    append(bytes, [](auto message) { message.initBootstrap().setQuestionId(0); });
+    for (std::uint32_t call = 1; call <= kCalls; ++call) {
+      append(bytes, [call](auto message) {
+        auto request = message.initCall();
+        request.setQuestionId(call);
+        request.initTarget().initPromisedAnswer().setQuestionId(0);
+        request.setInterfaceId(capnp::typeId<Echo>());
+        request.initParams().getContent().template initAs<Echo::EchoParams>().setValue(call);
+      });
+      append(bytes, [call](auto message) { message.initFinish().setQuestionId(call); });
+      if (call % kCallsInOneGo == 0 && !send(std::exchange(bytes, {}))) return;
+    }
+    hasEnded_ = true;
+  }
+
+  template <typename Fill>
+  static void append(std::string& bytes, Fill fill) {
+    capnp::MallocMessageBuilder builder;
+    fill(builder.initRoot<capnp::rpc::Message>());
+    const auto words = capnp::messageToFlatArray(builder);
+    bytes.append(words.asChars().begin(), words.asChars().size());
+  }
+
+  [[nodiscard]] bool send(const std::string& bytes) const {
+    for (std::size_t done = 0; done < bytes.size();) {
+      const ssize_t sent =
+          ::send(socket_.get(), bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
+      if (sent <= 0) return false;
+      done += static_cast<std::size_t>(sent);
+    }
+    return true;
+  }
+
+  const test::EchoStateRef state_ = std::make_shared<test::EchoState>();
+  UniqueFd socket_;
+  Connection::Ref connection_;
+  Gate replies_;
+  std::atomic<bool> hasEnded_{false};
+  std::thread reader_;
+  std::thread writer_;
+};
+
+TEST(Connection, APeerThatNeverPausesHoldsUpNobody) {
+  const CallOptions patient{.timeout = std::chrono::milliseconds::zero()};
+  EchoPair pair;
+  ASSERT_TRUE(test::echoes(pair.echo, 1));
+  // Together they leave the loop without work at no time, however the machine shares its cores.
+  std::array<FloodingPeer, 6> flood;
+  const auto hasEnded = [&] { return std::ranges::any_of(flood, &FloodingPeer::hasEnded); };
+  for (FloodingPeer& peer : flood) peer.awaitReplies();
+  EventLoop::shared().runAndWait([] {});
+  EXPECT_FALSE(hasEnded()) << "the mailbox waited for the flood's end";
+  for (std::uint64_t i = 0; i < 10; ++i) EXPECT_TRUE(test::echoes(pair.echo, i, patient));
+  EXPECT_FALSE(hasEnded()) << "calls of others waited for the flood's end";
+  const NSErrorRef error = callAndWait(
+      pair.echo, &Echo::Client::hangRequest, [](auto) {}, [](auto) {},
+      {.timeout = std::chrono::milliseconds(1)});
+  EXPECT_TRUE(test::isCocoaError(error, NSXPCConnectionTimedOut));
+  EXPECT_FALSE(hasEnded()) << "a timer waited for the flood's end";
 }
 
 TEST(Connection, PathsOfAnyLengthWork) {

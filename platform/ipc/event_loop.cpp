@@ -24,6 +24,9 @@ thread_local bool isLoopThread = false;
 constexpr auto kRetirement = 2 * kj::MILLISECONDS;
 /// With so many retired the loop lets go of them at once.
 constexpr std::size_t kMaximumRetired = 256;
+/// After so many events the loop looks for what else has come, though it has work left: else a peer
+/// that never pauses would keep everybody else waiting.
+constexpr kj::uint kEventsInOneGo = 1'000;
 
 void logFailure(const char* where, const kj::Exception& exception) {
   log_error(defaultLog(), "%s on the loop thread failed: %s", where,
@@ -89,6 +92,7 @@ struct EventLoop::State {
     blockSignals();
     Loop own(*this);
     loop = &own;
+    own.context.waitScope.setBusyPollInterval(kEventsInOneGo);
     for (;;) {
       // Observed before the mailbox is emptied, so that no wake-up falls between the two. The
       // eventfd is never read: every write to it is an edge of its own.

@@ -33,8 +33,8 @@ constexpr char kPreamble = 'Y';
 /// How often a full socket is tried again when there is no descriptor left to observe it with.
 constexpr auto kRoomPolling = 5 * kj::MILLISECONDS;
 
-/// After so many messages in one go, replies are sent: that is else done at the end of the loop's
-/// turn, which a peer that never pauses would put off for ever.
+/// After so many messages the loop gets to the end of its turn, where what was written is sent: a
+/// peer that never pauses would put that off for ever, for itself and for everybody else.
 constexpr std::size_t kMessagesInOneGo = 256;
 /// How often a backlog is looked at.
 constexpr auto kBacklogPolling = 50 * kj::MILLISECONDS;
@@ -215,10 +215,7 @@ kj::Promise<kj::Maybe<capnp::MessageReaderAndFds>> MessageStream::tryReadMessage
     return tryReadMessage(fdSpace, options, scratchSpace);
   };
   for (;;) {
-    if (takenInOneGo_ == kMessagesInOneGo) {
-      takenInOneGo_ = 0;
-      flushOrWait();
-    }
+    if (takenInOneGo_ == kMessagesInOneGo) return afterTurn().then(kj::cp(again));
     if (hasTooMuchWaiting()) {
       return port_.getTimer().afterDelay(kBacklogPolling).then(kj::cp(again));
     }
@@ -234,11 +231,19 @@ kj::Promise<kj::Maybe<capnp::MessageReaderAndFds>> MessageStream::tryReadMessage
       return Result(nullptr);
     }
     if (received == Received::Some) continue;
-    takenInOneGo_ = 0;
     kj::Promise<void> ready = kj::mv(*readable_);
     readable_.reset();
     return ready.then(kj::cp(again));
   }
+}
+
+kj::Promise<void> MessageStream::afterTurn() {
+  // What comes last runs before what was to come last earlier, such as the sending of others. So
+  // it only steps aside, until the loop has asked the system for news.
+  return kj::evalLast([this] {
+    takenInOneGo_ = 0;
+    return port_.getTimer().afterDelay(0 * kj::NANOSECONDS);
+  });
 }
 
 std::span<const std::byte> MessageStream::buffered() const {
@@ -407,6 +412,7 @@ void MessageStream::scheduleFlush() {
   flushScheduled_ = true;
   flushTask_ = kj::evalLast([this] {
                  flushScheduled_ = false;
+                 takenInOneGo_ = 0;
                  flushOrWait();
                }).eagerlyEvaluate(nullptr);
 }

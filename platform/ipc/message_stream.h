@@ -111,6 +111,8 @@ class MessageStream final : public capnp::MessageStream {
 
   // Receiving.
   void verifyPeer();
+  /// When all that the loop has to do now is done, and sent.
+  kj::Promise<void> afterTurn();
   kj::Maybe<kj::Array<capnp::word>> takeMessage();
   kj::ArrayPtr<kj::AutoCloseFd> takeDescriptors(std::uint64_t endOffset,
                                                 kj::ArrayPtr<kj::AutoCloseFd> space);
@@ -165,7 +167,7 @@ class MessageStream final : public capnp::MessageStream {
   std::deque<DescriptorBatch> batches_;
   /// Set while an edge of readability is awaited; armed before each receive, so that none is lost.
   std::optional<kj::Promise<void>> readable_;
-  std::size_t takenInOneGo_ = 0;
+  std::size_t takenInOneGo_ = 0;  ///< messages, since the last end of the loop's turn
 
   std::function<Backlog()> measureBacklog_;
   std::uint64_t sentBytes_ = 0;  ///< that the socket has taken

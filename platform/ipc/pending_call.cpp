@@ -55,7 +55,8 @@ void PendingCall::run() {
   try {
     task_ = send(makeRequest()).eagerlyEvaluate(nullptr);
   } catch (...) {
-    EventLoop::shared().post([this, error = currentReplyError()] { giveUp(error); });
+    // A cancellation that is posted already may come first, and end the call.
+    EventLoop::shared().post([self = self_, error = currentReplyError()] { self->giveUp(error); });
     return;
   }
   if (options_.timeout.count() > 0) {

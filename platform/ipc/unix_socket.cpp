@@ -28,6 +28,12 @@ NSErrorRef socketError(int number, const std::string& path, std::string text) {
 }
 
 NSErrorRef directoryError(int number, const std::string& directory) {
+  if (isDescriptorShortage(number)) {
+    return socketError(number, directory,
+                       "The socket directory " + directory +
+                           " cannot be opened: " + std::strerror(number) +
+                           ". Raise the limit on open files, or close some.");
+  }
   return socketError(
       number, directory,
       "The socket directory " + directory + " cannot be used: " + std::strerror(number) + ".");
@@ -189,9 +195,12 @@ bool isDescriptorShortage(int number) {
 }
 
 UniqueFd connectUnixSocket(const std::string& path, NSErrorRef* error) {
-  const auto address = SocketAddress::make(path, nullptr);
+  NSErrorRef unusable;
+  const auto address = SocketAddress::make(path, &unusable);
   if (!address) {
-    storeError(error, connectError(ENOENT, path));
+    const bool isMissing =
+        unusable->is(NSPOSIXErrorDomain, ENOENT) || unusable->is(NSPOSIXErrorDomain, ENOTDIR);
+    storeError(error, isMissing ? connectError(ENOENT, path) : unusable);
     return {};
   }
   UniqueFd fd = makeSocket(path, error);

@@ -61,7 +61,7 @@ class HostedExtension {
   std::string identify(const std::string& path) {
     std::optional<std::string> found;
     onLoop([&](const std::function<void()>& done) {
-      session_->identify(path, [&, done](std::optional<std::string> identifier, NSErrorRef) {
+      session_->identify(path, [&, done](std::optional<std::string> identifier, NSErrorRef, bool) {
         found = std::move(identifier);
         done();
       });
@@ -73,7 +73,7 @@ class HostedExtension {
   void lookUp(const std::string& identifier) {
     NSErrorRef failure;
     onLoop([&](const std::function<void()>& done) {
-      session_->item(identifier, [&, done](std::optional<ItemFields> item, NSErrorRef error) {
+      session_->item(identifier, [&, done](std::optional<ItemFields> item, NSErrorRef error, bool) {
         failure = std::move(error);
         isRight_ = isRight_ && item && item->identifier == identifier;
         done();

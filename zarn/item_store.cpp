@@ -3,6 +3,7 @@
 #include <SQLiteCpp/Exception.h>
 
 #include "platform/ostrell/constants.h"
+#include "zarn/chain_path.h"
 #include "zarn/connection.h"
 #include "zarn/row_queries.h"
 
@@ -63,19 +64,6 @@ std::optional<ItemRow> findBelow(Connection& connection, std::uint64_t place,
   return row;
 }
 
-std::string pathOfChain(const TreeLayout& layout, const ItemChain& chain, bool physical) {
-  std::string path = chain.place == kTrashID ? layout.trashFiles() : layout.root();
-  for (auto row = chain.rows.rbegin(); row != chain.rows.rend(); ++row) {
-    if (row->isContainerFolder()) {
-      path = layout.documents(row->extra->containerID);
-      continue;
-    }
-    path += '/';
-    path += physical ? row->nameOnDisk() : row->name;
-  }
-  return path;
-}
-
 }  // namespace
 
 ItemStore::ItemStore(std::shared_ptr<Database> database, TreeLayout layout)
@@ -127,7 +115,7 @@ std::optional<std::string> ItemStore::logicalPath(std::uint64_t id, NSErrorRef* 
   return query(*database_, error, [&](Connection& c) -> std::optional<std::string> {
     const auto chain = findChain(c, id);
     if (!chain) return std::nullopt;
-    return pathOfChain(layout_, *chain, false);
+    return pathOfChain(layout_, *chain, Names::Shown);
   });
 }
 
@@ -135,7 +123,7 @@ std::optional<ItemStore::Located> ItemStore::located(std::uint64_t id, NSErrorRe
   return query(*database_, error, [&](Connection& c) -> std::optional<Located> {
     auto chain = findChain(c, id);
     if (!chain || chain->rows.empty()) return std::nullopt;
-    std::string path = pathOfChain(layout_, *chain, false);
+    std::string path = pathOfChain(layout_, *chain, Names::Shown);
     return Located{std::move(chain->rows.front()), std::move(path)};
   });
 }
@@ -144,12 +132,12 @@ std::optional<std::string> ItemStore::physicalPath(std::uint64_t id, NSErrorRef*
   return query(*database_, error, [&](Connection& c) -> std::optional<std::string> {
     const auto chain = findChain(c, id);
     if (!chain) return std::nullopt;
-    return pathOfChain(layout_, *chain, true);
+    return pathOfChain(layout_, *chain, Names::OnDisk);
   });
 }
 
 std::string ItemStore::physicalPath(const ItemChain& chain) const {
-  return pathOfChain(layout_, chain, true);
+  return pathOfChain(layout_, chain, Names::OnDisk);
 }
 
 ItemStore::Counts ItemStore::counts(NSErrorRef* error) const {

@@ -13,6 +13,8 @@ class LinkResolver {
  public:
   explicit LinkResolver(TreeLayout layout);
 
+  [[nodiscard]] const TreeLayout& layout() const { return layout_; }
+
   /// Whether the symbolic link `name` in the open folder leads to something inside the drive, both
   /// by what its text says and by where it really ends. Loops and dangling links do not.
   [[nodiscard]] bool isBookmark(int folder, const std::string& name) const;

@@ -1,7 +1,9 @@
 #include <thread>
 
+#include "platform/foundation/fault_points.h"
 #include "zarn/scanner.h"
 #include "zarn/test_drive.h"
+#include "zarn/test_waiting.h"
 
 namespace yomber {
 namespace {
@@ -178,6 +180,29 @@ TEST_F(LocationScanTest, AScanThatLookedEarlierUndoesNothing) {
   reconciling.join();
   scan();
   EXPECT_EQ(names(id("folder")).size(), 301U);
+}
+
+TEST_F(LocationScanTest, AScanThatSawItAwayLeavesWhatHasComeBack) {
+  const std::string away = layout.home() + "/away";
+  const std::uint64_t item = id("folder/a.txt");
+  ASSERT_EQ(::rename(at("folder/a.txt").c_str(), away.c_str()), 0);
+  // Something new has to be read before that scan decides.
+  makeFolder("folder/new");
+  const std::string gate = layout.home() + "/go";
+  ASSERT_EQ(FaultPoint::arm("zarn.scan.before-new-folders=pause-until-file:" + gate), nullptr);
+  std::thread scanning([&] { EXPECT_EQ(scanFolders({"folder"}), nullptr); });
+  const bool isReached = waitUntil([&] { return std::filesystem::exists(gate + ".reached"); });
+  ASSERT_EQ(::rename(away.c_str(), at("folder/a.txt").c_str()), 0);
+  const auto back = look("folder/a.txt");
+  (void)sink->take();
+  std::ofstream(gate).put('x');
+  scanning.join();
+  FaultPoint::disarmAll();
+  ASSERT_TRUE(isReached);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(back->id, item);
+  EXPECT_EQ(id("folder/a.txt"), item);
+  for (const ItemChange& change : sink->take()) EXPECT_NE(change.row.id, item) << "nothing to tell";
 }
 
 }  // namespace

@@ -139,6 +139,12 @@ class Reconciler {
   void add(WriteTransaction& transaction, const Candidate& candidate);
   [[nodiscard]] static std::optional<ItemRow> findFormer(WriteTransaction& transaction,
                                                          const Candidate& candidate);
+  /// The folder that what is gone was in.
+  struct FormerFolder {
+    std::uint64_t id = kNoParent;
+    std::shared_ptr<const FileDescriptor> folder;
+  };
+  [[nodiscard]] bool isBack(Connection& connection, const ItemRow& row, FormerFolder& former) const;
   void removeGone(WriteTransaction& transaction);
 
   // Storing (reconciler_rows.cpp).

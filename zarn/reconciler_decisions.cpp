@@ -2,8 +2,10 @@
 #include <algorithm>
 
 #include "platform/foundation/fault_points.h"
+#include "zarn/chain_path.h"
 #include "zarn/reconciler.h"
 #include "zarn/row_queries.h"
+#include "zarn/tree_walker.h"
 
 namespace yomber {
 
@@ -203,11 +205,36 @@ void Reconciler::finish(WriteTransaction& transaction) {
   removeGone(transaction);
 }
 
+/// What was away when its folder was read can have come back since, without a change that others
+/// would have seen: then its row must not go.
+bool Reconciler::isBack(Connection& connection, const ItemRow& row, FormerFolder& former) const {
+  // Its name is another item's by now.
+  const auto named = findByName(connection, row.parent, row.name);
+  if (!named || named->id != row.id) return false;
+  if (former.id != row.parent) {
+    former = {.id = row.parent, .folder = nullptr};
+    const auto chain = findChain(connection, row.parent);
+    const auto place =
+        chain ? links_.layout().placeOf(pathOfChain(links_.layout(), *chain, Names::OnDisk))
+              : std::nullopt;
+    const auto base = place ? openFolder(place->path) : nullptr;
+    if (base) former.folder = openFolderBelow(base->get(), place->relative);
+  }
+  FolderEntry entry;
+  const std::string& name = row.nameOnDisk();
+  if (!former.folder || !lookAtEntry(former.folder->get(), name.c_str(), entry)) return false;
+  ItemAttributes attributes;
+  if (!entry.hasBirthTime && entry.type != EntryType::Symlink)
+    attributes = readItemAttributes(pathThroughDescriptor(former.folder->get(), name).c_str());
+  return isSameFile(row, entry, attributes);
+}
+
 void Reconciler::removeGone(WriteTransaction& transaction) {
+  FormerFolder former;
   for (const auto& [id, row] : gone_) {
     const auto current = findByID(transaction.connection(), id);
     if (!current) continue;  // its folder has taken it along
-    if (current->rank == row.rank) {
+    if (current->rank == row.rank && !isBack(transaction.connection(), *current, former)) {
       transaction.remove(*current);
     } else {
       noteConflict(current->parent, current->nameOnDisk());

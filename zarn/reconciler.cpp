@@ -115,7 +115,9 @@ void Reconciler::compareFolder(WriteTransaction& transaction, const FolderSnapsh
   const std::uint64_t folder = visit->second;
   visits_.erase(visit);
   const auto visitor = visitor_.lock();
-  if (!snapshot.isReadable || !refreshFolder(transaction, folder, snapshot)) {
+  const bool isRead = snapshot.isReadable && refreshFolder(transaction, folder, snapshot);
+  turns_[folder] = isRead;
+  if (!isRead) {
     if (visitor) visitor->didNotReadFolder(folder);
     return;
   }

@@ -56,6 +56,12 @@ class Reconciler {
   /// What was left alone because others had changed it since it was looked at: to be looked at
   /// again.
   [[nodiscard]] std::vector<DirtyFolder> takeConflicts();
+  /// Whether a folder was to be read, and whether it could be.
+  [[nodiscard]] bool hadTurn(std::uint64_t folder) const { return turns_.contains(folder); }
+  [[nodiscard]] bool hasRead(std::uint64_t folder) const {
+    const auto turn = turns_.find(folder);
+    return turn != turns_.end() && turn->second;
+  }
   [[nodiscard]] bool hasNewFolders() const { return !newFolders_.empty(); }
   [[nodiscard]] std::vector<NewFolder> takeNewFolders() { return std::exchange(newFolders_, {}); }
 
@@ -160,6 +166,7 @@ class Reconciler {
   const std::weak_ptr<FolderVisitor> visitor_;
   bool comparesEverything_ = false;
   std::unordered_map<std::uint64_t, std::uint64_t> visits_;
+  std::unordered_map<std::uint64_t, bool> turns_;  ///< of folders: whether they were read
   std::unordered_map<std::uint64_t, ItemRow> gone_;
   std::vector<Candidate> open_;
   std::size_t openFolders_ = 0;  ///< how many descriptors those hold

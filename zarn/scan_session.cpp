@@ -44,6 +44,17 @@ NSErrorRef ScanSession::finish() {
   return run([&](WriteTransaction& transaction) { reconciler_.finish(transaction); });
 }
 
+NSErrorRef ScanSession::findMissed(std::vector<std::uint64_t>& folders) const {
+  return database_->read([&](Connection& connection) {
+    StatementUse statement(connection.prepared("SELECT id,parent FROM item WHERE kind=?1"));
+    statement->bindInteger(1, static_cast<std::int64_t>(ItemKind::Folder));
+    while (statement->step()) {
+      const std::uint64_t id = statement->id(0);
+      if (!reconciler_.hadTurn(id) && reconciler_.hasRead(statement->id(1))) folders.push_back(id);
+    }
+  });
+}
+
 NSErrorRef ScanSession::readNewFolders(TreeWalker& walker, ScanReport& report) {
   constexpr std::size_t kBatchedEntries = 10'000;
   constexpr std::size_t kBatchedFolders = 100;

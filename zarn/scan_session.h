@@ -55,6 +55,10 @@ class ScanSession {
                                                  ScanReport& report);
   [[nodiscard]] NSErrorRef finish();
 
+  /// The topmost folders that have rows but never had their turn: each has come into one that was
+  /// read before.
+  [[nodiscard]] NSErrorRef findMissed(std::vector<std::uint64_t>& folders) const;
+
   [[nodiscard]] std::uint64_t changes() const { return changes_; }
   /// See Reconciler::takeConflicts.
   [[nodiscard]] std::vector<DirtyFolder> takeConflicts() { return reconciler_.takeConflicts(); }

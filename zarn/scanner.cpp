@@ -103,6 +103,7 @@ class Scanner::State {
                          ScanReport& report);
   NSErrorRef scanDirty(const std::vector<DirtyFolder>& folders, std::vector<DirtyFolder>& notFound,
                        ScanReport& report);
+  NSErrorRef tellMissed(const ScanSession& session) const;
   /// Looks again at what others have changed during a scan.
   NSErrorRef settle(std::vector<DirtyFolder> conflicts);
   [[nodiscard]] FolderScan folderScan() const {
@@ -184,9 +185,18 @@ NSErrorRef Scanner::State::reconcile(ScanReport& report) {
       if (NSErrorRef error = session.compare(taken)) return error;
     }
   }
-  const NSErrorRef error = session.finish();
+  NSErrorRef error = session.finish();
   report.changes = session.changes();
-  return error ? error : settle(session.takeConflicts());
+  if (!error) error = settle(session.takeConflicts());
+  return error ? error : tellMissed(session);
+}
+
+NSErrorRef Scanner::State::tellMissed(const ScanSession& session) const {
+  const auto told = visitor.lock();
+  std::vector<std::uint64_t> folders;
+  NSErrorRef error = told ? session.findMissed(folders) : nullptr;
+  for (const std::uint64_t folder : folders) told->didNotReadFolder(folder);
+  return error;
 }
 
 NSErrorRef Scanner::State::settle(std::vector<DirtyFolder> conflicts) {

@@ -7,6 +7,7 @@
 
 #include "platform/foundation/fault_points.h"
 #include "platform/ostrell/constants.h"
+#include "zarn/folder_snapshot.h"
 #include "zarn/row_queries.h"
 #include "zarn/test_drive.h"
 #include "zarn/write_transaction.h"
@@ -400,6 +401,42 @@ TEST_F(ScannerTest, TrashedItemsKeepTheirIdsAndAreMarked) {
   EXPECT_EQ(id("back"), folder);
   EXPECT_EQ(id("back/inner/deep.txt"), deep);
   EXPECT_FALSE(store->itemByID(deep)->isTrashed());
+}
+
+/// Does something when the trash, which comes after the root, is about to be read.
+class MovingVisitor : public FolderVisitor {
+ public:
+  MovingVisitor(std::uint64_t trash, std::function<void()> work)
+      : trash_(trash), work_(std::move(work)) {}
+  void willReadFolder(std::uint64_t, int descriptor) override {
+    FolderEntry folder;
+    if (lookAtEntry(descriptor, "", folder) && folder.inode == trash_) work_();
+  }
+  void didIdentifyFolder(std::uint64_t, std::uint64_t) override {}
+  void didNotReadFolder(std::uint64_t id) override { missed.push_back(id); }
+
+  std::vector<std::uint64_t> missed;
+
+ private:
+  const std::uint64_t trash_;
+  const std::function<void()> work_;
+};
+
+TEST_F(ScannerTest, AFolderThatComesIntoWhatWasReadBeforeIsToldOf) {
+  std::filesystem::create_directories(layout.trashFiles() + "/folder/inner");
+  scan();
+  const auto folder = store->itemAtPath(layout.trashFiles() + "/folder");
+  const auto trash = store->itemByID(kTrashID);
+  ASSERT_TRUE(folder && trash);
+  const auto visitor = std::make_shared<MovingVisitor>(trash->inode, [&] {
+    ASSERT_EQ(::rename((layout.trashFiles() + "/folder").c_str(), at("back").c_str()), 0);
+    // As whoever observes the root, and finds nothing new in what is known.
+    EXPECT_TRUE(scanner->scanLocation(at("back")));
+  });
+  Scanner scanning(store, visitor);
+  ASSERT_EQ(scanning.scanAll(), nullptr);
+  EXPECT_EQ(id("back"), folder->id);
+  EXPECT_EQ(visitor->missed, std::vector<std::uint64_t>{folder->id});
 }
 
 TEST_F(ScannerTest, LeavesAloneWhatItMayNotRead) {

@@ -501,7 +501,12 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
     }
     for (const std::uint64_t id : forgotten_) {
       const auto now = findContent(connection, id);
-      if (now && now->zone == share_.zone) removeContent(connection, id);
+      if (!now || now->zone != share_.zone) continue;
+      removeContent(connection, id);
+      // It may have been put back, and not been saved since it seemed to have a record.
+      const std::int64_t when = core_.now();
+      if (findByID(connection, id))
+        addJob(connection, id, JobKind::Upload, now->account, when, when);
     }
     if (hasFolders_) makeWaitingRecordsDue(connection, share_.root);
     for (const SharedItem& item : items) {

@@ -415,6 +415,12 @@ class UploadGroup {
     if (account) addJob(connection, job.item, JobKind::Upload, *account, core_.now(), core_.now());
   }
 
+  /// Whether the record that made a save needless is gone, as was found out meanwhile: others have
+  /// removed it, and what they removed is back.
+  static bool isForgotten(const Upload& upload, const std::optional<ContentRow>& now) {
+    return !now && upload.kind == Upload::Kind::Nothing;
+  }
+
   /// Whether what others have saved since was taken over before this was confirmed: that counts.
   static bool isOvertaken(const Upload& upload, const std::optional<ContentRow>& now) {
     const auto& before = upload.subject.content;
@@ -496,8 +502,10 @@ class UploadGroup {
     ContentRow confirmed = upload.confirmed;
     const std::int64_t now = core_.now();
     const auto known = findContent(connection, confirmed.id);
-    if (isOvertaken(upload, known)) {
-      addJob(connection, confirmed.id, JobKind::Upload, known->account, now, now);
+    if (isForgotten(upload, known) || isOvertaken(upload, known)) {
+      const std::int64_t account = known ? known->account : confirmed.account;
+      addJob(connection, confirmed.id, JobKind::Upload, account, now, now);
+      core_.queue->noteJobs(JobKind::Upload);
       return true;
     }
     if (known) confirmed.isPinned = known->isPinned;

@@ -138,8 +138,7 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
 void SharePull::locate(Connection& connection, SharedItem& item) const {
   item.row = findByID(connection, item.id);
   item.content = findContent(connection, item.id);
-  item.isBeingRemoved =
-      !item.row && item.content && findJob(connection, item.id, JobKind::Upload).has_value();
+  item.isBeingRemoved = !item.row && findJob(connection, item.id, JobKind::Upload).has_value();
   const auto chain = item.row ? findChain(connection, item.id) : std::nullopt;
   if (!chain) return;
   item.path = core_.items->physicalPath(*chain);
@@ -182,7 +181,7 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
 bool SharePull::isNew(const SharedItem& item) const {
   if (!item.record || item.row) return false;
   // It went from here, and nobody has changed it since: the store is about to be told.
-  const bool isPending = item.isBeingRemoved && !item.isRefused &&
+  const bool isPending = item.isBeingRemoved && !item.isRefused && item.content &&
                          item.content->zone == share_.zone &&
                          saysTheSame(*item.record, *item.content);
   return !isPending;

@@ -57,6 +57,7 @@ class SharePull {
   void applyPlace(SharedItem& item);
   NSErrorRef removeRecordElsewhere(SharedItem& item) const;
   void applyRemoval(SharedItem& item);
+  void forget(const SharedItem& item);
   void moveToTrash(const SharedItem& item, const FileStamp& seen);
   void removeFolder(SharedItem& item);
   void moveOut(SharedItem& item);

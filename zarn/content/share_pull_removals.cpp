@@ -56,12 +56,27 @@ void SharePull::applyRemoval(SharedItem& item) {
     forgotten_.erase(item.id);
     return wait(item, error);
   }
+  forget(item);
   (void)core_.scanner->scanLocation(item.path, nullptr);
   if (!isHeld) return tree_.drop(taken);
   std::string kept;
   error = tree_.keepCopy(taken, folderForCopies(item), lastOf(item.path), kept);
   if (error) return log_error(defaultLog(), "[ERROR] %@ was not saved: %@", taken, error);
   (void)core_.scanner->scanLocation(kept, nullptr);
+}
+
+/// Before anybody looks: whoever finds out that it is gone would have the store told, where it may
+/// have been put back.
+void SharePull::forget(const SharedItem& item) {
+  const NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    const auto content = findContent(connection, item.id);
+    if (content && content->zone == share_.zone) removeContent(connection, item.id);
+    const auto job = findJob(connection, item.id, JobKind::Upload);
+    if (job && !findByID(connection, item.id)) removeJob(connection, *job);
+    return NSErrorRef();
+  });
+  if (!error) forgotten_.erase(item.id);
 }
 
 /// What somebody else has removed from the account's own share can be put back.
@@ -89,6 +104,7 @@ void SharePull::removeFolder(SharedItem& item) {
     forgotten_.erase(item.id);
     return wait(item, error);
   }
+  forget(item);
   noteDirty(item.row->parent, item.path);
 }
 

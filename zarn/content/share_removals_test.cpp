@@ -23,6 +23,14 @@ class ShareRemovalsTest : public TwoDrives {
     ASSERT_EQ(records->modifyRecords({QSUbiquitousRozzelContainerIdentifier, "ann"}, batch, saved),
               nullptr);
   }
+  [[nodiscard]] bool hasUpload(const SharingDrive& drive, std::uint64_t id) const {
+    bool isFound = false;
+    EXPECT_EQ(drive.database->read([&](Connection& connection) {
+      isFound = findJob(connection, id, JobKind::Upload).has_value();
+    }),
+              nullptr);
+    return isFound;
+  }
   [[nodiscard]] std::int64_t attemptsOf(std::uint64_t record) const {
     std::int64_t attempts = -1;
     EXPECT_EQ(bob->database->read([&](Connection& connection) {
@@ -123,6 +131,46 @@ TEST_F(ShareRemovalsTest, WhatIsRemovedBeforeItWasLookedAtIsRemovedForAll) {
     return ann->names("Plans") == expected;
   }));
   EXPECT_EQ(bob->names("Plans"), expected);
+}
+
+TEST_F(ShareRemovalsTest, WhatIsPutBackWhileItsRemovalIsTakenOverStays) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  const std::uint64_t id = ann->id("Plans/a.txt");
+  const std::string away = ann->layout.home() + "/away";
+  ASSERT_EQ(::rename(ann->at("Plans/a.txt").c_str(), away.c_str()), 0);
+  ann->settle();
+  const auto pass = [this] {
+    (void)bob->shares().refresh(std::string(NSFileProviderRootContainerItemIdentifier));
+  };
+  {
+    const Pause fetched = pauseAt("zarn.pull.fetched");
+    std::thread following(pass);
+    EXPECT_TRUE(fetched.waitUntilReached());
+    EXPECT_EQ(::rename(away.c_str(), ann->at("Plans/a.txt").c_str()), 0);
+    ann->settle();
+    const Pause removing = pauseAt("zarn.upload.committed");
+    const Pause placed = pauseAt("zarn.pull.placed");
+    fetched.end();
+    EXPECT_TRUE(placed.waitUntilReached());
+    // A removal that was begun ends after the item has come again.
+    EXPECT_TRUE(waitUntil([&] { return removing.isReached() || !hasUpload(*bob, id); }));
+    placed.end();
+    following.join();
+    FaultPoint::disarmAll();
+    const Pause known = pauseAt("zarn.pull.stored");
+    std::thread followingOn(pass);
+    EXPECT_TRUE(known.waitUntilReached());
+    removing.end();
+    EXPECT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
+    known.end();
+    followingOn.join();
+  }
+  FaultPoint::disarmAll();
+  followBoth();
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
 }
 
 }  // namespace

@@ -42,7 +42,7 @@ struct SharedItem {
   bool isRefused = false;       ///< what was done here was refused: the record counts
   bool isFresh = false;         ///< its file has what the record says
   FileStamp stamp = {};         ///< of that file when it was looked at or made
-  bool isBeingRemoved = false;  ///< it went from here, which the store does not know yet
+  bool isBeingRemoved = false;  ///< it went from here, about which the store is to be told
 
   [[nodiscard]] bool isRoot(const ShareRow& share) const { return id == share.root; }
   /// Whether the record is known here already.

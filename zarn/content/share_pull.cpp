@@ -169,6 +169,8 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
   if (!error) error = addNew(items);
   if (!error) applyAll(items);
   if (!error && pullPlaced.hit()) error = NSError::errorWithErrno(EIO);
+  // What counts as done and is not there, somebody has removed.
+  if (!error && !placed_.empty()) error = tree_.sync();
   if (!error) error = storeContents(items, token, Step::Done);
   for (const auto& [id, path] : staged_) tree_.drop(path);
   NSErrorRef failure = scan();
@@ -326,7 +328,7 @@ void SharePull::placeNew(SharedItem& item, const std::string& folder) {
     rootPath_ = item.path;
     return;
   }
-  placed_[item.id] = item.path;
+  placed_[item.id] = {.path = item.path, .folder = item.record->parent};
   if (!newFolders_.contains(item.record->parent)) noteDirty(item.record->parent, item.path);
 }
 
@@ -504,8 +506,9 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
     }
     if (hasFolders_) makeWaitingRecordsDue(connection, share_.root);
     for (const SharedItem& item : items) {
-      if (step == Step::Prepared) break;  // should we end now, they are still to be taken over
-      if (busy_.contains(item.id)) {
+      if (step == Step::Prepared) {  // should we end now, they are still to be taken over
+        keepWaitingRecord(connection, share_.root, item.id);
+      } else if (busy_.contains(item.id)) {
         addWaitingRecord(connection, share_.root, item.id);
       } else if (waiting_.contains(item.id)) {
         postponeWaitingRecord(connection, share_.root, item.id, core_.now());
@@ -539,7 +542,7 @@ NSErrorRef SharePull::scan() {
   if (folders.empty()) return nullptr;
   std::vector<DirtyFolder> notFound;
   NSErrorRef error = core_.scanner->scanDirty(folders, notFound);
-  if (!notFound.empty()) placed_.clear();  // what is not there may be on its way
+  forgetPlacedBelow(notFound);
   // Others may look at the same time, and leave it to each other.
   const std::string root = std::exchange(rootPath_, {});
   if (!error && !root.empty() && !core_.items->itemByID(share_.root))

@@ -173,5 +173,25 @@ TEST_F(ShareRemovalsTest, WhatIsPutBackWhileItsRemovalIsTakenOverStays) {
   EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
 }
 
+TEST_F(ShareRemovalsTest, AFolderThatMovesHidesNothingThatIsRemovedElsewhere) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->write("Plans/Old/new.txt", "stays");
+  ann->settle();
+  meanwhile("zarn.pull.placed", [&] {
+    bob->remove("Plans/new.txt");
+    bob->rename("Plans/Old", "Plans/Older");
+  });
+  const Names expected{"Older", "a.txt"};
+  EXPECT_TRUE(waitUntil([&] {
+    bob->settle();
+    followBoth();
+    return ann->names("Plans") == expected;
+  }));
+  EXPECT_EQ(bob->names("Plans"), expected);
+  EXPECT_EQ(ann->names("Plans/Older"), (Names{"b.txt", "new.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/Older/new.txt"), "stays");
+}
+
 }  // namespace
 }  // namespace yomber

@@ -1,7 +1,9 @@
 #include <fcntl.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <functional>
+#include <thread>
 
 #include "zarn/content/test_sharing.h"
 
@@ -16,7 +18,19 @@ class SharesKillTest : public TwoDrives, public testing::WithParamInterface<cons
   /// Runs `work` with the drive of that account in a child that ends at the fault point. Threads
   /// are not carried across a fork: everything of ours is closed before.
   void dieDuring(const std::string& account, const std::string& point,
-                 const std::function<void(SharingDrive&)>& work) {
+                 const std::function<void(SharingDrive&)>& work,
+                 const std::function<void()>& beforeRestart = {}) {
+    die(
+        account,
+        [&](SharingDrive& drive) {
+          if (FaultPoint::arm(point + "=abort")) _exit(1);
+          work(drive);
+        },
+        beforeRestart);
+  }
+  /// The same where the work sees to the end itself.
+  void die(const std::string& account, const std::function<void(SharingDrive&)>& work,
+           const std::function<void()>& beforeRestart = {}) {
     const std::string annsHome = ann->layout.home();
     const std::string bobsHome = bob->layout.home();
     ann.reset();
@@ -26,13 +40,13 @@ class SharesKillTest : public TwoDrives, public testing::WithParamInterface<cons
     if (child == 0) {
       SharingDrive drive(account == "ann" ? annsHome : bobsHome,
                          std::make_shared<EmbeddedEngine>(storePath), account);
-      if (FaultPoint::arm(point + "=abort")) _exit(1);
       work(drive);
       _exit(0);
     }
     int ending = 0;
     ASSERT_EQ(waitpid(child, &ending, 0), child);
-    ASSERT_TRUE(WIFSIGNALED(ending)) << point << " was not reached";
+    ASSERT_TRUE(WIFSIGNALED(ending)) << "it has not come to that";
+    if (beforeRestart) beforeRestart();
     records = std::make_shared<EmbeddedEngine>(storePath);
     ann = std::make_unique<SharingDrive>(annsHome, records, "ann");
     bob = std::make_unique<SharingDrive>(bobsHome, records, "bob");
@@ -83,6 +97,36 @@ TEST_P(SharePullKillTest, WhatIsAcceptedAppearsWithTheNextStart) {
 INSTANTIATE_TEST_SUITE_P(AtEachPoint, SharePullKillTest,
                          testing::Values("zarn.share.accepted", "zarn.pull.fetched",
                                          "zarn.pull.placed", "zarn.pull.stored"));
+
+class ShareUnseenKillTest : public SharesKillTest {};
+
+TEST_F(ShareUnseenKillTest, WhatWasRemovedBeforeItWasLookedAtIsRemovedForAll) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->makeFolder("Plans/Folder");
+  ann->write("Plans/Folder/in.txt", "in it");
+  ann->write("Plans/stays.txt", "stays");
+  ann->settle();
+  const std::string gate = storePath + "-placed";
+  die("bob", [&](SharingDrive& drive) {
+    const Pause placed("zarn.pull.placed", gate);
+    std::thread following([&] { (void)drive.follow(); });
+    if (!placed.waitUntilReached()) _exit(1);
+    drive.remove("Plans/new.txt");
+    drive.remove("Plans/Folder");
+    if (FaultPoint::arm("zarn.pull.stored=abort")) _exit(1);
+    placed.end();
+    following.join();
+  });
+  const Names expected{"Old", "a.txt", "stays.txt"};
+  EXPECT_TRUE(waitUntil([&] {
+    EXPECT_EQ(bob->follow(), nullptr);
+    EXPECT_EQ(ann->follow(), nullptr);
+    return ann->names("Plans") == expected;
+  }));
+  EXPECT_EQ(bob->names("Plans"), expected);
+  EXPECT_EQ(bob->readWhole("Plans/stays.txt"), "stays");
+}
 
 class ShareConflictKillTest : public SharesKillTest {};
 

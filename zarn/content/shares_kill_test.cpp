@@ -2,6 +2,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <csignal>
 #include <functional>
 #include <thread>
 
@@ -170,7 +171,33 @@ TEST_P(ShareLeaveKillTest, WhatIsSharedNoLongerGoesWithTheNextStart) {
 }
 
 INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareLeaveKillTest,
-                         testing::Values("zarn.leave.noted", "zarn.leave.kept", "zarn.leave.gone"));
+                         testing::Values("zarn.leave.noted", "zarn.leave.kept",
+                                         "zarn.leave.removing", "zarn.leave.gone"));
+
+TEST_F(ShareLeaveKillTest, WhatWasPutIntoAnOpenFolderBeforeTheEndIsThereAfterTheNextStart) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  const std::string gate = storePath + "-removing";
+  die("bob", [&](SharingDrive& drive) {
+    const FileDescriptor folder(
+        open(drive.at("Plans/Old").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    const Pause removing("zarn.leave.removing", gate);
+    std::thread following([&] { (void)drive.follow(); });
+    if (!removing.waitUntilReached()) _exit(1);
+    const FileDescriptor file(
+        openat(folder.get(), "late.txt", O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+    if (pwrite(file.get(), "late", 4, 0) != 4) _exit(1);
+    (void)raise(SIGKILL);
+  });
+  bool isFound = false;
+  for (const std::string& name : bob->names()) {
+    const bool isFolder = std::filesystem::is_directory(bob->at(name));
+    for (const std::string& each : isFolder ? bob->names(name) : Names{""})
+      isFound = isFound || bob->read(isFolder ? name + "/" + each : name) == "late";
+  }
+  EXPECT_TRUE(isFound) << "what Bob wrote is lost";
+  EXPECT_FALSE(bob->exists("Plans"));
+}
 
 TEST_P(ShareEndKillTest, TheOwnersRecordsComeBackWithTheNextStart) {
   shareFolder(viewer("bob"));

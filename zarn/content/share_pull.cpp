@@ -138,6 +138,8 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
 void SharePull::locate(Connection& connection, SharedItem& item) const {
   item.row = findByID(connection, item.id);
   item.content = findContent(connection, item.id);
+  if (item.record && !item.record->isFolder)
+    item.saving = findSaving(connection, item.id, item.record->content);
   item.isBeingRemoved = !item.row && findJob(connection, item.id, JobKind::Upload).has_value();
   const auto chain = item.row ? findChain(connection, item.id) : std::nullopt;
   if (!chain) return;
@@ -185,7 +187,7 @@ bool SharePull::isNew(const SharedItem& item) const {
   // It went from here, and nobody has changed it since: the store is about to be told.
   const bool isPending = item.isBeingRemoved && !item.isRefused && item.content &&
                          item.content->zone == share_.zone &&
-                         saysTheSame(*item.record, *item.content);
+                         (item.isOwnSave() || saysTheSame(*item.record, *item.content));
   return !isPending;
 }
 
@@ -392,6 +394,11 @@ void SharePull::applyContent(SharedItem& item) {
   const FileStamp before = stampAt(item.path);
   if (before == FileStamp{})  // it has just gone elsewhere
     return wait(item, NSError::errorWithErrno(ENOENT, item.path));
+  if (item.isOwnSave()) {  // what is in the file since is newer
+    item.isFresh = true;
+    item.stamp = *item.saving;
+    return;
+  }
   // They came to the same, or it came here before it was noted.
   item.isFresh = !isUnsaved(item.path, wanted, &item.stamp);
   if (item.isFresh) return;
@@ -495,6 +502,7 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
       const auto now = findContent(connection, content.id);
       content.isPinned = now && now->isPinned;
       storeContent(connection, content);
+      removeSavings(connection, content.id);
       if (findJob(connection, content.id, JobKind::Upload) || findByID(connection, content.id)) {
         const std::int64_t when = core_.now();
         addJob(connection, content.id, JobKind::Upload, content.account, when, when);

@@ -156,6 +156,32 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareConflictKillTest,
                          testing::Values("zarn.pull.displaced", "zarn.pull.placed",
                                          "zarn.pull.stored"));
 
+class ShareUploadKillTest : public SharesKillTest {};
+
+TEST_P(ShareUploadKillTest, WhatIsWrittenAfterASaveThatNobodyHeardOfIsTheDocument) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  const std::string name = GetParam();
+  const std::string path = bob->at("Plans/" + name);
+  dieDuring(
+      "bob", "zarn.upload.committed",
+      [&](SharingDrive& drive) {
+        drive.write("Plans/" + name, "second");
+        drive.settle();
+      },
+      [&] { std::ofstream(path, std::ios::binary) << "third, by bob"; });
+  EXPECT_TRUE(waitUntil([&] {
+    return bob->follow() == nullptr && ann->follow() == nullptr && ann->exists("Plans/" + name) &&
+           ann->readWhole("Plans/" + name) == "third, by bob";
+  }));
+  EXPECT_EQ(bob->read("Plans/" + name), "third, by bob");
+  EXPECT_EQ(ann->names("Plans"), bob->names("Plans"));
+  for (const std::string& each : bob->names("Plans"))
+    EXPECT_EQ(each.find("kept copy"), std::string::npos) << each;
+}
+
+INSTANTIATE_TEST_SUITE_P(OfOldAndNew, ShareUploadKillTest, testing::Values("a.txt", "new.txt"));
+
 TEST_P(ShareLeaveKillTest, WhatIsSharedNoLongerGoesWithTheNextStart) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);

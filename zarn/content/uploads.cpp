@@ -66,7 +66,8 @@ class UploadGroup {
   }
 
   void finish() {
-    NSErrorRef error = syncDocuments();
+    NSErrorRef error = noteSaving();
+    if (!error) error = syncDocuments();
     if (!error) error = commitAssets();
     if (!error) makeThumbnails();
     if (!error) error = saveRecords();
@@ -200,6 +201,22 @@ class UploadGroup {
     if (unsynced_.size() >= kFewFiles) file = FileDescriptor();
     unsynced_.push_back(std::move(file));
     return nullptr;
+  }
+
+  /// Where others save as well, whose save it was must be known however this process ends.
+  NSErrorRef noteSaving() {
+    std::vector<const ContentRow*> saving;
+    for (const Upload& upload : uploads_) {
+      const ContentRow& confirmed = upload.confirmed;
+      if (upload.kind == Upload::Kind::Save && confirmed.content && isSharedZone(confirmed.zone))
+        saving.push_back(&confirmed);
+    }
+    if (saving.empty()) return nullptr;
+    return core_.database().write([&](WriteTransaction& transaction) {
+      for (const ContentRow* const each : saving)
+        storeSaving(transaction.connection(), each->id, *each->content, each->stamp);
+      return NSErrorRef();
+    });
   }
 
   /// What this disk could still forget, its document and the row with its id, must not be told to
@@ -391,6 +408,7 @@ class UploadGroup {
     }
     core_.finished.fetch_add(1);
     removeJob(connection, job);
+    removeSavings(connection, job.item);
     if (!upload.owner.empty())
       return leaveTo(connection, upload, accountKey(connection, upload.owner));
     if (upload.recordOwner) return leaveTo(connection, upload, *upload.recordOwner);

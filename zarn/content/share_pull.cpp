@@ -10,6 +10,7 @@
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
+#include "zarn/content/new_identity.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"
 
@@ -167,6 +168,7 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
   dirty_.clear();
   inside_.clear();
   if (NSErrorRef error = read(items)) return error;
+  makeRoom(items, token == nullptr ? Age::OfNow : Age::OfPage);
   NSErrorRef error = callOffRemovals(items);
   if (!error) error = addNew(items);
   if (!error) applyAll(items);
@@ -181,6 +183,36 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
 }
 
 // --- New ones.
+
+/// What was moved out of the share before, and is the account's own since.
+bool SharePull::hasIDOfAnother(const SharedItem& item) const {
+  const bool isOfZone = item.content && item.content->zone == share_.zone;
+  if (!item.record || !item.row || item.isInside || isOfZone || item.isRoot(share_)) return false;
+  if (share_.isOwn() && item.row->isTrashed()) return false;  // it comes back from there
+  bool isShare = true;
+  (void)core_.database().read(
+      [&](Connection& connection) { isShare = findShare(connection, item.id).has_value(); });
+  return !isShare && !item.row->isContainerFolder();
+}
+
+/// Records that come to have the id of an item of the account's own are new here, and that gets
+/// another id.
+void SharePull::makeRoom(Items& items, Age age) {
+  for (SharedItem& item : items) {
+    if (!hasIDOfAnother(item)) continue;
+    // It may have been on its way out when the page was made.
+    NSErrorRef error =
+        age == Age::OfPage ? NSError::errorWithErrno(EAGAIN) : removeRecordElsewhere(item);
+    if (!error) error = giveNewIdentity(core_, item.id);
+    if (error) {
+      wait(item, error);
+      continue;
+    }
+    item.row.reset();
+    item.content.reset();
+    item.path.clear();
+  }
+}
 
 bool SharePull::isNew(const SharedItem& item) const {
   if (!item.record || item.row) return false;
@@ -372,7 +404,8 @@ void SharePull::applyKnown(SharedItem& item) {
 /// What others had removed went to the owner's trash, and with it to a zone of his own.
 NSErrorRef SharePull::removeRecordElsewhere(SharedItem& item) const {
   std::vector<NSErrorRef> refused;
-  const bool isRecorded = item.content && item.content->isRecorded();
+  const bool isRecorded =
+      item.content && item.content->isRecorded() && !item.content->zone.zoneName().empty();
   NSErrorRef error =
       isRecorded ? store_->remove({{item.id, item.content->zone, {}}}, refused) : nullptr;
   if (!error && !refused.empty()) error = refused.front();

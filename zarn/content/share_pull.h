@@ -40,6 +40,11 @@ class SharePull {
   NSErrorRef read(Items& items) const;
   void locate(Connection& connection, SharedItem& item) const;
 
+  /// Whether the items are as the store has them now, or as they were when a page was made.
+  enum class Age : bool { OfPage, OfNow };
+  void makeRoom(Items& items, Age age);
+  [[nodiscard]] bool hasIDOfAnother(const SharedItem& item) const;
+
   // New ones.
   NSErrorRef callOffRemovals(const Items& items);
   NSErrorRef addNew(Items& items);

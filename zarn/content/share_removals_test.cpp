@@ -1,8 +1,11 @@
 #include <sys/stat.h>
+#include <sys/xattr.h>
 
+#include "platform/ostrell/constants.h"
 #include "platform/rozzel/record.h"
 #include "zarn/content/share_rows.h"
 #include "zarn/content/test_sharing.h"
+#include "zarn/item_attributes.h"
 
 namespace yomber {
 namespace {
@@ -171,6 +174,46 @@ TEST_F(ShareRemovalsTest, WhatIsPutBackWhileItsRemovalIsTakenOverStays) {
   EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
   EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt"}));
   EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+}
+
+TEST_F(ShareRemovalsTest, WhatIsPutBackComesAlsoToWhoHasMadeItHisOwn) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ASSERT_EQ(setxattr(bob->at("Plans/a.txt").c_str(), kTagsAttribute, "blue", 4, 0), 0);
+  const std::vector<std::uint64_t> ids{ann->id("Plans/a.txt"), ann->id("Plans/Old"),
+                                       ann->id("Plans/Old/b.txt")};
+  bob->rename("Plans/a.txt", "mine.txt");
+  bob->rename("Plans/Old", "Mine");
+  bob->settle();
+  // As the trash, from where the owner puts it back.
+  for (const char* name : {"a.txt", "Old"})
+    ASSERT_EQ(::rename(ann->at("Plans/" + std::string(name)).c_str(),
+                       (ann->layout.home() + "/" + name).c_str()),
+              0);
+  ann->settle();
+  followBoth();
+  for (const char* name : {"a.txt", "Old"})
+    ASSERT_EQ(::rename((ann->layout.home() + "/" + name).c_str(),
+                       ann->at("Plans/" + std::string(name)).c_str()),
+              0);
+  ann->settle();
+  followBoth();
+  bob->settle();
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Plans/Old/b.txt"), "short");
+  EXPECT_EQ((std::vector{bob->id("Plans/a.txt"), bob->id("Plans/Old"), bob->id("Plans/Old/b.txt")}),
+            ids);
+  EXPECT_EQ(bob->names(), (Names{"Mine", "Plans", "mine.txt"}));
+  EXPECT_EQ(bob->readWhole("mine.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Mine/b.txt"), "short");
+  EXPECT_EQ(readItemAttributes(bob->at("mine.txt").c_str()).extra.tags, Names{"blue"});
+  for (const char* path : {"mine.txt", "Mine/b.txt"}) {
+    EXPECT_EQ(zonesWith("bob", bob->id(path)), Names{QSUbiquitousDefaultContainerID}) << path;
+    EXPECT_EQ(readItemAttributes(bob->at(path).c_str()).id, bob->id(path));
+  }
+  for (const std::uint64_t id : ids) EXPECT_EQ(zonesWith("bob", id), Names{}) << id;
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
 }
 
 TEST_F(ShareRemovalsTest, AFolderThatMovesHidesNothingThatIsRemovedElsewhere) {

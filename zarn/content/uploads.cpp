@@ -38,6 +38,11 @@ bool isContentGone(const NSErrorRef& error) {
          rz_isError(error->underlyingError(), RZErrorAssetDamaged);
 }
 
+/// Whether the store has a record of it, rather than its content only.
+bool hasRecord(const std::optional<ContentRow>& content) {
+  return content && content->isRecorded() && !content->zone.zoneName().empty();
+}
+
 /// One document on its way.
 struct Upload {
   JobSubject subject;
@@ -84,8 +89,7 @@ class UploadGroup {
     upload.confirmed.account = subject.job.account;
     if (subject.content) upload.confirmed = *subject.content;
     if (!subject.row) {
-      upload.kind = subject.content && subject.content->isRecorded() ? Upload::Kind::Remove
-                                                                     : Upload::Kind::Nothing;
+      upload.kind = hasRecord(subject.content) ? Upload::Kind::Remove : Upload::Kind::Nothing;
       return;
     }
     if (subject.row->isFolder()) return prepareFolder(upload);
@@ -121,7 +125,7 @@ class UploadGroup {
   static bool isInStore(Upload& upload) {
     const auto& before = upload.subject.content;
     ContentRow& after = upload.confirmed;
-    const bool isElsewhere = before && before->isRecorded() && before->zone != upload.subject.zone;
+    const bool isElsewhere = hasRecord(before) && before->zone != upload.subject.zone;
     if (isElsewhere) upload.previousZone = before->zone;
     after.zone = upload.subject.zone;
     after.parent = upload.subject.row->parent;

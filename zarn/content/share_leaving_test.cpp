@@ -173,6 +173,19 @@ TEST_F(ShareLeavingTest, WhatWasMovedOutBeforeIsTheParticipantsOwn) {
   EXPECT_EQ(bob->read("mine.txt"), kLong);
 }
 
+TEST_F(ShareLeavingTest, WhatWasMovedOutWithoutContentIsSavedAsTheParticipantsOwn) {
+  shareFolder(editor("bob"));
+  ASSERT_TRUE(bob->isFault("Plans/a.txt"));
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  bob->rename("Plans/a.txt", "mine.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(refresh(*bob), nullptr);
+  FaultPoint::disarmAll();
+  EXPECT_TRUE(waitUntil([&] { return hasOwnRecord("bob", bob->id("mine.txt")); }));
+  EXPECT_EQ(bob->readWhole("mine.txt"), kLong);
+}
+
 TEST_F(ShareLeavingTest, WhatWasMovedOutAndHasNoContentAnywhereIsGivenUpWithAReason) {
   shareFolder(editor("bob"));
   ASSERT_TRUE(bob->isFault("Plans/a.txt"));

@@ -533,6 +533,9 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
     Connection& connection = transaction.connection();
     for (ContentRow& content : contents) {
       const auto now = findContent(connection, content.id);
+      // It was known before it was put here: somebody has removed it, and the store was told.
+      const bool isGone = !now && content.content && placed_.contains(content.id);
+      if (isGone) continue;
       content.isPinned = now && now->isPinned;
       storeContent(connection, content);
       removeSavings(connection, content.id);

@@ -176,6 +176,26 @@ TEST_F(ShareRemovalsTest, WhatIsPutBackWhileItsRemovalIsTakenOverStays) {
   EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
 }
 
+TEST_F(ShareRemovalsTest, WhatIsRemovedAndPutBackBeforeItsPageIsDoneStays) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->settle();
+  const std::string away = ann->layout.home() + "/away";
+  meanwhile("zarn.pull.placed", [&] {
+    bob->settle();
+    bob->remove("Plans/new.txt");
+    bob->settle();
+    ASSERT_EQ(::rename(ann->at("Plans/new.txt").c_str(), away.c_str()), 0);
+    ann->settle();
+    ASSERT_EQ(::rename(away.c_str(), ann->at("Plans/new.txt").c_str()), 0);
+    ann->settle();
+  });
+  followBoth();
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt", "new.txt"}));
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt", "new.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/new.txt"), kLong);
+}
+
 TEST_F(ShareRemovalsTest, WhatIsPutBackComesAlsoToWhoHasMadeItHisOwn) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);

@@ -115,6 +115,7 @@ void createTables(Connection& connection) {
   connection.execute(kThumbnailTable);
   connection.execute(kShareTables);
   connection.execute(kShareWaitingTimes);
+  connection.execute(kSavingTable);
   connection.execute(("PRAGMA application_id=" + std::to_string(kApplicationID)).c_str());
   connection.execute(("PRAGMA user_version=" + std::to_string(kSchemaVersion)).c_str());
   setMetaInteger(connection, meta::kIdentity, static_cast<std::int64_t>(randomID()));

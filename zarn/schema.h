@@ -8,7 +8,7 @@
 namespace yomber {
 
 /// The version of the tables that this program reads and writes.
-inline constexpr std::int64_t kSchemaVersion = 6;
+inline constexpr std::int64_t kSchemaVersion = 7;
 
 /// Thrown by `prepareSchema` for a file that a newer program made.
 struct SchemaTooNew {

@@ -81,6 +81,13 @@ const char* const kShareWaitingTimes = R"sql(
   CREATE INDEX share_waiting_due ON share_waiting(root, due);
 )sql";
 
+// What the store was about to be given as a shared document's content, and of which file; until one
+// of them is known to be there.
+const char* const kSavingTable =
+    "CREATE TABLE saving(id INTEGER NOT NULL, hash BLOB NOT NULL, size INTEGER NOT NULL, "
+    "inode INTEGER NOT NULL, mtime INTEGER NOT NULL, ctime INTEGER NOT NULL, "
+    "PRIMARY KEY(id, hash)) WITHOUT ROWID";
+
 namespace {
 
 /// What turns version n, its place in the table plus one, into the next. Never changed once
@@ -99,6 +106,8 @@ constexpr std::array kMigrations{
     Migration{"shares", [](Connection& connection) { connection.execute(kShareTables); }},
     Migration{"when shared records are asked for again",
               [](Connection& connection) { connection.execute(kShareWaitingTimes); }},
+    Migration{"what is being saved in shares",
+              [](Connection& connection) { connection.execute(kSavingTable); }},
 };
 
 }  // namespace

@@ -12,6 +12,7 @@ extern const char* const kFailedJobsIndex;
 extern const char* const kThumbnailTable;
 extern const char* const kShareTables;
 extern const char* const kShareWaitingTimes;
+extern const char* const kSavingTable;
 
 /// Brings tables of version `from` to version `to`, one version after the other, inside the
 /// caller's transaction. Throws SQLite::Exception.

@@ -222,6 +222,41 @@ void removeContent(Connection& connection, std::uint64_t id) {
   StatementUse statement(connection.prepared("DELETE FROM content WHERE id=?1"));
   statement->bindID(1, id);
   statement->step();
+  removeSavings(connection, id);
+}
+
+void storeSaving(Connection& connection, std::uint64_t id, const RZAsset& content,
+                 const FileStamp& stamp) {
+  StatementUse statement(connection.prepared(
+      "INSERT OR REPLACE INTO saving(id,hash,size,inode,mtime,ctime) VALUES(?1,?2,?3,?4,?5,?6)"));
+  statement->bindID(1, id);
+  statement->bindBytes(2, hashBytes(content));
+  statement->bindID(3, content.size);
+  statement->bindID(4, stamp.inode);
+  statement->bindInteger(5, stamp.mtime);
+  statement->bindInteger(6, stamp.ctime);
+  statement->step();
+}
+
+std::optional<FileStamp> findSaving(Connection& connection, std::uint64_t id,
+                                    const RZAsset& content) {
+  StatementUse statement(
+      connection.prepared("SELECT size,inode,mtime,ctime FROM saving WHERE id=?1 AND hash=?2"));
+  statement->bindID(1, id);
+  statement->bindBytes(2, hashBytes(content));
+  if (!statement->step()) return std::nullopt;
+  FileStamp stamp;
+  stamp.size = statement->id(0);
+  stamp.inode = statement->id(1);
+  stamp.mtime = statement->integer(2);
+  stamp.ctime = statement->integer(3);
+  return stamp;
+}
+
+void removeSavings(Connection& connection, std::uint64_t id) {
+  StatementUse statement(connection.prepared("DELETE FROM saving WHERE id=?1"));
+  statement->bindID(1, id);
+  statement->step();
 }
 
 std::vector<std::uint64_t> findChildIDs(Connection& connection, std::uint64_t folder) {

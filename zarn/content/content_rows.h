@@ -87,7 +87,18 @@ struct ContentRow {
                                                            const std::string& account);
 [[nodiscard]] std::optional<ContentRow> findContent(Connection& connection, std::uint64_t id);
 void storeContent(Connection& connection, const ContentRow& row);
+/// With what was about to be saved.
 void removeContent(Connection& connection, std::uint64_t id);
+
+// Content that the store is about to be given, with the file that has it. Where the process ends
+// before it hears what came of that, the next one knows by it which record is its own.
+
+void storeSaving(Connection& connection, std::uint64_t id, const RZAsset& content,
+                 const FileStamp& stamp);
+[[nodiscard]] std::optional<FileStamp> findSaving(Connection& connection, std::uint64_t id,
+                                                  const RZAsset& content);
+/// What was about to be saved before counts no longer.
+void removeSavings(Connection& connection, std::uint64_t id);
 /// The ids of what is in a folder.
 [[nodiscard]] std::vector<std::uint64_t> findChildIDs(Connection& connection, std::uint64_t folder);
 [[nodiscard]] bool hasPins(Connection& connection);

@@ -100,9 +100,11 @@ NSErrorRef Shares::pass() {
   // What was done while no process ran must not be taken for something else.
   if (open(session) || !core_->scanner->hasScannedAll()) return nullptr;
   if (!isRecovered_) SharedTree(*core_, *session.store).recover();
-  NSErrorRef error = isRecovered_ ? nullptr : askForWaitingAgain(session.account);
+  NSErrorRef error = isRecovered_ ? nullptr : noteRemovalsBeforeStart(session.account);
+  if (!error && !isRecovered_) error = askForWaitingAgain(session.account);
+  if (error) return error;
   isRecovered_ = true;
-  if (!error) error = followZones(session);
+  error = followZones(session);
   if (error) return error;
   const ContentCore::Refused refused = core_->takeRefused();
   for (const bool isForbidden : {false, true}) {
@@ -129,6 +131,16 @@ NSErrorRef Shares::askForWaitingAgain(std::int64_t account) const {
     makeAllWaitingRecordsDue(transaction.connection(), account);
     return NSErrorRef();
   });
+}
+
+NSErrorRef Shares::noteRemovalsBeforeStart(std::int64_t account) const {
+  std::vector<ShareRow> shares;
+  NSErrorRef error = core_->database().read(
+      [&](Connection& connection) { shares = findShares(connection, account); });
+  for (const ShareRow& share : shares) {
+    if (!error) error = yomber::noteRemovalsBeforeStart(*core_, share);
+  }
+  return error;
 }
 
 NSErrorRef Shares::followZones(const Session& session) {

@@ -1,7 +1,5 @@
 #include "zarn/content/share_leaving.h"
 
-#include <sys/stat.h>
-
 #include <cerrno>
 #include <string>
 #include <utility>
@@ -66,22 +64,10 @@ NSErrorRef removeItem(ContentCore& core, const SharedTree& tree, const ShareRow&
   error = remains.keep(*path);
   if (!error) error = checkNobodyStays(core, share, root, folder);
   if (!error && leaveKept.hit()) error = NSError::errorWithErrno(EIO);
+  if (!error) error = remains.remove(*path);
+  if (!error) error = checkNobodyStays(core, share, root, folder);
   if (error) return error;
-  std::string taken;
-  struct stat status{};
-  if (lstat(path->c_str(), &status) == 0) {  // a document may have been what was kept
-    error = tree.takeAway(*path, SharedTree::Kept::No, taken);
-    if (error) return error;
-    error = remains.keep(taken);
-  }
-  if (error) {
-    // As it was: the next time finds the rest.
-    std::string name = path->substr(path->rfind('/') + 1);
-    (void)tree.place(taken, path->substr(0, path->rfind('/')), name);
-    return error;
-  }
   (void)core.scanner->scanLocation(*path, nullptr);
-  tree.drop(taken);
   endDownloads(core, items, noLongerShared(share.title));
   return nullptr;
 }

@@ -104,6 +104,34 @@ TEST_F(ShareLeavingTest, WhatIsWrittenWhileTheItemGoesIsKept) {
   EXPECT_EQ(bob->read("a (kept copy).txt"), "changed late");
 }
 
+TEST_F(ShareLeavingTest, WhatIsPutIntoAnOpenFolderWhileThatIsRemovedIsKept) {
+  shareFolder(editor("bob"));
+  const FileDescriptor folder(
+      open(bob->at("Plans/Old").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  ASSERT_TRUE(folder);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  meanwhile("zarn.leave.removing", [&] {
+    const FileDescriptor file(
+        openat(folder.get(), "late.txt", O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+    ASSERT_TRUE(file);
+    ASSERT_EQ(pwrite(file.get(), "late", 4, 0), 4);
+  });
+  EXPECT_EQ(bob->names(), Names{"Plans (kept copy)"});
+  EXPECT_EQ(bob->names("Plans (kept copy)"), Names{"late.txt"});
+  EXPECT_EQ(bob->read("Plans (kept copy)/late.txt"), "late");
+}
+
+TEST_F(ShareLeavingTest, AFolderThatAnEarlierProcessTookAwayComesBackWithWhatIsInIt) {
+  shareFolder(editor("bob"));
+  const std::string taken = bob->layout.privateArea() + "/shares/taken-1";
+  ASSERT_TRUE(std::filesystem::create_directories(taken + "/Old"));
+  std::ofstream(taken + "/Old/late.txt") << "late";
+  bob->restart();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->names(), (Names{"Kept folder", "Plans"}));
+  EXPECT_EQ(bob->read("Kept folder/Old/late.txt"), "late");
+}
+
 TEST_F(ShareLeavingTest, WhatIsWrittenLaterIntoADocumentThatWasOpenIsKept) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
@@ -143,6 +171,19 @@ TEST_F(ShareLeavingTest, WhatWasMovedOutBeforeIsTheParticipantsOwn) {
   EXPECT_TRUE(waitUntil([&] { return hasOwnRecord("bob", bob->id("mine.txt")); }));
   EXPECT_EQ(bob->names(), Names{"mine.txt"});
   EXPECT_EQ(bob->read("mine.txt"), kLong);
+}
+
+TEST_F(ShareLeavingTest, WhatWasMovedOutWithoutContentIsSavedAsTheParticipantsOwn) {
+  shareFolder(editor("bob"));
+  ASSERT_TRUE(bob->isFault("Plans/a.txt"));
+  ASSERT_EQ(FaultPoint::arm("zarn.upload.read=error"), nullptr);
+  bob->rename("Plans/a.txt", "mine.txt");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  ASSERT_EQ(refresh(*bob), nullptr);
+  FaultPoint::disarmAll();
+  EXPECT_TRUE(waitUntil([&] { return hasOwnRecord("bob", bob->id("mine.txt")); }));
+  EXPECT_EQ(bob->readWhole("mine.txt"), kLong);
 }
 
 TEST_F(ShareLeavingTest, WhatWasMovedOutAndHasNoContentAnywhereIsGivenUpWithAReason) {

@@ -10,6 +10,7 @@
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
+#include "zarn/content/new_identity.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"
 
@@ -138,8 +139,9 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
 void SharePull::locate(Connection& connection, SharedItem& item) const {
   item.row = findByID(connection, item.id);
   item.content = findContent(connection, item.id);
-  item.isBeingRemoved =
-      !item.row && item.content && findJob(connection, item.id, JobKind::Upload).has_value();
+  if (item.record && !item.record->isFolder)
+    item.saving = findSaving(connection, item.id, item.record->content);
+  item.isBeingRemoved = !item.row && findJob(connection, item.id, JobKind::Upload).has_value();
   const auto chain = item.row ? findChain(connection, item.id) : std::nullopt;
   if (!chain) return;
   item.path = core_.items->physicalPath(*chain);
@@ -166,10 +168,13 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
   dirty_.clear();
   inside_.clear();
   if (NSErrorRef error = read(items)) return error;
+  makeRoom(items, token == nullptr ? Age::OfNow : Age::OfPage);
   NSErrorRef error = callOffRemovals(items);
   if (!error) error = addNew(items);
   if (!error) applyAll(items);
   if (!error && pullPlaced.hit()) error = NSError::errorWithErrno(EIO);
+  // What counts as done and is not there, somebody has removed.
+  if (!error && !placed_.empty()) error = tree_.sync();
   if (!error) error = storeContents(items, token, Step::Done);
   for (const auto& [id, path] : staged_) tree_.drop(path);
   NSErrorRef failure = scan();
@@ -179,12 +184,42 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
 
 // --- New ones.
 
+/// What was moved out of the share before, and is the account's own since.
+bool SharePull::hasIDOfAnother(const SharedItem& item) const {
+  const bool isOfZone = item.content && item.content->zone == share_.zone;
+  if (!item.record || !item.row || item.isInside || isOfZone || item.isRoot(share_)) return false;
+  if (share_.isOwn() && item.row->isTrashed()) return false;  // it comes back from there
+  bool isShare = true;
+  (void)core_.database().read(
+      [&](Connection& connection) { isShare = findShare(connection, item.id).has_value(); });
+  return !isShare && !item.row->isContainerFolder();
+}
+
+/// Records that come to have the id of an item of the account's own are new here, and that gets
+/// another id.
+void SharePull::makeRoom(Items& items, Age age) {
+  for (SharedItem& item : items) {
+    if (!hasIDOfAnother(item)) continue;
+    // It may have been on its way out when the page was made.
+    NSErrorRef error =
+        age == Age::OfPage ? NSError::errorWithErrno(EAGAIN) : removeRecordElsewhere(item);
+    if (!error) error = giveNewIdentity(core_, item.id);
+    if (error) {
+      wait(item, error);
+      continue;
+    }
+    item.row.reset();
+    item.content.reset();
+    item.path.clear();
+  }
+}
+
 bool SharePull::isNew(const SharedItem& item) const {
   if (!item.record || item.row) return false;
   // It went from here, and nobody has changed it since: the store is about to be told.
-  const bool isPending = item.isBeingRemoved && !item.isRefused &&
+  const bool isPending = item.isBeingRemoved && !item.isRefused && item.content &&
                          item.content->zone == share_.zone &&
-                         saysTheSame(*item.record, *item.content);
+                         (item.isOwnSave() || saysTheSame(*item.record, *item.content));
   return !isPending;
 }
 
@@ -327,7 +362,7 @@ void SharePull::placeNew(SharedItem& item, const std::string& folder) {
     rootPath_ = item.path;
     return;
   }
-  placed_[item.id] = item.path;
+  placed_[item.id] = {.path = item.path, .folder = item.record->parent};
   if (!newFolders_.contains(item.record->parent)) noteDirty(item.record->parent, item.path);
 }
 
@@ -369,7 +404,8 @@ void SharePull::applyKnown(SharedItem& item) {
 /// What others had removed went to the owner's trash, and with it to a zone of his own.
 NSErrorRef SharePull::removeRecordElsewhere(SharedItem& item) const {
   std::vector<NSErrorRef> refused;
-  const bool isRecorded = item.content && item.content->isRecorded();
+  const bool isRecorded =
+      item.content && item.content->isRecorded() && !item.content->zone.zoneName().empty();
   NSErrorRef error =
       isRecorded ? store_->remove({{item.id, item.content->zone, {}}}, refused) : nullptr;
   if (!error && !refused.empty()) error = refused.front();
@@ -391,6 +427,11 @@ void SharePull::applyContent(SharedItem& item) {
   const FileStamp before = stampAt(item.path);
   if (before == FileStamp{})  // it has just gone elsewhere
     return wait(item, NSError::errorWithErrno(ENOENT, item.path));
+  if (item.isOwnSave()) {  // what is in the file since is newer
+    item.isFresh = true;
+    item.stamp = *item.saving;
+    return;
+  }
   // They came to the same, or it came here before it was noted.
   item.isFresh = !isUnsaved(item.path, wanted, &item.stamp);
   if (item.isFresh) return;
@@ -492,8 +533,12 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
     Connection& connection = transaction.connection();
     for (ContentRow& content : contents) {
       const auto now = findContent(connection, content.id);
+      // It was known before it was put here: somebody has removed it, and the store was told.
+      const bool isGone = !now && content.content && placed_.contains(content.id);
+      if (isGone) continue;
       content.isPinned = now && now->isPinned;
       storeContent(connection, content);
+      removeSavings(connection, content.id);
       if (findJob(connection, content.id, JobKind::Upload) || findByID(connection, content.id)) {
         const std::int64_t when = core_.now();
         addJob(connection, content.id, JobKind::Upload, content.account, when, when);
@@ -510,8 +555,9 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
     }
     if (hasFolders_) makeWaitingRecordsDue(connection, share_.root);
     for (const SharedItem& item : items) {
-      if (step == Step::Prepared) break;  // should we end now, they are still to be taken over
-      if (busy_.contains(item.id)) {
+      if (step == Step::Prepared) {  // should we end now, they are still to be taken over
+        keepWaitingRecord(connection, share_.root, item.id);
+      } else if (busy_.contains(item.id)) {
         addWaitingRecord(connection, share_.root, item.id);
       } else if (waiting_.contains(item.id)) {
         postponeWaitingRecord(connection, share_.root, item.id, core_.now());
@@ -545,7 +591,7 @@ NSErrorRef SharePull::scan() {
   if (folders.empty()) return nullptr;
   std::vector<DirtyFolder> notFound;
   NSErrorRef error = core_.scanner->scanDirty(folders, notFound);
-  if (!notFound.empty()) placed_.clear();  // what is not there may be on its way
+  forgetPlacedBelow(notFound);
   // Others may look at the same time, and leave it to each other.
   const std::string root = std::exchange(rootPath_, {});
   if (!error && !root.empty() && !core_.items->itemByID(share_.root))

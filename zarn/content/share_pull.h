@@ -40,6 +40,11 @@ class SharePull {
   NSErrorRef read(Items& items) const;
   void locate(Connection& connection, SharedItem& item) const;
 
+  /// Whether the items are as the store has them now, or as they were when a page was made.
+  enum class Age : bool { OfPage, OfNow };
+  void makeRoom(Items& items, Age age);
+  [[nodiscard]] bool hasIDOfAnother(const SharedItem& item) const;
+
   // New ones.
   NSErrorRef callOffRemovals(const Items& items);
   NSErrorRef addNew(Items& items);
@@ -57,11 +62,13 @@ class SharePull {
   void applyPlace(SharedItem& item);
   NSErrorRef removeRecordElsewhere(SharedItem& item) const;
   void applyRemoval(SharedItem& item);
+  void forget(const SharedItem& item);
   void moveToTrash(const SharedItem& item, const FileStamp& seen);
   void removeFolder(SharedItem& item);
   void moveOut(SharedItem& item);
   [[nodiscard]] std::string folderForCopies(const SharedItem& item) const;
   NSErrorRef clearOut(const SharedItem& item);
+  void forgetPlacedBelow(const std::vector<DirtyFolder>& folders);
   NSErrorRef noteUnseenRemovals();
 
   enum class Step : bool { Prepared, Done };
@@ -82,14 +89,21 @@ class SharePull {
   std::set<std::uint64_t> busy_;                               ///< of these, those in use
   std::set<std::uint64_t> settled_;                            ///< were taken over, or need not be
   std::set<std::uint64_t> forgotten_;                          ///< have no record any more
-  std::unordered_map<std::uint64_t, std::string>
-      placed_;               ///< new on this page, where they were put
+  struct Placed {
+    std::string path;
+    std::uint64_t folder = 0;
+  };
+  std::unordered_map<std::uint64_t, Placed> placed_;  ///< new on this page, where they were put
   std::string rootPath_;     ///< where the shared item was put on this page
   bool isAtEnd_ = false;     ///< there are no more changes
   bool hasFolders_ = false;  ///< this page has brought some
   std::map<std::uint64_t, std::set<std::string>> dirty_;  ///< names to be scanned, by folder
   std::unordered_map<std::uint64_t, bool> inside_;        ///< folders that were asked about
 };
+
+/// What an earlier process had put here, and somebody had removed before anybody looked: that goes
+/// to the store. To be called when the whole tree was scanned, before anything is taken over.
+[[nodiscard]] NSErrorRef noteRemovalsBeforeStart(ContentCore& core, const ShareRow& share);
 
 /// The folder in which what a share's items leave behind is put: the one that the shared item is
 /// in, the drive's own where that cannot be.

@@ -2,6 +2,8 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <map>
+#include <utility>
 
 #include "platform/foundation/log.h"
 #include "zarn/content/share_pull.h"
@@ -20,7 +22,68 @@ FileStamp stampAt(const std::string& path) {
   return lstat(path.c_str(), &status) == 0 ? FileStamp::of(status) : FileStamp{};
 }
 
+/// Whether all that a folder holds can be seen, so that what is not seen in it is not there.
+bool isReadable(const ContentCore& core, std::uint64_t folder) {
+  const auto path = core.items->physicalPath(folder);
+  std::vector<std::string> names;
+  return path && !SharedTree::list(*path, names);
+}
+
+/// Items that have a record but are not here, by whether their folder says that they have gone.
+struct LostItems {
+  std::vector<ContentRow> gone;
+  std::vector<std::uint64_t> unknown;
+};
+
+LostItems sortLost(const ContentCore& core, std::map<std::uint64_t, ContentRow> lost) {
+  LostItems items;
+  std::map<std::uint64_t, bool> readable;
+  for (const auto& [id, content] : lost) {
+    std::uint64_t folder = content.parent;
+    std::size_t steps = 0;
+    // With a folder has gone what is in it.
+    for (auto above = lost.find(folder); above != lost.end() && steps < lost.size(); ++steps) {
+      folder = above->second.parent;
+      above = lost.find(folder);
+    }
+    const auto [known, isNew] = readable.try_emplace(folder);
+    if (isNew) known->second = isReadable(core, folder);
+    if (known->second) {
+      items.gone.push_back(content);
+    } else {
+      items.unknown.push_back(id);
+    }
+  }
+  return items;
+}
+
 }  // namespace
+
+NSErrorRef noteRemovalsBeforeStart(ContentCore& core, const ShareRow& share) {
+  std::map<std::uint64_t, ContentRow> lost;
+  NSErrorRef error = core.database().read([&](Connection& connection) {
+    const ReadTransaction transaction(connection);
+    // With the shared item goes what is in it: that is leaving the share.
+    if (share.isLeaving() || !findByID(connection, share.root)) return;
+    for (const std::uint64_t id : findLostContent(connection, share)) {
+      if (auto content = findContent(connection, id)) lost.emplace(id, std::move(*content));
+    }
+  });
+  if (error || lost.empty()) return error;
+  const LostItems items = sortLost(core, std::move(lost));
+  error = core.database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    const std::int64_t now = core.now();
+    for (const ContentRow& content : items.gone) {
+      if (!findByID(connection, content.id))
+        addJob(connection, content.id, JobKind::Upload, content.account, now, now);
+    }
+    for (const std::uint64_t id : items.unknown) keepWaitingRecord(connection, share.root, id);
+    return NSErrorRef();
+  });
+  core.queue->noteJobs(JobKind::Upload);
+  return error;
+}
 
 /// Something that is new here, where nothing may be added.
 void SharePull::moveOut(SharedItem& item) {
@@ -56,12 +119,27 @@ void SharePull::applyRemoval(SharedItem& item) {
     forgotten_.erase(item.id);
     return wait(item, error);
   }
+  forget(item);
   (void)core_.scanner->scanLocation(item.path, nullptr);
   if (!isHeld) return tree_.drop(taken);
   std::string kept;
   error = tree_.keepCopy(taken, folderForCopies(item), lastOf(item.path), kept);
   if (error) return log_error(defaultLog(), "[ERROR] %@ was not saved: %@", taken, error);
   (void)core_.scanner->scanLocation(kept, nullptr);
+}
+
+/// Before anybody looks: whoever finds out that it is gone would have the store told, where it may
+/// have been put back.
+void SharePull::forget(const SharedItem& item) {
+  const NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
+    Connection& connection = transaction.connection();
+    const auto content = findContent(connection, item.id);
+    if (content && content->zone == share_.zone) removeContent(connection, item.id);
+    const auto job = findJob(connection, item.id, JobKind::Upload);
+    if (job && !findByID(connection, item.id)) removeJob(connection, *job);
+    return NSErrorRef();
+  });
+  if (!error) forgotten_.erase(item.id);
 }
 
 /// What somebody else has removed from the account's own share can be put back.
@@ -89,6 +167,7 @@ void SharePull::removeFolder(SharedItem& item) {
     forgotten_.erase(item.id);
     return wait(item, error);
   }
+  forget(item);
   noteDirty(item.row->parent, item.path);
 }
 
@@ -120,14 +199,30 @@ NSErrorRef SharePull::clearOut(const SharedItem& item) {
   return nullptr;
 }
 
+/// Of folders that are not where they were nothing can be said: they may be on their way, with all
+/// that was put into them.
+void SharePull::forgetPlacedBelow(const std::vector<DirtyFolder>& folders) {
+  std::vector<std::uint64_t> rest;
+  for (const DirtyFolder& folder : folders) rest.push_back(folder.id);
+  while (!rest.empty()) {
+    const std::uint64_t folder = rest.back();
+    rest.pop_back();
+    std::erase_if(placed_, [&](const auto& each) {
+      const bool isIn = each.second.folder == folder;
+      if (isIn) rest.push_back(each.first);
+      return isIn;
+    });
+  }
+}
+
 /// What somebody has removed between the moment in which it was put here and the first look at it
 /// has never had a row, whose end would tell the store. It may have moved as well: then it gets a
 /// row elsewhere before its job is due, which finds that.
 NSErrorRef SharePull::noteUnseenRemovals() {
   std::vector<std::uint64_t> gone;
   struct stat status{};
-  for (const auto& [id, path] : placed_) {
-    if (lstat(path.c_str(), &status) != 0 && errno == ENOENT) gone.push_back(id);
+  for (const auto& [id, placed] : placed_) {
+    if (lstat(placed.path.c_str(), &status) != 0 && errno == ENOENT) gone.push_back(id);
   }
   if (gone.empty()) return nullptr;
   NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {

@@ -12,6 +12,7 @@
 
 #include "platform/foundation/bounced_name.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "zarn/content/file_lease.h"
 #include "zarn/content/share_rows.h"
@@ -21,6 +22,8 @@
 
 namespace yomber {
 namespace {
+
+FaultPoint leaveRemoving("zarn.leave.removing");
 
 using Fate = GoingItems::Fate;
 
@@ -70,6 +73,16 @@ Fate fateOf(const Found& found, const RZRecordZoneID& zone, bool isShared) {
   const bool isElsewhere =
       found.content && found.content->isRecorded() && found.content->zone != zone;
   return isElsewhere ? Fate::Stays : Fate::Goes;
+}
+
+bool isThere(const std::string& path) {
+  struct stat status{};
+  return lstat(path.c_str(), &status) == 0;
+}
+
+FileStamp stampAt(const std::string& path) {
+  struct stat status{};
+  return lstat(path.c_str(), &status) == 0 ? FileStamp::of(status) : FileStamp{};
 }
 
 std::string lastOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
@@ -163,26 +176,93 @@ NSErrorRef ShareRemains::keepOne(const std::string& path, bool isTop,
   struct stat status{};
   if (lstat(path.c_str(), &status) != 0)
     return errno == ENOENT ? nullptr : NSError::errorWithErrno(errno, path);
-  const auto known = items_.byInode.find(status.st_ino);
-  const bool isKnown = known != items_.byInode.end();
-  if (!isKnown && !isTop) return keepUnseen(path, status);
-  const bool isFolder = S_ISDIR(status.st_mode);
-  if (isKnown && !isTop && known->second.fate == Fate::Stays) {
-    const GoingItems::Item& own = known->second;
-    return keepOwn(path, own.parent, lastOf(path), own.isOtherShare);
-  }
-  if (isFolder) return listFolder(path, rest);
-  const std::optional<ContentRow> content = isKnown ? known->second.content : std::nullopt;
+  const GoingItems::Item* const known = find(status.st_ino);
+  if (known == nullptr && !isTop) return keepUnseen(path, status);
+  if (known != nullptr && !isTop && known->fate == Fate::Stays)
+    return keepOwn(path, known->parent, lastOf(path), known->isOtherShare);
+  if (S_ISDIR(status.st_mode)) return listFolder(path, rest);
+  const std::optional<ContentRow> content = known != nullptr ? known->content : std::nullopt;
   if (!isUnsaved(path, content) && !isBeingWritten(path)) return nullptr;
   return keepCopy(path, isTop ? name_ : lastOf(path));
 }
 
+const GoingItems::Item* ShareRemains::find(std::uint64_t inode) const {
+  const auto known = items_.byInode.find(inode);
+  return known == items_.byInode.end() ? nullptr : &known->second;
+}
+
+NSErrorRef ShareRemains::remove(const std::string& top) {
+  constexpr int kMostLooks = 100;
+  struct Place {
+    std::string path;
+    int looks = 0;
+  };
+  std::vector<Place> rest{{.path = top}};
+  while (!rest.empty()) {
+    const std::string path = rest.back().path;
+    if (!isThere(path)) {
+      rest.pop_back();
+      continue;
+    }
+    if (++rest.back().looks > kMostLooks) return NSError::errorWithErrno(EBUSY, path);
+    std::vector<std::string> entries;
+    if (NSErrorRef error = removeOne(path, path == top, entries)) return error;
+    for (std::string& entry : entries) rest.push_back({.path = std::move(entry)});
+  }
+  return nullptr;
+}
+
+/// A folder goes when nothing is in it: who has it open may put something there until then, and
+/// nothing after that.
+NSErrorRef ShareRemains::removeOne(const std::string& path, bool isTop,
+                                   std::vector<std::string>& entries) {
+  struct stat status{};
+  if (lstat(path.c_str(), &status) != 0)
+    return errno == ENOENT ? nullptr : NSError::errorWithErrno(errno, path);
+  const GoingItems::Item* const known = find(status.st_ino);
+  const bool isToMove = !isTop && (known == nullptr || known->fate == Fate::Stays);
+  if (isToMove) return keepOne(path, isTop, entries);
+  if (!S_ISDIR(status.st_mode))
+    return removeDocument(path, isTop ? name_ : lastOf(path),
+                          known != nullptr ? known->content : std::nullopt);
+  tree_.setWritable(path, true);
+  NSErrorRef error = listFolder(path, entries);
+  if (error || !entries.empty()) return error;
+  if (leaveRemoving.hit()) return NSError::errorWithErrno(EIO, path);
+  error = tree_.removeFolder(path);
+  return error && error->is(NSPOSIXErrorDomain, ENOTEMPTY) ? nullptr : error;
+}
+
+/// Nobody may write to it between the look at it and its end.
+NSErrorRef ShareRemains::removeDocument(const std::string& path, const std::string& name,
+                                        const std::optional<ContentRow>& content) const {
+  const FileStamp seen = stampAt(path);
+  if (isUnsaved(path, content) || isBeingWritten(path)) return keepCopy(path, name);
+  std::string taken;
+  NSErrorRef error = tree_.takeAway(path, SharedTree::Kept::No, taken, &seen);
+  // The latter is one that is being filled.
+  const bool isOpen =
+      error && (error->is(NSPOSIXErrorDomain, EBUSY) || error->is(NSPOSIXErrorDomain, EWOULDBLOCK));
+  if (isOpen) {
+    // Out of reach first: who has it open still can have written to it, but nobody else comes.
+    error = tree_.takeAway(path, SharedTree::Kept::Yes, taken);
+    if (error) return error;
+    if (isBeingWritten(taken) || isUnsaved(taken, content)) return bringBack(taken, name);
+  }
+  if (!error) tree_.drop(taken);
+  return error;
+}
+
 NSErrorRef ShareRemains::keepCopy(const std::string& path, const std::string& name) const {
   std::string taken;
+  if (NSErrorRef error = tree_.takeAway(path, SharedTree::Kept::Yes, taken)) return error;
+  (void)core_.scanner->scanLocation(path, nullptr);
+  return bringBack(taken, name);
+}
+
+NSErrorRef ShareRemains::bringBack(const std::string& taken, const std::string& name) const {
   std::string kept;
-  NSErrorRef error = tree_.takeAway(path, SharedTree::Kept::Yes, taken);
-  if (!error) (void)core_.scanner->scanLocation(path, nullptr);
-  if (!error) error = tree_.keepCopy(taken, folder_, name, kept);
+  NSErrorRef error = tree_.keepCopy(taken, folder_, name, kept);
   if (!error) (void)core_.scanner->scanLocation(kept, nullptr);
   return error;
 }

@@ -52,18 +52,25 @@ class ShareRemains {
         folder_(std::move(folder)),
         name_(std::move(name)) {}
 
-  /// Looks at what is on the disk at `top`, where the item is, or was taken away to. To be called
-  /// before that, and once more after it: for what came in between.
+  /// Looks at what is on the disk at `top`, where the item is.
   [[nodiscard]] NSErrorRef keep(const std::string& top);
+  /// Removes what may go, one by one; what has come since is kept all the same. EBUSY while more
+  /// and more comes.
+  [[nodiscard]] NSErrorRef remove(const std::string& top);
 
  private:
   NSErrorRef keepOne(const std::string& path, bool isTop, std::vector<std::string>& rest);
   NSErrorRef keepCopy(const std::string& path, const std::string& name) const;
+  NSErrorRef bringBack(const std::string& taken, const std::string& name) const;
+  NSErrorRef removeOne(const std::string& path, bool isTop, std::vector<std::string>& entries);
+  NSErrorRef removeDocument(const std::string& path, const std::string& name,
+                            const std::optional<ContentRow>& content) const;
   /// `parent`, `nameThere`: the place of its row.
   NSErrorRef keepOwn(const std::string& path, std::uint64_t parent, const std::string& nameThere,
                      bool isOtherShare) const;
   NSErrorRef keepUnseen(const std::string& path, const struct stat& status);
   NSErrorRef keepUnknown(const std::string& path);
+  [[nodiscard]] const GoingItems::Item* find(std::uint64_t inode) const;
 
   const ContentCore& core_;
   const SharedTree& tree_;

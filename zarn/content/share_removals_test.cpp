@@ -1,8 +1,11 @@
 #include <sys/stat.h>
+#include <sys/xattr.h>
 
+#include "platform/ostrell/constants.h"
 #include "platform/rozzel/record.h"
 #include "zarn/content/share_rows.h"
 #include "zarn/content/test_sharing.h"
+#include "zarn/item_attributes.h"
 
 namespace yomber {
 namespace {
@@ -22,6 +25,14 @@ class ShareRemovalsTest : public TwoDrives {
     std::vector<RZRecordRef> saved;
     ASSERT_EQ(records->modifyRecords({QSUbiquitousRozzelContainerIdentifier, "ann"}, batch, saved),
               nullptr);
+  }
+  [[nodiscard]] bool hasUpload(const SharingDrive& drive, std::uint64_t id) const {
+    bool isFound = false;
+    EXPECT_EQ(drive.database->read([&](Connection& connection) {
+      isFound = findJob(connection, id, JobKind::Upload).has_value();
+    }),
+              nullptr);
+    return isFound;
   }
   [[nodiscard]] std::int64_t attemptsOf(std::uint64_t record) const {
     std::int64_t attempts = -1;
@@ -123,6 +134,126 @@ TEST_F(ShareRemovalsTest, WhatIsRemovedBeforeItWasLookedAtIsRemovedForAll) {
     return ann->names("Plans") == expected;
   }));
   EXPECT_EQ(bob->names("Plans"), expected);
+}
+
+TEST_F(ShareRemovalsTest, WhatIsPutBackWhileItsRemovalIsTakenOverStays) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  const std::uint64_t id = ann->id("Plans/a.txt");
+  const std::string away = ann->layout.home() + "/away";
+  ASSERT_EQ(::rename(ann->at("Plans/a.txt").c_str(), away.c_str()), 0);
+  ann->settle();
+  const auto pass = [this] {
+    (void)bob->shares().refresh(std::string(NSFileProviderRootContainerItemIdentifier));
+  };
+  {
+    const Pause fetched = pauseAt("zarn.pull.fetched");
+    std::thread following(pass);
+    EXPECT_TRUE(fetched.waitUntilReached());
+    EXPECT_EQ(::rename(away.c_str(), ann->at("Plans/a.txt").c_str()), 0);
+    ann->settle();
+    const Pause removing = pauseAt("zarn.upload.committed");
+    const Pause placed = pauseAt("zarn.pull.placed");
+    fetched.end();
+    EXPECT_TRUE(placed.waitUntilReached());
+    // A removal that was begun ends after the item has come again.
+    EXPECT_TRUE(waitUntil([&] { return removing.isReached() || !hasUpload(*bob, id); }));
+    placed.end();
+    following.join();
+    FaultPoint::disarmAll();
+    const Pause known = pauseAt("zarn.pull.stored");
+    std::thread followingOn(pass);
+    EXPECT_TRUE(known.waitUntilReached());
+    removing.end();
+    EXPECT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
+    known.end();
+    followingOn.join();
+  }
+  FaultPoint::disarmAll();
+  followBoth();
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+}
+
+TEST_F(ShareRemovalsTest, WhatIsRemovedAndPutBackBeforeItsPageIsDoneStays) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->settle();
+  const std::string away = ann->layout.home() + "/away";
+  meanwhile("zarn.pull.placed", [&] {
+    bob->settle();
+    bob->remove("Plans/new.txt");
+    bob->settle();
+    ASSERT_EQ(::rename(ann->at("Plans/new.txt").c_str(), away.c_str()), 0);
+    ann->settle();
+    ASSERT_EQ(::rename(away.c_str(), ann->at("Plans/new.txt").c_str()), 0);
+    ann->settle();
+  });
+  followBoth();
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt", "new.txt"}));
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt", "new.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/new.txt"), kLong);
+}
+
+TEST_F(ShareRemovalsTest, WhatIsPutBackComesAlsoToWhoHasMadeItHisOwn) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  ASSERT_EQ(setxattr(bob->at("Plans/a.txt").c_str(), kTagsAttribute, "blue", 4, 0), 0);
+  const std::vector<std::uint64_t> ids{ann->id("Plans/a.txt"), ann->id("Plans/Old"),
+                                       ann->id("Plans/Old/b.txt")};
+  bob->rename("Plans/a.txt", "mine.txt");
+  bob->rename("Plans/Old", "Mine");
+  bob->settle();
+  // As the trash, from where the owner puts it back.
+  for (const char* name : {"a.txt", "Old"})
+    ASSERT_EQ(::rename(ann->at("Plans/" + std::string(name)).c_str(),
+                       (ann->layout.home() + "/" + name).c_str()),
+              0);
+  ann->settle();
+  followBoth();
+  for (const char* name : {"a.txt", "Old"})
+    ASSERT_EQ(::rename((ann->layout.home() + "/" + name).c_str(),
+                       ann->at("Plans/" + std::string(name)).c_str()),
+              0);
+  ann->settle();
+  followBoth();
+  bob->settle();
+  EXPECT_EQ(bob->names("Plans"), (Names{"Old", "a.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Plans/Old/b.txt"), "short");
+  EXPECT_EQ((std::vector{bob->id("Plans/a.txt"), bob->id("Plans/Old"), bob->id("Plans/Old/b.txt")}),
+            ids);
+  EXPECT_EQ(bob->names(), (Names{"Mine", "Plans", "mine.txt"}));
+  EXPECT_EQ(bob->readWhole("mine.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Mine/b.txt"), "short");
+  EXPECT_EQ(readItemAttributes(bob->at("mine.txt").c_str()).extra.tags, Names{"blue"});
+  for (const char* path : {"mine.txt", "Mine/b.txt"}) {
+    EXPECT_EQ(zonesWith("bob", bob->id(path)), Names{QSUbiquitousDefaultContainerID}) << path;
+    EXPECT_EQ(readItemAttributes(bob->at(path).c_str()).id, bob->id(path));
+  }
+  for (const std::uint64_t id : ids) EXPECT_EQ(zonesWith("bob", id), Names{}) << id;
+  EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
+}
+
+TEST_F(ShareRemovalsTest, AFolderThatMovesHidesNothingThatIsRemovedElsewhere) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->write("Plans/Old/new.txt", "stays");
+  ann->settle();
+  meanwhile("zarn.pull.placed", [&] {
+    bob->remove("Plans/new.txt");
+    bob->rename("Plans/Old", "Plans/Older");
+  });
+  const Names expected{"Older", "a.txt"};
+  EXPECT_TRUE(waitUntil([&] {
+    bob->settle();
+    followBoth();
+    return ann->names("Plans") == expected;
+  }));
+  EXPECT_EQ(bob->names("Plans"), expected);
+  EXPECT_EQ(ann->names("Plans/Older"), (Names{"b.txt", "new.txt"}));
+  EXPECT_EQ(bob->readWhole("Plans/Older/new.txt"), "stays");
 }
 
 }  // namespace

@@ -150,9 +150,33 @@ std::vector<std::uint64_t> contentIn(Connection& connection, const RZRecordZoneI
   return ids;
 }
 
+std::vector<std::uint64_t> findLostContent(Connection& connection, const ShareRow& share) {
+  StatementUse statement(connection.prepared(
+      "SELECT id FROM content WHERE owner IS NOT NULL AND zone=?1 AND owner=?2 AND account=?3 "
+      "AND id<>?4 AND NOT EXISTS(SELECT 1 FROM item WHERE item.id=content.id) "
+      "AND NOT EXISTS(SELECT 1 FROM job WHERE job.item=content.id AND kind=?5) "
+      "AND NOT EXISTS(SELECT 1 FROM share_waiting WHERE root=?4 AND record=content.id)"));
+  statement->bindBytes(1, share.zone.zoneName());
+  statement->bindBytes(2, share.zone.ownerName());
+  statement->bindInteger(3, share.account);
+  statement->bindID(4, share.root);
+  statement->bindInteger(5, static_cast<std::int64_t>(JobKind::Upload));
+  std::vector<std::uint64_t> ids;
+  while (statement->step()) ids.push_back(statement->id(0));
+  return ids;
+}
+
 void addWaitingRecord(Connection& connection, std::uint64_t root, std::uint64_t record) {
   StatementUse statement(
       connection.prepared("INSERT OR REPLACE INTO share_waiting(root,record) VALUES(?1,?2)"));
+  statement->bindID(1, root);
+  statement->bindID(2, record);
+  statement->step();
+}
+
+void keepWaitingRecord(Connection& connection, std::uint64_t root, std::uint64_t record) {
+  StatementUse statement(
+      connection.prepared("INSERT OR IGNORE INTO share_waiting(root,record) VALUES(?1,?2)"));
   statement->bindID(1, root);
   statement->bindID(2, record);
   statement->step();

@@ -70,6 +70,9 @@ void removeShare(Connection& connection, std::uint64_t root);
 /// How many items have a record in a shared zone.
 [[nodiscard]] std::uint64_t countContentIn(Connection& connection, const RZRecordZoneID& zone);
 
+/// The items that have one there, but are not here, about which nothing is to be done.
+[[nodiscard]] std::vector<std::uint64_t> findLostContent(Connection& connection,
+                                                         const ShareRow& share);
 /// The items that have one there.
 [[nodiscard]] std::vector<std::uint64_t> contentIn(Connection& connection,
                                                    const RZRecordZoneID& zone);
@@ -78,6 +81,8 @@ void removeShare(Connection& connection, std::uint64_t root);
 
 /// To be asked for with the next pass: its file is open, or has just changed.
 void addWaitingRecord(Connection& connection, std::uint64_t root, std::uint64_t record);
+/// The same, unless it waits already.
+void keepWaitingRecord(Connection& connection, std::uint64_t root, std::uint64_t record);
 /// What must come for it is not known, as its folder: to be asked for again after three seconds,
 /// then after twice the time, at most an hour; after a dozen times no more by itself.
 void postponeWaitingRecord(Connection& connection, std::uint64_t root, std::uint64_t record,

@@ -37,14 +37,18 @@ struct SharedItem {
   std::optional<SharedRecord> record;  ///< nothing: the store has none (any more)
   std::optional<ItemRow> row;          ///< nothing: it is not here
   std::optional<ContentRow> content;
-  std::string path;             ///< on this disk
-  bool isInside = false;        ///< it is in the share, or the shared item itself
-  bool isRefused = false;       ///< what was done here was refused: the record counts
-  bool isFresh = false;         ///< its file has what the record says
-  FileStamp stamp = {};         ///< of that file when it was looked at or made
-  bool isBeingRemoved = false;  ///< it went from here, which the store does not know yet
+  std::string path;        ///< on this disk
+  bool isInside = false;   ///< it is in the share, or the shared item itself
+  bool isRefused = false;  ///< what was done here was refused: the record counts
+  bool isFresh = false;    ///< its file has what the record says
+  FileStamp stamp = {};    ///< of that file when it was looked at or made
+  /// Where the record's content was about to be saved from here, which was not confirmed: the file
+  /// that had it.
+  std::optional<FileStamp> saving = {};
+  bool isBeingRemoved = false;  ///< it went from here, about which the store is to be told
 
   [[nodiscard]] bool isRoot(const ShareRow& share) const { return id == share.root; }
+  [[nodiscard]] bool isOwnSave() const { return saving && !isRefused; }
   /// Whether the record is known here already.
   [[nodiscard]] bool isOwnEcho(const ShareRow& share) const {
     return record && row && content && !isRefused && content->zone == share.zone &&

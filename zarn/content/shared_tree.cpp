@@ -18,7 +18,6 @@
 #include "zarn/item_attributes.h"
 #include "zarn/lent_mode.h"
 #include "zarn/random_id.h"
-#include "zarn/staged_removal.h"
 
 namespace yomber {
 namespace {
@@ -28,6 +27,7 @@ constexpr std::string_view kTakenPrefix = "taken-";
 /// Links and the like carry no attributes: they are always kept.
 constexpr std::string_view kLinkPrefix = "link-";
 constexpr const char* kKeptLinkName = "Kept link";
+constexpr const char* kKeptFolderName = "Kept folder";
 /// On what was taken away: the name under which it is to come back.
 constexpr const char* kKeptNameAttribute = "user.yomber.kept";
 constexpr std::int64_t kNanosecondsInSecond = 1'000'000'000;
@@ -43,6 +43,11 @@ FileDescriptor openPath(const std::string& path) {
 bool isLinkAt(const std::string& path) {
   struct stat status{};
   return lstat(path.c_str(), &status) == 0 && !S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode);
+}
+
+bool isFilledFolder(const std::string& path) {
+  std::vector<std::string> names;
+  return !isLinkAt(path) && !SharedTree::list(path, names) && !names.empty();
 }
 
 bool setAttribute(int file, const char* name, const std::string& value) {
@@ -313,12 +318,6 @@ NSErrorRef SharedTree::keepCopy(const std::string& taken, const std::string& fol
 
 void SharedTree::drop(const std::string& taken) const {
   if (taken.empty() || unlink(taken.c_str()) == 0 || errno == ENOENT) return;
-  setWritable(taken, true);
-  {
-    const FileDescriptor folder(
-        open(taken.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    if (folder) (void)removeStaged(folder.get());
-  }
   if (rmdir(taken.c_str()) != 0)
     log_error(defaultLog(), "[ERROR] cannot remove %@: %@", taken, NSError::errorWithErrno(errno));
 }
@@ -335,6 +334,10 @@ void SharedTree::recover() const {
     const ssize_t length = lgetxattr(path.c_str(), kKeptNameAttribute, kept.data(), kept.size());
     std::string wanted(kept.data(), length > 0 ? static_cast<std::size_t>(length) : 0);
     if (isLink) wanted = kKeptLinkName;
+    if (wanted.empty() && isFilledFolder(path)) {
+      wanted = kKeptFolderName;
+      setWritable(path, true);
+    }
     if (!isPossibleName(wanted)) {
       drop(path);
     } else if (!place(path, core_.items->layout().root(), wanted)) {

@@ -62,7 +62,7 @@ class SharedTree {
   /// Brings what was taken away back as an item of its own, next to where it was.
   [[nodiscard]] NSErrorRef keepCopy(const std::string& taken, const std::string& folder,
                                     std::string_view name, std::string& kept) const;
-  /// Removes what was taken away, a folder with all that it holds.
+  /// Removes what was taken away or staged; a folder only when it holds nothing.
   void drop(const std::string& taken) const;
   /// Brings what an earlier process took away and has not brought back into the drive's root, and
   /// removes the rest. To be called before anything else.

@@ -95,6 +95,7 @@ class Shares {
   void poke();
   NSErrorRef pass() REQUIRES(working_);
   NSErrorRef askForWaitingAgain(std::int64_t account) const;
+  NSErrorRef noteRemovalsBeforeStart(std::int64_t account) const;
   NSErrorRef followZones(const Session& session) REQUIRES(working_);
   NSErrorRef adopt(const Session& session, const RZRecordZone& zone);
   NSErrorRef adoptForeign(ShareRow row, const RZShare& share);

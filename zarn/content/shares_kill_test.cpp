@@ -1,7 +1,10 @@
 #include <fcntl.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
+#include <csignal>
 #include <functional>
+#include <thread>
 
 #include "zarn/content/test_sharing.h"
 
@@ -16,7 +19,19 @@ class SharesKillTest : public TwoDrives, public testing::WithParamInterface<cons
   /// Runs `work` with the drive of that account in a child that ends at the fault point. Threads
   /// are not carried across a fork: everything of ours is closed before.
   void dieDuring(const std::string& account, const std::string& point,
-                 const std::function<void(SharingDrive&)>& work) {
+                 const std::function<void(SharingDrive&)>& work,
+                 const std::function<void()>& beforeRestart = {}) {
+    die(
+        account,
+        [&](SharingDrive& drive) {
+          if (FaultPoint::arm(point + "=abort")) _exit(1);
+          work(drive);
+        },
+        beforeRestart);
+  }
+  /// The same where the work sees to the end itself.
+  void die(const std::string& account, const std::function<void(SharingDrive&)>& work,
+           const std::function<void()>& beforeRestart = {}) {
     const std::string annsHome = ann->layout.home();
     const std::string bobsHome = bob->layout.home();
     ann.reset();
@@ -26,13 +41,13 @@ class SharesKillTest : public TwoDrives, public testing::WithParamInterface<cons
     if (child == 0) {
       SharingDrive drive(account == "ann" ? annsHome : bobsHome,
                          std::make_shared<EmbeddedEngine>(storePath), account);
-      if (FaultPoint::arm(point + "=abort")) _exit(1);
       work(drive);
       _exit(0);
     }
     int ending = 0;
     ASSERT_EQ(waitpid(child, &ending, 0), child);
-    ASSERT_TRUE(WIFSIGNALED(ending)) << point << " was not reached";
+    ASSERT_TRUE(WIFSIGNALED(ending)) << "it has not come to that";
+    if (beforeRestart) beforeRestart();
     records = std::make_shared<EmbeddedEngine>(storePath);
     ann = std::make_unique<SharingDrive>(annsHome, records, "ann");
     bob = std::make_unique<SharingDrive>(bobsHome, records, "bob");
@@ -84,6 +99,36 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, SharePullKillTest,
                          testing::Values("zarn.share.accepted", "zarn.pull.fetched",
                                          "zarn.pull.placed", "zarn.pull.stored"));
 
+class ShareUnseenKillTest : public SharesKillTest {};
+
+TEST_F(ShareUnseenKillTest, WhatWasRemovedBeforeItWasLookedAtIsRemovedForAll) {
+  shareFolder(editor("bob"));
+  ann->write("Plans/new.txt", kLong);
+  ann->makeFolder("Plans/Folder");
+  ann->write("Plans/Folder/in.txt", "in it");
+  ann->write("Plans/stays.txt", "stays");
+  ann->settle();
+  const std::string gate = storePath + "-placed";
+  die("bob", [&](SharingDrive& drive) {
+    const Pause placed("zarn.pull.placed", gate);
+    std::thread following([&] { (void)drive.follow(); });
+    if (!placed.waitUntilReached()) _exit(1);
+    drive.remove("Plans/new.txt");
+    drive.remove("Plans/Folder");
+    if (FaultPoint::arm("zarn.pull.stored=abort")) _exit(1);
+    placed.end();
+    following.join();
+  });
+  const Names expected{"Old", "a.txt", "stays.txt"};
+  EXPECT_TRUE(waitUntil([&] {
+    EXPECT_EQ(bob->follow(), nullptr);
+    EXPECT_EQ(ann->follow(), nullptr);
+    return ann->names("Plans") == expected;
+  }));
+  EXPECT_EQ(bob->names("Plans"), expected);
+  EXPECT_EQ(bob->readWhole("Plans/stays.txt"), "stays");
+}
+
 class ShareConflictKillTest : public SharesKillTest {};
 
 TEST_P(ShareConflictKillTest, WhatBothWroteIsThereAfterTheNextStart) {
@@ -111,6 +156,32 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareConflictKillTest,
                          testing::Values("zarn.pull.displaced", "zarn.pull.placed",
                                          "zarn.pull.stored"));
 
+class ShareUploadKillTest : public SharesKillTest {};
+
+TEST_P(ShareUploadKillTest, WhatIsWrittenAfterASaveThatNobodyHeardOfIsTheDocument) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  const std::string name = GetParam();
+  const std::string path = bob->at("Plans/" + name);
+  dieDuring(
+      "bob", "zarn.upload.committed",
+      [&](SharingDrive& drive) {
+        drive.write("Plans/" + name, "second");
+        drive.settle();
+      },
+      [&] { std::ofstream(path, std::ios::binary) << "third, by bob"; });
+  EXPECT_TRUE(waitUntil([&] {
+    return bob->follow() == nullptr && ann->follow() == nullptr && ann->exists("Plans/" + name) &&
+           ann->readWhole("Plans/" + name) == "third, by bob";
+  }));
+  EXPECT_EQ(bob->read("Plans/" + name), "third, by bob");
+  EXPECT_EQ(ann->names("Plans"), bob->names("Plans"));
+  for (const std::string& each : bob->names("Plans"))
+    EXPECT_EQ(each.find("kept copy"), std::string::npos) << each;
+}
+
+INSTANTIATE_TEST_SUITE_P(OfOldAndNew, ShareUploadKillTest, testing::Values("a.txt", "new.txt"));
+
 TEST_P(ShareLeaveKillTest, WhatIsSharedNoLongerGoesWithTheNextStart) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
@@ -126,7 +197,33 @@ TEST_P(ShareLeaveKillTest, WhatIsSharedNoLongerGoesWithTheNextStart) {
 }
 
 INSTANTIATE_TEST_SUITE_P(AtEachPoint, ShareLeaveKillTest,
-                         testing::Values("zarn.leave.noted", "zarn.leave.kept", "zarn.leave.gone"));
+                         testing::Values("zarn.leave.noted", "zarn.leave.kept",
+                                         "zarn.leave.removing", "zarn.leave.gone"));
+
+TEST_F(ShareLeaveKillTest, WhatWasPutIntoAnOpenFolderBeforeTheEndIsThereAfterTheNextStart) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(ann->stopSharing("Plans"), nullptr);
+  const std::string gate = storePath + "-removing";
+  die("bob", [&](SharingDrive& drive) {
+    const FileDescriptor folder(
+        open(drive.at("Plans/Old").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    const Pause removing("zarn.leave.removing", gate);
+    std::thread following([&] { (void)drive.follow(); });
+    if (!removing.waitUntilReached()) _exit(1);
+    const FileDescriptor file(
+        openat(folder.get(), "late.txt", O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+    if (pwrite(file.get(), "late", 4, 0) != 4) _exit(1);
+    (void)raise(SIGKILL);
+  });
+  bool isFound = false;
+  for (const std::string& name : bob->names()) {
+    const bool isFolder = std::filesystem::is_directory(bob->at(name));
+    for (const std::string& each : isFolder ? bob->names(name) : Names{""})
+      isFound = isFound || bob->read(isFolder ? name + "/" + each : name) == "late";
+  }
+  EXPECT_TRUE(isFound) << "what Bob wrote is lost";
+  EXPECT_FALSE(bob->exists("Plans"));
+}
 
 TEST_P(ShareEndKillTest, TheOwnersRecordsComeBackWithTheNextStart) {
   shareFolder(viewer("bob"));

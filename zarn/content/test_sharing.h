@@ -182,6 +182,26 @@ class SharingDrive {
   const std::shared_ptr<EmbeddedEngine> records_;
 };
 
+/// Has whoever comes to a fault point wait there.
+class Pause {
+ public:
+  Pause(const std::string& point, std::string gate) : gate_(std::move(gate)) {
+    EXPECT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate_), nullptr);
+  }
+  ~Pause() { end(); }
+  Pause(const Pause&) = delete;
+  Pause& operator=(const Pause&) = delete;
+
+  [[nodiscard]] bool isReached() const { return std::filesystem::exists(gate_ + ".reached"); }
+  [[nodiscard]] bool waitUntilReached() const {
+    return waitUntil([this] { return isReached(); });
+  }
+  void end() const { std::ofstream(gate_).put('x'); }
+
+ private:
+  const std::string gate_;
+};
+
 /// Ann and Bob, each with a drive, on one store.
 class TwoDrives : public testing::Test {
  protected:
@@ -247,6 +267,9 @@ class TwoDrives : public testing::Test {
       if (found.at(0).record) names.push_back(zone.zoneID.zoneName());
     }
     return names;
+  }
+  [[nodiscard]] Pause pauseAt(const std::string& point) const {
+    return {point, storePath + "-" + point};
   }
   void goOffline() const { std::ofstream(storePath + "/offline").put('x'); }
   void comeBack() const { std::filesystem::remove(storePath + "/offline"); }

@@ -38,6 +38,11 @@ bool isContentGone(const NSErrorRef& error) {
          rz_isError(error->underlyingError(), RZErrorAssetDamaged);
 }
 
+/// Whether the store has a record of it, rather than its content only.
+bool hasRecord(const std::optional<ContentRow>& content) {
+  return content && content->isRecorded() && !content->zone.zoneName().empty();
+}
+
 /// One document on its way.
 struct Upload {
   JobSubject subject;
@@ -66,7 +71,8 @@ class UploadGroup {
   }
 
   void finish() {
-    NSErrorRef error = syncDocuments();
+    NSErrorRef error = noteSaving();
+    if (!error) error = syncDocuments();
     if (!error) error = commitAssets();
     if (!error) makeThumbnails();
     if (!error) error = saveRecords();
@@ -83,8 +89,7 @@ class UploadGroup {
     upload.confirmed.account = subject.job.account;
     if (subject.content) upload.confirmed = *subject.content;
     if (!subject.row) {
-      upload.kind = subject.content && subject.content->isRecorded() ? Upload::Kind::Remove
-                                                                     : Upload::Kind::Nothing;
+      upload.kind = hasRecord(subject.content) ? Upload::Kind::Remove : Upload::Kind::Nothing;
       return;
     }
     if (subject.row->isFolder()) return prepareFolder(upload);
@@ -120,7 +125,7 @@ class UploadGroup {
   static bool isInStore(Upload& upload) {
     const auto& before = upload.subject.content;
     ContentRow& after = upload.confirmed;
-    const bool isElsewhere = before && before->isRecorded() && before->zone != upload.subject.zone;
+    const bool isElsewhere = hasRecord(before) && before->zone != upload.subject.zone;
     if (isElsewhere) upload.previousZone = before->zone;
     after.zone = upload.subject.zone;
     after.parent = upload.subject.row->parent;
@@ -200,6 +205,22 @@ class UploadGroup {
     if (unsynced_.size() >= kFewFiles) file = FileDescriptor();
     unsynced_.push_back(std::move(file));
     return nullptr;
+  }
+
+  /// Where others save as well, whose save it was must be known however this process ends.
+  NSErrorRef noteSaving() {
+    std::vector<const ContentRow*> saving;
+    for (const Upload& upload : uploads_) {
+      const ContentRow& confirmed = upload.confirmed;
+      if (upload.kind == Upload::Kind::Save && confirmed.content && isSharedZone(confirmed.zone))
+        saving.push_back(&confirmed);
+    }
+    if (saving.empty()) return nullptr;
+    return core_.database().write([&](WriteTransaction& transaction) {
+      for (const ContentRow* const each : saving)
+        storeSaving(transaction.connection(), each->id, *each->content, each->stamp);
+      return NSErrorRef();
+    });
   }
 
   /// What this disk could still forget, its document and the row with its id, must not be told to
@@ -391,6 +412,7 @@ class UploadGroup {
     }
     core_.finished.fetch_add(1);
     removeJob(connection, job);
+    removeSavings(connection, job.item);
     if (!upload.owner.empty())
       return leaveTo(connection, upload, accountKey(connection, upload.owner));
     if (upload.recordOwner) return leaveTo(connection, upload, *upload.recordOwner);

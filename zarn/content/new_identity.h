@@ -1,0 +1,14 @@
+#pragma once
+
+#include <cstdint>
+
+#include "platform/foundation/error.h"
+#include "zarn/content/content_core.h"
+
+namespace yomber {
+
+/// Gives an item another id, as a record of somebody else's needs the one that it has. Nothing else
+/// changes of it; a record of it must not be in the store any more, and is made anew.
+[[nodiscard]] NSErrorRef giveNewIdentity(ContentCore& core, std::uint64_t id);
+
+}  // namespace yomber

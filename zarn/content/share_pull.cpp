@@ -10,7 +10,6 @@
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
-#include "zarn/content/new_identity.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"
 
@@ -183,36 +182,6 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
 }
 
 // --- New ones.
-
-/// What was moved out of the share before, and is the account's own since.
-bool SharePull::hasIDOfAnother(const SharedItem& item) const {
-  const bool isOfZone = item.content && item.content->zone == share_.zone;
-  if (!item.record || !item.row || item.isInside || isOfZone || item.isRoot(share_)) return false;
-  if (share_.isOwn() && item.row->isTrashed()) return false;  // it comes back from there
-  bool isShare = true;
-  (void)core_.database().read(
-      [&](Connection& connection) { isShare = findShare(connection, item.id).has_value(); });
-  return !isShare && !item.row->isContainerFolder();
-}
-
-/// Records that come to have the id of an item of the account's own are new here, and that gets
-/// another id.
-void SharePull::makeRoom(Items& items, Age age) {
-  for (SharedItem& item : items) {
-    if (!hasIDOfAnother(item)) continue;
-    // It may have been on its way out when the page was made.
-    NSErrorRef error =
-        age == Age::OfPage ? NSError::errorWithErrno(EAGAIN) : removeRecordElsewhere(item);
-    if (!error) error = giveNewIdentity(core_, item.id);
-    if (error) {
-      wait(item, error);
-      continue;
-    }
-    item.row.reset();
-    item.content.reset();
-    item.path.clear();
-  }
-}
 
 bool SharePull::isNew(const SharedItem& item) const {
   if (!item.record || item.row) return false;

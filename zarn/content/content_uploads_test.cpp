@@ -1,6 +1,8 @@
 #include <thread>
 
+#include "zarn/content/content_rows.h"
 #include "zarn/content/test_content.h"
+#include "zarn/write_transaction.h"
 
 namespace yomber {
 namespace {
@@ -112,6 +114,30 @@ TEST_F(ContentUploadsTest, WithTheStoreOutOfReachJobsWaitWithoutCountingAttempts
   comeBack();
   ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
   EXPECT_EQ(contentInStore(id("a")), "text");
+}
+
+TEST_F(ContentUploadsTest, WhatHadNothingToSaveIsSavedWhenItsRecordWasForgottenMeanwhile) {
+  write("a", content(1'000));
+  settle();
+  stopAt("zarn.upload.committed");
+  setAttribute("a", "user.note", "text");
+  scan();
+  ASSERT_TRUE(isStopped());
+  RZRecordBatch batch;
+  batch.recordsToDelete.push_back({record(id("a"))->recordID(), {}});
+  std::vector<RZRecordRef> saved;
+  ASSERT_EQ(records->modifyRecords({QSUbiquitousRozzelContainerIdentifier, "ann"}, batch, saved),
+            nullptr);
+  const std::uint64_t item = id("a");
+  ASSERT_EQ(database->write([&](WriteTransaction& transaction) {
+    removeContent(transaction.connection(), item);
+    return NSErrorRef();
+  }),
+            nullptr);
+  go();
+  ASSERT_TRUE(waitUntil([&] { return record(item) != nullptr; }));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(contentInStore(item), content(1'000));
 }
 
 TEST_F(ContentUploadsTest, OverQuotaTheJobWaitsAndOthersGoOn) {

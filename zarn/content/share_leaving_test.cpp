@@ -116,9 +116,12 @@ TEST_F(ShareLeavingTest, WhatIsPutIntoAnOpenFolderWhileThatIsRemovedIsKept) {
     ASSERT_TRUE(file);
     ASSERT_EQ(pwrite(file.get(), "late", 4, 0), 4);
   });
-  EXPECT_EQ(bob->names(), Names{"Plans (kept copy)"});
-  EXPECT_EQ(bob->names("Plans (kept copy)"), Names{"late.txt"});
-  EXPECT_EQ(bob->read("Plans (kept copy)/late.txt"), "late");
+  // In its folder, or without it, where another look at the share came in between.
+  const bool isInFolder = bob->names() == Names{"Plans (kept copy)"};
+  const std::string kept =
+      isInFolder ? "Plans (kept copy)/late.txt" : std::string("late (kept copy).txt");
+  EXPECT_EQ(bob->names(isInFolder ? "Plans (kept copy)" : "").size(), 1U);
+  EXPECT_EQ(bob->read(kept), "late");
 }
 
 TEST_F(ShareLeavingTest, AFolderThatAnEarlierProcessTookAwayComesBackWithWhatIsInIt) {

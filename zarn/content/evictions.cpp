@@ -65,7 +65,7 @@ NSErrorRef compareContent(const ContentCore& core, Departure& departure, int fil
   const bool mayBeSame = content.stamp.hasSameContent(departure.before);
   const auto store = core.storeOf(content.account);
   FileDescriptor stored;
-  const NSErrorRef error = store && mayBeSame ? store->open(*content.content, stored) : nullptr;
+  NSErrorRef error = store && mayBeSame ? store->open(*content.content, stored) : nullptr;
   // Nobody knows then whether it will be there when it is back.
   if (isOutOfReach(error)) return error;
   if (error) {

@@ -99,6 +99,18 @@ class SharingDrivesTest : public testing::Test {
     EXPECT_EQ(ann->shares().save(changed, saved), nullptr);
     return saved;
   }
+  /// Ann's folder with a document, which Bob has accepted and may change.
+  void shareDocument() {
+    fs::create_directory(ann->at("Plans"));
+    ann->write("Plans/a.txt", text);
+    const auto saved = share("Plans", RZShareParticipantPermission::ReadWrite);
+    ASSERT_NE(saved, nullptr);
+    ASSERT_EQ(bob->shares().accept(*saved->URL(), accepted), nullptr);
+    ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
+  }
+
+  const std::string text = std::string(10'000, 'x') + "end";
+  std::string accepted;  ///< the folder's identifier at Bob's
 
  private:
   TemporaryDirectory directory_;
@@ -109,17 +121,10 @@ class SharingDrivesTest : public testing::Test {
 };
 
 TEST_F(SharingDrivesTest, AFolderIsSharedReadWrittenAndSharedNoLonger) {
-  const std::string text = std::string(10'000, 'x') + "end";
-  fs::create_directory(ann->at("Plans"));
-  ann->write("Plans/a.txt", text);
-  const auto saved = share("Plans", RZShareParticipantPermission::ReadWrite);
-  ASSERT_NE(saved, nullptr);
-  std::string identifier;
-  ASSERT_EQ(bob->shares().accept(*saved->URL(), identifier), nullptr);
+  shareDocument();
   const auto row = ann->drive->store->itemAtPath(ann->at("Plans"));
   ASSERT_TRUE(row);
-  EXPECT_EQ(identifier, itemIdentifier(row->id, row->kind));
-  ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
+  EXPECT_EQ(accepted, itemIdentifier(row->id, row->kind));
   EXPECT_EQ(bob->read("Plans/a.txt"), text);
   bob->write("Plans/b.txt", "by bob");
   ASSERT_TRUE(waitUntil([&] { return ann->has("Plans/b.txt"); }));
@@ -138,13 +143,7 @@ TEST_F(SharingDrivesTest, AFolderIsSharedReadWrittenAndSharedNoLonger) {
 }
 
 TEST_F(SharingDrivesTest, WhatAnEditorDeletesIsInItsOwnersTrash) {
-  const std::string text = std::string(10'000, 'x') + "end";
-  fs::create_directory(ann->at("Plans"));
-  ann->write("Plans/a.txt", text);
-  const auto saved = share("Plans", RZShareParticipantPermission::ReadWrite);
-  std::string identifier;
-  ASSERT_EQ(bob->shares().accept(*saved->URL(), identifier), nullptr);
-  ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
+  shareDocument();
   fs::remove(bob->at("Plans/a.txt"));
   ASSERT_TRUE(waitUntil([&] { return !ann->has("Plans/a.txt"); }));
   const std::string trashed = ann->drive->layout.trashFiles() + "/a.txt";
@@ -157,107 +156,27 @@ TEST_F(SharingDrivesTest, WhatAnEditorDeletesIsInItsOwnersTrash) {
   ASSERT_TRUE(waitUntil([&] { return bob->read("Plans/a.txt") == text; })) << "shared again";
 }
 
-/// Ann puts back what Bob has removed while her drive is still taking his removal over.
-class PutBackMeanwhileTest : public SharingDrivesTest {
- protected:
-  ~PutBackMeanwhileTest() override {
-    go("zarn.pull.placed");
-    FaultPoint::disarmAll();
-  }
-
-  void shareDocument() {
-    fs::create_directory(ann->at("Plans"));
-    ann->write("Plans/a.txt", text);
-    const auto saved = share("Plans", RZShareParticipantPermission::ReadWrite);
-    std::string identifier;
-    ASSERT_EQ(bob->shares().accept(*saved->URL(), identifier), nullptr);
-    ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
-    // Or else they would stop at what they have still to hear of.
-    const std::string all(NSFileProviderRootContainerItemIdentifier);
-    for (const auto& each : {ann.get(), bob.get()}) {
-      ASSERT_TRUE(each->drive->engine->waitUntilIdle(std::chrono::seconds(60)));
-      ASSERT_EQ(each->shares().refresh(all), nullptr);
-    }
-  }
-  void putBack() {
-    const std::string trashed = ann->drive->layout.trashFiles() + "/a.txt";
-    ASSERT_TRUE(waitUntil([&] { return fs::exists(trashed); }));
-    ASSERT_EQ(::rename(trashed.c_str(), ann->at("Plans/a.txt").c_str()), 0);
-  }
-  void stopAt(const std::string& point) const {
-    ASSERT_EQ(FaultPoint::arm(point + "=pause-until-file:" + gate(point)), nullptr);
-  }
-  void go(const std::string& point) const { std::ofstream(gate(point)).put('x'); }
-  [[nodiscard]] bool isSharedAgain() const {
-    return waitUntil([&] { return bob->read("Plans/a.txt") == text; });
-  }
-
-  const std::string text = std::string(10'000, 'x') + "end";
-
- private:
-  [[nodiscard]] std::string gate(const std::string& point) const {
-    return ann->drive->layout.home() + "/go-" + point;
-  }
-};
-
-TEST_F(PutBackMeanwhileTest, ItIsSharedAgainWhenItsUploadCameFirst) {
+TEST_F(SharingDrivesTest, WhatIsPutBackAndSeenToBeforeItsRemovalIsTakenOverIsSharedAgain) {
   shareDocument();
-  stopAt("zarn.pull.placed");
+  // Or else they would stop at what they have still to hear of.
+  const std::string all(NSFileProviderRootContainerItemIdentifier);
+  for (const auto& each : {ann.get(), bob.get()}) {
+    ASSERT_TRUE(each->drive->engine->waitUntilIdle(std::chrono::seconds(60)));
+    ASSERT_EQ(each->shares().refresh(all), nullptr);
+  }
+  const std::string gate = ann->drive->layout.home() + "/go";
+  ASSERT_EQ(FaultPoint::arm("zarn.pull.placed=pause-until-file:" + gate), nullptr);
   fs::remove(bob->at("Plans/a.txt"));
-  putBack();
-  ASSERT_TRUE(waitUntil([&] {
+  const std::string trashed = ann->drive->layout.trashFiles() + "/a.txt";
+  EXPECT_TRUE(waitUntil([&] { return fs::exists(trashed); }));
+  EXPECT_EQ(::rename(trashed.c_str(), ann->at("Plans/a.txt").c_str()), 0);
+  EXPECT_TRUE(waitUntil([&] {
     const auto row = ann->drive->store->itemAtPath(ann->at("Plans/a.txt"));
     return row && ann->drive->engine->waitUntilIdle(std::chrono::milliseconds(0));
   }));
-  go("zarn.pull.placed");
-  EXPECT_TRUE(isSharedAgain());
-}
-
-TEST_F(SharingDrivesTest, WhatAnEditorMovesOutAndBackIsWithItsOwnerAgain) {
-  const std::string text = std::string(10'000, 'x') + "end";
-  fs::create_directory(ann->at("Plans"));
-  ann->write("Plans/a.txt", text);
-  const auto saved = share("Plans", RZShareParticipantPermission::ReadWrite);
-  std::string identifier;
-  ASSERT_EQ(bob->shares().accept(*saved->URL(), identifier), nullptr);
-  ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
-  EXPECT_EQ(bob->read("Plans/a.txt"), text);
-  ASSERT_EQ(::rename(bob->at("Plans/a.txt").c_str(), bob->at("a.txt").c_str()), 0);
-  const std::string trashed = ann->drive->layout.trashFiles() + "/a.txt";
-  ASSERT_TRUE(waitUntil([&] { return fs::exists(trashed); }));
-  ASSERT_EQ(::rename(bob->at("a.txt").c_str(), bob->at("Plans/b.txt").c_str()), 0);
-  ASSERT_TRUE(waitUntil([&] { return ann->has("Plans/b.txt"); }));
-  EXPECT_EQ(ann->read("Plans/b.txt"), text);
-  EXPECT_FALSE(fs::exists(trashed)) << "it is the same document";
-  EXPECT_TRUE(bob->has("Plans/b.txt"));
-}
-
-TEST_F(SharingDrivesTest, AViewerIsRefusedAtEveryDoor) {
-  fs::create_directory(ann->at("Plans"));
-  ann->write("Plans/a.txt", "text");
-  const auto saved = share("Plans", RZShareParticipantPermission::ReadOnly);
-  std::string identifier;
-  ASSERT_EQ(bob->shares().accept(*saved->URL(), identifier), nullptr);
-  ASSERT_TRUE(waitUntil([&] { return bob->has("Plans/a.txt"); }));
-  bob->write("own.txt", "own");
-  NSErrorRef error;
-  const auto isRefused = [&] {
-    constexpr std::int64_t kNotAllowed = 513;
-    return error && error->is(NSCocoaErrorDomain, kNotAllowed);
-  };
-  EXPECT_FALSE(bob->drive->trash->trash(bob->at("Plans/a.txt"), [] { return false; }, &error));
-  EXPECT_TRUE(isRefused());
-  for (const auto& [from, to] :
-       std::vector<std::pair<std::string, std::string>>{{"Plans/a.txt", "Plans/b.txt"},
-                                                        {"Plans/a.txt", "a.txt"},
-                                                        {"own.txt", "Plans/own.txt"}}) {
-    error = nullptr;
-    (void)bob->drive->moves->capability(bob->at(from), bob->at(to), &error);
-    EXPECT_TRUE(isRefused()) << from << " to " << to;
-  }
-  error = nullptr;
-  (void)bob->drive->moves->capability(bob->at("Plans"), bob->at("Renamed"), &error);
-  EXPECT_EQ(error, nullptr) << "its own place is Bob's business";
+  std::ofstream(gate).put('x');
+  EXPECT_TRUE(waitUntil([&] { return bob->read("Plans/a.txt") == text; }));
+  FaultPoint::disarmAll();
 }
 
 }  // namespace

@@ -16,6 +16,8 @@ NSErrorRef cocoaError(std::int64_t code, const char* text, const NSErrorRef& cau
       {{NSLocalizedDescriptionKey, std::string(text)}, {NSUnderlyingErrorKey, cause}});
 }
 
+bool isOwn(const RZRecordZoneID& zone) { return zone.ownerName() == RZCurrentUserDefaultName; }
+
 RZRecordID recordIDOf(std::uint64_t item, const RZRecordZoneID& zone) {
   return {std::to_string(item), zone};
 }
@@ -100,10 +102,9 @@ NSErrorRef ContentStore::checkReachability() const {
 
 NSErrorRef ContentStore::checkRoom(const RZRecordZoneID& zone, std::uint64_t size,
                                    std::uint64_t replaced) const {
-  const bool isOwn = zone.ownerName() == RZCurrentUserDefaultName;
   RZQuota quota;
   if (NSErrorRef error =
-          engine_->fetchQuota(isOwn ? database_.accountName : zone.ownerName(), quota)) {
+          engine_->fetchQuota(isOwn(zone) ? database_.accountName : zone.ownerName(), quota)) {
     return contentError(std::move(error));
   }
   const std::uint64_t growth = size > replaced ? size - replaced : 0;
@@ -146,8 +147,7 @@ RZDatabaseID ContentStore::databaseOf(RZDatabaseScope scope) const {
 }
 
 RZDatabaseID ContentStore::databaseOf(const RZRecordZoneID& zone) const {
-  const bool isOwn = zone.ownerName() == RZCurrentUserDefaultName;
-  return databaseOf(isOwn ? RZDatabaseScope::Private : RZDatabaseScope::Shared);
+  return databaseOf(isOwn(zone) ? RZDatabaseScope::Private : RZDatabaseScope::Shared);
 }
 
 NSErrorRef ContentStore::makeZones(const RZRecordBatch& batch) {

@@ -3,7 +3,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/mman.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,6 +11,7 @@
 #include <utility>
 
 #include "platform/drawing/drawable_types.h"
+#include "platform/foundation/background_thread.h"
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/log.h"
@@ -27,7 +27,6 @@ constexpr std::size_t kTogether = 64;
 /// What waits beyond that is found when its folder is listed.
 constexpr std::size_t kLooks = 10'000;
 constexpr int kDeepest = 256;
-constexpr int kNiceness = 10;
 using Flavour = ThumbnailCache::Flavour;
 /// What file managers look for. Larger ones would take as much room as the pictures themselves.
 constexpr std::array kFlavours{Flavour::Large, Flavour::Normal};
@@ -124,8 +123,7 @@ bool DesktopThumbnails::isEnding() {
 }
 
 void DesktopThumbnails::run() {
-  // Of this thread alone; nobody waits for it.
-  (void)setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kNiceness);
+  giveWayToOthers();
   for (;;) {
     lookAtNoted();
     {

@@ -8,6 +8,7 @@
 #include <thread>
 #include <utility>
 
+#include "platform/foundation/background_thread.h"
 #include "platform/foundation/date.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/lock.h"
@@ -95,6 +96,7 @@ class Drive::Housekeeping {
   }
 
   void run() {
+    giveWayToOthers();
     while (true) {
       signals_->expire(NSDate::now().nanoseconds());
       while (scanner_->stampSome(kStamps) != 0) {

@@ -7,6 +7,7 @@
 #include <thread>
 #include <utility>
 
+#include "platform/foundation/background_thread.h"
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
@@ -113,7 +114,9 @@ class Engine final : public ContentEngine {
   }
 
  private:
-  void addWorkers(JobKind kind, std::size_t count, const JobQueue::Portion& atOnce,
+  /// Whether somebody waits for what a worker does.
+  enum class Urgency { Asked, Background };
+  void addWorkers(JobKind kind, std::size_t count, Urgency urgency, const JobQueue::Portion& atOnce,
                   const Work& work);
   void watchStore();
   void end();
@@ -128,10 +131,11 @@ class Engine final : public ContentEngine {
   bool isEnding_ GUARDED_BY(mutex_) = false;
 };
 
-void Engine::addWorkers(JobKind kind, std::size_t count, const JobQueue::Portion& atOnce,
-                        const Work& work) {
+void Engine::addWorkers(JobKind kind, std::size_t count, Urgency urgency,
+                        const JobQueue::Portion& atOnce, const Work& work) {
   for (std::size_t i = 0; i < count; ++i) {
-    threads_.emplace_back([core = core_, kind, atOnce, work] {
+    threads_.emplace_back([core = core_, kind, urgency, atOnce, work] {
+      if (urgency == Urgency::Background) giveWayToOthers();
       for (;;) {
         const auto jobs = core->queue->take(kind, atOnce);
         if (jobs.empty()) return;
@@ -146,14 +150,15 @@ void Engine::addWorkers(JobKind kind, std::size_t count, const JobQueue::Portion
 
 void Engine::start() {
   const Options& options = core_->options;
-  addWorkers(JobKind::Upload, options.uploadWorkers, kUploadsAtOnce, withNothingAfter(doUploads));
-  addWorkers(JobKind::Download, options.downloadWorkers, kDownloadsAtOnce,
+  using enum Urgency;
+  addWorkers(JobKind::Upload, options.uploadWorkers, Background, kUploadsAtOnce,
+             withNothingAfter(doUploads));
+  addWorkers(JobKind::Download, options.downloadWorkers, Asked, kDownloadsAtOnce,
              withNothingAfter(doDownloads));
-  addWorkers(JobKind::Evict, options.evictWorkers, kEvictionsAtOnce, doEvictions);
-  addWorkers(JobKind::Settle, 1, kSettlingAtOnce, withNothingAfter(doSettling));
-  addWorkers(JobKind::Spread, 1, kSpreadingAtOnce, withNothingAfter(doSpreading));
-  // One: nobody waits for what it does.
-  addWorkers(JobKind::Thumbnail, 1, kThumbnailsAtOnce, withNothingAfter(doThumbnails));
+  addWorkers(JobKind::Evict, options.evictWorkers, Asked, kEvictionsAtOnce, doEvictions);
+  addWorkers(JobKind::Settle, 1, Background, kSettlingAtOnce, withNothingAfter(doSettling));
+  addWorkers(JobKind::Spread, 1, Background, kSpreadingAtOnce, withNothingAfter(doSpreading));
+  addWorkers(JobKind::Thumbnail, 1, Background, kThumbnailsAtOnce, withNothingAfter(doThumbnails));
   threads_.emplace_back([this] { watchStore(); });
   shares_->start();
   if (!core_->database().needsFirstScan()) sweep();

@@ -176,6 +176,7 @@ NSErrorRef Scanner::State::reconcile(ScanReport& report) {
   ScanSession session(store->database(), links, visitor);
   session.setComparesEverything();
   for (const ScanPlace& place : places) session.setFolderOfVisit(place.visit, place.id);
+  const std::uint64_t rankBefore = store->database()->currentRank();
   {
     WalkingThread<std::unique_ptr<FolderSnapshot>> walk(
         walkerOptions(false), places,
@@ -187,7 +188,11 @@ NSErrorRef Scanner::State::reconcile(ScanReport& report) {
   }
   NSErrorRef error = session.finish();
   report.changes = session.changes();
-  if (!error) error = settle(session.takeConflicts());
+  std::vector<DirtyFolder> conflicts = session.takeConflicts();
+  const bool isAsBefore = conflicts.empty() && store->database()->currentRank() == rankBefore;
+  // Where nothing has changed meanwhile, nothing was missed: no need to look at all rows.
+  if (error || isAsBefore) return error;
+  error = settle(std::move(conflicts));
   return error ? error : tellMissed(session);
 }
 

@@ -3,7 +3,6 @@
 #include <fnmatch.h>
 
 #include <algorithm>
-#include <cctype>
 #include <charconv>
 #include <fstream>
 #include <map>
@@ -18,8 +17,9 @@ constexpr const char* kSystemGlobs = "/usr/share/mime/globs2";
 
 std::string lowered(std::string_view text) {
   std::string result(text);
-  std::transform(result.begin(), result.end(), result.begin(),
-                 [](unsigned char c) { return static_cast<char>(c < 0x80 ? std::tolower(c) : c); });
+  std::transform(result.begin(), result.end(), result.begin(), [](char c) {
+    return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
+  });
   return result;
 }
 
@@ -53,6 +53,29 @@ bool hasWildcard(std::string_view pattern) {
   return pattern.find_first_of("*?[") != std::string_view::npos;
 }
 
+/// A text that every match of a pattern contains: the longest one before any bracket or backslash.
+std::string_view literalOf(std::string_view pattern) {
+  pattern = pattern.substr(0, pattern.find_first_of("[\\"));
+  std::string_view longest;
+  while (!pattern.empty()) {
+    const std::size_t end = std::min(pattern.find_first_of("*?"), pattern.size());
+    if (end > longest.size()) longest = pattern.substr(0, end);
+    pattern.remove_prefix(std::min(end + 1, pattern.size()));
+  }
+  return longest;
+}
+
+/// A pattern that is neither a name nor a suffix.
+struct Glob {
+  GlobLine line;
+  std::string literal;  ///< spares most names the pattern
+
+  [[nodiscard]] bool matches(const std::string& text) const {
+    return text.find(literal) != std::string::npos &&
+           fnmatch(line.pattern.c_str(), text.c_str(), 0) == 0;
+  }
+};
+
 }  // namespace
 
 const std::string ContentTypes::kFolder = "inode/directory";
@@ -74,7 +97,7 @@ struct ContentTypes::Table {
   // Apart by whether letters' case counts; keys of the others are in lower case.
   ByText exactNames[2];
   ByText exactSuffixes[2];
-  std::vector<GlobLine> globs;
+  std::vector<Glob> globs;
 
   void add(GlobLine line) {
     if (!line.isCaseSensitive) line.pattern = lowered(line.pattern);
@@ -85,7 +108,8 @@ struct ContentTypes::Table {
     } else if (!hasWildcard(line.pattern)) {
       exactNames[line.isCaseSensitive].try_emplace(line.pattern, line);
     } else {
-      globs.push_back(std::move(line));
+      std::string literal(literalOf(line.pattern));
+      globs.push_back({std::move(line), std::move(literal)});
     }
   }
 
@@ -108,9 +132,8 @@ struct ContentTypes::Table {
       look(exactSuffixes[true], name.substr(dot), best);
       look(exactSuffixes[false], lower.substr(dot), best);
     }
-    for (const GlobLine& glob : globs) {
-      const std::string& text = glob.isCaseSensitive ? name : lower;
-      if (fnmatch(glob.pattern.c_str(), text.c_str(), 0) == 0) consider(glob, best);
+    for (const Glob& glob : globs) {
+      if (glob.matches(glob.line.isCaseSensitive ? name : lower)) consider(glob.line, best);
     }
     return best;
   }

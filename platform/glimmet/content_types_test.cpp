@@ -21,6 +21,9 @@ class ContentTypesTest : public testing::Test {
                            "50:text/x-makefile:makefile\n"
                            "10:text/x-readme:readme*\n"
                            "60:image/x-special:*.gz.img\n"
+                           "50:text/x-page:*.[1-9]\n"
+                           "50:text/x-part:*.p?rt[0-9]\n"
+                           "50:text/x-star:*\\*\n"
                            "malformed\nx:y:z\n50:\n";
     types_ = std::make_unique<ContentTypes>(path);
   }
@@ -43,6 +46,14 @@ TEST_F(ContentTypesTest, KnowsWholeNamesAndGlobs) {
   EXPECT_EQ(types_->typeForName("Makefile"), "text/x-makefile");
   EXPECT_EQ(types_->typeForName("README.first"), "text/x-readme");
   EXPECT_EQ(types_->typeForName("readme.gz"), "application/gzip");
+}
+
+TEST_F(ContentTypesTest, KnowsGlobsOfEveryForm) {
+  EXPECT_EQ(types_->typeForName("ls.1"), "text/x-page");
+  EXPECT_EQ(types_->typeForName("ls.0"), ContentTypes::kUnknown);
+  EXPECT_EQ(types_->typeForName("a.PART7"), "text/x-part");
+  EXPECT_EQ(types_->typeForName("a.part"), ContentTypes::kUnknown);
+  EXPECT_EQ(types_->typeForName("all*"), "text/x-star");
 }
 
 TEST_F(ContentTypesTest, FallsBackForTheRest) {

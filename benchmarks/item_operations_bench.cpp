@@ -15,6 +15,7 @@
 #include "benchmarks/figure.h"
 #include "benchmarks/many_files.h"
 #include "benchmarks/process_use.h"
+#include "benchmarks/quiet_drive.h"
 #include "platform/fileprovider/constants.h"
 #include "platform/foundation/lock.h"
 #include "tests/harness/test_drive.h"
@@ -99,7 +100,7 @@ class Operations {
 
   /// What is left when all is done: nothing is to be used without a reason.
   [[nodiscard]] bool printRest() {
-    waitUntilSettled();
+    bench::waitUntilQuiet(drive_);
     const pid_t zarn = drive_.pidOf(testing::TestDrive::Process::Zarn);
     const pid_t extension = drive_.pidOf(testing::TestDrive::Process::Extension);
     constexpr int kIdleSeconds = 10;
@@ -142,7 +143,7 @@ class Operations {
       return !error && items.size() == count;
     };
     require(testing::eventually(areThere, kPatience), "the files are not all seen");
-    waitUntilSettled();
+    bench::waitUntilQuiet(drive_);
     return items;
   }
 
@@ -157,15 +158,6 @@ class Operations {
         changes_->createDirectory(name, NSFileProviderRootContainerItemIdentifier);
     require(made.item.has_value(), "no folder can be made");
     return made.item->identifier;
-  }
-
-  void waitUntilSettled() {
-    const auto isSettled = [&] {
-      const nlohmann::json status = drive_.status();
-      return status.is_object() && status.contains("transfers") &&
-             status["transfers"]["waiting"] == 0 && status["transfers"]["under_way"].empty();
-    };
-    require(testing::eventually(isSettled, kPatience), "transfers do not end");
   }
 
   void measure(bench::Repeated& measured, const std::vector<Item>& items,

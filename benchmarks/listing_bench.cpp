@@ -9,6 +9,7 @@
 
 #include "benchmarks/figure.h"
 #include "benchmarks/many_files.h"
+#include "benchmarks/quiet_drive.h"
 #include "platform/fileprovider/constants.h"
 #include "tests/harness/test_drive.h"
 #include "yomber/drive_client.h"
@@ -123,9 +124,7 @@ int main() {
   testing::TestDrive drive;
   bench::makeFiles(drive.root(), count);
   drive.up();
-  const auto isScanned = [&] { return drive.status()["zarn"]["scanning"] == false; };
-  if (!testing::eventually(isScanned, std::chrono::minutes(10)))
-    throw std::runtime_error("the scan did not end");
+  bench::waitUntilQuiet(drive);
   (void)bench::findSeconds(drive.root());
 
   DriveClient client(DrivePaths::forHome(drive.home()));

@@ -19,6 +19,7 @@
 
 #include "benchmarks/figure.h"
 #include "benchmarks/many_files.h"
+#include "benchmarks/quiet_drive.h"
 #include "tests/harness/mounted_drive.h"
 
 namespace {
@@ -267,14 +268,7 @@ int main() {
   if (rclone.isMounted()) sides["rclone"] = rclone.folder();
 
   // What is uploaded meanwhile is not what is measured.
-  const auto waitUntilUploaded = [&drive] {
-    (void)testing::eventually(
-        [&] {
-          const auto transfers = drive.drive().status().at("transfers");
-          return transfers.at("waiting") == 0 && transfers.at("under_way").empty();
-        },
-        std::chrono::minutes(10));
-  };
+  const auto waitUntilUploaded = [&drive] { bench::waitUntilQuiet(drive.drive()); };
   std::map<std::string, std::map<std::string, bench::Repeated>> measured;
   for (std::size_t round = 0; round < sizes.rounds; ++round) {
     std::fprintf(stderr, "mount_bench: round %zu of %zu\n", round + 1, sizes.rounds);

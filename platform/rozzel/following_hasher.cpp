@@ -44,7 +44,7 @@ class FollowingHasher::Worker {
       changed_.notifyAll();
     }
     if (!thread_.joinable()) thread_ = std::thread([this] { follow(); });
-    waitUntilLeft(kLead);
+    keepLead();
   }
 
   void skipped(std::uint64_t count) {
@@ -66,7 +66,18 @@ class FollowingHasher::Worker {
   /// Waits until at most `count` bytes wait for the hash.
   void waitUntilLeft(std::uint64_t count) {
     LockGuard guard(mutex_);
+    wait(count);
+  }
+  /// Once the hash is too far behind, it catches up by half: to be woken for each piece would cost
+  /// both threads more than the hash.
+  void keepLead() {
+    LockGuard guard(mutex_);
+    if (written_ - hashed_ > kLead) wait(kLead / 2);
+  }
+  void wait(std::uint64_t count) REQUIRES(mutex_) {
+    awaited_ = count;
     while (written_ - hashed_ > count) changed_.wait(mutex_);
+    awaited_ = 0;
   }
 
   void follow() {
@@ -77,7 +88,7 @@ class FollowingHasher::Worker {
       LockGuard guard(mutex_);
       hashed_ += next->length;
       if (failure && !failure_) failure_ = std::move(failure);
-      changed_.notifyAll();
+      if (written_ - hashed_ <= awaited_) changed_.notifyAll();
     }
   }
 
@@ -106,6 +117,7 @@ class FollowingHasher::Worker {
   Condition changed_;
   std::uint64_t written_ GUARDED_BY(mutex_) = 0;
   std::uint64_t hashed_ GUARDED_BY(mutex_) = 0;
+  std::uint64_t awaited_ GUARDED_BY(mutex_) = 0;  ///< the writer waits until so many are left
   NSErrorRef failure_ GUARDED_BY(mutex_);
   bool isEnding_ GUARDED_BY(mutex_) = false;
 

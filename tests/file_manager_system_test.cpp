@@ -12,6 +12,7 @@
 #include <fstream>
 #include <iterator>
 #include <string>
+#include <utility>
 
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
@@ -139,6 +140,9 @@ class FileManager : public ::testing::Test {
     return result;
   }
 
+  /// How many uploads, downloads and evictions there have been.
+  std::size_t transfers() { return mounted_.drive().status().at("transfers").at("finished"); }
+
   const int count_ = documents();
   DesktopFolders folders_;
   MountedDrive mounted_;
@@ -155,11 +159,18 @@ TEST_F(FileManager, ShowsThePicturesOfWhatIsAwayAndDownloadsNothing) {
   const Screen screen;
   ASSERT_NE(screen.display(), "");
   ASSERT_EQ(screen.magentaPixels(), 0U);
+  const std::size_t before = transfers();
   const LineProcess manager({"/usr/bin/env", "pcmanfm", mounted_.at("mixed")},
                             {{"DISPLAY", screen.display()}});
   constexpr std::size_t kOnePicture = 1000;
-  EXPECT_TRUE(eventually([&] { return screen.magentaPixels() > kOnePicture; }));
+  std::size_t seen = 0;
+  const auto areAllShown = [&] {
+    const std::size_t pixels = screen.magentaPixels();
+    return std::exchange(seen, pixels) == pixels && pixels > 5 * kOnePicture;
+  };
+  EXPECT_TRUE(eventually(areAllShown)) << seen;
   EXPECT_EQ(away(), count_);
+  EXPECT_EQ(transfers(), before);
 }
 
 }  // namespace

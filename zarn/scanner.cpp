@@ -189,9 +189,9 @@ NSErrorRef Scanner::State::reconcile(ScanReport& report) {
   NSErrorRef error = session.finish();
   report.changes = session.changes();
   std::vector<DirtyFolder> conflicts = session.takeConflicts();
-  const bool isAsBefore = conflicts.empty() && store->database()->currentRank() == rankBefore;
+  const bool isUnchanged = conflicts.empty() && store->database()->currentRank() == rankBefore;
   // Where nothing has changed meanwhile, nothing was missed: no need to look at all rows.
-  if (error || isAsBefore) return error;
+  if (error || isUnchanged) return error;
   error = settle(std::move(conflicts));
   return error ? error : tellMissed(session);
 }

@@ -51,12 +51,22 @@ std::string bashScript(const CLI::App& app) {
   return out.str();
 }
 
+/// As one word of a fish script.
+std::string quotedForFish(const std::string& text) {
+  std::string result = "'";
+  for (const char c : text) {
+    if (c == '\'' || c == '\\') result += '\\';
+    result += c;
+  }
+  return result + "'";
+}
+
 std::string fishScript(const CLI::App& app) {
   std::ostringstream out;
   out << "# Completion of yomber for fish.\n";
   for (const CLI::App* command : app.get_subcommands([](const CLI::App*) { return true; })) {
-    out << "complete -c yomber -n __fish_use_subcommand -a " << command->get_name() << " -d '"
-        << command->get_description() << "'\n";
+    out << "complete -c yomber -n __fish_use_subcommand -a " << command->get_name() << " -d "
+        << quotedForFish(command->get_description()) << "\n";
     for (const CLI::Option* option : command->get_options()) {
       for (const std::string& name : option->get_lnames()) {
         out << "complete -c yomber -n '__fish_seen_subcommand_from " << command->get_name()

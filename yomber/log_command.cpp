@@ -1,10 +1,14 @@
 #include <algorithm>
+#include <array>
+#include <cstdint>
 #include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <map>
+#include <tuple>
 #include <vector>
 
+#include <fcntl.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -43,27 +47,25 @@ class LogFiles {
   }
 
  private:
-  struct Position {
-    ino_t file = 0;
-    std::streamoff offset = 0;
-  };
+  /// Its inode and birth: a full file goes on under another name.
+  using File = std::tuple<std::uint64_t, std::int64_t, std::uint32_t>;
 
   void readNew(const fs::path& path, std::vector<std::string>& lines) {
-    struct stat now{};
-    if (stat(path.c_str(), &now) != 0) return;
-    Position& position = positions_[path.string()];
-    const bool rotated = position.file != now.st_ino || position.offset > now.st_size;
-    if (rotated) position = {now.st_ino, 0};
+    struct statx now{};
+    if (statx(AT_FDCWD, path.c_str(), 0, STATX_INO | STATX_SIZE | STATX_BTIME, &now) != 0) return;
+    std::streamoff& end = ends_[File(now.stx_ino, now.stx_btime.tv_sec, now.stx_btime.tv_nsec)];
+    // Where births are not known: another file that has got the number of one that went.
+    if (static_cast<std::uint64_t>(end) > now.stx_size) end = 0;
     std::ifstream file(path);
-    file.seekg(position.offset);
+    file.seekg(end);
     for (std::string line; std::getline(file, line) && !file.eof();) {
-      position.offset += static_cast<std::streamoff>(line.size()) + 1;
+      end += static_cast<std::streamoff>(line.size()) + 1;
       lines.push_back(std::move(line));
     }
   }
 
   const std::string directory_;
-  std::map<std::string, Position> positions_;
+  std::map<File, std::streamoff> ends_;
 };
 
 void print(const std::vector<std::string>& lines, std::size_t last) {
@@ -96,7 +98,8 @@ void showFiles(CommandContext& context, const DrivePaths& paths, const LogOption
 void showJournal(CommandContext& context, const DrivePaths& paths, const LogOptions& options) {
   std::vector<std::string> words{"journalctl", "--no-pager", "--output=short-iso-precise",
                                  "--lines=" + std::to_string(options.lines)};
-  for (const char* program : {"zarn", "fileproviderd", "qs-fileprovider", "supervisor"}) {
+  for (const char* program : {"zarn", "fileproviderd", "qs-fileprovider", "supervisor",
+                              "yomber-mount", "mount-supervisor"}) {
     words.push_back("--identifier=" + journalIdentifier(program, paths));
   }
   if (options.follow) words.emplace_back("--follow");

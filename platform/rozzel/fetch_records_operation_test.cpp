@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/gate.h"
 #include "platform/foundation/lock.h"
 #include "platform/rozzel/test_store.h"
@@ -48,6 +49,8 @@ struct Fetch {
 
 class FetchRecordsOperationTest : public testing::Test {
  protected:
+  ~FetchRecordsOperationTest() override { FaultPoint::disarmAll(); }
+
   std::shared_ptr<RZFetchRecordsOperation> operationFor(std::vector<std::string> names,
                                                         const RZRecordZoneID& zone = kZone) {
     auto operation = std::make_shared<RZFetchRecordsOperation>();
@@ -152,6 +155,25 @@ TEST_F(FetchRecordsOperationTest, AStoreThatGoesAwayInTheMiddleFailsWhatIsLeft) 
   ASSERT_EQ(fetch_.names(), names);
   EXPECT_NE(deliveries.front().record, nullptr);
   EXPECT_TRUE(rz_isError(deliveries.back().error, RZErrorNetworkUnavailable));
+  EXPECT_TRUE(rz_isError(fetch_.onlyEnding(), RZErrorNetworkUnavailable));
+}
+
+TEST_F(FetchRecordsOperationTest, DoesNotAskAgainAfterAPartThatFailed) {
+  const auto names = saveMany(600);
+  whenDelivered = [](const RZRecordID& id) {
+    if (id.recordName() == "r0") {
+      EXPECT_EQ(FaultPoint::arm("rozzel.fetch.part=error"), nullptr);
+    } else if (id.recordName() == "r8") {
+      FaultPoint::disarmAll();
+    }
+  };
+  run(operationFor(names));
+  const auto deliveries = fetch_.all();
+  ASSERT_EQ(fetch_.names(), names);
+  for (std::size_t i = 0; i < deliveries.size(); ++i) {
+    ASSERT_EQ(deliveries[i].record != nullptr, i < 8) << names[i];
+    ASSERT_EQ(rz_isError(deliveries[i].error, RZErrorNetworkUnavailable), i >= 8) << names[i];
+  }
   EXPECT_TRUE(rz_isError(fetch_.onlyEnding(), RZErrorNetworkUnavailable));
 }
 

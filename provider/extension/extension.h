@@ -128,12 +128,13 @@ class QSFileProviderExtension : public NSFileProviderExtension,
       std::shared_ptr<std::vector<std::shared_ptr<RZFetchRecordsOperation>>>;
   using ThumbnailZones = std::shared_ptr<std::vector<RZRecordZoneID>>;
   /// Runs the operations one after the other, each in the database that has its zone; they are
-  /// taken from the arrays. The completion gets the last error.
-  void launchNewFetchThumbnailOperationFrom(const ThumbnailOperations& operations,
-                                            const ThumbnailZones& withZoneIDs,
-                                            const std::shared_ptr<RZContainer>& inContainer,
-                                            const NSErrorRef& previousError,
-                                            const ErrorHandler& completionHandler);
+  /// taken from the arrays, which a subclass may look at before. The completion gets the last
+  /// error.
+  virtual void launchNewFetchThumbnailOperationFrom(const ThumbnailOperations& operations,
+                                                    const ThumbnailZones& withZoneIDs,
+                                                    const std::shared_ptr<RZContainer>& inContainer,
+                                                    const NSErrorRef& previousError,
+                                                    const ErrorHandler& completionHandler);
 
   /// The largest square in both the size and what containers' icons are shown at.
   [[nodiscard]] CGSize _properSizeForContainerThumbnail(CGSize size);

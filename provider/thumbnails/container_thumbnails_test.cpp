@@ -3,6 +3,7 @@
 
 #include <filesystem>
 
+#include "platform/foundation/notification_center.h"
 #include "provider/testing/thumbnail_fixture.h"
 
 namespace yomber {
@@ -10,14 +11,16 @@ namespace {
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
+using ::testing::SizeIs;
 
 class ContainerThumbnailsTest : public ThumbnailTest {
  protected:
-  void addContainer(const std::string& containerID, const std::string& iconName) {
+  void addContainer(const std::string& containerID, const std::string& iconName,
+                    std::uint64_t rawID = 7000) {
     const std::string documents = daemon.home() + "/tree/" + containerID + "/Documents";
     std::filesystem::create_directories(documents);
     daemon.addContainer({containerID, "App", documents, "org.example.App.desktop", iconName});
-    daemon.addItem(scriptedFolder(7000, "App"), documents);
+    daemon.addItem(scriptedFolder(rawID, "App"), documents);
   }
   ThumbnailAnswer thumbnailOf(const std::string& containerID, CGSize size) {
     extension->_fetchThumbnailForContainerID(
@@ -115,6 +118,40 @@ TEST_F(ContainerThumbnailsTest, ARequestForAContainersFolderNeedsNoRecords) {
       {"[DEBUG] width (300.00) is greater than max width (120.00)",
        "[DEBUG] width (120.00) and height (48.00) should be equal for container's thumbnail",
        "[DEBUG] no thumbnail left to fetch"});
+}
+
+TEST_F(ContainerThumbnailsTest, TheContainersAreAskedForOnceThoughTheirListChangesMeanwhile) {
+  writeFile(dataHome() + "/bare.png", png(32));
+  addContainer("org.example.App", "notes");
+  addContainer("org.example.Bare", dataHome() + "/bare.png", 7001);
+  Gate changed;
+  const auto observer = std::make_shared<int>(0);
+  NSNotificationCenter::defaultCenter().addObserver(observer, QSContainerListDidChangeNotification,
+                                                    [&] { changed.open(); });
+  whenAnswered = [&](const std::string& identifier) {
+    if (identifier != "i:7000") return;
+    daemon.postContainerListDidChange();  // the library forgets the list that it had
+    EXPECT_TRUE(changed.wait());
+  };
+  EXPECT_EQ(fetchAll({"i:7000", "i:7001"}), nullptr);
+  const auto answers = thumbnails->values();
+  ASSERT_THAT(answers, SizeIs(2));
+  EXPECT_EQ(answers[0].identifier, "i:7000");
+  EXPECT_EQ(answers[0].image(), png(48));
+  EXPECT_EQ(answers[0].type, std::nullopt);
+  EXPECT_EQ(answers[1].identifier, "i:7001");
+  EXPECT_EQ(answers[1].image(), png(32));
+  EXPECT_EQ(answers[1].type, "com.kelvo.fileprovider.qs-undecorated-container");
+  EXPECT_EQ(daemon.callCount("containers"), 1U);
+  NSNotificationCenter::defaultCenter().removeObserver(observer.get());
+}
+
+TEST_F(ContainerThumbnailsTest, ARequestWithoutAContainersFolderDoesNotAskForTheContainers) {
+  addFolder(20, "folder");
+  addRecord(10, "picture");
+  EXPECT_EQ(fetchAll({"i:20", "d:10", "rubbish"}), nullptr);
+  EXPECT_THAT(thumbnails->values(), SizeIs(3));
+  EXPECT_EQ(daemon.callCount("containers"), 0U);
 }
 
 }  // namespace

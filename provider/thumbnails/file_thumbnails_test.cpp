@@ -20,6 +20,7 @@ using Call = ScriptedDaemon::Call;
 constexpr const char* kNoneLeft = "[DEBUG] no thumbnail left to fetch";
 constexpr const char* kNonEmpty = "[DEBUG] no thumbnail found for a non-empty file";
 constexpr const char* kClosed = "[DEBUG] ┗# ";
+constexpr const char* kFinished = "[DEBUG] finished fetching all thumbnail batches";
 
 class FileThumbnailsTest : public ThumbnailTest {
  protected:
@@ -55,8 +56,9 @@ TEST_F(FileThumbnailsTest, AStoredThumbnailIsHandedOverWithoutAType) {
   EXPECT_EQ(answer.error, nullptr);
   expectLines({"[DEBUG] ┣# fetching the thumbnails for: {d:10 = 10 in zone (__currentUser__)}",
                callbackLine("d:10"), "[DEBUG] received a thumbnail of 9 bytes for d:10",
-               "[DEBUG] finished fetching all thumbnail batches"});
-  EXPECT_EQ(log.countContaining("starting fetch thumbnail for"), 1U);
+               kFinished});
+  EXPECT_EQ(log.texts().front(), startLine("(d:10)"));
+  EXPECT_TRUE(isClosed(startLine("(d:10)")));
 }
 
 TEST_F(FileThumbnailsTest, TheFetchSectionIsClosedOnceForEachRecord) {
@@ -64,9 +66,10 @@ TEST_F(FileThumbnailsTest, TheFetchSectionIsClosedOnceForEachRecord) {
   addRecord(11, "two");
   addRecord(12, "three");
   EXPECT_EQ(fetchAll({"d:10", "d:11", "d:12"}), nullptr);
-  ASSERT_TRUE(log.waitFor(LogLevel::Debug, "[DEBUG] finished fetching all thumbnail batches"));
+  ASSERT_TRUE(log.waitFor(LogLevel::Debug, kFinished));
   const auto section = log.sectionOf(callbackLine("d:10"));
   EXPECT_EQ(section % 2, 1U);
+  EXPECT_NE(section, log.sectionOf(startLine("(d:10, d:11, d:12)")));
   EXPECT_EQ(log.sectionOf(callbackLine("d:12")), section);
   std::array<char, 32> closing{};
   std::snprintf(closing.data(), closing.size(), "[DEBUG] ┗%llx ",
@@ -95,7 +98,9 @@ TEST_F(FileThumbnailsTest, WhatIsNoDocumentIsAnsweredAtOnceAndLeavesNothingToFet
   EXPECT_EQ(progress->totalUnitCount(), 0);
   const auto texts = log.texts();
   ASSERT_FALSE(texts.empty());
+  EXPECT_EQ(texts.front(), startLine("(i:20, rubbish, a:7, )"));
   EXPECT_EQ(texts.back(), kClosed);
+  EXPECT_TRUE(isClosed(texts.front()));
 }
 
 TEST_F(FileThumbnailsTest, ARequestForNothingCompletes) {
@@ -104,16 +109,21 @@ TEST_F(FileThumbnailsTest, ARequestForNothingCompletes) {
 }
 
 TEST_F(FileThumbnailsTest, ADaemonThatCannotTellTheRecordsFailsTheRequest) {
-  daemon.script([](ScriptedDaemon::Answers& answers) {
-    answers.contentRecords = [](const std::vector<std::string>&) {
-      return ScriptedDaemon::Records{
-          .records = {},
-          .error = NSError::errorWithDomain(QSOstrellErrorDomain, QSOstrellErrorLoggedOut)};
+  const auto refusal = NSError::errorWithDomain(QSOstrellErrorDomain, QSOstrellErrorLoggedOut);
+  daemon.script([refusal](ScriptedDaemon::Answers& answers) {
+    answers.contentRecords = [refusal](const std::vector<std::string>&) {
+      return ScriptedDaemon::Records{.records = {}, .error = refusal};
     };
   });
-  EXPECT_EQ(domainAndCode(fetchAll({"d:10"})), "NSFileProviderErrorDomain -1000");
-  EXPECT_THAT(thumbnails->values(), IsEmpty());
-  EXPECT_EQ(log.countContaining("[ERROR] can't get the record ids for "), 1U);
+  EXPECT_EQ(domainAndCode(fetchAll({"d:10", "rubbish", "d:11"})),
+            "NSFileProviderErrorDomain -1000");
+  EXPECT_EQ(onlyThumbnail().identifier, "rubbish");
+  EXPECT_EQ(log.count(LogLevel::Error, "[ERROR] can't get the record ids for (d:10, d:11): " +
+                                           refusal->description()),
+            1U);
+  EXPECT_EQ(log.countContaining("can't get the record ids"), 1U);
+  EXPECT_EQ(log.texts().back(), kClosed);
+  EXPECT_TRUE(isClosed(startLine("(d:10, rubbish, d:11)")));
 }
 
 TEST_F(FileThumbnailsTest, DocumentsThatTheDaemonDoesNotMapHaveNoThumbnail) {
@@ -128,6 +138,21 @@ TEST_F(FileThumbnailsTest, AnEmptyFileHasNoThumbnail) {
   EXPECT_EQ(onlyThumbnail().data, nullptr);
   EXPECT_EQ(onlyThumbnail().error, nullptr);
   expectLines({callbackLine("d:10"), "[DEBUG] empty record for d:10"});
+}
+
+TEST_F(FileThumbnailsTest, AnImageOfMoreThanEightMebibytesIsNone) {
+  constexpr std::size_t kMost = std::size_t{8} << 20U;
+  addRecord(10, std::string(kMost, 'x'));
+  addRecord(11, std::string(kMost + 1, 'x'));
+  EXPECT_EQ(fetchAll({"d:10", "d:11"}), nullptr);
+  const auto answers = thumbnails->values();
+  ASSERT_THAT(answers, SizeIs(2));
+  ASSERT_NE(answers[0].data, nullptr);
+  EXPECT_EQ(answers[0].data->length(), kMost);
+  EXPECT_EQ(answers[1].data, nullptr);
+  EXPECT_EQ(answers[1].error, nullptr);
+  expectLines(
+      {"[DEBUG] received a thumbnail of 8388608 bytes for d:10", callbackLine("d:11"), kNonEmpty});
 }
 
 TEST_F(FileThumbnailsTest, AFileWithoutAStoredThumbnailIsLeftAloneUpToTheThreshold) {
@@ -260,7 +285,6 @@ TEST_F(FileThumbnailsTest, FiftyThousandIdentifiersOfAllKindsAreAllAnswered) {
     identifiers.push_back("d:0" + std::to_string(i));
   }
   addRecords(records);
-  log.setLevel(LogLevel::Fault);
   std::size_t pictures = 0;
   std::size_t failures = 0;
   std::size_t nothing = 0;
@@ -276,6 +300,12 @@ TEST_F(FileThumbnailsTest, FiftyThousandIdentifiersOfAllKindsAreAllAnswered) {
   EXPECT_EQ(pictures, ofEachKind / 10);
   EXPECT_EQ(failures, 2 * ofEachKind);
   EXPECT_EQ(nothing, 2 * ofEachKind);
+  std::string list;
+  for (const auto& each : identifiers) list += (list.empty() ? "(" : ", ") + each;
+  EXPECT_TRUE(isClosed(startLine(list + ")")));
+  EXPECT_EQ(log.countContaining("received a thumbnail callback"), ofEachKind / 10);
+  EXPECT_EQ(log.countContaining("scheduling operation"), 1U);
+  EXPECT_EQ(log.count(LogLevel::Debug, kFinished), 1U);
 }
 
 }  // namespace

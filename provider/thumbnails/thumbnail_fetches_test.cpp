@@ -1,17 +1,20 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <fstream>
 
+#include "platform/foundation/fault_points.h"
 #include "platform/rozzel/fetch_records_operation.h"
 #include "provider/testing/thumbnail_fixture.h"
 
 namespace yomber {
 namespace {
 
-using ::testing::Each;
 using ::testing::ElementsAre;
+using ::testing::HasSubstr;
 using ::testing::IsEmpty;
+using ::testing::MatchesRegex;
 using ::testing::SizeIs;
 
 constexpr const char* kMoreThan =
@@ -19,8 +22,41 @@ constexpr const char* kMoreThan =
 constexpr const char* kFinished = "[DEBUG] finished fetching all thumbnail batches";
 constexpr const char* kNext = "[DEBUG] fetching next thumbnail batch";
 
+/// Keeps the fetches of a request as they were before the first one ran.
+class ThumbnailsWithPlan final : public QSFileProviderExtension {
+ public:
+  void launchNewFetchThumbnailOperationFrom(const ThumbnailOperations& operations,
+                                            const ThumbnailZones& withZoneIDs,
+                                            const std::shared_ptr<RZContainer>& inContainer,
+                                            const NSErrorRef& previousError,
+                                            const ErrorHandler& completionHandler) override {
+    if (fetches.empty()) {
+      fetches = *operations;
+      container = inContainer;
+    }
+    QSFileProviderExtension::launchNewFetchThumbnailOperationFrom(
+        operations, withZoneIDs, inContainer, previousError, completionHandler);
+  }
+
+  std::vector<std::shared_ptr<RZFetchRecordsOperation>> fetches;
+  std::shared_ptr<RZContainer> container;
+};
+
 class ThumbnailFetchesTest : public ThumbnailTest {
  protected:
+  ~ThumbnailFetchesTest() override { FaultPoint::disarmAll(); }
+
+  /// Two fetches of the three records of a zone, and one of another owner's.
+  std::shared_ptr<ThumbnailsWithPlan> fetchWithPlan() {
+    auto planned = std::make_shared<ThumbnailsWithPlan>();
+    extension = planned;
+    setBatchSize(2);
+    addRecords(sameThumbnails(3));
+    addRecord(10, "yours", 5, "other", "zone");
+    EXPECT_EQ(fetchAll({"d:1000", "d:1001", "d:1002", "d:10"}), nullptr);
+    EXPECT_THAT(planned->fetches, SizeIs(3));
+    return planned;
+  }
   std::vector<std::size_t> batchSizes(std::size_t count) {
     std::vector<RZRecordID> ids;
     for (std::size_t i = 0; i < count; ++i) {
@@ -31,6 +67,9 @@ class ThumbnailFetchesTest : public ThumbnailTest {
         ids, [&](const std::vector<RZRecordID>& batch) { sizes.push_back(batch.size()); });
     EXPECT_THAT(ids, IsEmpty());
     return sizes;
+  }
+  static std::string completedLine(const std::string& zone) {
+    return "[DEBUG] completed fetching thumbnail batch for " + zone;
   }
   static std::string failureLine(const std::string& zone, const std::string& error) {
     return "[ERROR] error while fetching thumbnail batch for " + zone + ": " + error;
@@ -86,15 +125,56 @@ TEST_F(ThumbnailFetchesTest, TwoZonesOfTwoOwnersAreFetchedOneAfterTheOther) {
   for (const auto& each : thumbnails->values()) images[each.identifier] = each.image();
   const std::map<std::string, std::string> expected{{"d:10", "mine"}, {"d:20", "yours"}};
   EXPECT_EQ(images, expected);
-  expectLines({"[DEBUG] completed fetching thumbnail batch for zone (__currentUser__)", kNext,
-               "[DEBUG] completed fetching thumbnail batch for zone (other)", kFinished});
+  expectLines(
+      {completedLine("zone (__currentUser__)"), kNext, completedLine("zone (other)"), kFinished});
+}
+
+TEST_F(ThumbnailFetchesTest, EveryFetchAsksForTheImageBeforeTheSizeAtOnceAndOnlyOnce) {
+  const auto planned = fetchWithPlan();
+  for (const auto& fetch : planned->fetches) {
+    ASSERT_TRUE(fetch->desiredKeys().has_value());
+    EXPECT_THAT(*fetch->desiredKeys(),
+                ElementsAre(kQSRecordKeyThumbnail1024x1024, kQSRecordKeySize));
+    EXPECT_EQ(static_cast<int>(fetch->qualityOfService()), 17);
+    EXPECT_EQ(fetch->configuration().discretionaryNetworkBehavior(), 0);
+    EXPECT_FALSE(fetch->configuration().automaticallyRetryNetworkFailures());
+  }
+}
+
+TEST_F(ThumbnailFetchesTest, EveryFetchIsTheDaemonsAndOfTheRequestsOneGroup) {
+  const auto planned = fetchWithPlan();
+  EXPECT_EQ(planned->container->sourceApplicationBundleIdentifier(), QSDaemonBundleID);
+  const auto group = planned->fetches.front()->group();
+  ASSERT_NE(group, nullptr);
+  EXPECT_EQ(group->name(), "download-thumbnails-user-initiated");
+  for (const auto& fetch : planned->fetches) {
+    EXPECT_EQ(fetch->configuration().sourceApplicationBundleIdentifier(), QSDaemonBundleID);
+    EXPECT_EQ(fetch->group(), group);
+  }
+}
+
+TEST_F(ThumbnailFetchesTest, EachFetchIsLoggedWithItsRecordsItsGroupAndItsZone) {
+  const auto planned = fetchWithPlan();
+  std::vector<std::string> fetches;
+  for (const auto& fetch : planned->fetches) fetches.push_back(fetch->description());
+  const std::string operation = "<yomber::RZFetchRecordsOperation: 0x[0-9a-f]+> of ";
+  const std::string group = " records \\(download-thumbnails-user-initiated\\)";
+  ASSERT_THAT(fetches, ElementsAre(MatchesRegex(operation + "3" + group),
+                                   MatchesRegex(operation + "3" + group),
+                                   MatchesRegex(operation + "1" + group)));
+  const std::string scheduling = "[DEBUG] scheduling operation ";
+  expectLines({scheduling + fetches[0] + " for zone: zone (__currentUser__)",
+               completedLine("zone (__currentUser__)"),
+               scheduling + fetches[1] + " for zone: zone (__currentUser__)",
+               completedLine("zone (__currentUser__)"),
+               scheduling + fetches[2] + " for zone: zone (other)", completedLine("zone (other)")});
 }
 
 TEST_F(ThumbnailFetchesTest, TheFailureOfABatchSticksWhenALaterOneSucceeds) {
   know(5, {"5", RZRecordZoneID("a zone that is gone")});
   addRecord(10, "picture", 5, "someone", "zone");
   const NSErrorRef error = fetchAll({"d:5", "d:10"});
-  EXPECT_EQ(domainAndCode(error), "RZErrorDomain 26");
+  ASSERT_EQ(domainAndCode(error), "RZErrorDomain 26");
   const auto answers = thumbnails->values();
   ASSERT_THAT(answers, SizeIs(2));
   EXPECT_EQ(answers[0].identifier, "d:5");
@@ -104,6 +184,49 @@ TEST_F(ThumbnailFetchesTest, TheFailureOfABatchSticksWhenALaterOneSucceeds) {
                       failureLine("a zone that is gone (__currentUser__)", error->description())),
             1U);
   EXPECT_EQ(log.count(LogLevel::Debug, kFinished), 1U);
+}
+
+TEST_F(ThumbnailFetchesTest, OfTwoFailuresTheLastIsToldThoughAThirdBatchSucceeds) {
+  know(5, {"5", RZRecordZoneID("a zone that is gone")});
+  addRecord(10, "ten", 5, "someone", "b");
+  addRecord(20, "twenty", 5, "someone", "c");
+  const std::string offline = daemon.home() + "/store/offline";
+  whenAnswered = [&](const std::string& identifier) {
+    if (identifier == "d:5") std::ofstream(offline) << "x";
+    if (identifier == "d:10") std::filesystem::remove(offline);
+  };
+  const NSErrorRef error = fetchAll({"d:5", "d:10", "d:20"});
+  ASSERT_EQ(domainAndCode(error), "RZErrorDomain 2");
+  const auto answers = thumbnails->values();
+  ASSERT_THAT(answers, SizeIs(3));
+  ASSERT_EQ(domainAndCode(answers[0].error), "RZErrorDomain 26");
+  EXPECT_EQ(domainAndCode(answers[1].error), "RZErrorDomain 2");
+  EXPECT_EQ(answers[2].image(), "twenty");
+  expectLines(
+      {failureLine("a zone that is gone (__currentUser__)", answers[0].error->description()), kNext,
+       failureLine("b (__currentUser__)", error->description()), kNext, kFinished});
+}
+
+TEST_F(ThumbnailFetchesTest, AFetchThatFailsIsFollowedByTheNextOneOfItsZone) {
+  setBatchSize(2);
+  addRecords(sameThumbnails(3));
+  ASSERT_EQ(FaultPoint::arm("rozzel.fetch.part=error"), nullptr);
+  whenAnswered = [](const std::string&) { FaultPoint::disarmAll(); };
+  const NSErrorRef error = fetchAll(identifiersOf(1000, 3));
+  ASSERT_EQ(domainAndCode(error), "RZErrorDomain 2");
+  EXPECT_THAT(error->description(), HasSubstr("the fetch was told to fail"));
+  std::vector<std::string> images;
+  std::vector<std::string> failures;
+  for (const auto& each : thumbnails->values()) {
+    images.push_back(each.image());
+    failures.push_back(domainAndCode(each.error));
+  }
+  EXPECT_THAT(images, ElementsAre("nil", "nil", "nil", "picture", "picture", "picture"));
+  const std::string unreachable = "RZErrorDomain 2";
+  EXPECT_THAT(failures, ElementsAre(unreachable, unreachable, unreachable, "nil", "nil", "nil"));
+  const std::string zone = "zone (__currentUser__)";
+  expectLines({completedLine(zone), failureLine(zone, error->description()), kNext,
+               completedLine(zone), kFinished});
 }
 
 TEST_F(ThumbnailFetchesTest, AStoreOutOfReachFailsEveryRecordAndTheRequest) {
@@ -145,6 +268,32 @@ TEST_F(ThumbnailFetchesTest, CancellingTheProgressCancelsEveryFetchOfTheRequest)
   EXPECT_EQ(log.countContaining("error while fetching thumbnail batch"), 3U);
   EXPECT_EQ(progress->totalUnitCount(), 0);
   EXPECT_EQ(progress->completedUnitCount(), 0);
+}
+
+TEST_F(ThumbnailFetchesTest, CancellingDuringTheSecondFetchLeavesTheFirstAndEndsTheOthers) {
+  setBatchSize(2);
+  addRecords(sameThumbnails(5));
+  Gate reached;
+  Gate goOn;
+  int answers = 0;
+  whenAnswered = [&](const std::string&) {
+    if (++answers != 6) return;  // each fetch asks for the five of the zone
+    reached.open();
+    EXPECT_TRUE(goOn.wait());
+  };
+  const auto progress = fetch(identifiersOf(1000, 5));
+  ASSERT_TRUE(reached.wait());
+  progress->cancel();
+  goOn.open();
+  const NSErrorRef error = only(errors);
+  ASSERT_EQ(domainAndCode(error), "NSCocoaErrorDomain 3072");
+  std::vector<std::string> delivered;
+  for (const auto& each : thumbnails->values()) delivered.push_back(each.identifier);
+  EXPECT_THAT(delivered, ElementsAre("d:1000", "d:1001", "d:1002", "d:1003", "d:1004", "d:1000"));
+  const std::string zone = "zone (__currentUser__)";
+  const std::string cancelled = failureLine(zone, error->description());
+  expectLines({completedLine(zone), kNext, completedLine(zone), cancelled, kNext,
+               completedLine(zone), cancelled, kFinished});
 }
 
 }  // namespace

@@ -22,6 +22,7 @@
 #include "protocols/daemon.capnp.h"
 #include "protocols/extension.capnp.h"
 #include "protocols/services.capnp.h"
+#include "protocols/sharing.capnp.h"
 #include "tests/fuzz/expect.h"
 #include "tests/fuzz/fixed_home.h"
 #include "tests/fuzz/hostile_input.h"
@@ -124,6 +125,27 @@ std::vector<Call> contentCallsOf(const std::string& path) {
           {"movingItem", given + ", destination = \"" + path + " moved\")"}};
 }
 
+/// `path` is a parameter of that name.
+std::vector<Call> sharingCallsAt(const std::string& path) {
+  const std::string share =
+      "(share = (zoneName = \"Documents\", zoneOwner = \"grace\", rootRecord = \"2001\", changeTag "
+      "= "
+      "\"1\", type = \"document\", title = \"item 2\", ownerName = \"grace\", participants = "
+      "[(userName = \"ada\", role = 3, permission = 2, acceptanceStatus = 1)], publicPermission = "
+      "1))";
+  return {{"checkIfShareable", "(rawID = 3000)"},
+          {"copyShare", "(" + path + ")"},
+          {"newShare", "(" + path + ")"},
+          {"saveShare", share},
+          {"destroyShare", share},
+          {"copyShareURL", "(" + path + ", documentType = \"text/plain\")"},
+          {"copyShareToken", "(" + path + ")"},
+          {"refreshSharingState", "(identifier = \"d:2001\")"},
+          {"shareOptions", "(identifier = \"d:2001\")"},
+          {"acceptShare", "(url = \"yomber-share:guessed\")"},
+          {"sharesWithMe", "()"}};
+}
+
 void addDaemonSeeds(const Corpus& corpus) {
   const auto daemon = Schema::from<Daemon>();
   const std::string root = kDaemonRoot;
@@ -164,6 +186,7 @@ void addDaemonSeeds(const Corpus& corpus) {
        {"setTagNames", "(" + path + ", names = [\"red\", \"green\"])"},
        {"contentState", "(" + path + ")"},
        {"transfers", "()"}});
+  corpus.addCallsBehind(daemon, "sharing", Schema::from<protocol::Sharing>(), sharingCallsAt(path));
   RpcScript watching;
   auto sender = watching.call(watching.bootstrap(), daemon, "getItemUpdateSender");
   sender.pointers = {0, 0};
@@ -186,6 +209,8 @@ void addControlSeeds(const Corpus& corpus) {
                             {"watch", "(container = \"" + root + "\")"},
                             {"status", "()"}});
   corpus.addCalls(control, contentCallsOf("/root/item7"));
+  corpus.addCalls(control, {{"services", "(identifier = \"item7\")"},
+                            {"service", "(identifier = \"item7\", name = \"test.workshop\")"}});
   corpus.addCallsBehind(control, "changes", Schema::from<protocol::Changes>(),
                         changesOf("item7", root));
   RpcScript listing;
@@ -205,6 +230,11 @@ void addExtensionSeeds(const Corpus& corpus) {
                               {"itemForIdentifier", "(identifier = \"i:3000\")"},
                               {"enumerator", "(container = \"i:3000\")"}});
   corpus.addCalls(extension, contentCallsOf("/tmp/item"));
+  corpus.addCalls(
+      extension,
+      {{"services", "(identifier = \"d:2001\", client = 0)"},
+       {"service",
+        "(identifier = \"d:2001\", name = \"com.kelvo.PandrelCollaboration\", client = 0)"}});
   corpus.addCallsBehind(extension, "changes", Schema::from<protocol::Changes>(),
                         changesOf("d:2001", "i:3000"));
   for (const char* const container : {"i:3000", "NSFileProviderRootContainerItemIdentifier",

@@ -121,6 +121,56 @@ TEST_F(ShareCommands, ALinkIsForEverybodyOnlyWhenItsOwnerSaysSo) {
   EXPECT_TRUE(info(ann_, "report.txt")["participants"][1]["link"].get<bool>());
 }
 
+TEST_F(ShareCommands, ASharedFolderHasItsServicesOnBothSides) {
+  ASSERT_EQ(ann_.yomber({"share", "add", "Plans", "bob"}).exitCode, 0);
+  ASSERT_NE(acceptedByBob(linkOf("Plans")), "");
+  const auto seen = info(bob_, "Plans");
+  EXPECT_EQ(seen["owner"], "ann");
+  EXPECT_EQ(seen["type"], "folder");
+  const auto people = bob_.json({"share", "participants", "Plans"});
+  ASSERT_THAT(people, SizeIs(2));
+  EXPECT_EQ(people[1]["name"], "bob");
+  EXPECT_EQ(people[1]["status"], "accepted");
+
+  ASSERT_EQ(bob_.yomber({"share", "stop", "Plans"}).exitCode, 0);
+  EXPECT_TRUE(eventually([&] { return bob_.names().empty(); }));
+  EXPECT_EQ(got(ann_, "Plans/one.txt"), "one");
+  ASSERT_TRUE(info(ann_, "Plans")["shared"].get<bool>());
+  ASSERT_EQ(ann_.yomber({"share", "stop", "Plans"}).exitCode, 0);
+  EXPECT_FALSE(info(ann_, "Plans")["shared"].get<bool>());
+}
+
+TEST_F(ShareCommands, AViewerChangesNothingUntilTheOwnerLetsHim) {
+  ASSERT_EQ(ann_.yomber({"share", "add", "Plans", "bob", "--role", "viewer"}).exitCode, 0);
+  ASSERT_NE(acceptedByBob(linkOf("Plans")), "");
+  ASSERT_TRUE(eventually([&] { return got(bob_, "Plans/one.txt") == "one"; }));
+  const ProcessResult renamed = bob_.yomber({"rename", "Plans/one.txt", "mine.txt"});
+  EXPECT_EQ(renamed.exitCode, kNotPermitted);
+  EXPECT_THAT(renamed.errors, HasSubstr("one.txt"));
+  EXPECT_EQ(bob_.yomber({"trash", "Plans/one.txt"}).exitCode, kNotPermitted);
+  EXPECT_EQ(bob_.yomber({"mkdir", "Plans/inside"}).exitCode, kNotPermitted);
+  EXPECT_EQ(bob_.names("Plans"), std::vector<std::string>{"one.txt"});
+
+  ASSERT_EQ(ann_.yomber({"share", "add", "Plans", "bob", "--role", "editor"}).exitCode, 0);
+  EXPECT_TRUE(eventually(
+      [&] { return bob_.yomber({"rename", "Plans/one.txt", "ours.txt"}).exitCode == 0; }));
+  EXPECT_TRUE(
+      eventually([&] { return ann_.names("Plans") == std::vector<std::string>{"ours.txt"}; }));
+}
+
+TEST_F(ShareCommands, WhoCameByTheLinkGoesWhenItIsClosed) {
+  const std::string link = linkOf("report.txt");
+  ASSERT_EQ(ann_.yomber({"share", "permission", "report.txt", "editor"}).exitCode, 0);
+  ASSERT_NE(acceptedByBob(link), "");
+  ASSERT_EQ(got(bob_, "report.txt"), "first");
+  bob_.write("report.txt", "second");
+  EXPECT_TRUE(eventually([&] { return got(ann_, "report.txt") == "second"; }));
+
+  ASSERT_EQ(ann_.yomber({"share", "permission", "report.txt", "none"}).exitCode, 0);
+  EXPECT_TRUE(eventually([&] { return bob_.names().empty(); }));
+  EXPECT_EQ(bob_.yomber({"share", "accept", link}).exitCode, kNotPermitted);
+}
+
 TEST_F(ShareCommands, WhoeverIsRemovedLosesTheItemAndWhoeverLeavesItToo) {
   ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "bob"}).exitCode, 0);
   const std::string link = linkOf("report.txt");

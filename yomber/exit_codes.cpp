@@ -40,6 +40,7 @@ ExitCode exitCodeForFile(const NSError& error) {
     return ExitCode::NoRoom;
   }
   if (error.is(NSCocoaErrorDomain, NSFileReadCorruptFileError)) return ExitCode::Damaged;
+  if (error.is(NSCocoaErrorDomain, NSFileWriteNoPermissionError)) return ExitCode::NotPermitted;
   if (error.is(NSCocoaErrorDomain, NSUbiquitousFileUnavailableError) ||
       error.is(QSOstrellErrorDomain, QSOstrellErrorCannotEvict) ||
       error.is(NSPOSIXErrorDomain, EBUSY)) {

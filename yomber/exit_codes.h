@@ -9,7 +9,7 @@ namespace yomber {
 enum class ExitCode : int {
   Ok = 0,
   Failure = 1,
-  NotPermitted = 13,  ///< a share is not this account's to have, or to change (EACCES)
+  NotPermitted = 13,  ///< an item or a share is not the user's to have, or to change (EACCES)
   NameTaken = 17,     ///< the name is taken (EEXIST)
   NoRoom = 28,        ///< the disk is full, or a quota is used up (ENOSPC)
   Usage = 64,         ///< the command line is wrong

@@ -26,7 +26,7 @@ TEST(ExitCodes, NobodySignedInIsSaidApartFromOtherFailuresInBothDomains) {
 
 TEST(ExitCodes, WhatAShareDoesNotAllowIsSaidApartFromWhatADiskRefuses) {
   EXPECT_EQ(codeOf(RZErrorDomain, RZErrorPermissionFailure), ExitCode::NotPermitted);
-  EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSFileWriteNoPermissionError), ExitCode::Failure);
+  EXPECT_EQ(codeOf(NSCocoaErrorDomain, NSFileWriteNoPermissionError), ExitCode::NotPermitted);
   EXPECT_EQ(codeOf(RZErrorDomain, RZErrorUnknownItem), ExitCode::NoSuchItem);
   EXPECT_EQ(codeOf(QSOstrellErrorDomain, QSOstrellErrorNotShared), ExitCode::NoSuchItem);
 }

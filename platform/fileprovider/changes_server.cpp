@@ -50,14 +50,19 @@ void encodeOutcome(const Outcome& outcome, Changed::Builder result) {
 
 /// What an item has to allow for a change, and how its refusal reads.
 struct Permission {
+  std::string identifier;
   std::uint32_t capability;
   const char* change;
 };
+using Permissions = std::vector<Permission>;
+
+Permission addingTo(std::string parent) {
+  return {std::move(parent), NSFileProviderItemCapabilitiesAllowsAddingSubItems, "added to"};
+}
 
 /// Nil where the item allows the change, or is not known: then the change itself says so.
-NSErrorRef refusal(NSFileProviderExtension& extension, const std::string& identifier,
-                   Permission wanted) {
-  const auto item = extension.itemForIdentifier(identifier);
+NSErrorRef refusal(NSFileProviderExtension& extension, const Permission& wanted) {
+  const auto item = extension.itemForIdentifier(wanted.identifier);
   if (item == nullptr || (item->fields().capabilities & wanted.capability) != 0) return nullptr;
   const std::string name = item->filename().empty() ? "this item" : "\"" + item->filename() + "\"";
   return NSError::errorWithDomain(
@@ -85,11 +90,11 @@ class ChangesServer final : public protocol::Changes::Server {
     }
     const auto url = NSURL::fileURLWithPath(stringFromWire(params.getPath()));
     if (url == nullptr) return refuse(context, invalid("what is imported needs an absolute path"));
-    return change(context, "importDocument",
-                  [url, parent = stringFromWire(params.getParent())](
-                      NSFileProviderExtension& extension, ItemHandler handler) {
-                    extension.importDocumentAtURL(url, parent, std::move(handler));
-                  });
+    std::string parent = stringFromWire(params.getParent());
+    return changeAllowed(context, "importDocument", {addingTo(parent)},
+                         [url, parent](NSFileProviderExtension& extension, ItemHandler handler) {
+                           extension.importDocumentAtURL(url, parent, std::move(handler));
+                         });
   }
 
   kj::Promise<void> createDirectory(CreateDirectoryContext context) override {
@@ -97,12 +102,12 @@ class ChangesServer final : public protocol::Changes::Server {
     if (const auto error = tooLong(params.getName().size(), params.getParent().size())) {
       return refuse(context, error);
     }
-    return change(
-        context, "createDirectory",
-        [name = stringFromWire(params.getName()), parent = stringFromWire(params.getParent())](
-            NSFileProviderExtension& extension, ItemHandler handler) {
-          extension.createDirectoryWithName(name, parent, std::move(handler));
-        });
+    std::string parent = stringFromWire(params.getParent());
+    return changeAllowed(context, "createDirectory", {addingTo(parent)},
+                         [name = stringFromWire(params.getName()), parent](
+                             NSFileProviderExtension& extension, ItemHandler handler) {
+                           extension.createDirectoryWithName(name, parent, std::move(handler));
+                         });
   }
 
   kj::Promise<void> rename(RenameContext context) override {
@@ -110,11 +115,11 @@ class ChangesServer final : public protocol::Changes::Server {
     if (const auto error = tooLong(params.getName().size(), params.getIdentifier().size())) {
       return refuse(context, error);
     }
-    return changeAllowed(context, "rename", stringFromWire(params.getIdentifier()),
-                         {NSFileProviderItemCapabilitiesAllowsRenaming, "renamed"},
-                         [name = stringFromWire(params.getName())](
-                             NSFileProviderExtension& extension, const std::string& identifier,
-                             ItemHandler handler) {
+    std::string identifier = stringFromWire(params.getIdentifier());
+    return changeAllowed(context, "rename",
+                         {{identifier, NSFileProviderItemCapabilitiesAllowsRenaming, "renamed"}},
+                         [name = stringFromWire(params.getName()), identifier](
+                             NSFileProviderExtension& extension, ItemHandler handler) {
                            extension.renameItemWithIdentifier(identifier, name, std::move(handler));
                          });
   }
@@ -127,12 +132,12 @@ class ChangesServer final : public protocol::Changes::Server {
                                    params.getParent().size())) {
       return refuse(context, error);
     }
+    std::string identifier = stringFromWire(params.getIdentifier());
+    std::string parent = stringFromWire(params.getParent());
     return changeAllowed(
-        context, "reparent", stringFromWire(params.getIdentifier()),
-        {NSFileProviderItemCapabilitiesAllowsReparenting, "moved"},
-        [newName, parent = stringFromWire(params.getParent())](NSFileProviderExtension& extension,
-                                                               const std::string& identifier,
-                                                               ItemHandler handler) {
+        context, "reparent",
+        {{identifier, NSFileProviderItemCapabilitiesAllowsReparenting, "moved"}, addingTo(parent)},
+        [newName, identifier, parent](NSFileProviderExtension& extension, ItemHandler handler) {
           extension.reparentItemWithIdentifier(identifier, parent, newName, std::move(handler));
         });
   }
@@ -140,10 +145,11 @@ class ChangesServer final : public protocol::Changes::Server {
   kj::Promise<void> trash(TrashContext context) override {
     const auto given = context.getParams().getIdentifier();
     if (const auto error = tooLong(given.size())) return refuse(context, error);
+    std::string identifier = stringFromWire(given);
     return changeAllowed(
-        context, "trash", stringFromWire(given),
-        {NSFileProviderItemCapabilitiesAllowsTrashing, "moved to the trash"},
-        [](NSFileProviderExtension& extension, const std::string& identifier, ItemHandler handler) {
+        context, "trash",
+        {{identifier, NSFileProviderItemCapabilitiesAllowsTrashing, "moved to the trash"}},
+        [identifier](NSFileProviderExtension& extension, ItemHandler handler) {
           extension.trashItemWithIdentifier(identifier, std::move(handler));
         });
   }
@@ -153,26 +159,27 @@ class ChangesServer final : public protocol::Changes::Server {
     if (const auto error = tooLong(params.getIdentifier().size(), params.getParent().size())) {
       return refuse(context, error);
     }
-    return change(context, "untrash",
-                  [identifier = stringFromWire(params.getIdentifier()),
-                   parent = textOrNothing(params.getParent())](NSFileProviderExtension& extension,
-                                                               ItemHandler handler) {
-                    extension.untrashItemWithIdentifier(identifier, parent, std::move(handler));
-                  });
+    const auto parent = textOrNothing(params.getParent());
+    return changeAllowed(
+        context, "untrash", parent ? Permissions{addingTo(*parent)} : Permissions{},
+        [identifier = stringFromWire(params.getIdentifier()), parent](
+            NSFileProviderExtension& extension, ItemHandler handler) {
+          extension.untrashItemWithIdentifier(identifier, parent, std::move(handler));
+        });
   }
 
   kj::Promise<void> delete_(DeleteContext context) override {
     const auto given = context.getParams().getIdentifier();
     if (const auto error = tooLong(given.size())) return refuse(context, error);
-    return changeAllowed(
-        context, "delete", stringFromWire(given),
-        {NSFileProviderItemCapabilitiesAllowsDeleting, "deleted"},
-        [](NSFileProviderExtension& extension, const std::string& identifier, ItemHandler handler) {
-          extension.deleteItemWithIdentifier(identifier,
-                                             [handler = std::move(handler)](NSErrorRef error) {
-                                               handler(nullptr, std::move(error));
-                                             });
-        });
+    std::string identifier = stringFromWire(given);
+    return changeAllowed(context, "delete",
+                         {{identifier, NSFileProviderItemCapabilitiesAllowsDeleting, "deleted"}},
+                         [identifier](NSFileProviderExtension& extension, ItemHandler handler) {
+                           extension.deleteItemWithIdentifier(
+                               identifier, [handler = std::move(handler)](NSErrorRef error) {
+                                 handler(nullptr, std::move(error));
+                               });
+                         });
   }
 
   kj::Promise<void> setLastUsedDate(SetLastUsedDateContext context) override {
@@ -259,17 +266,19 @@ class ChangesServer final : public protocol::Changes::Server {
         [context](Outcome outcome) mutable { encodeOutcome(outcome, context.getResults()); });
   }
 
-  /// The same where the item has to allow it.
+  /// The same where all of this has to be allowed.
   template <typename Context, typename Start>
-  kj::Promise<void> changeAllowed(Context context, const char* operation, std::string identifier,
-                                  Permission wanted, Start start) {
+  kj::Promise<void> changeAllowed(Context context, const char* operation, Permissions permissions,
+                                  Start start) {
     return change(context, operation,
-                  [identifier = std::move(identifier), wanted, start = std::move(start)](
+                  [permissions = std::move(permissions), start = std::move(start)](
                       NSFileProviderExtension& extension, ItemHandler handler) {
-                    if (NSErrorRef error = refusal(extension, identifier, wanted)) {
-                      return handler(nullptr, std::move(error));
+                    for (const Permission& wanted : permissions) {
+                      if (NSErrorRef error = refusal(extension, wanted)) {
+                        return handler(nullptr, std::move(error));
+                      }
                     }
-                    start(extension, identifier, std::move(handler));
+                    start(extension, std::move(handler));
                   });
   }
 

@@ -226,6 +226,31 @@ TEST_F(ChangesServer, RefusesWhatAnItemDoesNotAllow) {
       change(&Changes::Client::deleteRequest, [](auto params) { params.setIdentifier("fixed"); }),
       "nothing: no item");
   EXPECT_EQ(error_->localizedDescription(), "\"name of fixed\" cannot be deleted");
+  EXPECT_EQ(change(&Changes::Client::createDirectoryRequest,
+                   [](auto params) {
+                     params.setName(wireData("new"));
+                     params.setParent("fixed");
+                   }),
+            "nothing: no item");
+  EXPECT_EQ(error_->localizedDescription(), "\"name of fixed\" cannot be added to");
+  EXPECT_EQ(change(&Changes::Client::importDocumentRequest,
+                   [](auto params) {
+                     params.setPath(wireData("/tmp/new"));
+                     params.setParent("fixed");
+                   }),
+            "nothing: no item");
+  EXPECT_EQ(change(&Changes::Client::reparentRequest,
+                   [](auto params) {
+                     params.setIdentifier("d:1");
+                     params.setParent("fixed");
+                   }),
+            "nothing: no item");
+  EXPECT_EQ(change(&Changes::Client::untrashRequest,
+                   [](auto params) {
+                     params.setIdentifier("d:1");
+                     params.setParent("fixed");
+                   }),
+            "nothing: no item");
   EXPECT_EQ(rename("unknown", "new"), "rename unknown new: done")
       << "what is not known is the extension's to say";
 }

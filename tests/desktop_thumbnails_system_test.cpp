@@ -13,6 +13,7 @@
 #include "tests/harness/content_client.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mounted_drive.h"
+#include "tests/harness/stored_thumbnails.h"
 
 namespace yomber::testing {
 namespace {
@@ -20,6 +21,13 @@ namespace {
 namespace fs = std::filesystem;
 using Flavour = ThumbnailCache::Flavour;
 using Upload = ContentClient::Upload;
+
+/// More than what an evicted file keeps; readers of pictures pass over the zeros.
+constexpr std::uintmax_t kSmall = 100'000;
+
+constexpr const char* kLookingAgain = "mount.thumbnail.again";
+/// What was missed is looked at again without a pause.
+constexpr const char* kPauseSkipped = "mount.thumbnail.missed";
 
 /// A folder for what desktops cache, told to every process that the test starts.
 class CacheFolder {
@@ -33,14 +41,24 @@ class CacheFolder {
 
 class DesktopThumbnailsTest : public ::testing::Test {
  protected:
+  explicit DesktopThumbnailsTest(const std::vector<std::string>& gates = {},
+                                 const std::vector<std::string>& failing = {})
+      : mounted_(gates, failing) {}
+
   /// A picture that is in the store only.
   void makeAway(const std::string& name, const std::string& sample) {
+    makeAway(name, contentOf(YOMBER_PICTURES "/" + sample), kSmall);
+  }
+  /// The same of any bytes, with zeros up to that size.
+  void makeAway(const std::string& name, const std::string& bytes, std::uintmax_t size) {
     fs::create_directories(fs::path(mounted_.at(name)).parent_path());
-    // More than what an evicted file keeps, which readers of pictures pass over.
-    std::ofstream(mounted_.at(name), std::ios::binary)
-        << contentOf(YOMBER_PICTURES "/" + sample) << std::string(100'000, '\0');
+    std::ofstream(mounted_.at(name), std::ios::binary) << bytes;
+    fs::resize_file(mounted_.at(name), size);
     const std::string onDisk = mounted_.onDisk(name);
-    ASSERT_TRUE(eventually([&] { return client_.state(onDisk).upload == Upload::CONFIRMED; }));
+    ASSERT_TRUE(eventually([&] {
+      const auto state = client_.state(onDisk);
+      return state.upload == Upload::CONFIRMED && state.size == size;
+    }));
     ASSERT_EQ(client_.evict(onDisk), nullptr);
     ASSERT_TRUE(isFaultAtPath(onDisk));
   }
@@ -110,6 +128,23 @@ TEST_F(DesktopThumbnailsTest, WhatIsHereIsLeftToTheDesktop) {
   makeAway("away.jpg", "wide-gamut.jpg");
   EXPECT_TRUE(eventually([&] { return isThere("away.jpg", Flavour::Large); }));
   EXPECT_FALSE(isThere("here.jpg", Flavour::Large));
+}
+
+/// The mount looks at what it has missed again as soon as the gate is opened.
+class LaterDesktopThumbnailsTest : public DesktopThumbnailsTest {
+ protected:
+  LaterDesktopThumbnailsTest() : DesktopThumbnailsTest({kLookingAgain}, {kPauseSkipped}) {}
+};
+
+TEST_F(LaterDesktopThumbnailsTest, AThumbnailThatIsStoredLaterComesThereWithoutAListing) {
+  makeAway("photo.jpg", "no picture", kSmall);
+  ASSERT_TRUE(eventually([&] { return mounted_.isReached(kLookingAgain); }));
+  EXPECT_FALSE(isThere("photo.jpg", Flavour::Large));
+  StoredThumbnails(mounted_.drive())
+      .put({client_.identifierAt(mounted_.onDisk("photo.jpg"))},
+           [](std::size_t) { return contentOf(YOMBER_PICTURES "/quarters.jpg"); });
+  mounted_.openGate(kLookingAgain);
+  EXPECT_TRUE(eventually([&] { return isThere("photo.jpg", Flavour::Large); }));
 }
 
 }  // namespace

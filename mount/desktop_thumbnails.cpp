@@ -265,8 +265,7 @@ void DesktopThumbnails::consider(const Folder& folder, const std::string& name, 
   struct stat status{};
   if (lstat(onDisk.c_str(), &status) != 0 || !S_ISREG(status.st_mode) || status.st_size == 0)
     return;
-  // A larger one without a thumbnail would be brought here to be drawn.
-  if (std::cmp_greater(status.st_size, largest_) || !isFaultAtPath(onDisk)) return;
+  if (!isFaultAtPath(onDisk)) return;
   ThumbnailCache::File file{.path = mountPoint_ + joined(folder.shown, shown),
                             .mtime = status.st_mtim.tv_sec,
                             .size = static_cast<std::uint64_t>(status.st_size)};
@@ -284,12 +283,15 @@ void DesktopThumbnails::fetchWaiting() {
   std::vector<Candidate> candidates = std::exchange(waiting_, {});
   std::map<std::string, Candidate*> byIdentifier;
   std::vector<std::string> asked;
+  std::vector<std::string> large;
   NSErrorRef error;
   for (Candidate& each : candidates) {
     std::string identifier;
     if (isEnding()) return;
     error = requests_.identify(each.location, identifier);
-    if (!error && byIdentifier.try_emplace(identifier, &each).second) asked.push_back(identifier);
+    if (error || !byIdentifier.try_emplace(identifier, &each).second) continue;
+    // Of a large one without a thumbnail the host may have the content brought here, to be drawn.
+    (each.file.size > largest_ ? large : asked).push_back(identifier);
   }
   const auto take = [&](const std::string& identifier, const NSDataRef& image) {
     const auto found = byIdentifier.find(identifier);
@@ -297,7 +299,12 @@ void DesktopThumbnails::fetchWaiting() {
     found->second->hasImage = true;
     store(found->second->file, image);
   };
+  if (!byIdentifier.empty()) error = nullptr;
   if (!asked.empty()) error = requests_.fetch(asked, take);
+  if (!large.empty()) {
+    const NSErrorRef failure = requests_.readStored(large, take);
+    if (failure) error = failure;
+  }
   for (const Candidate& each : candidates) {
     if (!each.hasImage) noteMissed(each);
   }

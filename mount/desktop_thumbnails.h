@@ -24,10 +24,10 @@ namespace yomber {
 ///
 /// All of the tree is looked through once zarn tells of changes, an entry when it changes (it was
 /// given up, say), and a folder when it is listed and was not looked at since it changed. Pictures
-/// come from the record store, over the host. A folder in which something is to be had later,
-/// perhaps, is looked at again by and by, a few times.
-/// Thread-safety: every operation may be called on any thread, and returns at once; a thread of its
-/// own does the work.
+/// come from the record store, over the host or straight from it, and no content is brought here
+/// for them. A folder in which something is to be had later, perhaps, is looked at again by and by,
+/// a few times. Thread-safety: every operation may be called on any thread, and returns at once; a
+/// thread of its own does the work.
 class DesktopThumbnails {
  public:
   /// `mountPoint`: the absolute path of the mount.
@@ -103,7 +103,7 @@ class DesktopThumbnails {
   const ThumbnailCache cache_;
   PictureDrawer drawer_;
   ThumbnailRequests requests_;
-  const std::uint64_t largest_;  ///< bytes of what is asked for
+  const std::uint64_t largest_;  ///< bytes of what the host is asked about
   // The thread's own.
   std::vector<Candidate> waiting_;
   std::map<std::string, Missed> missed_;  ///< by the folder's location on this disk

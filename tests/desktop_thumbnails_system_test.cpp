@@ -20,8 +20,11 @@ namespace {
 
 namespace fs = std::filesystem;
 using Flavour = ThumbnailCache::Flavour;
+using Local = ContentClient::Local;
 using Upload = ContentClient::Upload;
 
+/// More than what the extension brings here for a thumbnailer's sake.
+constexpr std::uintmax_t kLarge = (std::uintmax_t{64} << 20U) + 4096;
 /// More than what an evicted file keeps; readers of pictures pass over the zeros.
 constexpr std::uintmax_t kSmall = 100'000;
 
@@ -61,6 +64,11 @@ class DesktopThumbnailsTest : public ::testing::Test {
     }));
     ASSERT_EQ(client_.evict(onDisk), nullptr);
     ASSERT_TRUE(isFaultAtPath(onDisk));
+  }
+
+  /// How many contents have come or gone.
+  [[nodiscard]] nlohmann::json transfers() {
+    return mounted_.drive().status().at("transfers").at("finished");
   }
 
   [[nodiscard]] bool isThere(const std::string& name, Flavour flavour) const {
@@ -130,10 +138,25 @@ TEST_F(DesktopThumbnailsTest, WhatIsHereIsLeftToTheDesktop) {
   EXPECT_FALSE(isThere("here.jpg", Flavour::Large));
 }
 
+TEST_F(DesktopThumbnailsTest, ALargePictureThatIsAwayHasItsPictureThereAndStaysAway) {
+  makeAway("large.jpg", contentOf(YOMBER_PICTURES "/quarters.jpg"), kLarge);
+  const auto before = transfers();
+  for (const Flavour flavour : {Flavour::Normal, Flavour::Large})
+    EXPECT_TRUE(eventually([&] { return isThere("large.jpg", flavour); }));
+  EXPECT_EQ(client_.state(mounted_.onDisk("large.jpg")).local, Local::FAULT);
+  EXPECT_EQ(transfers(), before);
+}
+
 /// The mount looks at what it has missed again as soon as the gate is opened.
 class LaterDesktopThumbnailsTest : public DesktopThumbnailsTest {
  protected:
-  LaterDesktopThumbnailsTest() : DesktopThumbnailsTest({kLookingAgain}, {kPauseSkipped}) {}
+  LaterDesktopThumbnailsTest() : DesktopThumbnailsTest({kLookingAgain}, {kPauseSkipped}) {
+    const fs::path thumbnailers =
+        fs::path(mounted_.drive().environment().at("XDG_DATA_HOME")) / "thumbnailers";
+    fs::create_directories(thumbnailers);
+    std::ofstream(thumbnailers / "nothing.thumbnailer")
+        << "[Thumbnailer Entry]\nExec=false\nMimeType=image/jpeg;\n";
+  }
 };
 
 TEST_F(LaterDesktopThumbnailsTest, AThumbnailThatIsStoredLaterComesThereWithoutAListing) {
@@ -145,6 +168,14 @@ TEST_F(LaterDesktopThumbnailsTest, AThumbnailThatIsStoredLaterComesThereWithoutA
            [](std::size_t) { return contentOf(YOMBER_PICTURES "/quarters.jpg"); });
   mounted_.openGate(kLookingAgain);
   EXPECT_TRUE(eventually([&] { return isThere("photo.jpg", Flavour::Large); }));
+}
+
+TEST_F(LaterDesktopThumbnailsTest, ALargeOneWithoutAThumbnailIsNotBroughtHereForOne) {
+  makeAway("large.jpg", "no picture", kLarge);
+  const auto before = transfers();
+  ASSERT_TRUE(eventually([&] { return mounted_.isReached(kLookingAgain); }));
+  EXPECT_EQ(client_.state(mounted_.onDisk("large.jpg")).local, Local::FAULT);
+  EXPECT_EQ(transfers(), before);
 }
 
 }  // namespace

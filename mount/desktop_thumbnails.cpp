@@ -6,13 +6,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
-#include <map>
 #include <utility>
 
 #include "platform/drawing/drawable_types.h"
 #include "platform/foundation/background_thread.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/log.h"
 #include "platform/glimmet/content_types.h"
@@ -27,9 +28,26 @@ constexpr std::size_t kTogether = 64;
 /// What waits beyond that is found when its folder is listed.
 constexpr std::size_t kLooks = 10'000;
 constexpr int kDeepest = 256;
+/// Most thumbnails that come later come soon; each pause is this many times the last.
+constexpr std::chrono::seconds kFirstPause{30};
+constexpr int kLongerEachTime = 4;
+/// What is not there after hours is a file of which there is none.
+constexpr int kLooksAgain = 5;
+constexpr std::size_t kMissed = 1000;
 using Flavour = ThumbnailCache::Flavour;
 /// What file managers look for. Larger ones would take as much room as the pictures themselves.
 constexpr std::array kFlavours{Flavour::Large, Flavour::Normal};
+
+/// Without the pause, the folder is looked at again at once.
+FaultPoint pauseSkipped("mount.thumbnail.missed");
+FaultPoint lookingAgain("mount.thumbnail.again");
+
+std::chrono::seconds pauseBefore(int lookAgain) {
+  if (pauseSkipped.hit()) return std::chrono::seconds::zero();
+  auto pause = kFirstPause;
+  for (int i = 1; i < lookAgain; ++i) pause *= kLongerEachTime;
+  return pause;
+}
 
 std::string joined(const std::string& folder, const std::string& name) {
   return folder + "/" + name;
@@ -126,11 +144,19 @@ void DesktopThumbnails::run() {
   giveWayToOthers();
   for (;;) {
     lookAtNoted();
+    lookAtMissed();
     {
+      const auto due = nextDue();
       LockGuard guard(mutex_);
-      while (looks_.empty() && !isAllToBeLookedAt_ && !isEnding_) changed_.wait(mutex_);
+      while (looks_.empty() && !isAllToBeLookedAt_ && !isEnding_ && Clock::now() < due) {
+        if (due == Clock::time_point::max()) {
+          changed_.wait(mutex_);
+        } else {
+          (void)changed_.waitUntil(mutex_, due);
+        }
+      }
       if (isEnding_) return;
-      if (!looks_.empty()) continue;
+      if (!looks_.empty() || !isAllToBeLookedAt_) continue;
       isAllToBeLookedAt_ = false;
       looked_.clear();
     }
@@ -184,7 +210,7 @@ void DesktopThumbnails::lookAtTree(const Folder& folder, int depth) {
     const std::string name = entry->d_name;
     if (name == "." || name == ".." || isEnding()) continue;
     if (entry->d_type == DT_REG) {
-      consider(folder, name);
+      consider(folder, name, 0);
     } else if (entry->d_type == DT_DIR) {
       const std::string shown = places_.shownName(folder.inode, name);
       folders.push_back({.base = folder.base,
@@ -200,60 +226,110 @@ void DesktopThumbnails::lookAtTree(const Folder& folder, int depth) {
 }
 
 void DesktopThumbnails::lookAt(const Look& look) {
-  if (!look.name.empty()) return consider(look.folder, look.name);
-  DIR* const stream = opendir(look.folder.onDisk.c_str());
+  if (!look.name.empty()) return consider(look.folder, look.name, 0);
+  lookAtFolder(look.folder, 0);
+}
+
+void DesktopThumbnails::lookAtFolder(const Folder& folder, int looksAgain) {
+  DIR* const stream = opendir(folder.onDisk.c_str());
   if (stream == nullptr) return;
-  noteLooked(look.folder.inode);
+  noteLooked(folder.inode);
   while (const dirent* const entry = readdir(stream)) {
     if (isEnding()) break;
-    if (entry->d_type == DT_REG) consider(look.folder, entry->d_name);
+    if (entry->d_type == DT_REG) consider(folder, entry->d_name, looksAgain);
   }
   closedir(stream);
 }
 
-void DesktopThumbnails::consider(const Folder& folder, const std::string& name) {
+void DesktopThumbnails::lookAtMissed() {
+  const auto now = Clock::now();
+  std::vector<Missed> due;
+  std::erase_if(missed_, [&](auto& each) {
+    if (each.second.due > now) return false;
+    due.push_back(std::move(each.second));
+    return true;
+  });
+  if (due.empty() || lookingAgain.hit()) return;
+  for (const Missed& each : due) {
+    if (isEnding()) return;
+    lookAtFolder(each.folder, each.looksAgain);
+    fetchWaiting();
+    lookAtNoted();
+  }
+}
+
+void DesktopThumbnails::consider(const Folder& folder, const std::string& name, int looksAgain) {
   const std::string shown = places_.shownName(folder.inode, name);
   if (!mayBePicture(shown)) return;
   const std::string onDisk = joined(folder.onDisk, name);
   struct stat status{};
   if (lstat(onDisk.c_str(), &status) != 0 || !S_ISREG(status.st_mode) || status.st_size == 0)
     return;
-  // A larger one without a thumbnail would be brought here to be drawn.
-  if (std::cmp_greater(status.st_size, largest_) || !isFaultAtPath(onDisk)) return;
+  if (!isFaultAtPath(onDisk)) return;
   ThumbnailCache::File file{.path = mountPoint_ + joined(folder.shown, shown),
                             .mtime = status.st_mtim.tv_sec,
                             .size = static_cast<std::uint64_t>(status.st_size)};
   bool isThere = true;
   for (const Flavour flavour : kFlavours) isThere = isThere && cache_.has(file, flavour);
   if (isThere) return;
-  waiting_.push_back({std::move(file), joined(folder.location, shown)});
+  waiting_.push_back({.file = std::move(file),
+                      .location = joined(folder.location, shown),
+                      .folder = folder,
+                      .looksAgain = looksAgain});
   if (waiting_.size() >= kTogether) fetchWaiting();
 }
 
 void DesktopThumbnails::fetchWaiting() {
-  const std::vector<Candidate> candidates = std::exchange(waiting_, {});
-  std::map<std::string, const Candidate*> byIdentifier;
-  std::vector<std::string> identifiers;
+  std::vector<Candidate> candidates = std::exchange(waiting_, {});
+  std::map<std::string, Candidate*> byIdentifier;
+  std::vector<std::string> asked;
+  std::vector<std::string> large;
   NSErrorRef error;
-  for (const Candidate& each : candidates) {
+  for (Candidate& each : candidates) {
     std::string identifier;
     if (isEnding()) return;
     error = requests_.identify(each.location, identifier);
-    if (!error && byIdentifier.try_emplace(identifier, &each).second)
-      identifiers.push_back(identifier);
+    if (error || !byIdentifier.try_emplace(identifier, &each).second) continue;
+    // Of a large one without a thumbnail the host may have the content brought here, to be drawn.
+    (each.file.size > largest_ ? large : asked).push_back(identifier);
   }
-  if (!identifiers.empty()) {
-    error =
-        requests_.fetch(identifiers, [&](const std::string& identifier, const NSDataRef& image) {
-          const auto found = byIdentifier.find(identifier);
-          if (image && found != byIdentifier.end() && !isEnding())
-            store(found->second->file, image);
-        });
+  const auto take = [&](const std::string& identifier, const NSDataRef& image) {
+    const auto found = byIdentifier.find(identifier);
+    if (!image || found == byIdentifier.end() || isEnding()) return;
+    found->second->hasImage = true;
+    store(found->second->file, image);
+  };
+  if (!byIdentifier.empty()) error = nullptr;
+  if (!asked.empty()) error = requests_.fetch(asked, take);
+  if (!large.empty()) {
+    const NSErrorRef failure = requests_.readStored(large, take);
+    if (failure) error = failure;
+  }
+  for (const Candidate& each : candidates) {
+    if (!each.hasImage) noteMissed(each);
   }
   if (!error) return;
   log_info(defaultLog(), "[INFO] some thumbnails are not to be had now: %@", error);
   LockGuard guard(mutex_);
   looked_.clear();
+}
+
+void DesktopThumbnails::noteMissed(const Candidate& candidate) {
+  if (candidate.looksAgain >= kLooksAgain) return;
+  const std::string& place = candidate.folder.onDisk;
+  const auto known = missed_.find(place);
+  if (known == missed_.end() && missed_.size() >= kMissed) return;
+  const int next = candidate.looksAgain + 1;
+  const auto due = Clock::now() + pauseBefore(next);
+  // What has only now been missed is not to wait for as long as what has been for hours.
+  if (known != missed_.end() && known->second.due <= due) return;
+  missed_.insert_or_assign(place, Missed{candidate.folder, next, due});
+}
+
+DesktopThumbnails::Clock::time_point DesktopThumbnails::nextDue() const {
+  auto next = Clock::time_point::max();
+  for (const auto& [place, each] : missed_) next = std::min(next, each.due);
+  return next;
 }
 
 void DesktopThumbnails::store(const ThumbnailCache::File& file, const NSDataRef& image) {

@@ -1,7 +1,9 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <deque>
+#include <map>
 #include <memory>
 #include <string>
 #include <thread>
@@ -22,9 +24,10 @@ namespace yomber {
 ///
 /// All of the tree is looked through once zarn tells of changes, an entry when it changes (it was
 /// given up, say), and a folder when it is listed and was not looked at since it changed. Pictures
-/// come from the record store, over the host; what cannot be had is left to the next look.
-/// Thread-safety: every operation may be called on any thread, and returns at once; a thread of its
-/// own does the work.
+/// come from the record store, over the host or straight from it, and no content is brought here
+/// for them. A folder in which something is to be had later, perhaps, is looked at again by and by,
+/// a few times. Thread-safety: every operation may be called on any thread, and returns at once; a
+/// thread of its own does the work.
 class DesktopThumbnails {
  public:
   /// `mountPoint`: the absolute path of the mount.
@@ -65,6 +68,16 @@ class DesktopThumbnails {
   struct Candidate {
     ThumbnailCache::File file;
     std::string location;
+    Folder folder;
+    int looksAgain = 0;  ///< as for a missed folder, before this one
+    bool hasImage = false;
+  };
+  using Clock = std::chrono::steady_clock;
+  /// A folder in which there was no thumbnail of something.
+  struct Missed {
+    Folder folder;
+    int looksAgain = 0;  ///< how often it was looked at again by then
+    Clock::time_point due;
   };
 
   void note(Look look);
@@ -75,9 +88,14 @@ class DesktopThumbnails {
   void lookAtAll();
   void lookAtTree(const Folder& folder, int depth);
   void lookAt(const Look& look);
+  void lookAtFolder(const Folder& folder, int looksAgain);
+  void lookAtMissed();
   /// Looks at the entry; one that needs a thumbnail waits until there are some.
-  void consider(const Folder& folder, const std::string& name);
+  void consider(const Folder& folder, const std::string& name, int looksAgain);
   void fetchWaiting();
+  void noteMissed(const Candidate& candidate);
+  /// When a missed folder is to be looked at; never, where there is none.
+  [[nodiscard]] Clock::time_point nextDue() const;
   void store(const ThumbnailCache::File& file, const NSDataRef& image);
 
   const Places& places_;
@@ -85,8 +103,10 @@ class DesktopThumbnails {
   const ThumbnailCache cache_;
   PictureDrawer drawer_;
   ThumbnailRequests requests_;
-  const std::uint64_t largest_;     ///< bytes of what is asked for
-  std::vector<Candidate> waiting_;  ///< the thread's own
+  const std::uint64_t largest_;  ///< bytes of what the host is asked about
+  // The thread's own.
+  std::vector<Candidate> waiting_;
+  std::map<std::string, Missed> missed_;  ///< by the folder's location on this disk
 
   Mutex mutex_;
   Condition changed_;

@@ -28,6 +28,7 @@
 #include "platform/foundation/log_sinks.h"
 #include "platform/foundation/shared_heaps.h"
 #include "platform/ostrell/constants.h"
+#include "platform/ostrell/daemon_connection.h"
 
 namespace yomber {
 namespace {
@@ -167,6 +168,7 @@ int run(const std::vector<std::string>& given) {
   const auto paths =
       arguments->home ? DrivePaths::forHome(*arguments->home) : DrivePaths::forDefaultHome();
   if (const auto error = paths.check()) return fail(error->localizedDescription());
+  QSDaemonConnection::setDefaultHome(paths.home);
   openLog("yomber-mount", paths);
   return serve(paths, *arguments, endingSignals);
 }

@@ -6,6 +6,9 @@
 #include "platform/fileprovider/thumbnail_taker.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
+#include "platform/ostrell/constants.h"
+#include "platform/ostrell/daemon_connection.h"
+#include "platform/rozzel/container.h"
 
 namespace yomber {
 namespace {
@@ -15,6 +18,39 @@ using protocol::Control;
 constexpr ipc::CallOptions kPatience{.timeout = std::chrono::minutes(2)};
 /// Large enough for what the desktop keeps; the store's thumbnails are larger anyway.
 constexpr double kSide = 256;
+/// What no thumbnail needs.
+constexpr std::uint64_t kLargestImage = std::uint64_t{8} << 20;
+
+/// Nil when there is none, or with an error.
+NSDataRef storedImage(RZDatabase& database, const RZRecordID& recordID, NSErrorRef& error) {
+  const RZDesiredKeys keys{{kQSRecordKeyThumbnail1024x1024}};
+  std::vector<RZFetchedRecord> fetched;
+  error = database.fetchRecords({recordID}, keys, fetched);
+  if (!error) error = fetched.front().error;
+  if (error) return nullptr;
+  const auto* const asset =
+      fetched.front().record->valueForKey<RZAsset>(kQSRecordKeyThumbnail1024x1024);
+  if (asset == nullptr) return nullptr;
+  std::string bytes;
+  error = database.engine()->readAsset(*asset, kLargestImage, bytes);
+  return error ? nullptr : std::make_shared<const NSData>(std::move(bytes));
+}
+
+/// The records of those of the items that the store has.
+QSContentRecordIDsRef recordsOf(const std::vector<std::string>& identifiers, NSErrorRef& error) {
+  std::vector<QSFileObjectIDRef> objects;
+  for (const std::string& each : identifiers) {
+    if (auto object = QSFileObjectID::fileObjectIDWithString(each))
+      objects.push_back(std::move(object));
+  }
+  const auto proxy = QSDaemonConnection::defaultConnection().newSyncProxy();
+  proxy->resolveFileObjectIDsToContentRecordIDs(
+      objects, [&proxy](const QSContentRecordIDsRef& found, const NSErrorRef& failure) {
+        proxy->setObjResult(found, failure);
+      });
+  error = proxy->error();
+  return std::dynamic_pointer_cast<const QSContentRecordIDs>(proxy->result());
+}
 
 }  // namespace
 
@@ -62,6 +98,23 @@ NSErrorRef ThumbnailRequests::fetch(const std::vector<std::string>& identifiers,
       },
       [&](auto results) { failure = ipc::decodeOptional(results.getFailure()); }, kPatience);
   return transport ? transport : failure;
+}
+
+NSErrorRef ThumbnailRequests::readStored(const std::vector<std::string>& identifiers,
+                                         const Take& take) {
+  NSErrorRef failure;
+  const QSContentRecordIDsRef records = recordsOf(identifiers, failure);
+  if (!records) return failure;
+  const auto container =
+      RZContainer::containerWithIdentifier(QSUbiquitousRozzelContainerIdentifier);
+  for (const auto& [object, recordID] : records->recordIDs()) {
+    NSErrorRef error;
+    const NSDataRef image =
+        storedImage(*container->databaseForZone(recordID.zoneID()), recordID, error);
+    if (image) take(object->asString(), image);
+    if (error) failure = error;
+  }
+  return failure;
 }
 
 }  // namespace yomber

@@ -12,8 +12,8 @@
 
 namespace yomber {
 
-/// What the mount asks the host about thumbnails. Nobody waits for these: what fails is not tried
-/// again. Thread-safety: one thread at a time; every operation blocks until it is answered.
+/// What the mount asks about thumbnails: the host mostly. Nobody waits for these: what fails is not
+/// tried again. Thread-safety: one thread at a time; every operation blocks until it is answered.
 class ThumbnailRequests {
  public:
   explicit ThumbnailRequests(std::string controlSocket)
@@ -25,6 +25,11 @@ class ThumbnailRequests {
   /// this has returned; the image is nil where there is none.
   using Take = std::function<void(const std::string& identifier, const NSDataRef& image)>;
   [[nodiscard]] NSErrorRef fetch(const std::vector<std::string>& identifiers, const Take& take);
+  /// Calls `take` on this thread for those of the items that have a thumbnail, which is read from
+  /// the record store itself: however large an item is, its content is not brought here to be
+  /// drawn.
+  [[nodiscard]] static NSErrorRef readStored(const std::vector<std::string>& identifiers,
+                                             const Take& take);
 
  private:
   ipc::Remote<protocol::Control> control(NSErrorRef* error);

@@ -13,13 +13,24 @@
 #include "tests/harness/content_client.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mounted_drive.h"
+#include "tests/harness/stored_thumbnails.h"
 
 namespace yomber::testing {
 namespace {
 
 namespace fs = std::filesystem;
 using Flavour = ThumbnailCache::Flavour;
+using Local = ContentClient::Local;
 using Upload = ContentClient::Upload;
+
+/// More than what the extension brings here for a thumbnailer's sake.
+constexpr std::uintmax_t kLarge = (std::uintmax_t{64} << 20U) + 4096;
+/// More than what an evicted file keeps; readers of pictures pass over the zeros.
+constexpr std::uintmax_t kSmall = 100'000;
+
+constexpr const char* kLookingAgain = "mount.thumbnail.again";
+/// What was missed is looked at again without a pause.
+constexpr const char* kPauseSkipped = "mount.thumbnail.missed";
 
 /// A folder for what desktops cache, told to every process that the test starts.
 class CacheFolder {
@@ -33,16 +44,31 @@ class CacheFolder {
 
 class DesktopThumbnailsTest : public ::testing::Test {
  protected:
+  explicit DesktopThumbnailsTest(const std::vector<std::string>& gates = {},
+                                 const std::vector<std::string>& failing = {})
+      : mounted_(gates, failing) {}
+
   /// A picture that is in the store only.
   void makeAway(const std::string& name, const std::string& sample) {
+    makeAway(name, contentOf(YOMBER_PICTURES "/" + sample), kSmall);
+  }
+  /// The same of any bytes, with zeros up to that size.
+  void makeAway(const std::string& name, const std::string& bytes, std::uintmax_t size) {
     fs::create_directories(fs::path(mounted_.at(name)).parent_path());
-    // More than what an evicted file keeps, which readers of pictures pass over.
-    std::ofstream(mounted_.at(name), std::ios::binary)
-        << contentOf(YOMBER_PICTURES "/" + sample) << std::string(100'000, '\0');
+    std::ofstream(mounted_.at(name), std::ios::binary) << bytes;
+    fs::resize_file(mounted_.at(name), size);
     const std::string onDisk = mounted_.onDisk(name);
-    ASSERT_TRUE(eventually([&] { return client_.state(onDisk).upload == Upload::CONFIRMED; }));
+    ASSERT_TRUE(eventually([&] {
+      const auto state = client_.state(onDisk);
+      return state.upload == Upload::CONFIRMED && state.size == size;
+    }));
     ASSERT_EQ(client_.evict(onDisk), nullptr);
     ASSERT_TRUE(isFaultAtPath(onDisk));
+  }
+
+  /// How many contents have come or gone.
+  [[nodiscard]] nlohmann::json transfers() {
+    return mounted_.drive().status().at("transfers").at("finished");
   }
 
   [[nodiscard]] bool isThere(const std::string& name, Flavour flavour) const {
@@ -110,6 +136,46 @@ TEST_F(DesktopThumbnailsTest, WhatIsHereIsLeftToTheDesktop) {
   makeAway("away.jpg", "wide-gamut.jpg");
   EXPECT_TRUE(eventually([&] { return isThere("away.jpg", Flavour::Large); }));
   EXPECT_FALSE(isThere("here.jpg", Flavour::Large));
+}
+
+TEST_F(DesktopThumbnailsTest, ALargePictureThatIsAwayHasItsPictureThereAndStaysAway) {
+  makeAway("large.jpg", contentOf(YOMBER_PICTURES "/quarters.jpg"), kLarge);
+  const auto before = transfers();
+  for (const Flavour flavour : {Flavour::Normal, Flavour::Large})
+    EXPECT_TRUE(eventually([&] { return isThere("large.jpg", flavour); }));
+  EXPECT_EQ(client_.state(mounted_.onDisk("large.jpg")).local, Local::FAULT);
+  EXPECT_EQ(transfers(), before);
+}
+
+/// The mount looks at what it has missed again as soon as the gate is opened.
+class LaterDesktopThumbnailsTest : public DesktopThumbnailsTest {
+ protected:
+  LaterDesktopThumbnailsTest() : DesktopThumbnailsTest({kLookingAgain}, {kPauseSkipped}) {
+    const fs::path thumbnailers =
+        fs::path(mounted_.drive().environment().at("XDG_DATA_HOME")) / "thumbnailers";
+    fs::create_directories(thumbnailers);
+    std::ofstream(thumbnailers / "nothing.thumbnailer")
+        << "[Thumbnailer Entry]\nExec=false\nMimeType=image/jpeg;\n";
+  }
+};
+
+TEST_F(LaterDesktopThumbnailsTest, AThumbnailThatIsStoredLaterComesThereWithoutAListing) {
+  makeAway("photo.jpg", "no picture", kSmall);
+  ASSERT_TRUE(eventually([&] { return mounted_.isReached(kLookingAgain); }));
+  EXPECT_FALSE(isThere("photo.jpg", Flavour::Large));
+  StoredThumbnails(mounted_.drive())
+      .put({client_.identifierAt(mounted_.onDisk("photo.jpg"))},
+           [](std::size_t) { return contentOf(YOMBER_PICTURES "/quarters.jpg"); });
+  mounted_.openGate(kLookingAgain);
+  EXPECT_TRUE(eventually([&] { return isThere("photo.jpg", Flavour::Large); }));
+}
+
+TEST_F(LaterDesktopThumbnailsTest, ALargeOneWithoutAThumbnailIsNotBroughtHereForOne) {
+  makeAway("large.jpg", "no picture", kLarge);
+  const auto before = transfers();
+  ASSERT_TRUE(eventually([&] { return mounted_.isReached(kLookingAgain); }));
+  EXPECT_EQ(client_.state(mounted_.onDisk("large.jpg")).local, Local::FAULT);
+  EXPECT_EQ(transfers(), before);
 }
 
 }  // namespace

@@ -42,8 +42,10 @@ TEST_F(ShareFollowingTest, AShareIsFollowedOnAfterTheDatabaseWasLost) {
 TEST_F(ShareFollowingTest, WhatWasWrittenBeforeTheDatabaseWasLostIsKept) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  goOffline();  // or else it might be saved before
   bob->write("Plans/a.txt", "unsaved by bob");
   loseBobsDatabase();
+  comeBack();
   ASSERT_TRUE(bob->engine->waitUntilIdle(SharingDrive::kPatience));
   // What is still being looked at, as after every start, waits for the next pass.
   EXPECT_TRUE(waitUntil(

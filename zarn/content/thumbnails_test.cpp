@@ -1,7 +1,9 @@
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 
 #include <filesystem>
 
+#include "platform/drawing/picture_drawer.h"
 #include "platform/foundation/temporary_directory.h"
 #include "platform/glimmet/installed_thumbnailers.h"
 #include "zarn/content/document_drawer.h"
@@ -9,6 +11,8 @@
 
 namespace yomber {
 namespace {
+
+constexpr std::int64_t kTwoMonths = std::int64_t{62} * 24 * 3'600'000'000'000;
 
 class ThumbnailsTest : public ContentDrive {
  protected:
@@ -20,7 +24,7 @@ class ThumbnailsTest : public ContentDrive {
     engine.reset();
     DocumentDrawer::Options drawing;
     drawing.pictures.program = program;
-    drawing.pictures.patience = std::chrono::seconds(60);  // under sanitizers, on a busy machine
+    drawing.pictures.patience = kDrawingPatience;
     drawing.thumbnailers = thumbnailers_;
     options.drawer = std::make_shared<DocumentDrawer>(drawing);
     options.drawingPatience = std::chrono::minutes(2);
@@ -54,6 +58,34 @@ class ThumbnailsTest : public ContentDrive {
     return bytes;
   }
 
+  /// The thumbnail's pixels, drawn once more.
+  [[nodiscard]] std::optional<DrawnPicture> drawnThumbnail(const std::string& path) const {
+    constexpr std::uint32_t kLarger = 2048;  // nothing is enlarged
+    const FileDescriptor file(memfd_create("thumbnail", MFD_CLOEXEC));
+    const std::string bytes = thumbnailBytes(path);
+    EXPECT_EQ(::write(file.get(), bytes.data(), bytes.size()), std::ssize(bytes));
+    PictureDrawer::Options patient;
+    patient.patience = kDrawingPatience;
+    return PictureDrawer(patient).draw(file.get(), kLarger, drawing::Form::Png);
+  }
+  /// A picture without a thumbnail gets one in the background, and the store goes out of reach when
+  /// that comes to the fault point. It has to get it all the same.
+  void expectThumbnailThoughTheStoreGoesAt(const std::string& point) {
+    useDrawer("/nowhere/yomber-thumbnailer");
+    write("photo.jpg", sample("quarters.jpg"));
+    settle();
+    ASSERT_FALSE(thumbnail("photo.jpg"));
+    stopAt(point);
+    useDrawer({});
+    ASSERT_TRUE(isStopped());
+    goOffline();
+    go();
+    EXPECT_TRUE(waitUntil([&] { return engine->transfers().isOffline; }));
+    comeBack();
+    EXPECT_TRUE(waitUntil([&] { return thumbnail("photo.jpg").has_value(); }));
+  }
+
+  static constexpr std::chrono::seconds kDrawingPatience{60};  // under sanitizers, when busy
   const TemporaryDirectory thumbnailerFiles_;
   const std::shared_ptr<InstalledThumbnailers> thumbnailers_ =
       std::make_shared<InstalledThumbnailers>(std::vector{thumbnailerFiles_.path()});
@@ -68,6 +100,24 @@ TEST_F(ThumbnailsTest, APictureIsUploadedWithItsThumbnail) {
   EXPECT_TRUE(thumbnailBytes("icon.png").starts_with("\x89PNG"));
   EXPECT_TRUE(thumbnailBytes("paper.pdf").starts_with("\xff\xd8\xff"));
   EXPECT_EQ(state("photo.jpg").upload, ContentState::Upload::Confirmed);
+}
+
+TEST_F(ThumbnailsTest, AThumbnailIsNoMoreThan1024PixelsHighAndWide) {
+  write("drawing.svg", sample("quarters.svg"));
+  write("high.svg",
+        "<svg xmlns=\"http://www.w3.org/2000/svg\" width=\"1\" height=\"4\">"
+        "<rect width=\"1\" height=\"4\"/></svg>");
+  write("paper.pdf", sample("quarters.pdf"));
+  write("small.jpg", sample("quarters.jpg"));
+  settle();
+  const auto sizeOf = [&](const std::string& path) {
+    const auto drawn = drawnThumbnail(path);
+    return drawn ? std::pair(drawn->width, drawn->height) : std::pair(0U, 0U);
+  };
+  EXPECT_EQ(sizeOf("drawing.svg").first, 1024U);
+  EXPECT_EQ(sizeOf("high.svg"), std::pair(256U, 1024U));
+  EXPECT_EQ(sizeOf("paper.pdf").first, 1024U);
+  EXPECT_EQ(sizeOf("small.jpg"), std::pair(48U, 32U)) << "pixels are not enlarged";
 }
 
 TEST_F(ThumbnailsTest, AVideoIsDrawnByTheThumbnailerThatIsInstalled) {
@@ -154,6 +204,24 @@ TEST_F(ThumbnailsTest, TheSameContentIsDrawnOnce) {
   EXPECT_TRUE(thumbnail("copy.jpg"));
 }
 
+TEST_F(ThumbnailsTest, AThumbnailThatTheStoreHasDroppedIsDrawnAgain) {
+  write("photo.jpg", sample("quarters.jpg"));
+  settle();
+  const auto dropped = thumbnail("photo.jpg");
+  ASSERT_TRUE(dropped);
+  remove("photo.jpg");
+  settle();
+  EmbeddedEngineOptions later;
+  later.clock = [] { return NSDate::fromNanoseconds(NSDate::now().nanoseconds() + kTwoMonths); };
+  RZGarbageReport report;
+  ASSERT_EQ(EmbeddedEngine(storePath, later).collectGarbage(report), nullptr);
+  std::string file;
+  ASSERT_NE(records->localFile(*dropped, file), nullptr);
+  write("copy.jpg", sample("quarters.jpg"));
+  settle();
+  EXPECT_TRUE(thumbnailBytes("copy.jpg").starts_with("\xff\xd8\xff"));
+}
+
 TEST_F(ThumbnailsTest, ARenamedPictureKeepsItsThumbnailAndADocumentCanBecomeOne) {
   write("photo.jpg", sample("quarters.jpg"));
   write("data.txt", sample("quarters.png"));
@@ -236,6 +304,14 @@ TEST_F(ThumbnailsTest, WhatIsNotStoredInTimeIsMadeLater) {
   settle();
   FaultPoint::disarmAll();
   EXPECT_TRUE(thumbnail("photo.jpg"));
+}
+
+TEST_F(ThumbnailsTest, AStoreThatGoesBeforeItTakesAThumbnailGetsItWhenItIsBack) {
+  expectThumbnailThoughTheStoreGoesAt("zarn.thumbnail.drawn");
+}
+
+TEST_F(ThumbnailsTest, AStoreThatGoesBeforeTheRecordHasItsThumbnailSavesItWhenItIsBack) {
+  expectThumbnailThoughTheStoreGoesAt("zarn.thumbnail.made");
 }
 
 TEST_F(ThumbnailsTest, AQuotaWithoutRoomForItTakesTheDocument) {

@@ -2,9 +2,12 @@
 #include <algorithm>
 #include <array>
 #include <atomic>
+#include <cerrno>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <map>
+#include <memory>
 #include <thread>
 #include <vector>
 
@@ -18,6 +21,7 @@
 #include "platform/ostrell/constants.h"
 #include "tests/harness/content_client.h"
 #include "tests/harness/file_contents.h"
+#include "tests/harness/host_client.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -67,6 +71,14 @@ Look lookAt(const std::string& path) {
           .mode = status.stx_mode,
           .modified = status.stx_mtime.tv_sec * 1'000'000'000 + status.stx_mtime.tv_nsec,
           .created = status.stx_btime.tv_sec * 1'000'000'000 + status.stx_btime.tv_nsec};
+}
+
+/// What a client may be told while others want the content, or want it gone.
+void expectMayBeSaid(const NSErrorRef& error) {
+  const bool mayBe = !error || error->is(NSPOSIXErrorDomain, EBUSY) ||
+                     error->is(NSCocoaErrorDomain, NSUserCancelledError) ||
+                     error->is(QSOstrellErrorDomain, QSOstrellErrorCannotEvict);
+  EXPECT_TRUE(mayBe) << error->description();
 }
 
 class ContentSystem : public ::testing::Test {
@@ -243,6 +255,80 @@ TEST_F(ContentSystem, TenClientsAtOnceSeeOnlyTheContent) {
   EXPECT_EQ(wrong, 0);
   EXPECT_EQ(client_->provide(at("x")), nullptr);
   EXPECT_EQ(contentOf(at("x")), content);
+}
+
+class ContentCrowd : public ContentSystem {
+ protected:
+  static constexpr int kClients = 10;
+
+  /// All of them do one thing each, at once. False when one was left unanswered.
+  bool actAtOnce(const std::function<void(int number)>& act) {
+    std::atomic<int> ended{0};
+    std::vector<std::thread> threads;
+    for (int number = 0; number < kClients; ++number) {
+      threads.emplace_back([&, number] {
+        act(number);
+        ++ended;
+      });
+    }
+    const bool areAnswered = eventually([&] { return ended == kClients; });
+    EXPECT_TRUE(areAnswered) << kClients - ended << " clients wait for an answer";
+    if (!areAnswered) drive_.crash();  // with which the calls end
+    for (auto& thread : threads) thread.join();
+    return areAnswered;
+  }
+  /// Asks the host for the content, and reads it while the host keeps it.
+  void provideAndRead(const HostClient& host) {
+    // Under a descriptor, with which zarn does not give it up either.
+    const int file = ::open(at("x").c_str(), O_RDONLY | O_CLOEXEC);
+    HostClient::Need need;
+    const NSErrorRef error = host.provide(at("x"), need);
+    std::string found(content_.size(), '\0');
+    const ssize_t length = pread(file, found.data(), found.size(), 0);
+    close(file);
+    expectMayBeSaid(error);
+    if (error) return;
+    EXPECT_TRUE(length == static_cast<ssize_t>(content_.size()) && found == content_);
+    ++served_;
+  }
+
+  const std::string content_ = someContent(400'000, 9);
+  std::atomic<int> served_{0};
+};
+
+TEST_F(ContentCrowd, TenClientsOfTheHostAndOfZarnAreAllAnsweredAndSeeOnlyTheContent) {
+  makeFault("x", content_);
+  std::vector<std::unique_ptr<HostClient>> hosts;
+  std::vector<std::unique_ptr<ContentClient>> zarns;
+  for (int number = 0; number < kClients; ++number) {
+    hosts.push_back(std::make_unique<HostClient>(drive_.home()));
+    zarns.push_back(std::make_unique<ContentClient>(drive_.home()));
+  }
+  for (int round = 0; round < 30; ++round) {
+    // Also that nobody's wish was left: it can go.
+    ASSERT_TRUE(eventually([&] { return client_->evict(at("x")) == nullptr; })) << round;
+    const bool isForgotten = round % 2 == 0;  // in every second round, all wishes are taken back
+    ASSERT_TRUE(actAtOnce([&](int number) {
+      const HostClient& host = *hosts[static_cast<std::size_t>(number)];
+      const ContentClient& zarn = *zarns[static_cast<std::size_t>(number)];
+      switch ((number + round) % 5) {
+        case 0:
+          return expectMayBeSaid(host.stopProviding(at("x")));
+        case 1:
+          return expectMayBeSaid(zarn.evict(at("x")));
+        case 2:
+          return host.provideAndForget(at("x"));
+        default:
+          return isForgotten ? host.provideAndForget(at("x")) : provideAndRead(host);
+      }
+    })) << round;
+  }
+  EXPECT_GT(served_, 0);
+  ASSERT_TRUE(eventually([&] { return client_->evict(at("x")) == nullptr; }));
+  EXPECT_EQ(client_->state(at("x")).local, Local::FAULT);
+  HostClient::Need need;
+  EXPECT_EQ(hosts.front()->provide(at("x"), need), nullptr);
+  EXPECT_EQ(contentOf(at("x")), content_);
 }
 
 TEST_F(ContentSystem, ADocumentThatIsAwaySurvivesARestart) {

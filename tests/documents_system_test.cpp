@@ -4,6 +4,7 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <thread>
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -14,6 +15,7 @@
 #include "platform/ostrell/constants.h"
 #include "tests/harness/content_client.h"
 #include "tests/harness/file_contents.h"
+#include "tests/harness/host_client.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -200,6 +202,35 @@ TEST_F(DocumentsSystem, WhatIsAwayMovesBetweenApplicationsFoldersAndComesThere) 
     ASSERT_EQ(client_->provide(each.path), nullptr);
     EXPECT_TRUE(contentOf(each.path) == each.content);
   }
+}
+
+TEST_F(DocumentsSystem, WhatIsBroughtHereToBeMovedIsNotStopped) {
+  const std::string notes = installNotes();
+  const std::string gate = fs::path(drive_.home()).parent_path() / "gate";
+  drive_.environment()["YOMBER_FAULTS"] = "zarn.fill.begun=pause-until-file:" + gate;
+  up();
+  ASSERT_TRUE(eventually([&] { return fs::exists(notes); }));
+  const std::string content = someContent(60'000, 6);
+  makeFault("x", content);
+  const std::string id = client_->identifierAt(at("x"));
+  ProcessResult moved;
+  std::thread mover([&] { moved = drive_.yomber({"mv", "x", notes}); });
+  EXPECT_TRUE(eventually([&] { return fs::exists(gate + ".reached"); }));
+  const HostClient host(drive_.home());
+  EXPECT_EQ(host.stopProviding(at("x")), nullptr);
+  const std::string refused =
+      "[WARNING] Can't cancel download of " + at("x") + " which is downloading for CZM";
+  EXPECT_TRUE(eventually([&] {
+    return drive_.yomber({"log", "--lines", "500"}).output.find(refused) != std::string::npos;
+  }));
+  EXPECT_EQ(client_->state(at("x")).local, Local::DOWNLOADING);
+  EXPECT_FALSE(fs::exists(notes + "/x"));
+  std::ofstream(gate).put('x');
+  mover.join();
+  EXPECT_EQ(moved.exitCode, 0) << moved.errors;
+  EXPECT_EQ(client_->identifierAt(notes + "/x"), id);
+  EXPECT_EQ(client_->state(notes + "/x").local, Local::HERE);
+  EXPECT_TRUE(contentOf(notes + "/x") == content);
 }
 
 TEST_F(DocumentsSystem, ACopyOfWhatIsAwayIsAnItemOfItsOwn) {

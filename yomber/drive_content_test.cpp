@@ -3,55 +3,22 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <memory>
 #include <string>
 #include <thread>
 
-#include "platform/foundation/drive_paths.h"
-#include "platform/ipc/listener.h"
-#include "platform/ostrell/scripted_daemon.h"
-#include "yomber/drive_client.h"
+#include "yomber/content_fixture.h"
 
 namespace yomber {
 namespace {
 
-/// A host that answers nothing but whether it is there.
-class SilentHost final : public protocol::Control::Server {
- public:
-  kj::Promise<void> status(StatusContext /*context*/) override { return kj::READY_NOW; }
-};
-
-class DriveContentTest : public testing::Test {
+/// While it lives, the daemon is soon thought to be stuck.
+class LittlePatience {
  protected:
-  DriveContentTest() {
-    setenv("YOMBER_DAEMON_TIMEOUT_MS", "50", 1);
-    daemon = std::make_unique<ScriptedDaemon>();
-    const DrivePaths paths = DrivePaths::forHome(daemon->home());
-    NSErrorRef error;
-    host = ipc::Listener::listen(
-        paths.controlSocket,
-        [](const ipc::PeerCredentials&) -> capnp::Capability::Client {
-          return kj::heap<SilentHost>();
-        },
-        &error);
-    EXPECT_NE(host, nullptr) << error->description();
-    client = std::make_unique<DriveClient>(paths);
-    content = DriveContent::open(*client, &error);
-    EXPECT_TRUE(content) << error->description();
-  }
-  ~DriveContentTest() override {
-    content.reset();
-    client.reset();
-    host.reset();
-    daemon.reset();
-    unsetenv("YOMBER_DAEMON_TIMEOUT_MS");
-  }
-
-  std::unique_ptr<ScriptedDaemon> daemon;
-  std::unique_ptr<ipc::Listener> host;
-  std::unique_ptr<DriveClient> client;
-  std::optional<DriveContent> content;
+  LittlePatience() { setenv("YOMBER_DAEMON_TIMEOUT_MS", "50", 1); }
+  ~LittlePatience() { unsetenv("YOMBER_DAEMON_TIMEOUT_MS"); }
 };
+
+class DriveContentTest : LittlePatience, public ContentFixture {};
 
 TEST_F(DriveContentTest, EmptyingALargeTrashIsWaitedForWhileTheDaemonAnswers) {
   daemon->hold("emptyTrash");

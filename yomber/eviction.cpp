@@ -1,7 +1,11 @@
 #include "yomber/eviction.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+
 #include <cerrno>
 
+#include "platform/foundation/file_descriptor.h"
 #include "yomber/failure_text.h"
 
 namespace yomber {
@@ -56,6 +60,21 @@ Eviction kept(const ContentState& state, const std::string& reason) {
   return eviction;
 }
 
+/// The daemon's own reason; nil when the content has gone meanwhile. Asked with the file open, with
+/// which nothing is given up: the extension may have kept it for a move, of which the daemon does
+/// not know.
+NSErrorRef askForReason(const DriveContent& content, const std::string& path) {
+  struct stat status{};
+  std::string onDisk = path;
+  const bool isElsewhere = lstat(path.c_str(), &status) != 0;
+  if (isElsewhere) {
+    if (NSErrorRef error = content.physicalLocation(path, onDisk)) return error;
+  }
+  constexpr int kOpening = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+  const FileDescriptor file(open(onDisk.c_str(), kOpening));
+  return file ? content.evict(path) : NSError::errorWithErrno(errno, onDisk);
+}
+
 }  // namespace
 
 Eviction evictContent(const DriveContent& content, const std::string& path) {
@@ -72,8 +91,7 @@ Eviction evictContent(const DriveContent& content, const std::string& path) {
   if (state.local == ContentState::Local::FAULT) return ended(Eviction::Outcome::Evicted, state);
   if (const std::string reason = reasonToKeep(state); !reason.empty()) return kept(state, reason);
 
-  // The state does not say why: the daemon's own refusal does.
-  if (const NSErrorRef reason = content.evict(path)) {
+  if (const NSErrorRef reason = askForReason(content, path)) {
     return kept(state, failureText(reason));
   }
   if (NSErrorRef error = content.state(path, state)) return failed(error);

@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <csignal>
 #include <set>
 #include <vector>
 
@@ -229,15 +230,33 @@ class FileOperationsAcrossTest : public FileOperationsTest {
       GTEST_SKIP() << "/dev/shm is no file system of its own here";
     }
   }
+  /// False where that file system has no attributes of the user's.
+  [[nodiscard]] static bool giveIdentity(const NSURLRef& file, const std::string& identity) {
+    return setxattr(file->path().c_str(), "user.yomber.id", identity.data(), identity.size(), 0) ==
+           0;
+  }
+  /// Of what lies in the tree.
+  [[nodiscard]] std::optional<std::string> identityOf(const std::string& name) const {
+    return NSFileManager::defaultManager().extendedAttribute(at(name), "user.yomber.id");
+  }
+  [[nodiscard]] static std::string getFrom(const NSURLRef& file) {
+    std::ifstream stream(file->path(), std::ios::binary);
+    return {std::istreambuf_iterator<char>(stream), {}};
+  }
   OtherFileSystem other_;
 };
 
 TEST_F(FileOperationsAcrossTest, MovesByCopyingWithTheIdentity) {
   fs::create_directories(other_.url("folder/inner")->path());
   std::ofstream(other_.url("folder/inner/file")->path()) << "content";
+  const bool isPossible =
+      giveIdentity(other_.url("folder"), "7") && giveIdentity(other_.url("folder/inner/file"), "8");
+  if (!isPossible) GTEST_SKIP() << "/dev/shm keeps no attributes here";
   const auto answer = move(other_.url("folder"), url("tree"), "moved");
   EXPECT_EQ(answer.error, nullptr) << answer.error->description();
   EXPECT_EQ(get("tree/moved/inner/file"), "content");
+  EXPECT_EQ(identityOf("tree/moved"), "7");
+  EXPECT_EQ(identityOf("tree/moved/inner/file"), "8");
   EXPECT_FALSE(fs::exists(other_.url("folder")->path()));
   EXPECT_EQ(count("staging"), 0U);
 }
@@ -248,6 +267,26 @@ TEST_F(FileOperationsAcrossTest, AMoveThatCannotFinishLeavesTheSource) {
   EXPECT_EQ(move(other_.url("file"), url("tree")).number(), EIO);
   EXPECT_TRUE(fs::exists(other_.url("file")->path()));
   EXPECT_FALSE(exists("tree/file"));
+}
+
+TEST_F(FileOperationsAcrossTest, WhatDiesBetweenTheCopyAndTheRemovalLosesNothing) {
+  std::ofstream(other_.url("file")->path()) << "content";
+  EXPECT_EXIT(
+      {
+        (void)FaultPoint::arm("fileprovider.move.copy-in-place=abort");
+        const NSURLRef source = other_.url("file");
+        (void)moveFile({source, source->path()}, {{url("tree"), at("tree")}, "file"});
+      },
+      testing::KilledBySignal(SIGABRT), "");
+  EXPECT_EQ(getFrom(other_.url("file")), "content");
+  EXPECT_EQ(get("tree/file"), "content");
+  EXPECT_EQ(count("tree"), 2U) << "the copy, and the folder that was there";
+  EXPECT_EQ(count("staging"), 0U);
+  // Who tries again is told of the copy, and may move it under another name.
+  EXPECT_TRUE(move(other_.url("file"), url("tree")).is(NSFileWriteFileExistsError));
+  EXPECT_EQ(getFrom(other_.url("file")), "content");
+  EXPECT_EQ(move(other_.url("file"), url("tree"), "again").path(), at("tree/again"));
+  EXPECT_EQ(get("tree/file") + get("tree/again"), "contentcontent");
 }
 
 TEST_F(FileOperationsAcrossTest, StagesBesideTheDestinationWhenTheStagingFolderIsElsewhere) {

@@ -1,6 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/xattr.h>
 
+#include "platform/foundation/fault_attributes.h"
 #include "platform/ostrell/errors.h"
 #include "provider/testing/operations_fixture.h"
 
@@ -86,6 +88,16 @@ TEST_F(ImportTest, AnotherFailureIsAnsweredAsItIs) {
   EXPECT_EQ(answer.item, nullptr);
   EXPECT_EQ(domainAndCode(answer.error), "NSCocoaErrorDomain 4");
   EXPECT_EQ(log.countContaining("[DEBUG] got new URL (null); "), 1U);
+}
+
+TEST_F(ImportTest, AFailureThatOtherOperationsTranslateIsAnsweredAsItIs) {
+  const std::string source = makeSource("away.txt");
+  ASSERT_EQ(setxattr(source.c_str(), kFaultAttribute, "x", 1, 0), 0);
+  import(source);
+  const auto answer = only(items);
+  EXPECT_EQ(answer.item, nullptr);
+  EXPECT_EQ(domainAndCode(answer.error), "NSCocoaErrorDomain 4354");
+  EXPECT_FALSE(exists(inRoot("folder/away.txt")));
 }
 
 TEST_F(ImportTest, ADocumentThatCannotBeLookedUpAnswersNeitherItemNorError) {

@@ -258,7 +258,7 @@ TEST_F(ReparentTest, MovesDownloadBesideEachOther) {
   }
 }
 
-TEST_F(ReparentTest, TwoMovesOfOneItemBothKeepItAndOneOfThemFindsItGone) {
+TEST_F(ReparentTest, OfTwoMovesOfOneItemOneFindsItGone) {
   addFolder(8, "other");
   answerCapabilityWith(QSMoveCapabilityAcrossContainers);
   answerLookupsWithTheItem();

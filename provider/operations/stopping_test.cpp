@@ -1,11 +1,13 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <memory>
 #include <utility>
 #include <vector>
 
 #include "platform/ostrell/errors.h"
+#include "provider/testing/gate.h"
 #include "provider/testing/operations_fixture.h"
 
 namespace yomber {
@@ -28,12 +30,34 @@ class StoppingTest : public OperationsTest {
   }
   /// Moves the item to another container; its download is under way when this returns.
   void beginForcedDownloadOf(const std::string& identifier) {
+    beginForcedDownloadOf(identifier, into(items));
+  }
+  void beginForcedDownloadOf(const std::string& identifier, ItemHandler handler) {
     answerCapabilityWith(QSMoveCapabilityAcrossContainers);
     addFolder(90, "elsewhere");
     daemon.hold("startProviding");
     const auto before = daemon.callCount("startProviding");
-    extension->reparentItemWithIdentifier(identifier, "i:90", std::nullopt, into(items));
+    extension->reparentItemWithIdentifier(identifier, "i:90", std::nullopt, std::move(handler));
     ASSERT_TRUE(daemon.waitForCalls("startProviding", before + 1));
+  }
+  void failProviding() {
+    daemon.scriptContent([](ScriptedContentAnswers& answers) {
+      answers.startProviding = [](const std::string&, std::uint64_t) {
+        return NSError::errorWithDomain(NSCocoaErrorDomain, 4354);
+      };
+    });
+  }
+  /// A handler that does this; the gate opens when nothing of its request is left to be done.
+  static ItemHandler handlerOf(const std::shared_ptr<Gate>& ended,
+                               const std::function<void(const ItemAnswer&)>& what) {
+    const std::shared_ptr<void> last(nullptr, [ended](void*) { ended->open(); });
+    return [last, what](const NSFileProviderItemRef& item, const NSErrorRef& error) {
+      what({item, error});
+    };
+  }
+  [[nodiscard]] std::size_t refusedStops(const std::string& name) const {
+    return log.count(LogLevel::Default, "[WARNING] Can't cancel download of " + inRoot(name) +
+                                            " which is downloading for CZM");
   }
   void stop(const std::string& name) { extension->stopProvidingItemAtURL(urlInRoot(name)); }
   void expectNothingWasStopped() {
@@ -85,10 +109,7 @@ TEST_F(StoppingTest, WhatIsDownloadingForAMoveIsNotStopped) {
   beginForcedDownloadOf("d:5");
   log.forget();
   stop("moving.txt");
-  EXPECT_EQ(
-      log.count(LogLevel::Default, "[WARNING] Can't cancel download of " + inRoot("moving.txt") +
-                                       " which is downloading for CZM"),
-      1U);
+  EXPECT_EQ(refusedStops("moving.txt"), 1U);
   expectNothingWasStopped();
   know(5, inRoot("elsewhere/moving.txt"));
   daemon.release("startProviding");
@@ -162,36 +183,62 @@ TEST_F(StoppingTest, AnItemWhoseLocationIsNotKnownAnyMoreKeepsNothing) {
   EXPECT_EQ(items->wait().size(), 1U);
 }
 
-TEST_F(StoppingTest, OnceTheMoveHasBegunStopsCountAgain) {
+TEST_F(StoppingTest, OnceTheMoveHasBegunStopsCountAgainBeforeItIsAnswered) {
   addDocument(5, "moving.txt");
   beginForcedDownloadOf("d:5");
   const std::string moved = inRoot("elsewhere/moving.txt");
   know(5, moved);
+  daemon.hold("itemAtLocation");
   daemon.release("startProviding");
-  EXPECT_EQ(only(items).error, nullptr);
-  // The list is cleared after the move was started, maybe after it was answered.
-  const auto url = NSURL::fileURLWithPath(moved);
+  ASSERT_TRUE(daemon.waitForCalls("itemAtLocation"));
+  // The move may have come so far before the thread that began it has ended the keeping.
   EXPECT_TRUE(daemon.waitUntil([&] {
-    extension->stopProvidingItemAtURL(url);
+    stop("elsewhere/moving.txt");
     return daemon.callCount("evict") > 0;
   }));
   EXPECT_THAT(daemon.calls(), Contains(Call{"evict", {moved}}));
+  EXPECT_TRUE(items->values().empty());
+  daemon.release("itemAtLocation");
+  EXPECT_EQ(only(items).error, nullptr);
 }
 
-TEST_F(StoppingTest, AFailedDownloadEndsTheKeepingToo) {
+TEST_F(StoppingTest, AFailedDownloadEndsTheKeepingAfterItIsAnswered) {
   addDocument(5, "moving.txt");
-  daemon.scriptContent([](ScriptedContentAnswers& answers) {
-    answers.startProviding = [](const std::string&, std::uint64_t) {
-      return NSError::errorWithDomain(NSCocoaErrorDomain, 4354);
-    };
-  });
-  beginForcedDownloadOf("d:5");
+  failProviding();
+  const auto ended = std::make_shared<Gate>();
+  beginForcedDownloadOf("d:5", handlerOf(ended, [&](const ItemAnswer& answer) {
+                          stop("moving.txt");
+                          items->add(answer);
+                        }));
   daemon.release("startProviding");
   EXPECT_EQ(domainAndCode(only(items).error), "NSCocoaErrorDomain 4354");
-  EXPECT_TRUE(daemon.waitUntil([&] {
-    stop("moving.txt");
-    return daemon.callCount("evict") > 0;
-  }));
+  EXPECT_EQ(refusedStops("moving.txt"), 1U);
+  expectNothingWasStopped();
+  ASSERT_TRUE(ended->wait());
+  stop("moving.txt");
+  EXPECT_EQ(daemon.callCount("evict"), 1U);
+}
+
+TEST_F(StoppingTest, OfTwoMovesOfOneItemEachKeepsItUntilItsOwnDownloadEnds) {
+  addDocument(5, "moving.txt");
+  failProviding();
+  const auto firstEnded = std::make_shared<Gate>();
+  const auto secondEnded = std::make_shared<Gate>();
+  const auto secondMayEnd = std::make_shared<Gate>();
+  beginForcedDownloadOf("d:5", handlerOf(firstEnded, [](const ItemAnswer&) {}));
+  beginForcedDownloadOf("d:5", handlerOf(secondEnded, [secondMayEnd](const ItemAnswer&) {
+                          EXPECT_TRUE(secondMayEnd->wait());
+                        }));
+  daemon.release("startProviding");
+  ASSERT_TRUE(firstEnded->wait());
+  stop("moving.txt");
+  EXPECT_EQ(refusedStops("moving.txt"), 1U);
+  expectNothingWasStopped();
+  secondMayEnd->open();
+  ASSERT_TRUE(secondEnded->wait());
+  stop("moving.txt");
+  EXPECT_EQ(refusedStops("moving.txt"), 1U);
+  EXPECT_EQ(daemon.callCount("evict"), 1U);
 }
 
 // ---- Change notices and moves -------------------------------------------------------------------

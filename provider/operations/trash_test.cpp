@@ -47,6 +47,28 @@ TEST_F(TrashTest, ABookmarkIsTrashedItself) {
   EXPECT_FALSE(exists(inRoot("bookmark")));
 }
 
+TEST_F(TrashTest, AFileThatHasAnotherNameOnThisDiskIsTrashed) {
+  const std::string location = inRoot("a name that the disk cannot hold");
+  daemon.addItem(scriptedDocument(5, "a name that the disk cannot hold"), location);
+  const std::string onDisk = makeFile("short");
+  daemon.scriptContent([&](ScriptedContentAnswers& answers) {
+    answers.physicalLocation = [onDisk](const std::string&) {
+      return ScriptedLocation{onDisk, nullptr};
+    };
+    answers.trash = [onDisk, target = inTrash("short")](const std::string&) {
+      std::filesystem::rename(onDisk, target);
+      return ScriptedLocation{target, nullptr};
+    };
+  });
+  know(6, inTrash("short"));
+  trash("d:5");
+  EXPECT_EQ(only(items).identifier(), "d:6");
+  EXPECT_EQ(only(items).error, nullptr);
+  EXPECT_FALSE(exists(onDisk));
+  EXPECT_THAT(daemon.calls(), Contains(Call{"physicalLocation", {location}}));
+  EXPECT_THAT(daemon.calls(), Contains(Call{"trash", {location}}));
+}
+
 TEST_F(TrashTest, AnUnknownItemIsMissing) {
   trash("d:404");
   ASSERT_EQ(items->values().size(), 1U);

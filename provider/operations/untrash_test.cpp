@@ -136,6 +136,21 @@ TEST_F(UntrashTest, ATakenNameIsMadeFree) {
   EXPECT_EQ(contentOf(inRoot("origin/old.txt")), "another");
 }
 
+TEST_F(UntrashTest, AFileThatHasAnotherNameOnThisDiskIsPutBack) {
+  addFolder(7, "folder");
+  const std::string onDisk = inTrash("short");
+  std::filesystem::rename(trashed, onDisk);
+  daemon.scriptContent([&](ScriptedContentAnswers& answers) {
+    answers.physicalLocation = [onDisk](const std::string&) {
+      return ScriptedLocation{onDisk, nullptr};
+    };
+  });
+  untrash("i:7");
+  expectPutBackTo(inRoot("folder/old.txt"));
+  EXPECT_FALSE(exists(onDisk));
+  EXPECT_THAT(daemon.calls(), Contains(Call{"physicalLocation", {trashed}}));
+}
+
 TEST_F(UntrashTest, AnUnknownItemIsMissing) {
   extension->untrashItemWithIdentifier("d:404", std::nullopt, into(items));
   ASSERT_EQ(items->values().size(), 1U);

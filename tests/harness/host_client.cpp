@@ -99,6 +99,13 @@ NSErrorRef HostClient::provide(const std::string& path, Need& need) const {
   return lost ? lost : failure;
 }
 
+void HostClient::provideAndForget(const std::string& path) const {
+  auto handle = ipc::call(
+      control_, &Control::Client::startProvidingRequest,
+      [=](auto params) { params.setPath(wireData(path)); }, [](const NSErrorRef&, const auto*) {});
+  handle.cancel();
+}
+
 NSErrorRef HostClient::stopProviding(const std::string& path) const {
   NSErrorRef failure;
   const NSErrorRef lost = ipc::callAndWait(

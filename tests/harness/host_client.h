@@ -36,6 +36,8 @@ class HostClient {
   /// While it lives, the host asks nobody to give the content up.
   using Need = ipc::Remote<protocol::Need>;
   [[nodiscard]] NSErrorRef provide(const std::string& path, Need& need) const;
+  /// Asks and takes the wish back at once.
+  void provideAndForget(const std::string& path) const;
   [[nodiscard]] NSErrorRef stopProviding(const std::string& path) const;
 
   /// The identifiers of what a folder holds, as it is listed; nothing when it cannot be.

@@ -80,6 +80,10 @@ std::optional<std::int64_t> jobsInDatabase(const std::string& home) {
   }
 }
 
+std::string ManifestCheck::trashFolder() const {
+  return load_.options().home + "/tree/.Trash/files";
+}
+
 void ManifestCheck::nothingWrongCanBeRead() const {
   for (const auto& worker : load_.workers()) {
     for (const Document& document : worker->documents()) {
@@ -175,6 +179,21 @@ void ManifestCheck::everythingIsThere() const {
     }
     expectFolders(*worker);
   }
+  expectTrash();
+}
+
+void ManifestCheck::expectTrash() const {
+  std::set<std::string> names;
+  for (const auto& worker : load_.workers()) {
+    for (const Document& document : worker->documents()) {
+      if (document.isInTrash) names.insert(nameOf(worker->zarn()->locationOf(document.id)));
+    }
+  }
+  std::set<std::string> onDisk;
+  for (const auto& entry : fs::directory_iterator(trashFolder())) {
+    onDisk.insert(entry.path().filename());
+  }
+  EXPECT_EQ(onDisk, names) << "in the trash";
 }
 
 void ManifestCheck::expectFolders(LoadWorker& worker) const {

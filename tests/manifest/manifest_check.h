@@ -43,6 +43,9 @@ class ManifestCheck {
   [[nodiscard]] bool isSettled(LoadWorker& worker, std::string& reason) const;
   bool resolve(LoadWorker& worker, std::string& reason) const;
   void expectFolders(LoadWorker& worker) const;
+  void expectTrash() const;
+  /// Where on disk the trash keeps what is in it.
+  [[nodiscard]] std::string trashFolder() const;
   void expectProvided(LoadWorker& worker, const Document& document) const;
   [[nodiscard]] std::map<int, std::vector<std::string>> filesByNumber(LoadWorker& worker) const;
   void look(Document& document, const std::vector<std::string>& files,

@@ -52,7 +52,7 @@ bool isSoundDatabase(const std::string& path) {
 }
 
 std::map<int, std::vector<std::string>> ManifestCheck::filesByNumber(LoadWorker& worker) const {
-  std::vector<std::string> folders{load_.options().home + "/tree/.Trash/files"};
+  std::vector<std::string> folders{trashFolder()};
   for (const LoadWorker::Folder& folder : worker.folders()) folders.push_back(folder.path);
   std::map<int, std::vector<std::string>> files;
   for (const std::string& folder : folders) {

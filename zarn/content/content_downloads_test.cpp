@@ -77,6 +77,34 @@ TEST_F(ContentDownloadsTest, ADownloadThatNobodyWishesForAnyLongerIsGivenUp) {
   EXPECT_EQ(provide("a"), nullptr);
 }
 
+TEST_F(ContentDownloadsTest, ContentThatIsWholeStaysAlsoWhenNobodyWishesForItAnyLonger) {
+  const std::string text = content(3'000'000);
+  makeFault("a", text);
+  const struct stat before = status("a");
+  for (const char* point :
+       {"zarn.fill.verified", "zarn.fill.dated", "zarn.fill.filled", "zarn.download.filled"}) {
+    ASSERT_EQ(evict("a"), nullptr) << point;
+    const std::uint64_t finished = engine->transfers().finished;
+    stopAt(point);
+    Answer answer;
+    auto wish = engine->startProviding(at("a"), 0, answer.take());
+    ASSERT_TRUE(isStopped()) << point;
+    wish.reset();
+    EXPECT_TRUE(answer.get()->is(NSCocoaErrorDomain, NSUserCancelledError)) << point;
+    go();
+    ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+    EXPECT_FALSE(isFault("a")) << point;
+    EXPECT_TRUE(read("a") == text) << point;
+    EXPECT_EQ(status("a").st_mtim.tv_sec, before.st_mtim.tv_sec) << point;
+    EXPECT_EQ(status("a").st_mtim.tv_nsec, before.st_mtim.tv_nsec) << point;
+    EXPECT_EQ(state("a").local, ContentState::Local::Here) << point;
+    EXPECT_EQ(engine->transfers().finished, finished + 1) << point;
+    EXPECT_EQ(engine->transfers().waiting, 0U) << point;
+    EXPECT_EQ(answer.calls(), 1) << point;
+    FaultPoint::disarmAll();
+  }
+}
+
 TEST_F(ContentDownloadsTest, AWishThatComesAsTheLastOneGoesIsServed) {
   const std::string text = content(3'000'000);
   makeFault("a", text);

@@ -1,6 +1,9 @@
 #include <sys/wait.h>
 
+#include <thread>
+
 #include "zarn/content/test_content.h"
+#include "zarn/content/test_leases.h"
 #include "zarn/write_transaction.h"
 
 namespace yomber {
@@ -43,6 +46,21 @@ class ContentKillTest : public ContentDrive, public testing::WithParamInterface<
     scan();
     ASSERT_TRUE(engine->waitUntilIdle(kPatience));
   }
+  /// After a death in its filling: whole or a fault, and the content comes.
+  void expectContentComes(const std::string& path, const std::string& text,
+                          const struct stat& before) {
+    if (!isFault(path)) {
+      EXPECT_TRUE(read(path) == text);
+    }
+    EXPECT_EQ(provide(path), nullptr);
+    EXPECT_TRUE(read(path) == text);
+    EXPECT_EQ(status(path).st_ino, before.st_ino);
+    EXPECT_EQ(status(path).st_mtim.tv_sec, before.st_mtim.tv_sec);
+    EXPECT_EQ(status(path).st_mtim.tv_nsec, before.st_mtim.tv_nsec);
+    ASSERT_TRUE(waitUntil([&] { return state(path).upload == ContentState::Upload::Confirmed; }));
+    EXPECT_TRUE(contentInStore(id(path)) == text);
+    EXPECT_EQ(engine->transfers().waiting, 0U);
+  }
 };
 
 class UploadKillTest : public ContentKillTest {};
@@ -60,9 +78,9 @@ TEST_P(UploadKillTest, TheNextProcessGoesOnWithTheUpload) {
 }
 
 INSTANTIATE_TEST_SUITE_P(AtEachPoint, UploadKillTest,
-                         testing::Values("zarn.upload.read", "zarn.upload.staged",
-                                         "zarn.upload.synced", "zarn.upload.committed",
-                                         "zarn.upload.confirmed"));
+                         testing::Values("zarn.upload.read", "zarn.upload.reading",
+                                         "zarn.upload.staged", "zarn.upload.synced",
+                                         "zarn.upload.committed", "zarn.upload.confirmed"));
 
 TEST_P(EvictionKillTest, TheFileIsWholeOrAFaultAndItsContentComesBack) {
   const std::string text = content(500'000);
@@ -96,17 +114,7 @@ TEST_P(DownloadKillTest, TheFileIsAFaultUntilItsContentIsWhole) {
   const struct stat before = status("a");
   ASSERT_EQ(evict("a"), nullptr);
   dieDuring(GetParam(), [&] { (void)provide("a"); });
-  if (!isFault("a")) {
-    EXPECT_TRUE(read("a") == text);
-  }
-  EXPECT_EQ(provide("a"), nullptr);
-  EXPECT_TRUE(read("a") == text);
-  EXPECT_EQ(status("a").st_ino, before.st_ino);
-  EXPECT_EQ(status("a").st_mtim.tv_sec, before.st_mtim.tv_sec);
-  EXPECT_EQ(status("a").st_mtim.tv_nsec, before.st_mtim.tv_nsec);
-  ASSERT_TRUE(waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; }));
-  EXPECT_TRUE(contentInStore(id("a")) == text);
-  EXPECT_EQ(engine->transfers().waiting, 0U);
+  expectContentComes("a", text, before);
 }
 
 INSTANTIATE_TEST_SUITE_P(AtEachPoint, DownloadKillTest,
@@ -115,6 +123,24 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, DownloadKillTest,
                                          "zarn.fill.dated", "zarn.fill.filled",
                                          "zarn.download.filled", "zarn.settle.synced",
                                          "zarn.settle.unmarked"));
+
+TEST_F(ContentKillTest, WhoDiesWhileAReaderWaitsForTheContentLosesNoneOfIt) {
+  const std::string text = content(5'000'000);
+  makeFault("a", text);
+  const struct stat before = status("a");
+  dieDuring("zarn.fill.waited", [&] {
+    stopAt("zarn.fill.copying");
+    Answer answer;
+    const auto wish = engine->startProviding(at("a"), 0, answer.take());
+    ASSERT_TRUE(isStopped());
+    std::thread reader([&] { (void)FileDescriptor(::open(at("a").c_str(), O_RDONLY)); });
+    ASSERT_TRUE(waitUntil([&] { return isLeaseWaitedFor(status("a")); }));
+    go();
+    (void)answer.get();
+    reader.join();
+  });
+  expectContentComes("a", text, before);
+}
 
 class ThumbnailKillTest : public ContentKillTest {};
 

@@ -1,8 +1,8 @@
 // Others who write to faults while they are filled, and what becomes of their bytes.
-#include <fstream>
 #include <thread>
 
 #include "zarn/content/test_content.h"
+#include "zarn/content/test_leases.h"
 
 namespace yomber {
 namespace {
@@ -13,16 +13,7 @@ constexpr off_t kWhere = 4'500'000;
 class ForeignWritesTest : public ContentDrive {
  protected:
   /// Whether somebody waits for the end of a lease on the file.
-  bool isWaitedFor(const std::string& path) const {
-    const std::string inode = ":" + std::to_string(status(path).st_ino) + " ";
-    std::ifstream locks("/proc/locks");
-    for (std::string line; std::getline(locks, line);) {
-      if (line.find("BREAKING") != std::string::npos && line.find(inode) != std::string::npos) {
-        return true;
-      }
-    }
-    return false;
-  }
+  bool isWaitedFor(const std::string& path) const { return isLeaseWaitedFor(status(path)); }
   [[nodiscard]] FileDescriptor openAt(const std::string& path, int flags) const {
     FileDescriptor file(::open(at(path).c_str(), flags | O_CLOEXEC));
     EXPECT_TRUE(file) << path;

@@ -1,5 +1,7 @@
 #include <algorithm>
+#include <array>
 #include <chrono>
+#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -17,6 +19,15 @@ namespace {
 
 namespace fs = std::filesystem;
 using Names = std::vector<std::string>;
+
+/// To the second, as dates are printed.
+std::string nowUtc() {
+  const std::time_t now = std::time(nullptr);
+  std::tm parts{};
+  gmtime_r(&now, &parts);
+  std::array<char, 32> text{};
+  return {text.data(), std::strftime(text.data(), text.size(), "%Y-%m-%dT%H:%M:%S", &parts)};
+}
 
 /// A drive that is up, and a folder of this machine beside it.
 class Commands : public ::testing::Test {
@@ -168,6 +179,43 @@ TEST_F(Commands, MarksAreSetShownAndTakenAway) {
   EXPECT_EQ(drive_.json({"used", "file", "--at", "2026-03-01T12:00:00Z"}).at(0)["last_used"],
             "2026-03-01T12:00:00Z");
   EXPECT_EQ(codeOf({"used", "file", "--at", "yesterday"}), 64);
+}
+
+TEST_F(Commands, WithoutADateAnItemHasBeenUsedNowAndClearedItNeverWas) {
+  add("file");
+  const auto dateOf = [](const nlohmann::json& item) {
+    return item.at("last_used").get<std::string>().substr(0, nowUtc().size());
+  };
+  const std::string before = nowUtc();
+  const auto used = drive_.json({"used", "file"}).at(0);
+  EXPECT_GE(dateOf(used), before);
+  EXPECT_LE(dateOf(used), nowUtc());
+  EXPECT_EQ(drive_.json({"stat", "file"}).at(0)["last_used"], used["last_used"]);
+  EXPECT_FALSE(drive_.json({"used", "file", "--clear"}).at(0).contains("last_used"));
+  EXPECT_FALSE(drive_.json({"stat", "file"}).at(0).contains("last_used"));
+}
+
+TEST_F(Commands, WithToEveryArgumentIsAnItem) {
+  ASSERT_EQ(codeOf({"mkdir", "a", "b"}), 0);
+  add("x");
+  const auto moved = drive_.json({"mv", "x", "a", "--to", "b"});
+  ASSERT_EQ(moved.size(), 2U);
+  EXPECT_EQ(drive_.names(), Names{"b"});
+  EXPECT_EQ(drive_.names("b"), (Names{"a", "x"}));
+  EXPECT_EQ(codeOf({"mv", "b/x", "--to", "/"}), 0) << "one item is enough";
+  EXPECT_EQ(drive_.names(), (Names{"b", "x"}));
+  EXPECT_EQ(codeOf({"mv", "x", "--to", "nowhere"}), 66);
+}
+
+TEST_F(Commands, AScriptIsToldOfEachThatIsRemovedAndOfWhatIsNot) {
+  add("x");
+  add("y");
+  const auto removed = drive_.yomber({"--json", "rm", "x", "nothing", "y"});
+  EXPECT_EQ(removed.exitCode, 66);
+  EXPECT_EQ(removed.output, "{\"done\":true}\n{\"done\":true}\n");
+  EXPECT_TRUE(nlohmann::json::parse(removed.errors).at("error").contains("message"));
+  EXPECT_FALSE(fs::exists(inside("x")));
+  EXPECT_FALSE(fs::exists(inside("y")));
 }
 
 TEST_F(Commands, ChangesAreToldSinceTheLastTime) {

@@ -10,6 +10,7 @@
 #include <iterator>
 #include <map>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -20,6 +21,7 @@
 #include "tests/harness/content_client.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/stored_thumbnails.h"
+#include "tests/harness/terminal_process.h"
 #include "tests/harness/test_drive.h"
 #include "yomber/drive_client.h"
 #include "yomber/drive_thumbnails.h"
@@ -30,6 +32,7 @@ namespace {
 namespace fs = std::filesystem;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
+using ::testing::Not;
 using ::testing::SizeIs;
 using Local = ContentClient::Local;
 
@@ -90,6 +93,9 @@ class ThumbnailsSystem : public ::testing::Test {
     }
     return count;
   }
+  [[nodiscard]] std::string outside(const std::string& name) const {
+    return fs::path(drive_.home()).parent_path() / name;
+  }
   [[nodiscard]] std::string offline() const { return drive_.home() + "/store/offline"; }
 
   TestDrive drive_;
@@ -127,6 +133,77 @@ TEST_F(ThumbnailsSystem, WhatHasNoThumbnailIsSaidInWords) {
   EXPECT_EQ(missing.exitCode, 66);
   EXPECT_THAT(missing.output, HasSubstr("p0.dat 2.png"));
   EXPECT_EQ(drive_.yomber({"thumbnail", "folder", "--size", "12", "--out", out}).exitCode, 64);
+}
+
+TEST_F(ThumbnailsSystem, AtATerminalALineCountsAndASumStandsForAllThatHaveOne) {
+  ASSERT_NO_FATAL_FAILURE(upWithDocuments(3));
+  drive_.write("photos/plain.dat", "no picture");
+  ASSERT_TRUE(eventually([&] { return drive_.names("photos").size() == 4; }));
+  const std::string out = outside("out");
+  TerminalProcess command(drive_.commandLine({"thumbnail", "-r", "photos", "--out", out}),
+                          drive_.environment());
+  EXPECT_EQ(command.waitForEnd(), 0);
+  const std::string& printed = command.printed();
+  EXPECT_TRUE(printed.starts_with("\r1 of 4")) << printed;
+  EXPECT_THAT(printed, HasSubstr("\r4 of 4"));
+  EXPECT_THAT(printed, HasSubstr("\r\x1b[Knone  plain.dat: it has no thumbnail\n"));
+  EXPECT_TRUE(printed.ends_with("\r\x1b[K3 of 4 items have a thumbnail\n")) << printed;
+  EXPECT_THAT(printed, Not(HasSubstr("thumbnail  " + out)));
+  EXPECT_EQ(contentOf(out + "/p2.dat.png"), pictureOf(2));
+}
+
+TEST_F(ThumbnailsSystem, WhatIsNotPrintedToTheTerminalIsALineForEachAllTheSame) {
+  ASSERT_NO_FATAL_FAILURE(upWithDocuments(3));
+  const std::string out = outside("out");
+  const std::string list = outside("list");
+  std::vector<std::string> words{"/bin/sh", "-c", "exec \"$@\" >\"$0\"", list};
+  for (const std::string& word : drive_.commandLine({"thumbnail", "-r", "photos", "--out", out})) {
+    words.push_back(word);
+  }
+  TerminalProcess command(words, drive_.environment());
+  EXPECT_EQ(command.waitForEnd(), 0);
+  EXPECT_THAT(command.printed(), HasSubstr("\r3 of 3"));
+  const std::string listed = contentOf(list);
+  for (const char* const name : {"p0", "p1", "p2"}) {
+    EXPECT_THAT(listed, HasSubstr("thumbnail  " + out + "/" + name + ".dat.png\n"));
+  }
+  EXPECT_THAT(listed, Not(HasSubstr("items have a thumbnail")));
+}
+
+TEST_F(ThumbnailsSystem, AtATerminalALineOfJsonHasTheLineToItself) {
+  ASSERT_NO_FATAL_FAILURE(upWithDocuments(2));
+  TerminalProcess command(
+      drive_.commandLine({"--json", "thumbnail", "-r", "photos", "--out", outside("out")}),
+      drive_.environment());
+  EXPECT_EQ(command.waitForEnd(), 0);
+  std::istringstream lines(command.printed());
+  for (int number = 0; number < 2; ++number) {
+    std::string line;
+    ASSERT_TRUE(std::getline(lines, line)) << command.printed();
+    EXPECT_THAT(line, HasSubstr("\r\x1b[K{"));
+    EXPECT_TRUE(nlohmann::json::accept(line.substr(line.find('{')))) << line;
+  }
+}
+
+TEST_F(ThumbnailsSystem, AScriptIsToldOfWhatHasNoThumbnailToo) {
+  ASSERT_NO_FATAL_FAILURE(upWithDocuments(1));
+  drive_.write("plain.dat", "no picture");
+  ASSERT_TRUE(eventually([&] { return drive_.names().size() == 2; }));
+  const auto lines = drive_.json({"thumbnail", "plain.dat", "--out", outside("out")});
+  ASSERT_THAT(lines, SizeIs(1));
+  EXPECT_EQ(lines[0].at("outcome"), "none");
+  EXPECT_EQ(lines[0].at("name"), "plain.dat");
+  EXPECT_FALSE(lines[0].contains("path"));
+}
+
+TEST_F(ThumbnailsSystem, ADocumentsPictureIsTheStoredOneWhateverTheSize) {
+  ASSERT_NO_FATAL_FAILURE(upWithDocuments(1));
+  for (const char* const size : {"16x16", "2000x2000"}) {
+    const auto lines =
+        drive_.json({"thumbnail", "photos/p0.dat", "--size", size, "--out", outside("out")});
+    ASSERT_THAT(lines, SizeIs(1));
+    EXPECT_EQ(contentOf(lines[0].at("path")), pictureOf(0)) << size;
+  }
 }
 
 TEST_F(ThumbnailsSystem, AnExtensionThatIsKilledInTheMiddleLosesNothing) {

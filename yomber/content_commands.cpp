@@ -48,7 +48,8 @@ struct ContentRun {
   }
 
   /// Any thread.
-  void report(const std::string& path, const char* outcome, nlohmann::ordered_json more = {}) {
+  void report(const std::string& path, const char* outcome,
+              const nlohmann::ordered_json& more = nlohmann::ordered_json::object()) {
     LockGuard guard(mutex);
     if (context.json) {
       nlohmann::ordered_json line{{"location", path}, {"outcome", outcome}};

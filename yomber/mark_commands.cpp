@@ -5,10 +5,12 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <nlohmann/json.hpp>
 
+#include "platform/ostrell/constants.h"
 #include "yomber/command.h"
 #include "yomber/drive_changes.h"
 #include "yomber/item_output.h"
@@ -113,12 +115,30 @@ void runUsed(CommandContext& context, const MarkOptions& options) {
              });
 }
 
+/// Why an application has no folder, in words that name it.
+NSErrorRef withReason(const NSErrorRef& error, const std::string& application) {
+  std::string reason;
+  if (error->is(QSOstrellErrorDomain, QSOstrellErrorInvalidParameter)) {
+    reason = "no application " + printableName(application) + " is installed";
+  } else if (error->is(QSOstrellErrorDomain, QSOstrellErrorNotEntitled)) {
+    reason =
+        printableName(application) + " has no folder in the drive: its .desktop file names none";
+  } else {
+    return error;
+  }
+  auto info = error->userInfo();
+  info[NSLocalizedDescriptionKey] = std::move(reason);
+  return NSError::errorWithDomain(error->domain(), error->code(), std::move(info));
+}
+
 void runAppFolder(CommandContext& context, const MarkOptions& options) {
   DriveClient client(context.paths());
   NSErrorRef error;
   const auto changes = DriveChanges::open(client, &error);
   if (!changes) return context.fail(error);
-  report(context, changes->defaultApplicationContainer(options.item));
+  ChangeResult result = changes->defaultApplicationContainer(options.item);
+  if (result.error) result.error = withReason(result.error, options.item);
+  report(context, result);
 }
 
 }  // namespace

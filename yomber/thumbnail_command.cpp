@@ -80,7 +80,11 @@ class ThumbnailRun {
  public:
   ThumbnailRun(CommandContext& context, const std::string& folder,
                const std::unordered_map<std::string, std::string>& names)
-      : context_(context), files_(folder), names_(names), progress_(names.size()) {}
+      : context_(context),
+        files_(folder),
+        names_(names),
+        progress_(names.size()),
+        isSummed_(progress_.isShown() && !context.json && isatty(STDOUT_FILENO) == 1) {}
 
   void take(const ItemThumbnail& thumbnail) {
     const auto found = names_.find(thumbnail.identifier);
@@ -100,7 +104,7 @@ class ThumbnailRun {
 
   void summarize() const {
     progress_.clear();
-    if (!progress_.isShown() || context_.json) return;
+    if (!isSummed_) return;
     std::cout << written_ << " of " << names_.size() << " items have a thumbnail" << std::endl;
   }
 
@@ -108,9 +112,8 @@ class ThumbnailRun {
   using Json = nlohmann::ordered_json;
 
   void takeNone(const ItemThumbnail& thumbnail, const std::string& name) {
-    progress_.clear();
     const bool isNone = thumbnail.error == nullptr || isMissingIcon(thumbnail.error);
-    if (isNone) return report(thumbnail, name, "none", {});
+    if (isNone) return report(thumbnail, name, "none", Json::object());
     report(thumbnail, name, "failed", {{"reason", failureText(thumbnail.error)}});
     const ExitCode code = exitCodeFor(thumbnail.error);
     context_.exitCode = code == ExitCode::Ok ? ExitCode::Failure : code;
@@ -118,6 +121,8 @@ class ThumbnailRun {
 
   void report(const ItemThumbnail& thumbnail, const std::string& name, std::string_view outcome,
               const Json& more) const {
+    if (isSummed_ && outcome == "thumbnail") return;
+    progress_.clear();
     if (context_.json) {
       Json line{{"id", thumbnail.identifier}, {"name", name}, {"outcome", outcome}};
       if (thumbnail.contentType) line["type"] = *thumbnail.contentType;
@@ -128,7 +133,7 @@ class ThumbnailRun {
     } else if (outcome == "failed") {
       std::cout << "failed  " << printableName(name) << ": " << more["reason"].get<std::string>()
                 << std::endl;
-    } else if (!progress_.isShown()) {
+    } else {
       std::cout << "thumbnail  " << printableName(more["path"].get<std::string>()) << std::endl;
     }
   }
@@ -137,6 +142,8 @@ class ThumbnailRun {
   ThumbnailFiles files_;
   const std::unordered_map<std::string, std::string>& names_;
   ProgressLine progress_;
+  /// A person sees how far it is and the sum, in place of a line for each.
+  const bool isSummed_;
   std::size_t done_ = 0;
   std::size_t written_ = 0;
 };
@@ -209,7 +216,10 @@ void addThumbnailCommand(CLI::App& app, CommandContext& context) {
       ->add_option("items", options->items,
                    "Paths from the drive's root, locations in its tree, or identifiers")
       ->required();
-  command->add_option("--size", options->size, "Width and height in points, as 256x256")
+  command
+      ->add_option("--size", options->size,
+                   "Width and height in points, as 256x256, of an application's icon; documents "
+                   "have one stored picture, of at most 1024x1024, whatever the size")
       ->capture_default_str();
   command->add_option("--out", options->folder, "The folder, which is made where it is missing")
       ->capture_default_str();

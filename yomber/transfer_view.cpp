@@ -95,9 +95,11 @@ std::string transferLine(const Transfer& transfer, std::size_t barWidth) {
 }
 
 std::string transferSummary(const Transfers& transfers) {
-  if (transfers.underWay.empty() && transfers.waiting == 0) return "none";
-  return std::to_string(transfers.underWay.size()) + " under way, " +
-         std::to_string(transfers.waiting) + " waiting";
+  const std::uint64_t underWay = transfers.underWay.size();
+  if (underWay == 0 && transfers.waiting == 0) return "none";
+  // Those under way are among all that wait.
+  const std::uint64_t others = std::max(transfers.waiting, underWay) - underWay;
+  return std::to_string(underWay) + " under way, " + std::to_string(others) + " waiting";
 }
 
 NSErrorRef followTransfers(const ipc::Remote<protocol::Daemon>& daemon) {

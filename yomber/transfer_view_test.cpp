@@ -40,7 +40,16 @@ TEST(TransferView, SumsUp) {
   EXPECT_EQ(transferSummary(transfers), "none");
   transfers.underWay.push_back(transferOf(1, 2));
   transfers.waiting = 5;
-  EXPECT_EQ(transferSummary(transfers), "1 under way, 5 waiting");
+  EXPECT_EQ(transferSummary(transfers), "1 under way, 4 waiting");
+}
+
+TEST(TransferView, CountsADocumentThatIsUnderWayOnce) {
+  Transfers transfers;
+  transfers.underWay.push_back(transferOf(1, 2));
+  for (const std::uint64_t waiting : {0U, 1U}) {
+    transfers.waiting = waiting;
+    EXPECT_EQ(transferSummary(transfers), "1 under way, 0 waiting") << waiting;
+  }
 }
 
 }  // namespace

@@ -85,6 +85,24 @@ TEST_F(Browse, SymbolicLinkLoopsAreListedAndFollowedByNobody) {
   fs::create_directory_symlink(".", drive_.root() + "/self");
   drive_.up();
   EXPECT_EQ(drive_.names(), (std::vector<std::string>{"a", "b", "self"}));
+  // Each is an item, but what it leads to is none.
+  for (const char* name : {"a", "b"}) {
+    const ProcessResult found = drive_.yomber({"id", name});
+    EXPECT_EQ(found.exitCode, 0) << name << found.errors;
+    const std::string identifier = found.output.substr(0, found.output.find('\n'));
+    for (const std::string& item : {std::string(name), identifier}) {
+      EXPECT_EQ(drive_.yomber({"url", item}).exitCode, 66) << item;
+      EXPECT_EQ(drive_.yomber({"stat", item}).exitCode, 66) << item;
+    }
+  }
+  // The other leads to the root, and below it by its own name there is nothing.
+  const std::string self = drive_.json({"id", "self"}).at(0)["id"];
+  EXPECT_TRUE(self.starts_with("d:")) << self;
+  for (const std::string& item : {std::string("self"), self}) {
+    EXPECT_EQ(drive_.json({"url", item}).at(0)["location"], drive_.root());
+    EXPECT_EQ(drive_.json({"stat", item}).at(0)["id"], drive_.json({"id", "/"}).at(0)["id"]);
+  }
+  EXPECT_EQ(drive_.yomber({"id", "self/self/a"}).exitCode, 66);
 }
 
 TEST_F(Browse, EveryFolderOfTheDriveIsInTheListOfFolders) {

@@ -165,16 +165,46 @@ TEST_F(Recovery, OddNamesAreListedAsTheyAre) {
   drive_.write("cafe\u0301");  // decomposed: the same name to a person
   drive_.up();
   std::set<std::string> shown;
+  std::vector<std::string> encoded;
   std::size_t count = 0;
   for (const nlohmann::json& item : drive_.json({"ls"})) {
     ++count;
     if (item.contains("name")) shown.insert(item["name"]);
+    if (item.contains("name_base64")) encoded.push_back(item["name_base64"]);
   }
   EXPECT_EQ(count, odd.size() + 2);
   for (const std::string& name : {longest, odd[2], odd[3], odd[4], odd[5]})
     EXPECT_TRUE(shown.contains(name)) << name;
+  EXPECT_EQ(encoded, std::vector<std::string>{"YmFkIP/+IHV0Zi04"});
   // One of the twins is shown under another name; both are items of their own.
   EXPECT_FALSE(shown.contains("caf\u00e9") && shown.contains("cafe\u0301"));
+}
+
+TEST_F(Recovery, ItemsWithOddNamesAreFoundByNameByLocationAndByIdentifier) {
+  struct OddName {
+    std::string name;
+    std::string key;    ///< of the name in the JSON
+    std::string value;  ///< what stands there
+  };
+  const std::string longest(255, 'n');
+  const std::vector<OddName> odd{{longest, "name", longest},
+                                 {"two\nlines", "name", "two\nlines"},
+                                 {"bad \xff\xfe utf-8", "name_base64", "YmFkIP/+IHV0Zi04"}};
+  for (const OddName& each : odd) drive_.write(each.name, each.value);
+  drive_.up();
+  for (const auto& [name, key, value] : odd) {
+    const std::string location = drive_.root() + "/" + name;
+    const std::string identifier = drive_.json({"id", name}).at(0)["id"];
+    EXPECT_TRUE(identifier.starts_with("d:")) << identifier;
+    for (const std::string& item : {name, location, identifier}) {
+      EXPECT_EQ(drive_.yomber({"id", item}).output, identifier + "\n") << item;
+      EXPECT_EQ(drive_.yomber({"url", item}).output, location + "\n") << item;
+      const nlohmann::json shown = drive_.json({"stat", item}).at(0);
+      EXPECT_EQ(shown["id"], identifier) << item;
+      EXPECT_EQ(shown[key], value) << item;
+      EXPECT_EQ(shown["size"], value.size()) << item;
+    }
+  }
 }
 
 TEST_F(Recovery, SigningOutPausesAWatchAndSigningInBringsWhatWasMissed) {

@@ -208,6 +208,17 @@ TEST_F(ChangeHistoryTest, AfterABatchTheRankZeroAnchorIsExpiredAndTheHistoryIsDr
   EXPECT_THAT(changesFrom(currentAnchor(enumerator))->calls(), ElementsAre("anchor"));
 }
 
+TEST_F(ChangeHistoryTest, AnExpiredAnchorIsFinishedBeforeTheHistoryIsDropped) {
+  auto observer = std::make_shared<RecordingChangeObserver>();
+  observer->whileCalled = [&](const std::string& call) {
+    EXPECT_EQ(call, "error");
+    EXPECT_TRUE(currentAnchor(enumerator)->isEqualToData(first));
+  };
+  enumerator->enumerateChangesForObserver(observer, NSData::dataWithString("foreign"));
+  expectExpired(observer);
+  EXPECT_FALSE(currentAnchor(enumerator)->isEqualToData(first));
+}
+
 TEST_F(ChangeHistoryTest, AnExpiredAnchorIsNotSignalled) {
   expectExpired(changesFrom(currentAnchor(makeEnumerator())));
   EXPECT_THAT(manager.signals(), IsEmpty());
@@ -243,6 +254,23 @@ TEST_F(ChangeHistoryTest, AnExpiredAnchorIsFinishedWithTheLockHeld) {
   enumerator->enumerateChangesForObserver(observer, NSData::dataWithString("foreign"));
   EXPECT_TRUE(received.wait());
   receiver.join();
+}
+
+TEST_F(ChangeHistoryTest, TheCurrentAnchorIsGivenWhileAnotherThreadHoldsTheLock) {
+  Gate given;
+  std::thread asker;
+  auto observer = std::make_shared<RecordingChangeObserver>();
+  observer->whileCalled = [&](const std::string& call) {
+    EXPECT_EQ(call, "error");
+    asker = std::thread([&] {
+      EXPECT_NE(currentAnchor(enumerator), nullptr);
+      given.open();
+    });
+    EXPECT_TRUE(given.wait());
+  };
+  enumerator->enumerateChangesForObserver(observer, NSData::dataWithString("foreign"));
+  expectExpired(observer);
+  asker.join();
 }
 
 TEST_F(ChangeHistoryTest, NoUpdateIsFinishedWithTheLockHeld) {

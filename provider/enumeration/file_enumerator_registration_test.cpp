@@ -208,6 +208,9 @@ TEST_F(RegistrationTest, AFailureOfAnotherDomainDropsTheHistoryWithoutASignal) {
   // The account's change finds no sender, so it signals too: one signal in all, not two.
   postAccountTokenDidChange();
   EXPECT_THAT(manager.signals(), ElementsAre("i:3"));
+  // What was sent to the daemon before has arrived when the next registration is answered.
+  EXPECT_EQ(setUp(), nullptr);
+  EXPECT_EQ(daemon.callCount("invalidate"), 0U);
 }
 
 TEST_F(RegistrationTest, AFailedWatchDropsTheHistoryAndTheNextListingRegistersAgain) {
@@ -220,6 +223,7 @@ TEST_F(RegistrationTest, AFailedWatchDropsTheHistoryAndTheNextListingRegistersAg
   answerWatchesWith(nullptr);
   EXPECT_EQ(setUp(), nullptr);
   EXPECT_EQ(daemon.callCount("getItemUpdateSender"), 2U);
+  EXPECT_EQ(daemon.callCount("invalidate"), 0U);
 }
 
 TEST_F(RegistrationTest, ALostConnectionDropsTheHistoryAndSignals) {

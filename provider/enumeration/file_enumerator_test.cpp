@@ -154,6 +154,10 @@ TEST_F(FileEnumeratorTest, AConnectionLostDuringTheListingFinishesWithTheConnect
   EXPECT_THAT(observer->calls(), ElementsAre("error"));
   EXPECT_EQ(log.countContaining("received next page"), 0U);
   EXPECT_EQ(log.countContaining("there was an error when listing items"), 0U);
+  // Whoever finished it lets go of it only when done. The inner section stays open.
+  ASSERT_TRUE(daemon.waitUntil([&] { return observer.use_count() == 1; }));
+  EXPECT_EQ(log.count(LogLevel::Debug, kClose), 1U);
+  EXPECT_EQ(log.sectionOf(kClose), log.sectionOf(kOpen));
 }
 
 TEST_F(FileEnumeratorTest, ARefusedRegistrationFinishesTranslatedAndListsNothing) {

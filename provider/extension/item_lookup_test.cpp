@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "platform/ostrell/errors.h"
+#include "platform/ostrell/url_additions.h"
 #include "provider/extension/extension.h"
 #include "provider/testing/provider_fixture.h"
 
@@ -119,6 +120,22 @@ TEST_F(ItemLookupTest, ABookmarkYieldsItselfWhenNotResolving) {
   EXPECT_EQ(pathOf(extension->_URLForItemWithPersistentIdentifier("d:6", ResolveAliases::No)),
             bookmark);
   EXPECT_EQ(log.count(LogLevel::Debug, kBookmarkLine), 0U);
+}
+
+TEST_F(ItemLookupTest, ABookmarkThatLeadsNowhereYieldsNilAndWhyItCannotBeResolved) {
+  const std::string bookmark = makeLink("bookmark", inRoot("missing"));
+  daemon.addItem(scriptedDocument(6, "bookmark"), bookmark);
+  NSErrorRef reason;
+  ASSERT_EQ(qs_URLByResolvingExternalDocumentReferenceWithError(NSURL::fileURLWithPath(bookmark),
+                                                                &reason),
+            nullptr);
+  log.forget();
+  EXPECT_EQ(pathOf(extension->URLForItemWithPersistentIdentifier("d:6")), "nil");
+  const std::vector<std::string> expected{
+      "[DEBUG] ┏# asked url for d:6", kBookmarkLine,
+      "[ERROR] returning nil, there was an error: " + reason->description(), kClose};
+  EXPECT_EQ(among(log.texts(), expected), expected);
+  EXPECT_EQ(log.count(LogLevel::Error, expected[2]), 1U);
 }
 
 TEST_F(ItemLookupTest, APrivateLocationIsReplacedByTheDaemons) {
@@ -318,6 +335,15 @@ TEST_F(ItemLookupTest, ABookmarksIdentifierYieldsItsTargetsItem) {
   const auto item = extension->itemForIdentifier("d:6", nullptr);
   ASSERT_NE(item, nullptr);
   EXPECT_EQ(item->itemIdentifier(), "i:7");
+}
+
+TEST_F(ItemLookupTest, ABookmarkThatLeadsNowhereIsTheFrameworksMissingItem) {
+  daemon.addItem(scriptedDocument(6, "bookmark"), makeLink("bookmark", inRoot("missing")));
+  NSErrorRef error;
+  EXPECT_EQ(extension->itemForIdentifier("d:6", &error), nullptr);
+  EXPECT_EQ(domainAndCode(error), "NSFileProviderErrorDomain -1005");
+  EXPECT_TRUE(error->userInfo().contains(NSFileProviderErrorNonExistentItemIdentifierKey));
+  EXPECT_EQ(daemon.callCount("itemAtLocation"), 0U);
 }
 
 TEST_F(ItemLookupTest, WhenNobodyIsSignedInTheDaemonIsNeverAskedForTheItem) {

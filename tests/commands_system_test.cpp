@@ -132,8 +132,9 @@ TEST_F(Commands, WhatIsRemovedIsGoneAndTheRootNeverIs) {
   EXPECT_EQ(codeOf({"rm", "many"}), 0);
   EXPECT_FALSE(fs::exists(inside("many")));
   EXPECT_EQ(codeOf({"rm", "many"}), 66);
-  for (const char* const command : {"rm", "trash"}) EXPECT_EQ(codeOf({command, "/"}), 1) << command;
-  EXPECT_EQ(codeOf({"rename", "/", "name"}), 1);
+  for (const char* const command : {"rm", "trash"})
+    EXPECT_EQ(codeOf({command, "/"}), 13) << command;
+  EXPECT_EQ(codeOf({"rename", "/", "name"}), 13);
   EXPECT_TRUE(fs::exists(drive_.root()));
 }
 

@@ -24,13 +24,10 @@ void RecentBackups::forgetOld() {
   }
 }
 
-void RecentBackups::note(std::uint64_t item, std::uint64_t folder, std::string_view name,
-                         std::string_view backupName) {
+void RecentBackups::note(const ItemRow& document, std::string_view backupName) {
   LockGuard guard(mutex_);
-  entries_.push_back({.time = clock_(),
-                      .folder = folder,
-                      .name = std::string(name),
-                      .backup = {.item = item, .backupName = std::string(backupName)}});
+  entries_.push_back(
+      {.time = clock_(), .backup = {.document = document, .backupName = std::string(backupName)}});
   forgetOld();
 }
 
@@ -39,7 +36,8 @@ std::optional<RecentBackups::Backup> RecentBackups::take(std::uint64_t folder,
   LockGuard guard(mutex_);
   forgetOld();
   const auto found = std::find_if(entries_.begin(), entries_.end(), [&](const Entry& entry) {
-    return entry.folder == folder && entry.name == name;
+    const ItemRow& document = entry.backup.document;
+    return document.parent == folder && document.nameOnDisk() == name;
   });
   if (found == entries_.end()) return std::nullopt;
   Backup backup = std::move(found->backup);

@@ -9,6 +9,7 @@
 #include <string_view>
 
 #include "platform/foundation/lock.h"
+#include "zarn/item_row.h"
 
 namespace yomber {
 
@@ -25,11 +26,11 @@ class RecentBackups {
   /// When empty, the machine's.
   void setClock(Clock clock);
 
-  void note(std::uint64_t item, std::uint64_t folder, std::string_view name,
-            std::string_view backupName);
+  /// `document` is as it was before.
+  void note(const ItemRow& document, std::string_view backupName);
 
   struct Backup {
-    std::uint64_t item = 0;
+    ItemRow document;  ///< as it was before
     std::string backupName;
   };
   /// The document that had this name until a moment ago; asked for once.
@@ -38,8 +39,6 @@ class RecentBackups {
  private:
   struct Entry {
     std::chrono::steady_clock::time_point time;
-    std::uint64_t folder = 0;
-    std::string name;
     Backup backup;
   };
   void forgetOld() REQUIRES(mutex_);

@@ -142,7 +142,9 @@ class Reconciler {
                     const std::optional<ItemRow>& own);
   void move(WriteTransaction& transaction, const Candidate& candidate, const ItemRow& row);
   void postpone(const Candidate& candidate);
-  void add(WriteTransaction& transaction, const Candidate& candidate);
+  /// `former` is what it was before its row went, where that is known.
+  void add(WriteTransaction& transaction, const Candidate& candidate,
+           std::optional<ItemRow> former = std::nullopt);
   [[nodiscard]] static std::optional<ItemRow> findFormer(WriteTransaction& transaction,
                                                          const Candidate& candidate);
   /// The folder that what is gone was in.

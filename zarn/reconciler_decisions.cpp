@@ -81,15 +81,21 @@ bool Reconciler::takeBackedUp(WriteTransaction& transaction, Candidate& candidat
   if (candidate.entry.type != EntryType::File) return false;
   if (own && !isBeingSaved(candidate, *own)) return false;
   const auto backup = transaction.recentBackups().take(candidate.parent, candidate.name);
-  if (!backup || (own && own->id == backup->item)) return false;
-  const auto row = findByID(transaction.connection(), backup->item);
+  if (!backup || (own && own->id == backup->document.id)) return false;
+  const auto row = findByID(transaction.connection(), backup->document.id);
   const bool isBackup = row && row->parent == candidate.parent &&
                         row->nameOnDisk() == backup->backupName &&
                         isSameType(*row, candidate.entry);
-  if (!isBackup) return false;
+  if (row && !isBackup) return false;
   if (own) {
     gone_.erase(own->id);
     transaction.remove(*own);
+  }
+  if (!row) {
+    // The backup was seen to go before the new file was seen.
+    candidate.attributes.id.reset();
+    add(transaction, candidate, backup->document);
+    return true;
   }
   gone_.erase(row->id);
   candidate.attributes.id.reset();
@@ -134,7 +140,7 @@ void Reconciler::move(WriteTransaction& transaction, const Candidate& candidate,
   const std::string& name = row.nameOnDisk();
   const bool isBackup = row.kind == ItemKind::Document && row.parent == candidate.parent &&
                         isBackupName(candidate.name, name);
-  if (isBackup) transaction.recentBackups().note(row.id, row.parent, name, candidate.name);
+  if (isBackup) transaction.recentBackups().note(row, candidate.name);
   if (candidate.entry.type == EntryType::Folder && candidate.snapshot != nullptr) {
     noteFolder(*candidate.snapshot, candidate.entry, row.id, false);
   }
@@ -160,12 +166,13 @@ std::optional<ItemRow> Reconciler::findFormer(WriteTransaction& transaction,
   });
 }
 
-void Reconciler::add(WriteTransaction& transaction, const Candidate& candidate) {
+void Reconciler::add(WriteTransaction& transaction, const Candidate& candidate,
+                     std::optional<ItemRow> former) {
   // Somebody else's scan may have been faster.
   const auto present = findByDiskName(transaction.connection(), candidate.parent, candidate.name);
   if (present && !gone_.contains(present->id)) return;
   ItemRow row;
-  const auto former = findFormer(transaction, candidate);
+  if (!former) former = findFormer(transaction, candidate);
   if (former) {
     row.extra = former->extra;
     row.flags = former->flags & row_flag::kKeepsExtra;

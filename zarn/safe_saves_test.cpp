@@ -59,6 +59,33 @@ TEST_F(SafeSavesTest, ABackupThatIsRemovedAtOnceLeavesTheID) {
   EXPECT_EQ(id("a.txt"), document);
 }
 
+TEST_F(SafeSavesTest, ABackupThatIsSeenToGoBeforeTheNewFileIsSeenLeavesTheID) {
+  for (const bool isUploadedMeanwhile : {false, true}) {
+    const std::string name = isUploadedMeanwhile ? "b.txt" : "a.txt";
+    write(name, "first");
+    scan();
+    const std::uint64_t document = id(name);
+    rename(name, name + "~");
+    scan();
+    if (isUploadedMeanwhile) {
+      write("new.txt", "second");
+      scan();
+      markUploaded("new.txt");
+    }
+    remove(name + "~");
+    scan();
+    ASSERT_EQ(id(name + "~"), 0U);
+    if (isUploadedMeanwhile) {
+      rename("new.txt", name);
+    } else {
+      write(name, "second");
+    }
+    scan();
+    EXPECT_EQ(id(name), document) << name;
+    EXPECT_EQ(idOnDisk(name), document) << name;
+  }
+}
+
 TEST_F(SafeSavesTest, AfterTwoSecondsTheIDStaysWithTheFile) {
   useClock();
   for (const bool isLate : {false, true}) {

@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/fileprovider/item_codec.h"
+#include "platform/fileprovider/thumbnail.h"
 #include "platform/fileprovider/thumbnail_taker.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
@@ -18,8 +19,6 @@ using protocol::Control;
 constexpr ipc::CallOptions kPatience{.timeout = std::chrono::minutes(2)};
 /// Large enough for what the desktop keeps; the store's thumbnails are larger anyway.
 constexpr double kSide = 256;
-/// What no thumbnail needs.
-constexpr std::uint64_t kLargestImage = std::uint64_t{8} << 20;
 
 /// Nil when there is none, or with an error.
 NSDataRef storedImage(RZDatabase& database, const RZRecordID& recordID, NSErrorRef& error) {
@@ -32,7 +31,7 @@ NSDataRef storedImage(RZDatabase& database, const RZRecordID& recordID, NSErrorR
       fetched.front().record->valueForKey<RZAsset>(kQSRecordKeyThumbnail1024x1024);
   if (asset == nullptr) return nullptr;
   std::string bytes;
-  error = database.engine()->readAsset(*asset, kLargestImage, bytes);
+  error = database.engine()->readAsset(*asset, kMaximumThumbnailBytes, bytes);
   return error ? nullptr : std::make_shared<const NSData>(std::move(bytes));
 }
 

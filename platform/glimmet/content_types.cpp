@@ -3,9 +3,10 @@
 #include <fnmatch.h>
 
 #include <algorithm>
+#include <bitset>
 #include <charconv>
 #include <fstream>
-#include <map>
+#include <functional>
 #include <optional>
 #include <unordered_map>
 #include <vector>
@@ -65,14 +66,66 @@ std::string_view literalOf(std::string_view pattern) {
   return longest;
 }
 
-/// A pattern that is neither a name nor a suffix.
-struct Glob {
-  GlobLine line;
-  std::string literal;  ///< spares most names the pattern
+using Bytes = std::bitset<256>;
 
+/// The bytes that one element of a pattern (a letter, a bracket, a wildcard) can begin or end with.
+Bytes bytesOf(const std::string& element) {
+  const auto isPlain = [](char c) { return c > 0 && c != '*' && c != '?' && c != '\\'; };
+  const bool isNegated = element.starts_with("[!") || element.starts_with("[^");
+  if (element.empty() || isNegated || !std::ranges::all_of(element, isPlain)) return Bytes().set();
+  Bytes bytes;
+  for (char c = 1; c > 0 && c < 127; ++c) {
+    if (fnmatch(element.c_str(), std::string(1, c).c_str(), 0) == 0) {
+      bytes.set(static_cast<unsigned char>(c));
+    }
+  }
+  return bytes;
+}
+
+Bytes firstBytesOf(const std::string& pattern) {
+  // A bracket that is closed at once holds the closing one.
+  if (pattern.front() == '[') return bytesOf(pattern.substr(0, pattern.find(']', 2) + 1));
+  return bytesOf(pattern.substr(0, 1));
+}
+
+Bytes lastBytesOf(const std::string& pattern) {
+  const bool isEscaped = pattern.find('\\') != std::string::npos;
+  if (isEscaped) return Bytes().set();
+  if (pattern.back() != ']') return bytesOf(pattern.substr(pattern.size() - 1));
+  const std::size_t open = pattern.rfind('[');
+  return bytesOf(open == std::string::npos ? "" : pattern.substr(open));
+}
+
+/// A pattern that is neither a name nor a suffix.
+class Glob {
+ public:
+  explicit Glob(GlobLine line)
+      : line_(std::move(line)),
+        literal_(literalOf(line_.pattern)),
+        first_(firstBytesOf(line_.pattern)),
+        last_(lastBytesOf(line_.pattern)) {}
+
+  [[nodiscard]] const GlobLine& line() const { return line_; }
   [[nodiscard]] bool matches(const std::string& text) const {
-    return text.find(literal) != std::string::npos &&
-           fnmatch(line.pattern.c_str(), text.c_str(), 0) == 0;
+    return !text.empty() && first_[static_cast<unsigned char>(text.front())] &&
+           last_[static_cast<unsigned char>(text.back())] &&
+           text.find(literal_) != std::string::npos &&
+           fnmatch(line_.pattern.c_str(), text.c_str(), 0) == 0;
+  }
+
+ private:
+  GlobLine line_;
+  // What spares most names the pattern.
+  std::string literal_;
+  Bytes first_;
+  Bytes last_;
+};
+
+/// For keys that are parts of a name.
+struct TextHash {
+  using is_transparent = void;
+  std::size_t operator()(std::string_view text) const {
+    return std::hash<std::string_view>()(text);
   }
 };
 
@@ -92,7 +145,7 @@ struct ContentTypes::Table {
       return std::pair(weight, length) < std::pair(other.weight, other.length);
     }
   };
-  using ByText = std::unordered_map<std::string, GlobLine>;
+  using ByText = std::unordered_map<std::string, GlobLine, TextHash, std::equal_to<>>;
 
   // Apart by whether letters' case counts; keys of the others are in lower case.
   ByText exactNames[2];
@@ -108,8 +161,7 @@ struct ContentTypes::Table {
     } else if (!hasWildcard(line.pattern)) {
       exactNames[line.isCaseSensitive].try_emplace(line.pattern, line);
     } else {
-      std::string literal(literalOf(line.pattern));
-      globs.push_back({std::move(line), std::move(literal)});
+      globs.emplace_back(std::move(line));
     }
   }
 
@@ -118,7 +170,7 @@ struct ContentTypes::Table {
     if (best.type == nullptr || best.isBelow(match)) best = match;
   }
 
-  static void look(const ByText& table, const std::string& key, Match& best) {
+  static void look(const ByText& table, std::string_view key, Match& best) {
     if (const auto found = table.find(key); found != table.end()) consider(found->second, best);
   }
 
@@ -129,11 +181,11 @@ struct ContentTypes::Table {
     look(exactNames[false], lower, best);
     for (std::size_t dot = name.find('.'); dot != std::string::npos;
          dot = name.find('.', dot + 1)) {
-      look(exactSuffixes[true], name.substr(dot), best);
-      look(exactSuffixes[false], lower.substr(dot), best);
+      look(exactSuffixes[true], std::string_view(name).substr(dot), best);
+      look(exactSuffixes[false], std::string_view(lower).substr(dot), best);
     }
     for (const Glob& glob : globs) {
-      if (glob.matches(glob.line.isCaseSensitive ? name : lower)) consider(glob.line, best);
+      if (glob.matches(glob.line().isCaseSensitive ? name : lower)) consider(glob.line(), best);
     }
     return best;
   }

@@ -24,6 +24,11 @@ class ContentTypesTest : public testing::Test {
                            "50:text/x-page:*.[1-9]\n"
                            "50:text/x-part:*.p?rt[0-9]\n"
                            "50:text/x-star:*\\*\n"
+                           "50:text/x-number:[0-9][0-9].vdr\n"
+                           "50:text/x-unlike:*.[!0-9a-y]\n"
+                           "50:text/x-bracket:[]]x*\n"
+                           "50:text/x-open:a[*\n"
+                           "50:text/x-any:?.any*\n"
                            "malformed\nx:y:z\n50:\n";
     types_ = std::make_unique<ContentTypes>(path);
   }
@@ -54,6 +59,13 @@ TEST_F(ContentTypesTest, KnowsGlobsOfEveryForm) {
   EXPECT_EQ(types_->typeForName("a.PART7"), "text/x-part");
   EXPECT_EQ(types_->typeForName("a.part"), ContentTypes::kUnknown);
   EXPECT_EQ(types_->typeForName("all*"), "text/x-star");
+  EXPECT_EQ(types_->typeForName("07.vdr"), "text/x-number");
+  EXPECT_EQ(types_->typeForName("x7.vdr"), ContentTypes::kUnknown);
+  EXPECT_EQ(types_->typeForName("page.z"), "text/x-unlike");
+  EXPECT_EQ(types_->typeForName("page.\xc3"), "text/x-unlike");
+  EXPECT_EQ(types_->typeForName("]x-rays"), "text/x-bracket");
+  EXPECT_EQ(types_->typeForName("a[bc"), "text/x-open");
+  EXPECT_EQ(types_->typeForName("\xff.anything"), "text/x-any");
 }
 
 TEST_F(ContentTypesTest, FallsBackForTheRest) {

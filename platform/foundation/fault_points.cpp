@@ -11,6 +11,7 @@
 #include <set>
 #include <string>
 #include <thread>
+#include <utility>
 
 #include "platform/foundation/lock.h"
 
@@ -19,19 +20,23 @@ namespace yomber {
 namespace {
 
 struct FaultAction {
-  enum class Kind { Abort, Error, Pause };
+  enum class Kind { Abort, Error, Pause, PauseFirst, PauseEach };
   Kind kind = Kind::Error;
   std::string file;
 };
 
 constexpr std::string_view kPausePrefix = "pause-until-file:";
+constexpr std::string_view kPauseFirstPrefix = "pause-first-until-file:";
+constexpr std::string_view kPauseEachPrefix = "pause-each-until-file:";
 
 std::optional<FaultAction> parseAction(std::string_view text) {
   if (text == "abort") return FaultAction{.kind = FaultAction::Kind::Abort, .file = {}};
   if (text == "error") return FaultAction{.kind = FaultAction::Kind::Error, .file = {}};
-  if (text.starts_with(kPausePrefix) && text.size() > kPausePrefix.size()) {
-    return FaultAction{.kind = FaultAction::Kind::Pause,
-                       .file = std::string(text.substr(kPausePrefix.size()))};
+  for (const auto& [prefix, kind] : {std::pair(kPausePrefix, FaultAction::Kind::Pause),
+                                     std::pair(kPauseFirstPrefix, FaultAction::Kind::PauseFirst),
+                                     std::pair(kPauseEachPrefix, FaultAction::Kind::PauseEach)}) {
+    if (text.starts_with(prefix) && text.size() > prefix.size())
+      return FaultAction{.kind = kind, .file = std::string(text.substr(prefix.size()))};
   }
   return std::nullopt;
 }
@@ -53,10 +58,15 @@ std::optional<FaultActions> parseFaults(std::string_view faults) {
   return result;
 }
 
-void pauseUntilFile(const std::string& file) {
+/// Whether nobody was there before.
+bool noteReached(const std::string& file) {
   const std::string reached = file + ".reached";
-  const int descriptor = open(reached.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600);
+  const int descriptor = open(reached.c_str(), O_CREAT | O_EXCL | O_WRONLY | O_CLOEXEC, 0600);
   if (descriptor >= 0) close(descriptor);
+  return descriptor >= 0;
+}
+
+void waitForFile(const std::string& file) {
   while (access(file.c_str(), F_OK) != 0) {
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
@@ -132,7 +142,18 @@ bool FaultPoint::act() {
     case FaultAction::Kind::Abort:
       std::abort();
     case FaultAction::Kind::Pause:
-      pauseUntilFile(action->file);
+      (void)noteReached(action->file);
+      waitForFile(action->file);
+      return false;
+    case FaultAction::Kind::PauseFirst:
+      if (noteReached(action->file)) waitForFile(action->file);
+      return false;
+    case FaultAction::Kind::PauseEach:
+      (void)noteReached(action->file);
+      waitForFile(action->file);
+      // In this order: where the file is gone, what is noted is the next one's.
+      unlink((action->file + ".reached").c_str());
+      unlink(action->file.c_str());
       return false;
     case FaultAction::Kind::Error:
       break;
@@ -146,7 +167,8 @@ NSErrorRef FaultPoint::arm(std::string_view faults) {
     return NSError::errorWithDomain(
         NSPOSIXErrorDomain, EINVAL,
         {{NSLocalizedDescriptionKey,
-          "faults are written name=abort, name=error or name=pause-until-file:PATH, with commas "
+          "faults are written name=abort, name=error, name=pause-until-file:PATH, "
+          "name=pause-first-until-file:PATH or name=pause-each-until-file:PATH, with commas "
           "between them: " +
               std::string(faults)}});
   }

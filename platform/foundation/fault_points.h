@@ -19,8 +19,10 @@ namespace yomber {
 ///   YOMBER_FAULTS="zarn.store.before-commit=abort,zarn.scan.folder=pause-until-file:/tmp/x/go"
 ///
 /// Actions: `abort` ends the process as a crash would; `error` makes `hit` answer true; with
-/// `pause-until-file:PATH` the thread makes PATH.reached and waits until PATH exists. Commas cannot
-/// be part of a path here.
+/// `pause-until-file:PATH` the thread makes PATH.reached and waits until PATH exists; with
+/// `pause-first-until-file:PATH` only whoever makes that file waits, and all others pass; with
+/// `pause-each-until-file:PATH` a thread takes both files away when it goes on, so that the next
+/// time is waited for too (one thread at a time). Commas cannot be part of a path here.
 ///
 /// Costs one relaxed load while nothing is armed.
 /// Thread-safety: every operation may be called on any thread.

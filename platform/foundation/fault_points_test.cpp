@@ -60,6 +60,30 @@ TEST_F(FaultPointsTest, PausesUntilTheFileExists) {
   std::filesystem::remove_all(directory);
 }
 
+TEST_F(FaultPointsTest, PausesEachTimeUntilTheFileExists) {
+  char directory[] = "/tmp/yomber-fault-points-XXXXXX";
+  ASSERT_NE(mkdtemp(directory), nullptr);
+  const std::string go = std::string(directory) + "/go";
+  FaultPoint point("test.pause");
+  ASSERT_EQ(FaultPoint::arm("test.pause=pause-each-until-file:" + go), nullptr);
+  std::atomic<int> passed{0};
+  std::thread thread([&] {
+    for (int time = 0; time < 3; ++time) {
+      EXPECT_FALSE(point.hit());
+      ++passed;
+    }
+  });
+  for (int time = 0; time < 3; ++time) {
+    while (!std::filesystem::exists(go + ".reached")) std::this_thread::yield();
+    EXPECT_EQ(passed, time);
+    std::ofstream(go).put('x');
+    while (std::filesystem::exists(go)) std::this_thread::yield();
+  }
+  thread.join();
+  EXPECT_EQ(passed, 3);
+  std::filesystem::remove_all(directory);
+}
+
 TEST_F(FaultPointsTest, AbortsTheProcess) {
   FaultPoint point("test.abort");
   ASSERT_EQ(FaultPoint::arm("test.abort=abort"), nullptr);

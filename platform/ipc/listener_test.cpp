@@ -19,6 +19,7 @@
 #include "platform/ipc/connection.h"
 #include "platform/ipc/deadlines.h"
 #include "platform/ipc/test_echo_server.h"
+#include "platform/ipc/test_error_lines.h"
 
 namespace yomber::ipc {
 namespace {
@@ -100,6 +101,7 @@ TEST_F(ListenerTest, AMissingDirectoryIsAClearError) {
 }
 
 TEST_F(ListenerTest, BeyondTheLimitPeersAreClosed) {
+  const test::ErrorLines errors;
   const auto listener = listen({.maximumConnections = 2});
   ASSERT_NE(listener, nullptr);
   auto first = Connection::connect(path);
@@ -110,6 +112,7 @@ TEST_F(ListenerTest, BeyondTheLimitPeersAreClosed) {
   const UniqueFd third = connectUnixSocket(path, &error);
   ASSERT_TRUE(third);
   EXPECT_TRUE(closesSilently(third.get()));
+  EXPECT_TRUE(errors.has("at " + path + ": all 2 connections are taken"));
   // A place becomes free when a peer leaves.
   test::Tally left;
   first->onDisconnect([&](const NSErrorRef&) { left.add(); });
@@ -122,6 +125,7 @@ TEST_F(ListenerTest, BeyondTheLimitPeersAreClosed) {
 
 TEST_F(ListenerTest, AnotherUsersPeerIsClosed) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to become another user";
+  const test::ErrorLines errors;
   const auto listener = listen();
   ASSERT_NE(listener, nullptr);
   ASSERT_EQ(::chmod(directory.path().c_str(), 0711), 0);
@@ -141,6 +145,8 @@ TEST_F(ListenerTest, AnotherUsersPeerIsClosed) {
   EXPECT_EQ(WEXITSTATUS(status), 0);
   EXPECT_EQ(state->destroyed.value(), 0U) << "nothing was made for it";
   EXPECT_EQ(listener->connectionCount(), 0U);
+  // The line comes before the closing.
+  EXPECT_TRUE(errors.has("Refused process " + std::to_string(pid) + " of user 65534 at " + path));
   EXPECT_TRUE(serves());
 }
 

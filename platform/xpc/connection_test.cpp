@@ -10,6 +10,7 @@
 #include "platform/xpc/connection_link.h"
 #include "platform/xpc/test_workshop.capnp.h"
 #include "platform/xpc/test_workshop.h"
+#include "protocols/services.capnp.h"
 
 namespace yomber::test {
 namespace {
@@ -73,6 +74,19 @@ TEST(NSXPCConnection, AnswersAMethodThatIsLeftOutWithAnErrorAndStays) {
             (std::vector<std::string>{"NSCocoaErrorDomain 4101", "NSCocoaErrorDomain 4101"}));
   EXPECT_EQ(workshop.addOne(1), 2U);
   EXPECT_FALSE(wasReplied);
+}
+
+TEST(NSXPCConnection, AnswersACallOfAnotherInterfaceWithAnErrorAndStays) {
+  WorkshopConnection workshop;
+  workshop.client->resume();
+  ASSERT_EQ(workshop.addOne(1), 2U);
+  using Other = protocol::SharingService;
+  const NSErrorRef error = ipc::callAndWait(
+      workshop.client->link()->remote<Other>(), &Other::Client::fetchSharingInfoRequest,
+      [](auto) {}, [](auto) {});
+  EXPECT_EQ(domainAndCode(error), "NSCocoaErrorDomain 4101");
+  EXPECT_EQ(workshop.addOne(2), 3U);
+  EXPECT_TRUE(workshop.failures->all().empty());
 }
 
 TEST(NSXPCConnection, SaysWhichMethodIsLeftOut) {

@@ -5,16 +5,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <memory>
 #include <string>
-#include <string_view>
-#include <utility>
 #include <vector>
 
-#include "platform/foundation/log.h"
 #include "platform/ipc/gate.h"
 #include "platform/ipc/message_stream.h"
+#include "platform/ipc/test_error_lines.h"
 #include "platform/xpc/test_workshop.h"
 
 namespace yomber::test {
@@ -123,35 +120,9 @@ TEST(NSXPCListener, RefusesWhoBeginsWithAnythingElse) {
   }
 }
 
-/// Keeps the error lines of the default log while it lives.
-class ErrorLines {
- public:
-  ErrorLines() : notes_(std::make_shared<HandlerNotes>()) {
-    defaultLog().setSink(std::make_shared<Sink>(notes_));
-  }
-  ~ErrorLines() { defaultLog().setSink(nullptr); }
-  ErrorLines(const ErrorLines&) = delete;
-  ErrorLines& operator=(const ErrorLines&) = delete;
-  [[nodiscard]] bool has(const std::string& part) const {
-    const auto lines = notes_->all();
-    return std::ranges::any_of(
-        lines, [&](const auto& line) { return line.find(part) != std::string::npos; });
-  }
-
- private:
-  struct Sink final : Log::Sink {
-    explicit Sink(std::shared_ptr<HandlerNotes> into) : notes(std::move(into)) {}
-    void write(LogLevel level, std::string_view line) override {
-      if (level == LogLevel::Error) notes->note(std::string(line));
-    }
-    const std::shared_ptr<HandlerNotes> notes;
-  };
-  const std::shared_ptr<HandlerNotes> notes_;
-};
-
 TEST(NSXPCListener, RefusesAnotherUser) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to become another user";
-  const ErrorLines errors;
+  const ipc::test::ErrorLines errors;
   Waiting waiting;
   const int descriptor = waiting.endpoint->descriptor();
   const pid_t child = ::fork();

@@ -2,13 +2,16 @@
 
 #include <cerrno>
 #include <future>
+#include <memory>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "platform/fileprovider/errors.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/served_extension.h"
 #include "platform/foundation/gate.h"
+#include "platform/foundation/lock.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
 
@@ -52,6 +55,38 @@ class ContentExtension final : public NSFileProviderExtension {
   std::string changed;
   ErrorHandler held;
   Gate started;
+};
+
+/// An extension whose start of "/gated" waits at a gate before it has begun anything.
+class GatedExtension final : public NSFileProviderExtension {
+ public:
+  using NSFileProviderExtension::startProvidingItemAtURL;
+  void startProvidingItemAtURL(const NSURLRef& url, NSFileCoordinatorReadingOptions /*options*/,
+                               ErrorHandler completionHandler) override {
+    begun.open();
+    const bool mayGoOn = url->path() != "/gated" || gate.wait();
+    EXPECT_TRUE(mayGoOn);
+    note("start " + url->path());
+    completionHandler(nullptr);
+  }
+  void stopProvidingItemAtURL(const NSURLRef& url) override { note("stop " + url->path()); }
+
+  std::vector<std::string> notes() {
+    LockGuard guard(mutex_);
+    return notes_;
+  }
+
+  Gate begun;
+  Gate gate;
+
+ private:
+  void note(const std::string& text) {
+    LockGuard guard(mutex_);
+    notes_.push_back(text);
+  }
+
+  Mutex mutex_;
+  std::vector<std::string> notes_ GUARDED_BY(mutex_);
 };
 
 class ContentRequests : public testing::Test {
@@ -111,6 +146,39 @@ TEST_F(ContentRequests, AStopEndsWhatIsUnderWay) {
   stop("/later");
   EXPECT_EQ(extension_->stopped, "/later");
   EXPECT_TRUE(answered.get_future().get()->is(NSCocoaErrorDomain, NSUserCancelledError));
+}
+
+TEST(ContentRequestOrder, AStopNeverOvertakesTheStartThatCameBeforeItAndHoldsUpNoOther) {
+  const auto extension = std::make_shared<GatedExtension>();
+  const ServedExtension served(extension);
+  Gate answered;
+  const auto start = [&](const std::string& path) {
+    (void)ipc::call(
+        served.remote, &Extension::Client::startProvidingRequest,
+        [path](auto params) { params.setPath(wireData(path)); },
+        [&](const NSErrorRef&, const Extension::StartProvidingResults::Reader*) {
+          answered.open();
+        });
+  };
+  const auto stop = [&](const std::string& path) {
+    (void)ipc::call(
+        served.remote, &Extension::Client::stopProvidingRequest,
+        [path](auto params) { params.setPath(wireData(path)); },
+        [&](const NSErrorRef&, const Extension::StopProvidingResults::Reader*) {
+          answered.open();
+        });
+  };
+  start("/gated");
+  stop("/gated");
+  ASSERT_TRUE(extension->begun.wait());
+  start("/other");
+  stop("/other");
+  ASSERT_TRUE(answered.wait(2));
+  EXPECT_EQ(extension->notes(), (std::vector<std::string>{"start /other", "stop /other"}));
+  extension->gate.open();
+  ASSERT_TRUE(answered.wait(4));
+  EXPECT_EQ(extension->notes(), (std::vector<std::string>{"start /other", "stop /other",
+                                                          "start /gated", "stop /gated"}));
 }
 
 TEST_F(ContentRequests, AnswersWhatTheExtensionForgets) {

@@ -4,6 +4,8 @@
 #include <cerrno>
 #include <climits>
 #include <cmath>
+#include <map>
+#include <memory>
 #include <optional>
 #include <string>
 #include <utility>
@@ -15,6 +17,7 @@
 #include "platform/fileprovider/reply_observers.h"
 #include "platform/fileprovider/service_requests.h"
 #include "platform/fileprovider/thumbnail_request.h"
+#include "platform/foundation/serial_queue.h"
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/loop_reply.h"
 #include "platform/ipc/server_call.h"
@@ -177,6 +180,29 @@ class EnumeratorServer final : public protocol::Enumerator::Server {
   const std::shared_ptr<HeldEnumerator> held_;
 };
 
+/// Where the starts and stops of providing run: those of one location in the order in which they
+/// came. A stop that overtook its start would find nothing to end, and the start would go on for
+/// nobody. Those of different locations do not wait for each other.
+///
+/// Thread-safety: loop thread only.
+class ProvidingQueues {
+ public:
+  /// To be kept by what runs there.
+  std::shared_ptr<SerialQueue> of(const NSURLRef& url) {
+    const auto found = queues_.find(url->path());
+    if (found != queues_.end()) {
+      if (auto queue = found->second.lock()) return queue;
+    }
+    std::erase_if(queues_, [](const auto& each) { return each.second.expired(); });
+    auto queue = SerialQueue::create("providing");
+    queues_[url->path()] = queue;
+    return queue;
+  }
+
+ private:
+  std::map<std::string, std::weak_ptr<SerialQueue>> queues_;
+};
+
 class ExtensionServer final : public protocol::Extension::Server {
  public:
   explicit ExtensionServer(std::shared_ptr<NSFileProviderExtension> extension)
@@ -263,11 +289,12 @@ class ExtensionServer final : public protocol::Extension::Server {
     auto url = locationOf(params.getPath());
     if (url == nullptr) return refuse(context);
     auto reply = ipc::LoopReply<NSErrorRef>::makeFor(dropped());
-    runExtensionCode("startProvidingItemAtURL",
-                     [extension = extension_, url = std::move(url), options = params.getOptions(),
-                      handler = std::move(reply.fulfill)] {
-                       extension->startProvidingItemAtURL(url, options, handler);
-                     });
+    const auto queue = providing_.of(url);
+    runExtensionCodeOn(*queue, "startProvidingItemAtURL",
+                       [queue, extension = extension_, url = std::move(url),
+                        options = params.getOptions(), handler = std::move(reply.fulfill)] {
+                         extension->startProvidingItemAtURL(url, options, handler);
+                       });
     context.releaseParams();
     return reply.promise.then([context](const NSErrorRef& error) mutable {
       ipc::encodeOptional(error, context.getResults().initFailure());
@@ -278,9 +305,9 @@ class ExtensionServer final : public protocol::Extension::Server {
     auto url = locationOf(context.getParams().getPath());
     context.releaseParams();
     if (url == nullptr) return kj::READY_NOW;
-    return ipc::onPool([extension = extension_, url = std::move(url)](const CancelFlag&) {
-      extension->stopProvidingItemAtURL(url);
-    });
+    const auto queue = providing_.of(url);
+    return ipc::onQueue(queue, [queue, extension = extension_, url = std::move(url)](
+                                   const CancelFlag&) { extension->stopProvidingItemAtURL(url); });
   }
 
   kj::Promise<void> itemChanged(ItemChangedContext context) override {
@@ -410,6 +437,7 @@ class ExtensionServer final : public protocol::Extension::Server {
   }
 
   const std::shared_ptr<NSFileProviderExtension> extension_;
+  ProvidingQueues providing_;
 };
 
 }  // namespace

@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <memory>
 #include <string>
 #include <thread>
@@ -14,6 +13,7 @@
 #include "platform/ostrell/constants.h"
 #include "platform/ostrell/reading_options.h"
 #include "platform/ostrell/scripted_daemon.h"
+#include "platform/ostrell/test_short_patience.h"
 
 namespace yomber {
 namespace {
@@ -173,12 +173,6 @@ TEST_F(FileProvidingOperationTest, CancellationsThatRaceTheAnswerEndEachOperatio
 }
 
 // ---- A daemon that is alive but stuck ----------------------------------------------------------
-
-class ShortPatience {
- public:
-  ShortPatience() { setenv("YOMBER_DAEMON_TIMEOUT_MS", "400", 1); }
-  ~ShortPatience() { unsetenv("YOMBER_DAEMON_TIMEOUT_MS"); }
-};
 
 /// The time limit is read when the daemon's link is made.
 class ProvidingByAStuckDaemonTest : private ShortPatience, public FileProvidingOperationTest {};

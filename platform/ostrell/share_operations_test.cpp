@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <memory>
 #include <string>
 #include <tuple>
@@ -11,6 +12,7 @@
 #include "platform/ostrell/daemon_connection.h"
 #include "platform/ostrell/errors.h"
 #include "platform/ostrell/scripted_daemon.h"
+#include "platform/ostrell/test_short_patience.h"
 #include "platform/rozzel/errors.h"
 
 namespace yomber {
@@ -75,6 +77,16 @@ class ShareOperationsTest : public testing::Test {
           into->add({.first = identifier, .error = error});
         });
     return operation;
+  }
+
+  /// One of each kind, by what it asks the daemon.
+  std::map<std::string, NSOperationRef> oneOfEach() {
+    return {{"copyShare", copyOperation(url)},
+            {"copyShareURL", linkOperation()},
+            {"saveShare", saveOperation(scriptedShare("a"))},
+            {"destroyShare", destroyOperation(scriptedShare("a"))},
+            {"copyShareToken", tokenOperation()},
+            {"acceptShare", acceptOperation("yomber-share:00ff")}};
   }
 
   Answer only() {
@@ -271,15 +283,8 @@ TEST_F(ShareOperationsTest, AcceptingSendsTheLinkAndBringsTheIdentifier) {
 }
 
 TEST_F(ShareOperationsTest, CancellingDropsTheCallAndEndsItOnce) {
-  const std::vector<std::pair<std::string, NSOperationRef>> all{
-      {"copyShare", copyOperation(url)},
-      {"copyShareURL", linkOperation()},
-      {"saveShare", saveOperation(scriptedShare("a"))},
-      {"destroyShare", destroyOperation(scriptedShare("a"))},
-      {"copyShareToken", tokenOperation()},
-      {"acceptShare", acceptOperation("yomber-share:00ff")}};
   std::size_t ended = 0;
-  for (const auto& [method, operation] : all) {
+  for (const auto& [method, operation] : oneOfEach()) {
     daemon.hold(method);
     queue.addOperation(operation);
     ASSERT_TRUE(daemon.waitForCalls(method)) << method;
@@ -316,6 +321,49 @@ TEST_F(ShareOperationsTest, LosingTheDaemonEndsItWithCode4) {
   const Answer answer = only();
   EXPECT_TRUE(qs_isOstrellErrorCode(answer.error, QSOstrellErrorConnectionLost));
 }
+
+// ---- A daemon that is alive but stuck ----------------------------------------------------------
+
+/// The time limit is read when the daemon's link is made.
+class ShareOperationsOfAStuckDaemonTest : private ShortPatience, public ShareOperationsTest {};
+
+TEST_F(ShareOperationsOfAStuckDaemonTest, AnsweringOtherQuestionsItMayTakeItsTime) {
+  const auto all = oneOfEach();
+  for (const auto& [method, operation] : all) {
+    daemon.hold(method);
+    queue.addOperation(operation);
+    ASSERT_TRUE(daemon.waitForCalls(method)) << method;
+  }
+  daemon.forgetCalls();
+  ASSERT_TRUE(daemon.waitForCalls("describe", 2 * all.size()));
+  EXPECT_TRUE(answers->values().empty());
+  for (const auto& [method, operation] : all) daemon.release(method);
+  for (const Answer& answer : answers->wait(all.size()))
+    EXPECT_TRUE(!answer.error || qs_isOstrellErrorCode(answer.error, QSOstrellErrorNotShared));
+}
+
+TEST_F(ShareOperationsOfAStuckDaemonTest, AnsweringNothingItIsGivenUpOnce) {
+  const auto all = oneOfEach();
+  for (const auto& [method, operation] : all) {
+    daemon.hold(method);
+    queue.addOperation(operation);
+    ASSERT_TRUE(daemon.waitForCalls(method)) << method;
+  }
+  daemon.hold("*");
+  ASSERT_EQ(answers->wait(all.size()).size(), all.size());
+  for (const auto& [method, operation] : all)
+    EXPECT_TRUE(daemon.waitForCalls(method + ".dropped")) << method;
+  daemon.release("*");
+  queue.waitUntilAllOperationsAreFinished();
+  ASSERT_EQ(answers->values().size(), all.size());
+  for (const Answer& answer : answers->values()) {
+    ASSERT_NE(answer.error, nullptr);
+    EXPECT_TRUE(answer.error->is(NSCocoaErrorDomain, NSXPCConnectionTimedOut));
+    EXPECT_TRUE(answer.error->localizedDescription().contains("yomber down"));
+  }
+}
+
+// ------------------------------------------------------------------------------------------------
 
 TEST_F(ShareOperationsTest, ANewShareIsMadeForTheLocation) {
   NSErrorRef error;

@@ -8,7 +8,7 @@
 #include <string_view>
 
 #include "platform/foundation/fault_attributes.h"
-#include "platform/rozzel/asset.h"
+#include "platform/ostrell/fault_record.h"
 
 namespace yomber {
 
@@ -40,22 +40,6 @@ struct StampedLook {
   }
 };
 [[nodiscard]] StampedLook lookAtStamp(int file);
-
-/// What a fault's attribute says: all that is needed to know the item again, and to bring its
-/// content back, should the database be lost.
-struct FaultRecord {
-  std::uint64_t item = 0;
-  RZAsset content;
-  std::int64_t mtime = 0;  ///< of the file when its content was given up
-  std::uint64_t head = 0;  ///< tells whether the kept bytes are still those of then
-  std::string tag;         ///< of the store's record
-  std::string account;     ///< whose record that is
-
-  [[nodiscard]] std::string encoded() const;
-  /// Nothing when the text makes no sense, or is of a later version.
-  static std::optional<FaultRecord> decode(std::string_view text);
-  friend bool operator==(const FaultRecord&, const FaultRecord&) = default;
-};
 
 /// Tells kept bytes apart.
 [[nodiscard]] std::uint64_t headChecksum(std::string_view bytes);

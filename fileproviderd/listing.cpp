@@ -1,5 +1,6 @@
 #include "fileproviderd/listing.h"
 
+#include <algorithm>
 #include <deque>
 #include <memory>
 #include <utility>
@@ -20,9 +21,12 @@ using PageResponse = capnp::Response<Enumerator::EnumerateItemsResults>;
 
 /// So many calls of `next` may wait for their page.
 constexpr std::size_t kMaximumWaiting = 16;
+/// So many pages are kept for the client to come: the extension works on while he takes one in.
+constexpr std::size_t kMaximumAhead = 2;
 
 /// The listing itself; the capability holds it, and answers that come when it is gone are dropped.
-class ListingState : public std::enable_shared_from_this<ListingState> {
+class ListingState final : public std::enable_shared_from_this<ListingState>,
+                           private kj::TaskSet::ErrorHandler {
  public:
   /// One `next`.
   struct Call {
@@ -53,10 +57,12 @@ class ListingState : public std::enable_shared_from_this<ListingState> {
  private:
   void open();
   void requestPage();
+  void readAhead();
   void didGetPage(PageResponse&& response);
   void didNotGetPage(const kj::Exception& exception);
   void fail(const NSErrorRef& error);
   void serve();
+  void taskFailed(kj::Exception&& exception) override { fail(ipc::connectionError(exception)); }
   void dropUnwanted() {
     std::erase_if(waiting_, [](const Call& call) { return !call.isWanted(); });
   }
@@ -68,13 +74,15 @@ class ListingState : public std::enable_shared_from_this<ListingState> {
   const std::chrono::milliseconds pageLimit_;
 
   bool hasStarted_ = false;
+  bool isRequesting_ = false;
   bool isComplete_ = false;  ///< the last page has been asked for and is here, or was handed out
   NSErrorRef failure_;
   std::string token_;  ///< of the next page; empty for the first
   ipc::Remote<Enumerator> enumerator_;
-  kj::Maybe<PageResponse> ready_;
-  kj::Promise<void> request_ = nullptr;
+  std::size_t handedOut_ = 0;  ///< pages
+  std::deque<PageResponse> ready_;
   std::deque<Call> waiting_;
+  kj::TaskSet requests_{*this};
 };
 
 void ListingState::open() {
@@ -96,6 +104,7 @@ void ListingState::open() {
 }
 
 void ListingState::requestPage() {
+  isRequesting_ = true;
   auto request = enumerator_.client().enumerateItemsRequest();
   auto page = request.initPage();
   if (!token_.empty()) {
@@ -108,18 +117,24 @@ void ListingState::requestPage() {
   auto& timer = ipc::EventLoop::shared().timer();
   const auto weak = weak_from_this();
   kj::Promise<PageResponse> response = request.send();
-  request_ = timer.timeoutAfter(pageLimit_.count() * kj::MILLISECONDS, kj::mv(response))
-                 .then(
-                     [weak](PageResponse&& got) {
-                       if (const auto self = weak.lock()) self->didGetPage(kj::mv(got));
-                     },
-                     [weak](kj::Exception&& exception) {
-                       if (const auto self = weak.lock()) self->didNotGetPage(exception);
-                     })
-                 .eagerlyEvaluate(nullptr);
+  requests_.add(timer.timeoutAfter(pageLimit_.count() * kj::MILLISECONDS, kj::mv(response))
+                    .then(
+                        [weak](PageResponse&& got) {
+                          if (const auto self = weak.lock()) self->didGetPage(kj::mv(got));
+                        },
+                        [weak](kj::Exception&& exception) {
+                          if (const auto self = weak.lock()) self->didNotGetPage(exception);
+                        }));
+}
+
+/// Many ask for one page and no more: the first two are asked for one by one.
+void ListingState::readAhead() {
+  if (isRequesting_ || isComplete_ || !enumerator_) return;
+  if (ready_.size() < std::min(handedOut_, kMaximumAhead)) requestPage();
 }
 
 void ListingState::didGetPage(PageResponse&& response) {
+  isRequesting_ = false;
   const auto result = response.getResult();
   if (result.isError()) return fail(ipc::decodeError(result.getError()));
   const auto next = result.getPage().getNext();
@@ -129,7 +144,9 @@ void ListingState::didGetPage(PageResponse&& response) {
     return fail(extensionUnavailableError("listed the same page again and again"));
   }
   token_ = std::move(token);
-  ready_ = kj::mv(response);
+  ready_.push_back(kj::mv(response));
+  // Before this page is copied: zarn is at work on the next one meanwhile.
+  readAhead();
   serve();
 }
 
@@ -142,11 +159,11 @@ void ListingState::didNotGetPage(const kj::Exception& exception) {
 }
 
 void ListingState::fail(const NSErrorRef& error) {
+  enumerator_ = nullptr;
   explain_(error, [weak = weak_from_this()](NSErrorRef explained) {
     const auto self = weak.lock();
     if (self == nullptr) return;
     self->failure_ = std::move(explained);
-    self->enumerator_ = nullptr;
     self->serve();
   });
 }
@@ -154,25 +171,17 @@ void ListingState::fail(const NSErrorRef& error) {
 void ListingState::serve() {
   // A page goes to whoever still waits: nobody asks for the same one again.
   dropUnwanted();
-  KJ_IF_MAYBE (page, ready_) {
-    if (waiting_.empty()) return;
+  while (!ready_.empty() && !waiting_.empty()) {
     const auto call = std::move(waiting_.front());
     waiting_.pop_front();
-    const PageResponse response = kj::mv(*page);
-    ready_ = nullptr;
-    if (isComplete_) {
-      enumerator_ = nullptr;
-    } else {
-      // Before this page is copied: zarn is at work on the next one meanwhile. Not from within the
-      // request's own continuation, which may not replace itself.
-      ipc::EventLoop::shared().post([weak = weak_from_this()] {
-        if (const auto self = weak.lock()) self->requestPage();
-      });
-    }
-    call.answer(&response, nullptr);
-    if (!isComplete_) return;
+    const PageResponse page = kj::mv(ready_.front());
+    ready_.pop_front();
+    ++handedOut_;
+    readAhead();
+    call.answer(&page, nullptr);
   }
-  if (failure_ == nullptr && !(isComplete_ && ready_ == nullptr)) return;
+  if (isComplete_) enumerator_ = nullptr;
+  if (!ready_.empty() || (failure_ == nullptr && !isComplete_)) return;
   for (const auto& call : std::exchange(waiting_, {})) call.answer(nullptr, failure_);
 }
 

@@ -52,14 +52,27 @@ std::uint64_t extraWords(const ItemExtra& extra) {
   return words;
 }
 
+std::uint64_t rowWords(const ItemRow& row, const std::string& contentType) {
+  // The structure itself, and two identifiers: the constants are the longest.
+  constexpr std::uint64_t kFixed = 20 + 2 * 7;
+  std::uint64_t words = kFixed + pointedWords(row.name.size()) + pointedWords(contentType.size());
+  if (row.extra) words += extraWords(*row.extra);
+  return words;
+}
+
 }  // namespace
 
 void encodeRow(const ItemRow& row, protocol::Item::Builder builder) {
+  encodeRow(row, itemContentType(row), builder);
+}
+
+void encodeRow(const ItemRow& row, const std::string& contentType,
+               protocol::Item::Builder builder) {
   builder.setIdentifier(IdentifierText(row.id, row.kind).wire());
   const std::uint64_t parent = row.parent == kNoParent ? kRootID : row.parent;
   builder.setParentIdentifier(IdentifierText(parent, ItemKind::Folder).wire());
   builder.setFilename(wireData(row.name));
-  builder.setContentType(wireText(itemContentType(row)));
+  builder.setContentType(wireText(contentType));
   builder.setKind(static_cast<protocol::Item::Kind>(row.kind));
   builder.setRawID(row.id);
   builder.setSize(row.size);
@@ -79,18 +92,13 @@ void encodeDeadItem(std::uint64_t id, ItemKind kind, protocol::Item::Builder bui
   builder.setFlags(row_flag::kDead);
 }
 
-std::uint64_t encodedRowWords(const ItemRow& row) {
-  // The structure itself, and two identifiers: the constants are the longest.
-  constexpr std::uint64_t kFixed = 20 + 2 * 7;
-  std::uint64_t words =
-      kFixed + pointedWords(row.name.size()) + pointedWords(itemContentType(row).size());
-  if (row.extra) words += extraWords(*row.extra);
-  return words;
-}
+std::uint64_t encodedRowWords(const ItemRow& row) { return rowWords(row, itemContentType(row)); }
 
-std::uint64_t encodedRowWords(const std::vector<ItemRow>& rows) {
+std::uint64_t encodedPageWords(const ListingPage& page) {
   std::uint64_t words = 8;
-  for (const auto& row : rows) words += encodedRowWords(row);
+  for (std::size_t i = 0; i < page.rows.size(); ++i) {
+    words += rowWords(page.rows[i], *page.contentTypes[i]);
+  }
   return words;
 }
 

@@ -30,12 +30,14 @@ class RemoteReceiver final : public WatchReceiver {
       auto items = params.initItems(static_cast<unsigned>(changes.size()));
       for (unsigned i = 0; i < items.size(); ++i) encode(changes[i], items[i]);
     };
+    const std::uint64_t number = begin();
     // A receiver may take as long as it likes: what waits for it is bounded.
-    keep(ipc::call(remote_, &Receiver::Client::receiveUpdatesRequest, fill,
-                   [answered = std::move(answered)](const NSErrorRef& error, const auto*) {
-                     answered(error == nullptr);
-                   },
-                   {.timeout = std::chrono::milliseconds(0)}));
+    auto call = ipc::call(remote_, &Receiver::Client::receiveUpdatesRequest, fill,
+                          [answered = std::move(answered)](const NSErrorRef& error, const auto*) {
+                            answered(error == nullptr);
+                          },
+                          {.timeout = std::chrono::milliseconds(0)});
+    keep(std::move(call), number);
   }
 
   void fail(NSErrorRef error) override {
@@ -46,7 +48,14 @@ class RemoteReceiver final : public WatchReceiver {
         [](const NSErrorRef&, const auto*) {});
   }
 
-  void cancel() { keep({}); }
+  void cancel() {
+    ipc::CallHandle call;
+    {
+      LockGuard guard(mutex_);
+      std::swap(call_, call);
+    }
+    call.cancel();
+  }
 
  private:
   static void encode(const WatchedChange& change, protocol::Item::Builder item) {
@@ -57,18 +66,21 @@ class RemoteReceiver final : public WatchReceiver {
     }
   }
 
-  /// Gives up the call that was kept before; one that was answered is over already.
-  void keep(ipc::CallHandle call) {
-    {
-      LockGuard guard(mutex_);
-      std::swap(call_, call);
-    }
-    call.cancel();
+  std::uint64_t begin() {
+    LockGuard guard(mutex_);
+    return ++begun_;
+  }
+  /// Unless it was answered meanwhile and the next is under way already: the answer may come, on
+  /// another thread, before the call is kept.
+  void keep(ipc::CallHandle call, std::uint64_t number) {
+    LockGuard guard(mutex_);
+    if (number == begun_) std::swap(call_, call);
   }
 
   const ipc::Remote<Receiver> remote_;
   Mutex mutex_;
   ipc::CallHandle call_ GUARDED_BY(mutex_);
+  std::uint64_t begun_ GUARDED_BY(mutex_) = 0;
 };
 
 void answer(const NSErrorRef& error, protocol::OptionalError::Builder failure) {

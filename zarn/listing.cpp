@@ -107,7 +107,11 @@ PagesAhead::Page readPage(Connection& connection, const ListingScope& scope, con
   if (start.isBeyondEnd) return result;
   std::vector<ItemRow>& rows = result.page.rows;
   auto end = readRows(connection, scope, start, limit, rows);
-  for (ItemRow& row : rows) loadExtra(connection, row);
+  result.page.contentTypes.reserve(rows.size());
+  for (ItemRow& row : rows) {
+    loadExtra(connection, row);
+    result.page.contentTypes.push_back(&itemContentType(row));
+  }
   if (!end) return result;
   result.page.nextOffset = offset + rows.size();
   result.end = *std::move(end);
@@ -132,8 +136,8 @@ class Listing::State : public ChangeSink {
  public:
   explicit State(std::shared_ptr<Database> database) : database_(std::move(database)) {}
 
-  NSErrorRef page(std::uint64_t connection, const ListingScope& scope, std::uint64_t offset,
-                  std::uint32_t limit, ListingPage& out);
+  NSErrorRef page(const ListingCursors::Key& key, std::uint32_t limit, ListingPage& out,
+                  ReadAhead& readAhead);
   void connectionEnded(std::uint64_t connection) {
     pagesAhead_.removeConnection(connection);
     LockGuard guard(mutex_);
@@ -145,7 +149,7 @@ class Listing::State : public ChangeSink {
   using Key = ListingCursors::Key;
 
   NSErrorRef readNow(const Key& key, std::uint32_t limit, PagesAhead::Page& out);
-  void readAhead(const Key& key, std::uint32_t limit, const ListingPoint& after);
+  ReadAhead planReadAhead(const Key& key, std::uint32_t limit, const ListingPoint& after);
   Start findStart(Connection& reader, const Key& key);
   std::shared_ptr<const ListingFences> fencesOf(Connection& reader, const ListingScope& scope);
   void forgetOtherDatabase() REQUIRES(mutex_);
@@ -211,9 +215,10 @@ Start Listing::State::findStart(Connection& reader, const Key& key) {
   return {fences->points[fence - 1], offset % ListingFences::kDistance, false};
 }
 
-NSErrorRef Listing::State::page(std::uint64_t connection, const ListingScope& scope,
-                                std::uint64_t offset, std::uint32_t limit, ListingPage& out) {
+NSErrorRef Listing::State::page(const Key& key, std::uint32_t limit, ListingPage& out,
+                                ReadAhead& readAhead) {
   out = {};
+  readAhead = nullptr;
   if (limit == 0) {
     return NSError::errorWithDomain(
         QSOstrellErrorDomain, QSOstrellErrorInvalidParameter,
@@ -222,7 +227,6 @@ NSErrorRef Listing::State::page(std::uint64_t connection, const ListingScope& sc
          {NSLocalizedDescriptionKey, std::string("A page's limit must be at least 1.")}});
   }
   const std::uint32_t count = std::min(limit, kMaximumLimit);
-  const Key key{connection, scope, offset};
   PagesAhead::Page result;
   if (auto ahead = pagesAhead_.take(key, count, database_->currentRank())) {
     result = *std::move(ahead);
@@ -231,9 +235,9 @@ NSErrorRef Listing::State::page(std::uint64_t connection, const ListingScope& sc
   }
   out = std::move(result.page);
   if (out.nextOffset == 0) return nullptr;
-  const Key next{connection, scope, out.nextOffset};
+  const Key next{key.connection, key.scope, out.nextOffset};
   // Many ask for one page and no more.
-  if (offset != 0) readAhead(next, count, result.end);
+  if (key.offset != 0) readAhead = planReadAhead(next, count, result.end);
   LockGuard guard(mutex_);
   forgetOtherDatabase();
   cursors_.store(next, std::move(result.end));
@@ -246,7 +250,8 @@ NSErrorRef Listing::State::readNow(const Key& key, std::uint32_t limit, PagesAhe
   });
 }
 
-void Listing::State::readAhead(const Key& key, std::uint32_t limit, const ListingPoint& after) {
+Listing::ReadAhead Listing::State::planReadAhead(const Key& key, std::uint32_t limit,
+                                                 const ListingPoint& after) {
   const auto read = [key, limit, after, database = database_]() -> std::optional<PagesAhead::Page> {
     PagesAhead::Page result;
     const NSErrorRef error = database->read([&](Connection& reader) {
@@ -256,7 +261,7 @@ void Listing::State::readAhead(const Key& key, std::uint32_t limit, const Listin
     if (error) return std::nullopt;
     return result;
   };
-  pagesAhead_.readAhead(key, limit, database_->currentRank(), read);
+  return pagesAhead_.plan(key, limit, database_->currentRank(), read);
 }
 
 Listing::Listing(std::shared_ptr<Database> database) : state_(std::make_shared<State>(database)) {
@@ -266,13 +271,15 @@ Listing::Listing(std::shared_ptr<Database> database) : state_(std::make_shared<S
 Listing::~Listing() = default;
 
 NSErrorRef Listing::page(std::uint64_t connection, std::uint64_t folder, ListingOrder order,
-                         std::uint64_t offset, std::uint32_t limit, ListingPage& out) {
-  return state_->page(connection, {folder, order}, offset, limit, out);
+                         std::uint64_t offset, std::uint32_t limit, ListingPage& out,
+                         ReadAhead& readAhead) {
+  return state_->page({connection, {folder, order}, offset}, limit, out, readAhead);
 }
 
 NSErrorRef Listing::foldersPage(std::uint64_t connection, ListingOrder order, std::uint64_t offset,
-                                std::uint32_t limit, ListingPage& out) {
-  return state_->page(connection, {ListingScope::kAllFolders, order}, offset, limit, out);
+                                std::uint32_t limit, ListingPage& out, ReadAhead& readAhead) {
+  return state_->page({connection, {ListingScope::kAllFolders, order}, offset}, limit, out,
+                      readAhead);
 }
 
 void Listing::connectionEnded(std::uint64_t connection) { state_->connectionEnded(connection); }

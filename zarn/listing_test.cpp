@@ -67,7 +67,9 @@ class ListingTest : public TestDrive {
   ListingPage page(ListingOrder order, std::uint64_t offset, std::uint32_t limit,
                    std::uint64_t connection = 1) {
     ListingPage result;
-    EXPECT_EQ(listing->page(connection, kFolder, order, offset, limit, result), nullptr);
+    Listing::ReadAhead readAhead;
+    EXPECT_EQ(listing->page(connection, kFolder, order, offset, limit, result, readAhead), nullptr);
+    if (readAhead) readAhead();
     return result;
   }
   std::vector<std::string> all(ListingOrder order, std::uint32_t limit) {
@@ -152,6 +154,22 @@ TEST_F(ListingTest, APageThatWasReadAheadShowsWhatChangedSince) {
   EXPECT_EQ(third.rows[1].name, "item 200 a");
 }
 
+TEST_F(ListingTest, FromTheSecondPageOnTheNextOneIsReadAhead) {
+  fill(350);
+  ListingPage current;
+  Listing::ReadAhead readAhead;
+  for (const std::uint64_t offset : {0U, 100U, 200U, 300U}) {
+    ASSERT_EQ(listing->page(1, kFolder, ListingOrder::Date, offset, 100, current, readAhead),
+              nullptr);
+    const bool isFollowed = offset == 100 || offset == 200;
+    EXPECT_EQ(static_cast<bool>(readAhead), isFollowed) << offset;
+    ASSERT_EQ(current.contentTypes.size(), current.rows.size());
+    for (std::size_t i = 0; i < current.rows.size(); ++i) {
+      EXPECT_EQ(*current.contentTypes[i], itemContentType(current.rows[i]));
+    }
+  }
+}
+
 TEST_F(ListingTest, FencesFollowChanges) {
   fill(600);
   EXPECT_EQ(page(ListingOrder::Name, 400, 1, 5).rows.front().name, "item 400");
@@ -186,15 +204,17 @@ TEST_F(ListingTest, AllFoldersLeavesOutTheTrashAndTheRoot) {
   for (const ListingOrder order : {ListingOrder::Name, ListingOrder::Date}) {
     std::set<std::uint64_t> seen;
     std::uint64_t offset = 0;
+    Listing::ReadAhead readAhead;
     do {
       ListingPage current;
-      ASSERT_EQ(listing->foldersPage(1, order, offset, 200, current), nullptr);
+      ASSERT_EQ(listing->foldersPage(1, order, offset, 200, current, readAhead), nullptr);
+      if (readAhead) readAhead();
       for (const ItemRow& row : current.rows) EXPECT_TRUE(seen.insert(row.id).second);
       offset = current.nextOffset;
     } while (offset != 0);
     EXPECT_EQ(seen.size(), 601U);
     ListingPage jumped;
-    ASSERT_EQ(listing->foldersPage(2, order, 450, 200, jumped), nullptr);
+    ASSERT_EQ(listing->foldersPage(2, order, 450, 200, jumped, readAhead), nullptr);
     EXPECT_EQ(jumped.rows.size(), 151U);
   }
 }
@@ -215,14 +235,16 @@ TEST_F(ListingTest, BringsTagsAndRefusesNoLimit) {
   ASSERT_TRUE(current.rows[0].extra);
   EXPECT_EQ(current.rows[0].extra->tags, std::vector<std::string>{"red"});
   ListingPage none;
-  const NSErrorRef error = listing->page(1, kFolder, ListingOrder::Name, 0, 0, none);
+  Listing::ReadAhead nothing;
+  const NSErrorRef error = listing->page(1, kFolder, ListingOrder::Name, 0, 0, none, nothing);
   ASSERT_TRUE(error);
   EXPECT_TRUE(error->is(QSOstrellErrorDomain, QSOstrellErrorInvalidParameter));
 }
 
 TEST_F(ListingTest, AFolderThatIsGoneHasNoEntries) {
   ListingPage current;
-  EXPECT_EQ(listing->page(1, 987654, ListingOrder::Name, 0, 200, current), nullptr);
+  Listing::ReadAhead nothing;
+  EXPECT_EQ(listing->page(1, 987654, ListingOrder::Name, 0, 200, current, nothing), nullptr);
   EXPECT_TRUE(current.rows.empty());
   EXPECT_EQ(current.nextOffset, 0U);
 }

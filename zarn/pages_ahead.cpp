@@ -3,8 +3,6 @@
 #include <algorithm>
 #include <utility>
 
-#include "platform/foundation/thread_pool.h"
-
 namespace yomber {
 
 std::shared_ptr<PagesAhead::Entry> PagesAhead::State::remove(const Key& key) {
@@ -18,7 +16,7 @@ std::shared_ptr<PagesAhead::Entry> PagesAhead::State::remove(const Key& key) {
 void PagesAhead::State::run(const std::shared_ptr<Entry>& entry, const Read& read) {
   {
     LockGuard guard(mutex);
-    if (entry->stage == Entry::Stage::Abandoned) return;
+    if (entry->stage != Entry::Stage::Planned) return;
     entry->stage = Entry::Stage::Reading;
   }
   std::optional<Page> page = read();
@@ -28,7 +26,8 @@ void PagesAhead::State::run(const std::shared_ptr<Entry>& entry, const Read& rea
   done.notifyAll();
 }
 
-void PagesAhead::readAhead(const Key& key, std::uint32_t limit, std::uint64_t rank, Read read) {
+std::function<void()> PagesAhead::plan(const Key& key, std::uint32_t limit, std::uint64_t rank,
+                                       Read read) {
   auto entry = std::make_shared<Entry>();
   entry->key = key;
   entry->limit = limit;
@@ -42,8 +41,7 @@ void PagesAhead::readAhead(const Key& key, std::uint32_t limit, std::uint64_t ra
     }
     state_->entries.push_back(entry);
   }
-  ThreadPool::shared().async(
-      [state = state_, entry, read = std::move(read)] { state->run(entry, read); });
+  return [state = state_, entry, read = std::move(read)] { state->run(entry, read); };
 }
 
 std::optional<PagesAhead::Page> PagesAhead::take(const Key& key, std::uint32_t limit,
@@ -52,7 +50,7 @@ std::optional<PagesAhead::Page> PagesAhead::take(const Key& key, std::uint32_t l
   const auto entry = state_->remove(key);
   if (entry == nullptr) return std::nullopt;
   // One that has not begun is read as quickly by whoever asks.
-  if (entry->stage == Entry::Stage::Queued || entry->limit != limit || entry->rank != rank) {
+  if (entry->stage == Entry::Stage::Planned || entry->limit != limit || entry->rank != rank) {
     entry->stage = Entry::Stage::Abandoned;
     return std::nullopt;
   }

@@ -27,13 +27,15 @@ class PagesAhead {
     ListingPoint end;  ///< of the last row, when there are more
   };
   using Key = ListingCursors::Key;
-  /// Runs on the pool; nothing when the page could not be read.
+  /// Nothing when the page could not be read. Must not throw.
   using Read = std::function<std::optional<Page>()>;
 
   explicit PagesAhead(std::size_t capacity) : state_(std::make_shared<State>(capacity)) {}
 
-  /// Has the page of `limit` rows read. `rank` is the database's last rank.
-  void readAhead(const Key& key, std::uint32_t limit, std::uint64_t rank, Read read);
+  /// Answers what reads the page of `limit` rows, once, on whatever thread calls it. `rank` is the
+  /// database's last rank.
+  [[nodiscard]] std::function<void()> plan(const Key& key, std::uint32_t limit, std::uint64_t rank,
+                                           Read read);
   /// The page, when it was read and `rank` is still the last; waits for one that is just being
   /// read. Nothing otherwise. A page is taken once.
   [[nodiscard]] std::optional<Page> take(const Key& key, std::uint32_t limit, std::uint64_t rank);
@@ -41,11 +43,11 @@ class PagesAhead {
 
  private:
   struct Entry {
-    enum class Stage : std::uint8_t { Queued, Reading, Done, Abandoned };
+    enum class Stage : std::uint8_t { Planned, Reading, Done, Abandoned };
     Key key;
     std::uint32_t limit = 0;
     std::uint64_t rank = 0;
-    Stage stage = Stage::Queued;
+    Stage stage = Stage::Planned;
     std::optional<Page> page;
   };
   struct State {

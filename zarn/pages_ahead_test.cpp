@@ -15,10 +15,9 @@ PagesAhead::Key keyOf(std::uint64_t offset, std::uint64_t connection = 1) {
   return {connection, {.folder = 7, .order = ListingOrder::Date}, offset};
 }
 
-/// A page that can be told apart by where the next one begins; `begun` says that it is being read.
-PagesAhead::Read pageWith(std::uint64_t nextOffset, Gate& begun) {
-  return [nextOffset, &begun] {
-    begun.open();
+/// A page that can be told apart by where the next one begins.
+PagesAhead::Read pageWith(std::uint64_t nextOffset) {
+  return [nextOffset] {
     PagesAhead::Page result;
     result.page.nextOffset = nextOffset;
     return std::optional(result);
@@ -27,9 +26,7 @@ PagesAhead::Read pageWith(std::uint64_t nextOffset, Gate& begun) {
 
 TEST(PagesAheadTest, APageIsTakenOnce) {
   PagesAhead pages(4);
-  Gate begun;
-  pages.readAhead(keyOf(200), kLimit, 5, pageWith(400, begun));
-  ASSERT_TRUE(begun.wait());
+  pages.plan(keyOf(200), kLimit, 5, pageWith(400))();
   const auto page = pages.take(keyOf(200), kLimit, 5);
   ASSERT_TRUE(page);
   EXPECT_EQ(page->page.nextOffset, 400U);
@@ -40,52 +37,56 @@ TEST(PagesAheadTest, WhoAsksForAPageThatIsBeingReadGetsIt) {
   PagesAhead pages(4);
   Gate begun;
   Gate mayEnd;
-  pages.readAhead(keyOf(200), kLimit, 5, [&]() -> std::optional<PagesAhead::Page> {
+  const auto read = pages.plan(keyOf(200), kLimit, 5, [&]() -> std::optional<PagesAhead::Page> {
     begun.open();
     (void)mayEnd.wait();
-    return PagesAhead::Page{.page = {.rows = {}, .nextOffset = 400}, .end = {}};
+    return pageWith(400)();
   });
+  std::thread reader(read);
   ASSERT_TRUE(begun.wait());
   std::thread opener([&] { mayEnd.open(); });
   const auto page = pages.take(keyOf(200), kLimit, 5);
   opener.join();
+  reader.join();
   ASSERT_TRUE(page);
   EXPECT_EQ(page->page.nextOffset, 400U);
 }
 
+TEST(PagesAheadTest, APageThatIsNotYetBeingReadIsLeftToWhoAsksForIt) {
+  PagesAhead pages(4);
+  bool isRead = false;
+  const auto read = pages.plan(keyOf(200), kLimit, 5, [&] {
+    isRead = true;
+    return pageWith(400)();
+  });
+  EXPECT_FALSE(pages.take(keyOf(200), kLimit, 5));
+  read();
+  EXPECT_FALSE(isRead);
+}
+
 TEST(PagesAheadTest, APageFromBeforeACommitIsNotTaken) {
   PagesAhead pages(4);
-  Gate begun;
-  pages.readAhead(keyOf(200), kLimit, 5, pageWith(400, begun));
-  ASSERT_TRUE(begun.wait());
+  pages.plan(keyOf(200), kLimit, 5, pageWith(400))();
   EXPECT_FALSE(pages.take(keyOf(200), kLimit, 6));
 }
 
 TEST(PagesAheadTest, APageOfAnotherSizeIsNotTaken) {
   PagesAhead pages(4);
-  Gate begun;
-  pages.readAhead(keyOf(200), kLimit, 5, pageWith(400, begun));
-  ASSERT_TRUE(begun.wait());
+  pages.plan(keyOf(200), kLimit, 5, pageWith(400))();
   EXPECT_FALSE(pages.take(keyOf(200), kLimit + 1, 5));
 }
 
 TEST(PagesAheadTest, APageThatCouldNotBeReadIsNoPage) {
   PagesAhead pages(4);
-  Gate begun;
-  pages.readAhead(keyOf(200), kLimit, 5, [&]() -> std::optional<PagesAhead::Page> {
-    begun.open();
-    return std::nullopt;
-  });
-  ASSERT_TRUE(begun.wait());
+  pages.plan(keyOf(200), kLimit, 5,
+             []() -> std::optional<PagesAhead::Page> { return std::nullopt; })();
   EXPECT_FALSE(pages.take(keyOf(200), kLimit, 5));
 }
 
 TEST(PagesAheadTest, TheOldestGiveWay) {
   PagesAhead pages(2);
-  Gate begun[3];
   for (std::uint64_t i = 0; i < 3; ++i) {
-    pages.readAhead(keyOf(200, i), kLimit, 5, pageWith(400, begun[i]));
-    ASSERT_TRUE(begun[i].wait());
+    pages.plan(keyOf(200, i), kLimit, 5, pageWith(400))();
   }
   EXPECT_FALSE(pages.take(keyOf(200, 0), kLimit, 5));
   EXPECT_TRUE(pages.take(keyOf(200, 1), kLimit, 5));
@@ -94,11 +95,8 @@ TEST(PagesAheadTest, TheOldestGiveWay) {
 
 TEST(PagesAheadTest, AConnectionsPagesEndWithIt) {
   PagesAhead pages(4);
-  Gate begun[2];
-  pages.readAhead(keyOf(200, 1), kLimit, 5, pageWith(400, begun[0]));
-  pages.readAhead(keyOf(200, 2), kLimit, 5, pageWith(400, begun[1]));
-  ASSERT_TRUE(begun[0].wait());
-  ASSERT_TRUE(begun[1].wait());
+  pages.plan(keyOf(200, 1), kLimit, 5, pageWith(400))();
+  pages.plan(keyOf(200, 2), kLimit, 5, pageWith(400))();
   pages.removeConnection(1);
   EXPECT_FALSE(pages.take(keyOf(200, 1), kLimit, 5));
   EXPECT_TRUE(pages.take(keyOf(200, 2), kLimit, 5));

@@ -73,15 +73,17 @@ struct PooledCall {
 /// Runs `work` in the place of the pool's thread; no exception leaves it.
 void runCatching(const std::function<void()>& work, kj::Maybe<kj::Exception>& failure);
 
-template <typename Submit, typename Work>
-kj::Promise<std::invoke_result_t<Work&, const CancelFlag&>> runElsewhere(Submit submit, Work work) {
+template <typename Submit, typename Work, typename Afterwards>
+kj::Promise<std::invoke_result_t<Work&, const CancelFlag&>> runElsewhere(Submit submit, Work work,
+                                                                         Afterwards afterwards) {
   using Result = std::invoke_result_t<Work&, const CancelFlag&>;
   EventLoop::shared().assertCurrent("onPool and onQueue");
   auto pair = kj::newPromiseAndFulfiller<Result>();
   auto shared = std::make_shared<PooledCall<Result>>();
   shared->fulfiller = kj::mv(pair.fulfiller);
   CancelFlag cancelled = shared->cancelled;
-  submit([shared = std::move(shared), work = std::make_shared<Work>(std::move(work))]() mutable {
+  submit([shared = std::move(shared), work = std::make_shared<Work>(std::move(work)),
+          afterwards = std::move(afterwards)]() mutable {
     runCatching(
         [&] {
           if constexpr (std::is_void_v<Result>) {
@@ -95,6 +97,7 @@ kj::Promise<std::invoke_result_t<Work&, const CancelFlag&>> runElsewhere(Submit 
     work.reset();
     // The closure takes this thread's only reference along: the result dies on the loop thread.
     EventLoop::shared().post([owned = std::move(shared)] { owned->settle(); });
+    afterwards();
   });
   return pair.promise.attach(kj::defer([cancelled] { cancelled.set(); }));
 }
@@ -104,19 +107,25 @@ kj::Promise<std::invoke_result_t<Work&, const CancelFlag&>> runElsewhere(Submit 
 /// Runs `work(cancelFlag)` on the thread pool and answers its result on the loop thread. When the
 /// promise is dropped the flag is set, the work runs on, and its result is destroyed on the loop
 /// thread. What the work throws becomes the promise's exception. `Work` may be move-only; it is
-/// destroyed on the pool's thread. REQUIRES: on the loop thread.
-template <typename Work>
-auto onPool(Work work) {
+/// destroyed on the pool's thread. `afterwards()`, which must not throw, runs on the same thread
+/// once the result is on its way, also when nobody waits for it. REQUIRES: on the loop thread.
+template <typename Work, typename Afterwards>
+auto onPool(Work work, Afterwards afterwards) {
   return detail::runElsewhere(
       [](std::function<void()> job) { ThreadPool::shared().async(std::move(job)); },
-      std::move(work));
+      std::move(work), std::move(afterwards));
+}
+
+template <typename Work>
+auto onPool(Work work) {
+  return onPool(std::move(work), [] {});
 }
 
 /// The same on `queue`, in order with what else is submitted there.
 template <typename Work>
 auto onQueue(const std::shared_ptr<SerialQueue>& queue, Work work) {
   return detail::runElsewhere([&queue](std::function<void()> job) { queue->async(std::move(job)); },
-                              std::move(work));
+                              std::move(work), [] {});
 }
 
 }  // namespace yomber::ipc

@@ -59,8 +59,8 @@ interface Content {
 
   contentState @12 (path :Data) -> (state :State, failure :Common.OptionalError);
   transfers @13 () -> (transfers :List(Transfer), waiting :UInt64, finished :UInt64);
-  # What is under way at the moment, at most 1000; how many jobs wait; how many have ended since zarn
-  # started.
+  # What is under way at the moment, at most 1000; how many jobs wait; how many have moved something
+  # since zarn started.
 
   startDownloading @14 (paths :List(Data), options :UInt64) -> (failure :Common.OptionalError);
   # Has the content of items brought here, and answers as soon as that has begun: nobody waits for it,

@@ -13,7 +13,8 @@ $Cxx.namespace("yomber::protocol");
 
 interface TreeObserver {
   # Implemented by the mount. zarn makes one call after the other, each when the last was answered; what
-  # happens meanwhile is gathered, each entry once. An observer that fails a call is told nothing more.
+  # happens meanwhile is gathered, each entry once. An observer that fails a call is told nothing more, and
+  # let go of: when nobody refers to it any more, it is to observe anew.
   #
   # What is read on disk after `observeTree` was answered is covered: if it changes, a later call says
   # so. What was read before (over an earlier connection, say) is not.

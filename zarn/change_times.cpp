@@ -1,6 +1,8 @@
 #include "zarn/change_times.h"
 
+#include <chrono>
 #include <ctime>
+#include <thread>
 
 #include "platform/foundation/file_time.h"
 #include "zarn/folder_snapshot.h"
@@ -28,6 +30,11 @@ std::int64_t coarseNow() {
   timespec now{};
   clock_gettime(CLOCK_REALTIME_COARSE, &now);
   return nanosecondsOf(now);
+}
+
+void waitForTick() {
+  const std::int64_t now = coarseNow();
+  while (coarseNow() == now) std::this_thread::sleep_for(std::chrono::milliseconds(1));
 }
 
 std::optional<std::int64_t> changeTimeAfterOwnWrite(int folder, const std::string& name,

@@ -24,6 +24,10 @@ namespace yomber {
 /// CLOCK_REALTIME_COARSE.
 [[nodiscard]] std::int64_t coarseNow();
 
+/// Until the tick that runs is over: some milliseconds at most. What changes from then on is not
+/// given the times of what was done before.
+void waitForTick();
+
 /// Whether the attributes are what a file with this row carries, apart from whether its content is
 /// here.
 [[nodiscard]] bool isDescribedBy(const ItemRow& row, const ItemAttributes& attributes);

@@ -54,7 +54,7 @@ struct ContentTransfer {
 struct ContentTransfers {
   std::vector<ContentTransfer> transfers;  ///< those under way first, then those that failed
   std::uint64_t waiting = 0;               ///< jobs, whether or not listed here
-  std::uint64_t finished = 0;              ///< jobs since the engine was made
+  std::uint64_t finished = 0;              ///< that moved something, since the engine was made
   bool isOffline = false;                  ///< the store was out of reach when last asked
 };
 
@@ -98,6 +98,9 @@ class ContentEngine {
     /// Pauses between attempts double from the first to the second.
     std::chrono::milliseconds firstPause{1'000};
     std::chrono::milliseconds longestPause{15 * 60 * 1'000};
+    /// A save is several changes, often of several files: for how long a document has to be left
+    /// alone before it is uploaded. One that goes on changing is uploaded after ten times that.
+    std::chrono::milliseconds uploadPause{500};
     /// How often a store out of reach is tried.
     std::chrono::milliseconds offlinePause{2'000};
     /// For how long marks of filled files gather before they are synced and taken off together.
@@ -122,8 +125,12 @@ class ContentEngine {
   virtual void start() = 0;
   /// Ends the threads; what they were doing goes on after the next start. Wishes end with 3072.
   virtual void stop() = 0;
-  /// To be called when a database was built anew: gives jobs to the documents in it.
+  /// To be called when a database was built anew: gives jobs to the documents in it, as their files
+  /// get their marks (Scanner::stampSome). A mark that is written later would be a change, for
+  /// which the document is read and compared once more.
   virtual void sweep() {}
+  /// To be called when files got their marks.
+  virtual void didStamp() {}
   /// The store of the account that is signed in now, under the name that tells accounts apart; null
   /// when nobody is. Jobs belong to the account under which they were made, and wait for it.
   virtual void setStore(std::shared_ptr<ContentStore> contents, const std::string& account) = 0;

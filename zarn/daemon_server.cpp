@@ -245,23 +245,31 @@ kj::Promise<void> DaemonServer::containerItem(ContainerItemContext context) {
 
 // --- Listing.
 
-/// `find` reads the page on the pool.
+/// `find` reads the page on the pool, and whoever did that reads on once it is answered: another
+/// thread would begin first, and on few processors keep the answer waiting.
 template <typename Context, typename Find>
 kj::Promise<void> DaemonServer::answerPage(Context context, Find find) {
   context.allowCancellation();
-  return ipc::onPool([find = std::move(find)](const ipc::CancelFlag& cancelled) {
-           FoundPage found;
-           if (!cancelled.isSet()) found.error = find(found.page);
-           return found;
-         })
+  const auto readAhead = std::make_shared<Listing::ReadAhead>();
+  return ipc::onPool(
+             [find = std::move(find), readAhead](const ipc::CancelFlag& cancelled) {
+               FoundPage found;
+               if (!cancelled.isSet()) found.error = find(found.page, *readAhead);
+               return found;
+             },
+             [readAhead] {
+               if (*readAhead) (*readAhead)();
+             })
       .then([context](FoundPage found) mutable {
         const auto& rows = found.page.rows;
-        const std::uint64_t words = found.error ? 64 : encodedRowWords(rows);
+        const std::uint64_t words = found.error ? 64 : encodedPageWords(found.page);
         auto result = context.getResults(capnp::MessageSize{words, 0}).initResult();
         if (found.error) return ipc::encodeError(found.error, result.initError());
         auto page = result.initPage();
         auto items = page.initItems(static_cast<unsigned>(rows.size()));
-        for (unsigned i = 0; i < items.size(); ++i) encodeRow(rows[i], items[i]);
+        for (unsigned i = 0; i < items.size(); ++i) {
+          encodeRow(rows[i], *found.page.contentTypes[i], items[i]);
+        }
         page.setNextOffset(found.page.nextOffset);
       });
 }
@@ -282,13 +290,13 @@ kj::Promise<void> DaemonServer::enumerateItemsInFolder(EnumerateItemsInFolderCon
         failure = noSuchItemError(yomber::describe(folder.getObject()));
       }
     }
-    return answerPage(context,
-                      [drive = drive_, failure, connection = connection_, id,
-                       order = listingOrder(params.getSortOrder()), offset = params.getOffset(),
-                       limit = params.getLimit()](ListingPage& page) {
-                        if (failure) return failure;
-                        return drive->listing->page(connection, id, order, offset, limit, page);
-                      });
+    return answerPage(
+        context, [drive = drive_, failure, connection = connection_, id,
+                  order = listingOrder(params.getSortOrder()), offset = params.getOffset(),
+                  limit = params.getLimit()](ListingPage& page, Listing::ReadAhead& ahead) {
+          if (failure) return failure;
+          return drive->listing->page(connection, id, order, offset, limit, page, ahead);
+        });
   });
 }
 
@@ -299,13 +307,13 @@ kj::Promise<void> DaemonServer::enumerateAllFolders(EnumerateAllFoldersContext c
     if (!failure && params.getLimit() > Listing::kMaximumLimit) {
       failure = invalidParameterError("limit", std::to_string(params.getLimit()));
     }
-    return answerPage(context,
-                      [drive = drive_, failure, connection = connection_,
-                       order = listingOrder(params.getSortOrder()), offset = params.getOffset(),
-                       limit = params.getLimit()](ListingPage& page) {
-                        if (failure) return failure;
-                        return drive->listing->foldersPage(connection, order, offset, limit, page);
-                      });
+    return answerPage(
+        context, [drive = drive_, failure, connection = connection_,
+                  order = listingOrder(params.getSortOrder()), offset = params.getOffset(),
+                  limit = params.getLimit()](ListingPage& page, Listing::ReadAhead& ahead) {
+          if (failure) return failure;
+          return drive->listing->foldersPage(connection, order, offset, limit, page, ahead);
+        });
   });
 }
 

@@ -129,6 +129,7 @@ TEST_F(DaemonTreeTest, WhatIsMadeChangedRenamedAndRemovedOnDiskIsTold) {
 TEST_F(DaemonTreeTest, NamesThatTheDriveLeavesAloneAreToldToo) {
   upScanned();
   const auto observed = observe();
+  ASSERT_TRUE(observed.told->waitForStart());
   write(".x.swp");
   EXPECT_TRUE(observed.told->waitForEntry(entry("", ".x.swp")));
   EXPECT_FALSE(drive_->store->itemAtPath(root_ + "/.x.swp"));
@@ -137,6 +138,7 @@ TEST_F(DaemonTreeTest, NamesThatTheDriveLeavesAloneAreToldToo) {
 TEST_F(DaemonTreeTest, WhatComesWithANewFolderIsToldHoweverFastItCame) {
   upScanned();
   const auto observed = observe();
+  ASSERT_TRUE(observed.told->waitForStart());
   for (int i = 0; i < 20; ++i) write("new/deep" + std::to_string(i) + "/.x.swp");
   for (int i = 0; i < 20; ++i) {
     const std::string folder = "new/deep" + std::to_string(i);
@@ -156,6 +158,7 @@ TEST_F(DaemonTreeTest, WithoutWatchesWhatScansFindIsTold) {
   options.observer.unwatchedCostFactor = 1;
   upScanned(options);
   const auto observed = observe();
+  ASSERT_TRUE(observed.told->waitForStart());
   write("a/made");
   fs::rename(root_ + "/b/x", root_ + "/b/y");
   EXPECT_TRUE(observed.told->waitForEntry(entry("a", "made")));

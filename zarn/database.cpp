@@ -22,6 +22,7 @@
 #include "platform/foundation/log.h"
 #include "zarn/bulk_load.h"
 #include "zarn/busy_files.h"
+#include "zarn/checkpointer.h"
 #include "zarn/connection.h"
 #include "zarn/recent_backups.h"
 #include "zarn/schema.h"
@@ -33,14 +34,6 @@ namespace {
 constexpr std::size_t kMaximumBatch = 256;
 constexpr std::size_t kIdleReaders = 8;
 constexpr std::uint64_t kRemovalsBetweenPrunings = 1000;
-/// The log is written back to the database once it has so many pages, beside the writer: it waits
-/// for the disk, and commits must not.
-constexpr int kCheckpointPages = 4000;
-/// While commits go on, the log is never written back to its end. From so many pages on the writer
-/// does the little that is left itself, so that the log begins anew.
-constexpr int kLongLogPages = 20'000;
-/// Then it does all of it, so that the log does not grow without bound.
-constexpr int kMaximumLogPages = 100'000;
 constexpr const char* kAsideSuffix = ".new";
 constexpr const char* kSuspectSuffix = ".suspect";
 
@@ -130,12 +123,6 @@ struct Database::State {
   std::uint64_t removals = 0;
   int logPages = 0;
 
-  std::atomic<bool> isNearlyWrittenBack{false};
-  Mutex checkpointMutex;
-  Condition checkpointChanged;
-  bool isCheckpointDue GUARDED_BY(checkpointMutex) = false;
-  bool isCheckpointerEnding GUARDED_BY(checkpointMutex) = false;
-
   Mutex queueMutex;
   Condition queueChanged;
   std::deque<Task> queue GUARDED_BY(queueMutex);
@@ -155,13 +142,10 @@ struct Database::State {
   RecentlyGone recentlyGone;  // the writer's
 
   std::thread thread;
-  std::thread checkpointer;
+  Checkpointer checkpointer;
 
   void openWriter();
-  void runCheckpoints();
   NSErrorRef writeBack();
-  void requestCheckpoint();
-  void endCheckpoints();
   void run();
   bool takeBatch(std::vector<Task>& batch);
   void runAlone(Task& task);
@@ -274,7 +258,10 @@ void Database::State::runBatch(std::vector<Task>& batch) {
   rank = transaction.rank();
   if (afterwards) afterwards();
   publish(transaction);
-  requestCheckpoint();
+  if (checkpointer.didCommit(logPages)) {
+    (void)sqlite3_wal_checkpoint_v2(writer->database().getHandle(), nullptr,
+                                    SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+  }
 }
 
 std::function<void()> Database::State::letParticipate(WriteTransaction& transaction) {
@@ -287,36 +274,7 @@ std::function<void()> Database::State::letParticipate(WriteTransaction& transact
   return strong ? strong->willCommit(transaction) : std::function<void()>();
 }
 
-/// On the writer thread, after a commit.
-void Database::State::requestCheckpoint() {
-  if (logPages < kCheckpointPages) return;
-  const bool isLittleLeft = logPages > kLongLogPages && isNearlyWrittenBack.exchange(false);
-  if (isLittleLeft || logPages > kMaximumLogPages) {
-    (void)sqlite3_wal_checkpoint_v2(writer->database().getHandle(), nullptr,
-                                    SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
-    return;
-  }
-  LockGuard guard(checkpointMutex);
-  isCheckpointDue = true;
-  checkpointChanged.notifyOne();
-}
-
-void Database::State::runCheckpoints() {
-  for (;;) {
-    {
-      LockGuard guard(checkpointMutex);
-      while (!isCheckpointDue && !isCheckpointerEnding) checkpointChanged.wait(checkpointMutex);
-      if (isCheckpointerEnding) return;
-      isCheckpointDue = false;
-    }
-    if (const NSErrorRef error = writeBack()) {
-      log_error(defaultLog(), "[ERROR] the database's log could not be written back: %@", error);
-    } else {
-      isNearlyWrittenBack = true;
-    }
-  }
-}
-
+/// On the checkpointer's thread.
 NSErrorRef Database::State::writeBack() {
   std::unique_ptr<Connection> reader;
   NSErrorRef error;
@@ -333,15 +291,6 @@ NSErrorRef Database::State::writeBack() {
   }
   if (reader) returnReader(std::move(reader));
   return error;
-}
-
-void Database::State::endCheckpoints() {
-  {
-    LockGuard guard(checkpointMutex);
-    isCheckpointerEnding = true;
-    checkpointChanged.notifyOne();
-  }
-  checkpointer.join();
 }
 
 void Database::State::runTask(Task& task, WriteTransaction& transaction) {
@@ -444,7 +393,7 @@ NSErrorRef Database::State::swapIn(const std::string& aside) {
 Database::Database(std::shared_ptr<State> state) : state_(std::move(state)) {
   State* const running = state_.get();
   running->thread = std::thread([state = state_] { state->run(); });
-  running->checkpointer = std::thread([running] { running->runCheckpoints(); });
+  running->checkpointer.start([running] { return running->writeBack(); });
 }
 
 Database::~Database() {
@@ -459,7 +408,7 @@ Database::~Database() {
   } else {
     state_->thread.join();
   }
-  state_->endCheckpoints();
+  state_->checkpointer.end();
 }
 
 namespace {

@@ -59,14 +59,15 @@ RZEngineRef openStore(const DrivePaths& paths, const std::shared_ptr<ContentEngi
 
 }  // namespace
 
-/// What has to be done now and then: marks for files that the first scan left unmarked, items that
-/// leave the working set as time goes by, and content in the store that nobody refers to any more.
+/// What has to be done now and then: marks for files that the first scan left unmarked, whose
+/// upload waits for that, items that leave the working set as time goes by, and content in the
+/// store that nobody refers to any more.
 class Drive::Housekeeping {
  public:
-  Housekeeping(std::shared_ptr<Database> database, std::shared_ptr<Scanner> scanner,
+  Housekeeping(std::shared_ptr<Scanner> scanner, std::shared_ptr<ContentEngine> engine,
                std::shared_ptr<WorkingSetSignals> signals, std::optional<StoreUpkeep> upkeep)
-      : database_(std::move(database)),
-        scanner_(std::move(scanner)),
+      : scanner_(std::move(scanner)),
+        engine_(std::move(engine)),
         signals_(std::move(signals)),
         upkeep_(std::move(upkeep)),
         thread_([this] { run(); }) {}
@@ -80,9 +81,10 @@ class Drive::Housekeeping {
   }
 
  private:
-  static constexpr std::uint32_t kStamps = 100;
-  static constexpr std::chrono::milliseconds kStampPause{50};
-  static constexpr std::chrono::milliseconds kBusyPause{1000};  // while other things change
+  // Somewhat faster than small files are uploaded; each mark is a change that the observer sees.
+  static constexpr std::uint32_t kStamps = 500;
+  static constexpr std::chrono::milliseconds kStampPause{100};
+  static constexpr std::chrono::seconds kErrorPause{10};
   static constexpr std::chrono::minutes kPause{15};
 
   /// False when it is time to stop.
@@ -95,25 +97,35 @@ class Drive::Housekeeping {
     return !isStopping_;
   }
 
+  /// False when it is time to stop.
+  bool stamp() {
+    for (std::uint32_t count = 1; count != 0;) {
+      const NSErrorRef error = scanner_->stampSome(kStamps, count);
+      if (error) {
+        log_error(defaultLog(), "[ERROR] files cannot be marked with their ids yet: %@", error);
+        if (!pause(kErrorPause)) return false;
+        count = 1;
+        continue;
+      }
+      engine_->didStamp();
+      if (count != 0 && !pause(kStampPause)) return false;
+    }
+    return true;
+  }
+
   void run() {
     giveWayToOthers();
     while (true) {
       signals_->expire(NSDate::now().nanoseconds());
-      while (scanner_->stampSome(kStamps) != 0) {
-        const std::uint64_t rank = database_->currentRank();
-        const bool isBusy = std::exchange(lastRank_, rank) != rank;
-        if (!pause(isBusy ? kBusyPause : kStampPause)) return;
-      }
-      if (!pause(kPause)) return;
+      if (!stamp() || !pause(kPause)) return;
       if (upkeep_) (void)upkeep_->runIfDue();
     }
   }
 
-  const std::shared_ptr<Database> database_;
   const std::shared_ptr<Scanner> scanner_;
+  const std::shared_ptr<ContentEngine> engine_;
   const std::shared_ptr<WorkingSetSignals> signals_;
   std::optional<StoreUpkeep> upkeep_;
-  std::uint64_t lastRank_ = 0;  // own thread
   Mutex mutex_;
   Condition changed_;
   bool isStopping_ GUARDED_BY(mutex_) = false;
@@ -171,7 +183,8 @@ Drive::Drive(const DrivePaths& drivePaths, Options options, std::shared_ptr<Data
       setters(std::make_shared<ItemSetters>(store, scanner)),
       moves(std::make_shared<MoveCapabilities>(store, scanner, trash)),
       locations(std::make_shared<ItemLocations>(store, scanner, containers)),
-      engine(options.engine ? options.engine : ContentEngine::create(store, scanner, {})),
+      engine(options.engine ? options.engine
+                            : ContentEngine::create(store, scanner, options.content)),
       workingSetSignals_(std::make_shared<WorkingSetSignals>(feed,
                                                              [weak = std::weak_ptr(registrations)] {
                                                                if (const auto strong = weak.lock())
@@ -210,8 +223,8 @@ void Drive::start() {
                            auto& notFound) { return scanner->scanDirty(dirty, notFound); },
        .didFinishFirstScan =
            [this] {
-             housekeeping_ = std::make_unique<Housekeeping>(database, scanner, workingSetSignals_,
-                                                            storeUpkeep());
+             housekeeping_ =
+                 std::make_unique<Housekeeping>(scanner, engine, workingSetSignals_, storeUpkeep());
            }});
 }
 

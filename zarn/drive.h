@@ -47,6 +47,7 @@ class Drive : public std::enable_shared_from_this<Drive> {
     TreeJournal::Options journal;
     /// Where `.desktop` files are looked for.
     std::vector<std::string> applications = applicationDirectories();
+    ContentEngine::Options content;
     /// In the place of the drive's own, which then has no record store.
     std::shared_ptr<ContentEngine> engine;
   };

@@ -91,6 +91,7 @@ class DriveConvergenceTest : public testing::Test {
 
   void up(Drive::Options options = {}) {
     options.applications = {};
+    options.content.uploadPause = std::chrono::milliseconds::zero();
     NSErrorRef error;
     drive_ = Drive::open(DrivePaths::forHome(base_ + "/home"), options, &error);
     ASSERT_TRUE(drive_) << error->description();

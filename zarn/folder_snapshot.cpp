@@ -11,6 +11,7 @@
 #include <limits>
 
 #include "platform/foundation/file_time.h"
+#include "platform/foundation/unnoticed_reads.h"
 #include "zarn/change_times.h"
 #include "zarn/tree_layout.h"
 
@@ -93,6 +94,7 @@ bool lookAtEntry(int folder, const char* name, FolderEntry& out) {
 
 int readFolderEntries(int folder, FolderSnapshot& snapshot) {
   alignas(dirent64) thread_local std::array<char, kReadBuffer> buffer;
+  readUnnoticed(folder);
   for (;;) {
     const ssize_t length = getdents64(folder, buffer.data(), buffer.size());
     if (length < 0) return errno;

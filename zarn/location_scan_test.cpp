@@ -66,8 +66,7 @@ TEST_F(LocationScanTest, ARenamedItemKeepsItsId) {
 
 TEST_F(LocationScanTest, WhatIsGoneLosesItsRowAndComesBackUnderItsId) {
   const auto a = id("folder/a.txt");
-  while (scanner->stampSome(100) != 0) {
-  }
+  stampAll();
   rename("folder/a.txt", "b.txt");
   expectNoSuchItem("folder/a.txt");
   EXPECT_FALSE(store->itemByID(a));
@@ -182,27 +181,68 @@ TEST_F(LocationScanTest, AScanThatLookedEarlierUndoesNothing) {
   EXPECT_EQ(names(id("folder")).size(), 301U);
 }
 
-TEST_F(LocationScanTest, AScanThatSawItAwayLeavesWhatHasComeBack) {
+/// A scan of a folder that has seen what is there, and decides on it later.
+class LaterDecisionTest : public LocationScanTest {
+ protected:
+  void beginScanning() {
+    // Something new has to be read before that scan decides.
+    makeFolder("folder/new");
+    ASSERT_EQ(FaultPoint::arm("zarn.scan.before-new-folders=pause-until-file:" + gate_), nullptr);
+    scanning_ = std::thread([this] { EXPECT_EQ(scanFolders({"folder"}), nullptr); });
+    EXPECT_TRUE(waitUntil([&] { return std::filesystem::exists(gate_ + ".reached"); }));
+  }
+  void finishScanning() {
+    std::ofstream(gate_).put('x');
+    scanning_.join();
+    FaultPoint::disarmAll();
+  }
+
+ private:
+  const std::string gate_ = layout.home() + "/go";
+  std::thread scanning_;
+};
+
+TEST_F(LaterDecisionTest, LeavesWhatHasComeBack) {
   const std::string away = layout.home() + "/away";
   const std::uint64_t item = id("folder/a.txt");
   ASSERT_EQ(::rename(at("folder/a.txt").c_str(), away.c_str()), 0);
-  // Something new has to be read before that scan decides.
-  makeFolder("folder/new");
-  const std::string gate = layout.home() + "/go";
-  ASSERT_EQ(FaultPoint::arm("zarn.scan.before-new-folders=pause-until-file:" + gate), nullptr);
-  std::thread scanning([&] { EXPECT_EQ(scanFolders({"folder"}), nullptr); });
-  const bool isReached = waitUntil([&] { return std::filesystem::exists(gate + ".reached"); });
-  ASSERT_EQ(::rename(away.c_str(), at("folder/a.txt").c_str()), 0);
+  beginScanning();
+  EXPECT_EQ(::rename(away.c_str(), at("folder/a.txt").c_str()), 0);
   const auto back = look("folder/a.txt");
   (void)sink->take();
-  std::ofstream(gate).put('x');
-  scanning.join();
-  FaultPoint::disarmAll();
-  ASSERT_TRUE(isReached);
+  finishScanning();
   ASSERT_TRUE(back);
   EXPECT_EQ(back->id, item);
   EXPECT_EQ(id("folder/a.txt"), item);
   for (const ItemChange& change : sink->take()) EXPECT_NE(change.row.id, item) << "nothing to tell";
+}
+
+TEST_F(LaterDecisionTest, LeavesADocumentThatOthersHaveSeenSaved) {
+  const std::uint64_t item = id("folder/a.txt");
+  write("folder/saved", "saved");
+  rename("folder/saved", "folder/a.txt");
+  beginScanning();
+  const auto saved = look("folder/a.txt");
+  (void)sink->take();
+  finishScanning();
+  ASSERT_TRUE(saved);
+  EXPECT_EQ(saved->id, item);
+  EXPECT_EQ(id("folder/a.txt"), item);
+  for (const ItemChange& change : sink->take()) EXPECT_NE(change.row.id, item) << "nothing to tell";
+}
+
+TEST_F(LaterDecisionTest, LeavesADocumentThatIsSavedOnceMore) {
+  const std::uint64_t item = id("folder/a.txt");
+  write("folder/saved", "saved");
+  rename("folder/saved", "folder/a.txt");
+  beginScanning();
+  EXPECT_TRUE(look("folder/a.txt"));
+  write("folder/saved", "saved again");
+  rename("folder/saved", "folder/a.txt");
+  finishScanning();
+  const auto saved = look("folder/a.txt");
+  ASSERT_TRUE(saved);
+  EXPECT_EQ(saved->id, item);
 }
 
 }  // namespace

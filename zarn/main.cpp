@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "platform/foundation/drive_paths.h"
+#include "platform/foundation/duration_setting.h"
 #include "platform/foundation/ending_signals.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/log_sinks.h"
@@ -173,8 +174,11 @@ int run(const std::vector<std::string>& given) {
   const Claim claim = claimDrive(paths);
   if (!claim.lock) return fail(claim.code, claim.failure);
   openLog("zarn", paths);
+  Drive::Options options = arguments->drive;
+  options.content.uploadPause =
+      durationSetting("YOMBER_UPLOAD_PAUSE_MS", options.content.uploadPause, {});
   NSErrorRef error;
-  const auto drive = Drive::open(paths, arguments->drive, &error);
+  const auto drive = Drive::open(paths, options, &error);
   if (!drive) return failLogged(kCannotStart, error);
   return serve(drive, endingSignals);
 }

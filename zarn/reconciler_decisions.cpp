@@ -60,6 +60,14 @@ bool Reconciler::takeReplaced(WriteTransaction& transaction, Candidate& candidat
   ItemRow replaced = place->second;
   if (!isSameType(replaced, candidate.entry) || isElsewhere(replaced)) return false;
   if (!isStillThere(candidate)) return false;
+  const auto current = findByID(transaction.connection(), replaced.id);
+  if (!current) return false;
+  if (current->rank != replaced.rank || current->inode != replaced.inode) {
+    // Another scan was faster: perhaps the file is the document already.
+    gone_.erase(place);
+    noteConflict(candidate.parent, candidate.name);
+    return true;
+  }
   const auto own = findOwnRow(transaction, candidate);
   if (own && !isBeingSaved(candidate, *own)) return false;
   // A file that nobody else knows yet, saved over a document: the document goes on.

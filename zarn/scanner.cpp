@@ -299,6 +299,8 @@ std::optional<ItemRow> Scanner::scanLocation(std::string_view path, NSErrorRef* 
   return row;
 }
 
-std::uint32_t Scanner::stampSome(std::uint32_t limit) { return state_->stamper.stampSome(limit); }
+NSErrorRef Scanner::stampSome(std::uint32_t limit, std::uint32_t& count) {
+  return state_->stamper.stampSome(limit, count);
+}
 
 }  // namespace yomber

@@ -83,9 +83,9 @@ class Scanner {
 
   /// Writes the ids of up to `limit` items that the first scan left unmarked into their files'
   /// attributes, so that a lost database can be rebuilt with the same ids. Each write shows as an
-  /// attribute change to observers, so pace it. Answers how many were looked at; 0 when all is
+  /// attribute change to observers, so pace it. `count` is how many were looked at; 0 when all is
   /// done.
-  [[nodiscard]] std::uint32_t stampSome(std::uint32_t limit);
+  [[nodiscard]] NSErrorRef stampSome(std::uint32_t limit, std::uint32_t& count);
 
  private:
   class State;

@@ -1,11 +1,13 @@
 #include "zarn/scanner.h"
 
+#include <sys/stat.h>
 #include <sys/wait.h>
 
 #include <map>
 #include <set>
 
 #include "platform/foundation/fault_points.h"
+#include "platform/foundation/file_time.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/folder_snapshot.h"
 #include "zarn/row_queries.h"
@@ -17,10 +19,6 @@ namespace {
 
 class ScannerTest : public TestDrive {
  protected:
-  void stampAll() {
-    while (scanner->stampSome(100) != 0) {
-    }
-  }
   void populate() {
     makeFolder("folder");
     makeFolder("folder/inner");
@@ -271,7 +269,35 @@ TEST_F(ScannerTest, StampsAreInvisible) {
   EXPECT_EQ(scan().changes, 0U);
   EXPECT_EQ(database->currentRank(), rank);
   EXPECT_TRUE(sink->take().empty());
-  EXPECT_EQ(scanner->stampSome(100), 0U);
+  std::uint32_t count = 1;
+  EXPECT_EQ(scanner->stampSome(100, count), nullptr);
+  EXPECT_EQ(count, 0U);
+}
+
+TEST_F(ScannerTest, AStampIsNoChangeThatIsStillToBeSeen) {
+  constexpr int kFiles = 100;
+  makeFolder("folder");
+  for (int i = 0; i < kFiles; ++i) write("folder/" + std::to_string(i));
+  scan();
+  stampAll();
+  for (int i = 0; i < kFiles; ++i) {
+    const std::string path = "folder/" + std::to_string(i);
+    struct stat status{};
+    ASSERT_EQ(stat(at(path).c_str(), &status), 0);
+    EXPECT_EQ(row(path)->ctime, nanosecondsOf(status.st_ctim)) << path;
+  }
+}
+
+TEST_F(ScannerTest, AScanLeavesAFoldersDateOfAccess) {
+  populate();
+  // Older than its change: whoever reads it is noticed.
+  const timespec dates[2] = {{.tv_sec = 1'000'000'000, .tv_nsec = 0},
+                             {.tv_sec = 0, .tv_nsec = UTIME_NOW}};
+  ASSERT_EQ(utimensat(AT_FDCWD, at("folder").c_str(), dates, 0), 0);
+  scan();
+  struct stat status{};
+  ASSERT_EQ(stat(at("folder").c_str(), &status), 0);
+  EXPECT_EQ(status.st_atim.tv_sec, 1'000'000'000);
 }
 
 TEST_F(ScannerTest, LinksAreKnownByPlace) {

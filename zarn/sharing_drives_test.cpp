@@ -31,6 +31,7 @@ class OneDrive {
     NSErrorRef error;
     Drive::Options options;
     options.applications.clear();
+    options.content.uploadPause = std::chrono::milliseconds::zero();
     drive = Drive::open(paths, options, &error);
     EXPECT_NE(drive, nullptr) << error->description();
     drive->start();

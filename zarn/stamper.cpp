@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 
+#include <functional>
 #include <vector>
 
 #include "zarn/change_times.h"
@@ -15,10 +16,10 @@
 namespace yomber {
 namespace {
 
-struct Stamped {
-  std::uint64_t id = 0;
-  std::int64_t ctimeBefore = 0;
-  std::int64_t ctime = 0;
+struct Stamping {
+  const ItemRow* row = nullptr;  ///< of the batch
+  bool isMarked = false;
+  std::int64_t ctime = 0;  ///< to remember
 };
 
 struct Batch {
@@ -47,24 +48,56 @@ bool isToBeStamped(const ItemRow& row) {
 }
 
 /// Marks one file, provided that it is still the one that the row describes.
-bool stampRow(int folder, const std::string& name, const ItemRow& row, Stamped& out) {
+bool mark(int folder, const ItemRow& row) {
+  const std::string& name = row.nameOnDisk();
   FolderEntry before;
   if (!lookAtEntry(folder, name.c_str(), before) || !before.carriesID()) return false;
   const bool isStill = before.inode == row.inode && before.btime == row.btime &&
                        before.mtime == row.mtime && before.size == row.size;
-  if (!isStill || !stampItem(folder, name, row.inode, row.id)) return false;
-  out = {row.id, row.ctime, changeTimeAfterOwnWrite(folder, name, row).value_or(row.ctime)};
-  return true;
+  return isStill && stampItem(folder, name, row.inode, row.id);
 }
 
-NSErrorRef store(WriteTransaction& transaction, const std::vector<Stamped>& stamped,
+/// Does something with each whose folder can be opened.
+void forEachInFolder(FolderOpener& folders, std::vector<Stamping>& items,
+                     const std::function<void(int folder, Stamping& item)>& action) {
+  std::uint64_t folder = kNoParent;
+  std::shared_ptr<const FileDescriptor> opened;
+  for (Stamping& item : items) {
+    if (item.row->parent != folder) {
+      folder = item.row->parent;
+      opened = folders.open(folder);
+    }
+    if (opened) action(opened->get(), item);
+  }
+}
+
+std::vector<Stamping> stamp(const ItemStore& store, const std::vector<ItemRow>& rows) {
+  std::vector<Stamping> items;
+  for (const ItemRow& row : rows) {
+    if (isToBeStamped(row) && row.parent != kNoParent)
+      items.push_back({.row = &row, .ctime = row.ctime});
+  }
+  FolderOpener folders(store);
+  forEachInFolder(folders, items,
+                  [](int folder, Stamping& item) { item.isMarked = mark(folder, *item.row); });
+  std::erase_if(items, [](const Stamping& item) { return !item.isMarked; });
+  if (items.empty()) return items;
+  waitForTick();
+  forEachInFolder(folders, items, [](int folder, Stamping& item) {
+    const ItemRow& row = *item.row;
+    item.ctime = changeTimeAfterOwnWrite(folder, row.nameOnDisk(), row).value_or(row.ctime);
+  });
+  return items;
+}
+
+NSErrorRef store(WriteTransaction& transaction, const std::vector<Stamping>& stamped,
                  std::int64_t end) {
-  for (const Stamped& item : stamped) {
-    auto row = findByID(transaction.connection(), item.id);
+  for (const Stamping& item : stamped) {
+    auto row = findByID(transaction.connection(), item.row->id);
     if (!row) continue;
     row->flags |= row_flag::kStamped;
     // A scan that came in between has a newer time.
-    if (row->ctime == item.ctimeBefore) row->ctime = item.ctime;
+    if (row->ctime == item.row->ctime) row->ctime = item.ctime;
     transaction.updateQuietly(*row);
   }
   setMetaInteger(transaction.connection(), meta::kStampedUpTo, end);
@@ -73,26 +106,17 @@ NSErrorRef store(WriteTransaction& transaction, const std::vector<Stamped>& stam
 
 }  // namespace
 
-std::uint32_t Stamper::stampSome(std::uint32_t limit) {
+NSErrorRef Stamper::stampSome(std::uint32_t limit, std::uint32_t& count) {
+  count = 0;
   LockGuard guard(mutex_);
   Batch batch;
-  if (readBatch(*store_->database(), limit, batch) || batch.rows.empty()) return 0;
-  std::vector<Stamped> stamped;
-  std::uint64_t folder = kNoParent;
-  std::shared_ptr<const FileDescriptor> opened;
-  FolderOpener folders(*store_);
-  for (const ItemRow& row : batch.rows) {
-    if (!isToBeStamped(row) || row.parent == kNoParent) continue;
-    if (row.parent != folder) {
-      folder = row.parent;
-      opened = folders.open(folder);
-    }
-    Stamped item;
-    if (opened && stampRow(opened->get(), row.nameOnDisk(), row, item)) stamped.push_back(item);
-  }
-  const NSErrorRef error = store_->database()->write(
+  if (NSErrorRef error = readBatch(*store_->database(), limit, batch)) return error;
+  if (batch.rows.empty()) return nullptr;
+  const std::vector<Stamping> stamped = stamp(*store_, batch.rows);
+  NSErrorRef error = store_->database()->write(
       [&](WriteTransaction& transaction) { return store(transaction, stamped, batch.end); });
-  return error ? 0 : static_cast<std::uint32_t>(batch.rows.size());
+  if (!error) count = static_cast<std::uint32_t>(batch.rows.size());
+  return error;
 }
 
 }  // namespace yomber

@@ -3,6 +3,7 @@
 #include <cstdint>
 #include <memory>
 
+#include "platform/foundation/error.h"
 #include "platform/foundation/lock.h"
 #include "zarn/item_store.h"
 
@@ -16,8 +17,8 @@ class Stamper {
  public:
   explicit Stamper(std::shared_ptr<ItemStore> store) : store_(std::move(store)) {}
 
-  /// Up to `limit` items; answers how many were looked at.
-  std::uint32_t stampSome(std::uint32_t limit);
+  /// Up to `limit` items. `count` is how many were looked at; 0 when all is done.
+  [[nodiscard]] NSErrorRef stampSome(std::uint32_t limit, std::uint32_t& count);
 
  private:
   const std::shared_ptr<ItemStore> store_;

@@ -192,6 +192,7 @@ class DaemonTest : public testing::Test {
 
   void up(Drive::Options options = {}) {
     options.applications = {base_ + "/applications"};
+    options.content.uploadPause = std::chrono::milliseconds::zero();
     NSErrorRef error;
     drive_ = Drive::open(paths_, options, &error);
     ASSERT_TRUE(drive_) << error->description();

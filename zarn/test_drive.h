@@ -73,6 +73,13 @@ class TestDrive : public testing::Test {
     EXPECT_EQ(error, nullptr) << error->description();
     return report;
   }
+  /// Writes all ids that a first scan left unwritten.
+  void stampAll() {
+    for (std::uint32_t count = 1; count != 0;) {
+      const NSErrorRef error = scanner->stampSome(100, count);
+      ASSERT_EQ(error, nullptr) << error->description();
+    }
+  }
 
   [[nodiscard]] std::string at(const std::string& path) const {
     return path.empty() ? layout.root() : layout.root() + "/" + path;

@@ -54,17 +54,18 @@ class TreeJournal::Member final : public JournalSubscription,
 
   void sendNext() {
     JournalBatch batch;
-    switch (nextStep(batch)) {
+    std::shared_ptr<JournalReceiver> receiver;
+    switch (nextStep(batch, receiver)) {
       case Step::None:
         return;
       case Step::ReadNames:
-        return ThreadPool::shared().async([weak = weak_from_this()] {
-          if (const auto self = weak.lock()) self->readNames();
+        return ThreadPool::shared().async([weak = weak_from_this(), receiver] {
+          if (const auto self = weak.lock()) self->readNames(*receiver);
         });
       case Step::LoseTrack:
-        return receiver_->loseTrack(whenAnswered());
+        return receiver->loseTrack(whenAnswered());
       case Step::Change:
-        return receiver_->change(std::move(batch), whenAnswered());
+        return receiver->change(std::move(batch), whenAnswered());
     }
   }
 
@@ -84,7 +85,8 @@ class TreeJournal::Member final : public JournalSubscription,
     needsLoss_ = true;
   }
 
-  Step nextStep(JournalBatch& batch) {
+  /// `receiver` is who is told; he may be let go of before a call to him has returned.
+  Step nextStep(JournalBatch& batch, std::shared_ptr<JournalReceiver>& receiver) {
     LockGuard guard(mutex_);
     if (isClosed_ || isBusy_) return Step::None;
     Step step = Step::None;
@@ -99,6 +101,7 @@ class TreeJournal::Member final : public JournalSubscription,
       step = Step::Change;
     }
     isBusy_ = step != Step::None;
+    receiver = receiver_;
     return step;
   }
 
@@ -108,13 +111,16 @@ class TreeJournal::Member final : public JournalSubscription,
     };
   }
 
+  /// Who did not take a call is let go of: that he is told nothing more, he learns by that.
   void answered(bool taken) {
+    std::shared_ptr<JournalReceiver> ended;
     {
       LockGuard guard(mutex_);
       isBusy_ = false;
       if (!taken) {
         isClosed_ = true;
         queue_.clear();
+        std::swap(ended, receiver_);
       }
     }
     if (taken) return sendNext();
@@ -123,7 +129,7 @@ class TreeJournal::Member final : public JournalSubscription,
   }
 
   /// The first part of the names, or the next one. On the pool.
-  void readNames() {
+  void readNames(JournalReceiver& receiver) {
     std::optional<ShownNamesPosition> from;
     bool isFirst = false;
     {
@@ -145,8 +151,8 @@ class TreeJournal::Member final : public JournalSubscription,
       position_ = next.value_or(ShownNamesPosition{});
       hasStarted_ = true;
     }
-    if (isFirst) return receiver_->start(std::move(names), whenAnswered());
-    receiver_->change({.entries = {}, .shownNames = std::move(names)}, whenAnswered());
+    if (isFirst) return receiver.start(std::move(names), whenAnswered());
+    receiver.change({.entries = {}, .shownNames = std::move(names)}, whenAnswered());
   }
 
   /// Tried again when there is more to tell.
@@ -159,9 +165,9 @@ class TreeJournal::Member final : public JournalSubscription,
   const Options options_;
   const std::shared_ptr<State> state_;
   const std::shared_ptr<ItemStore> store_;
-  const std::shared_ptr<JournalReceiver> receiver_;
 
   Mutex mutex_;
+  std::shared_ptr<JournalReceiver> receiver_ GUARDED_BY(mutex_);  // nil once closed
   JournalQueue queue_ GUARDED_BY(mutex_);
   bool isClosed_ GUARDED_BY(mutex_) = false;
   bool isBusy_ GUARDED_BY(mutex_) = false;      // a call is on its way, or names are being read

@@ -6,6 +6,7 @@
 
 #include <chrono>
 #include <thread>
+#include <utility>
 
 #include "zarn/recording_receiver.h"
 #include "zarn/test_drive.h"
@@ -45,6 +46,17 @@ class TreeJournalTest : public TestDrive {
   }
   [[nodiscard]] DiskEntry entry(const std::string& folder, const std::string& name) const {
     return {.folder = inode(folder), .name = name};
+  }
+
+  /// Whether nobody but the test keeps the receiver; it is dropped.
+  [[nodiscard]] bool waitUntilLetGoOf() {
+    const std::weak_ptr<RecordingReceiver> watched = std::exchange(receiver_, nullptr);
+    // The thread that has just told it may still be on its way out.
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+    while (!watched.expired() && std::chrono::steady_clock::now() < deadline) {
+      std::this_thread::yield();
+    }
+    return watched.expired();
   }
 
   bool areWatched_ = false;
@@ -298,6 +310,8 @@ TEST_F(TreeJournalTest, WhoDoesNotTakeACallIsToldNothingMore) {
   journal_->entriesDidChange({{1, "x"}});
   journal_->didLoseTrack();
   EXPECT_THAT(receiver_->told().calls, ElementsAre("start"));
+  // And let go of, although he still has his subscription.
+  EXPECT_TRUE(waitUntilLetGoOf());
 }
 
 TEST_F(TreeJournalTest, ADroppedSubscriptionLeavesNothingBehind) {
@@ -305,15 +319,8 @@ TEST_F(TreeJournalTest, ADroppedSubscriptionLeavesNothingBehind) {
   EXPECT_FALSE(journal_->wantsEvents());
   observe();
   EXPECT_TRUE(journal_->wantsEvents());
-  const std::weak_ptr<RecordingReceiver> watched = receiver_;
-  receiver_.reset();
   subscription_.reset();
-  // The thread that has just told it may still be on its way out.
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-  while (!watched.expired() && std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::yield();
-  }
-  EXPECT_TRUE(watched.expired());
+  EXPECT_TRUE(waitUntilLetGoOf());
   EXPECT_EQ(journal_->count(), 0U);
   EXPECT_FALSE(journal_->wantsEvents());
 }

@@ -115,7 +115,8 @@ ContentCore::ContentCore(std::shared_ptr<ItemStore> itemStore, std::shared_ptr<S
       scanner(std::move(itemScanner)),
       options(withClock(engineOptions)),
       queue(makeQueue(*items, engineOptions)),
-      participant(std::make_shared<ContentParticipant>(queue, options.clock)),
+      participant(std::make_shared<ContentParticipant>(
+          queue, options.clock, std::chrono::nanoseconds(options.uploadPause).count())),
       drawer(options.drawer ? options.drawer : std::make_shared<DocumentDrawer>()) {
   // Jobs of changes that come while nobody is signed in are those of who was last.
   (void)database().read([&](Connection& connection) {

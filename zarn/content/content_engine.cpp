@@ -9,6 +9,7 @@
 
 #include "platform/foundation/background_thread.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "platform/ostrell/constants.h"
 #include "zarn/content/content_core.h"
@@ -38,6 +39,8 @@ NSErrorRef noSuchFile(std::string_view path) {
                                   {{NSFilePathErrorKey, std::string(path)}});
 }
 
+FaultPoint wishTakenBack("zarn.wish.taken-back");
+
 /// A wish that has been answered already.
 class GrantedWish final : public ContentWish {
  public:
@@ -54,7 +57,10 @@ class WaitingWish final : public ContentWish {
         item_(item),
         number_(core_->wishes.add(item, std::move(completion), progress_)) {}
   ~WaitingWish() override {
-    if (const auto completion = core_->wishes.remove(item_, number_)) completion(cancelled());
+    const auto completion = core_->wishes.remove(item_, number_);
+    if (!completion) return;
+    (void)wishTakenBack.hit();
+    completion(cancelled());
   }
   WaitingWish(const WaitingWish&) = delete;
   WaitingWish& operator=(const WaitingWish&) = delete;
@@ -95,6 +101,7 @@ class Engine final : public ContentEngine {
     core_->setStore(std::move(contents), account);
   }
   void sweep() override;
+  void didStamp() override;
   void setTrash(std::function<NSErrorRef(const std::string& path)> trash) override {
     core_->trash = std::move(trash);
   }
@@ -196,7 +203,7 @@ void Engine::end() {
   }
 }
 
-/// True when there is no more to sweep.
+/// True when there is no more to sweep for now.
 using Sweep = std::function<bool(ContentCore&, WriteTransaction&)>;
 
 /// A part at a time, so that others get their turn.
@@ -214,10 +221,14 @@ void sweepOn(const std::shared_ptr<ContentCore>& core, JobKind kind, const Sweep
       });
 }
 
-void Engine::sweep() {
+void Engine::didStamp() {
   sweepOn(core_, JobKind::Upload, [](ContentCore& core, WriteTransaction& transaction) {
     return core.participant->sweep(transaction);
   });
+}
+
+void Engine::sweep() {
+  didStamp();
   core_->database().writeLater(
       [core = core_](WriteTransaction& transaction) {
         beginThumbnailSweep(*core, transaction);

@@ -1,5 +1,6 @@
 #include "zarn/content/content_participant.h"
 
+#include <algorithm>
 #include <vector>
 
 #include "zarn/content/share_rows.h"
@@ -12,6 +13,8 @@ namespace {
 
 constexpr std::int64_t kSweptAtOnce = 2000;
 constexpr std::int64_t kAllSwept = -1;
+/// For how many pauses what goes on changing waits.
+constexpr std::int64_t kMostPauses = 10;
 
 bool isSameFileContent(const ItemRow& row, const FileStamp& stamp) {
   return row.inode == stamp.inode && row.size == stamp.size && row.mtime == stamp.mtime;
@@ -48,6 +51,17 @@ void ContentParticipant::noteFolder(Connection& connection, const ItemRow& row, 
   made.hasUploads = true;
 }
 
+/// Once it is left alone: the steps of a save are one upload.
+void ContentParticipant::addUpload(Connection& connection, std::uint64_t id,
+                                   std::int64_t account) const {
+  const std::int64_t now = clock_();
+  const auto before = findJob(connection, id, JobKind::Upload);
+  const bool isPausing = before && before->state == JobState::Waiting && before->due > now;
+  const std::int64_t since = isPausing ? std::min(before->created, now) : now;
+  const std::int64_t due = std::min(now + uploadPause_, since + kMostPauses * uploadPause_);
+  addJob(connection, id, JobKind::Upload, account, due, since);
+}
+
 void ContentParticipant::noteDocument(Connection& connection, const ItemRow& row, Made& made) {
   const auto content = findContent(connection, row.id);
   const bool isHere = (row.flags & row_flag::kDownloaded) != 0;
@@ -56,13 +70,13 @@ void ContentParticipant::noteDocument(Connection& connection, const ItemRow& row
   const bool isDone = content && isMarked && isConfirmed(row, *content) &&
                       (!isHere || row.ctime == content->stamp.ctime);
   const std::int64_t account = content && content->content ? content->account : queue_->account();
-  const std::int64_t now = clock_();
   if (!isDone) {
-    addJob(connection, row.id, JobKind::Upload, account, now, now);
+    addUpload(connection, row.id, account);
     made.hasUploads = true;
   }
   const bool isToCome = !isHere && !findJob(connection, row.id, JobKind::Download);
   if (isToCome && isPinned(connection, row.id)) {
+    const std::int64_t now = clock_();
     addJob(connection, row.id, JobKind::Download, account, now, now);
     made.hasDownloads = true;
   }
@@ -135,16 +149,23 @@ bool ContentParticipant::sweep(WriteTransaction& transaction) {
   std::int64_t at = metaInteger(connection, meta::kSweptUpTo);
   if (at == kAllSwept) return true;
   std::vector<ItemRow> rows;
-  std::int64_t last = kAllSwept;
   {
-    StatementUse statement(connection.prepared(
-        "SELECT " YOMBER_ROW_COLUMNS ",seq FROM item WHERE seq>?1 ORDER BY seq LIMIT ?2"));
+    StatementUse statement(connection.prepared("SELECT " YOMBER_ROW_COLUMNS
+                                               ",seq FROM item WHERE seq>?1 AND seq<=?2 "
+                                               "ORDER BY seq LIMIT ?3"));
     statement->bindInteger(1, at);
-    statement->bindInteger(2, kSweptAtOnce);
+    statement->bindInteger(2, metaInteger(connection, meta::kStampedUpTo));
+    statement->bindInteger(3, kSweptAtOnce);
     while (statement->step()) {
       readRow(*statement, rows.emplace_back());
-      last = statement->integer(kRowColumnCount);
+      at = statement->integer(kRowColumnCount);
     }
+  }
+  if (rows.empty()) {
+    StatementUse others(connection.prepared("SELECT 1 FROM item WHERE seq>?1 LIMIT 1"));
+    others->bindInteger(1, at);
+    if (!others->step()) setMetaInteger(connection, meta::kSweptUpTo, kAllSwept);
+    return true;
   }
   Made made;
   for (const ItemRow& row : rows) {
@@ -152,8 +173,8 @@ bool ContentParticipant::sweep(WriteTransaction& transaction) {
                          findJob(connection, row.id, JobKind::Upload);
     if (!isKnown) noteDocument(connection, row, made);
   }
-  setMetaInteger(connection, meta::kSweptUpTo, last);
-  return last == kAllSwept;
+  setMetaInteger(connection, meta::kSweptUpTo, at);
+  return false;
 }
 
 }  // namespace yomber

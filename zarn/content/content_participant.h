@@ -15,13 +15,15 @@ namespace yomber {
 /// Thread-safety: for the writer thread.
 class ContentParticipant : public CommitParticipant {
  public:
-  ContentParticipant(std::shared_ptr<JobQueue> queue, std::function<std::int64_t()> clock)
-      : queue_(std::move(queue)), clock_(std::move(clock)) {}
+  /// `uploadPause` as in the engine's options; in ns, as the clock.
+  ContentParticipant(std::shared_ptr<JobQueue> queue, std::function<std::int64_t()> clock,
+                     std::int64_t uploadPause)
+      : queue_(std::move(queue)), clock_(std::move(clock)), uploadPause_(uploadPause) {}
 
   std::function<void()> willCommit(WriteTransaction& transaction) override;
 
   /// Gives jobs to documents that were there before this program made jobs, some thousands at a
-  /// time. True when all have been seen to.
+  /// time, as far as their files have got their marks. True when that is all for now.
   bool sweep(WriteTransaction& transaction);
 
  private:
@@ -31,6 +33,7 @@ class ContentParticipant : public CommitParticipant {
     bool hasSpreads = false;
   };
   void noteDocument(Connection& connection, const ItemRow& row, Made& made);
+  void addUpload(Connection& connection, std::uint64_t id, std::int64_t account) const;
   void noteFolder(Connection& connection, const ItemRow& row, Made& made) const;
   [[nodiscard]] static bool isLeft(Connection& connection, const ContentRow& content);
   void noteRemoval(Connection& connection, std::uint64_t id, Made& made);
@@ -39,6 +42,7 @@ class ContentParticipant : public CommitParticipant {
 
   const std::shared_ptr<JobQueue> queue_;
   const std::function<std::int64_t()> clock_;
+  const std::int64_t uploadPause_;
 };
 
 /// Whether the store's record says what the row does, and has its content.

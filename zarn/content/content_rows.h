@@ -77,8 +77,10 @@ struct ContentRow {
   std::string tag;                 ///< of the record
   FileStamp stamp;                 ///< of the file when that was its content
 
-  /// Whether the store has a record of it.
+  /// Whether the store has a record of it, or did have.
   [[nodiscard]] bool isRecorded() const { return content.has_value() || !tag.empty(); }
+  /// Whether the store has a record of it, rather than its content only.
+  [[nodiscard]] bool hasRecord() const { return isRecorded() && !zone.zoneName().empty(); }
 };
 
 /// The zone of an account's record of a document whose content the store has; nothing for any other

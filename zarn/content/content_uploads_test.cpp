@@ -1,3 +1,5 @@
+#include <fcntl.h>
+
 #include <thread>
 
 #include "zarn/content/content_rows.h"
@@ -40,6 +42,20 @@ TEST_F(ContentUploadsTest, AnEditThatKeepsSizeAndDateIsUploadedToo) {
   ASSERT_EQ(utimensat(AT_FDCWD, at("a").c_str(), times, 0), 0);
   settle();
   EXPECT_EQ(contentInStore(id("a")), "other");
+}
+
+TEST_F(ContentUploadsTest, TheDateOfAccessIsThatOfWhoUsesTheFile) {
+  write("a", content(100'000));
+  const timespec longAgo{.tv_sec = 1'000'000, .tv_nsec = 0};
+  const timespec times[2] = {longAgo, longAgo};
+  ASSERT_EQ(utimensat(AT_FDCWD, at("a").c_str(), times, 0), 0);
+  settle();
+  EXPECT_EQ(contentInStore(id("a")), content(100'000));
+  EXPECT_EQ(status("a").st_atim.tv_sec, longAgo.tv_sec);
+  // Nor is it a use to compare it with the store.
+  setAttribute("a", "user.note", "text");
+  ASSERT_EQ(evict("a"), nullptr);
+  EXPECT_EQ(status("a").st_atim.tv_sec, longAgo.tv_sec);
 }
 
 TEST_F(ContentUploadsTest, ARenameChangesTheRecordAndMovesNoContent) {
@@ -272,6 +288,96 @@ TEST_F(ContentUploadsTest, PausesBetweenAttemptsGrowByTheClockThatIsGiven) {
   }
 }
 
+/// Changes an hour apart, with a pause of two, by a clock that only the test moves.
+class UploadPauseTest : public ContentUploadsTest {
+ protected:
+  static constexpr std::int64_t kHour = 3'600'000'000'000;
+
+  UploadPauseTest() {
+    engine->stop();
+    engine.reset();
+    options.clock = [this] { return now_.load(); };
+    engine = ContentEngine::create(
+        store, std::make_shared<Scanner>(store, std::weak_ptr<FolderVisitor>()), [&] {
+          auto patient = options;
+          patient.uploadPause = std::chrono::hours(2);
+          return patient;
+        }());
+    signIn("ann");
+    engine->start();
+  }
+  ~UploadPauseTest() override { engine->stop(); }
+
+  void change(const std::string& text) {
+    write("a", text);
+    // Seen as it is, and with the mark that it gets. Or else it would be read once more, to be
+    // sure, when its time has come.
+    const FileDescriptor file(::open(at("a").c_str(), O_RDONLY | O_CLOEXEC));
+    for (int look = 0; look < 2; ++look) {
+      ASSERT_TRUE(waitUntil([&] { return lookAtStamp(file.get()).isSettled; }));
+      scan();
+    }
+  }
+  void pass(std::int64_t time) {
+    now_ += time;
+    ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  }
+  [[nodiscard]] bool isUploaded() {
+    return waitUntil([&] { return state("a").upload == ContentState::Upload::Confirmed; });
+  }
+  [[nodiscard]] std::uint64_t finished() const { return engine->transfers().finished; }
+
+ private:
+  std::atomic<std::int64_t> now_ = 1'000'000 * kHour;
+};
+
+TEST_F(UploadPauseTest, WhatIsChangedAgainSoonIsUploadedOnce) {
+  change("one");
+  pass(kHour);
+  change("and two");
+  pass(kHour * 3 / 2);
+  EXPECT_EQ(engine->transfers().waiting, 1U);
+  EXPECT_EQ(finished(), 0U);
+  pass(kHour);
+  ASSERT_TRUE(isUploaded());
+  EXPECT_EQ(finished(), 1U);
+  EXPECT_EQ(contentInStore(id("a")), "and two");
+}
+
+TEST_F(UploadPauseTest, WhatGoesOnChangingIsUploadedNevertheless) {
+  std::string text;
+  for (int hour = 0; hour < 20; ++hour) {
+    change(text += '+');
+    EXPECT_EQ(finished(), 0U);
+    pass(kHour);
+  }
+  ASSERT_TRUE(isUploaded());
+  EXPECT_EQ(contentInStore(id("a")), text);
+}
+
+TEST_F(UploadPauseTest, WhatIsRemovedMeanwhileIsNeverUploaded) {
+  change("one");
+  const std::uint64_t item = id("a");
+  std::filesystem::remove(at("a"));
+  scan();
+  pass(3 * kHour);
+  EXPECT_EQ(engine->transfers().waiting, 0U);
+  EXPECT_EQ(finished(), 0U);
+  EXPECT_EQ(record(item, "ann"), nullptr);
+}
+
+TEST_F(UploadPauseTest, WhatIsChangedAfterAnUploadPausesAnew) {
+  change("one");
+  pass(3 * kHour);
+  ASSERT_TRUE(isUploaded());
+  change("and two");
+  pass(kHour);
+  EXPECT_EQ(finished(), 1U);
+  pass(kHour);
+  ASSERT_TRUE(isUploaded());
+  EXPECT_EQ(contentInStore(id("a")), "and two");
+}
+
 TEST_F(ContentUploadsTest, SignedOutJobsWaitAndNoOtherAccountSeesThem) {
   write("a", "of ann");
   settle();
@@ -331,6 +437,7 @@ TEST_F(ContentUploadsTest, DocumentsOfARebuiltDatabaseAreGivenJobs) {
   open();
   startEngine();
   scan();
+  stampAll();
   engine->sweep();
   ASSERT_TRUE(waitUntil([&] {
     return state("a").upload == ContentState::Upload::Confirmed &&
@@ -341,6 +448,50 @@ TEST_F(ContentUploadsTest, DocumentsOfARebuiltDatabaseAreGivenJobs) {
   EXPECT_EQ(read("b"), away);
   const NSErrorRef refusal = evict("b");
   EXPECT_EQ(refusal, nullptr) << refusal->description();
+}
+
+/// A tree that was there before the drive: the first scan finds it, and its files are marked later.
+class FirstUploadsTest : public ContentUploadsTest {
+ protected:
+  static constexpr std::uint64_t kDocuments = 5;
+
+  FirstUploadsTest() {
+    engine->stop();
+    engine.reset();
+    close();
+    for (const char* suffix : {"", "-wal", "-shm"}) {
+      std::filesystem::remove(layout.databasePath() + suffix);
+    }
+    for (std::uint64_t i = 0; i < kDocuments; ++i) write("document " + std::to_string(i), "text");
+    open();
+    startEngine();
+    scan();
+  }
+  [[nodiscard]] std::uint64_t finished() const { return engine->transfers().finished; }
+};
+
+TEST_F(FirstUploadsTest, ADocumentIsUploadedWhenItsFileIsMarked) {
+  engine->sweep();
+  std::uint32_t count = 0;
+  ASSERT_EQ(scanner->stampSome(3, count), nullptr);  // the root, the trash and a document
+  engine->didStamp();
+  ASSERT_TRUE(waitUntil([&] { return finished() > 0 && engine->transfers().waiting == 0; }));
+  EXPECT_EQ(finished(), 1U);
+  stampAll();
+  engine->didStamp();
+  ASSERT_TRUE(waitUntil([&] { return finished() == kDocuments; }));
+}
+
+TEST_F(FirstUploadsTest, ItsMarkIsNoChangeThatIsUploadedAgain) {
+  stampAll();
+  engine->sweep();
+  ASSERT_TRUE(
+      waitUntil([&] { return finished() >= kDocuments && engine->transfers().waiting == 0; }));
+  for (std::uint64_t i = 0; i < kDocuments; ++i) {
+    ASSERT_TRUE(scanner->scanLocation(at("document " + std::to_string(i))));
+  }
+  EXPECT_EQ(engine->transfers().waiting, 0U);
+  EXPECT_EQ(finished(), kDocuments);
 }
 
 }  // namespace

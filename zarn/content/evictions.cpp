@@ -4,16 +4,16 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <chrono>
 #include <functional>
 #include <memory>
-#include <thread>
 #include <utility>
 #include <vector>
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
+#include "platform/foundation/unnoticed_reads.h"
 #include "platform/ostrell/constants.h"
+#include "zarn/change_times.h"
 #include "zarn/content/content_core.h"
 #include "zarn/row_queries.h"
 #include "zarn/write_transaction.h"
@@ -87,7 +87,7 @@ FileStamp settledStamp(int file) {
   while (true) {
     const StampedLook look = lookAtStamp(file);
     if (look.isSettled) return look.stamp;
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));  // less than a tick
+    waitForTick();
   }
 }
 
@@ -115,6 +115,7 @@ NSErrorRef lookAt(const ContentCore& core, Departure& departure) {
   struct stat status{};
   if (!file || fstat(file.get(), &status) != 0) return NSError::errorWithErrno(errno, path);
   if (!S_ISREG(status.st_mode)) return refusal("only documents can be given up");
+  readUnnoticed(file.get());
   departure.before = settledStamp(file.get());
   if (status.st_nlink > 1) return refusal("it has several names (hard links)");
   const FaultExamination found = examineFault(file.get());

@@ -10,7 +10,8 @@
 namespace yomber {
 namespace {
 
-/// What nobody but the store has stays known of it.
+/// What nobody but the store has stays known of it. So does the record, under the id that it has:
+/// whoever sees that item go has it removed.
 void storeRenewed(Connection& connection, const ItemRow& before, std::uint64_t id) {
   auto content = findContent(connection, before.id);
   if (!content) return;
@@ -20,7 +21,6 @@ void storeRenewed(Connection& connection, const ItemRow& before, std::uint64_t i
   const bool isHere = (before.flags & row_flag::kDownloaded) != 0;
   if (isHere || before.isFolder()) content->content.reset();
   storeContent(connection, *content);
-  removeContent(connection, before.id);
 }
 
 /// The new id; nothing when there is no such item.

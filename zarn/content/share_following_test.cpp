@@ -17,6 +17,9 @@ class ShareFollowingTest : public TwoDrives {
     for (const char* suffix : {"", "-wal", "-shm"})
       std::filesystem::remove(layout.databasePath() + suffix);
     bob = std::make_unique<SharingDrive>(layout.home(), records, "bob");
+    for (std::uint32_t count = 1; count != 0;)
+      ASSERT_EQ(bob->scanner->stampSome(100, count), nullptr);
+    bob->engine->didStamp();
   }
 };
 

@@ -184,7 +184,7 @@ NSErrorRef SharePull::applyPage(Items items, const RZChangeToken* token) {
 // --- New ones.
 
 bool SharePull::isNew(const SharedItem& item) const {
-  if (!item.record || item.row) return false;
+  if (!item.record || item.row || waiting_.contains(item.id)) return false;
   // It went from here, and nobody has changed it since: the store is about to be told.
   const bool isPending = item.isBeingRemoved && !item.isRefused && item.content &&
                          item.content->zone == share_.zone &&
@@ -373,10 +373,9 @@ void SharePull::applyKnown(SharedItem& item) {
 /// What others had removed went to the owner's trash, and with it to a zone of his own.
 NSErrorRef SharePull::removeRecordElsewhere(SharedItem& item) const {
   std::vector<NSErrorRef> refused;
-  const bool isRecorded =
-      item.content && item.content->isRecorded() && !item.content->zone.zoneName().empty();
+  const bool hasRecord = item.content && item.content->hasRecord();
   NSErrorRef error =
-      isRecorded ? store_->remove({{item.id, item.content->zone, {}}}, refused) : nullptr;
+      hasRecord ? store_->remove({{item.id, item.content->zone, {}}}, refused) : nullptr;
   if (!error && !refused.empty()) error = refused.front();
   if (!error) item.content.reset();
   return error;

@@ -101,18 +101,22 @@ bool SharePull::hasIDOfAnother(const SharedItem& item) const {
 /// another id.
 void SharePull::makeRoom(Items& items, Age age) {
   for (SharedItem& item : items) {
-    if (!hasIDOfAnother(item)) continue;
-    // It may have been on its way out when the page was made.
-    NSErrorRef error =
-        age == Age::OfPage ? NSError::errorWithErrno(EAGAIN) : removeRecordElsewhere(item);
-    if (!error) error = giveNewIdentity(core_, item.id);
-    if (error) {
-      wait(item, error);
-      continue;
+    if (hasIDOfAnother(item)) {
+      // It may have been on its way out when the page was made.
+      const NSErrorRef error =
+          age == Age::OfPage ? NSError::errorWithErrno(EAGAIN) : giveNewIdentity(core_, item.id);
+      if (error) {
+        wait(item, error);
+        continue;
+      }
+      item.row.reset();
+      item.path.clear();
+      item.isBeingRemoved = true;
     }
-    item.row.reset();
-    item.content.reset();
-    item.path.clear();
+    const bool isElsewhere = item.record && !item.row && item.content &&
+                             item.content->hasRecord() && item.content->zone != share_.zone;
+    // Whoever is to remove that record goes by what is known of it.
+    if (isElsewhere && item.isBeingRemoved) wait(item, NSError::errorWithErrno(EAGAIN));
   }
 }
 

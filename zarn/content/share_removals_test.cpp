@@ -236,6 +236,37 @@ TEST_F(ShareRemovalsTest, WhatIsPutBackComesAlsoToWhoHasMadeItHisOwn) {
   EXPECT_EQ(ann->names("Plans"), (Names{"Old", "a.txt"}));
 }
 
+TEST_F(ShareRemovalsTest, WhatIsPutBackWhileItIsSavedElsewhereIsRecordedOnceByEach) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  const std::uint64_t id = ann->id("Plans/a.txt");
+  bob->rename("Plans/a.txt", "mine.txt");
+  bob->settle();
+  const std::string away = ann->layout.home() + "/away";
+  ASSERT_EQ(::rename(ann->at("Plans/a.txt").c_str(), away.c_str()), 0);
+  ann->settle();
+  followBoth();
+  ASSERT_EQ(::rename(away.c_str(), ann->at("Plans/a.txt").c_str()), 0);
+  ann->settle();
+  {
+    const Pause saving = pauseAt("zarn.upload.read");
+    bob->write("mine.txt", "Bob's own");
+    EXPECT_EQ(bob->scanner->scanAll(), nullptr);
+    ASSERT_TRUE(saving.waitUntilReached());
+    EXPECT_EQ(bob->shares().refresh(std::string(NSFileProviderRootContainerItemIdentifier)),
+              nullptr);
+    EXPECT_NE(bob->id("mine.txt"), id);
+    EXPECT_FALSE(bob->exists("Plans/a.txt"));
+  }
+  followBoth();
+  EXPECT_EQ(bob->id("Plans/a.txt"), id);
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->read("mine.txt"), "Bob's own");
+  EXPECT_EQ(zonesWith("bob", id), Names{});
+  EXPECT_EQ(zonesWith("bob", bob->id("mine.txt")), Names{QSUbiquitousDefaultContainerID});
+  EXPECT_EQ(zonesWith("ann", id), Names{share->recordID().zoneID().zoneName()});
+}
+
 TEST_F(ShareRemovalsTest, AFolderThatMovesHidesNothingThatIsRemovedElsewhere) {
   shareFolder(editor("bob"));
   ann->write("Plans/new.txt", kLong);

@@ -296,6 +296,8 @@ NSErrorRef Shares::accept(const std::string& url, std::string& identifier) {
       store.engine()->acceptShare(database.containerIdentifier, store.account(), url, share));
   if (rz_isError(error, RZErrorPermissionFailure))
     log_default(defaultLog(), "[NOTICE] refused a share's URL to %@", store.account());
+  if (rz_isError(error, RZErrorUnknownItem))
+    log_default(defaultLog(), "[NOTICE] refused a URL of no share to %@", store.account());
   if (!error && shareAccepted.hit()) error = NSError::errorWithErrno(EIO);
   if (error) return error;
   const auto root = itemOfRecord(share->rootRecordID().recordName());

@@ -77,6 +77,7 @@ class ContentDrive : public TestDrive {
     options.longestPause = std::chrono::milliseconds(20);
     options.offlinePause = std::chrono::milliseconds(5);
     options.settlePause = std::chrono::milliseconds(1);
+    options.uploadPause = std::chrono::milliseconds::zero();
     engine = ContentEngine::create(
         store, std::make_shared<Scanner>(store, std::weak_ptr<FolderVisitor>()), options);
     if (!account.empty()) signIn(account);

@@ -61,6 +61,7 @@ class SharingDrive {
     options.longestPause = std::chrono::milliseconds(20);
     options.offlinePause = std::chrono::milliseconds(5);
     options.settlePause = std::chrono::milliseconds(1);
+    options.uploadPause = std::chrono::milliseconds::zero();
     options.sharesPause = std::chrono::hours(1);
     engine = ContentEngine::create(store, scanner, options);
     engine->setStore(std::make_shared<ContentStore>(records_, account), account);

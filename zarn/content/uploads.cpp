@@ -11,6 +11,7 @@
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
+#include "platform/foundation/unnoticed_reads.h"
 #include "zarn/content/content_core.h"
 #include "zarn/content/thumbnail_maker.h"
 #include "zarn/content/thumbnail_rows.h"
@@ -36,11 +37,6 @@ constexpr std::size_t kFewFiles = 4;
 bool isContentGone(const NSErrorRef& error) {
   return rz_isError(error->underlyingError(), RZErrorAssetMissing) ||
          rz_isError(error->underlyingError(), RZErrorAssetDamaged);
-}
-
-/// Whether the store has a record of it, rather than its content only.
-bool hasRecord(const std::optional<ContentRow>& content) {
-  return content && content->isRecorded() && !content->zone.zoneName().empty();
 }
 
 /// One document on its way.
@@ -89,7 +85,8 @@ class UploadGroup {
     upload.confirmed.account = subject.job.account;
     if (subject.content) upload.confirmed = *subject.content;
     if (!subject.row) {
-      upload.kind = hasRecord(subject.content) ? Upload::Kind::Remove : Upload::Kind::Nothing;
+      const bool hasRecord = subject.content && subject.content->hasRecord();
+      upload.kind = hasRecord ? Upload::Kind::Remove : Upload::Kind::Nothing;
       return;
     }
     if (subject.row->isFolder()) return prepareFolder(upload);
@@ -125,7 +122,7 @@ class UploadGroup {
   static bool isInStore(Upload& upload) {
     const auto& before = upload.subject.content;
     ContentRow& after = upload.confirmed;
-    const bool isElsewhere = hasRecord(before) && before->zone != upload.subject.zone;
+    const bool isElsewhere = before && before->hasRecord() && before->zone != upload.subject.zone;
     if (isElsewhere) upload.previousZone = before->zone;
     after.zone = upload.subject.zone;
     after.parent = upload.subject.row->parent;
@@ -140,6 +137,7 @@ class UploadGroup {
     FileDescriptor file(
         open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
     if (!file) return look(upload, errno);
+    readUnnoticed(file.get());
     if (uploadRead.hit()) return NSError::errorWithErrno(EIO, path);
     const FaultExamination found = examineFault(file.get());
     switch (found.condition) {
@@ -410,7 +408,7 @@ class UploadGroup {
       }
       return core_.postpone(connection, job, upload.error);
     }
-    core_.finished.fetch_add(1);
+    if (upload.kind != Upload::Kind::Nothing) core_.finished.fetch_add(1);
     removeJob(connection, job);
     removeSavings(connection, job.item);
     if (!upload.owner.empty())

@@ -25,6 +25,8 @@ namespace {
 constexpr std::string_view kOwnPrefix = "user.yomber.";
 /// Permissions are checked by the kernel, which does not ask for these.
 constexpr std::string_view kAccessListPrefix = "system.posix_acl_";
+/// Programs that list files ask for it of each, until one answer is that there are none here.
+constexpr std::string_view kLabel = "security.selinux";
 
 bool isOwn(std::string_view name) { return name.starts_with(kOwnPrefix); }
 bool isAccessList(std::string_view name) { return name.starts_with(kAccessListPrefix); }
@@ -183,6 +185,7 @@ void FileSystem::getxattr(fuse_req_t request, Node& node, const char* name, std:
   if (failure == 0) {
     length = ::getxattr(pathOfDescriptor(descriptor.number).c_str(), name, value.data(), size);
     if (length < 0) failure = errno;
+    if (failure == ENODATA && name == kLabel) failure = EOPNOTSUPP;
   }
   if (failure != 0) {
     (void)fuse_reply_err(request, failure);

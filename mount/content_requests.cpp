@@ -14,6 +14,7 @@
 #include "platform/ipc/error_codec.h"
 #include "platform/ipc/event_loop.h"
 #include "platform/ipc/patience.h"
+#include "platform/ostrell/errors.h"
 
 namespace yomber {
 namespace {
@@ -45,13 +46,28 @@ ipc::Patience::Question questionFor(const ipc::Remote<Control>& control) {
 /// Whether it is one of the drive's own processes that cannot be reached, which are started again,
 /// rather than the store.
 bool isForTheMoment(const NSErrorRef& error) {
-  if (!error || !error->is(NSFileProviderErrorDomain, NSFileProviderErrorServerUnreachable)) {
-    return false;
-  }
+  if (!error) return false;
+  // Of the extension, which has lost zarn or does not find it.
+  if (error->is(QSOstrellErrorDomain, QSOstrellErrorConnectionLost)) return true;
+  if (error->is(NSPOSIXErrorDomain, ECONNREFUSED)) return true;
+  if (!error->is(NSFileProviderErrorDomain, NSFileProviderErrorServerUnreachable)) return false;
   for (NSErrorRef cause = error; cause; cause = cause->underlyingError()) {
     if (cause->is(NSCocoaErrorDomain, NSUbiquitousFileUnavailableError)) return false;
   }
   return true;
+}
+
+/// `cause` was tried to be got over for long enough.
+NSErrorRef unanswered(const NSErrorRef& cause) {
+  NSErrorUserInfo info{{NSLocalizedDescriptionKey, std::string("the content does not come")}};
+  if (cause) info.emplace(NSUnderlyingErrorKey, cause);
+  return NSError::errorWithDomain(NSPOSIXErrorDomain, EIO, std::move(info));
+}
+
+/// A number that is none would be taken for success, or refused by the kernel.
+int errnoOfSystem(std::int64_t code) {
+  constexpr std::int64_t kLast = 511;  // that the kernel hands on
+  return code > 0 && code <= kLast ? static_cast<int>(code) : EIO;
 }
 
 int errnoOfProvider(std::int64_t code) {
@@ -90,7 +106,7 @@ int errnoOfCocoa(std::int64_t code) {
 
 int errnoOf(const NSErrorRef& error) {
   if (!error) return 0;
-  if (error->domain() == NSPOSIXErrorDomain) return static_cast<int>(error->code());
+  if (error->domain() == NSPOSIXErrorDomain) return errnoOfSystem(error->code());
   if (error->domain() == NSFileProviderErrorDomain) return errnoOfProvider(error->code());
   return error->domain() == NSCocoaErrorDomain ? errnoOfCocoa(error->code()) : EIO;
 }
@@ -104,7 +120,10 @@ class ContentRequests::Providing final : public std::enable_shared_from_this<Pro
         completion_(std::move(completion)) {}
 
   void begin() {
-    ThreadPool::shared().async([self = shared_from_this()] { self->attempt(); });
+    watched_ = requests_->watch_->watch(path_, [weak = weak_from_this()] {
+      if (const auto self = weak.lock()) self->giveUp(unanswered(nullptr));
+    });
+    attempt();
   }
 
   void cancel() { giveUp(cancellation()); }
@@ -121,12 +140,17 @@ class ContentRequests::Providing final : public std::enable_shared_from_this<Pro
   }
 
  private:
-  /// May wait for the connection.
   void attempt() {
-    NSErrorRef error;
+    if (isOver()) return;
     began_ = Clock::now();
-    const auto control = requests_->control(&error);
-    if (!control) return failed(error);
+    requests_->withControl(
+        [self = shared_from_this()](const ipc::Remote<Control>& control, const NSErrorRef& error) {
+          if (!control) return self->failed(error);
+          self->ask(control);
+        });
+  }
+
+  void ask(const ipc::Remote<Control>& control) {
     const auto self = shared_from_this();
     const auto patience = std::make_shared<ipc::Patience>(
         kStuck, questionFor(control), [self](const NSErrorRef& stuck) { self->giveUp(stuck); });
@@ -138,7 +162,9 @@ class ContentRequests::Providing final : public std::enable_shared_from_this<Pro
           patience->end();
           NSErrorRef failure = transport;
           if (results != nullptr) failure = ipc::decodeOptional(results->getFailure());
-          self->answered(transport, failure);
+          const bool isToTryAgain = transport || isForTheMoment(failure);
+          if (!isToTryAgain) return self->finish(failure);
+          self->failed(failure);
         },
         kAsLongAsItTakes);
     LockGuard guard(mutex_);
@@ -146,28 +172,24 @@ class ContentRequests::Providing final : public std::enable_shared_from_this<Pro
     if (isCancelled_) call_.cancel();
   }
 
-  /// On the loop thread: what comes next may block.
-  void answered(const NSErrorRef& transport, const NSErrorRef& failure) {
-    ThreadPool::shared().async([self = shared_from_this(), transport, failure] {
-      if (transport || isForTheMoment(failure)) {
-        self->failed(transport ? transport : failure);
-      } else {
-        self->finish(failure);
-      }
-    });
+  [[nodiscard]] bool isOver() {
+    LockGuard guard(mutex_);
+    return isCancelled_ || !completion_;
   }
 
+  /// Tries again in a moment, and keeps no thread for that: many may be waiting.
   void failed(const NSErrorRef& error) {
-    {
-      LockGuard guard(mutex_);
-      if (isCancelled_ || !completion_) return;
-    }
+    if (isOver()) return;
     const auto now = Clock::now();
     if (now - began_ > kWorkedOn || !giveUpAt_) giveUpAt_ = now + kPatience;
-    if (now > *giveUpAt_) return finish(error);
+    if (now > *giveUpAt_) return finish(unanswered(error));
     requests_->dropConnection();
-    std::this_thread::sleep_for(kBetweenAttempts);
-    attempt();
+    ipc::EventLoop::shared().post([self = shared_from_this()] {
+      ipc::EventLoop& loop = ipc::EventLoop::shared();
+      loop.detach(loop.timer().afterDelay(kBetweenAttempts.count() * kj::MILLISECONDS).then([self] {
+        self->attempt();
+      }));
+    });
   }
 
   void finish(const NSErrorRef& error) {
@@ -182,18 +204,21 @@ class ContentRequests::Providing final : public std::enable_shared_from_this<Pro
 
   const std::shared_ptr<ContentRequests> requests_;
   const std::string path_;
+  std::shared_ptr<DownloadWatch::Watched> watched_;  ///< set once
   Mutex mutex_;
   Completion completion_ GUARDED_BY(mutex_);
   ipc::CallHandle call_ GUARDED_BY(mutex_);
   bool isCancelled_ GUARDED_BY(mutex_) = false;
 
-  // Of the thread that attempts; there is one at a time.
+  // Of the attempt; there is one at a time.
   Clock::time_point began_;
   std::optional<Clock::time_point> giveUpAt_;
 };
 
-std::shared_ptr<ContentRequests> ContentRequests::create(std::string controlSocket) {
-  return std::shared_ptr<ContentRequests>(new ContentRequests(std::move(controlSocket)));
+std::shared_ptr<ContentRequests> ContentRequests::create(std::string controlSocket,
+                                                         std::shared_ptr<DownloadWatch> watch) {
+  return std::shared_ptr<ContentRequests>(
+      new ContentRequests(std::move(controlSocket), std::move(watch)));
 }
 
 std::shared_ptr<ContentRequests::Request> ContentRequests::provide(const std::string& path,
@@ -241,9 +266,7 @@ NSErrorRef ContentRequests::movingItem(const std::string& path, const std::strin
 }
 
 void ContentRequests::itemChanged(const std::string& path) {
-  ThreadPool::shared().async([self = shared_from_this(), path] {
-    NSErrorRef error;
-    const auto remote = self->control(&error);
+  withControl([path](const ipc::Remote<Control>& remote, const NSErrorRef&) {
     // Whoever is not told now sees it on the disk.
     if (!remote) return;
     (void)ipc::call(
@@ -282,6 +305,39 @@ ipc::Remote<Control> ContentRequests::control(NSErrorRef* error) {
     }
   }
   return connection->bootstrap<Control>();
+}
+
+void ContentRequests::withControl(const ControlHandler& handler) {
+  ipc::Connection::Ref connection;
+  {
+    LockGuard guard(mutex_);
+    if (connection_ && connection_->isConnected()) {
+      connection = connection_;
+    } else {
+      waiting_.push_back(handler);
+      if (waiting_.size() > 1) return;
+    }
+  }
+  if (connection) return handler(connection->bootstrap<Control>(), nullptr);
+  ipc::Connection::connectAsync(
+      controlSocket_,
+      [self = shared_from_this()](const ipc::Connection::Ref& made, const NSErrorRef& error) {
+        self->didConnect(made, error);
+      });
+}
+
+void ContentRequests::didConnect(const ipc::Connection::Ref& connection, const NSErrorRef& error) {
+  std::vector<ControlHandler> waiting;
+  ipc::Connection::Ref used;
+  {
+    LockGuard guard(mutex_);
+    // Another thread may have been faster, and others use what it made.
+    if (connection_ == nullptr || !connection_->isConnected()) connection_ = connection;
+    used = connection_;
+    std::swap(waiting, waiting_);
+  }
+  const auto control = used ? used->bootstrap<Control>() : ipc::Remote<Control>(nullptr);
+  for (const auto& handler : waiting) handler(control, error);
 }
 
 void ContentRequests::dropConnection() {

@@ -8,6 +8,7 @@
 #include "mount/kernel_session.h"
 #include "platform/foundation/log.h"
 #include "platform/foundation/thread_pool.h"
+#include "platform/ipc/event_loop.h"
 
 namespace yomber {
 
@@ -20,6 +21,13 @@ ContentWaits::~ContentWaits() {
 }
 
 void ContentWaits::wait(fuse_req_t request, NodeUse node, const std::string& path, Then then) {
+  const auto ask = [&](ContentRequests::Completion completion) {
+    return requests_->provide(path, std::move(completion));
+  };
+  wait(request, std::move(node), Ask(ask), std::move(then));
+}
+
+void ContentWaits::wait(fuse_req_t request, NodeUse node, const Ask& ask, Then then) {
   std::uint64_t number = 0;
   {
     LockGuard guard(mutex_);
@@ -27,11 +35,12 @@ void ContentWaits::wait(fuse_req_t request, NodeUse node, const std::string& pat
     const Node* const key = node.get();
     File& file = files_[key];
     file.waiters.push_back({number, std::move(then)});
+    file.lastWaiter = number;
     if (!file.request) {
       file.node = std::move(node);
       file.round = number;
-      file.request = requests_->provide(
-          path, [this, key, number](const NSErrorRef& error) { answer(key, number, error); });
+      file.request =
+          ask([this, key, number](const NSErrorRef& error) { answer(key, number, error); });
     }
     // What the library keeps for us is as large as a pointer. Under the lock: once that is released
     // the request may be answered.
@@ -50,24 +59,41 @@ void ContentWaits::interrupted(fuse_req_t request, void* number) {
 
 void ContentWaits::interrupt(std::uint64_t number) {
   Then then;
-  File ended;  // what it holds is let go of without the lock
   {
     LockGuard guard(mutex_);
-    for (auto file = files_.begin(); file != files_.end(); ++file) {
-      auto& waiters = file->second.waiters;
+    for (auto& [node, file] : files_) {
+      auto& waiters = file.waiters;
       const auto found = std::find_if(waiters.begin(), waiters.end(),
                                       [&](const Waiter& w) { return w.number == number; });
       if (found == waiters.end()) continue;
       then = std::move(found->then);
       waiters.erase(found);
-      if (waiters.empty()) {
-        ended = std::move(file->second);
-        files_.erase(file);
-      }
+      if (waiters.empty()) dropSoon(node, file.lastWaiter);
       break;
     }
   }
   if (then) then(EINTR);
+}
+
+/// Unless somebody else comes.
+void ContentWaits::dropSoon(const Node* node, std::uint64_t lastWaiter) {
+  ipc::EventLoop::shared().post([this, node, lastWaiter] {
+    ipc::EventLoop& loop = ipc::EventLoop::shared();
+    loop.detach(
+        loop.timer().afterDelay(kComingBack.count() * kj::SECONDS).then([this, node, lastWaiter] {
+          ThreadPool::shared().async([this, node, lastWaiter] { drop(node, lastWaiter); });
+        }));
+  });
+}
+
+void ContentWaits::drop(const Node* node, std::uint64_t lastWaiter) {
+  File ended;  // what it holds is let go of without the lock
+  LockGuard guard(mutex_);
+  const auto found = files_.find(node);
+  if (found == files_.end() || found->second.lastWaiter != lastWaiter) return;
+  if (!found->second.waiters.empty()) return;
+  ended = std::move(found->second);
+  files_.erase(found);
 }
 
 void ContentWaits::answer(const Node* node, std::uint64_t round, const NSErrorRef& error) {

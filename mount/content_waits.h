@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -14,8 +15,9 @@
 
 namespace yomber {
 
-/// Requests that wait for content. Those of one file wait together; when the last of them has been
-/// interrupted, the content is not asked for any more.
+/// Requests that wait for content. Those of one file wait together. Any signal interrupts them, and
+/// who was interrupted by one that means nothing asks again: so content goes on being asked for a
+/// little longer than somebody waits for it.
 ///
 /// Thread-safety: every operation may be called on any thread.
 class ContentWaits {
@@ -29,8 +31,13 @@ class ContentWaits {
   /// Called once, on a thread of the pool, with 0 or an errno: EINTR when whoever waits was
   /// interrupted.
   using Then = std::function<void(int failure)>;
+  /// For how long content is still asked for after the last who waited was interrupted.
+  static constexpr std::chrono::seconds kComingBack{5};
   /// Asks for the content of `node`, which is at the location `path` of the drive.
   void wait(fuse_req_t request, NodeUse node, const std::string& path, Then then);
+  /// Asks `ask` for it, where nobody else has asked for that of the node.
+  using Ask = std::function<std::shared_ptr<ContentRequests::Request>(ContentRequests::Completion)>;
+  void wait(fuse_req_t request, NodeUse node, const Ask& ask, Then then);
 
  private:
   struct Waiter {
@@ -39,13 +46,16 @@ class ContentWaits {
   };
   struct File {
     NodeUse node;
-    std::uint64_t round = 0;  ///< tells one asking from the next
+    std::uint64_t round = 0;       ///< tells one asking from the next
+    std::uint64_t lastWaiter = 0;  ///< the number of the one who came last
     std::shared_ptr<ContentRequests::Request> request;
     std::vector<Waiter> waiters;
   };
 
   static void interrupted(fuse_req_t request, void* number);
   void interrupt(std::uint64_t number);
+  void dropSoon(const Node* node, std::uint64_t lastWaiter);
+  void drop(const Node* node, std::uint64_t lastWaiter);
   void answer(const Node* node, std::uint64_t round, const NSErrorRef& error);
 
   const std::shared_ptr<ContentRequests> requests_;

@@ -11,7 +11,7 @@
 #include <utility>
 
 #include "mount/file_system.h"
-
+#include "mount/removed_content.h"
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
 
@@ -41,6 +41,12 @@ void takeSetIDAway(fuse_req_t request, int file) {
   if (taken != 0) (void)fchmod(file, status.st_mode & ALLPERMS & ~taken);
 }
 
+std::uint64_t blockBytesOf(int descriptor) {
+  struct stat status{};
+  if (fstat(descriptor, &status) != 0) return 0;
+  return static_cast<std::uint64_t>(status.st_blocks) * kBlockBytes;
+}
+
 /// How one write is to be done: the kernel tells with each.
 int writeFlags(const fuse_file_info* info) {
   // Where the end is, only the disk knows: others may have written there.
@@ -63,15 +69,15 @@ void answerWrite(fuse_req_t request, OpenFile& file, const char* bytes, std::siz
 }
 
 /// EAGAIN when the content has to come first, or is coming. `mayWait`: rather than disturb whoever
-/// is filling it.
-int truncateNow(fuse_req_t request, int place, off_t size, bool mayWait) {
-  const bool isBeingChanged = readAttribute(place, kHeldDateAttribute, nullptr, 0) >= 0;
-  if (isFault(place) && (size != 0 || (mayWait && isBeingChanged))) return EAGAIN;
+/// is filling it. EINPROGRESS when it has to be settled first, and that is not to be waited for.
+int truncateNow(fuse_req_t request, int place, off_t size, bool mayWait, bool mayWaitForDisk) {
+  if (isFault(place) && (size != 0 || (mayWait && isBeingChanged(place)))) return EAGAIN;
   const FileDescriptor file(
       ::open(pathOfDescriptor(place).c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
   if (!file) return errno;  // EAGAIN: leased
   const bool isHere = !isFault(file.get());
   if (!isHere && size != 0) return EAGAIN;
+  if (isHere && !mayWaitForDisk && isToBeSettled(file.get())) return EINPROGRESS;
   takeSetIDAway(request, file.get());
   int failure = isHere ? settleForWriting(file.get()) : 0;
   if (failure == 0 && ftruncate(file.get(), size) != 0) failure = errno;
@@ -84,18 +90,46 @@ int truncateNow(fuse_req_t request, int place, off_t size, bool mayWait) {
 
 void FileSystem::withContent(fuse_req_t request, const std::shared_ptr<OpenFile>& file,
                              std::function<void(int failure)> then, int attempts) {
-  const int failure = file->openContent();
+  const int failure = file->openContent(false);
+  if (failure != EINPROGRESS) {
+    return contentOpened(request, file, failure, std::move(then), attempts);
+  }
+  waitForDisk([this, request, file, then = std::move(then), attempts] {
+    contentOpened(request, file, file->openContent(true), then, attempts);
+  });
+}
+
+void FileSystem::contentOpened(fuse_req_t request, const std::shared_ptr<OpenFile>& file,
+                               int failure, std::function<void(int failure)> then, int attempts) {
   if (failure != EAGAIN) return then(failure);
-  const auto path = locationOf(file->node());
-  if (!path || attempts == 0) return then(path ? EIO : ENOENT);
-  waits_.wait(request, nodes_.use(file->node()), *path,
-              [this, request, file, then = std::move(then), attempts](int waited) {
-                // Busy: somebody has it open for writing at this moment.
-                if (waited != 0 && (waited != EBUSY || attempts == 0)) return then(waited);
-                if (space_ != nullptr) space_->noteGrowth();
-                if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
-                withContent(request, file, then, attempts - 1);
-              });
+  if (attempts == 0) return then(EIO);
+  const bool wasRemoved = isRemoved(file->any());
+  waitForContent(request, file->node(), file->any(),
+                 [this, request, file, then = std::move(then), attempts, wasRemoved](int waited) {
+                   // Meanwhile the drive has lost sight of it.
+                   const bool isGone = !wasRemoved && waited != EINTR && isRemoved(file->any());
+                   // Busy: somebody has it open for writing at this moment.
+                   if (waited != 0 && waited != EBUSY && !isGone) return then(waited);
+                   if (space_ != nullptr) space_->noteGrowth(blockBytesOf(file->any()));
+                   if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
+                   withContent(request, file, then, attempts - 1);
+                 });
+}
+
+void FileSystem::waitForContent(fuse_req_t request, Node& node, int place,
+                                ContentWaits::Then then) {
+  if (isRemoved(place)) {
+    const auto kept = std::make_shared<const FileDescriptor>(fcntl(place, F_DUPFD_CLOEXEC, 0));
+    return waits_.wait(
+        request, nodes_.use(node),
+        [kept](ContentRequests::Completion completion) {
+          return provideRemoved(kept, std::move(completion));
+        },
+        std::move(then));
+  }
+  const auto path = locationOf(node);
+  if (!path) return then(ENOENT);
+  waits_.wait(request, nodes_.use(node), *path, std::move(then));
 }
 
 void FileSystem::read(fuse_req_t request, Node& /*node*/, std::size_t size, off_t offset,
@@ -121,14 +155,23 @@ void FileSystem::write(fuse_req_t request, Node& node, const char* bytes, std::s
   OpenFile& file = fileOf(info);
   nodes_.noteTold(node, 0);
   const int flags = writeFlags(info);
-  if (file.content() >= 0) return answerWrite(request, file, bytes, size, offset, flags);
+  const bool waitsForDisk = (flags & (RWF_DSYNC | RWF_SYNC)) != 0;
+  if (file.content() >= 0 && !waitsForDisk) {
+    return answerWrite(request, file, bytes, size, offset, flags);
+  }
   const auto shared = openFiles_.shared(file);
-  auto kept = std::make_shared<std::string>(bytes, size);
-  withContent(request, shared, [request, shared, kept, offset, flags](int failure) {
-    if (failure == 0) {
-      return answerWrite(request, *shared, kept->data(), kept->size(), offset, flags);
+  const auto writeNow = [request, shared, kept = std::make_shared<std::string>(bytes, size), offset,
+                         flags] {
+    answerWrite(request, *shared, kept->data(), kept->size(), offset, flags);
+  };
+  withContent(request, shared, [this, request, writeNow, waitsForDisk](int failure) {
+    if (failure != 0) {
+      (void)fuse_reply_err(request, failure);
+    } else if (waitsForDisk) {
+      waitForDisk(writeNow);
+    } else {
+      writeNow();
     }
-    (void)fuse_reply_err(request, failure);
   });
 }
 
@@ -138,15 +181,17 @@ void FileSystem::fsync(fuse_req_t request, Node& node, int isDataOnly, fuse_file
   if (file->content() < 0) {
     if (auto other = openFiles_.of(node)) file = std::move(other);
   }
-  FileDescriptor opened;
-  if (file->content() < 0) {
-    const std::string path = pathOfDescriptor(file->any());
-    opened = FileDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
-  }
-  const int descriptor = opened ? opened.get() : file->content();
-  int result = 0;  // who is filling it, or gives it up, syncs it himself
-  if (descriptor >= 0) result = isDataOnly != 0 ? fdatasync(descriptor) : ::fsync(descriptor);
-  (void)fuse_reply_err(request, result == 0 ? 0 : errno);
+  waitForDisk([request, file, isDataOnly] {
+    FileDescriptor opened;
+    if (file->content() < 0 && !isBeingChanged(file->any())) {
+      const std::string path = pathOfDescriptor(file->any());
+      opened = FileDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+    }
+    const int descriptor = opened ? opened.get() : file->content();
+    int result = 0;  // who is filling it, or gives it up, syncs it himself
+    if (descriptor >= 0) result = isDataOnly != 0 ? fdatasync(descriptor) : ::fsync(descriptor);
+    (void)fuse_reply_err(request, result == 0 ? 0 : errno);
+  });
 }
 
 void FileSystem::fallocate(fuse_req_t request, Node& node, int mode, off_t offset, off_t length,
@@ -209,7 +254,8 @@ void FileSystem::copyFileRange(fuse_req_t request, Node& /*source*/, off_t sourc
 }
 
 void FileSystem::truncate(fuse_req_t request, Node& node, off_t size, fuse_file_info* info,
-                          std::function<void(int failure)> then, int attempts) {
+                          std::function<void(int failure)> then, int attempts,
+                          bool mayWaitForDisk) {
   const int held = info != nullptr ? fileOf(info).content() : -1;
   if (held >= 0) {
     takeSetIDAway(request, held);
@@ -217,20 +263,26 @@ void FileSystem::truncate(fuse_req_t request, Node& node, off_t size, fuse_file_
   }
   Descriptor place;
   int failure = descriptorOf(node, place);
-  if (failure == 0) failure = truncateNow(request, place.number, size, attempts == kAttempts);
-  if (failure != EAGAIN) return then(failure);
-  const auto wanted = locationOf(node);
-  if (!wanted || attempts == 0) return then(wanted ? EBUSY : ENOENT);
+  if (failure == 0) {
+    failure = truncateNow(request, place.number, size, attempts == kAttempts, mayWaitForDisk);
+  }
   auto use = std::make_shared<NodeUse>(nodes_.use(node));
-  waits_.wait(request, nodes_.use(node), *wanted,
-              [this, request, use, size, then = std::move(then), attempts](int waited) {
-                // Busy: somebody has it open for writing at this moment. Where nothing stays,
-                // nobody needs what could not be had.
-                const bool goesOn = waited == EBUSY || (size == 0 && waited != EINTR);
-                if (waited != 0 && !goesOn) return then(waited);
-                if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
-                truncate(request, *use->get(), size, nullptr, then, attempts - 1);
-              });
+  if (failure == EINPROGRESS) {
+    return waitForDisk([this, request, use, size, then = std::move(then), attempts] {
+      truncate(request, *use->get(), size, nullptr, then, attempts, true);
+    });
+  }
+  if (failure != EAGAIN) return then(failure);
+  if (attempts == 0) return then(EBUSY);
+  waitForContent(request, node, place.number,
+                 [this, request, use, size, then = std::move(then), attempts](int waited) {
+                   // Busy: somebody has it open for writing at this moment. Where nothing stays,
+                   // nobody needs what could not be had.
+                   const bool goesOn = waited == EBUSY || (size == 0 && waited != EINTR);
+                   if (waited != 0 && !goesOn) return then(waited);
+                   if (attempts < kAttempts) std::this_thread::sleep_for(kPause);
+                   truncate(request, *use->get(), size, nullptr, then, attempts - 1);
+                 });
 }
 
 }  // namespace yomber

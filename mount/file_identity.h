@@ -25,10 +25,12 @@ struct FileIdentity {
   friend bool operator==(const FileIdentity&, const FileIdentity&) = default;
 };
 
+/// What st_blocks counts.
+inline constexpr std::uint64_t kBlockBytes = 512;
+
 /// Content that is away is a hole behind its first block.
 inline bool mayHaveHoles(const struct statx& status) {
-  constexpr std::uint64_t kBlock = 512;
-  return S_ISREG(status.stx_mode) && status.stx_blocks * kBlock < status.stx_size;
+  return S_ISREG(status.stx_mode) && status.stx_blocks * kBlockBytes < status.stx_size;
 }
 
 /// What `statx` is asked for.

@@ -12,6 +12,7 @@
 
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/file_time.h"
 
 namespace yomber {
@@ -21,6 +22,8 @@ namespace {
 constexpr double kForGood = 3e8;
 /// While nobody tells us of changes, in seconds.
 constexpr double kForTheMoment = 1;
+
+FaultPoint diskWaited("mount.disk.waited");
 
 statx_timestamp timestampOf(std::int64_t time) {
   const timespec from = timespecOf(time);
@@ -39,9 +42,17 @@ FileSystem::FileSystem(std::unique_ptr<Places> places, std::shared_ptr<ContentRe
       openFiles_({.open = [this](int descriptor) { return session_->openBacking(descriptor); },
                   .close = [this](int number) { session_->closeBacking(number); }}),
       waits_(requests_),
-      root_(&nodeOfBase(Places::kRoot)) {}
+      root_(&nodeOfBase(Places::kRoot)),
+      disk_({.promptThreads = 4, .maximumThreads = 64, .keptIdleThreads = 1}) {}
 
 FileSystem::~FileSystem() = default;
+
+void FileSystem::waitForDisk(std::function<void()> work) {
+  disk_.async([work = std::move(work)] {
+    (void)diskWaited.hit();
+    work();
+  });
+}
 
 Node& FileSystem::nodeOf(fuse_ino_t number) const {
   if (number == FUSE_ROOT_ID) return *root_;
@@ -95,10 +106,13 @@ int FileSystem::inPlace(const Node& node, const std::function<int(int, const cha
   int failure = ESTALE;
   for (int attempt = 0; attempt < kMoves; ++attempt) {
     const auto place = nodes_.placeOf(node);
-    if (!place) break;
-    const SharedDescriptor folder = folders_.open(*place->folder.get(), failure);
-    if (folder) failure = use(folder->get(), place->name.c_str());
-    if (failure != ESTALE && failure != ENOENT) return failure;
+    if (!place && nodes_.remains(node)) break;
+    if (place) {
+      const SharedDescriptor folder = folders_.open(*place->folder.get(), failure);
+      if (folder) failure = use(folder->get(), place->name.c_str());
+      if (failure != ESTALE && failure != ENOENT) return failure;
+    }
+    // What it changes places with may have been seen in its place, or it in the other one.
     nodes_.waitForMoves();
   }
   return ESTALE;
@@ -171,6 +185,7 @@ std::optional<DesktopThumbnails::Folder> FileSystem::desktopFolder(const Node& f
 }
 
 void FileSystem::noteChangedEntry(std::uint64_t folder, const std::string& nameOnDisk) {
+  if (space_ != nullptr) space_->noteChange();
   if (thumbnails_ == nullptr || !DesktopThumbnails::mayBePicture(nameOnDisk)) return;
   const NodeUse above = nodes_.byInode(folder);
   const auto place = above ? desktopFolder(*above.get()) : std::nullopt;

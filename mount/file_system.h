@@ -6,6 +6,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "mount/content_waits.h"
 #include "mount/desktop_thumbnails.h"
@@ -18,6 +19,7 @@
 #include "mount/node_table.h"
 #include "mount/open_files.h"
 #include "mount/places.h"
+#include "platform/foundation/thread_pool.h"
 
 namespace yomber {
 
@@ -26,8 +28,9 @@ class FolderListing;
 /// The drive as a folder: every request of the kernel, carried out on the tree.
 ///
 /// Nothing here waits for anybody, except requests that need content which is away: those are
-/// answered when it has come, and hold no thread meanwhile. Every operation answers its request
-/// exactly once. Thread-safety: any number of requests at a time.
+/// answered when it has come, and hold no thread meanwhile. What has to be on the disk first is
+/// waited for on threads of its own. Every operation answers its request exactly once.
+/// Thread-safety: any number of requests at a time.
 class FileSystem {
  public:
   FileSystem(std::unique_ptr<Places> places, std::shared_ptr<ContentRequests> requests);
@@ -46,6 +49,9 @@ class FileSystem {
   /// Whether changes are told to us as they happen: what the kernel is told holds until then, and
   /// for a moment only otherwise.
   void setIsTold(bool isTold) { isTold_ = isTold; }
+  /// Whether the kernel takes entries without their attributes where it asks for them with these:
+  /// then it is for us to say who gets them.
+  void setChoosesAttributes(bool chooses) { choosesAttributes_ = chooses; }
 
   [[nodiscard]] NodeTable& nodes() { return nodes_; }
   [[nodiscard]] Places& places() { return *places_; }
@@ -148,9 +154,11 @@ class FileSystem {
   /// Answers with what was looked at since `begun`.
   void answerAttributes(fuse_req_t request, Node& node, struct statx status,
                         EntryGate::Moment begun);
-  /// Answers with an entry that was looked at since `begun`; the kernel knows it from then on.
+  /// Looks until nothing changes meanwhile, then answers.
+  void lookAndAnswer(fuse_req_t request, Node& folder, int descriptor, const std::string& name);
+  /// Answers with an entry that was looked at; the kernel knows it from then on.
   void answerFound(fuse_req_t request, Node& folder, const std::string& name,
-                   const struct statx& status, EntryGate::Moment begun);
+                   const struct statx& status, const EntryGate::Telling& telling);
   /// Looks at what was just made, and answers with it.
   void answerMade(fuse_req_t request, Node& folder, int descriptor, const std::string& name);
   void answerBase(fuse_req_t request, std::uint32_t base);
@@ -161,38 +169,58 @@ class FileSystem {
   [[nodiscard]] static mode_t firstMode(fuse_req_t request, mode_t mode);
   [[nodiscard]] int giveToCaller(fuse_req_t request, int folder, const char* name,
                                  mode_t mode) const;
-  /// What the kernel may still use of the entry when it has been removed; nil when it knows none.
-  [[nodiscard]] SharedDescriptor remainsOf(Node& folder, int descriptor, const std::string& name);
+  /// What the kernel may still use of a node when its entry has been removed; nil when there is
+  /// none.
+  [[nodiscard]] static SharedDescriptor remainsOf(const NodeUse& node, int descriptor,
+                                                  const std::string& name);
   void removeEntry(fuse_req_t request, Node& folder, const char* name, int flags);
-  void renameNow(fuse_req_t request, Node& folder, const std::string& name, Node& newFolder,
-                 const std::string& newName, unsigned flags);
-  /// Whether a move needs an answer of the host first; then it is carried out later.
-  bool askBeforeMove(fuse_req_t request, Node& folder, const std::string& name, Node& newFolder,
-                     const std::string& newName, unsigned flags);
+  /// Of an entry to another place; whoever asks for it keeps the folders alive.
+  struct Move {
+    Node* folder = nullptr;
+    std::string name;  ///< on disk
+    Node* newFolder = nullptr;
+    std::string newName;
+    unsigned flags = 0;
+  };
+  void renameNow(fuse_req_t request, const Move& move);
+  /// The moves that need an answer of the host first.
+  [[nodiscard]] std::vector<Move> movesToAsk(const Move& move);
+  [[nodiscard]] bool isToBeAsked(const Move& move);
+  [[nodiscard]] bool lacksContent(const Node& folder, const std::string& name);
+  /// Asks of the last of `toAsk` and brings what it needs, then of the others, then moves. Waits.
+  void askThenRename(fuse_req_t request, const Move& move, std::vector<Move> toAsk);
 
-  void makeLink(fuse_req_t request, Node& node, Node& target, const char* name);
   /// Opens a file for whoever asks: as `openInPlace`.
   [[nodiscard]] int openNode(Node& node, int flags, FileDescriptor& content, FileDescriptor& place);
+  void openFound(fuse_req_t request, Node& node, int flags, FileDescriptor content,
+                 FileDescriptor place);
   /// With the entry, for what was made.
   void answerOpen(fuse_req_t request, const std::shared_ptr<OpenFile>& file,
                   const fuse_entry_param* entry);
   std::shared_ptr<OpenFile> addOpen(Node& node, int flags, FileDescriptor content,
                                     FileDescriptor place);
+  /// Asks for the content of a node, of which there is a descriptor: also when it was removed.
+  void waitForContent(fuse_req_t request, Node& node, int place, ContentWaits::Then then);
   /// How often content that came may be gone again before it is opened.
   static constexpr int kAttempts = 8;
   /// Calls `then` with 0 when the content is here, else with an errno: at once, or later.
   void withContent(fuse_req_t request, const std::shared_ptr<OpenFile>& file,
                    std::function<void(int failure)> then, int attempts = kAttempts);
+  void contentOpened(fuse_req_t request, const std::shared_ptr<OpenFile>& file, int failure,
+                     std::function<void(int failure)> then, int attempts);
   void truncate(fuse_req_t request, Node& node, off_t size, fuse_file_info* info,
-                std::function<void(int failure)> then, int attempts = kAttempts);
+                std::function<void(int failure)> then, int attempts = kAttempts,
+                bool mayWaitForDisk = false);
+  /// Does what may wait for the disk where it keeps no other request waiting.
+  void waitForDisk(std::function<void()> work);
   int setOthers(int descriptor, const struct stat& wanted, int which) const;
 
   bool addEntry(Node& folder, const FolderStream& stream, const FolderStream::Entry& entry,
                 bool withAttributes, FolderListing& listing);
   [[nodiscard]] int fillListing(Node& folder, FolderStream& stream, off_t offset,
                                 bool withAttributes, FolderListing& listing);
-  void readFolder(fuse_req_t request, Node& folder, std::size_t size, off_t offset,
-                  fuse_file_info* info, bool withAttributes);
+  void readFolder(fuse_req_t request, Node& folder, off_t offset, FolderStream& stream,
+                  bool withAttributes, FolderListing& listing);
 
   const std::unique_ptr<Places> places_;
   const std::shared_ptr<ContentRequests> requests_;
@@ -203,9 +231,11 @@ class FileSystem {
   ContentWaits waits_;
   Node* const root_;
   std::atomic<bool> isTold_ = false;
+  std::atomic<bool> choosesAttributes_ = false;
   KernelSession* session_ = nullptr;
   LocalSpace* space_ = nullptr;
   DesktopThumbnails* thumbnails_ = nullptr;
+  ThreadPool disk_;
 };
 
 }  // namespace yomber

@@ -84,8 +84,25 @@ void FileSystem::open(fuse_req_t request, Node& node, fuse_file_info* info) {
     (void)fuse_reply_err(request, failure);
     return;
   }
-  const auto file = addOpen(node, info->flags, std::move(content), std::move(place));
-  if ((info->flags & O_TRUNC) == 0) return answerOpen(request, file, nullptr);
+  const int flags = info->flags;
+  const bool isForWriting = (flags & O_ACCMODE) != O_RDONLY;
+  if (!content || !isForWriting || !isToBeSettled(content.get())) {
+    return openFound(request, node, flags, std::move(content), std::move(place));
+  }
+  const auto settled = std::make_shared<FileDescriptor>(std::move(content));
+  waitForDisk([this, request, &node, flags, settled] {
+    const int unsettled = settleForWriting(settled->get());
+    if (unsettled == 0) {
+      return openFound(request, node, flags, std::move(*settled), FileDescriptor());
+    }
+    (void)fuse_reply_err(request, unsettled);
+  });
+}
+
+void FileSystem::openFound(fuse_req_t request, Node& node, int flags, FileDescriptor content,
+                           FileDescriptor place) {
+  const auto file = addOpen(node, flags, std::move(content), std::move(place));
+  if ((flags & O_TRUNC) == 0) return answerOpen(request, file, nullptr);
   // Only now that it is known to be the file that was meant.
   truncate(request, node, 0, nullptr, [this, request, file](int truncation) {
     if (truncation == 0) return answerOpen(request, file, nullptr);
@@ -121,6 +138,7 @@ std::shared_ptr<OpenFile> FileSystem::addOpen(Node& node, int flags, FileDescrip
   auto file = openFiles_.add(nodes_, node, flags, std::move(content), std::move(place), wanted);
   if (space_ != nullptr) space_->noteUse(node.identity.inode);
   file->changeWhenOpened = nanosecondsOf(status.st_ctim);
+  file->bytesWhenOpened = static_cast<std::uint64_t>(status.st_blocks) * kBlockBytes;
   return file;
 }
 
@@ -152,7 +170,10 @@ void FileSystem::release(fuse_req_t request, Node& node, fuse_file_info* info) {
                          nanoseconds(status.stx_ctime) != file.changeWhenOpened;
   const auto path = isChanged ? locationOf(node) : std::nullopt;
   if (isChanged) nodes_.noteTold(node, 0);
-  if (isChanged && space_ != nullptr) space_->noteGrowth();
+  const std::uint64_t bytes = status.stx_blocks * kBlockBytes;
+  if (isChanged && space_ != nullptr && bytes > file.bytesWhenOpened) {
+    space_->noteGrowth(bytes - file.bytesWhenOpened);
+  }
   openFiles_.remove(file);
   (void)fuse_reply_err(request, 0);
   if (path) requests_->itemChanged(*path);

@@ -33,7 +33,11 @@ SharedDescriptor FolderDescriptors::open(const Node& folder, int& failure) {
   failure = ESTALE;
   for (int attempt = 0; attempt < kAttempts; ++attempt) {
     const auto way = nodes_.wayTo(folder);
-    if (!way) return nodes_.remains(folder);
+    if (!way) {
+      if (auto remains = nodes_.remains(folder)) return remains;
+      nodes_.waitForMoves();  // what it changes places with may have been seen in its place
+      continue;
+    }
     FileDescriptor found = follow(*way, failure);
     struct statx status{};
     if (!found || lookAt(found.get(), "", status) != 0) {

@@ -43,6 +43,8 @@ class FolderStream {
   [[nodiscard]] int descriptor() const { return folder_.get(); }
 
   Mutex mutex;
+  /// Whoever lists it looks at every entry. Set before it is listed.
+  bool isWalked = false;
 
  private:
   const FileDescriptor folder_;

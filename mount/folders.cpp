@@ -1,16 +1,16 @@
 // Listing folders.
 #include <dirent.h>
 #include <fcntl.h>
-#include <linux/fuse.h>
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 #include <memory>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "mount/file_system.h"
+#include "mount/folder_listing.h"
 #include "mount/folder_stream.h"
 
 namespace yomber {
@@ -19,56 +19,6 @@ namespace {
 bool isDots(std::string_view name) { return name == "." || name == ".."; }
 
 }  // namespace
-
-/// A reply that is being filled with entries.
-class FolderListing {
- public:
-  FolderListing(fuse_req_t request, std::size_t size) : request_(request), bytes_(size) {}
-
-  /// False when it is full.
-  bool add(const char* name, const struct stat& attributes, off_t next) {
-    return took(fuse_add_direntry(request_, rest(), left(), name, &attributes, next));
-  }
-  bool add(const char* name, const fuse_entry_param& entry, off_t next) {
-    return took(fuse_add_direntry_plus(request_, rest(), left(), name, &entry, next));
-  }
-  [[nodiscard]] bool hasRoomFor(const std::string& name) const {
-    return fuse_add_direntry_plus(request_, nullptr, 0, name.c_str(), nullptr, 0) <= left();
-  }
-  /// The kernel is to remember the node, if the reply reaches it.
-  void noteTold(Node& node) { told_.push_back(&node); }
-  [[nodiscard]] const std::vector<Node*>& told() const { return told_; }
-  [[nodiscard]] bool isEmpty() const { return used_ == 0; }
-
-  /// What is told with attributes must be asked for again before it is used.
-  void holdForNow() {
-    for (std::size_t at = 0; at + sizeof(fuse_direntplus) <= used_;) {
-      fuse_direntplus entry{};
-      std::memcpy(&entry, bytes_.data() + at, sizeof entry);
-      entry.entry_out.entry_valid = 0;
-      entry.entry_out.entry_valid_nsec = 0;
-      entry.entry_out.attr_valid = 0;
-      entry.entry_out.attr_valid_nsec = 0;
-      std::memcpy(bytes_.data() + at, &entry, sizeof entry);
-      at += FUSE_DIRENTPLUS_SIZE(&entry);
-    }
-  }
-  int answer() { return fuse_reply_buf(request_, bytes_.data(), used_); }
-
- private:
-  char* rest() { return bytes_.data() + used_; }
-  [[nodiscard]] std::size_t left() const { return bytes_.size() - used_; }
-  bool took(std::size_t size) {
-    if (size > left()) return false;
-    used_ += size;
-    return true;
-  }
-
-  fuse_req_t request_;
-  std::vector<char> bytes_;
-  std::size_t used_ = 0;
-  std::vector<Node*> told_;
-};
 
 void FileSystem::opendir(fuse_req_t request, Node& folder, fuse_file_info* info) {
   int failure = 0;
@@ -85,9 +35,12 @@ void FileSystem::opendir(fuse_req_t request, Node& folder, fuse_file_info* info)
   std::vector<Places::ShownBase> shown;
   if (&folder == root_) shown = places_->shownBases();
   auto stream = std::make_unique<FolderStream>(std::move(opened), std::move(shown));
+  stream->isWalked = choosesAttributes_ && (info->flags & O_NOFOLLOW) != 0;
   info->fh = reinterpret_cast<std::uint64_t>(stream.get());
-  info->cache_readdir = isTold_ && !folder.isUnwatched && &folder != root_;
-  info->keep_cache = info->cache_readdir;
+  info->keep_cache = isTold_ && !folder.isUnwatched && &folder != root_;
+  // From names that it has already, the kernel would look up each entry that is walked over.
+  const bool lacksAttributes = stream->isWalked && folder.listing.takeNames();
+  info->cache_readdir = info->keep_cache && !lacksAttributes;
   const bool isNews = thumbnails_ != nullptr && thumbnails_->isUnknown(folder.identity.inode);
   auto listed = isNews ? desktopFolder(folder) : std::nullopt;
   if (fuse_reply_open(request, info) == 0) (void)stream.release();
@@ -102,18 +55,26 @@ void FileSystem::releasedir(fuse_req_t request, Node& /*folder*/, fuse_file_info
 void FileSystem::fsyncdir(fuse_req_t request, Node& /*folder*/, int isDataOnly,
                           fuse_file_info* info) {
   const int descriptor = streamOf(info).descriptor();
-  const int result = isDataOnly != 0 ? fdatasync(descriptor) : ::fsync(descriptor);
-  (void)fuse_reply_err(request, result == 0 ? 0 : errno);
+  // The folder stays open until this is answered.
+  waitForDisk([request, descriptor, isDataOnly] {
+    const int result = isDataOnly != 0 ? fdatasync(descriptor) : ::fsync(descriptor);
+    (void)fuse_reply_err(request, result == 0 ? 0 : errno);
+  });
 }
 
 void FileSystem::readdir(fuse_req_t request, Node& folder, std::size_t size, off_t offset,
                          fuse_file_info* info) {
-  readFolder(request, folder, size, offset, info, false);
+  FolderListing listing(request, size, FolderListing::Form::Names);
+  readFolder(request, folder, offset, streamOf(info), false, listing);
 }
 
 void FileSystem::readdirplus(fuse_req_t request, Node& folder, std::size_t size, off_t offset,
                              fuse_file_info* info) {
-  readFolder(request, folder, size, offset, info, true);
+  FolderListing listing(request, size, FolderListing::Form::WithAttributes);
+  FolderStream& stream = streamOf(info);
+  const bool isWanted = !choosesAttributes_ || stream.isWalked || offset == 0;
+  const bool wasLookedAt = folder.listing.takeLookup();
+  readFolder(request, folder, offset, stream, isWanted || wasLookedAt, listing);
 }
 
 /// Adds an entry to a listing; false when that is full.
@@ -122,22 +83,20 @@ bool FileSystem::addEntry(Node& folder, const FolderStream& stream,
                           FolderListing& listing) {
   const std::string shown =
       entry.shown != nullptr ? entry.name : places_->shownName(folder.identity.inode, entry.name);
-  fuse_entry_param told{};
-  told.attr.st_ino =
-      entry.shown != nullptr ? places_->base(entry.shown->base).identity.inode : entry.inode;
-  told.attr.st_mode = DTTOIF(entry.type);
-  if (!withAttributes) return listing.add(shown.c_str(), told.attr, entry.next);
-  // Without a number the kernel takes the name alone, and looks it up when it needs it.
-  if (isDots(entry.name) || entry.shown != nullptr || !listing.hasRoomFor(shown)) {
-    return listing.add(shown.c_str(), told, entry.next);
+  const bool isByName = !withAttributes || isDots(entry.name) || entry.shown != nullptr;
+  if (isByName || !listing.hasRoomFor(shown.c_str())) {
+    struct stat known{};
+    known.st_ino =
+        entry.shown != nullptr ? places_->base(entry.shown->base).identity.inode : entry.inode;
+    known.st_mode = DTTOIF(entry.type);
+    return listing.addName(shown.c_str(), known, entry.next);
   }
   struct statx status{};
   if (lookAt(stream.descriptor(), entry.name, status) != 0) return true;  // gone meanwhile
   putRight(stream.descriptor(), entry.name, status);
   Node& node = nodes_.found(folder, entry.name, status);
-  told = entryOf(folder, node, status, true);
-  listing.noteTold(node);
-  return listing.add(shown.c_str(), told, entry.next);
+  listing.addEntry(shown.c_str(), entryOf(folder, node, status, true), node, entry.next);
+  return true;
 }
 
 int FileSystem::fillListing(Node& folder, FolderStream& stream, off_t offset, bool withAttributes,
@@ -155,15 +114,22 @@ int FileSystem::fillListing(Node& folder, FolderStream& stream, off_t offset, bo
   }
 }
 
-void FileSystem::readFolder(fuse_req_t request, Node& folder, std::size_t size, off_t offset,
-                            fuse_file_info* info, bool withAttributes) {
+/// Attributes are told along to whoever wants them: who walks a tree (programs that do open its
+/// folders so that no link is followed), who has just begun, since most folders are small, and who
+/// looks at entries while he reads on. For that to show, the last of as many as fit is told by its
+/// name alone.
+void FileSystem::readFolder(fuse_req_t request, Node& folder, off_t offset, FolderStream& stream,
+                            bool withAttributes, FolderListing& listing) {
   const EntryGate::Moment begun = gate_.now(folder.identity.inode);
-  FolderListing listing(request, size);
-  const int failure = fillListing(folder, streamOf(info), offset, withAttributes, listing);
+  const bool isSampled = choosesAttributes_ && !stream.isWalked;
+  const int failure = fillListing(folder, stream, offset, withAttributes, listing);
   if (failure != 0 && listing.isEmpty()) {
     (void)fuse_reply_err(request, failure);
     return;
   }
+  if (!withAttributes && !listing.isEmpty()) folder.listing.noteNames();
+  Node* const sample = isSampled && listing.isFull() ? listing.tellLastByName() : nullptr;
+  if (sample != nullptr) nodes_.forget(*sample, 1);
   const EntryGate::Telling telling(gate_, folder.identity.inode, begun);
   if (withAttributes && !telling.holds()) listing.holdForNow();
   // Once it is answered, the folder may be closed, and the stream gone.

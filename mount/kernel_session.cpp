@@ -55,7 +55,7 @@ bool isTruncation(const fuse_buf& request) {
   return (wanted.valid & FATTR_SIZE) != 0;
 }
 
-/// Whether what is asked for moves content, or waits for the disk.
+/// Whether what is asked for moves content.
 bool mayTakeLong(const fuse_buf& request) {
   fuse_in_header header{};
   if (request.size < sizeof header) return false;
@@ -63,8 +63,6 @@ bool mayTakeLong(const fuse_buf& request) {
   switch (header.opcode) {
     case FUSE_READ:
     case FUSE_WRITE:
-    case FUSE_FSYNC:
-    case FUSE_FSYNCDIR:
     case FUSE_FALLOCATE:
     case FUSE_COPY_FILE_RANGE:
       return true;

@@ -49,11 +49,13 @@ KernelUpdates::Found KernelUpdates::lookAgain(Node& folder, int descriptor,
   const bool isSame =
       found.known && found.isThere && found.known->identity == FileIdentity::of(found.status);
   found.isOther = found.known && !isSame;
-  if (found.isOther) nodes.removed(folder, nameOnDisk);
+  if (found.isOther)
+    nodes.removed({.folder = folder, .name = nameOnDisk, .node = found.known.get()});
   return found;
 }
 
-/// The folder is not where it was, so the entry cannot be looked at.
+/// The folder is not where it was, so the entry cannot be looked at; or looking now says nothing of
+/// later.
 void KernelUpdates::entryMayHaveChanged(Node& folder, const std::string& nameOnDisk) {
   session_.entryMayBeOther(folder, files_.places().shownName(folder.identity.inode, nameOnDisk));
   if (const NodeUse node = files_.nodes().inPlace(folder, nameOnDisk)) {
@@ -68,9 +70,16 @@ void KernelUpdates::folderChanged(std::uint64_t folder) {
   const NodeUse above = nodes.byInode(folder);
   if (!above) return;
   files_.gate().change(folder);
+  // Of what is in it now nobody will tell: the kernel is to look for itself.
+  const bool isUnwatched = above->isUnwatched || (!above->base && !nodes.placeOf(*above.get()));
   for (const NodeUse& node : nodes.all()) {
     const auto place = nodes.placeOf(*node.get());
-    if (place && place->folder.get() == above.get()) entryChanged(folder, place->name);
+    if (!place || place->folder.get() != above.get()) continue;
+    if (isUnwatched) {
+      entryMayHaveChanged(*above.get(), place->name);
+    } else {
+      entryChanged(folder, place->name);
+    }
   }
   nodes.noteTold(*above.get(), 0);
   session_.contentIsOther(*above.get());

@@ -29,6 +29,7 @@
 #include "platform/foundation/shared_heaps.h"
 #include "platform/ostrell/constants.h"
 #include "platform/ostrell/daemon_connection.h"
+#include "platform/ostrell/daemon_question.h"
 
 namespace yomber {
 namespace {
@@ -118,7 +119,9 @@ int serve(const DrivePaths& paths, const Arguments& arguments, const sigset_t& e
   const std::string root = paths.tree + "/" + QSUbiquitousDefaultContainerID + "/Documents";
   auto places = Places::open(root, paths.tree + "/.Trash", &error);
   if (!places) return fail("there is no drive at " + paths.home + "; start it with 'yomber up'");
-  auto requests = ContentRequests::create(paths.controlSocket);
+  // A daemon that is stuck is noticed after two such limits.
+  auto watch = DownloadWatch::create(paths.daemonSocket, 2 * daemonTimeLimit());
+  auto requests = ContentRequests::create(paths.controlSocket, std::move(watch));
   FileSystem files(std::move(places), requests);
   const bool isRoot = geteuid() == 0;
   const KernelSession::Options options{.mountPoint = resolved(arguments.mountPoint),
@@ -132,8 +135,12 @@ int serve(const DrivePaths& paths, const Arguments& arguments, const sigset_t& e
   if (!session) return fail(error->localizedDescription());
   files.setSession(session.get());
   std::optional<LocalSpace> space;
-  if (arguments.keep)
-    files.setLocalSpace(&space.emplace(files.places(), requests, *arguments.keep));
+  if (arguments.keep) {
+    const auto giveUp = [requests](const std::string& location) {
+      return requests->stopProviding(location);
+    };
+    files.setLocalSpace(&space.emplace(files.places(), giveUp, *arguments.keep));
+  }
   std::optional<DesktopThumbnails> thumbnails;
   // Without a home of its user there is no desktop.
   if (!cacheDirectory().empty())

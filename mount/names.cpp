@@ -9,16 +9,29 @@
 #include <optional>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "mount/file_system.h"
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/thread_pool.h"
+#include "platform/ostrell/exclusions.h"
 
 namespace yomber {
 namespace {
 
+FaultPoint moveDone("mount.move.done");
+
 constexpr mode_t kSetID = S_ISUID | S_ISGID;
+
+/// Once the file has lost the name to which the descriptor was opened.
+Remains remainsAt(SharedDescriptor descriptor) {
+  struct stat status{};
+  const bool hasOtherNames = descriptor && fstat(descriptor->get(), &status) == 0 &&
+                             !S_ISDIR(status.st_mode) && status.st_nlink > 0;
+  return {.descriptor = std::move(descriptor), .hasOtherNames = hasOtherNames};
+}
 
 }  // namespace
 
@@ -45,36 +58,21 @@ void FileSystem::symlink(fuse_req_t request, const char* target, fuse_ino_t fold
 }
 
 void FileSystem::link(fuse_req_t request, Node& node, fuse_ino_t folder, const char* name) {
-  const auto path = locationOf(node);
-  if (!path || !isFaultAtPath(*path)) return makeLink(request, node, nodeOf(folder), name);
-  // We know one name of each file: without that, nobody could say whose content is to come. What
-  // has several names is not given up, so that it stays.
-  auto source = std::make_shared<NodeUse>(nodes_.use(node));
-  auto target = std::make_shared<NodeUse>(nodes_.use(nodeOf(folder)));
-  waits_.wait(request, nodes_.use(node), *path,
-              [this, request, source, target, entry = std::string(name)](int waited) {
-                if (waited == 0 || waited == EBUSY)
-                  return makeLink(request, *source->get(), *target->get(), entry.c_str());
-                (void)fuse_reply_err(request, waited);
-              });
-}
-
-void FileSystem::makeLink(fuse_req_t request, Node& node, Node& target, const char* name) {
+  Node& target = nodeOf(folder);
   Descriptor source;
-  const int failure = descriptorOf(node, source);
+  int failure = descriptorOf(node, source);
+  // We know one name of each file: without that, nobody could say whose content is to come. Nor is
+  // it waited for here, with the folder locked; whoever is refused copies.
+  if (failure == 0 && isFault(source.number)) failure = EPERM;
+  const SharedDescriptor opened = failure == 0 ? folders_.open(target, failure) : nullptr;
+  if (opened && isShownBase(target, name)) failure = EEXIST;
+  if (failure == 0) {
+    const std::string path = pathOfDescriptor(source.number);
+    if (linkat(AT_FDCWD, path.c_str(), opened->get(), name, AT_SYMLINK_FOLLOW) != 0)
+      failure = errno;
+  }
   if (failure != 0) {
     (void)fuse_reply_err(request, failure);
-    return;
-  }
-  const std::string path = pathOfDescriptor(source.number);
-  int descriptor = 0;
-  const SharedDescriptor opened = folders_.open(target, descriptor);
-  if (!opened || isShownBase(target, name)) {
-    (void)fuse_reply_err(request, opened ? EEXIST : descriptor);
-    return;
-  }
-  if (linkat(AT_FDCWD, path.c_str(), opened->get(), name, AT_SYMLINK_FOLLOW) != 0) {
-    (void)fuse_reply_err(request, errno);
     return;
   }
   nodes_.noteTold(target, 0);
@@ -134,7 +132,8 @@ void FileSystem::answerMade(fuse_req_t request, Node& folder, int descriptor,
     (void)fuse_reply_err(request, failure);
     return;
   }
-  answerFound(request, folder, name, status, begun);
+  answerFound(request, folder, name, status,
+              EntryGate::Telling(gate_, folder.identity.inode, begun));
 }
 
 void FileSystem::unlink(fuse_req_t request, Node& folder, const char* name) {
@@ -154,24 +153,25 @@ void FileSystem::removeEntry(fuse_req_t request, Node& folder, const char* name,
     return;
   }
   const std::string onDisk = nameOnDisk(folder, name);
-  SharedDescriptor remains = remainsOf(folder, descriptor->get(), onDisk);
+  const NodeUse gone = nodes_.inPlace(folder, onDisk);
+  SharedDescriptor remains = remainsOf(gone, descriptor->get(), onDisk);
   std::optional<NodeTable::Moving> moving(nodes_);
   if (unlinkat(descriptor->get(), onDisk.c_str(), flags) != 0) {
     (void)fuse_reply_err(request, errno);
     return;
   }
-  if (const NodeUse gone = nodes_.inPlace(folder, onDisk)) {
-    nodes_.noteTold(*gone.get(), 0);
-    if (gone->isFolder()) folders_.forget(gone->identity);
-  }
-  nodes_.removed(folder, onDisk, std::move(remains));
+  gate_.change(folder.identity.inode);
+  if (gone) nodes_.noteTold(*gone.get(), 0);
+  if (gone && gone->isFolder()) folders_.forget(gone->identity);
+  nodes_.removed({.folder = folder, .name = onDisk, .node = gone.get()},
+                 remainsAt(std::move(remains)));
   moving.reset();
   nodes_.noteTold(folder, 0);
   (void)fuse_reply_err(request, 0);
 }
 
-SharedDescriptor FileSystem::remainsOf(Node& folder, int descriptor, const std::string& name) {
-  const NodeUse node = nodes_.inPlace(folder, name);
+SharedDescriptor FileSystem::remainsOf(const NodeUse& node, int descriptor,
+                                       const std::string& name) {
   if (!node) return nullptr;
   FileDescriptor opened(openat(descriptor, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   struct statx status{};
@@ -187,71 +187,116 @@ void FileSystem::rename(fuse_req_t request, Node& folder, const char* name, fuse
     (void)fuse_reply_err(request, EBUSY);
     return;
   }
-  const std::string from = nameOnDisk(folder, name);
-  const std::string to = nameOnDisk(target, newName);
-  if (askBeforeMove(request, folder, from, target, to, flags)) return;
-  renameNow(request, folder, from, target, to, flags);
+  const Move move{.folder = &folder,
+                  .name = nameOnDisk(folder, name),
+                  .newFolder = &target,
+                  .newName = nameOnDisk(target, newName),
+                  .flags = flags};
+  std::vector<Move> toAsk = movesToAsk(move);
+  if (toAsk.empty()) return renameNow(request, move);
+  ThreadPool::shared().async(
+      [this, request, move, toAsk = std::move(toAsk)] { askThenRename(request, move, toAsk); });
 }
 
-void FileSystem::renameNow(fuse_req_t request, Node& folder, const std::string& name,
-                           Node& newFolder, const std::string& newName, unsigned flags) {
+void FileSystem::renameNow(fuse_req_t request, const Move& move) {
+  const auto& [folder, name, newFolder, newName, flags] = move;
   int failure = 0;
-  const SharedDescriptor from = folders_.open(folder, failure);
-  const SharedDescriptor to = from ? folders_.open(newFolder, failure) : nullptr;
+  const SharedDescriptor from = folders_.open(*folder, failure);
+  const SharedDescriptor to = from ? folders_.open(*newFolder, failure) : nullptr;
   if (!to) {
     (void)fuse_reply_err(request, failure);
     return;
   }
   const bool isExchange = (flags & RENAME_EXCHANGE) != 0;
-  SharedDescriptor replaced;
-  if (!isExchange) replaced = remainsOf(newFolder, to->get(), newName);
+  const NodeUse node = nodes_.inPlace(*folder, name);
+  const NodeUse other = nodes_.inPlace(*newFolder, newName);
+  SharedDescriptor replaced = isExchange ? nullptr : remainsOf(other, to->get(), newName);
   std::optional<NodeTable::Moving> moving(nodes_);
   if (renameat2(from->get(), name.c_str(), to->get(), newName.c_str(), flags) != 0) {
     (void)fuse_reply_err(request, errno);
     return;
   }
-  for (const auto& [place, moved] : {std::pair(&folder, &name), std::pair(&newFolder, &newName)}) {
-    if (const NodeUse node = nodes_.inPlace(*place, *moved)) nodes_.noteTold(*node.get(), 0);
+  (void)moveDone.hit();
+  for (Node* const place : {folder, newFolder}) {
+    gate_.change(place->identity.inode);
     nodes_.noteTold(*place, 0);
   }
-  nodes_.moved(folder, name, newFolder, newName, isExchange, std::move(replaced));
+  for (const NodeUse* const each : {&node, &other}) {
+    if (*each) nodes_.noteTold(*each->get(), 0);
+  }
+  nodes_.moved({.folder = *folder, .name = name, .node = node.get()},
+               {.folder = *newFolder, .name = newName, .node = other.get()}, isExchange,
+               remainsAt(std::move(replaced)));
   moving.reset();
   (void)fuse_reply_err(request, 0);
 }
 
-bool FileSystem::askBeforeMove(fuse_req_t request, Node& folder, const std::string& name,
-                               Node& newFolder, const std::string& newName, unsigned flags) {
-  const auto from = nodes_.wayTo(folder);
-  const auto to = nodes_.wayTo(newFolder);
-  const bool isWithin = !from || !to || from->base == to->base || from->base == Places::kTrash ||
-                        to->base == Places::kTrash;
-  const auto source = locationOf(folder);
-  const auto target = locationOf(newFolder);
-  if (isWithin || !source || !target) return false;
-  const std::string path = *source + "/" + places_->shownName(folder.identity.inode, name);
-  const std::string destination =
-      *target + "/" + places_->shownName(newFolder.identity.inode, newName);
-  ThreadPool::shared().async(
-      [this, request, &folder, name, &newFolder, newName, flags, path, destination] {
-        bool requiresProviding = false;
-        const NSErrorRef error = requests_->movingItem(path, destination, requiresProviding);
-        const NodeUse node = nodes_.inPlace(folder, name);
-        if (error) {
-          (void)fuse_reply_err(request, errnoOf(error));
-        } else if (!requiresProviding || !node) {
-          renameNow(request, folder, name, newFolder, newName, flags);
-        } else {
-          waits_.wait(request, nodes_.use(*node.get()), path,
-                      [this, request, &folder, name, &newFolder, newName, flags](int failure) {
-                        if (failure != 0) {
-                          (void)fuse_reply_err(request, failure);
-                        } else {
-                          renameNow(request, folder, name, newFolder, newName, flags);
-                        }
-                      });
-        }
-      });
-  return true;
+std::vector<FileSystem::Move> FileSystem::movesToAsk(const Move& move) {
+  std::vector<Move> result;
+  if (isToBeAsked(move)) result.push_back(move);
+  if ((move.flags & RENAME_EXCHANGE) == 0) return result;
+  const Move back{.folder = move.newFolder,
+                  .name = move.newName,
+                  .newFolder = move.folder,
+                  .newName = move.name,
+                  .flags = move.flags};
+  if (isToBeAsked(back)) result.push_back(back);
+  return result;
+}
+
+/// Which folders are shared, the daemon knows: any move to another folder may be one into a share,
+/// or out of one. One to a name that the drive leaves alone takes it out of the drive. That matters
+/// for a document that is away; of what is in a folder nothing would be brought.
+bool FileSystem::isToBeAsked(const Move& move) {
+  const auto from = nodes_.wayTo(*move.folder);
+  const auto to = nodes_.wayTo(*move.newFolder);
+  // The trash keeps an item where it belongs.
+  if (!from || !to || to->base == Places::kTrash) return false;
+  if (from->base != to->base) return true;
+  if (move.folder->isUnwatched || qs_isExcludedName(move.name)) return false;
+  const bool isElsewhere = move.folder != move.newFolder || qs_isExcludedName(move.newName);
+  return isElsewhere && lacksContent(*move.folder, move.name);
+}
+
+bool FileSystem::lacksContent(const Node& folder, const std::string& name) {
+  int failure = 0;
+  const SharedDescriptor descriptor = folders_.open(folder, failure);
+  struct statx status{};
+  if (!descriptor || lookAt(descriptor->get(), name.c_str(), status) != 0) return false;
+  return S_ISREG(status.stx_mode) &&
+         isFaultAtPath(pathOfDescriptor(descriptor->get()) + "/" + name);
+}
+
+void FileSystem::askThenRename(fuse_req_t request, const Move& move, std::vector<Move> toAsk) {
+  if (toAsk.empty()) return renameNow(request, move);
+  const Move asked = std::move(toAsk.back());
+  toAsk.pop_back();
+  const auto source = locationOf(*asked.folder);
+  const auto target = locationOf(*asked.newFolder);
+  const NodeUse node = nodes_.inPlace(*asked.folder, asked.name);
+  if (!source || !target || !node) {
+    (void)fuse_reply_err(request, ESTALE);
+    return;
+  }
+  const auto shown = [&](const Node& folder, const std::string& name) {
+    return "/" + places_->shownName(folder.identity.inode, name);
+  };
+  const std::string path = *source + shown(*asked.folder, asked.name);
+  const std::string destination = *target + shown(*asked.newFolder, asked.newName);
+  bool requiresProviding = false;
+  const int failure = errnoOf(requests_->movingItem(path, destination, requiresProviding));
+  // What the drive does not know, it has not away either.
+  if (failure != 0 && failure != ENOENT) {
+    (void)fuse_reply_err(request, failure);
+  } else if (!requiresProviding) {
+    askThenRename(request, move, std::move(toAsk));
+  } else {
+    waits_.wait(request, nodes_.use(*node.get()), path,
+                [this, request, move, toAsk = std::move(toAsk)](int waited) {
+                  if (waited == 0) return askThenRename(request, move, toAsk);
+                  (void)fuse_reply_err(request, waited);
+                });
+  }
 }
 
 }  // namespace yomber

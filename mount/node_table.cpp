@@ -2,17 +2,18 @@
 
 #include <algorithm>
 #include <limits>
+#include <ranges>
 #include <utility>
 
-#include "mount/open_files.h"
 #include "mount/places.h"
+#include "platform/ostrell/exclusions.h"
 
 namespace yomber {
 namespace {
 
 /// Where the daemon watches nothing: what the drive leaves alone, and its own notes in the trash.
 bool isUnwatchedFolder(const Node& folder, std::string_view name) {
-  return folder.isUnwatched || name.ends_with(".nosync") ||
+  return folder.isUnwatched || qs_isExcludedName(name) ||
          (folder.base == Places::kTrash && name == "info");
 }
 
@@ -21,9 +22,7 @@ constexpr std::int64_t kUnknownChange = std::numeric_limits<std::int64_t>::min()
 
 }  // namespace
 
-Node::Node(FileIdentity itsIdentity, std::uint32_t itsType)
-    : identity(itsIdentity), type(itsType) {}
-Node::~Node() = default;
+Node::Node(FileIdentity itsIdentity, std::uint8_t itsType) : identity(itsIdentity), type(itsType) {}
 
 NodeUse::NodeUse(NodeUse&& other) noexcept
     : table_(other.table_), node_(std::exchange(other.node_, nullptr)) {}
@@ -41,33 +40,35 @@ NodeUse::~NodeUse() {
 NodeTable::NodeTable() = default;
 
 NodeTable::~NodeTable() {
-  for (Node* node : byPlace_) delete node;
+  byPlace_.forEach([](Node& node) { delete &node; });
   for (Node* node : unplaced_) delete node;
 }
 
 Node& NodeTable::addBase(std::uint32_t base, FileIdentity identity) {
   LockGuard guard(mutex_);
-  const auto known = byInode_.find(identity.inode);
-  if (known != byInode_.end() && known->second->base == base) return *known->second;
-  auto* node = new Node(identity, S_IFDIR);
+  Node* const known = byInode_.find(identity.inode);
+  if (known != nullptr && known->base == base) return *known;
+  if (known != nullptr) byInode_.erase(*known);
+  auto* node = new Node(identity, DT_DIR);
   node->base = base;
   node->uses_ = 1;
   unplaced_.insert(node);
-  byInode_[identity.inode] = node;
+  byInode_.insert(*node);
   return *node;
 }
 
 Node& NodeTable::found(Node& folder, std::string_view name, const struct statx& status) {
   const FileIdentity identity = FileIdentity::of(status);
+  const auto type = static_cast<std::uint8_t>(IFTODT(status.stx_mode));
   LockGuard guard(mutex_);
-  Node*& known = byInode_[identity.inode];
-  if (known != nullptr &&
-      (known->identity != identity || known->type != (status.stx_mode & S_IFMT))) {
+  Node* known = byInode_.find(identity.inode);
+  if (known != nullptr && (known->identity != identity || known->type != type)) {
+    byInode_.erase(*known);
     known = nullptr;  // its inode number was given again
   }
   if (known == nullptr) {
-    known = new Node(identity, status.stx_mode & S_IFMT);
-    unplaced_.insert(known);
+    known = new Node(identity, type);
+    byInode_.insert(*known);
   }
   Node& node = *known;
   ++node.lookups_;
@@ -101,41 +102,61 @@ std::int64_t NodeTable::told(const Node& node) const {
   return node.toldChange_;
 }
 
-void NodeTable::moved(Node& folder, std::string_view name, Node& newFolder,
-                      std::string_view newName, bool isExchange, SharedDescriptor remains) {
+void NodeTable::moved(const Entry& from, const Entry& to, bool isExchange, Remains replaced) {
   LockGuard guard(mutex_);
-  Node* const node = at(folder, name);
-  Node* const other = at(newFolder, newName);
+  Node* const node = from.node;
+  Node* const other = to.node;
   if (node == other) return;  // two names of one file
   // Kept while it is nowhere.
   if (node != nullptr) ++node->uses_;
   if (other != nullptr) ++other->uses_;
-  if (node != nullptr) unplace(*node);
-  if (other != nullptr && isExchange) unplace(*other);
-  if (other != nullptr && !isExchange) remove(*other, std::move(remains));
-  if (node != nullptr) place(*node, newFolder, newName);
-  if (other != nullptr && isExchange) place(*other, folder, name);
+  if (other != nullptr && !isExchange) remove(to, std::move(replaced));
+  if (node != nullptr) place(*node, to.folder, to.name);
+  if (other != nullptr && isExchange) place(*other, from.folder, from.name);
   if (node != nullptr) endUse(*node);
   if (other != nullptr) endUse(*other);
 }
 
-void NodeTable::removed(Node& folder, std::string_view name, SharedDescriptor remains) {
+void NodeTable::removed(const Entry& entry, Remains remains) {
   LockGuard guard(mutex_);
-  Node* const node = at(folder, name);
-  if (node == nullptr) return;
-  ++node->uses_;
-  remove(*node, std::move(remains));
-  endUse(*node);
+  if (entry.node == nullptr) return;
+  ++entry.node->uses_;
+  remove(entry, std::move(remains));
+  endUse(*entry.node);
 }
 
-void NodeTable::remove(Node& node, SharedDescriptor remains) {
+void NodeTable::remove(const Entry& entry, Remains remains) {
+  Node& node = *entry.node;
+  // It was found under another name meanwhile.
+  if (node.parent_ != nullptr && at(entry.folder, entry.name) != &node) return;
   unplace(node);
-  node.remains_ = std::move(remains);
+  if (!remains.descriptor) return;
+  if (remains.hasOtherNames) named_.emplace_back(&node, remains.descriptor);
+  remains_[&node] = std::move(remains.descriptor);
+  if (named_.size() > kNamedKept) endOldestNamed();
+}
+
+void NodeTable::endOldestNamed() {
+  const auto [node, descriptor] = std::move(named_.front());
+  named_.pop_front();
+  const auto found = remains_.find(node);
+  // The node may be another one by now, or have other remains.
+  if (found == remains_.end() || found->second != descriptor.lock()) return;
+  ended_.push_back(std::move(found->second));
+  remains_.erase(found);
 }
 
 SharedDescriptor NodeTable::remains(const Node& node) const {
   LockGuard guard(mutex_);
-  return node.remains_;
+  const auto found = remains_.find(&node);
+  return found == remains_.end() ? nullptr : found->second;
+}
+
+void NodeTable::endRemains(const Node& node) {
+  const auto found = remains_.find(&node);
+  if (found == remains_.end()) return;
+  ended_.push_back(std::move(found->second));
+  remains_.erase(found);
 }
 
 NodeUse NodeTable::startUse(Node& node) {
@@ -150,8 +171,8 @@ NodeUse NodeTable::use(Node& node) {
 
 NodeUse NodeTable::byInode(std::uint64_t inode) {
   LockGuard guard(mutex_);
-  const auto known = byInode_.find(inode);
-  return known == byInode_.end() ? NodeUse() : startUse(*known->second);
+  Node* const known = byInode_.find(inode);
+  return known == nullptr ? NodeUse() : startUse(*known);
 }
 
 NodeUse NodeTable::inPlace(Node& folder, std::string_view name) {
@@ -164,7 +185,10 @@ std::vector<NodeUse> NodeTable::all() {
   LockGuard guard(mutex_);
   std::vector<NodeUse> result;
   result.reserve(byInode_.size());
-  for (const auto& [inode, node] : byInode_) result.push_back(startUse(*node));
+  byInode_.forEach([&](Node& node) {
+    ++node.uses_;
+    result.push_back(NodeUse(*this, node));
+  });
   return result;
 }
 
@@ -174,7 +198,7 @@ std::optional<NodeTable::Way> NodeTable::wayTo(const Node& node) const {
   const Node* step = &node;
   while (!step->base) {
     if (step->parent_ == nullptr) return std::nullopt;
-    way.steps.push_back({step->parent_->identity.inode, step->name_});
+    way.steps.push_back({step->parent_->identity.inode, step->name_.string()});
     step = step->parent_;
   }
   std::reverse(way.steps.begin(), way.steps.end());
@@ -185,7 +209,7 @@ std::optional<NodeTable::Way> NodeTable::wayTo(const Node& node) const {
 std::optional<NodeTable::Place> NodeTable::placeOf(const Node& node) {
   LockGuard guard(mutex_);
   if (node.parent_ == nullptr) return std::nullopt;
-  return Place{startUse(*node.parent_), node.name_};
+  return Place{startUse(*node.parent_), node.name_.string()};
 }
 
 std::size_t NodeTable::size() const {
@@ -194,8 +218,7 @@ std::size_t NodeTable::size() const {
 }
 
 Node* NodeTable::at(const Node& folder, std::string_view name) const {
-  const auto found = byPlace_.find(PlaceKey{&folder, name});
-  return found == byPlace_.end() ? nullptr : *found;
+  return byPlace_.find(PlaceKey{&folder, name});
 }
 
 void NodeTable::place(Node& node, Node& folder, std::string_view name) {
@@ -204,17 +227,32 @@ void NodeTable::place(Node& node, Node& folder, std::string_view name) {
     unplace(*other);
     endUse(*other);
   }
+  const bool mayHaveEntries = node.isFolder() && node.uses_ > 0;
   ++node.uses_;
   unplace(node);
   breakCycle(node, folder);
-  node.isUnwatched = node.isFolder() && isUnwatchedFolder(folder, name);
+  const bool isUnwatched = node.isFolder() && isUnwatchedFolder(folder, name);
+  const bool isOtherwise = node.isUnwatched.exchange(isUnwatched) != isUnwatched;
   ++folder.uses_;
   node.parent_ = &folder;
   node.name_ = name;
-  if (node.remains_) ended_.push_back(std::move(node.remains_));  // it has another name
+  endRemains(node);  // it has another name
   unplaced_.erase(&node);
-  byPlace_.insert(&node);
+  byPlace_.insert(node);
+  if (isOtherwise && mayHaveEntries) noteWatchedBelow();
   endUse(node);
+}
+
+/// Nobody knows what is below a folder but what is there itself; such moves are rare.
+void NodeTable::noteWatchedBelow() {
+  std::vector<Node*> way;
+  byPlace_.forEach([&way](Node& node) {
+    if (!node.isFolder()) return;
+    way.clear();
+    for (Node* step = &node; step->parent_ != nullptr; step = step->parent_) way.push_back(step);
+    for (Node* step : std::views::reverse(way))
+      step->isUnwatched = isUnwatchedFolder(*step->parent_, step->name_.view());
+  });
 }
 
 /// Folders that were moved behind our back may be found again in any order: one of those on the way
@@ -232,7 +270,7 @@ void NodeTable::breakCycle(const Node& node, Node& folder) {
 void NodeTable::unplace(Node& node) {
   Node* const folder = node.parent_;
   if (folder == nullptr) return;
-  byPlace_.erase(&node);
+  byPlace_.erase(node);
   unplaced_.insert(&node);
   node.parent_ = nullptr;
   node.name_.clear();
@@ -252,9 +290,8 @@ void NodeTable::dropIfUnused(Node& node) {
     --node.uses_;
   }
   unplaced_.erase(&node);
-  if (node.remains_) ended_.push_back(std::move(node.remains_));
-  const auto known = byInode_.find(node.identity.inode);
-  if (known != byInode_.end() && known->second == &node) byInode_.erase(known);
+  endRemains(node);
+  byInode_.erase(node);
   delete &node;
 }
 

@@ -1,7 +1,10 @@
 #pragma once
 
+#include <dirent.h>
+
 #include <atomic>
 #include <cstdint>
+#include <deque>
 #include <memory>
 #include <optional>
 #include <shared_mutex>
@@ -9,52 +12,63 @@
 #include <string_view>
 #include <unordered_map>
 #include <unordered_set>
+#include <utility>
 #include <vector>
 
 #include "mount/file_identity.h"
+#include "mount/linked_table.h"
+#include "mount/listing_marks.h"
+#include "mount/short_name.h"
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/lock.h"
 
 namespace yomber {
 
-class NodeFiles;
-
 using SharedDescriptor = std::shared_ptr<const FileDescriptor>;
 
 /// A file or folder that the kernel knows. Its fields belong to the NodeTable, except where they
 /// say otherwise.
+///
+/// There are as many as the kernel remembers, often all of a drive: what few of them have is kept
+/// beside them, and no field is larger than it has to be.
 class Node {
  public:
-  Node(FileIdentity itsIdentity, std::uint32_t itsType);
+  Node(FileIdentity itsIdentity, std::uint8_t itsType);
   Node(const Node&) = delete;
   Node& operator=(const Node&) = delete;
-  ~Node();
 
-  [[nodiscard]] bool isFolder() const { return (type & S_IFMT) == S_IFDIR; }
+  [[nodiscard]] bool isFolder() const { return type == DT_DIR; }
 
   const FileIdentity identity;
-  const std::uint32_t type;  ///< S_IFMT bits
   /// Of a folder that is shown in the root although it lies elsewhere, and of the root: the number
   /// of its place among `Places`.
   std::optional<std::uint32_t> base;
+  const std::uint8_t type;  ///< DT_…
   /// A folder in which nobody sees changes.
   std::atomic<bool> isUnwatched = false;
   /// The content may be away: it had holes when it was last looked at.
   std::atomic<bool> mayBeAway = false;
+  /// Of a folder: what is known of those who list it.
+  ListingMarks listing;
 
  private:
   friend class NodeTable;
-  friend class OpenFiles;
-  Node* parent_ = nullptr;  ///< null: a base, or removed
-  std::string name_;        ///< on this disk
-  std::uint64_t lookups_ = 0;
   std::uint32_t uses_ = 0;  ///< children, open files and whoever holds a NodeUse
+  Node* parent_ = nullptr;  ///< null: a base, or removed
+  ShortName name_;          ///< on this disk
+  std::uint64_t lookups_ = 0;
   std::int64_t toldChange_ = 0;
-  SharedDescriptor remains_;
-  std::unique_ptr<NodeFiles> files_;  ///< OpenFiles' own
+  Node* nextByInode_ = nullptr;
+  Node* nextByPlace_ = nullptr;
 };
 
 class NodeTable;
+
+/// What is left of a file that went from its place.
+struct Remains {
+  SharedDescriptor descriptor;  ///< O_PATH; may be nil
+  bool hasOtherNames = false;   ///< none of which is known here
+};
 
 /// Keeps a node although the kernel may forget it. Thread-safety: that of the table.
 class NodeUse {
@@ -105,13 +119,22 @@ class NodeTable {
   /// The ctime that the kernel knows; none that a file has when it may know another one.
   [[nodiscard]] std::int64_t told(const Node& node) const;
 
-  /// The file in the place has another place now. With `isExchange` the two have changed places;
-  /// else what was in the other place was removed.
-  void moved(Node& folder, std::string_view name, Node& newFolder, std::string_view newName,
-             bool isExchange, SharedDescriptor remains = nullptr);
-  /// The file is nowhere any more. The kernel may have it for a while still: `remains`, a
-  /// descriptor of the file (O_PATH), if given, is kept for as long, and its inode number with it.
-  void removed(Node& folder, std::string_view name, SharedDescriptor remains = nullptr);
+  /// Of how many files with other names the remains are kept. The kernel may remember those for
+  /// good, but looks most of them up again, which tells us a name.
+  static constexpr std::size_t kNamedKept = 128;
+
+  /// A place, and the node that was known to be there before a change; null: none.
+  struct Entry {
+    Node& folder;
+    std::string_view name;
+    Node* node = nullptr;
+  };
+  /// What was at `from` is at `to` now. With `isExchange` the two have changed places; else what
+  /// was at `to` was removed. Whoever looks there may have told before that it is.
+  void moved(const Entry& from, const Entry& to, bool isExchange, Remains replaced = {});
+  /// The file is there no more. The kernel may have it for a while still: what remains is kept for
+  /// as long, and its inode number with it.
+  void removed(const Entry& entry, Remains remains = {});
   /// What is left of a node that was removed; nil when that is nothing.
   [[nodiscard]] SharedDescriptor remains(const Node& node) const;
 
@@ -167,28 +190,32 @@ class NodeTable {
     const Node* folder;
     std::string_view name;
   };
-  struct HashPlace {
-    using is_transparent = void;
-    std::size_t operator()(const Node* node) const {
-      return (*this)(PlaceKey{node->parent_, node->name_});
-    }
-    std::size_t operator()(const PlaceKey& key) const {
+  struct ByPlace {
+    static std::size_t hash(const PlaceKey& key) {
       return std::hash<std::string_view>()(key.name) * 31 + std::hash<const void*>()(key.folder);
     }
-  };
-  struct SamePlace {
-    using is_transparent = void;
-    bool operator()(const Node* a, const Node* b) const { return a == b; }
-    bool operator()(const PlaceKey& key, const Node* node) const {
-      return node->parent_ == key.folder && node->name_ == key.name;
+    static std::size_t hash(const Node& node) {
+      return hash(PlaceKey{node.parent_, node.name_.view()});
     }
-    bool operator()(const Node* node, const PlaceKey& key) const { return (*this)(key, node); }
+    static bool isSame(const Node& node, const PlaceKey& key) {
+      return node.parent_ == key.folder && node.name_ == key.name;
+    }
+  };
+  struct ByInode {
+    static std::uint64_t hash(std::uint64_t inode) { return inode; }
+    static std::uint64_t hash(const Node& node) { return node.identity.inode; }
+    static bool isSame(const Node& node, std::uint64_t inode) {
+      return node.identity.inode == inode;
+    }
   };
 
   Node* at(const Node& folder, std::string_view name) const REQUIRES(mutex_);
   void place(Node& node, Node& folder, std::string_view name) REQUIRES(mutex_);
   void unplace(Node& node) REQUIRES(mutex_);
-  void remove(Node& node, SharedDescriptor remains) REQUIRES(mutex_);
+  void noteWatchedBelow() REQUIRES(mutex_);
+  void remove(const Entry& entry, Remains remains) REQUIRES(mutex_);
+  void endOldestNamed() REQUIRES(mutex_);
+  void endRemains(const Node& node) REQUIRES(mutex_);
   static void note(Node& node, std::int64_t change);
   void breakCycle(const Node& node, Node& folder) REQUIRES(mutex_);
   void endUse(Node& node) REQUIRES(mutex_);
@@ -197,9 +224,13 @@ class NodeTable {
 
   std::shared_mutex moving_;
   mutable Mutex mutex_;
-  std::unordered_map<std::uint64_t, Node*> byInode_ GUARDED_BY(mutex_);
-  std::unordered_set<Node*, HashPlace, SamePlace> byPlace_ GUARDED_BY(mutex_);
+  /// Of several nodes with one inode number, the one that was made last.
+  LinkedTable<Node, &Node::nextByInode_, ByInode> byInode_ GUARDED_BY(mutex_);
+  LinkedTable<Node, &Node::nextByPlace_, ByPlace> byPlace_ GUARDED_BY(mutex_);
   std::unordered_set<Node*> unplaced_ GUARDED_BY(mutex_);  ///< bases, and what was removed
+  std::unordered_map<const Node*, SharedDescriptor> remains_ GUARDED_BY(mutex_);
+  /// Those of files with other names, the oldest first; some may have ended.
+  std::deque<std::pair<const Node*, std::weak_ptr<const FileDescriptor>>> named_ GUARDED_BY(mutex_);
   /// Of nodes that are gone. Closing them may free what they took on the disk: not under the lock.
   std::vector<SharedDescriptor> ended_ GUARDED_BY(mutex_);
 };

@@ -1,8 +1,10 @@
 #include "mount/node_table.h"
 
 #include <gtest/gtest.h>
+#include <malloc.h>
 
-#include "mount/open_files.h"
+#include <string>
+#include <vector>
 
 namespace yomber {
 namespace {
@@ -23,6 +25,9 @@ class NodeTableTest : public ::testing::Test {
   }
   Node& file(Node& above, const char* name, std::uint64_t inode) {
     return nodes_.found(above, name, statusOf(inode));
+  }
+  NodeTable::Entry entry(Node& folder, std::string_view name) {
+    return {.folder = folder, .name = name, .node = nodes_.inPlace(folder, name).get()};
   }
   /// "a/b/c"; "gone" when it has no place.
   std::string wayTo(const Node& node) {
@@ -86,23 +91,46 @@ TEST_F(NodeTableTest, AMoveTakesWhatIsBelowAlong) {
   Node& d = folder(root_, "d", 10);
   Node& a = file(d, "a", 11);
   Node& e = folder(root_, "e", 12);
-  nodes_.moved(root_, "d", e, "moved", false);
+  nodes_.moved(entry(root_, "d"), entry(e, "moved"), false);
   EXPECT_EQ(wayTo(a), "e/moved/a");
 }
 
 TEST_F(NodeTableTest, WhatAMoveReplacesIsGone) {
   Node& a = file(root_, "a", 10);
   Node& b = file(root_, "b", 11);
-  nodes_.moved(root_, "a", root_, "b", false);
+  nodes_.moved(entry(root_, "a"), entry(root_, "b"), false);
   EXPECT_EQ(wayTo(a), "b");
   EXPECT_EQ(wayTo(b), "gone");
+}
+
+TEST_F(NodeTableTest, WhoLooksWhereAFileWasMovedBeforeThatIsToldTakesNothingFromIt) {
+  Node& a = file(root_, "a", 10);
+  Node& b = file(root_, "b", 11);
+  const auto remains = std::make_shared<const FileDescriptor>();
+  const auto from = entry(root_, "a");
+  const auto to = entry(root_, "b");
+  file(root_, "b", 10);
+  nodes_.moved(from, to, false, {.descriptor = remains});
+  EXPECT_EQ(wayTo(a), "b");
+  EXPECT_EQ(nodes_.remains(a), nullptr);
+  EXPECT_EQ(wayTo(b), "gone");
+  EXPECT_EQ(nodes_.remains(b), remains);
+}
+
+TEST_F(NodeTableTest, AFileThatWasFoundUnderAnotherNameMeanwhileKeepsThat) {
+  Node& a = file(root_, "a", 10);
+  const auto removed = entry(root_, "a");
+  file(root_, "b", 10);
+  nodes_.removed(removed, {.descriptor = std::make_shared<const FileDescriptor>()});
+  EXPECT_EQ(wayTo(a), "b");
+  EXPECT_EQ(nodes_.remains(a), nullptr);
 }
 
 TEST_F(NodeTableTest, AnExchangeChangesPlaces) {
   Node& a = file(root_, "a", 10);
   Node& d = folder(root_, "d", 11);
   Node& b = file(d, "b", 12);
-  nodes_.moved(root_, "a", d, "b", true);
+  nodes_.moved(entry(root_, "a"), entry(d, "b"), true);
   EXPECT_EQ(wayTo(a), "d/b");
   EXPECT_EQ(wayTo(b), "a");
 }
@@ -120,15 +148,27 @@ TEST_F(NodeTableTest, FoldersThatHaveChangedPlacesBehindOurBackMakeNoCycle) {
 TEST_F(NodeTableTest, AFolderThatIsRenamedToOneThatNobodyWatchesIsUnwatched) {
   Node& d = folder(root_, "build", 10);
   EXPECT_FALSE(d.isUnwatched);
-  nodes_.moved(root_, "build", root_, "build.nosync", false);
+  nodes_.moved(entry(root_, "build"), entry(root_, "build.nosync"), false);
   EXPECT_TRUE(d.isUnwatched);
   EXPECT_TRUE(folder(d, "sub", 11).isUnwatched);
+}
+
+TEST_F(NodeTableTest, WhatIsBelowAFolderIsWatchedOrNotAsTheFolderIs) {
+  Node& d = folder(root_, "d", 10);
+  Node& sub = folder(d, "sub", 11);
+  Node& deep = folder(sub, "deep", 12);
+  Node& other = folder(root_, "other", 13);
+  nodes_.moved(entry(root_, "d"), entry(root_, "d.part"), false);
+  for (const Node* each : {&d, &sub, &deep}) EXPECT_TRUE(each->isUnwatched);
+  EXPECT_FALSE(other.isUnwatched);
+  nodes_.moved(entry(root_, "d.part"), entry(root_, "d"), false);
+  for (const Node* each : {&d, &sub, &deep}) EXPECT_FALSE(each->isUnwatched);
 }
 
 TEST_F(NodeTableTest, AMoveOfOneNameOfAFileToAnotherChangesNothing) {
   Node& a = file(root_, "a", 10);
   EXPECT_EQ(&file(root_, "b", 10), &a);
-  nodes_.moved(root_, "b", root_, "b", false);
+  nodes_.moved(entry(root_, "b"), entry(root_, "b"), false);
   EXPECT_EQ(wayTo(a), "b");
 }
 
@@ -136,7 +176,7 @@ TEST_F(NodeTableTest, AFileWithTwoNamesIsReachedByTheOneThatWasFoundLast) {
   Node& a = file(root_, "a", 10);
   EXPECT_EQ(&file(root_, "b", 10), &a);
   EXPECT_EQ(wayTo(a), "b");
-  nodes_.removed(root_, "b");
+  nodes_.removed(entry(root_, "b"));
   EXPECT_EQ(wayTo(a), "gone");
   EXPECT_EQ(&file(root_, "a", 10), &a);
   EXPECT_EQ(wayTo(a), "a");
@@ -147,7 +187,7 @@ TEST_F(NodeTableTest, WhatIsInUseStaysAlthoughItIsForgotten) {
   {
     const NodeUse use = nodes_.use(a);
     nodes_.forget(a, 1);
-    nodes_.removed(root_, "a");
+    nodes_.removed(entry(root_, "a"));
     EXPECT_EQ(use->identity.inode, 10U);
     EXPECT_EQ(nodes_.size(), 2U);
   }
@@ -174,7 +214,7 @@ TEST_F(NodeTableTest, RemembersWhatTheKernelWasTold) {
 TEST_F(NodeTableTest, WhatIsLeftOfARemovedFileIsKeptUntilTheKernelForgetsIt) {
   Node& a = file(root_, "a", 10);
   const auto remains = std::make_shared<const FileDescriptor>();
-  nodes_.removed(root_, "a", remains);
+  nodes_.removed(entry(root_, "a"), {.descriptor = remains});
   EXPECT_EQ(nodes_.remains(a), remains);
   EXPECT_EQ(remains.use_count(), 2);
   nodes_.forget(a, 1);
@@ -184,19 +224,96 @@ TEST_F(NodeTableTest, WhatIsLeftOfARemovedFileIsKeptUntilTheKernelForgetsIt) {
 TEST_F(NodeTableTest, AFileThatHasAnotherNameNeedsNoRemains) {
   Node& a = file(root_, "a", 10);
   const auto remains = std::make_shared<const FileDescriptor>();
-  nodes_.removed(root_, "a", remains);
+  nodes_.removed(entry(root_, "a"), {.descriptor = remains});
   EXPECT_EQ(&file(root_, "b", 10), &a);
   EXPECT_EQ(nodes_.remains(a), nullptr);
   nodes_.forget(a, 2);
   EXPECT_EQ(remains.use_count(), 1);
 }
 
+TEST_F(NodeTableTest, OfFilesThatHaveOtherNamesTheLastRemainsAreKept) {
+  const auto gone = std::make_shared<const FileDescriptor>();
+  Node& removed = file(root_, "removed", 9);
+  nodes_.removed(entry(root_, "removed"), {.descriptor = gone});
+  std::vector<Node*> named;
+  for (std::uint64_t i = 0; i <= NodeTable::kNamedKept; ++i) {
+    named.push_back(&file(root_, "a", 10 + i));
+    nodes_.removed(entry(root_, "a"),
+                   {.descriptor = std::make_shared<const FileDescriptor>(), .hasOtherNames = true});
+  }
+  EXPECT_EQ(nodes_.remains(*named.front()), nullptr);
+  EXPECT_NE(nodes_.remains(*named.at(1)), nullptr);
+  EXPECT_NE(nodes_.remains(*named.back()), nullptr);
+  EXPECT_EQ(nodes_.remains(removed), gone) << "it has no other name";
+}
+
+TEST_F(NodeTableTest, RemainsThatHaveEndedTakeNoOthersAlong) {
+  const auto replace = [this](std::uint64_t inode) {
+    nodes_.removed(entry(root_, "a"),
+                   {.descriptor = std::make_shared<const FileDescriptor>(), .hasOtherNames = true});
+    return &file(root_, "a", inode);
+  };
+  Node& first = file(root_, "a", 10);
+  replace(10);  // found again
+  const auto gone = std::make_shared<const FileDescriptor>();
+  nodes_.removed(entry(root_, "a"), {.descriptor = gone});
+  file(root_, "a", 11);
+  for (std::uint64_t i = 0; i <= NodeTable::kNamedKept; ++i) replace(12 + i);
+  EXPECT_EQ(nodes_.remains(first), gone);
+}
+
 TEST_F(NodeTableTest, WhatIsReplacedByAMoveLeavesRemainsToo) {
   file(root_, "a", 10);
   Node& b = file(root_, "b", 11);
   const auto remains = std::make_shared<const FileDescriptor>();
-  nodes_.moved(root_, "a", root_, "b", false, remains);
+  nodes_.moved(entry(root_, "a"), entry(root_, "b"), false, {.descriptor = remains});
   EXPECT_EQ(nodes_.remains(b), remains);
+}
+
+TEST_F(NodeTableTest, NamesOfAnyLengthAreFoundAsTheyWereGiven) {
+  const std::string longest(255, 'n');
+  for (std::size_t length = 1; length <= longest.size(); ++length) {
+    const std::string name = longest.substr(0, length);
+    Node& node = file(root_, name.c_str(), 1000 + length);
+    EXPECT_EQ(wayTo(node), name);
+    EXPECT_EQ(nodes_.inPlace(root_, name).get(), &node);
+  }
+  nodes_.moved(entry(root_, longest), entry(root_, "short"), false);
+  nodes_.moved(entry(root_, "n"), entry(root_, longest + longest), false);
+  EXPECT_EQ(nodes_.inPlace(root_, "short")->identity.inode, 1255U);
+  EXPECT_EQ(nodes_.inPlace(root_, longest + longest)->identity.inode, 1001U);
+  EXPECT_EQ(nodes_.inPlace(root_, "n").get(), nullptr);
+}
+
+TEST_F(NodeTableTest, ManyAreFoundUntilTheyAreForgotten) {
+  constexpr std::uint64_t kMany = 10'000;
+  std::vector<Node*> made;
+  for (std::uint64_t i = 0; i < kMany; ++i) {
+    made.push_back(&file(root_, std::to_string(i).c_str(), 1000 + 4096 * i));
+  }
+  EXPECT_EQ(nodes_.all().size(), kMany + 1);
+  for (std::uint64_t i = 0; i < kMany; i += 2) nodes_.forget(*made[i], 1);
+  EXPECT_EQ(nodes_.size(), kMany / 2 + 1);
+  for (std::uint64_t i = 0; i < kMany; ++i) {
+    Node* const kept = i % 2 == 0 ? nullptr : made[i];
+    EXPECT_EQ(nodes_.byInode(1000 + 4096 * i).get(), kept);
+    EXPECT_EQ(nodes_.inPlace(root_, std::to_string(i)).get(), kept);
+  }
+}
+
+TEST_F(NodeTableTest, ANodeTakesLittleMemory) {
+  const auto allocated = [] {
+    const struct mallinfo2 info = mallinfo2();
+    return info.uordblks + info.hblkhd;
+  };
+  constexpr std::size_t kMany = 100'000;
+  const std::size_t before = allocated();
+  for (std::size_t i = 0; i < kMany; ++i) {
+    file(root_, ("IMG_" + std::to_string(i) + ".jpg").c_str(), 1000 + i);
+  }
+  const std::size_t taken = allocated() - before;
+  if (taken == 0) GTEST_SKIP() << "this heap does not say what it has allocated";
+  EXPECT_LE(taken / kMany, 128U);
 }
 
 }  // namespace

@@ -24,11 +24,19 @@ bool isLeased(int failure) { return failure == EWOULDBLOCK; }
 
 }  // namespace
 
+bool isToBeSettled(int descriptor) {
+  return fgetxattr(descriptor, kFaultAttribute, nullptr, 0) >= 0;
+}
+
 int settleForWriting(int descriptor) {
-  if (fgetxattr(descriptor, kFaultAttribute, nullptr, 0) < 0) return 0;
+  if (!isToBeSettled(descriptor)) return 0;
   if (fdatasync(descriptor) != 0) return errno;
   takeMarksOff(descriptor);
   return 0;
+}
+
+bool isBeingChanged(int descriptor) {
+  return readAttribute(descriptor, kHeldDateAttribute, nullptr, 0) >= 0;
 }
 
 void takeMarksOff(int descriptor) {
@@ -50,7 +58,7 @@ OpenFile::~OpenFile() {
 
 bool OpenFile::isWritable() const { return (flags_ & O_ACCMODE) != O_RDONLY; }
 
-int OpenFile::openContent() {
+int OpenFile::openContent(bool mayWaitForDisk) {
   LockGuard guard(mutex_);
   if (content() >= 0) return 0;
   if (isFault(place_.get())) return EAGAIN;  // whoever is filling it is to be alone with it
@@ -58,8 +66,10 @@ int OpenFile::openContent() {
   FileDescriptor opened(::open(pathOfDescriptor(place_.get()).c_str(), flags_ | flags));
   if (!opened) return errno;  // EAGAIN: leased
   if (isFault(opened.get())) return EAGAIN;
-  if (const int failure = isWritable() ? settleForWriting(opened.get()) : 0; failure != 0)
-    return failure;
+  if (isWritable() && isToBeSettled(opened.get())) {
+    if (!mayWaitForDisk) return EINPROGRESS;
+    if (const int failure = settleForWriting(opened.get()); failure != 0) return failure;
+  }
   content_.store(opened.release(), std::memory_order_release);
   return 0;
 }
@@ -71,7 +81,7 @@ ssize_t OpenFile::readKept(void* bytes, std::size_t size, off_t offset) const {
   const auto start = static_cast<std::uint64_t>(offset);
   const auto whole = static_cast<std::uint64_t>(status.st_size);
   const std::uint64_t kept = std::min(whole, kKeptBytes);
-  if (std::min(start + size, whole) > kept) {
+  if (std::min(start + size, whole) > kept || isBeingChanged(place_.get())) {
     errno = EAGAIN;
     return -1;
   }
@@ -85,9 +95,8 @@ namespace {
 
 int openEither(int folder, const char* name, int flags, int ownFlags, FileDescriptor& content,
                FileDescriptor& place) {
-  const bool isForWriting = (flags & O_ACCMODE) != O_RDONLY;
   content = FileDescriptor(openat(folder, name, (flags & kKeptFlags) | ownFlags));
-  if (content && !isFault(content.get())) return isForWriting ? settleForWriting(content.get()) : 0;
+  if (content && !isFault(content.get())) return 0;
   if (!content && !isLeased(errno)) return errno;
   content = FileDescriptor();
   place = FileDescriptor(openat(folder, name, O_PATH | (ownFlags & O_NOFOLLOW) | O_CLOEXEC));
@@ -121,18 +130,18 @@ std::shared_ptr<OpenFile> OpenFiles::add(NodeTable& nodes, Node& node, int flags
   auto file =
       std::make_shared<OpenFile>(nodes.use(node), flags, std::move(content), std::move(place));
   LockGuard guard(mutex_);
-  if (!node.files_) node.files_ = std::make_unique<NodeFiles>();
-  auto& files = node.files_->files;
+  OfNode& all = open_[&node];
+  auto& files = all.files;
   const bool isDirect = std::any_of(files.begin(), files.end(), [](const auto& other) {
     return other->way == OpenFile::Way::Direct;
   });
-  const bool isBacked = node.files_->backing != 0;
+  const bool isBacked = all.backing != 0;
   file->way = isDirect && !isBacked ? OpenFile::Way::Direct : wanted;
   if (isBacked) file->way = OpenFile::Way::PassThrough;
   if (file->content() < 0) file->way = OpenFile::Way::Direct;
   if (file->way == OpenFile::Way::PassThrough && !isBacked) {
-    node.files_->backing = backing_.open(file->content());
-    if (node.files_->backing == 0) file->way = OpenFile::Way::Direct;
+    all.backing = backing_.open(file->content());
+    if (all.backing == 0) file->way = OpenFile::Way::Direct;
   }
   files.push_back(file);
   return file;
@@ -141,29 +150,33 @@ std::shared_ptr<OpenFile> OpenFiles::add(NodeTable& nodes, Node& node, int flags
 void OpenFiles::remove(OpenFile& file) {
   std::shared_ptr<OpenFile> removed;  // ends after the lock: it lets go of its node
   LockGuard guard(mutex_);
-  auto& files = file.node().files_->files;
+  const auto known = open_.find(&file.node());
+  if (known == open_.end()) return;
+  OfNode& all = known->second;
+  auto& files = all.files;
   const auto found = std::find_if(files.begin(), files.end(),
                                   [&](const auto& other) { return other.get() == &file; });
   if (found == files.end()) return;
   removed = std::move(*found);
   files.erase(found);
-  NodeFiles& all = *file.node().files_;
   const bool isBacked = std::any_of(files.begin(), files.end(), [](const auto& other) {
     return other->way == OpenFile::Way::PassThrough;
   });
   if (!isBacked && all.backing != 0) backing_.close(std::exchange(all.backing, 0));
-  if (files.empty()) file.node().files_.reset();
+  if (files.empty()) open_.erase(known);
 }
 
 int OpenFiles::backingOf(const Node& node) const {
   LockGuard guard(mutex_);
-  return node.files_ ? node.files_->backing : 0;
+  const auto known = open_.find(&node);
+  return known == open_.end() ? 0 : known->second.backing;
 }
 
 std::shared_ptr<OpenFile> OpenFiles::of(const Node& node) const {
   LockGuard guard(mutex_);
-  if (!node.files_) return nullptr;
-  const auto& files = node.files_->files;
+  const auto known = open_.find(&node);
+  if (known == open_.end()) return nullptr;
+  const auto& files = known->second.files;
   const auto found = std::find_if(files.begin(), files.end(),
                                   [](const auto& file) { return file->content() >= 0; });
   return found != files.end() ? *found : files.front();
@@ -171,15 +184,18 @@ std::shared_ptr<OpenFile> OpenFiles::of(const Node& node) const {
 
 bool OpenFiles::mayWaitForContent(const Node& node) const {
   LockGuard guard(mutex_);
-  if (!node.files_) return false;
-  const auto& files = node.files_->files;
+  const auto known = open_.find(&node);
+  if (known == open_.end()) return false;
+  const auto& files = known->second.files;
   return std::any_of(files.begin(), files.end(),
                      [](const auto& file) { return file->content() < 0; });
 }
 
 std::shared_ptr<OpenFile> OpenFiles::shared(const OpenFile& file) const {
   LockGuard guard(mutex_);
-  for (const auto& other : file.node().files_->files) {
+  const auto known = open_.find(&file.node());
+  if (known == open_.end()) return nullptr;
+  for (const auto& other : known->second.files) {
     if (other.get() == &file) return other;
   }
   return nullptr;

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <unordered_map>
 #include <utility>
 #include <vector>
 
@@ -38,14 +39,15 @@ class OpenFile {
   [[nodiscard]] int any() const { return content() >= 0 ? content() : place_.get(); }
 
   /// Opens the content, which is said to be here. 0 or an errno: EAGAIN when it is still, or again,
-  /// away.
-  [[nodiscard]] int openContent();
+  /// away; EINPROGRESS when it has to be settled first and `mayWaitForDisk` is false.
+  [[nodiscard]] int openContent(bool mayWaitForDisk);
   /// The first bytes of an evicted file, which it keeps; -1 and an errno (EAGAIN when they are not
-  /// to be had).
+  /// to be had, or its content is coming).
   [[nodiscard]] ssize_t readKept(void* bytes, std::size_t size, off_t offset) const;
 
   Way way = Way::Direct;              ///< set before others see the file
   std::int64_t changeWhenOpened = 0;  ///< ctime, ns
+  std::uint64_t bytesWhenOpened = 0;  ///< of disk blocks
 
  private:
   const NodeUse node_;
@@ -56,8 +58,8 @@ class OpenFile {
 };
 
 /// Opens a file in its folder without ever waiting for anybody: `content` where the content is
-/// here, else `place`. Never truncates. 0 or an errno. `mayBeAway`: then it is looked at first,
-/// since an open, however short, disturbs whoever is filling the file.
+/// here, else `place`. Never truncates, never settles. 0 or an errno. `mayBeAway`: then it is
+/// looked at first, since an open, however short, disturbs whoever is filling the file.
 [[nodiscard]] int openInPlace(int folder, const char* name, int flags, bool mayBeAway,
                               FileDescriptor& content, FileDescriptor& place);
 
@@ -67,8 +69,12 @@ class OpenFile {
 
 /// Content that has just come is marked until it is on the disk: should the power go, it is brought
 /// again. What is written to it must not be taken for that, so it is made durable, and the marks
-/// go, before. 0 or an errno.
+/// go, before. 0 or an errno. May wait for the disk, when there is something to settle.
 [[nodiscard]] int settleForWriting(int descriptor);
+/// Whether somebody is filling the file, or giving its content up: an open, however short, would
+/// disturb him. `descriptor` may be of its place.
+[[nodiscard]] bool isBeingChanged(int descriptor);
+[[nodiscard]] bool isToBeSettled(int descriptor);
 /// Of a file whose old content nobody wants any more.
 void takeMarksOff(int descriptor);
 
@@ -97,15 +103,15 @@ class OpenFiles {
   [[nodiscard]] std::shared_ptr<OpenFile> shared(const OpenFile& file) const;
 
  private:
-  const Backing backing_;
-  mutable Mutex mutex_;  // also guards Node::files_
-};
+  /// Those of one node.
+  struct OfNode {
+    std::vector<std::shared_ptr<OpenFile>> files;
+    int backing = 0;  ///< one for all who have it open: the kernel mixes no two
+  };
 
-/// OpenFiles' own.
-class NodeFiles {
- public:
-  std::vector<std::shared_ptr<OpenFile>> files;
-  int backing = 0;  ///< one for all who have it open: the kernel mixes no two
+  const Backing backing_;
+  mutable Mutex mutex_;
+  std::unordered_map<const Node*, OfNode> open_ GUARDED_BY(mutex_);
 };
 
 }  // namespace yomber

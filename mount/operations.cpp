@@ -20,12 +20,18 @@ struct OnNode<method> {
   }
 };
 
-void begin(void* /*session*/, fuse_conn_info* connection) {
+/// The first version of the protocol whose kernels ask for as much of a folder as its reader has
+/// room for: before, a page at a time, which room for attributes that are not told makes several.
+constexpr unsigned kAsksForMuch = 44;
+
+void begin(void* session, fuse_conn_info* connection) {
   constexpr unsigned kWanted = FUSE_CAP_PARALLEL_DIROPS | FUSE_CAP_CACHE_SYMLINKS |
-                               FUSE_CAP_READDIRPLUS | FUSE_CAP_READDIRPLUS_AUTO |
-                               FUSE_CAP_AUTO_INVAL_DATA | FUSE_CAP_ATOMIC_O_TRUNC |
-                               FUSE_CAP_ASYNC_READ | FUSE_CAP_EXPIRE_ONLY;
-  connection->want = kWanted & connection->capable;
+                               FUSE_CAP_READDIRPLUS | FUSE_CAP_AUTO_INVAL_DATA |
+                               FUSE_CAP_ATOMIC_O_TRUNC | FUSE_CAP_ASYNC_READ | FUSE_CAP_EXPIRE_ONLY;
+  const bool isOurChoice = connection->proto_minor >= kAsksForMuch;
+  static_cast<KernelSession*>(session)->files().setChoosesAttributes(isOurChoice);
+  const unsigned itsChoice = isOurChoice ? 0 : FUSE_CAP_READDIRPLUS_AUTO;
+  connection->want = (kWanted | itsChoice) & connection->capable;
   connection->time_gran = 1;
   // Requests that wait for content must not hold up those that do not.
   constexpr unsigned kWaiting = 1024;

@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <system_error>
 #include <utility>
 
 namespace yomber {
@@ -91,10 +92,14 @@ void RequestLoop::takeTurn() {
   if (idle_ == 0) addThread();
 }
 
-/// Somebody has to be there to take the turn next.
+/// Somebody has to be there to take the turn next. Where the system has no more threads, that is
+/// whoever has answered.
 void RequestLoop::addThread() {
   if (isOver_ || others_.size() + 1 >= mostThreads_) return;
-  others_.emplace_back([this] { work(); });
+  try {
+    others_.emplace_back([this] { work(); });
+  } catch (const std::system_error&) {
+  }
 }
 
 /// Until the turn is vacant. Sleeps while nothing is asked; looks every moment while something is.

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <array>
@@ -128,6 +129,34 @@ TEST_F(RequestLoopTest, ADeviceThatFailsEndsItWithTheReason) {
                           .mayTakeLong = [](const fuse_buf&) { return false; }},
       kThreads);
   EXPECT_EQ(loop_->run(), EIO);
+}
+
+/// In a process of its own, for which the system makes no threads any more.
+[[noreturn]] void answerAlone(unsigned mostThreads) {
+  const rlimit none{.rlim_cur = 0, .rlim_max = 0};
+  constexpr uid_t kNobody = 65534;
+  if (setrlimit(RLIMIT_NPROC, &none) != 0 || (geteuid() == 0 && setuid(kNobody) != 0)) _exit(1);
+  const std::string requests = "sLsLLs";
+  std::size_t next = 0;
+  std::string answered;
+  RequestLoop loop(
+      {.device = -1,
+       .receive =
+           [&](fuse_buf& buffer) {
+             if (next == requests.size()) return 0;
+             if (buffer.mem == nullptr) buffer.mem = malloc(1);
+             *static_cast<char*>(buffer.mem) = requests[next++];
+             return 1;
+           },
+       .answer = [&](const fuse_buf& buffer) { answered += *static_cast<char*>(buffer.mem); },
+       .mayTakeLong =
+           [](const fuse_buf& buffer) { return *static_cast<char*>(buffer.mem) == 'L'; }},
+      mostThreads);
+  _exit(loop.run() == 0 && answered == requests ? 0 : 3);
+}
+
+TEST_F(RequestLoopTest, WhereThereAreNoMoreThreadsOneAnswersAll) {
+  EXPECT_EXIT(answerAlone(kThreads), ::testing::ExitedWithCode(0), "");
 }
 
 }  // namespace

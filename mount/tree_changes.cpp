@@ -1,11 +1,13 @@
 #include "mount/tree_changes.h"
 
+#include <algorithm>
 #include <chrono>
 #include <set>
 #include <utility>
 #include <vector>
 
 #include "platform/fileprovider/item_codec.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/connection.h"
@@ -15,6 +17,8 @@
 
 namespace yomber {
 namespace {
+
+FaultPoint changeTold("mount.change.told");
 
 constexpr std::chrono::milliseconds kBetweenAttempts{300};
 
@@ -110,9 +114,16 @@ struct TreeChanges::Link {
   bool isEnding GUARDED_BY(applying) = false;
   std::uint64_t connection GUARDED_BY(applying) = 0;
 
+  /// The connection has ended, or nobody tells anything over it any more.
+  void lose(std::uint64_t from) {
+    LockGuard guard(mutex);
+    lost = std::max(lost, from);
+    changed.notifyAll();
+  }
+
   Mutex mutex;
   Condition changed;
-  bool isLost GUARDED_BY(mutex) = false;
+  std::uint64_t lost GUARDED_BY(mutex) = 0;  ///< the last connection that is
   bool isOver GUARDED_BY(mutex) = false;
 };
 
@@ -124,6 +135,10 @@ class ObserverServer final : public protocol::TreeObserver::Server {
  public:
   ObserverServer(std::shared_ptr<Link> link, std::uint64_t connection)
       : link_(std::move(link)), connection_(connection) {}
+  /// The daemon has let go of it.
+  ~ObserverServer() noexcept(false) { link_->lose(connection_); }
+  ObserverServer(const ObserverServer&) = delete;
+  ObserverServer& operator=(const ObserverServer&) = delete;
 
   kj::Promise<void> didStart(DidStartContext context) override {
     auto names = decoded(context.getParams().getShownNames());
@@ -131,6 +146,10 @@ class ObserverServer final : public protocol::TreeObserver::Server {
                            const ipc::CancelFlag&) { link->start(from, names); });
   }
   kj::Promise<void> didChange(DidChangeContext context) override {
+    if (changeTold.hit()) {
+      return kj::Exception(kj::Exception::Type::FAILED, __FILE__, __LINE__,
+                           kj::str("changes are not taken"));
+    }
     auto entries = decoded(context.getParams().getEntries());
     auto names = decoded(context.getParams().getShownNames());
     return ipc::onPool(
@@ -182,15 +201,7 @@ bool TreeChanges::follow(std::uint64_t number) {
   NSErrorRef error;
   const auto connection = ipc::Connection::connect(daemonSocket_, &error);
   if (!connection) return false;
-  {
-    LockGuard guard(link_->mutex);
-    link_->isLost = false;
-  }
-  connection->onDisconnect([link = link_](const NSErrorRef&) {
-    LockGuard guard(link->mutex);
-    link->isLost = true;
-    link->changed.notifyAll();
-  });
+  connection->onDisconnect([link = link_, number](const NSErrorRef&) { link->lose(number); });
   ipc::Remote<protocol::Registration> registration;
   error = ipc::callAndWait(
       connection->bootstrap<protocol::Daemon>(), &protocol::Daemon::Client::observeTreeRequest,
@@ -203,7 +214,7 @@ bool TreeChanges::follow(std::uint64_t number) {
     return false;
   }
   LockGuard guard(link_->mutex);
-  while (!link_->isLost && !link_->isOver) link_->changed.wait(link_->mutex);
+  while (link_->lost < number && !link_->isOver) link_->changed.wait(link_->mutex);
   return true;
 }
 

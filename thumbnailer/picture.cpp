@@ -24,6 +24,8 @@ using vips::VSource;
 constexpr int kQuality = 85;  // of JPEG: no difference to be seen at this size
 constexpr int kCompression = 6;
 constexpr double kOpaque = 255;
+/// One decodes, which nothing can do in parts, while another shrinks what there is.
+constexpr int kThreads = 2;
 
 /// What libvips may read; everything else that it knows is blocked.
 constexpr const char* kLoaders[] = {
@@ -174,7 +176,7 @@ void drawWritten(const VImage& image, const char* suffix) {
 
 bool prepare() {
   if (vips_init("yomber-thumbnailer") != 0) return false;
-  vips_concurrency_set(1);
+  vips_concurrency_set(std::min(vips_concurrency_get(), kThreads));
   vips_cache_set_max(0);
   vips_operation_block_set("VipsForeignLoad", TRUE);
   for (const char* loader : kLoaders) vips_operation_block_set(loader, FALSE);

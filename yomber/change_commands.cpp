@@ -1,5 +1,6 @@
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <filesystem>
 #include <functional>
 #include <iostream>
@@ -11,6 +12,7 @@
 
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/staging_folder.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/file_manager.h"
 #include "platform/foundation/lock.h"
 #include "platform/foundation/tree_copy.h"
@@ -99,18 +101,40 @@ std::string absolutePath(const std::string& given) {
   return path.has_filename() ? path.string() : path.parent_path().string();
 }
 
-/// Imports `source` under another name, through a copy that has it.
-ChangeResult importAs(const DriveChanges& changes, const DrivePaths& paths,
-                      const std::string& source, const std::string& name,
-                      const std::string& parent) {
-  const auto staging = StagingFolder::make(paths.privateDirectory);
-  if (!staging) return {std::nullopt, NSError::errorWithErrno(errno, paths.privateDirectory)};
-  const std::string copy = staging->path() + "/" + name;
-  if (NSErrorRef error = TreeCopy(TreeCopy::Identity::New).run(source, copy)) {
-    return {std::nullopt, error};
+/// Something of this machine under other names than its own: one copy of it, which is given one
+/// name after the other.
+class OtherNames {
+ public:
+  OtherNames(std::string folder, std::string source)
+      : folder_(std::move(folder)), source_(std::move(source)) {}
+
+  /// `path` is that of the copy, which goes with this object.
+  NSErrorRef give(const std::string& name, std::string& path) {
+    if (!staging_) staging_ = StagingFolder::make(folder_);
+    if (!staging_) return NSError::errorWithErrno(errno, folder_);
+    path = staging_->path() + "/" + name;
+    if (NSErrorRef error = copy_.empty() ? makeCopy(path) : renameCopy(path)) return error;
+    copy_ = path;
+    return nullptr;
   }
-  return changes.importDocument(copy, parent);
-}
+
+ private:
+  NSErrorRef makeCopy(const std::string& path) const {
+    static FaultPoint copied("yomber.put.copied");
+    if (NSErrorRef error = TreeCopy(TreeCopy::Identity::New).run(source_, path)) return error;
+    (void)copied.hit();
+    return nullptr;
+  }
+  NSErrorRef renameCopy(const std::string& path) const {
+    if (rename(copy_.c_str(), path.c_str()) == 0) return nullptr;
+    return NSError::errorWithErrno(errno, path);
+  }
+
+  const std::string folder_;
+  const std::string source_;
+  std::unique_ptr<StagingFolder> staging_;
+  std::string copy_;  ///< empty: there is none yet
+};
 
 /// False, and said so, when there is no such folder to put something into.
 bool identifyTarget(ChangeRun& run, const std::string& target, std::string& identifier) {
@@ -144,9 +168,12 @@ void runPut(CommandContext& context, const ChangeOptions& given) {
   sideBySide(options.arguments.size(), atATime, [&](std::size_t index) {
     const std::string source = absolutePath(options.arguments[index]);
     const std::string own = NSURL(source).lastPathComponent();
-    const auto attempt = [&](const std::string& name) {
-      return name == own ? run.changes->importDocument(source, parent)
-                         : importAs(*run.changes, paths, source, name, parent);
+    OtherNames others(paths.privateDirectory, source);
+    const auto attempt = [&](const std::string& name) -> ChangeResult {
+      std::string path = source;
+      const NSErrorRef error = name == own ? nullptr : others.give(name, path);
+      if (error) return {std::nullopt, error};
+      return run.changes->importDocument(path, parent);
     };
     run.report(changeWithPolicy(*run.changes, options.clashes, own, attempt), own);
   });

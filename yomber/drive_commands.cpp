@@ -104,7 +104,8 @@ void runUp(CommandContext& context, const UpOptions& options) {
 void runDown(CommandContext& context) {
   const DrivePaths paths = context.paths();
   bool wasMounted = false;
-  if (NSErrorRef error = unmountDrive(paths, wasMounted)) return context.fail(error);
+  if (NSErrorRef error = unmountDrive(paths, MayBeInUse::Yes, wasMounted))
+    return context.fail(error);
   bool wasUp = false;
   if (NSErrorRef error = endSupervision(supervisorLock(paths), wasUp)) return context.fail(error);
   if (context.json) {

@@ -6,10 +6,13 @@
 
 #include <linux/magic.h>
 #include <poll.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/vfs.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include "yomber/mount_users.h"
 #include "yomber/supervisor_process.h"
 
 namespace yomber {
@@ -57,9 +60,33 @@ NSErrorRef checkFolder(const DrivePaths& paths, const std::string& folder) {
     return failure(ENOTEMPTY, folder + " is not empty; what is in it would be hidden");
   }
   if (access("/dev/fuse", R_OK | W_OK) != 0) {
+    if (errno == EACCES) return failure(EACCES, "/dev/fuse is not open to this user");
     return failure(ENODEV, "there is no /dev/fuse; install the package fuse3");
   }
   return nullptr;
+}
+
+/// Takes away what nobody uses, without its process's doing; else EBUSY. 0 or an errno.
+int takeAwayUnused(const std::string& folder) {
+  if (umount2(folder.c_str(), UMOUNT_NOFOLLOW) == 0) return 0;
+  if (errno != EPERM) return errno;
+  const pid_t child = fork();
+  if (child == 0) {
+    execlp("fusermount3", "fusermount3", "-u", "-q", "--", folder.c_str(), nullptr);
+    _exit(127);
+  }
+  int status = 0;
+  if (child < 0 || waitpid(child, &status, 0) != child) return errno;
+  if (status == 0) return 0;
+  return isMounted(folder) ? EBUSY : EINVAL;
+}
+
+NSErrorRef inUse(const std::string& folder) {
+  const std::string users = textOf(usersOfMount(folder));
+  return failure(EBUSY, folder + " is in use" +
+                            (users.empty() ? ", by whom cannot be seen from here" : ": " + users) +
+                            "; close what is open there, or take it away nevertheless with "
+                            "'yomber unmount --lazy'");
 }
 
 }  // namespace
@@ -85,6 +112,7 @@ NSErrorRef mountDrive(const DrivePaths& paths, const MountOptions& options) {
                             .arguments = {programPath("yomber-mount"), "--home", paths.home},
                             .mayEnd = true};
   if (options.allowOthers) program.arguments.emplace_back("--allow-other");
+  if (!options.mayPassThrough) program.arguments.emplace_back("--no-pass-through");
   if (options.keep) {
     program.arguments.insert(program.arguments.end(), {"--keep", std::to_string(*options.keep)});
   }
@@ -98,7 +126,9 @@ NSErrorRef mountDrive(const DrivePaths& paths, const MountOptions& options) {
     if (steady_clock::now() > deadline) {
       bool wasMounted = false;
       // Another command may have mounted it elsewhere meanwhile.
-      if (mountPointOf(paths) == options.folder) (void)unmountDrive(paths, wasMounted);
+      if (mountPointOf(paths) == options.folder) {
+        (void)unmountDrive(paths, MayBeInUse::Yes, wasMounted);
+      }
       return failure(EIO, "the drive could not be mounted; see 'yomber log'");
     }
     poll(nullptr, 0, 10);
@@ -106,8 +136,12 @@ NSErrorRef mountDrive(const DrivePaths& paths, const MountOptions& options) {
   return nullptr;
 }
 
-NSErrorRef unmountDrive(const DrivePaths& paths, bool& wasMounted) {
+NSErrorRef unmountDrive(const DrivePaths& paths, MayBeInUse mayBeInUse, bool& wasMounted) {
+  const auto point = mountPointOf(paths);
+  const int kept = point ? takeAwayUnused(*point) : EINVAL;
+  if (kept == EBUSY && mayBeInUse == MayBeInUse::No) return inUse(*point);
   NSErrorRef failed = endSupervision(lockOf(paths), wasMounted);
+  wasMounted = wasMounted || kept == 0;  // without its mount it ends by itself
   std::error_code error;
   if (!failed) fs::remove(pointOf(paths), error);
   return failed;

@@ -17,12 +17,16 @@ namespace yomber {
 struct MountOptions {
   std::string folder;  ///< absolute
   bool allowOthers = false;
+  bool mayPassThrough = true;         ///< the kernel may read and write what is here by itself
   std::optional<std::uint64_t> keep;  ///< bytes of content on this disk, at most; nothing: any
 };
 /// Returns when the mount can be used. Fails with what to do; the drive is then not mounted.
 [[nodiscard]] NSErrorRef mountDrive(const DrivePaths& paths, const MountOptions& options);
-/// Files that are open through the mount stay as they are on the disk, but cannot be used through
-/// it any more.
-[[nodiscard]] NSErrorRef unmountDrive(const DrivePaths& paths, bool& wasMounted);
+/// Whether a mount is taken away that processes have something open in. That stays as it is on the
+/// disk, but cannot be used through the mount any more.
+enum class MayBeInUse : bool { No, Yes };
+/// Fails with EBUSY, and with who has something open, when it may not be in use but is.
+[[nodiscard]] NSErrorRef unmountDrive(const DrivePaths& paths, MayBeInUse mayBeInUse,
+                                      bool& wasMounted);
 
 }  // namespace yomber

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/fileprovider/services.h"
+#include "platform/foundation/fault_points.h"
 #include "platform/ostrell/daemon_connection.h"
 #include "platform/ostrell/errors.h"
 #include "platform/ostrell/share_operations.h"
@@ -17,10 +18,13 @@ namespace yomber {
 
 namespace {
 
+FaultPoint shareFetched("yomber.share.fetched");
+
 using SharingClient = ServiceClient<QSSharingServiceV1>;
 
-/// How often a change is made anew because others saved in between.
-constexpr int maximumAttempts = 8;
+/// How often something is done anew because others saved in between: each time somebody's change
+/// was saved, so that this is an end only for what never ends.
+constexpr int maximumAttempts = 1000;
 
 std::unique_ptr<SharingClient> openSharing(DriveClient& client,
                                            const NSFileProviderItemIdentifier& identifier,
@@ -81,6 +85,26 @@ NSErrorRef save(SharingClient& service, const RZShareRef& share, RZShareRef& sav
   });
 }
 
+/// Calls `act(service, share)` with the item's own share; anew when somebody else saved it
+/// meanwhile.
+template <typename Act>
+NSErrorRef withShare(DriveClient& client, const NSFileProviderItemIdentifier& identifier,
+                     const Act& act) {
+  NSErrorRef error;
+  for (int attempt = 0; attempt < maximumAttempts; ++attempt) {
+    // A connection keeps the share that it has fetched, so each attempt has one of its own.
+    const auto service = openSharing(client, identifier, error);
+    RZShareRef share;
+    if (service) error = fetchShare(*service, share);
+    if (!error && shareFetched.hit()) error = NSError::errorWithErrno(EIO);
+    if (error) return error;
+    if (!isOwnShare(identifier, *share)) return liesInShare(*share);
+    error = act(*service, *share);
+    if (!rz_isError(error, RZErrorServerRecordChanged)) return error;
+  }
+  return error;
+}
+
 }  // namespace
 
 DriveSharing::DriveSharing(DriveClient& client) : client_(client) {
@@ -111,20 +135,11 @@ NSErrorRef DriveSharing::participants(const NSFileProviderItemIdentifier& identi
 NSErrorRef DriveSharing::change(const NSFileProviderItemIdentifier& identifier,
                                 const std::function<void(RZShare& share)>& change,
                                 RZShareRef& saved) {
-  NSErrorRef error;
-  for (int attempt = 0; attempt < maximumAttempts; ++attempt) {
-    // A connection keeps the share that it has fetched, so each attempt has one of its own.
-    const auto service = openSharing(client_, identifier, error);
-    RZShareRef share;
-    if (service) error = fetchShare(*service, share);
-    if (error) return error;
-    if (!isOwnShare(identifier, *share)) return liesInShare(*share);
-    const auto wanted = std::make_shared<RZShare>(*share);
+  return withShare(client_, identifier, [&](SharingClient& service, const RZShare& share) {
+    const auto wanted = std::make_shared<RZShare>(share);
     change(*wanted);
-    error = save(*service, wanted, saved);
-    if (!rz_isError(error, RZErrorServerRecordChanged)) return error;
-  }
-  return error;
+    return save(service, wanted, saved);
+  });
 }
 
 NSErrorRef DriveSharing::link(const NSFileProviderItemIdentifier& identifier, std::string& url) {
@@ -140,14 +155,10 @@ NSErrorRef DriveSharing::link(const NSFileProviderItemIdentifier& identifier, st
 }
 
 NSErrorRef DriveSharing::stop(const NSFileProviderItemIdentifier& identifier) {
-  NSErrorRef error;
-  const auto service = openSharing(client_, identifier, error);
-  RZShareRef share;
-  if (service) error = fetchShare(*service, share);
-  if (error) return error;
-  if (!isOwnShare(identifier, *share)) return liesInShare(*share);
-  return service->call([](QSSharingServiceV1& item, const SharingClient::Done& done) {
-    (void)item.unshareWithCompletion(done);
+  return withShare(client_, identifier, [](SharingClient& service, const RZShare&) {
+    return service.call([](QSSharingServiceV1& item, const SharingClient::Done& done) {
+      (void)item.unshareWithCompletion(done);
+    });
   });
 }
 

@@ -28,6 +28,7 @@ class DriveSharing {
   NSErrorRef change(const NSFileProviderItemIdentifier& identifier,
                     const std::function<void(RZShare& share)>& change, RZShareRef& saved);
   NSErrorRef link(const NSFileProviderItemIdentifier& identifier, std::string& url);
+  /// Also when somebody else saved the share meanwhile.
   NSErrorRef stop(const NSFileProviderItemIdentifier& identifier);
   NSErrorRef accept(const std::string& url, NSFileProviderItemIdentifier& identifier);
   NSErrorRef sharedWithMe(std::vector<RZShareRef>& shares);

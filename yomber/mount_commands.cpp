@@ -22,10 +22,11 @@ void runMount(CommandContext& context, MountOptions options) {
                 "The drive is shown in " + options.folder);
 }
 
-void runUnmount(CommandContext& context) {
+void runUnmount(CommandContext& context, bool isLazy) {
   const DrivePaths paths = context.paths();
+  const auto mayBeInUse = isLazy ? MayBeInUse::Yes : MayBeInUse::No;
   bool wasMounted = false;
-  if (NSErrorRef error = unmountDrive(paths, wasMounted)) return context.fail(error);
+  if (NSErrorRef error = unmountDrive(paths, mayBeInUse, wasMounted)) return context.fail(error);
   context.print({{"home", paths.home}, {"was_mounted", wasMounted}},
                 wasMounted ? "The drive is not mounted any more." : "The drive was not mounted.");
 }
@@ -45,10 +46,15 @@ void addMountCommands(CLI::App& app, CommandContext& context) {
                    "longest unused first")
       ->transform(CLI::AsSizeValue(false))
       ->type_name("SIZE");
+  mount->add_flag("!--no-pass-through", options->mayPassThrough,
+                  "The kernel reads no file by itself");
   mount->callback([&context, options] { runMount(context, *options); });
 
   CLI::App* unmount = app.add_subcommand("unmount", "Do not show the drive as a folder any more");
-  unmount->callback([&context] { runUnmount(context); });
+  auto isLazy = std::make_shared<bool>(false);
+  unmount->add_flag("--lazy", *isLazy,
+                    "Also when programs have files open there, which they then cannot use");
+  unmount->callback([&context, isLazy] { runUnmount(context, *isLazy); });
 }
 
 }  // namespace yomber

@@ -145,8 +145,13 @@ void Supervisor::reap() {
     const auto child = std::ranges::find(children_, pid, &Child::pid);
     if (child == children_.end()) continue;
     const bool hasSucceeded = WIFEXITED(status) && WEXITSTATUS(status) == 0;
-    isEnding_ = isEnding_ || (hasSucceeded && child->program.mayEnd);
-    scheduleRestart(*child, status);
+    if (hasSucceeded && child->program.mayEnd) {
+      isEnding_ = true;
+      child->pid = 0;
+      log_info(defaultLog(), "[INFO] %s has ended", child->program.name);
+    } else {
+      scheduleRestart(*child, status);
+    }
   }
 }
 

@@ -18,10 +18,12 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include "platform/foundation/descriptor_limit.h"
+#include "platform/foundation/log_sinks.h"
 #include "platform/foundation/sanitized.h"
 #include "platform/foundation/temporary_directory.h"
 #include "platform/ipc/unix_socket.h"
@@ -163,6 +165,15 @@ class ServicesSystem : public ::testing::Test {
     expectAnswered(*noted.ends);
   }
 
+  /// How many lines of the drive's log contain the text.
+  [[nodiscard]] std::size_t linesOfLog(const std::string& text) const {
+    const std::string log = drive_.yomber({"log", "--lines", "100000"}).output;
+    std::size_t count = 0;
+    for (std::size_t at = log.find(text); at != std::string::npos; at = log.find(text, at + 1))
+      ++count;
+    return count;
+  }
+
   /// Visitors for the calls from `first` on, before `last`, that end in this way.
   void visit(const std::string& moment, std::size_t first, std::size_t last) {
     SCOPED_TRACE(moment + ", calls " + std::to_string(first) + " to " + std::to_string(last - 1));
@@ -262,6 +273,26 @@ TEST_F(ServicesSystem, AnExtensionThatIsKilledInterruptsItsClientsOnceWhoAskAgai
     EXPECT_EQ(*client.interruptions, 2) << "of two connections";
     EXPECT_EQ(*client.invalidations, 2);
   }
+}
+
+TEST_F(ServicesSystem, AnotherUserWithTheEndpointsOfThisOneIsHungUpOnAndInTheLog) {
+  if (geteuid() != 0) GTEST_SKIP() << "only root can become another user";
+  upWith(1);
+  LineProcess visitor(
+      {programPath("service_visitor"), drive_.home(), identifiers_[0], "0", "estranged", "no gate"},
+      drive_.environment());
+  std::vector<std::string> said;
+  EXPECT_TRUE(visitor.readUntil([&](const std::string& line) {
+    said.push_back(line);
+    return said.size() == 2;
+  }));
+  EXPECT_EQ(said, (std::vector<std::string>{"refused", "refused"}));
+  EXPECT_EQ(visitor.waitForEnd(), 0);
+  expectAnswers(identifiers_[0]);
+  if (logsToJournal()) GTEST_SKIP() << "this machine logs to its journal";
+  const std::string line = "The peer, process " + std::to_string(visitor.pid()) +
+                           ", belongs to user 65534 and was refused";
+  EXPECT_TRUE(eventually([&] { return linesOfLog(line) == 2; })) << linesOfLog(line);
 }
 
 TEST_F(ServicesSystem, ManyClientsOfManyItemsAreAllAnsweredAndNothingIsLeftOfThem) {

@@ -13,20 +13,17 @@
 #include <vector>
 
 #include "platform/ostrell/awaited.h"
-#include "platform/ostrell/collaboration_service.h"
-#include "platform/ostrell/sharing_service.h"
-#include "platform/xpc/connection.h"
-#include "provider/services/collaboration_service_source.h"
-#include "provider/services/sharing_client.h"
-#include "provider/testing/operations_fixture.h"
+#include "platform/xpc/listener.h"
+#include "provider/services/listening_service_source.h"
+#include "provider/testing/service_connections_fixture.h"
 
 namespace yomber {
 namespace {
 
 using Texts = std::vector<std::string>;
 
-/// Makes the sources of one item, and clients of theirs.
-class ServiceSourcesTest : public OperationsTest {
+/// What the two sources have in common.
+class ServiceSourcesTest : public ServiceConnectionsTest {
   struct Each {
     std::string name;
     std::shared_ptr<ListeningServiceSource> source;
@@ -40,21 +37,6 @@ class ServiceSourcesTest : public OperationsTest {
   };
 
  protected:
-  ServiceSourcesTest() { addDocument(5, "five.txt"); }
-
-  static NSXPCConnectionRef connect(ListeningServiceSource& source,
-                                    const NSXPCInterfaceRef& interface) {
-    const auto connection =
-        NSXPCConnection::initWithListenerEndpoint(source.makeListenerEndpointAndReturnError());
-    connection->setRemoteObjectInterface(interface);
-    connection->resume();
-    return connection;
-  }
-  NSXPCConnectionRef connectToSharing() { return connect(*sharing, getSharingServiceInterface()); }
-  NSXPCConnectionRef connectToCollaboration() {
-    return connect(*collaboration,
-                   NSXPCInterface::interfaceWithProtocol<QSFileProviderPandrelCollaboration>());
-  }
   static bool becomesInvalidated(const NSXPCListener& listener) {
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
     while (!listener.isInvalidated() && std::chrono::steady_clock::now() < deadline) {
@@ -62,37 +44,11 @@ class ServiceSourcesTest : public OperationsTest {
     }
     return listener.isInvalidated();
   }
-  NSErrorRef fetchesAVersion(const NSXPCConnectionRef& connection) {
-    const auto failures = std::make_shared<Awaited<NSErrorRef>>();
-    connection
-        ->remoteObjectProxyWithErrorHandler<QSFileProviderPandrelCollaboration>(into(failures))
-        ->fetchVersionAndCapabilitiesWithCompletionHandler(
-            [failures](std::uint64_t, std::uint64_t, const NSErrorRef& error) {
-              failures->add(error);
-            });
-    return only(failures);
-  }
-  /// Waits for one reply of the sharing service; the failure of the call itself otherwise.
-  NSErrorRef isShared(const NSXPCConnectionRef& connection) {
-    const auto failures = std::make_shared<Awaited<NSErrorRef>>();
-    connection->remoteObjectProxyWithErrorHandler<QSSharingServiceV1>(into(failures))
-        ->fetchSharingInfo([failures](bool, const NSFileProviderItemRef&, const NSErrorRef& error) {
-          failures->add(error);
-        });
-    return only(failures);
-  }
 
-  const std::shared_ptr<NSOperationQueue> queue = std::make_shared<NSOperationQueue>();
-  const std::shared_ptr<QSSharingClient> sharing =
-      QSSharingClient::initWithFileProviderExtension(extension, "d:5", queue);
-  const std::shared_ptr<QSFileProviderPandrelCollaborationServiceSource> collaboration =
-      QSFileProviderPandrelCollaborationServiceSource::initWithFileProviderExtension(extension,
-                                                                                     "d:5", queue);
   const std::vector<Each> sources{
       {"sharing", sharing, getSharingServiceInterface(),
        [this](const NSXPCConnectionRef& connection) { return isShared(connection); }},
-      {"collaboration", collaboration,
-       NSXPCInterface::interfaceWithProtocol<QSFileProviderPandrelCollaboration>(),
+      {"collaboration", collaboration, collaborationInterface(),
        [this](const NSXPCConnectionRef& connection) { return fetchesAVersion(connection); }}};
 };
 
@@ -262,93 +218,6 @@ TEST_F(ServiceSourcesTest, ServeCollaborationOverTheConnection) {
   EXPECT_EQ(answers->wait(3).back(), "com.kelvo.Ostrell base share never nil");
 }
 
-/// Fetches over a connection that the client calls off.
-struct CancelledFetchTest : ServiceSourcesTest {
-  CancelledFetchTest() { client = connectToCollaboration(); }
-  std::shared_ptr<QSFileProviderPandrelCollaboration> proxy() {
-    return client->remoteObjectProxyWithErrorHandler<QSFileProviderPandrelCollaboration>(
-        into(failures));
-  }
-  NSProgressRef fetchRevision() {
-    return proxy()->fetchLatestRevisionWithCompletionHandler(into(errors));
-  }
-  NSProgressRef fetchToken() {
-    return proxy()->fetchCollaborationTokenWithCompletionHandler(
-        [errors = errors](const std::optional<std::string>&, const std::optional<std::string>&,
-                          const std::optional<std::string>&, const std::optional<NSDate>&,
-                          const NSErrorRef& error) { errors->add(error); });
-  }
-
-  NSXPCConnectionRef client;
-  const std::shared_ptr<Awaited<NSErrorRef>> failures = std::make_shared<Awaited<NSErrorRef>>();
-};
-
-TEST_F(CancelledFetchTest, ARevisionThatIsUnderWayIsGivenUp) {
-  daemon.hold("startProviding");
-  const auto progress = fetchRevision();
-  ASSERT_NE(progress, nullptr);
-  ASSERT_TRUE(daemon.waitForCalls("startProviding"));
-  progress->cancel();
-  EXPECT_EQ(domainAndCode(only(errors)), "NSCocoaErrorDomain 3072");
-  EXPECT_TRUE(daemon.waitForCalls("startProviding.dropped"));
-  daemon.release("startProviding");
-  EXPECT_TRUE(failures->values().empty());
-}
-
-TEST_F(CancelledFetchTest, ATokenThatIsUnderWayIsGivenUp) {
-  daemon.hold("copyShareToken");
-  const auto progress = fetchToken();
-  ASSERT_NE(progress, nullptr);
-  ASSERT_TRUE(daemon.waitForCalls("copyShareToken"));
-  progress->cancel();
-  EXPECT_EQ(domainAndCode(only(errors)), "NSCocoaErrorDomain 3072");
-  EXPECT_TRUE(daemon.waitForCalls("copyShareToken.dropped"));
-  daemon.release("copyShareToken");
-  EXPECT_TRUE(failures->values().empty());
-}
-
-TEST_F(CancelledFetchTest, OneThatWasNotDeliveredYetIsGivenUpWhenItIs) {
-  daemon.hold("startProviding");
-  daemon.hold("copyShareToken");
-  const auto revision = fetchRevision();
-  revision->cancel();
-  const auto token = fetchToken();
-  token->cancel();
-  const auto all = errors->wait(2);
-  ASSERT_EQ(all.size(), 2U);
-  for (const auto& error : all) EXPECT_EQ(domainAndCode(error), "NSCocoaErrorDomain 3072");
-  daemon.release("startProviding");
-  daemon.release("copyShareToken");
-}
-
-TEST_F(CancelledFetchTest, CancellingAfterTheReplyChangesNothing) {
-  const auto progress = fetchRevision();
-  EXPECT_EQ(only(errors), nullptr);
-  progress->cancel();
-  EXPECT_EQ(isShared(connectToSharing()), nullptr);
-  const auto identifiers = std::make_shared<Awaited<std::string>>();
-  proxy()->fetchFileProviderIdentifierWithCompletionHandler(
-      [identifiers](const std::optional<std::string>& identifier, const NSErrorRef&) {
-        identifiers->add(identifier.value_or("nil"));
-      });
-  EXPECT_EQ(identifiers->wait(), Texts{"com.kelvo.Ostrell"});
-  EXPECT_EQ(errors->values().size(), 1U) << "one reply and no other";
-  EXPECT_TRUE(failures->values().empty());
-  EXPECT_EQ(daemon.callCount("startProviding.dropped"), 0U);
-}
-
-TEST_F(CancelledFetchTest, AFetchGoesOnWhenItsClientIsGone) {
-  daemon.hold("startProviding");
-  const auto progress = fetchRevision();
-  ASSERT_TRUE(daemon.waitForCalls("startProviding"));
-  client->invalidate();
-  ASSERT_TRUE(
-      log.waitFor(LogLevel::Debug, "[DEBUG] collaboration service source connection invalidated"));
-  daemon.release("startProviding");
-  queue->waitUntilAllOperationsAreFinished();
-  EXPECT_EQ(daemon.callCount("startProviding.dropped"), 0U);
-}
-
 TEST_F(ServiceSourcesTest, LeaveThreeMethodsOutAndKeepTheConnection) {
   const auto client = connectToCollaboration();
   const auto failures = std::make_shared<Awaited<NSErrorRef>>();
@@ -368,6 +237,27 @@ TEST_F(ServiceSourcesTest, LeaveThreeMethodsOutAndKeepTheConnection) {
         answers->add(error);
       });
   EXPECT_EQ(only(answers), nullptr);
+}
+
+TEST_F(ServiceSourcesTest, AnswerACallOfTheOtherInterfaceWithAnErrorAndKeepTheConnection) {
+  for (const std::size_t place : {0U, 1U}) {
+    const auto& each = sources[place];
+    const auto& other = sources[1 - place];
+    SCOPED_TRACE(each.name);
+    const auto ends = std::make_shared<Awaited<std::string>>();
+    const auto client = NSXPCConnection::initWithListenerEndpoint(
+        each.source->makeListenerEndpointAndReturnError());
+    client->setRemoteObjectInterface(other.interface);
+    client->setInterruptionHandler([ends] { ends->add("interrupted"); });
+    client->setInvalidationHandler([ends] { ends->add("invalidated"); });
+    client->resume();
+    // Had the first ended the connection, the second would fail as interrupted or invalid.
+    EXPECT_EQ(domainAndCode(other.ask(client)), "NSCocoaErrorDomain 4101");
+    EXPECT_EQ(domainAndCode(other.ask(client)), "NSCocoaErrorDomain 4101");
+    EXPECT_EQ(ends->values(), Texts());
+    client->invalidate();
+    EXPECT_EQ(ends->wait(), Texts{"invalidated"});
+  }
 }
 
 }  // namespace

@@ -7,6 +7,9 @@
 //   amid      it makes every call instead, and kills itself when CALL + 1 of them have ended;
 //   held      it prints "called" when the extension has heard the call, and waits to be killed;
 //   ended     it makes every call instead, waits for all, hangs up, prints "ended", and ends.
+//
+// With the moment "estranged" it becomes another user before it uses what the host has given it,
+// makes one call over each connection, prints "answered" or "refused" for each, and ends.
 
 #include <fcntl.h>
 #include <sys/prctl.h>
@@ -75,8 +78,26 @@ void endInOrder(std::unique_ptr<ServiceCaller> caller) {
   say("ended");
 }
 
+void becomeAnotherUser() {
+  constexpr uid_t kNobody = 65534;
+  if (getuid() == kNobody) return;
+  if (setgid(kNobody) != 0 || setuid(kNobody) != 0) std::_Exit(1);
+}
+
+int visitAsAnotherUser(const char* home, const char* identifier) {
+  NSErrorRef error;
+  const auto caller =
+      ServiceCaller::connect(NSFileProviderServices(DrivePaths::forHome(home)), identifier, &error,
+                             [](NSXPCConnection&) { becomeAnotherUser(); });
+  require(error);
+  for (const ServiceCallEnd& end : {caller->fetchShare(), caller->waitForAnswer()})
+    say(end.failure == nullptr ? "answered" : "refused");
+  return 0;
+}
+
 int visit(const char* home, const char* identifier, std::size_t number, std::string_view moment,
           const char* gate) {
+  if (moment == "estranged") return visitAsAnotherUser(home, identifier);
   auto caller = connect(home, identifier);
   require(caller->fetchShare().failure);
   // Has its answers also while the others' are held up.

@@ -47,16 +47,36 @@ function(yomber_test name)
     set(arg_TIMEOUT ${YOMBER_TEST_TIMEOUT})
   endif()
   set_target_properties(${name} PROPERTIES CROSSCOMPILING_EMULATOR "${YOMBER_TEST_LAUNCHER}")
+  yomber_discover_tests(${name} "" "" "" "${arg_LABELS}" "${arg_TIMEOUT}" "${arg_SERIAL}")
+endfunction()
+
+# yomber_test_again(<executable> <kind> <NAME=VALUE> [LABELS …] [TIMEOUT seconds] [FILTER filter])
+#
+# The same tests, or those that a filter of GoogleTest's leaves, once more with a variable that makes
+# them different; <kind> is in their names.
+function(yomber_test_again name kind variable)
+  cmake_parse_arguments(PARSE_ARGV 3 arg "" "TIMEOUT;FILTER" "LABELS")
+  yomber_discover_tests(${name} "${kind}" "${variable}" "${arg_FILTER}" "${arg_LABELS}" "${arg_TIMEOUT}" FALSE)
+endfunction()
+
+function(yomber_discover_tests name kind variable filter labels timeout serial)
+  set(list ${name}_TESTS)
+  set(prefix "${name}.")
+  if(kind)
+    set(list ${name}_${kind}_TESTS)
+    set(prefix "${name}.${kind}.")
+  endif()
   gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT 60
-    TEST_PREFIX "${name}.")
+    TEST_PREFIX "${prefix}" TEST_LIST ${list} TEST_FILTER "${filter}")
   # Properties that are lists do not survive gtest_discover_tests: they are set once ctest has its
   # list of the tests.
-  set(properties "${CMAKE_CURRENT_BINARY_DIR}/${name}_properties.cmake")
+  set(environment "${YOMBER_TEST_ENVIRONMENT}" ${variable})
+  set(properties "${CMAKE_CURRENT_BINARY_DIR}/${list}_properties.cmake")
   file(CONFIGURE OUTPUT "${properties}" @ONLY CONTENT [[
-foreach(test IN LISTS @name@_TESTS)
+foreach(test IN LISTS @list@)
   set_tests_properties("${test}" PROPERTIES
-    TIMEOUT @arg_TIMEOUT@ RUN_SERIAL @arg_SERIAL@ LABELS "@arg_LABELS@"
-    ENVIRONMENT "@YOMBER_TEST_ENVIRONMENT@")
+    TIMEOUT @timeout@ RUN_SERIAL @serial@ LABELS "@labels@"
+    ENVIRONMENT "@environment@")
 endforeach()
 ]])
   set_property(DIRECTORY APPEND PROPERTY TEST_INCLUDE_FILES "${properties}")

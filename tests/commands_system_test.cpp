@@ -12,6 +12,7 @@
 
 #include <gtest/gtest.h>
 
+#include "tests/harness/child_process.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -81,6 +82,21 @@ TEST_F(Commands, WhatIsPutIsThereAsItWas) {
   EXPECT_EQ(fs::read_symlink(inside("link")), "file");
   EXPECT_TRUE(fs::exists(outside("file"))) << "a copy leaves what it was made of";
   EXPECT_EQ(codeOf({"put", outside("nothing")}), 66);
+}
+
+TEST_F(Commands, WhatIsPutUnderAFreeNameIsCopiedOnceHoweverManyAreTaken) {
+  write(outside("report.pdf"), "new");
+  for (const char* name : {"report.pdf", "report 2.pdf", "report 3.pdf"}) add(name, "old");
+  const std::string gate = outside("go");
+  Environment environment = drive_.environment();
+  environment["YOMBER_FAULTS"] = "yomber.put.copied=pause-until-file:" + gate;
+  LineProcess put({programPath("yomber"), "put", outside("report.pdf"), "--keep-both"},
+                  environment);
+  EXPECT_TRUE(eventually([&] { return fs::exists(gate + ".reached"); }));
+  write(outside("report.pdf"), "changed meanwhile");
+  write(gate, "");
+  EXPECT_EQ(put.waitForEnd(), 0);
+  EXPECT_EQ(read(inside("report 4.pdf")), "new");
 }
 
 TEST_F(Commands, ATakenNameIsAClashUntilTheUserSaysWhatToDo) {

@@ -2,7 +2,6 @@
 #include <array>
 #include <filesystem>
 #include <fstream>
-#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -10,13 +9,13 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
-#include <sys/syscall.h>
 #include <sys/uio.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include "tests/harness/aside.h"
+#include "tests/harness/cached_pages.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
 
@@ -39,7 +38,9 @@ void putDatesBack(const std::string& path, const struct stat& before) {
 
 class MountNotices : public MountFixture {
  protected:
-  explicit MountNotices(std::vector<std::string> gates = {}) : MountFixture(std::move(gates)) {}
+  explicit MountNotices(std::vector<std::string> gates = {},
+                        const std::vector<std::string>& failing = {})
+      : MountFixture(std::move(gates), failing) {}
 
   /// What happened on the disk before has been told, and the kernel knows of it.
   void waitForNotices() {
@@ -74,6 +75,31 @@ TEST_F(MountNotices, AFolderWhoseDateWasPutBackIsListedAnew) {
   std::ofstream(onDisk("d/new")) << "x";
   putDatesBack(onDisk("d"), before);
   EXPECT_TRUE(eventually([&] { return names() == std::set<std::string>{"new", "old"}; }));
+}
+
+TEST_F(MountNotices, WhatChangesInAFolderThatTheDriveLeavesAloneShows) {
+  fs::create_directory(at("x.part"));
+  std::ofstream(at("x.part/f")) << "x";
+  EXPECT_EQ(fs::file_size(at("x.part/f")), 1U);
+  std::ofstream(onDisk("x.part/f")) << "longer";
+  EXPECT_TRUE(eventually([&] { return fs::file_size(at("x.part/f")) == 6U; }));
+  EXPECT_EQ(contentOf(at("x.part/f")), "longer");
+}
+
+TEST_F(MountNotices, WhatChangesBelowAFolderThatTheDriveLeavesAloneFromNowOnShows) {
+  fs::create_directories(at("d/sub"));
+  std::ofstream(at("d/sub/f")) << "x";
+  ASSERT_TRUE(isConfirmed("d/sub/f"));
+  EXPECT_EQ(fs::file_size(at("d/sub/f")), 1U);
+  ASSERT_EQ(rename(at("d").c_str(), at("d.part").c_str()), 0);
+  EXPECT_EQ(fs::file_size(at("d.part/sub/f")), 1U);
+  EXPECT_TRUE(eventually([&] { return mounted_.drive().names().empty(); }));
+  std::ofstream(onDisk("d.part/sub/f")) << "longer";
+  std::ofstream(onDisk("d.part/sub/g")) << "new";
+  EXPECT_TRUE(eventually([&] { return fs::file_size(at("d.part/sub/f")) == 6U; }));
+  EXPECT_EQ(contentOf(at("d.part/sub/f")), "longer");
+  fs::remove(onDisk("d.part/sub/g"));
+  EXPECT_TRUE(eventually([&] { return !fs::exists(at("d.part/sub/g")); }));
 }
 
 TEST_F(MountNotices, ContentWhoseDateWasPutBackIsReadAnew) {
@@ -123,19 +149,21 @@ TEST_F(WhileANoticeIsApplied, WhatIsMovedThereKeepsItsPlace) {
   EXPECT_EQ(statusOf(onDisk("report")).st_mode & ALLPERMS, 0600U);
 }
 
-/// Pages of a part of a file that are not on the disk yet; nothing where the system does not tell.
-std::optional<std::uint64_t> unwrittenPages(const std::string& path, off_t offset,
-                                            std::size_t length) {
-  constexpr long kCachestat = 451;
-  struct {
-    std::uint64_t offset, length;
-  } range{static_cast<std::uint64_t>(offset), length};
-  struct {
-    std::uint64_t cached = 0, dirty = 0, inWriteback = 0, evicted = 0, recentlyEvicted = 0;
-  } pages;
-  const OpenedFile file(path, O_RDONLY);
-  if (syscall(kCachestat, file.get(), &range, &pages, 0) != 0) return std::nullopt;
-  return pages.dirty + pages.inWriteback;
+/// Whatever the mount is told it does not take.
+class WhileNoNoticeIsTaken : public MountNotices {
+ protected:
+  WhileNoNoticeIsTaken() : MountNotices({}, {"mount.change.told"}) {}
+};
+
+TEST_F(WhileNoNoticeIsTaken, ItStartsAfreshAndSeesWhatHasChanged) {
+  for (const char* content : {"a", "bc", "def", "ghij"}) {
+    std::ofstream(onDisk("report")) << content;
+    EXPECT_TRUE(eventually([&] { return contentOf(at("report")) == content; })) << content;
+    EXPECT_TRUE(
+        eventually([&] { return fs::file_size(at("report")) == std::string(content).size(); }));
+  }
+  fs::remove(onDisk("report"));
+  EXPECT_TRUE(eventually([&] { return !fs::exists(at("report")); }));
 }
 
 TEST_F(MountNotices, AWriteThatIsToBeOnTheDiskIsThereWhenItReturns) {

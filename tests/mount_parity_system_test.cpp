@@ -8,7 +8,6 @@
 #include <vector>
 
 #include <fcntl.h>
-#include <grp.h>
 #include <linux/falloc.h>
 #include <linux/fs.h>
 #include <sys/file.h>
@@ -18,26 +17,15 @@
 #include <sys/statvfs.h>
 #include <sys/sysmacros.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include "tests/harness/mounted_drive.h"
-#include "tests/harness/parity_bench.h"
+#include "tests/harness/parity_fixture.h"
 
 namespace yomber::testing {
 namespace {
-
-namespace fs = std::filesystem;
-
-constexpr uid_t kNobody = 65534;
-
-struct Case {
-  const char* name;
-  std::function<void(Bench&)> run;
-};
 
 void rename2(Bench& b, const std::string& from, const std::string& to, unsigned flags) {
   b.note(("rename " + from + " " + to).c_str(),
@@ -450,81 +438,15 @@ const std::vector<Case>& attributesAndContent() {
   return all;
 }
 
-std::string outcome(const Case& one, const std::string& folder, pid_t holder = 0) {
-  Bench bench(folder, holder);
-  one.run(bench);
-  return bench.text();
+TEST_F(MountParity, NamesAndFoldersAreAsOnTheDiskForRoot) { compareAsRoot(namesAndFolders()); }
+TEST_F(MountParity, AttributesAndContentAreAsOnTheDiskForRoot) {
+  compareAsRoot(attributesAndContent());
 }
-
-class MountParity : public ::testing::Test {
- protected:
-  void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "the mount of another user shows only that user's calls";
-    std::string pattern = (fs::temp_directory_path() / "yomber-parity-XXXXXX").string();
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    native_ = pattern;
-    chmod(native_.c_str(), 0755);
-    chmod(mounted_.folder().c_str(), 0755);
-    umask(022);
-  }
-  void TearDown() override {
-    std::error_code failure;
-    fs::remove_all(native_, failure);
-  }
-
-  /// Both for one case, empty, and open to everybody.
-  void makeFolders(const std::string& name) {
-    for (const std::string& folder : {native_ + "/" + name, mounted_.at(name)}) {
-      ASSERT_EQ(mkdir(folder.c_str(), 0777), 0) << folder;
-      ASSERT_EQ(chmod(folder.c_str(), 0777), 0) << folder;
-    }
-  }
-  void compare(const std::vector<Case>& cases) {
-    for (const Case& one : cases) {
-      makeFolders(one.name);
-      EXPECT_EQ(outcome(one, mounted_.at(one.name), mounted_.pid()),
-                outcome(one, native_ + "/" + one.name))
-          << one.name;
-    }
-  }
-  /// The same in a process that is nobody's.
-  void compareAsNobody(const std::vector<Case>& cases) {
-    for (const Case& one : cases) makeFolders(one.name);
-    const pid_t child = fork();
-    if (child == 0) {
-      const bool isNobody = setgroups() && setresgid(kNobody, kNobody, kNobody) == 0 &&
-                            setresuid(kNobody, kNobody, kNobody) == 0;
-      int different = isNobody ? 0 : 100;
-      for (const Case& one : cases) {
-        const std::string mounted = outcome(one, mounted_.at(one.name));
-        const std::string native = outcome(one, native_ + "/" + one.name);
-        if (mounted == native) continue;
-        ++different;
-        (void)!write(STDERR_FILENO, one.name, std::strlen(one.name));
-        const std::string text = "\nmounted:\n" + mounted + "native:\n" + native;
-        (void)!write(STDERR_FILENO, text.data(), text.size());
-      }
-      _exit(different);
-    }
-    int status = -1;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_EQ(status, 0) << "see what was printed";
-  }
-
-  MountedDrive mounted_;
-  std::string native_;
-
- private:
-  static bool setgroups() { return ::setgroups(0, nullptr) == 0; }
-};
-
-TEST_F(MountParity, NamesAndFoldersAreAsOnTheDiskForRoot) { compare(namesAndFolders()); }
-TEST_F(MountParity, AttributesAndContentAreAsOnTheDiskForRoot) { compare(attributesAndContent()); }
 TEST_F(MountParity, NamesAndFoldersAreAsOnTheDiskForAnOrdinaryUser) {
-  compareAsNobody(namesAndFolders());
+  compareAsUser(namesAndFolders());
 }
 TEST_F(MountParity, AttributesAndContentAreAsOnTheDiskForAnOrdinaryUser) {
-  compareAsNobody(attributesAndContent());
+  compareAsUser(attributesAndContent());
 }
 
 }  // namespace

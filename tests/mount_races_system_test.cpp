@@ -1,11 +1,15 @@
 // What meets in the mount: applications, and whoever fills a file that they use.
 #include <array>
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <optional>
+#include <string>
 
 #include <fcntl.h>
+#include <linux/fs.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -131,6 +135,20 @@ TEST_F(WhileAFileIsFilled, WhoCutsItShortWaits) {
   EXPECT_EQ(contentOf(onDisk("report")), content_.substr(0, kFarInside + 10));
 }
 
+TEST_F(WhileAFileIsFilled, WhoOnlyWantsToKnowWhatItIsWaits) {
+  expectUndisturbed([this] {
+    const OpenedFile file(at("report"), O_RDONLY);
+    return file.read(100, 0) == content_.substr(0, 100) ? 0 : -1;
+  });
+}
+
+TEST_F(WhileAFileIsFilled, WhoSyncsItHasNothingToDo) {
+  expectUndisturbed([this] {
+    const OpenedFile file(at("report"), O_RDWR);
+    return fsync(file.get());
+  });
+}
+
 /// The dates of a file that is filled belong to whoever sets them.
 class WhileDatesArePutBack : public FilledFile, public ::testing::WithParamInterface<const char*> {
  protected:
@@ -197,6 +215,138 @@ TEST_F(WhileAFillingIsGivenUp, WhoEmptiesTheFileNeedsNoContent) {
   EXPECT_EQ(afterIt([this] { return truncate(at("report").c_str(), 0); }), 0);
   EXPECT_EQ(fs::file_size(onDisk("report")), 0U);
   EXPECT_TRUE(isConfirmed("report"));
+}
+
+constexpr const char* kLooked = "mount.lookup.looked";
+constexpr const char* kTold = "mount.lookup.told";
+constexpr const char* kMoved = "mount.move.done";
+
+/// A file that is moved over another one where the kernel looks every name up anew, which for those
+/// that it has it does beside moves.
+class WhileAFileIsMoved : public MountFixture {
+ protected:
+  WhileAFileIsMoved() : MountFixture({}, {}, {}, {kLooked, kTold, kMoved}) {
+    fs::create_directory(at("w.nosync"));
+    std::ofstream(at("w.nosync/a")) << "it";
+    std::ofstream(at("w.nosync/b")) << "other";
+    folder_.emplace(at("w.nosync"), O_PATH | O_DIRECTORY);
+    // Nobody looks a name up for who has this.
+    place_.emplace(at("w.nosync/a"), O_PATH);
+  }
+
+  /// Until the kernel has forgotten what it was told, and somebody comes to the gate for it.
+  [[nodiscard]] int lookUntilReached(const char* name, const char* gate) const {
+    int result = 0;
+    (void)eventually([&] {
+      // Which asks for nothing but the entry.
+      result = openat(folder_->get(), name, O_PATH | O_CLOEXEC);
+      if (result >= 0) close(result);
+      return mounted_.isReached(gate);
+    });
+    return result;
+  }
+  [[nodiscard]] int move() const { return renameat(folder_->get(), "a", folder_->get(), "b"); }
+  bool isReached(const char* gate) {
+    return eventually([&] { return mounted_.isReached(gate); });
+  }
+  void expectThatItIsTheOneThatWasMoved() {
+    const std::string path = "/proc/self/fd/" + std::to_string(place_->get());
+    EXPECT_EQ(chmod(path.c_str(), 0610), 0) << std::strerror(errno);
+    EXPECT_EQ(contentOf(path), "it");
+    struct stat status{};
+    ASSERT_EQ(stat(onDisk("w.nosync/b").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & ALLPERMS, 0610U);
+    EXPECT_EQ(contentOf(at("w.nosync/b")), "it");
+    EXPECT_FALSE(fs::exists(at("w.nosync/a")));
+  }
+
+  std::optional<OpenedFile> folder_;
+  std::optional<OpenedFile> place_;
+};
+
+TEST_F(WhileAFileIsMoved, WhoHasLookedWhereItWasDoesNotTakeItBack) {
+  mounted_.closeGate(kLooked);
+  Aside looking([this] { return lookUntilReached("a", kLooked); });
+  ASSERT_TRUE(isReached(kLooked));
+  EXPECT_EQ(move(), 0);
+  mounted_.openGate(kLooked);
+  (void)looking.result();
+  expectThatItIsTheOneThatWasMoved();
+}
+
+TEST_F(WhileAFileIsMoved, WhoLooksWhereItWillBeDoesNotTakeItForWhatWasThere) {
+  mounted_.closeGate(kMoved);
+  Aside moving([this] { return move(); });
+  ASSERT_TRUE(isReached(kMoved));
+  mounted_.closeGate(kTold);
+  Aside looking([this] { return lookUntilReached("b", kTold); });
+  ASSERT_TRUE(isReached(kTold));
+  // Nor does it look again before that matters.
+  mounted_.closeGate(kLooked);
+  mounted_.openGate(kMoved);
+  EXPECT_EQ(moving.result(), 0);
+  expectThatItIsTheOneThatWasMoved();
+  mounted_.openGate(kLooked);
+  mounted_.openGate(kTold);
+  EXPECT_EQ(looking.result(), 0);
+}
+
+TEST_F(WhileAFileIsMoved, WhoHasLookedWhereItWasRemovedDoesNotBringItBack) {
+  mounted_.closeGate(kLooked);
+  Aside looking([this] { return lookUntilReached("a", kLooked); });
+  ASSERT_TRUE(isReached(kLooked));
+  EXPECT_EQ(unlinkat(folder_->get(), "a", 0), 0);
+  mounted_.openGate(kLooked);
+  (void)looking.result();
+  struct stat status{};
+  EXPECT_EQ(fstat(place_->get(), &status), 0) << std::strerror(errno);
+  EXPECT_EQ(contentOf("/proc/self/fd/" + std::to_string(place_->get())), "it");
+}
+
+/// Of two entries that change places one is seen where the other one is for us still.
+class WhilePlacesAreChanged : public WhileAFileIsMoved {
+ protected:
+  /// `use` gets the location of what was in the place that is looked at.
+  void expectUsable(const OpenedFile& place, const std::function<int(const std::string&)>& use) {
+    mounted_.closeGate(kMoved);
+    Aside moving(
+        [this] { return renameat2(folder_->get(), "a", folder_->get(), "b", RENAME_EXCHANGE); });
+    ASSERT_TRUE(isReached(kMoved));
+    mounted_.closeGate(kTold);
+    Aside looking([this] { return lookUntilReached("b", kTold); });
+    ASSERT_TRUE(isReached(kTold));
+    const std::string path = "/proc/self/fd/" + std::to_string(place.get());
+    Aside using_([&] { return use(path); });
+    EXPECT_TRUE(eventually([&] { return using_.isAsked(); }));
+    mounted_.openGate(kMoved);
+    EXPECT_EQ(using_.result(), 0);
+    EXPECT_EQ(moving.result(), 0);
+    mounted_.openGate(kTold);
+    EXPECT_EQ(looking.result(), 0);
+  }
+};
+
+TEST_F(WhilePlacesAreChanged, AFileIsOpenedOnceThatIsTold) {
+  const OpenedFile other(at("w.nosync/b"), O_PATH);
+  std::string read;
+  expectUsable(other, [&](const std::string& path) {
+    const OpenedFile file(path, O_RDONLY);
+    read = file.read(100, 0);
+    return file.get();
+  });
+  EXPECT_EQ(read, "other");
+}
+
+TEST_F(WhilePlacesAreChanged, AFolderIsListedOnceThatIsTold) {
+  ASSERT_EQ(unlink(at("w.nosync/b").c_str()), 0);
+  ASSERT_EQ(mkdir(at("w.nosync/b").c_str(), 0755), 0);
+  const OpenedFile other(at("w.nosync/b"), O_PATH);
+  expectUsable(other, [](const std::string& path) {
+    std::error_code failure;
+    const fs::directory_iterator entries(path, failure);
+    errno = failure.value();
+    return failure ? -1 : 0;
+  });
 }
 
 }  // namespace

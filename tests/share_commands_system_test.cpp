@@ -1,12 +1,18 @@
 // Sharing between the drives of two accounts, by the command line.
+#include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <map>
+#include <memory>
+#include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "platform/foundation/log_sinks.h"
 #include "platform/foundation/temporary_directory.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/test_drive.h"
@@ -47,6 +53,15 @@ class ShareCommands : public ::testing::Test {
   [[nodiscard]] nlohmann::json info(const TestDrive& drive, const std::string& item) const {
     const auto lines = drive.json({"share", "info", item});
     return lines.empty() ? nlohmann::json() : lines.front();
+  }
+  using Statuses = std::map<std::string, std::string>;
+  /// Of everybody who takes part in what Ann shares, by name.
+  [[nodiscard]] Statuses statusesOf(const std::string& item) const {
+    Statuses statuses;
+    const auto shared = info(ann_, item);
+    for (const auto& person : shared.at("participants"))
+      EXPECT_TRUE(statuses.emplace(person.at("name"), person.at("status")).second);
+    return statuses;
   }
   [[nodiscard]] std::string linkOf(const std::string& item) const {
     const auto lines = ann_.json({"share", "link", item});
@@ -184,6 +199,147 @@ TEST_F(ShareCommands, WhoeverIsRemovedLosesTheItemAndWhoeverLeavesItToo) {
   ASSERT_EQ(ann_.yomber({"share", "remove", "report.txt", "bob"}).exitCode, 0);
   EXPECT_TRUE(eventually([&] { return bob_.names().empty(); }));
   EXPECT_EQ(ann_.yomber({"share", "remove", "report.txt", "bob"}).exitCode, kNoSuchItem);
+}
+
+/// A command about a share, stopped each time between its reading of the share and what it does
+/// with it.
+class HeldCommand {
+ public:
+  HeldCommand(TestDrive& drive, const std::vector<std::string>& words, std::string gate)
+      : gate_(std::move(gate)), process_(drive.commandLine(words), heldAt(gate_, drive)) {}
+
+  bool hasRead() {
+    return eventually([this] { return std::filesystem::exists(gate_ + ".reached"); });
+  }
+  /// Lets it do what it has read the share for.
+  bool letGo() {
+    std::ofstream(gate_).put('x');
+    return eventually([this] { return !std::filesystem::exists(gate_); });
+  }
+  std::optional<int> waitForEnd() { return process_.waitForEnd(); }
+  /// The same for one that may read the share again before.
+  std::optional<int> letGoToTheEnd() {
+    std::optional<int> end;
+    (void)eventually([&] {
+      if (!std::filesystem::exists(gate_)) std::ofstream(gate_).put('x');
+      end = process_.waitForEnd(std::chrono::milliseconds(20));
+      return end.has_value();
+    });
+    return end;
+  }
+
+ private:
+  static Environment heldAt(const std::string& gate, TestDrive& drive) {
+    Environment environment = drive.environment();
+    environment["YOMBER_FAULTS"] = "yomber.share.fetched=pause-each-until-file:" + gate;
+    return environment;
+  }
+
+  const std::string gate_;
+  LineProcess process_;
+};
+
+TEST_F(ShareCommands, WhoeverWasOvertakenWhileChangingAShareLosesNobody) {
+  for (const std::string item : {"report.txt", "Plans"}) {
+    SCOPED_TRACE(item);
+    ASSERT_EQ(ann_.yomber({"share", "add", item, "bob"}).exitCode, 0);
+    HeldCommand overtaken(ann_, {"share", "add", item, "eve"}, store_ / ("gate of " + item));
+    ASSERT_TRUE(overtaken.hasRead());
+    // Another process of its owner's saves the share, and another account does.
+    ASSERT_EQ(ann_.yomber({"share", "add", item, "carl", "--role", "editor"}).exitCode, 0);
+    ASSERT_NE(acceptedByBob(linkOf(item)), "");
+    EXPECT_EQ(overtaken.letGoToTheEnd(), 0);
+    EXPECT_EQ(
+        statusesOf(item),
+        (Statuses{
+            {"ann", "accepted"}, {"bob", "accepted"}, {"carl", "pending"}, {"eve", "pending"}}));
+  }
+}
+
+TEST_F(ShareCommands, WhoeverIsOvertakenAgainAndAgainIsSavedInTheEnd) {
+  constexpr int kTimes = 12;
+  Statuses expected{{"ann", "accepted"}, {"eve", "pending"}};
+  HeldCommand overtaken(ann_, {"share", "add", "report.txt", "eve"}, store_ / "gate");
+  for (int time = 0; time < kTimes; ++time) {
+    ASSERT_TRUE(overtaken.hasRead());
+    const std::string name = "person " + std::to_string(time);
+    ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", name}).exitCode, 0);
+    expected[name] = "pending";
+    ASSERT_TRUE(overtaken.letGo());
+  }
+  EXPECT_EQ(overtaken.letGoToTheEnd(), 0);
+  EXPECT_EQ(statusesOf("report.txt"), expected);
+}
+
+TEST_F(ShareCommands, ManyWhoChangeAShareAtOnceAllSucceed) {
+  for (const std::string item : {"report.txt", "Plans"}) {
+    SCOPED_TRACE(item);
+    ASSERT_EQ(ann_.yomber({"share", "add", item, "bob"}).exitCode, 0);
+    std::vector<std::unique_ptr<HeldCommand>> all;
+    const auto begin = [&](const std::vector<std::string>& words) {
+      const std::string gate = store_ / ("gate of " + item + std::to_string(all.size()));
+      all.push_back(std::make_unique<HeldCommand>(ann_, words, gate));
+    };
+    Statuses expected{{"ann", "accepted"}};
+    for (int number = 0; number < 12; ++number) {
+      const std::string name = "person " + std::to_string(number);
+      begin({"share", "add", item, name});
+      expected[name] = "pending";
+    }
+    begin({"share", "remove", item, "bob"});
+    for (const auto& each : all) ASSERT_TRUE(each->hasRead());
+    for (const auto& each : all) ASSERT_TRUE(each->letGo());
+    for (const auto& each : all) EXPECT_EQ(each->letGoToTheEnd(), 0);
+    EXPECT_EQ(statusesOf(item), expected);
+  }
+}
+
+TEST_F(ShareCommands, WhoeverStopsSharingIsNotHinderedByWhoeverChangesTheShare) {
+  ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "bob"}).exitCode, 0);
+  HeldCommand overtaken(ann_, {"share", "stop", "report.txt"}, store_ / "gate");
+  ASSERT_TRUE(overtaken.hasRead());
+  ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "eve"}).exitCode, 0);
+  ASSERT_NE(acceptedByBob(linkOf("report.txt")), "");
+  EXPECT_EQ(overtaken.letGoToTheEnd(), 0);
+  EXPECT_FALSE(info(ann_, "report.txt")["shared"].get<bool>());
+  EXPECT_TRUE(eventually([&] { return bob_.names().empty(); }));
+}
+
+TEST_F(ShareCommands, WhoeverIsOvertakenByTheEndOfSharingBringsNobodyBack) {
+  ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "bob"}).exitCode, 0);
+  const std::string link = linkOf("report.txt");
+  HeldCommand overtaken(ann_, {"share", "add", "report.txt", "eve"}, store_ / "gate");
+  ASSERT_TRUE(overtaken.hasRead());
+  ASSERT_EQ(ann_.yomber({"share", "stop", "report.txt"}).exitCode, 0);
+  EXPECT_EQ(overtaken.letGoToTheEnd(), kNoSuchItem);
+  EXPECT_FALSE(info(ann_, "report.txt")["shared"].get<bool>());
+  EXPECT_EQ(bob_.yomber({"share", "accept", link}).exitCode, kNoSuchItem);
+}
+
+TEST_F(ShareCommands, WhatIsRefusedToSomebodyIsInTheLogOfHisDrive) {
+  if (logsToJournal()) GTEST_SKIP() << "this machine logs to its journal";
+  const auto logged = [&](const std::string& line) {
+    return eventually([&] {
+      const ProcessResult log = bob_.yomber({"log", "--lines", "100000"});
+      return log.output.find(line) != std::string::npos;
+    });
+  };
+  const std::string guessed = "yomber-share:" + std::string(32, '0');
+  EXPECT_EQ(bob_.yomber({"share", "accept", guessed}).exitCode, kNoSuchItem);
+  EXPECT_TRUE(logged("[NOTICE] refused a URL of no share to bob"));
+
+  ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "carl"}).exitCode, 0);
+  const std::string carls = linkOf("report.txt");
+  EXPECT_EQ(bob_.yomber({"share", "accept", carls}).exitCode, kNotPermitted);
+  EXPECT_TRUE(logged("[NOTICE] refused a share's URL to bob"));
+  EXPECT_TRUE(bob_.names().empty());
+
+  ASSERT_EQ(ann_.yomber({"share", "add", "report.txt", "bob"}).exitCode, 0);
+  ASSERT_NE(acceptedByBob(carls), "");
+  EXPECT_EQ(bob_.yomber({"share", "add", "report.txt", "eve"}).exitCode, kNotPermitted);
+  EXPECT_TRUE(logged("[NOTICE] refused to save the share of ann for bob"));
+  EXPECT_EQ(statusesOf("report.txt"),
+            (Statuses{{"ann", "accepted"}, {"bob", "accepted"}, {"carl", "pending"}}));
 }
 
 TEST_F(ShareCommands, ADriveKeepsTheStoreThatItJoinedAndJoinsNoOther) {

@@ -19,7 +19,8 @@ namespace yomber::testing {
 
 class OpenedFile {
  public:
-  OpenedFile(const std::string& path, int flags) : file_(open(path.c_str(), flags | O_CLOEXEC)) {}
+  OpenedFile(const std::string& path, int flags)
+      : file_(open(path.c_str(), flags | O_CLOEXEC, 0644)) {}
   ~OpenedFile() {
     if (file_ >= 0) close(file_);
   }
@@ -41,8 +42,11 @@ class OpenedFile {
 class MountFixture : public ::testing::Test {
  protected:
   explicit MountFixture(std::vector<std::string> gates = {},
-                        const std::vector<std::string>& failing = {})
-      : mounted_(std::move(gates), failing), client_(mounted_.drive().home()) {}
+                        const std::vector<std::string>& failing = {},
+                        const Environment& environment = {},
+                        const std::vector<std::string>& turnstiles = {})
+      : mounted_(std::move(gates), failing, environment, turnstiles),
+        client_(mounted_.drive().home()) {}
 
   [[nodiscard]] std::string at(const std::string& name) const { return mounted_.at(name); }
   [[nodiscard]] std::string onDisk(const std::string& name) const { return mounted_.onDisk(name); }

@@ -1,5 +1,6 @@
 #include "tests/harness/mounted_drive.h"
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -11,6 +12,8 @@
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
+
+#include "tests/harness/mount_kind.h"
 
 namespace yomber::testing {
 
@@ -45,14 +48,22 @@ std::optional<pid_t> processWith(const std::string& name, const std::string& arg
 
 }  // namespace
 
-MountedDrive::MountedDrive(std::vector<std::string> gates, const std::vector<std::string>& failing)
+MountedDrive::MountedDrive(std::vector<std::string> gates, const std::vector<std::string>& failing,
+                           const Environment& environment,
+                           const std::vector<std::string>& turnstiles)
     : gates_(std::move(gates)) {
+  for (const auto& [name, value] : environment) drive_.environment()[name] = value;
   std::string pattern = (fs::temp_directory_path() / "yomber-mount-XXXXXX").string();
   if (mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("no folder to mount in");
   folder_ = pattern;
   std::string faults;
   for (const std::string& gate : gates_) faults += gate + "=pause-until-file:" + fileOf(gate) + ",";
   for (const std::string& point : failing) faults += point + "=error,";
+  for (const std::string& gate : turnstiles) {
+    faults += gate + "=pause-first-until-file:" + fileOf(gate) + ",";
+    openGate(gate);
+  }
+  gates_.insert(gates_.end(), turnstiles.begin(), turnstiles.end());
   if (!faults.empty()) drive_.environment()["YOMBER_FAULTS"] = faults;
   chmod(folder_.c_str(), 0755);
   drive_.up();
@@ -62,9 +73,15 @@ MountedDrive::MountedDrive(std::vector<std::string> gates, const std::vector<std
 MountedDrive::~MountedDrive() {
   for (const std::string& gate : gates_) openGate(gate);
   unmount();
-  (void)umount2(folder_.c_str(), MNT_DETACH);
+  (void)takeAway();
   std::error_code failure;
   fs::remove(folder_, failure);
+}
+
+void MountedDrive::closeGate(const std::string& gate) const {
+  // In this order: until the second has gone, everybody passes.
+  fs::remove(fileOf(gate));
+  fs::remove(fileOf(gate) + ".reached");
 }
 
 std::string MountedDrive::fileOf(const std::string& gate) const {
@@ -84,13 +101,19 @@ std::string MountedDrive::onDisk(const std::string& path) const {
 void MountedDrive::mount(const std::vector<std::string>& options) {
   std::vector<std::string> command{"mount", folder_};
   command.insert(command.end(), options.begin(), options.end());
+  if (mountKind() == MountKind::Cached) command.emplace_back("--no-pass-through");
   const ProcessResult result = drive_.yomber(command);
   if (result.exitCode != 0) {
     throw std::runtime_error("the drive cannot be mounted: " + result.errors);
   }
 }
 
-void MountedDrive::unmount() { (void)drive_.yomber({"unmount"}); }
+void MountedDrive::unmount() { (void)drive_.yomber({"unmount", "--lazy"}); }
+
+bool MountedDrive::takeAway() const {
+  if (umount2(folder_.c_str(), MNT_DETACH) == 0) return true;
+  return errno == EPERM && runProcess({"/usr/bin/fusermount3", "-u", "-z", folder_}).exitCode == 0;
+}
 
 pid_t MountedDrive::pid() const {
   std::optional<pid_t> found;

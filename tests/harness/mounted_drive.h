@@ -7,14 +7,17 @@
 
 namespace yomber::testing {
 
-/// A drive that is up and mounted in a folder of its own. Unmounted and removed when the object
-/// goes.
+/// A drive that is up and mounted in a folder of its own, in the way that mount_kind.h tells.
+/// Unmounted and removed when the object goes.
 class MountedDrive {
  public:
   /// `gates` are fault points (platform/foundation/fault_points.h) that hold up whoever comes there
-  /// until they are opened, `failing` such where whatever is done there fails.
+  /// until they are opened, `failing` such where whatever is done there fails, `turnstiles` gates
+  /// that are open at first and hold up one at a time. `environment` is for the drive's processes.
   explicit MountedDrive(std::vector<std::string> gates = {},
-                        const std::vector<std::string>& failing = {});
+                        const std::vector<std::string>& failing = {},
+                        const Environment& environment = {},
+                        const std::vector<std::string>& turnstiles = {});
   ~MountedDrive();
   MountedDrive(const MountedDrive&) = delete;
   MountedDrive& operator=(const MountedDrive&) = delete;
@@ -30,16 +33,21 @@ class MountedDrive {
   [[nodiscard]] bool isReached(const std::string& gate) const;
   /// Lets everybody through, now and later.
   void openGate(const std::string& gate) const;
+  /// Holds up whoever comes to an open gate next, and nobody else, until it is opened again. For
+  /// those of `turnstiles`.
+  void closeGate(const std::string& gate) const;
 
   void mount(const std::vector<std::string>& options = {});
   void unmount();
+  /// As its user does who asks nobody of the drive; false when nothing was mounted.
+  [[nodiscard]] bool takeAway() const;
   /// The pid of yomber-mount, waiting until there is one; throws when none comes.
   [[nodiscard]] pid_t pid() const;
 
  private:
   [[nodiscard]] std::string fileOf(const std::string& gate) const;
 
-  const std::vector<std::string> gates_;
+  std::vector<std::string> gates_;
   TestDrive drive_;
   std::string folder_;
 };

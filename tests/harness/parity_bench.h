@@ -4,8 +4,10 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <ctime>
 #include <filesystem>
 #include <functional>
+#include <map>
 #include <string>
 #include <system_error>
 #include <thread>
@@ -52,11 +54,46 @@ class Bench {
   void look(const std::string& name) {
     struct stat status{};
     if (note(("look " + name).c_str(), lstat(at(name).c_str(), &status)) < 0) return;
-    say("mode " + std::to_string(status.st_mode) + " links " +
-        std::to_string(S_ISDIR(status.st_mode) ? 0 : status.st_nlink) + " size " +
-        std::to_string(S_ISDIR(status.st_mode) ? 0 : status.st_size) + " owner " +
-        std::to_string(status.st_uid) + ":" + std::to_string(status.st_gid) + " device " +
-        std::to_string(status.st_rdev));
+    say("mode " + std::to_string(status.st_mode) + " links " + std::to_string(status.st_nlink) +
+        " size " + std::to_string(status.st_size) + " blocks " + std::to_string(status.st_blocks) +
+        " owner " + std::to_string(status.st_uid) + ":" + std::to_string(status.st_gid) +
+        " device " + std::to_string(status.st_rdev));
+  }
+  /// Which dates of these entries an operation changes. All are long past before it, but for those
+  /// of the status, since when the clock has moved on.
+  void dates(const char* what, const std::vector<std::string>& names,
+             const std::function<long()>& operation) {
+    constexpr timespec kPast{.tv_sec = 1'000'000, .tv_nsec = 0};
+    const timespec times[2]{kPast, kPast};
+    std::map<std::string, struct stat> before;
+    for (const std::string& name : names) {
+      struct stat status{};
+      if (utimensat(AT_FDCWD, at(name).c_str(), times, AT_SYMLINK_NOFOLLOW) == 0 &&
+          lstat(at(name).c_str(), &status) == 0) {
+        before[name] = status;
+      }
+    }
+    for (const auto& [name, status] : before) waitForClock(status.st_ctim);
+    note(what, std::min(operation(), 0L));
+    for (const std::string& name : names) {
+      struct stat status{};
+      const bool isThere = lstat(at(name).c_str(), &status) == 0;
+      std::string line = "  " + name + (isThere ? "" : " is not there");
+      const auto tell = [&](const char* date, timespec stat::* which) {
+        const auto& was = before.contains(name) ? before[name].*which : timespec{};
+        const auto& now = status.*which;
+        const bool isLater =
+            now.tv_sec > was.tv_sec || (now.tv_sec == was.tv_sec && now.tv_nsec > was.tv_nsec);
+        const bool isSame = now.tv_sec == was.tv_sec && now.tv_nsec == was.tv_nsec;
+        line += std::string(" ") + date + (isLater ? " later" : isSame ? " same" : " earlier");
+      };
+      if (isThere) {
+        tell("atime", &stat::st_atim);
+        tell("mtime", &stat::st_mtim);
+        tell("ctime", &stat::st_ctim);
+      }
+      say(line);
+    }
   }
   int file(const std::string& name, const std::string& content = "", mode_t mode = 0644) {
     const int descriptor = open(at(name).c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
@@ -89,6 +126,14 @@ class Bench {
   }
 
  private:
+  /// Until the clock that file systems take dates from is past that.
+  static void waitForClock(const timespec& date) {
+    timespec now{};
+    do {
+      clock_gettime(CLOCK_REALTIME_COARSE, &now);
+    } while (now.tv_sec < date.tv_sec ||
+             (now.tv_sec == date.tv_sec && now.tv_nsec <= date.tv_nsec));
+  }
   [[nodiscard]] bool holds(const std::string& end) const {
     std::error_code failure;
     const auto descriptors =

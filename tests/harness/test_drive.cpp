@@ -73,12 +73,14 @@ TestDrive::TestDrive(const std::string& parent) {
     fs::permissions(place, fs::perms::owner_all);
   }
   fs::create_directories(directory_ + "/data/applications");
-  // Nothing of the machine's own: sockets, applications and settings are the test's.
+  // Nothing of the machine's own: sockets, applications and settings are the test's. And
+  // uploads begin at once.
   environment_ = {{"YOMBER_HOME", home_},
                   {"XDG_RUNTIME_DIR", ""},
                   {"XDG_DATA_HOME", directory_ + "/data"},
                   {"XDG_DATA_DIRS", directory_ + "/data"},
-                  {"HOME", directory_}};
+                  {"HOME", directory_},
+                  {"YOMBER_UPLOAD_PAUSE_MS", "0"}};
 }
 
 TestDrive::~TestDrive() {

@@ -12,11 +12,20 @@
 #include "mount/file_system.h"
 #include "mount/folder_listing.h"
 #include "mount/folder_stream.h"
+#include "platform/foundation/descriptor_path.h"
 
 namespace yomber {
 namespace {
 
 bool isDots(std::string_view name) { return name == "." || name == ".."; }
+
+/// What may be read but not searched has no "." for us.
+FileDescriptor openToRead(int folder) {
+  constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+  FileDescriptor opened(openat(folder, ".", kFlags));
+  if (opened || errno != EACCES) return opened;
+  return FileDescriptor(::open(pathOfDescriptor(folder).c_str(), kFlags));
+}
 
 }  // namespace
 
@@ -25,7 +34,7 @@ void FileSystem::opendir(fuse_req_t request, Node& folder, fuse_file_info* info)
   const SharedDescriptor place = folders_.open(folder, failure);
   FileDescriptor opened;
   if (place) {
-    opened = FileDescriptor(openat(place->get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    opened = openToRead(place->get());
     failure = errno;
   }
   if (!opened) {
@@ -84,15 +93,18 @@ bool FileSystem::addEntry(Node& folder, const FolderStream& stream,
   const std::string shown =
       entry.shown != nullptr ? entry.name : places_->shownName(folder.identity.inode, entry.name);
   const bool isByName = !withAttributes || isDots(entry.name) || entry.shown != nullptr;
-  if (isByName || !listing.hasRoomFor(shown.c_str())) {
+  struct statx status{};
+  const bool isTold = !isByName && listing.hasRoomFor(shown.c_str());
+  const int failure = isTold ? lookAt(stream.descriptor(), entry.name, status) : 0;
+  if (failure == ENOENT) return true;  // gone meanwhile
+  // We need not be allowed to look at what is in a folder that we may read.
+  if (!isTold || failure != 0) {
     struct stat known{};
     known.st_ino =
         entry.shown != nullptr ? places_->base(entry.shown->base).identity.inode : entry.inode;
     known.st_mode = DTTOIF(entry.type);
     return listing.addName(shown.c_str(), known, entry.next);
   }
-  struct statx status{};
-  if (lookAt(stream.descriptor(), entry.name, status) != 0) return true;  // gone meanwhile
   putRight(stream.descriptor(), entry.name, status);
   Node& node = nodes_.found(folder, entry.name, status);
   listing.addEntry(shown.c_str(), entryOf(folder, node, status, true), node, entry.next);

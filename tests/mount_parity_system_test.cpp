@@ -53,6 +53,17 @@ const std::vector<Case>& namesAndFolders() {
          b.note("rmdir gone", rmdir(b.at("d").c_str()));
          b.note("below a file", (b.made("f"), mkdir(b.at("f/x").c_str(), 0755)));
        }},
+      {"a folder that may be read and not searched",
+       [](Bench& b) {
+         b.note("mkdir", mkdir(b.at("d").c_str(), 0755));
+         b.made("d/a");
+         b.note("mkdir", mkdir(b.at("d/sub").c_str(), 0755));
+         b.note("chmod", chmod(b.at("d").c_str(), 0600));
+         b.names("d");
+         b.look("d/a");
+         b.note("chmod", chmod(b.at("d").c_str(), 0755));
+         b.look("d/a");
+       }},
       {"names of every length",
        [](Bench& b) {
          b.made(std::string(255, 'n'), "x");

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "mount/file_system.h"
+#include "mount/set_id_bits.h"
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/file_time.h"
@@ -70,6 +71,47 @@ int setDates(int descriptor, const std::array<timespec, 2>& times) {
   return 0;
 }
 
+/// 0 or an errno. The set-id bits that go with it are those that the caller would take away on the
+/// disk. Where nothing but they would change, they are left to their owner, and to what comes next:
+/// the kernel asks so, too, for whoever is about to write.
+int setOwner(fuse_req_t request, int descriptor, const struct stat& wanted, int which) {
+  struct stat before{};
+  if (fstat(descriptor, &before) != 0) return errno;
+  const mode_t taken = S_ISDIR(before.st_mode) ? 0 : setIDToTake(request, before);
+  const bool isOwners = fuse_req_ctx(request)->uid == before.st_uid;
+  const bool isKept = (which & (FUSE_SET_ATTR_UID | FUSE_SET_ATTR_GID)) == 0;
+  if (isKept && taken != 0 && !isOwners) return 0;
+  const uid_t user = (which & FUSE_SET_ATTR_UID) != 0 ? wanted.st_uid : static_cast<uid_t>(-1);
+  const gid_t group = (which & FUSE_SET_ATTR_GID) != 0 ? wanted.st_gid : static_cast<gid_t>(-1);
+  if (fchownat(descriptor, "", user, group, AT_EMPTY_PATH) != 0) return errno;
+  // Where the group may not execute, the kernel goes by our groups, not by the caller's.
+  const bool isLeft = (taken & S_ISGID) != 0 && (before.st_mode & S_IXGRP) == 0;
+  const mode_t rest = before.st_mode & ALLPERMS & ~taken;
+  return isLeft && chmod(pathOfDescriptor(descriptor).c_str(), rest) != 0 ? errno : 0;
+}
+
+/// All but the size: 0 or an errno.
+int setOthers(fuse_req_t request, int descriptor, const struct stat& wanted, int which) {
+  const std::string path = pathOfDescriptor(descriptor);
+  constexpr int kTimes =
+      FUSE_SET_ATTR_ATIME | FUSE_SET_ATTR_MTIME | FUSE_SET_ATTR_ATIME_NOW | FUSE_SET_ATTR_MTIME_NOW;
+  // What changes nothing is a change of owner that leaves both as they are.
+  const bool isOwnerKept = (which & (FUSE_SET_ATTR_MODE | FUSE_SET_ATTR_SIZE | kTimes)) == 0;
+  if (isOwnerKept || (which & (FUSE_SET_ATTR_UID | FUSE_SET_ATTR_GID)) != 0) {
+    const int failure = setOwner(request, descriptor, wanted, which);
+    if (failure != 0) return failure;
+  }
+  // After the owner, whose change takes set-id bits away.
+  if ((which & FUSE_SET_ATTR_MODE) != 0 && chmod(path.c_str(), wanted.st_mode & ALLPERMS) != 0) {
+    return errno;
+  }
+  if ((which & kTimes) == 0) return 0;
+  const std::array<timespec, 2> times{
+      timeFrom(wanted, which, FUSE_SET_ATTR_ATIME, FUSE_SET_ATTR_ATIME_NOW, true),
+      timeFrom(wanted, which, FUSE_SET_ATTR_MTIME, FUSE_SET_ATTR_MTIME_NOW, false)};
+  return setDates(descriptor, times);
+}
+
 /// Names end with a zero each.
 std::vector<char> withoutOwn(const std::vector<char>& names) {
   std::vector<char> result;
@@ -102,7 +144,7 @@ void FileSystem::setattr(fuse_req_t request, Node& node, struct stat* wanted, in
                        which](int failure) {
     Descriptor descriptor;
     if (failure == 0) failure = descriptorOf(*use->get(), descriptor);
-    if (failure == 0) failure = setOthers(descriptor.number, others, which);
+    if (failure == 0) failure = setOthers(request, descriptor.number, others, which);
     const EntryGate::Moment begun = gate_.now(use->get()->identity.inode);
     struct statx status{};
     if (failure == 0) failure = lookAt(descriptor.number, "", status);
@@ -112,28 +154,6 @@ void FileSystem::setattr(fuse_req_t request, Node& node, struct stat* wanted, in
   };
   if ((which & FUSE_SET_ATTR_SIZE) == 0) return finish(0);
   truncate(request, node, wanted->st_size, info, finish);
-}
-
-int FileSystem::setOthers(int descriptor, const struct stat& wanted, int which) const {
-  const std::string path = pathOfDescriptor(descriptor);
-  constexpr int kTimes =
-      FUSE_SET_ATTR_ATIME | FUSE_SET_ATTR_MTIME | FUSE_SET_ATTR_ATIME_NOW | FUSE_SET_ATTR_MTIME_NOW;
-  // A change of owner that leaves both as they are changes nothing but the date of change.
-  const bool isOwnerKept = (which & (FUSE_SET_ATTR_MODE | FUSE_SET_ATTR_SIZE | kTimes)) == 0;
-  if (isOwnerKept || (which & (FUSE_SET_ATTR_UID | FUSE_SET_ATTR_GID)) != 0) {
-    const uid_t user = (which & FUSE_SET_ATTR_UID) != 0 ? wanted.st_uid : static_cast<uid_t>(-1);
-    const gid_t group = (which & FUSE_SET_ATTR_GID) != 0 ? wanted.st_gid : static_cast<gid_t>(-1);
-    if (fchownat(descriptor, "", user, group, AT_EMPTY_PATH) != 0) return errno;
-  }
-  // After the owner, whose change takes set-id bits away.
-  if ((which & FUSE_SET_ATTR_MODE) != 0 && chmod(path.c_str(), wanted.st_mode & ALLPERMS) != 0) {
-    return errno;
-  }
-  if ((which & kTimes) == 0) return 0;
-  const std::array<timespec, 2> times{
-      timeFrom(wanted, which, FUSE_SET_ATTR_ATIME, FUSE_SET_ATTR_ATIME_NOW, true),
-      timeFrom(wanted, which, FUSE_SET_ATTR_MTIME, FUSE_SET_ATTR_MTIME_NOW, false)};
-  return setDates(descriptor, times);
 }
 
 void FileSystem::readlink(fuse_req_t request, Node& node) {

@@ -12,6 +12,7 @@
 
 #include "mount/file_system.h"
 #include "mount/removed_content.h"
+#include "mount/set_id_bits.h"
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
 
@@ -29,16 +30,6 @@ void answerRead(fuse_req_t request, int descriptor, std::size_t size, off_t offs
   } else {
     (void)fuse_reply_buf(request, bytes.get(), static_cast<std::size_t>(count));
   }
-}
-
-/// Root may change such a file without taking the bits away, others may not; for the disk all
-/// changes are root's.
-void takeSetIDAway(fuse_req_t request, int file) {
-  struct stat status{};
-  if (fuse_req_ctx(request)->uid == 0 || fstat(file, &status) != 0) return;
-  const bool isGroups = (status.st_mode & S_IXGRP) != 0;
-  const mode_t taken = status.st_mode & (S_ISUID | (isGroups ? S_ISGID : 0));
-  if (taken != 0) (void)fchmod(file, status.st_mode & ALLPERMS & ~taken);
 }
 
 std::uint64_t blockBytesOf(int descriptor) {

@@ -213,7 +213,6 @@ class FileSystem {
                 bool mayWaitForDisk = false);
   /// Does what may wait for the disk where it keeps no other request waiting.
   void waitForDisk(std::function<void()> work);
-  int setOthers(int descriptor, const struct stat& wanted, int which) const;
 
   bool addEntry(Node& folder, const FolderStream& stream, const FolderStream::Entry& entry,
                 bool withAttributes, FolderListing& listing);

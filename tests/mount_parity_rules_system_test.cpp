@@ -332,6 +332,29 @@ const std::vector<Case>& permissions() {
          b.look("a");
          b.look("closed");
        }},
+      {"set-id bits of a file whose group may not execute it",
+       [](Bench& b) {
+         b.made("a", "x", 0666);
+         b.note("to somebody", chown(b.at("a").c_str(), kSomebody, kSomebody));
+         b.settle("a");
+         const auto change = [&b] {
+           const int file = open(b.at("a").c_str(), O_WRONLY | O_CLOEXEC);
+           b.note("write", write(file, "y", 1));
+           close(file);
+         };
+         for (const uid_t user : {kNobody, kSomebody}) {
+           b.note("chmod", chmod(b.at("a").c_str(), 06666));
+           as(user, change);
+           b.look("a");
+         }
+         b.note("chmod", chmod(b.at("a").c_str(), 06666));
+         as(kNobody, kSomebody, change);
+         b.look("a");
+         b.note("chmod", chmod(b.at("a").c_str(), 06666));
+         as(kSomebody, kNobody,
+            [&] { b.note("chgrp", chown(b.at("a").c_str(), kSomebody, kNobody)); });
+         b.look("a");
+       }},
       {"groups",
        [](Bench& b) {
          b.made("a", "x");

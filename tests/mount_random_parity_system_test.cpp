@@ -30,6 +30,8 @@
 namespace yomber::testing {
 namespace {
 
+constexpr long kStepsToAnew = 300;
+
 long numberFrom(const char* name, long otherwise) {
   const char* const text = std::getenv(name);
   return text != nullptr ? std::atol(text) : otherwise;
@@ -397,7 +399,6 @@ class MountRandomParity : public MountParity {
     MountParity::SetUp();
     for (const std::string& root : {mountedRoot(), nativeRoot()}) {
       ASSERT_EQ(mkdir(root.c_str(), 0777), 0);
-      ASSERT_EQ(chmod(root.c_str(), 0777), 0);
     }
   }
   void TearDown() override {
@@ -412,6 +413,16 @@ class MountRandomParity : public MountParity {
     std::string text;
     for (const std::string& line : story_) text += line + "\n";
     return text;
+  }
+  /// Both trees are empty again: at length nobody may do anything any more.
+  void beginAnew() {
+    remember("anew");
+    for (const std::string& root : {mountedRoot(), nativeRoot()}) {
+      openFolders(root);
+      for (const auto& entry : std::filesystem::directory_iterator(root))
+        std::filesystem::remove_all(entry);
+      ASSERT_EQ(::chmod(root.c_str(), 0777), 0);
+    }
   }
   /// How many operations did not end in an error.
   [[nodiscard]] long succeeded() const { return succeeded_; }
@@ -449,6 +460,9 @@ TEST_F(MountRandomParity, WhateverIsDoneGivesTheSameAnswersAndLeavesTheSameTree)
   Tree diskBefore(nativeRoot());
   Tree mountBefore(mountedRoot());
   for (long i = 0; i < steps; ++i) {
+    if (i % kStepsToAnew == 0) {
+      ASSERT_NO_FATAL_FAILURE(beginAnew());
+    }
     diskBefore.waitForClock();
     mountBefore.waitForClock();
     const Caller& caller = choices.caller();

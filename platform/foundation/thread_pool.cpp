@@ -4,8 +4,10 @@
 #include <pthread.h>
 
 #include <algorithm>
+#include <chrono>
 #include <cstdint>
 #include <deque>
+#include <optional>
 #include <system_error>
 #include <thread>
 #include <utility>
@@ -36,6 +38,8 @@ struct ThreadPool::State : std::enable_shared_from_this<ThreadPool::State> {
   bool monitorRuns GUARDED_BY(mutex) = false;
   bool boundWasLogged GUARDED_BY(mutex) = false;
   bool closing GUARDED_BY(mutex) = false;
+  /// When those that were more than are kept have ended: so much later, memory is given back.
+  std::optional<std::chrono::steady_clock::time_point> burstEnded GUARDED_BY(mutex);
 };
 
 namespace {
@@ -86,12 +90,11 @@ class PoolThreads {
       }
     }
     --state.threads;
-    const bool isBurstOver = !state.closing && state.idle <= state.limits.keptIdleThreads;
+    state.burstEnded = std::chrono::steady_clock::now();
     state.threadEnded.notifyAll();
+    state.workArrived.notifyOne();
     if (state.closing) state.stallPossible.notifyAll();
     state.mutex.unlock();
-    // What many at once have freed lies between what is still in use, and would stay with us.
-    if (isBurstOver) (void)malloc_trim(0);
   }
 
   static void runNext(State& state) REQUIRES(state.mutex) {
@@ -111,14 +114,29 @@ class PoolThreads {
     ++state.idle;
     bool timeLeft = true;
     while (state.work.empty() && !state.closing && timeLeft) {
-      if (state.idle <= state.limits.keptIdleThreads) {
-        state.workArrived.wait(state.mutex);
-      } else {
+      if (state.idle > state.limits.keptIdleThreads) {
         timeLeft = state.workArrived.waitUntil(state.mutex, deadline);
+      } else if (!state.burstEnded) {
+        state.workArrived.wait(state.mutex);
+      } else if (!state.workArrived.waitUntil(state.mutex,
+                                              *state.burstEnded + state.limits.idleTime)) {
+        giveMemoryBack(state);
       }
     }
     --state.idle;
     return timeLeft || !state.work.empty();
+  }
+
+  /// What many at once have freed lies between what is still in use, and would stay with us. Not
+  /// when the last of them ends: the others may still be about to free theirs.
+  static void giveMemoryBack(State& state) REQUIRES(state.mutex) {
+    if (!state.burstEnded) return;  // another thread has done it
+    state.burstEnded.reset();
+    --state.idle;
+    state.mutex.unlock();
+    (void)malloc_trim(0);
+    state.mutex.lock();
+    ++state.idle;
   }
 
   /// Watches the queue: work that waits although nothing has moved means that every thread is

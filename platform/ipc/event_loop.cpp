@@ -24,6 +24,8 @@ thread_local bool isLoopThread = false;
 constexpr auto kRetirement = 2 * kj::MILLISECONDS;
 /// With so many retired the loop lets go of them at once.
 constexpr std::size_t kMaximumRetired = 256;
+/// Room for more posted work than this is given back after a burst.
+constexpr std::size_t kKeptBatch = 1'024;
 /// After so many events the loop looks for what else has come, though it has work left: else a peer
 /// that never pauses would keep everybody else waiting.
 constexpr kj::uint kEventsInOneGo = 1'000;
@@ -116,6 +118,7 @@ struct EventLoop::State {
       }
     }
     loop->batch.clear();
+    if (loop->batch.capacity() > kKeptBatch) std::vector<Work>().swap(loop->batch);
   }
 
   void armRetirement() {

@@ -102,10 +102,11 @@ class Choices {
     if (once(30)) path += one<std::string>({"/", "/.", "//", "/" + std::string(256, 'x')});
     return path;
   }
-  /// An ordinary user's drive lets the owner write for a moment what it is to mark, and nobody is
-  /// to see that here.
+  /// In an ordinary user's mount the owner may always write and search. The drive lets him write
+  /// for a moment what it is to mark, and nobody is to see that here. And of a file with several
+  /// names the mount knows one, to which he could close the way.
   mode_t mode() {
-    static const mode_t always = geteuid() == 0 ? 0 : S_IWUSR;
+    static const mode_t always = geteuid() == 0 ? 0 : S_IWUSR | S_IXUSR;
     return always | one<mode_t>({0777, 0755, 0750, 0700, 0666, 0644, 0640, 0600, 0444, 0111, 0}) |
            one<mode_t>({0, 0, 0, 01000, 02000, 04000, 06000, 07000});
   }

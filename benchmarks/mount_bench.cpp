@@ -1,5 +1,6 @@
 // The mount beside the native folder on the same disk, and beside other programs' mounts of that
-// folder where they are installed: each figure is a ratio to the native folder in the same round.
+// folder where they are installed: each figure is a ratio to the native folder, right before or
+// after.
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -15,6 +16,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "benchmarks/figure.h"
@@ -57,38 +59,28 @@ struct Sizes {
 /// A folder whose operations are timed.
 class Side {
  public:
-  /// `waitUntilQuiet` returns when nothing goes on behind the folder.
-  Side(std::string folder, const Sizes& sizes, std::function<void()> waitUntilQuiet)
-      : folder_(std::move(folder)), sizes_(sizes), waitUntilQuiet_(std::move(waitUntilQuiet)) {}
+  /// `work` is for what it makes, and nobody else's: several sides may show the same folder.
+  Side(std::string folder, std::string work, const Sizes& sizes)
+      : folder_(std::move(folder)), work_(std::move(work)), sizes_(sizes) {}
 
-  /// Seconds, by figure.
-  std::map<std::string, double> measure() {
-    seconds_.clear();
-    waitUntilQuiet_();
-    list();
-    create();
-    waitUntilQuiet_();
-    look();
-    read();
-    rename();
-    waitUntilQuiet_();
-    readLarge();
-    sync();
-    fs::remove_all(at("work"));
-    return seconds_;
+  /// What is measured one after the other; the later need what the earlier have left.
+  using Part = void (Side::*)();
+  static const std::vector<Part>& parts() {
+    static const std::vector<Part> all{&Side::list,   &Side::create,    &Side::look, &Side::read,
+                                       &Side::rename, &Side::readLarge, &Side::sync, &Side::clear};
+    return all;
   }
-  /// The same, of large reads only.
-  std::map<std::string, double> measureLargeReads() {
-    seconds_.clear();
-    waitUntilQuiet_();
-    readLarge();
-    return seconds_;
-  }
+  static Part largeReads() { return &Side::readLarge; }
+
+  void measure(Part part) { (this->*part)(); }
+  /// By figure, since the last time.
+  std::map<std::string, double> takeSeconds() { return std::exchange(seconds_, {}); }
 
  private:
   [[nodiscard]] std::string at(const std::string& name) const { return folder_ + "/" + name; }
+  [[nodiscard]] std::string inWork(const std::string& name) const { return at(work_ + "/" + name); }
   [[nodiscard]] std::string file(std::size_t number) const {
-    return at("work/a/" + std::to_string(number));
+    return inWork("a/" + std::to_string(number));
   }
   void time(const std::string& figure, const std::function<void()>& work) {
     seconds_[figure] = bench::secondsFor(work);
@@ -106,8 +98,8 @@ class Side {
   }
 
   void create() {
-    fs::create_directories(at("work/a"));
-    fs::create_directories(at("work/b"));
+    fs::create_directories(inWork("a"));
+    fs::create_directories(inWork("b"));
     const std::string content(kBlock, 'x');
     time("create 4 KiB", [&] {
       for (std::size_t i = 0; i < sizes_.files; ++i) {
@@ -151,8 +143,8 @@ class Side {
         if (::rename((from + name).c_str(), (to + name).c_str()) != 0) giveUp(from + name);
       }
     };
-    time("rename in a folder", [&] { move(at("work/a/"), at("work/a/renamed ")); });
-    time("rename across folders", [&] { move(at("work/a/renamed "), at("work/b/")); });
+    time("rename in a folder", [&] { move(inWork("a/"), inWork("a/renamed ")); });
+    time("rename across folders", [&] { move(inWork("a/renamed "), inWork("b/")); });
   }
 
   void readLarge() {
@@ -166,7 +158,7 @@ class Side {
     const std::string content(kBlock, 'x');
     time("files written with fsync", [&] {
       for (std::size_t i = 0; i < kSyncedFiles; ++i) {
-        const std::string path = at("work/synced " + std::to_string(i));
+        const std::string path = inWork("synced " + std::to_string(i));
         const int made = open(path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
         if (write(made, content.data(), kBlock) != ssize_t{kBlock} || fsync(made) != 0)
           giveUp(path);
@@ -175,9 +167,11 @@ class Side {
     });
   }
 
+  void clear() { fs::remove_all(at(work_)); }
+
   const std::string folder_;
+  const std::string work_;
   const Sizes& sizes_;
-  const std::function<void()> waitUntilQuiet_;
   std::map<std::string, double> seconds_;
 };
 
@@ -241,7 +235,33 @@ class CachedMount {
   testing::LineProcess process_;
 };
 
+constexpr const char* kNative = "native";
+constexpr const char* kOurs = "the mount";
 constexpr const char* kCached = "without pass-through";
+
+using Sides = std::map<std::string, Side>;
+using Measured = std::map<std::string, std::map<std::string, bench::Repeated>>;
+
+/// Measures a part on these sides, one right after the other, since what a disk gives changes from
+/// minute to minute. What is uploaded or written back meanwhile is not what is measured.
+void measureBeside(testing::MountedDrive& drive, Sides& sides,
+                   const std::vector<std::string>& order, Side::Part part, Measured& measured) {
+  std::map<std::string, std::map<std::string, double>> seconds;
+  for (const std::string& name : order) {
+    bench::waitUntilQuiet(drive.drive());
+    ::sync();
+    sides.at(name).measure(part);
+    seconds[name] = sides.at(name).takeSeconds();
+  }
+  for (const auto& [name, figures] : seconds) {
+    if (name == kNative) continue;
+    for (const auto& [figure, took] : figures)
+      measured[name][figure].add(took, seconds[kNative].at(figure));
+  }
+}
+
+/// The next time another one is the first: a disk may have less to give the longer it gives.
+void takeTurns(std::vector<std::string>& order) { std::ranges::rotate(order, order.begin() + 1); }
 
 struct Goal {
   std::string figure;
@@ -299,32 +319,36 @@ int main() {
                     "rclone mount --daemon --vfs-cache-mode full --cache-dir '" +
                         (scratch / "cache").string() + "' '" + native + "'",
                     scratch / "rclone");
-  std::map<std::string, std::string> sides{{"the mount", drive.folder()}};
-  if (bindfs.isMounted()) sides["bindfs"] = bindfs.folder();
-  if (rclone.isMounted()) sides["rclone"] = rclone.folder();
+  Sides sides;
+  const auto add = [&](const std::string& name, const std::string& folder) {
+    sides.try_emplace(name, folder, "work " + name, sizes);
+  };
+  add(kNative, native);
+  add(kOurs, drive.folder());
+  if (bindfs.isMounted()) add("bindfs", bindfs.folder());
+  if (rclone.isMounted()) add("rclone", rclone.folder());
+  std::vector<std::string> order;
+  for (const auto& [name, side] : sides) order.push_back(name);
 
-  // What is uploaded meanwhile is not what is measured.
-  const auto waitUntilUploaded = [&drive] { bench::waitUntilQuiet(drive.drive()); };
-  std::map<std::string, std::map<std::string, bench::Repeated>> measured;
+  Measured measured;
+  std::vector<std::string> two{kNative, kCached};
   for (std::size_t round = 0; round < sizes.rounds; ++round) {
     std::fprintf(stderr, "mount_bench: round %zu of %zu\n", round + 1, sizes.rounds);
-    waitUntilUploaded();
-    auto yardstick = Side(native, sizes, [] {}).measure();
-    for (const auto& [name, folder] : sides) {
-      for (const auto& [figure, seconds] : Side(folder, sizes, waitUntilUploaded).measure()) {
-        measured[name][figure].add(seconds, yardstick.at(figure));
-      }
+    for (const Side::Part part : Side::parts()) {
+      measureBeside(drive, sides, order, part, measured);
+      takeTurns(order);
     }
     const CachedMount cached(drive, scratch / "cached");
-    Side side(scratch / "cached", sizes, waitUntilUploaded);
-    for (const auto& [figure, seconds] : side.measureLargeReads()) {
-      measured[kCached][figure].add(seconds, yardstick.at(figure));
-    }
+    sides.erase(kCached);
+    sides.try_emplace(kCached, scratch / "cached", "work cached", sizes);
+    measureBeside(drive, sides, two, Side::largeReads(), measured);
+    takeTurns(two);
   }
   bool isReached = true;
   for (const Goal& goal : goals()) {
-    for (const auto& [side, folder] : sides) {
-      const bool isOurs = side == "the mount";
+    for (const std::string& side : order) {
+      if (side == kNative) continue;
+      const bool isOurs = side == kOurs;
       char text[64];
       std::snprintf(text, sizeof text, "at most %.3g times", goal.most);
       const auto figure = measured[side][goal.figure].figure(
@@ -335,7 +359,7 @@ int main() {
     }
   }
   constexpr double kMostCached = 1.5;
-  for (auto& [name, repeated] : measured[kCached]) {
+  for (const auto& [name, repeated] : measured[kCached]) {
     const auto figure =
         repeated.figure(std::string(kCached) + ": " + name, "s", "native", "at most 1.5 times",
                         [](double ratio) { return ratio <= kMostCached; });

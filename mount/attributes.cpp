@@ -72,33 +72,38 @@ int setDates(int descriptor, const std::array<timespec, 2>& times) {
 }
 
 /// 0 or an errno. The set-id bits that go with it are those that the caller would take away on the
-/// disk. Where nothing but they would change, they are left to their owner, and to what comes next:
-/// the kernel asks so, too, for whoever is about to write.
-int setOwner(fuse_req_t request, int descriptor, const struct stat& wanted, int which) {
+/// disk. A request that changes neither user nor group comes from the kernel before a write by
+/// whoever has the file open, `mayBeWritten`, or of a chown that leaves both as they are: only the
+/// owner may take bits away with that.
+int setOwner(fuse_req_t request, int descriptor, const struct stat& wanted, int which,
+             bool mayBeWritten) {
   struct stat before{};
   if (fstat(descriptor, &before) != 0) return errno;
   const mode_t taken = S_ISDIR(before.st_mode) ? 0 : setIDToTake(request, before);
   const bool isOwners = fuse_req_ctx(request)->uid == before.st_uid;
   const bool isKept = (which & (FUSE_SET_ATTR_UID | FUSE_SET_ATTR_GID)) == 0;
-  if (isKept && taken != 0 && !isOwners) return 0;
+  if (isKept && taken != 0 && !isOwners && !mayBeWritten) return EPERM;
   const uid_t user = (which & FUSE_SET_ATTR_UID) != 0 ? wanted.st_uid : static_cast<uid_t>(-1);
   const gid_t group = (which & FUSE_SET_ATTR_GID) != 0 ? wanted.st_gid : static_cast<gid_t>(-1);
   if (fchownat(descriptor, "", user, group, AT_EMPTY_PATH) != 0) return errno;
   // Where the group may not execute, the kernel goes by our groups, not by the caller's.
-  const bool isLeft = (taken & S_ISGID) != 0 && (before.st_mode & S_IXGRP) == 0;
-  const mode_t rest = before.st_mode & ALLPERMS & ~taken;
+  struct stat after{};
+  const bool isLeft = (taken & S_ISGID) != 0 && fstat(descriptor, &after) == 0 &&
+                      (after.st_mode & (S_ISGID | S_IXGRP)) == S_ISGID;
+  const mode_t rest = after.st_mode & ALLPERMS & ~static_cast<mode_t>(S_ISGID);
   return isLeft && chmod(pathOfDescriptor(descriptor).c_str(), rest) != 0 ? errno : 0;
 }
 
 /// All but the size: 0 or an errno.
-int setOthers(fuse_req_t request, int descriptor, const struct stat& wanted, int which) {
+int setOthers(fuse_req_t request, int descriptor, const struct stat& wanted, int which,
+              bool mayBeWritten) {
   const std::string path = pathOfDescriptor(descriptor);
   constexpr int kTimes =
       FUSE_SET_ATTR_ATIME | FUSE_SET_ATTR_MTIME | FUSE_SET_ATTR_ATIME_NOW | FUSE_SET_ATTR_MTIME_NOW;
   // What changes nothing is a change of owner that leaves both as they are.
   const bool isOwnerKept = (which & (FUSE_SET_ATTR_MODE | FUSE_SET_ATTR_SIZE | kTimes)) == 0;
   if (isOwnerKept || (which & (FUSE_SET_ATTR_UID | FUSE_SET_ATTR_GID)) != 0) {
-    const int failure = setOwner(request, descriptor, wanted, which);
+    const int failure = setOwner(request, descriptor, wanted, which, mayBeWritten);
     if (failure != 0) return failure;
   }
   // After the owner, whose change takes set-id bits away.
@@ -144,7 +149,10 @@ void FileSystem::setattr(fuse_req_t request, Node& node, struct stat* wanted, in
                        which](int failure) {
     Descriptor descriptor;
     if (failure == 0) failure = descriptorOf(*use->get(), descriptor);
-    if (failure == 0) failure = setOthers(request, descriptor.number, others, which);
+    if (failure == 0) {
+      failure = setOthers(request, descriptor.number, others, which,
+                          openFiles_.mayBeWritten(*use->get()));
+    }
     const EntryGate::Moment begun = gate_.now(use->get()->identity.inode);
     struct statx status{};
     if (failure == 0) failure = lookAt(descriptor.number, "", status);

@@ -130,8 +130,8 @@ std::shared_ptr<OpenFile> FileSystem::addOpen(Node& node, int flags, FileDescrip
                                               FileDescriptor place) {
   struct stat status{};
   (void)fstat(content ? content.get() : place.get(), &status);
-  // Who writes to a file with set-id bits takes them away, unless he is root: when the kernel
-  // writes by itself, they go whoever writes.
+  // Who writes to a file with set-id bits takes them away, unless he may leave them: when the
+  // kernel writes by itself, they go whoever writes.
   const bool hasSetID = (status.st_mode & (S_ISUID | S_ISGID)) != 0;
   const auto present = hasSetID ? OpenFile::Way::Direct : OpenFile::Way::PassThrough;
   const auto wanted = session_->canPassThrough() ? present : OpenFile::Way::Cached;

@@ -97,7 +97,7 @@ bool FileSystem::addEntry(Node& folder, const FolderStream& stream,
   const bool isTold = !isByName && listing.hasRoomFor(shown.c_str());
   const int failure = isTold ? lookAt(stream.descriptor(), entry.name, status) : 0;
   if (failure == ENOENT) return true;  // gone meanwhile
-  // We need not be allowed to look at what is in a folder that we may read.
+  // A folder that we may read may have entries that we may not look at.
   if (!isTold || failure != 0) {
     struct stat known{};
     known.st_ino =

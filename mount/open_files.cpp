@@ -191,6 +191,14 @@ bool OpenFiles::mayWaitForContent(const Node& node) const {
                      [](const auto& file) { return file->content() < 0; });
 }
 
+bool OpenFiles::mayBeWritten(const Node& node) const {
+  LockGuard guard(mutex_);
+  const auto known = open_.find(&node);
+  return known != open_.end() && std::ranges::any_of(known->second.files, [](const auto& file) {
+           return file->isWritable();
+         });
+}
+
 std::shared_ptr<OpenFile> OpenFiles::shared(const OpenFile& file) const {
   LockGuard guard(mutex_);
   const auto known = open_.find(&file.node());

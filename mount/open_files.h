@@ -100,6 +100,8 @@ class OpenFiles {
   [[nodiscard]] std::shared_ptr<OpenFile> of(const Node& node) const;
   /// Whether anybody has the node open whose reads may wait for content.
   [[nodiscard]] bool mayWaitForContent(const Node& node) const;
+  /// Whether anybody has the node open who may write to it.
+  [[nodiscard]] bool mayBeWritten(const Node& node) const;
   [[nodiscard]] std::shared_ptr<OpenFile> shared(const OpenFile& file) const;
 
  private:

@@ -13,8 +13,8 @@ namespace yomber {
 [[nodiscard]] mode_t setIDToTake(fuse_req_t request, const struct stat& status);
 
 /// Takes them away from an open file whose content is about to be changed: root changes files for
-/// everybody, and so leaves them itself. First, and for good whatever comes of the change: with
-/// anything else somebody could run, for a moment, what another has written.
+/// everybody, and so leaves them itself. Before the change, and not put back if it fails: otherwise
+/// somebody could run, with those bits, for a moment what another has written.
 void takeSetIDAway(fuse_req_t request, int file);
 
 }  // namespace yomber

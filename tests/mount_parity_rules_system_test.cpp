@@ -342,6 +342,12 @@ const std::vector<Case>& permissions() {
            b.note("write", write(file, "y", 1));
            close(file);
          };
+         b.note("chmod", chmod(b.at("a").c_str(), 06666));
+         as(kNobody, [&] {
+           b.note("chown to nobody else",
+                  chown(b.at("a").c_str(), static_cast<uid_t>(-1), static_cast<gid_t>(-1)));
+         });
+         b.look("a");
          for (const uid_t user : {kNobody, kSomebody}) {
            b.note("chmod", chmod(b.at("a").c_str(), 06666));
            as(user, change);

@@ -115,7 +115,8 @@ class PoolThreads {
     bool timeLeft = true;
     while (state.work.empty() && !state.closing && timeLeft) {
       if (state.idle > state.limits.keptIdleThreads) {
-        timeLeft = state.workArrived.waitUntil(state.mutex, deadline);
+        timeLeft = state.workArrived.waitUntil(state.mutex, deadline) ||
+                   state.idle <= state.limits.keptIdleThreads;
       } else if (!state.burstEnded) {
         state.workArrived.wait(state.mutex);
       } else if (!state.workArrived.waitUntil(state.mutex,
@@ -130,7 +131,9 @@ class PoolThreads {
   /// What many at once have freed lies between what is still in use, and would stay with us. Not
   /// when the last of them ends: the others may still be about to free theirs.
   static void giveMemoryBack(State& state) REQUIRES(state.mutex) {
-    if (!state.burstEnded) return;  // another thread has done it
+    const bool isDue = state.burstEnded && std::chrono::steady_clock::now() >=
+                                               *state.burstEnded + state.limits.idleTime;
+    if (!isDue || !state.work.empty() || state.closing) return;
     state.burstEnded.reset();
     --state.idle;
     state.mutex.unlock();

@@ -11,9 +11,9 @@ namespace yomber {
 ///
 /// A new thread is started at once while there are few of them; beyond that only when work waits
 /// and nothing has moved for a moment, that is when the threads that exist are blocked. A bounded
-/// number of idle threads is kept; others end after a while without work, and the last of them
-/// gives the memory back that the process has freed. At the hard bound, work waits for a thread and
-/// a fault is logged.
+/// number of idle threads is kept; others end after a while without work. When the last of them has
+/// ended for as long, one that is kept gives the memory back that the process has freed. At the
+/// hard bound, work waits for a thread and a fault is logged.
 ///
 /// Thread-safety: every operation may be called on any thread.
 class ThreadPool {

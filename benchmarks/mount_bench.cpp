@@ -336,8 +336,8 @@ int main() {
     std::fprintf(stderr, "mount_bench: round %zu of %zu\n", round + 1, sizes.rounds);
     for (const Side::Part part : Side::parts()) {
       measureBeside(drive, sides, order, part, measured);
-      takeTurns(order);
     }
+    takeTurns(order);
     const CachedMount cached(drive, scratch / "cached");
     sides.erase(kCached);
     sides.try_emplace(kCached, scratch / "cached", "work cached", sizes);
@@ -346,8 +346,8 @@ int main() {
   }
   bool isReached = true;
   for (const Goal& goal : goals()) {
-    for (const std::string& side : order) {
-      if (side == kNative) continue;
+    for (const auto& [side, measuredThere] : sides) {
+      if (side == kNative || side == kCached) continue;
       const bool isOurs = side == kOurs;
       char text[64];
       std::snprintf(text, sizeof text, "at most %.3g times", goal.most);

@@ -2,18 +2,23 @@
 // names that they all use, gives the same answers and leaves the same tree behind.
 //
 // YOMBER_PARITY_STEPS says how many operations are done, YOMBER_SEED which; it is printed.
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <climits>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <deque>
+#include <filesystem>
 #include <functional>
 #include <initializer_list>
 #include <iostream>
 #include <map>
 #include <random>
 #include <string>
+#include <system_error>
+#include <utility>
 #include <vector>
 
 #include <fcntl.h>
@@ -51,12 +56,18 @@ constexpr std::array<Caller, 4> kCallers{{{"root", 0, 0, 0},
 
 void as(const Caller& caller, const std::function<void()>& work) {
   if (geteuid() != 0) return work();
+  /// Root again, however the work ends.
+  struct Return {
+    Return() = default;
+    ~Return() { EXPECT_TRUE(seteuid(0) == 0 && setegid(0) == 0); }
+    Return(const Return&) = delete;
+    Return& operator=(const Return&) = delete;
+  };
+  const Return back;
   ASSERT_EQ(setgroups(1, &caller.second), 0);
   ASSERT_EQ(setegid(caller.group), 0);
   ASSERT_EQ(seteuid(caller.user), 0);
   work();
-  ASSERT_EQ(seteuid(0), 0);
-  ASSERT_EQ(setegid(0), 0);
 }
 
 /// An answer of the system: the error's name when it is one.
@@ -288,7 +299,7 @@ Step Choices::list() {
         for (const auto& entry : std::filesystem::directory_iterator(root + "/" + path, failure))
           names.push_back(entry.path().filename());
         std::ranges::sort(names);
-        std::string answer = path + ": " + failure.message();
+        std::string answer = path + ": " + (failure ? strerrorname_np(failure.value()) : "0");
         for (const std::string& each : names) answer += " " + each;
         return answer;
       }};
@@ -397,12 +408,13 @@ void openFolders(const std::string& root) {
 class MountRandomParity : public MountParity {
  protected:
   void SetUp() override {
-    MountParity::SetUp();
+    ASSERT_NO_FATAL_FAILURE(MountParity::SetUp());
     for (const std::string& root : {mountedRoot(), nativeRoot()}) {
       ASSERT_EQ(mkdir(root.c_str(), 0777), 0);
     }
   }
   void TearDown() override {
+    if (native_.empty()) return;
     for (const std::string& root : {mountedRoot(), nativeRoot()}) openFolders(root);
     MountParity::TearDown();
   }
@@ -443,7 +455,7 @@ class MountRandomParity : public MountParity {
       onMount = step.run(mountedRoot());
       umask(022);
     });
-    if (onDisk.find(": E") == std::string::npos) ++succeeded_;
+    if (onDisk.find(" E") == std::string::npos) ++succeeded_;
     remember(std::string(caller.name) + ": " + step.text + " " + onDisk);
     ASSERT_EQ(onMount, onDisk) << story();
   }
@@ -455,7 +467,7 @@ class MountRandomParity : public MountParity {
 
 TEST_F(MountRandomParity, WhateverIsDoneGivesTheSameAnswersAndLeavesTheSameTree) {
   const long steps = numberFrom("YOMBER_PARITY_STEPS", 1'500);
-  const auto seed = static_cast<unsigned long>(numberFrom("YOMBER_SEED", std::random_device()()));
+  const auto seed = static_cast<unsigned long>(numberFrom("YOMBER_SEED", 7));
   std::cout << "YOMBER_SEED=" << seed << " YOMBER_PARITY_STEPS=" << steps << "\n";
   Choices choices(seed);
   Tree diskBefore(nativeRoot());
@@ -482,7 +494,7 @@ TEST_F(MountRandomParity, WhateverIsDoneGivesTheSameAnswersAndLeavesTheSameTree)
     mountBefore = std::move(mount);
   }
   std::cout << succeeded() << " operations succeeded\n";
-  EXPECT_GT(succeeded(), steps / 20);
+  EXPECT_GT(succeeded(), steps / 10);
 }
 
 }  // namespace

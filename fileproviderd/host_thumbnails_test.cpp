@@ -12,7 +12,7 @@
 #include "fileproviderd/host_fixture.h"
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/item_codec.h"
-#include "platform/fileprovider/thumbnail.h"
+#include "platform/fileprovider/thumbnail_batch.h"
 #include "platform/foundation/gate.h"
 #include "platform/ipc/call.h"
 #include "platform/ipc/error_codec.h"
@@ -32,22 +32,24 @@ struct ThumbnailClient {
    public:
     explicit Receiver(std::shared_ptr<ThumbnailClient> client) : client_(std::move(client)) {}
     kj::Promise<void> didFetch(DidFetchContext context) override {
-      {
-        LockGuard guard(client_->mutex);
-        for (const auto each : context.getParams().getThumbnails()) {
-          client_->told.push_back(decodeThumbnail(each));
-        }
-      }
-      client_->arrived.open();
-      KJ_REQUIRE(!client_->refuses, "no more");
-      if (!client_->holds) return kj::READY_NOW;
-      return kj::NEVER_DONE;
+      return ThumbnailBatch::decode(context.getParams())
+          .then([client = client_](ThumbnailBatch batch) { return client->take(batch); });
     }
 
    private:
     const std::shared_ptr<ThumbnailClient> client_;
   };
 
+  kj::Promise<void> take(const ThumbnailBatch& batch) {
+    {
+      LockGuard guard(mutex);
+      for (std::size_t i = 0; i < batch.size(); ++i) told.push_back(batch.at(i));
+    }
+    arrived.open();
+    KJ_REQUIRE(!refuses, "no more");
+    if (!holds) return kj::READY_NOW;
+    return kj::NEVER_DONE;
+  }
   std::vector<ItemThumbnail> all() {
     LockGuard guard(mutex);
     return told;

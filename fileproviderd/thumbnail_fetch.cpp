@@ -18,7 +18,7 @@ using protocol::ThumbnailReceiver;
 /// The first items are asked for in a small part, so that somebody who waits sees something soon.
 constexpr std::size_t kFirstPart = 16;
 constexpr std::size_t kPart = 256;
-constexpr std::size_t kPartsAtOnce = 3;
+constexpr std::size_t kPartsAtOnce = 6;
 /// So often the extension may end under one part.
 constexpr int kAttempts = 3;
 constexpr ipc::CallOptions kUnlimited{.timeout = std::chrono::milliseconds::zero()};
@@ -35,7 +35,7 @@ class ThumbnailFetch::PartReceiver final : public ThumbnailReceiver::Server {
     context.allowCancellation();
     const auto fetch = fetch_.lock();
     if (fetch == nullptr) return kj::READY_NOW;
-    auto promise = fetch->forward(context.getParams().getThumbnails());
+    auto promise = fetch->forward(context.getParams());
     context.releaseParams();
     return promise;
   }
@@ -128,7 +128,8 @@ void ThumbnailFetch::didAnswer(const PartRef& part, const ExtensionSessionRef& s
   });
 }
 
-kj::Promise<void> ThumbnailFetch::forward(capnp::List<protocol::Thumbnail>::Reader thumbnails) {
+kj::Promise<void> ThumbnailFetch::forward(ThumbnailReceiver::DidFetchParams::Reader params) {
+  const auto thumbnails = params.getThumbnails();
   std::vector<unsigned> wanted;
   for (unsigned i = 0; i < thumbnails.size(); ++i) {
     if (untold_.erase(stringFromWire(thumbnails[i].getIdentifier())) > 0) wanted.push_back(i);
@@ -137,6 +138,7 @@ kj::Promise<void> ThumbnailFetch::forward(capnp::List<protocol::Thumbnail>::Read
   auto request = receiver_.client().didFetchRequest();
   auto list = request.initThumbnails(static_cast<unsigned>(wanted.size()));
   for (unsigned i = 0; i < list.size(); ++i) list.setWithCaveats(i, thumbnails[wanted[i]]);
+  if (params.hasImages()) request.setImages(params.getImages());
   ++forwarding_;
   // The client takes them also when the extension, which waits for that, ends meanwhile.
   auto taken = request.send()

@@ -62,7 +62,7 @@ class ThumbnailFetch final : public std::enable_shared_from_this<ThumbnailFetch>
   void didAnswer(const PartRef& part, const ExtensionSessionRef& session, const NSErrorRef& lost,
                  const NSErrorRef& failure);
   /// Passes on what the client has not been told.
-  kj::Promise<void> forward(capnp::List<protocol::Thumbnail>::Reader thumbnails);
+  kj::Promise<void> forward(protocol::ThumbnailReceiver::DidFetchParams::Reader params);
   void didForward(NSErrorRef error);
   /// Tells of the items that the extension said nothing of.
   void settle(const PartRef& part, const NSErrorRef& failure);

@@ -1,16 +1,16 @@
 #pragma once
 
+#include <cstddef>
 #include <optional>
 #include <string>
 
 #include "platform/fileprovider/constants.h"
 #include "platform/foundation/data.h"
 #include "platform/foundation/error.h"
-#include "protocols/thumbnails.capnp.h"
 
 namespace yomber {
 
-/// The thumbnail of one item, as it travels.
+/// The thumbnail of one item.
 struct ItemThumbnail {
   NSFileProviderItemIdentifier identifier;
   NSDataRef image;                         ///< nil: the item has none
@@ -18,11 +18,7 @@ struct ItemThumbnail {
   NSErrorRef error;                        ///< why there is no image, where something went wrong
 };
 
-/// A larger image is refused by whoever would send it.
+/// A larger image is refused by whoever would send or take it.
 inline constexpr std::size_t kMaximumThumbnailBytes = std::size_t{8} << 20U;
-
-// Loop thread only.
-void encodeThumbnail(const ItemThumbnail& thumbnail, protocol::Thumbnail::Builder builder);
-[[nodiscard]] ItemThumbnail decodeThumbnail(protocol::Thumbnail::Reader reader);
 
 }  // namespace yomber

@@ -9,13 +9,14 @@
 #include <functional>
 #include <limits>
 #include <memory>
+#include <set>
 #include <string>
 #include <vector>
 
 #include "platform/fileprovider/errors.h"
 #include "platform/fileprovider/item_codec.h"
 #include "platform/fileprovider/served_extension.h"
-#include "platform/fileprovider/thumbnail.h"
+#include "platform/fileprovider/thumbnail_batch.h"
 #include "platform/foundation/gate.h"
 #include "platform/foundation/lock.h"
 #include "platform/ipc/call.h"
@@ -57,14 +58,8 @@ class Receiver {
    public:
     explicit Server(std::shared_ptr<Receiver> receiver) : receiver_(std::move(receiver)) {}
     kj::Promise<void> didFetch(DidFetchContext context) override {
-      for (const auto each : context.getParams().getThumbnails()) {
-        receiver_->add(decodeThumbnail(each));
-      }
-      if (receiver_->refuses) KJ_FAIL_REQUIRE("no more");
-      if (!receiver_->holds) return kj::READY_NOW;
-      auto pair = kj::newPromiseAndFulfiller<void>();
-      receiver_->held_.push_back(kj::mv(pair.fulfiller));
-      return kj::mv(pair.promise);
+      return ThumbnailBatch::decode(context.getParams())
+          .then([receiver = receiver_](ThumbnailBatch batch) { return receiver->take(batch); });
     }
 
    private:
@@ -88,6 +83,14 @@ class Receiver {
   Gate arrived;
 
  private:
+  kj::Promise<void> take(const ThumbnailBatch& batch) {
+    for (std::size_t i = 0; i < batch.size(); ++i) add(batch.at(i));
+    if (refuses) KJ_FAIL_REQUIRE("no more");
+    if (!holds) return kj::READY_NOW;
+    auto pair = kj::newPromiseAndFulfiller<void>();
+    held_.push_back(kj::mv(pair.fulfiller));
+    return kj::mv(pair.promise);
+  }
   void add(ItemThumbnail thumbnail) {
     {
       LockGuard guard(mutex_);
@@ -238,6 +241,25 @@ TEST_F(ThumbnailRequestTest, AnImageThatIsTooLargeBecomesAnError) {
   ASSERT_THAT(all, SizeIs(1));
   EXPECT_EQ(all[0].image, nullptr);
   EXPECT_NE(all[0].error, nullptr);
+}
+
+TEST_F(ThumbnailRequestTest, EveryImageIsItsOwnHoweverManyCallsTheyTake) {
+  constexpr int kCount = 40;
+  const auto imageOf = [](int i) { return std::string(300'000 + i, static_cast<char>('0' + i)); };
+  extension->answer = [&](const auto&, CGSize, const auto& handler, const auto& completion) {
+    for (int i = 0; i < kCount; ++i) {
+      handler(std::to_string(i), std::make_shared<NSData>(imageOf(i)), std::nullopt, nullptr);
+    }
+    completion(nullptr);
+  };
+  EXPECT_EQ(request({"a"}), nullptr);
+  std::set<std::string> told;
+  for (const ItemThumbnail& each : receiver->all()) {
+    told.insert(each.identifier);
+    ASSERT_NE(each.image, nullptr) << each.identifier;
+    EXPECT_TRUE(each.image->bytes() == imageOf(std::stoi(each.identifier))) << each.identifier;
+  }
+  EXPECT_THAT(told, SizeIs(kCount));
 }
 
 TEST_F(ThumbnailRequestTest, AReceiverThatTakesNothingHoldsTheExtensionUp) {

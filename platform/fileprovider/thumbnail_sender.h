@@ -1,11 +1,12 @@
 #pragma once
 
 #include <cstddef>
+#include <deque>
 #include <functional>
 #include <memory>
 #include <vector>
 
-#include "platform/fileprovider/thumbnail.h"
+#include "platform/fileprovider/thumbnail_batch.h"
 #include "platform/foundation/lock.h"
 #include "platform/ipc/remote.h"
 
@@ -32,23 +33,23 @@ class ThumbnailSender : public std::enable_shared_from_this<ThumbnailSender> {
   void end();
 
  private:
-  using Thumbnails = std::vector<ItemThumbnail>;
-
+  void add(ItemThumbnail thumbnail) REQUIRES(mutex_);
+  /// One that a receiver has read, or a new one.
+  [[nodiscard]] ImageFile takeFile() REQUIRES(mutex_);
   void sendWhatWaits();
-  void send(std::shared_ptr<const Thumbnails> part, std::size_t bytes);
-  void didSend(std::size_t bytes, NSErrorRef error);
-  /// The next call's, and how many bytes it has.
-  [[nodiscard]] Thumbnails takePart(std::size_t& bytes) REQUIRES(mutex_);
+  void send(std::shared_ptr<const ThumbnailBatch> batch);
+  void didSend(const ThumbnailBatch& batch, NSErrorRef error);
   /// The handler, when it is due.
   [[nodiscard]] std::function<void(NSErrorRef)> takeHandler() REQUIRES(mutex_);
 
   const ipc::Remote<protocol::ThumbnailReceiver> receiver_;
 
-  Mutex mutex_;
+  Mutex mutex_;  ///< held while an image is written
   Condition room_;
-  Thumbnails waiting_ GUARDED_BY(mutex_);
-  std::size_t bytes_ GUARDED_BY(mutex_) = 0;  ///< that wait or are under way
-  int calls_ GUARDED_BY(mutex_) = 0;          ///< under way
+  std::deque<ThumbnailBatch> waiting_ GUARDED_BY(mutex_);  ///< a call each
+  std::vector<ImageFile> read_ GUARDED_BY(mutex_);         ///< to be used again: memory costs time
+  std::size_t bytes_ GUARDED_BY(mutex_) = 0;               ///< that wait or are under way
+  int calls_ GUARDED_BY(mutex_) = 0;                       ///< under way
   bool isEnded_ GUARDED_BY(mutex_) = false;
   NSErrorRef failure_ GUARDED_BY(mutex_);
   std::function<void(NSErrorRef)> handler_ GUARDED_BY(mutex_);

@@ -1,8 +1,8 @@
 #include "platform/fileprovider/thumbnail_taker.h"
 
 #include <utility>
-#include <vector>
 
+#include "platform/fileprovider/thumbnail_batch.h"
 #include "platform/foundation/lock.h"
 #include "platform/foundation/serial_queue.h"
 #include "platform/ipc/server_call.h"
@@ -14,10 +14,10 @@ class ThumbnailTaker::State {
   State(const std::string& queueName, Take take)
       : queue(SerialQueue::create(queueName)), take_(std::move(take)) {}
 
-  void take(const std::vector<ItemThumbnail>& thumbnails) {
+  void take(const ThumbnailBatch& batch) {
     LockGuard guard(mutex_);
     if (!take_) return;
-    for (const ItemThumbnail& each : thumbnails) take_(each);
+    for (std::size_t i = 0; i < batch.size(); ++i) take_(batch.at(i));
   }
   void end() {
     LockGuard guard(mutex_);
@@ -37,12 +37,13 @@ class ThumbnailTaker::Receiver final : public protocol::ThumbnailReceiver::Serve
 
  protected:
   kj::Promise<void> didFetch(DidFetchContext context) override {
-    std::vector<ItemThumbnail> thumbnails;
-    for (const auto each : context.getParams().getThumbnails())
-      thumbnails.push_back(decodeThumbnail(each));
+    auto decoded = ThumbnailBatch::decode(context.getParams());
     context.releaseParams();
-    return ipc::onQueue(state_->queue, [state = state_, thumbnails = std::move(thumbnails)](
-                                           const ipc::CancelFlag&) { state->take(thumbnails); });
+    return decoded.then([state = state_](ThumbnailBatch batch) {
+      return ipc::onQueue(state->queue, [state, batch = std::move(batch)](const ipc::CancelFlag&) {
+        state->take(batch);
+      });
+    });
   }
 
  private:

@@ -5,6 +5,7 @@
 #include <string>
 
 #include "platform/fileprovider/thumbnail.h"
+#include "protocols/thumbnails.capnp.h"
 
 namespace yomber {
 

@@ -1,6 +1,10 @@
 # Precompiled headers for what is slow to parse: Cap'n Proto, GoogleTest, and what the command line is
-# written with. A target opts in with PCH capnp, gtest, gtest_capnp or command in yomber_room. The lint build parses without them, so that a file
-# that forgot an include is found there.
+# written with. A target opts in with PCH capnp, gtest, gtest_capnp or command in yomber_room. The
+# lint build parses everything but tests without them, so that a file that forgot an include is found
+# there.
+
+set(YOMBER_PRECOMPILE all CACHE STRING "Which targets use precompiled headers: all or tests")
+set_property(CACHE YOMBER_PRECOMPILE PROPERTY STRINGS all tests)
 
 set(YOMBER_GTEST_HEADERS <gtest/gtest.h> <gmock/gmock.h> <functional> <map> <memory> <mutex>
   <optional> <string> <thread> <vector>)
@@ -32,7 +36,7 @@ _yomber_precompiled(command ${YOMBER_COMMAND_HEADERS} ${YOMBER_CAPNP_HEADERS})
 
 # yomber_use_precompiled(<target> <gtest|capnp|gtest_capnp|command>)
 function(yomber_use_precompiled target kind)
-  if(NOT CMAKE_DISABLE_PRECOMPILE_HEADERS)
+  if(YOMBER_PRECOMPILE STREQUAL "all" OR kind MATCHES "gtest")
     target_precompile_headers(${target} REUSE_FROM yomber_pch_${kind})
   endif()
 endfunction()

@@ -1,11 +1,15 @@
 #include "benchmarks/process_use.h"
 
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
 #include <fstream>
+#include <set>
 #include <sstream>
 #include <stdexcept>
 #include <string>
-
-#include <unistd.h>
+#include <system_error>
 
 namespace yomber::bench {
 
@@ -26,6 +30,22 @@ double peakMebibytes(pid_t pid) {
     return kibibytes / 1024;
   }
   throw std::runtime_error("the memory of a process cannot be read");
+}
+
+double memoryFileMebibytes(pid_t pid) {
+  constexpr double kBlockBytes = 512;  // st_blocks, whatever the file system's own are
+  std::error_code gone;
+  std::set<ino_t> counted;
+  double bytes = 0;
+  for (const auto& each : std::filesystem::directory_iterator(pathOf(pid, "fd"), gone)) {
+    std::error_code closed;
+    const auto target = std::filesystem::read_symlink(each.path(), closed).string();
+    struct stat status{};
+    if (!target.starts_with("/memfd:") || stat(each.path().c_str(), &status) != 0) continue;
+    if (counted.insert(status.st_ino).second)
+      bytes += kBlockBytes * static_cast<double>(status.st_blocks);
+  }
+  return bytes / (1 << 20);
 }
 
 double processorSeconds(pid_t pid) {

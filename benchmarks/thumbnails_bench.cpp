@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iostream>
 #include <iterator>
 #include <random>
@@ -142,7 +143,7 @@ class Drive {
     double seconds = 0;
     double first = 0;  ///< seconds until the first
   };
-  Delivery fetchAll() {
+  Delivery fetchAll(const std::function<void()>& meanwhile = {}) {
     Delivery delivery;
     std::size_t pictures = 0;
     const auto begin = Clock::now();
@@ -153,6 +154,7 @@ class Drive {
                             [&](const ItemThumbnail& each) {
                               if (pictures == 0) delivery.first = elapsed();
                               if (each.image != nullptr) ++pictures;
+                              if (meanwhile) meanwhile();
                             }));
     delivery.seconds = elapsed();
     require(pictures == identifiers_.size(), "thumbnails are missing");
@@ -169,8 +171,12 @@ class Drive {
     return bench::secondsFor(
         [&] { run({"/bin/sh", "-c", "xargs cat < " + list + " > /dev/null"}); });
   }
-  [[nodiscard]] double extensionPeak() const {
-    return bench::peakMebibytes(drive_.pidOf(testing::TestDrive::Process::Extension));
+  /// What the extension has needed at most, the images under way included, in mebibytes.
+  [[nodiscard]] double extensionPeak() {
+    const pid_t extension = drive_.pidOf(testing::TestDrive::Process::Extension);
+    double images = 0;
+    (void)fetchAll([&] { images = std::max(images, bench::memoryFileMebibytes(extension)); });
+    return images + bench::peakMebibytes(extension);
   }
   bool nothingWasDownloaded() {
     std::string folder;

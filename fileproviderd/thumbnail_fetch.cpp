@@ -149,6 +149,8 @@ kj::Promise<void> ThumbnailFetch::forward(ThumbnailReceiver::DidFetchParams::Rea
                    .catch_([weak = weak_from_this()](kj::Exception&& exception) {
                      if (const auto self = weak.lock())
                        self->didForward(ipc::connectionError(exception));
+                     // An answer would say that the client has read the images.
+                     kj::throwFatalException(kj::mv(exception));
                    })
                    .fork();
   taken.addBranch().detach([](kj::Exception&&) {});

@@ -27,8 +27,8 @@ interface ImageFile {
 }
 
 interface ThumbnailReceiver {
-  # Who asked for thumbnails. A sender has at most two calls under way, and holds back until one of
-  # them is answered.
+  # Who asked for thumbnails. The extension has at most two calls of a request under way, and holds
+  # back until one of them is answered.
 
   didFetch @0 (thumbnails :List(Thumbnail), images :ImageFile) -> ();
   # Without images there is no file. The answer says that they have been read: the sender puts others

@@ -1,5 +1,6 @@
 #include "platform/fileprovider/image_file.h"
 
+#include <fcntl.h>
 #include <sys/mman.h>
 #include <unistd.h>
 
@@ -25,6 +26,9 @@ class Server final : public protocol::ImageFile::Server {
  private:
   const std::shared_ptr<const FileDescriptor> file_;
 };
+
+/// Reading anything else might wait for ever.
+bool isFileOfMemory(int descriptor) { return fcntl(descriptor, F_GET_SEALS) >= 0; }
 
 NSErrorRef unreadable(const std::string& why) {
   return NSError::errorWithDomain(NSCocoaErrorDomain, NSFileReadCorruptFileError,
@@ -96,7 +100,9 @@ NSDataRef ImageFile::read(ImagePlace place, NSErrorRef& error) const {
   if (place.length == 0) return NSData::dataWithString("");
   if (file_ == nullptr) {
     error = unreadable(
-        "the thumbnail's image did not arrive with it: this process may have too many files open");
+        "the thumbnail's image did not arrive with it: a process on its way may have too many "
+        "files "
+        "open");
     return nullptr;
   }
   std::string bytes;
@@ -116,7 +122,9 @@ kj::Promise<ImageFile> ImageFile::fromCapability(protocol::ImageFile::Client cap
     KJ_IF_MAYBE (shared, fd) {
       ipc::UniqueFd own;
       if (!outOfDescriptors.hit()) own = ipc::duplicateDescriptor(*shared);
-      if (own) images.file_ = std::make_shared<const FileDescriptor>(own.release());
+      if (own && isFileOfMemory(own.get())) {
+        images.file_ = std::make_shared<const FileDescriptor>(own.release());
+      }
     }
     return images;
   });

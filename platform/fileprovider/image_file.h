@@ -29,6 +29,8 @@ class ImageFile {
   /// The image at a place that somebody else tells of; nil with an error when there is none, or one
   /// that is too large for a thumbnail.
   [[nodiscard]] NSDataRef read(ImagePlace place, NSErrorRef& error) const;
+  /// Of what was appended; bytes.
+  [[nodiscard]] std::uint64_t length() const { return length_; }
   /// Forgets the images and keeps the memory for the next ones. Whoever has been sent the file must
   /// have read it.
   void clear() { length_ = 0; }
@@ -37,12 +39,12 @@ class ImageFile {
 
   // Loop thread only.
   [[nodiscard]] protocol::ImageFile::Client capability() const;
-  /// Without a file where none came along: there may have been no descriptor left.
+  /// Without a file where no file of memory came along: there may have been no descriptor left.
   static kj::Promise<ImageFile> fromCapability(protocol::ImageFile::Client capability);
 
  private:
   std::shared_ptr<const FileDescriptor> file_;
-  std::uint64_t length_ = 0;  ///< of what was appended
+  std::uint64_t length_ = 0;
 };
 
 /// Why an image of that many bytes is none.

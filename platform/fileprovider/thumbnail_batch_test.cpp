@@ -1,7 +1,9 @@
 #include "platform/fileprovider/thumbnail_batch.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
 #include <array>
@@ -154,6 +156,17 @@ TEST_F(ThumbnailBatchTest, PlacesOutsideOfTheFileAreErrors) {
   }
 }
 
+TEST_F(ThumbnailBatchTest, AnImageThatIsLargerThanAnyIsAnErrorAlsoWhereTheFileHasIt) {
+  FileDescriptor file(memfd_create("test", MFD_CLOEXEC));
+  ASSERT_EQ(ftruncate(file.get(), kMaximumThumbnailBytes + 1), 0);
+  const auto told = taken([&](Params params) {
+    tellOf(params, std::move(file));
+    params.getThumbnails()[0].getImage().getPlace().setLength(kMaximumThumbnailBytes + 1);
+  });
+  ASSERT_THAT(told, SizeIs(1));
+  expectError(told[0]);
+}
+
 TEST_F(ThumbnailBatchTest, AFileThatIsNoneIsAnError) {
   std::array<int, 2> ends{};
   ASSERT_EQ(pipe(ends.data()), 0);
@@ -161,6 +174,11 @@ TEST_F(ThumbnailBatchTest, AFileThatIsNoneIsAnError) {
   const auto ofPipe = taken([&](Params params) { tellOf(params, FileDescriptor(ends[0])); });
   ASSERT_THAT(ofPipe, SizeIs(1));
   expectError(ofPipe[0]);
+  const auto ofDevice = taken([](Params params) {
+    tellOf(params, FileDescriptor(open("/dev/zero", O_RDONLY | O_CLOEXEC)));
+  });
+  ASSERT_THAT(ofDevice, SizeIs(1));
+  expectError(ofDevice[0]);
   const auto ofNothing = taken([](Params params) { tellOf(params, FileDescriptor()); });
   ASSERT_THAT(ofNothing, SizeIs(1));
   expectError(ofNothing[0]);

@@ -3,14 +3,18 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <kj/debug.h>
+#include <sys/stat.h>
 
-#include <atomic>
+#include <algorithm>
 #include <cerrno>
+#include <filesystem>
 #include <functional>
 #include <limits>
 #include <memory>
 #include <set>
 #include <string>
+#include <system_error>
+#include <utility>
 #include <vector>
 
 #include "platform/fileprovider/errors.h"
@@ -73,39 +77,67 @@ class Receiver {
   void release() {
     ipc::EventLoop::shared().runAndWait([this] {
       holds = false;
-      for (auto& each : held_) each->fulfill();
+      for (auto& each : held_) {
+        addAll(each.batch);
+        each.answer->fulfill();
+      }
       held_.clear();
     });
   }
+  std::size_t taken() { return all().size(); }
+  /// Files of images that were there when a call came, by inode.
+  std::set<ino_t> files() {
+    LockGuard guard(mutex_);
+    return files_;
+  }
 
-  bool holds = false;    // loop thread once it is served
+  bool holds = false;    // loop thread once it is served; what is held has not been read
   bool refuses = false;  // loop thread once it is served
-  Gate arrived;
+  Gate arrived;          ///< a call has
 
  private:
-  kj::Promise<void> take(const ThumbnailBatch& batch) {
-    for (std::size_t i = 0; i < batch.size(); ++i) add(batch.at(i));
-    if (refuses) KJ_FAIL_REQUIRE("no more");
-    if (!holds) return kj::READY_NOW;
-    auto pair = kj::newPromiseAndFulfiller<void>();
-    held_.push_back(kj::mv(pair.fulfiller));
-    return kj::mv(pair.promise);
-  }
-  void add(ItemThumbnail thumbnail) {
-    {
-      LockGuard guard(mutex_);
-      thumbnails_.push_back(std::move(thumbnail));
-    }
+  struct Held {
+    ThumbnailBatch batch;
+    kj::Own<kj::PromiseFulfiller<void>> answer;
+  };
+
+  kj::Promise<void> take(ThumbnailBatch batch) {
+    noteFiles();
     arrived.open();
+    if (holds) {
+      auto pair = kj::newPromiseAndFulfiller<void>();
+      held_.push_back({std::move(batch), kj::mv(pair.fulfiller)});
+      return kj::mv(pair.promise);
+    }
+    addAll(batch);
+    if (refuses) KJ_FAIL_REQUIRE("no more");
+    return kj::READY_NOW;
+  }
+  void addAll(const ThumbnailBatch& batch) {
+    LockGuard guard(mutex_);
+    for (std::size_t i = 0; i < batch.size(); ++i) thumbnails_.push_back(batch.at(i));
+  }
+  void noteFiles() {
+    LockGuard guard(mutex_);
+    for (const auto& each : std::filesystem::directory_iterator("/proc/self/fd")) {
+      std::error_code gone;
+      const auto target = std::filesystem::read_symlink(each.path(), gone).string();
+      struct stat status{};
+      if (target.starts_with("/memfd:yomber-images") && stat(each.path().c_str(), &status) == 0)
+        files_.insert(status.st_ino);
+    }
   }
 
   Mutex mutex_;
   std::vector<ItemThumbnail> thumbnails_ GUARDED_BY(mutex_);
-  std::vector<kj::Own<kj::PromiseFulfiller<void>>> held_;  // loop thread
+  std::set<ino_t> files_ GUARDED_BY(mutex_);
+  std::vector<Held> held_;  // loop thread
 };
 
 class ThumbnailRequestTest : public testing::Test {
  protected:
+  ~ThumbnailRequestTest() override { receiver->release(); }  // a call that is held keeps everything
+
   /// Begins a request; `ended` opens with its failure.
   ipc::CallHandle begin(const std::vector<std::string>& identifiers, double side = 64) {
     return ipc::call(
@@ -243,44 +275,77 @@ TEST_F(ThumbnailRequestTest, AnImageThatIsTooLargeBecomesAnError) {
   EXPECT_NE(all[0].error, nullptr);
 }
 
-TEST_F(ThumbnailRequestTest, EveryImageIsItsOwnHoweverManyCallsTheyTake) {
+/// Images that tell themselves apart, four to a call.
+std::string imageNumber(int number) {
+  return std::string(static_cast<std::size_t>(300'000 + number), static_cast<char>('0' + number));
+}
+
+void expectImages(const std::vector<ItemThumbnail>& told, std::size_t count) {
+  std::set<std::string> identifiers;
+  for (const ItemThumbnail& each : told) {
+    identifiers.insert(each.identifier);
+    ASSERT_NE(each.image, nullptr) << each.identifier;
+    EXPECT_TRUE(each.image->bytes() == imageNumber(std::stoi(each.identifier))) << each.identifier;
+  }
+  EXPECT_THAT(identifiers, SizeIs(count));
+}
+
+TEST_F(ThumbnailRequestTest, EveryImageIsItsOwnInFilesThatAreUsedAgain) {
   constexpr int kCount = 40;
-  const auto imageOf = [](int i) { return std::string(300'000 + i, static_cast<char>('0' + i)); };
+  constexpr std::size_t kMostFiles = 8;
   extension->answer = [&](const auto&, CGSize, const auto& handler, const auto& completion) {
     for (int i = 0; i < kCount; ++i) {
-      handler(std::to_string(i), std::make_shared<NSData>(imageOf(i)), std::nullopt, nullptr);
+      handler(std::to_string(i), NSData::dataWithString(imageNumber(i)), std::nullopt, nullptr);
+      EXPECT_TRUE(receiver->arrived.wait(i + 1));  // so that each has a call of its own
     }
     completion(nullptr);
   };
   EXPECT_EQ(request({"a"}), nullptr);
-  std::set<std::string> told;
-  for (const ItemThumbnail& each : receiver->all()) {
-    told.insert(each.identifier);
-    ASSERT_NE(each.image, nullptr) << each.identifier;
-    EXPECT_TRUE(each.image->bytes() == imageOf(std::stoi(each.identifier))) << each.identifier;
-  }
-  EXPECT_THAT(told, SizeIs(kCount));
+  expectImages(receiver->all(), kCount);
+  EXPECT_LE(receiver->files().size(), kMostFiles);
+}
+
+TEST_F(ThumbnailRequestTest, AFileIsNotUsedAgainBeforeItsCallIsAnswered) {
+  receiver->holds = true;
+  constexpr int kCount = 12;  // more than two calls' and less than what holds the extension up
+  Gate delivered;
+  extension->answer = [&](const auto&, CGSize, const auto& handler, const auto& completion) {
+    for (int i = 0; i < kCount; ++i) {
+      handler(std::to_string(i), NSData::dataWithString(imageNumber(i)), std::nullopt, nullptr);
+    }
+    delivered.open();
+    completion(nullptr);
+  };
+  (void)begin({"a"});
+  ASSERT_TRUE(delivered.wait());
+  ASSERT_TRUE(receiver->arrived.wait(2));
+  receiver->release();
+  ASSERT_TRUE(ended.wait());
+  expectImages(receiver->all(), kCount);
 }
 
 TEST_F(ThumbnailRequestTest, AReceiverThatTakesNothingHoldsTheExtensionUp) {
   receiver->holds = true;
-  constexpr int kCount = 64;
-  std::atomic<int> delivered{0};
+  constexpr std::size_t kCount = 64;
+  constexpr std::size_t kMostAhead = 6;
+  Gate delivered;
+  std::size_t mostAhead = 0;
   extension->answer = [&](const auto&, CGSize, const auto& handler, const auto& completion) {
     const auto image = NSData::dataWithString(std::string(1 << 20, 'x'));
-    for (int i = 0; i < kCount; ++i) {
+    for (std::size_t i = 0; i < kCount; ++i) {
       handler("item " + std::to_string(i), image, std::nullopt, nullptr);
-      ++delivered;
+      delivered.open();
+      mostAhead = std::max(mostAhead, i + 1 - receiver->taken());
     }
     completion(nullptr);
   };
   (void)begin({"a"});
   ASSERT_TRUE(receiver->arrived.wait(2));
-  EXPECT_LT(delivered, 8);
+  ASSERT_TRUE(delivered.wait(4));
   receiver->release();
   ASSERT_TRUE(ended.wait());
-  EXPECT_EQ(delivered, kCount);
-  EXPECT_THAT(receiver->all(), SizeIs(kCount));
+  EXPECT_LE(mostAhead, kMostAhead);
+  EXPECT_EQ(receiver->taken(), kCount);
 }
 
 TEST_F(ThumbnailRequestTest, ARequestThatIsDroppedIsCancelledAndLetsTheExtensionGo) {

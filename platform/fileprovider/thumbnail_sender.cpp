@@ -12,36 +12,59 @@ constexpr int kMaximumCalls = 2;
 constexpr std::size_t kMaximumBytesWaiting = std::size_t{4} << 20U;
 constexpr std::size_t kBytesInCall = std::size_t{1} << 20U;
 constexpr std::size_t kThumbnailsInCall = 256;
+/// Of the files that have been read, so many are kept, and none that a large image has made large.
+constexpr std::size_t kFilesKept = 3;
+constexpr std::size_t kBytesInKeptFile = 2 * kBytesInCall;
+
+bool isFull(const ThumbnailBatch& batch) {
+  return batch.size() == kThumbnailsInCall || batch.bytes() >= kBytesInCall;
+}
 
 }  // namespace
 
 void ThumbnailSender::deliver(ItemThumbnail thumbnail) {
+  ThumbnailBatch batch;
   {
     LockGuard guard(mutex_);
     while (!isEnded_ && bytes_ >= kMaximumBytesWaiting) room_.wait(mutex_);
     if (isEnded_) return;
-    add(std::move(thumbnail));
+    batch = takeUnfilled();
   }
-  sendWhatWaits();
-}
-
-void ThumbnailSender::add(ItemThumbnail thumbnail) {
-  const auto isFull = [](const ThumbnailBatch& batch) {
-    return batch.size() == kThumbnailsInCall || batch.bytes() >= kBytesInCall;
-  };
-  if (waiting_.empty() || isFull(waiting_.back())) waiting_.emplace_back(takeFile());
-  ThumbnailBatch& batch = waiting_.back();
-  bytes_ -= batch.bytes();
+  const std::size_t before = batch.bytes();
   batch.add(std::move(thumbnail));
-  bytes_ += batch.bytes();
+  const std::size_t added = batch.bytes() - before;
+  didFill(std::move(batch), added);
 }
 
-ImageFile ThumbnailSender::takeFile() {
-  if (read_.empty()) return {};
+ThumbnailBatch ThumbnailSender::takeUnfilled() {
+  ++filling_;
+  if (!waiting_.empty() && !isFull(waiting_.back())) {
+    ThumbnailBatch batch = std::move(waiting_.back());
+    waiting_.pop_back();
+    return batch;
+  }
+  if (read_.empty()) return ThumbnailBatch();
   ImageFile file = std::move(read_.back());
   read_.pop_back();
   file.clear();
-  return file;
+  return ThumbnailBatch(std::move(file));
+}
+
+void ThumbnailSender::didFill(ThumbnailBatch batch, std::size_t added) {
+  std::function<void(NSErrorRef)> due;
+  NSErrorRef failure;
+  {
+    LockGuard guard(mutex_);
+    --filling_;
+    if (!isEnded_) {
+      bytes_ += added;
+      waiting_.push_back(std::move(batch));
+    }
+    due = takeHandler();
+    failure = failure_;
+  }
+  if (due) return due(failure);
+  sendWhatWaits();
 }
 
 void ThumbnailSender::finish(std::function<void(NSErrorRef)> handler) {
@@ -67,7 +90,7 @@ void ThumbnailSender::end() {
 }
 
 std::function<void(NSErrorRef)> ThumbnailSender::takeHandler() {
-  const bool isDue = calls_ == 0 && waiting_.empty();
+  const bool isDue = calls_ == 0 && filling_ == 0 && waiting_.empty();
   return isDue ? std::exchange(handler_, nullptr) : nullptr;
 }
 
@@ -97,6 +120,12 @@ void ThumbnailSender::send(std::shared_ptr<const ThumbnailBatch> batch) {
       {.timeout = std::chrono::milliseconds::zero()});
 }
 
+void ThumbnailSender::keepForReuse(const ImageFile& file) {
+  const bool isWorthIt =
+      file.exists() && file.length() <= kBytesInKeptFile && read_.size() < kFilesKept;
+  if (isWorthIt) read_.push_back(file);
+}
+
 void ThumbnailSender::didSend(const ThumbnailBatch& batch, NSErrorRef error) {
   std::function<void(NSErrorRef)> due;
   NSErrorRef failure;
@@ -106,8 +135,7 @@ void ThumbnailSender::didSend(const ThumbnailBatch& batch, NSErrorRef error) {
     --calls_;
     bytes_ -= batch.bytes();
     if (error == nullptr) {
-      // An answer says that the images have been read.
-      if (batch.images().exists()) read_.push_back(batch.images());
+      keepForReuse(batch.images());
     } else {
       if (failure_ == nullptr) failure_ = std::move(error);
       isEnded_ = true;

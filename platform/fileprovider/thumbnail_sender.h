@@ -33,22 +33,24 @@ class ThumbnailSender : public std::enable_shared_from_this<ThumbnailSender> {
   void end();
 
  private:
-  void add(ItemThumbnail thumbnail) REQUIRES(mutex_);
-  /// One that a receiver has read, or a new one.
-  [[nodiscard]] ImageFile takeFile() REQUIRES(mutex_);
+  /// The batch that is to be filled, which nobody else has meanwhile.
+  [[nodiscard]] ThumbnailBatch takeUnfilled() REQUIRES(mutex_);
+  void didFill(ThumbnailBatch batch, std::size_t added);
   void sendWhatWaits();
   void send(std::shared_ptr<const ThumbnailBatch> batch);
   void didSend(const ThumbnailBatch& batch, NSErrorRef error);
+  void keepForReuse(const ImageFile& file) REQUIRES(mutex_);
   /// The handler, when it is due.
   [[nodiscard]] std::function<void(NSErrorRef)> takeHandler() REQUIRES(mutex_);
 
   const ipc::Remote<protocol::ThumbnailReceiver> receiver_;
 
-  Mutex mutex_;  ///< held while an image is written
+  Mutex mutex_;
   Condition room_;
   std::deque<ThumbnailBatch> waiting_ GUARDED_BY(mutex_);  ///< a call each
   std::vector<ImageFile> read_ GUARDED_BY(mutex_);         ///< to be used again: memory costs time
   std::size_t bytes_ GUARDED_BY(mutex_) = 0;               ///< that wait or are under way
+  int filling_ GUARDED_BY(mutex_) = 0;                     ///< batches that are taken to be filled
   int calls_ GUARDED_BY(mutex_) = 0;                       ///< under way
   bool isEnded_ GUARDED_BY(mutex_) = false;
   NSErrorRef failure_ GUARDED_BY(mutex_);

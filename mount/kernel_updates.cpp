@@ -51,6 +51,7 @@ KernelUpdates::Found KernelUpdates::lookAgain(Node& folder, int descriptor,
   found.isOther = found.known && !isSame;
   if (found.isOther)
     nodes.removed({.folder = folder, .name = nameOnDisk, .node = found.known.get()});
+  if (found.isThere && !isSame) nodes.seen(folder, nameOnDisk, FileIdentity::of(found.status));
   return found;
 }
 

@@ -78,6 +78,16 @@ Node& NodeTable::found(Node& folder, std::string_view name, const struct statx& 
   return node;
 }
 
+void NodeTable::seen(Node& folder, std::string_view name, const FileIdentity& identity) {
+  std::vector<SharedDescriptor> ended;
+  LockGuard guard(mutex_);
+  Node* const node = byInode_.find(identity.inode);
+  const bool isNews = node != nullptr && node->identity == identity && !node->base &&
+                      (node->parent_ != &folder || node->name_ != name);
+  if (isNews) place(*node, folder, name);
+  ended.swap(ended_);
+}
+
 void NodeTable::forget(Node& node, std::uint64_t lookups) {
   std::vector<SharedDescriptor> ended;
   LockGuard guard(mutex_);

@@ -111,6 +111,9 @@ class NodeTable {
   /// The kernel is told of the file that was found in that place: one lookup more. `toldChange` is
   /// its ctime, ns.
   Node& found(Node& folder, std::string_view name, const struct statx& status);
+  /// Somebody else has moved a file to that place, or given it that name as well: it is there from
+  /// now on, when it is known, for whoever has it open or works in it.
+  void seen(Node& folder, std::string_view name, const FileIdentity& identity);
   /// The kernel gives lookups back.
   void forget(Node& node, std::uint64_t lookups);
 

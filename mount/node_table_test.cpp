@@ -53,6 +53,19 @@ TEST_F(NodeTableTest, AFileIsOneNodeHoweverOftenItIsFound) {
   EXPECT_EQ(nodes_.size(), 1U);
 }
 
+TEST_F(NodeTableTest, AFileIsWhereSomebodyElseHasMovedIt) {
+  Node& folder1 = folder(root_, "d", 10);
+  Node& below = file(folder1, "f", 11);
+  nodes_.removed(entry(root_, "d"));
+  EXPECT_EQ(wayTo(below), "gone");
+  nodes_.seen(root_, "e", folder1.identity);
+  EXPECT_EQ(wayTo(below), "e/f");
+  nodes_.seen(root_, "g", below.identity);
+  EXPECT_EQ(wayTo(below), "g");
+  nodes_.seen(root_, "h", {.inode = 11, .born = 7});
+  EXPECT_EQ(wayTo(below), "g") << "that is another file";
+}
+
 TEST_F(NodeTableTest, AnInodeNumberThatIsGivenAgainIsAnotherNode) {
   Node& first = file(root_, "a", 10);
   Node& second = nodes_.found(root_, "b", statusOf(10, S_IFREG, 2));

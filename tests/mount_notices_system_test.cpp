@@ -1,5 +1,7 @@
 // What the mount is told of changes while applications use what has changed.
 #include <array>
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <set>
@@ -100,6 +102,45 @@ TEST_F(MountNotices, WhatChangesBelowAFolderThatTheDriveLeavesAloneFromNowOnShow
   EXPECT_EQ(contentOf(at("d.part/sub/f")), "longer");
   fs::remove(onDisk("d.part/sub/g"));
   EXPECT_TRUE(eventually([&] { return !fs::exists(at("d.part/sub/g")); }));
+}
+
+/// What applications have open while the drive calls it, or a folder above it, something else.
+class RenamedElsewhere : public MountNotices {
+ protected:
+  void SetUp() override {
+    makeWitness();
+    fs::create_directories(at("d/sub"));
+    std::ofstream(at("d/sub/f")) << "content";
+    ASSERT_TRUE(isConfirmed("d/sub/f"));
+  }
+  /// Nobody looks up the new name here.
+  void renameElsewhere(const std::string& path, const std::string& name) {
+    ASSERT_EQ(mounted_.drive().yomber({"rename", path, name}).exitCode, 0);
+    waitForNotices();
+  }
+};
+
+TEST_F(RenamedElsewhere, AFolderIsWorkedInAsBefore) {
+  const OpenedFile folder(at("d"), O_RDONLY | O_DIRECTORY);
+  const OpenedFile below(at("d/sub"), O_PATH | O_DIRECTORY);
+  renameElsewhere("d", "e");
+  EXPECT_EQ(mkdirat(folder.get(), "new", 0700), 0) << strerror(errno);
+  struct stat status{};
+  EXPECT_EQ(fstatat(folder.get(), "sub/f", &status, 0), 0) << strerror(errno);
+  EXPECT_EQ(mkdirat(below.get(), "inner", 0700), 0) << strerror(errno);
+  EXPECT_TRUE(fs::is_directory(onDisk("e/sub/inner")));
+  EXPECT_TRUE(fs::exists(onDisk("e/new")));
+}
+
+TEST_F(RenamedElsewhere, AFileThatIsAwayIsReadAsBefore) {
+  const std::string content = someContent(200'000, 5);
+  std::ofstream(at("d/away")) << content;
+  ASSERT_TRUE(isConfirmed("d/away"));
+  evict("d/away");
+  const OpenedFile file(at("d/away"), O_RDONLY);
+  renameElsewhere("d/away", "other");
+  renameElsewhere("d", "e");
+  EXPECT_TRUE(file.read(content.size(), 0) == content);
 }
 
 TEST_F(MountNotices, ContentWhoseDateWasPutBackIsReadAnew) {

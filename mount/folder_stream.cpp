@@ -4,6 +4,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <string_view>
@@ -12,7 +13,8 @@ namespace yomber {
 namespace {
 
 constexpr std::size_t kBufferBytes = 64 << 10;
-/// Where what is no entry on the disk begins: behind all positions that file systems give.
+/// Where what is no entry on the disk begins: behind all positions that file systems give but that
+/// of the end, which may be the largest of all (ext4, btrfs).
 constexpr off_t kShownPosition = 0x7fff'ffff'ffff'0000;
 
 /// What getdents64 writes.
@@ -60,7 +62,7 @@ int FolderStream::look(Entry& entry) {
   entry.name = buffer_.data() + used_ + kNameOffset;
   entry.inode = found.inode;
   entry.type = found.type;
-  entry.next = found.next;
+  entry.next = std::min<off_t>(found.next, kShownPosition);
   return 0;
 }
 

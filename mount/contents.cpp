@@ -73,8 +73,24 @@ int truncateNow(fuse_req_t request, int place, off_t size, bool mayWait, bool ma
   int failure = isHere ? settleForWriting(file.get()) : 0;
   if (failure == 0 && ftruncate(file.get(), size) != 0) failure = errno;
   // Nothing of what is away is wanted any more when nothing stays.
-  if (failure == 0 && !isHere) takeMarksOff(file.get());
+  if (failure == 0 && !isHere) failure = takeMarksOff(file.get());
   return failure;
+}
+
+/// 0 or an errno. Who is filling the file, or gives it up, syncs it himself.
+int syncNow(const OpenFile& file, bool isDataOnly) {
+  FileDescriptor opened;
+  if (file.content() < 0) {
+    if (isBeingChanged(file.any())) return 0;
+    const std::string path = pathOfDescriptor(file.any());
+    for (const int access : {O_RDONLY, O_WRONLY}) {
+      opened = FileDescriptor(::open(path.c_str(), access | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+      if (opened || errno != EACCES) break;
+    }
+    if (!opened) return errno == EWOULDBLOCK ? 0 : errno;  // leased by him
+  }
+  const int descriptor = opened ? opened.get() : file.content();
+  return (isDataOnly ? fdatasync(descriptor) : ::fsync(descriptor)) == 0 ? 0 : errno;
 }
 
 }  // namespace
@@ -173,15 +189,7 @@ void FileSystem::fsync(fuse_req_t request, Node& node, int isDataOnly, fuse_file
     if (auto other = openFiles_.of(node)) file = std::move(other);
   }
   waitForDisk([request, file, isDataOnly] {
-    FileDescriptor opened;
-    if (file->content() < 0 && !isBeingChanged(file->any())) {
-      const std::string path = pathOfDescriptor(file->any());
-      opened = FileDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
-    }
-    const int descriptor = opened ? opened.get() : file->content();
-    int result = 0;  // who is filling it, or gives it up, syncs it himself
-    if (descriptor >= 0) result = isDataOnly != 0 ? fdatasync(descriptor) : ::fsync(descriptor);
-    (void)fuse_reply_err(request, result == 0 ? 0 : errno);
+    (void)fuse_reply_err(request, syncNow(*file, isDataOnly != 0));
   });
 }
 

@@ -11,9 +11,12 @@
 
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/fault_points.h"
 
 namespace yomber {
 namespace {
+
+FaultPoint markTaken("mount.mark.taken");
 
 /// What is left to us to open again with.
 constexpr int kKeptFlags = O_ACCMODE | O_SYNC | O_DSYNC;
@@ -31,19 +34,20 @@ bool isToBeSettled(int descriptor) {
 int settleForWriting(int descriptor) {
   if (!isToBeSettled(descriptor)) return 0;
   if (fdatasync(descriptor) != 0) return errno;
-  takeMarksOff(descriptor);
-  return 0;
+  return takeMarksOff(descriptor);
 }
 
 bool isBeingChanged(int descriptor) {
   return readAttribute(descriptor, kHeldDateAttribute, nullptr, 0) >= 0;
 }
 
-void takeMarksOff(int descriptor) {
+int takeMarksOff(int descriptor) {
+  if (markTaken.hit()) return EIO;
   // The fault first: the others mean nothing without it.
-  for (const char* mark : {kFaultAttribute, kFilledAttribute, kHeldDateAttribute}) {
-    (void)fremovexattr(descriptor, mark);
-  }
+  if (fremovexattr(descriptor, kFaultAttribute) != 0 && errno != ENODATA) return errno;
+  (void)fremovexattr(descriptor, kFilledAttribute);
+  (void)fremovexattr(descriptor, kHeldDateAttribute);
+  return 0;
 }
 
 OpenFile::OpenFile(NodeUse node, int flags, FileDescriptor content, FileDescriptor place)

@@ -75,8 +75,9 @@ class OpenFile {
 /// disturb him. `descriptor` may be of its place.
 [[nodiscard]] bool isBeingChanged(int descriptor);
 [[nodiscard]] bool isToBeSettled(int descriptor);
-/// Of a file whose old content nobody wants any more.
-void takeMarksOff(int descriptor);
+/// Of a file whose old content nobody wants any more. 0 or an errno: it is marked still, and what
+/// is written to it would not count.
+[[nodiscard]] int takeMarksOff(int descriptor);
 
 /// The files that are open, by node. Thread-safety: every operation may be called on any thread.
 class OpenFiles {

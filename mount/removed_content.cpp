@@ -60,8 +60,8 @@ class Fetching {
     if (NSErrorRef error = fill(file.get(), *record, before)) return error;
     const std::array<timespec, 2> dates{before.st_atim, before.st_mtim};
     (void)futimens(file.get(), dates.data());
-    takeMarksOff(file.get());
-    return nullptr;
+    const int failure = takeMarksOff(file.get());
+    return failure != 0 ? NSError::errorWithErrno(failure) : nullptr;
   }
 
  private:

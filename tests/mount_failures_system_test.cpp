@@ -6,6 +6,7 @@
 #include <string>
 
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -54,6 +55,31 @@ TEST_F(MountFailures, ContentThatTheStoreHasLostIsAnErrorAndNoOtherBytes) {
   fs::remove_all(assets());
   fs::rename(assets() + " elsewhere", assets());
   EXPECT_TRUE(eventually([&] { return contentOf(at("away")) == content_; }));
+}
+
+TEST_F(MountFailures, WhatCannotBeSyncedIsNotSaidToBe) {
+  makeAway("away", content_);
+  const OpenedFile file(at("away"), O_RDONLY);
+  EXPECT_EQ(fsync(file.get()), 0);
+  rlimit before{};
+  ASSERT_EQ(prlimit(mounted_.pid(), RLIMIT_NOFILE, nullptr, &before), 0);
+  const rlimit none{.rlim_cur = 3, .rlim_max = before.rlim_max};
+  ASSERT_EQ(prlimit(mounted_.pid(), RLIMIT_NOFILE, &none, nullptr), 0);
+  EXPECT_EQ(fsync(file.get()), -1);
+  EXPECT_EQ(errno, EMFILE);
+  ASSERT_EQ(prlimit(mounted_.pid(), RLIMIT_NOFILE, &before, nullptr), 0);
+  EXPECT_EQ(fsync(file.get()), 0);
+}
+
+class WhereMarksStay : public MountFailures {
+ protected:
+  WhereMarksStay() : MountFailures({}, {"mount.mark.taken"}) {}
+};
+
+TEST_F(WhereMarksStay, WhatIsAwayIsNotSaidToBeEmptied) {
+  makeAway("away", content_);
+  EXPECT_EQ(truncate(at("away").c_str(), 0), -1);
+  EXPECT_EQ(errno, EIO);
 }
 
 class WithoutRoom : public MountFailures {

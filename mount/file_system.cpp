@@ -229,13 +229,15 @@ void FileSystem::answerAttributes(fuse_req_t request, Node& node, struct statx s
 
 void FileSystem::answerBase(fuse_req_t request, std::uint32_t base) {
   Node& node = nodeOfBase(base);
+  const EntryGate::Moment begun = gate_.now(node.identity.inode);
   struct statx status{};
   const int failure = statusOf(node, status);
   if (failure != 0) {
     (void)fuse_reply_err(request, failure);
     return;
   }
-  fuse_entry_param entry = entryOf(node, node, status, true);
+  const EntryGate::Telling telling(gate_, node.identity.inode, begun);
+  fuse_entry_param entry = entryOf(node, node, status, telling.holds());
   nodes_.noteTold(node, nanoseconds(status.stx_ctime));
   // Which containers there are is told otherwise than entries are.
   entry.entry_timeout = kForTheMoment;

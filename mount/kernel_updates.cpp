@@ -1,9 +1,11 @@
 #include "mount/kernel_updates.h"
 
 #include <memory>
+#include <unordered_map>
 #include <utility>
 
 #include "platform/foundation/fault_points.h"
+#include "platform/foundation/lock.h"
 #include "platform/foundation/thread_pool.h"
 
 namespace yomber {
@@ -12,6 +14,33 @@ namespace {
 FaultPoint changeLooked("mount.change.looked");
 
 }  // namespace
+
+/// Whose content is being dropped on other threads, each on one. Thread-safety: any threads.
+class KernelUpdates::Dropping {
+ public:
+  /// False: somebody is at it, and will do it once more.
+  bool begin(const Node& node) {
+    LockGuard guard(mutex_);
+    const auto [place, isNew] = again_.try_emplace(&node, false);
+    if (!isNew) place->second = true;
+    return isNew;
+  }
+  /// The content has been dropped. True: once more.
+  bool isToBeDoneAgain(const Node& node) {
+    LockGuard guard(mutex_);
+    const auto place = again_.find(&node);
+    if (std::exchange(place->second, false)) return true;
+    again_.erase(place);
+    return false;
+  }
+
+ private:
+  Mutex mutex_;
+  std::unordered_map<const Node*, bool> again_ GUARDED_BY(mutex_);
+};
+
+KernelUpdates::KernelUpdates(FileSystem& files, KernelSession& session)
+    : files_(files), session_(session), dropping_(std::make_shared<Dropping>()) {}
 
 void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOnDisk) {
   files_.noteChangedEntry(folder, nameOnDisk);
@@ -109,10 +138,13 @@ void KernelUpdates::nodeIsOther(Node& node) {
   if (!files_.mayWaitForContent(node)) return session_.contentIsOther(node);
   session_.attributesAreOther(node);
   // The kernel drops no page that is being read, and waits: maybe for as long as content takes.
-  ThreadPool::shared().async(
-      [&session = session_, use = std::make_shared<NodeUse>(files_.nodes().use(node))] {
-        session.contentIsOther(*use->get());
-      });
+  if (!dropping_->begin(node)) return;
+  ThreadPool::shared().async([&session = session_, dropping = dropping_,
+                              use = std::make_shared<NodeUse>(files_.nodes().use(node))] {
+    do {
+      session.contentIsOther(*use->get());
+    } while (dropping->isToBeDoneAgain(*use->get()));
+  });
 }
 
 void KernelUpdates::anythingChanged() {

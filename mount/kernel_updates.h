@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <memory>
 #include <string>
 
 #include "mount/file_system.h"
@@ -13,7 +14,7 @@ namespace yomber {
 /// For one thread at a time, and none that answers requests.
 class KernelUpdates {
  public:
-  KernelUpdates(FileSystem& files, KernelSession& session) : files_(files), session_(session) {}
+  KernelUpdates(FileSystem& files, KernelSession& session);
 
   /// The entry of the folder with that inode has appeared, changed or gone.
   void entryChanged(std::uint64_t folder, const std::string& nameOnDisk);
@@ -43,8 +44,11 @@ class KernelUpdates {
   /// Content and attributes.
   void nodeIsOther(Node& node);
 
+  class Dropping;
+
   FileSystem& files_;
   KernelSession& session_;
+  const std::shared_ptr<Dropping> dropping_;
 };
 
 }  // namespace yomber

@@ -184,6 +184,42 @@ TEST_F(MountNames, ASecondNameIsRefusedAlsoOfWhatIsShownUnderAnotherName) {
   EXPECT_EQ(contentOf(at(shown)), someContent(50'000, 2));
 }
 
+/// Two names that are the same to a person: one is shown with a number.
+class ShownUnderAnotherName : public MountNames {
+ protected:
+  static constexpr const char* kComposed = "caf\u00e9";
+  static constexpr const char* kDecomposed = "cafe\u0301";
+  const std::string shown_ = std::string(kDecomposed) + " 2";
+
+  void SetUp() override {
+    std::ofstream(at(kComposed)) << "first";
+    ASSERT_TRUE(isConfirmed(kComposed));
+    std::ofstream(onDisk(kDecomposed)) << "second";
+    ASSERT_TRUE(eventually([&] { return fs::exists(at(shown_)); }));
+    ASSERT_TRUE(fs::exists(at(kDecomposed))) << "it can be looked up by its name on the disk";
+  }
+  void expectGoneByBoth() {
+    EXPECT_TRUE(eventually([&] { return !fs::exists(at(shown_)); }));
+    EXPECT_TRUE(eventually([&] { return !fs::exists(at(kDecomposed)); }));
+  }
+};
+
+TEST_F(ShownUnderAnotherName, WhatIsRemovedElsewhereIsGoneByBoth) {
+  fs::remove(onDisk(kDecomposed));
+  expectGoneByBoth();
+}
+
+TEST_F(ShownUnderAnotherName, WhatIsRemovedIsGoneByBoth) {
+  ASSERT_EQ(unlink(at(shown_).c_str()), 0);
+  expectGoneByBoth();
+}
+
+TEST_F(ShownUnderAnotherName, WhatGetsAnotherNameIsGoneByBoth) {
+  ASSERT_EQ(rename(at(shown_).c_str(), at("other").c_str()), 0);
+  expectGoneByBoth();
+  EXPECT_EQ(contentOf(at("other")), "second");
+}
+
 /// A document that is away, which somebody has open while it goes.
 class OpenedAway : public MountNames {
  protected:

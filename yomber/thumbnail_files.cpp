@@ -10,6 +10,7 @@
 
 #include "platform/foundation/bounced_name.h"
 #include "platform/foundation/file_descriptor.h"
+#include "platform/foundation/whole_transfer.h"
 
 namespace yomber {
 
@@ -26,16 +27,6 @@ std::string fileNameFor(const std::string& itemName, std::string_view suffix) {
   constexpr std::size_t longest = kMaximumNameLength - 16;
   if (name.size() + suffix.size() > longest) name.resize(longest - suffix.size());
   return name + std::string(suffix);
-}
-
-/// 0 or an errno value.
-int writeWhole(int descriptor, std::string_view bytes) {
-  while (!bytes.empty()) {
-    const ssize_t count = ::write(descriptor, bytes.data(), bytes.size());
-    if (count < 0 && errno != EINTR) return errno;
-    if (count > 0) bytes.remove_prefix(static_cast<std::size_t>(count));
-  }
-  return 0;
 }
 
 }  // namespace

@@ -13,6 +13,7 @@
 
 #include "platform/foundation/lock.h"
 #include "platform/foundation/uuid.h"
+#include "platform/foundation/whole_transfer.h"
 #include "platform/ipc/unix_socket.h"
 #include "platform/ostrell/constants.h"
 
@@ -83,22 +84,14 @@ bool readWhole(const std::string& path, std::string& text) {
   return true;
 }
 
-bool writeAll(int file, std::string_view text) {
-  while (!text.empty()) {
-    const ssize_t length = write(file, text.data(), text.size());
-    if (length < 0) return false;
-    text.remove_prefix(static_cast<std::size_t>(length));
-  }
-  return true;
-}
-
 /// Puts a new file in the place of the old one, so that a crash leaves either.
 NSErrorRef replaceFile(const std::string& path, std::string_view text) {
   const std::string aside = path + ".new";
   const ipc::UniqueFd file(open(aside.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
-  if (!file || !writeAll(file.get(), text) || fsync(file.get()) != 0) {
-    return NSError::errorWithErrno(errno, aside);
-  }
+  if (!file) return NSError::errorWithErrno(errno, aside);
+  int failure = writeWhole(file.get(), text);
+  if (failure == 0 && fsync(file.get()) != 0) failure = errno;
+  if (failure != 0) return NSError::errorWithErrno(failure, aside);
   if (rename(aside.c_str(), path.c_str()) != 0) return NSError::errorWithErrno(errno, path);
   const std::string directory = path.substr(0, path.rfind('/'));
   const ipc::UniqueFd parent(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));

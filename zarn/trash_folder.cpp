@@ -12,6 +12,7 @@
 #include "platform/foundation/bounced_name.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
+#include "platform/foundation/whole_transfer.h"
 #include "zarn/file_descriptor.h"
 
 namespace yomber {
@@ -20,16 +21,6 @@ namespace {
 constexpr mode_t kPrivateFile = 0600;
 constexpr std::size_t kLongestName = kMaximumNameLength - kTrashInfoSuffix.size();
 constexpr std::time_t kOthersGrace = 60;  // seconds
-
-int writeAll(int file, std::string_view text) {
-  while (!text.empty()) {
-    const ssize_t length = write(file, text.data(), text.size());
-    if (length < 0 && errno == EINTR) continue;
-    if (length < 0) return errno;
-    text.remove_prefix(static_cast<std::size_t>(length));
-  }
-  return 0;
-}
 
 }  // namespace
 
@@ -93,7 +84,7 @@ int TrashFolder::writeInfo(const std::string& path, const std::string& text) con
   const FileDescriptor file(
       open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kPrivateFile));
   if (!file) return errno;
-  int failure = writeAll(file.get(), text);
+  int failure = writeWhole(file.get(), text);
   // The sync of a file that is new brings its name to the disk as well, wherever names are
   // journalled; an item's own move comes after it in that journal.
   if (failure == 0 && fsync(file.get()) != 0) failure = errno;

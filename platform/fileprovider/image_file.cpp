@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <sys/mman.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <string>
@@ -10,6 +9,7 @@
 
 #include "platform/fileprovider/thumbnail.h"
 #include "platform/foundation/fault_points.h"
+#include "platform/foundation/whole_transfer.h"
 #include "platform/ipc/unix_socket.h"
 
 namespace yomber {
@@ -35,66 +35,31 @@ NSErrorRef unreadable(const std::string& why) {
                                   {{NSLocalizedDescriptionKey, why}});
 }
 
-/// 0 or an errno value.
-int writeAt(int file, std::string_view bytes, std::uint64_t offset) {
-  if (noMemory.hit()) return ENOSPC;
-  while (!bytes.empty()) {
-    const ssize_t count = pwrite(file, bytes.data(), bytes.size(), static_cast<off_t>(offset));
-    if (count < 0 && errno != EINTR) return errno;
-    if (count <= 0) continue;
-    bytes.remove_prefix(static_cast<std::size_t>(count));
-    offset += static_cast<std::uint64_t>(count);
-  }
-  return 0;
-}
-
-/// 0 or an errno value; `bytes` are fewer than was asked for where the file ends.
-int readAt(int file, ImagePlace place, std::string& bytes) {
-  int number = 0;
-  bytes.resize_and_overwrite(place.length, [&](char* buffer, std::size_t size) {
-    std::size_t done = 0;
-    while (done < size) {
-      const ssize_t count =
-          pread(file, buffer + done, size - done, static_cast<off_t>(place.offset + done));
-      if (count == 0) break;
-      if (count > 0) {
-        done += static_cast<std::size_t>(count);
-      } else if (errno != EINTR) {
-        number = errno;
-        break;
-      }
-    }
-    return done;
-  });
-  return number;
-}
-
-}  // namespace
-
-NSErrorRef imageTooLargeError(std::uint64_t length) {
+NSErrorRef tooLarge(std::uint64_t length) {
   return unreadable("the thumbnail has " + std::to_string(length) +
                     " bytes, more than any that is shown");
 }
 
+}  // namespace
+
 NSErrorRef ImageFile::append(std::string_view image, ImagePlace& place) {
-  if (!image.empty() && file_ == nullptr) {
+  if (image.size() > kMaximumThumbnailBytes) return tooLarge(image.size());
+  place = {.offset = length_, .length = image.size()};
+  if (image.empty()) return nullptr;
+  if (file_ == nullptr) {
     FileDescriptor made(memfd_create("yomber-images", MFD_CLOEXEC));
     if (!made) return NSError::errorWithErrno(errno);
     file_ = std::make_shared<const FileDescriptor>(std::move(made));
   }
-  if (!image.empty()) {
-    if (const int number = writeAt(file_->get(), image, length_)) {
-      return NSError::errorWithErrno(number);
-    }
-  }
-  place = {.offset = length_, .length = image.size()};
+  const int number = noMemory.hit() ? ENOSPC : writeWhole(file_->get(), image, length_);
+  if (number != 0) return NSError::errorWithErrno(number);
   length_ += image.size();
   return nullptr;
 }
 
 NSDataRef ImageFile::read(ImagePlace place, NSErrorRef& error) const {
   if (place.length > kMaximumThumbnailBytes) {
-    error = imageTooLargeError(place.length);
+    error = tooLarge(place.length);
     return nullptr;
   }
   if (place.length == 0) return NSData::dataWithString("");
@@ -105,8 +70,13 @@ NSDataRef ImageFile::read(ImagePlace place, NSErrorRef& error) const {
         "open");
     return nullptr;
   }
+  int number = 0;
   std::string bytes;
-  const int number = readAt(file_->get(), place, bytes);
+  bytes.resize_and_overwrite(place.length, [&](char* buffer, std::size_t size) {
+    std::size_t done = 0;
+    number = readWhole(file_->get(), {buffer, size}, place.offset, done);
+    return done;
+  });
   if (bytes.size() == place.length) return std::make_shared<const NSData>(std::move(bytes));
   error = number != 0 ? NSError::errorWithErrno(number)
                       : unreadable("the thumbnail's image is not whole");

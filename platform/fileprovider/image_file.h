@@ -24,7 +24,8 @@ struct ImagePlace {
 /// Thread-safety: one thread at a time; for reading, any.
 class ImageFile {
  public:
-  /// Puts the image behind those that are there. With an error it is not there.
+  /// Puts the image behind those that are there. With an error it is not there: it is too large for
+  /// a thumbnail, or finds no memory.
   [[nodiscard]] NSErrorRef append(std::string_view image, ImagePlace& place);
   /// The image at a place that somebody else tells of; nil with an error when there is none, or one
   /// that is too large for a thumbnail.
@@ -46,8 +47,5 @@ class ImageFile {
   std::shared_ptr<const FileDescriptor> file_;
   std::uint64_t length_ = 0;
 };
-
-/// Why an image of that many bytes is none.
-[[nodiscard]] NSErrorRef imageTooLargeError(std::uint64_t length);
 
 }  // namespace yomber

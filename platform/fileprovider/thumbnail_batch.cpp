@@ -18,14 +18,8 @@ void ThumbnailBatch::add(ItemThumbnail thumbnail) {
   Entry& entry = entries_.emplace_back(Entry{std::move(thumbnail), std::nullopt});
   bytes_ += kOverhead;
   if (image == nullptr) return;
-  NSErrorRef error;
   ImagePlace place;
-  if (image->length() > kMaximumThumbnailBytes) {
-    error = imageTooLargeError(image->length());
-  } else {
-    error = images_.append(image->bytes(), place);
-  }
-  if (error != nullptr) {
+  if (NSErrorRef error = images_.append(image->bytes(), place)) {
     entry.thumbnail.error = std::move(error);
     return;
   }

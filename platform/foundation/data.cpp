@@ -5,13 +5,13 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdint>
 #include <cstring>
 #include <span>
 
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/hexadecimal.h"
+#include "platform/foundation/whole_transfer.h"
 
 namespace yomber {
 
@@ -29,20 +29,13 @@ NSDataRef NSData::dataWithContentsOfFile(const std::string& path, std::size_t ma
   if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return nullptr;
   const auto length = static_cast<std::uint64_t>(status.st_size);
   if (length > maximumLength) return nullptr;
-  bool isWhole = true;
   std::string bytes;
   bytes.resize_and_overwrite(length, [&](char* buffer, std::size_t size) {
     std::size_t done = 0;
-    while (done < size) {
-      const ssize_t count = read(file.get(), buffer + done, size - done);
-      if (count < 0 && errno == EINTR) continue;
-      if (count <= 0) break;
-      done += static_cast<std::size_t>(count);
-    }
-    isWhole = done == size;
+    (void)readWhole(file.get(), {buffer, size}, 0, done);
     return done;
   });
-  return isWhole ? std::make_shared<const NSData>(std::move(bytes)) : nullptr;
+  return bytes.size() == length ? std::make_shared<const NSData>(std::move(bytes)) : nullptr;
 }
 
 void NSData::getBytes(void* buffer, std::size_t length) const {

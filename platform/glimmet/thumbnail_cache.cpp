@@ -16,6 +16,7 @@
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/hexadecimal.h"
 #include "platform/foundation/percent_encoding.h"
+#include "platform/foundation/whole_transfer.h"
 
 namespace yomber {
 namespace {
@@ -103,16 +104,6 @@ std::string readStart(const std::string& path) {
   return text.starts_with(kSignature) ? text : std::string();
 }
 
-bool writeAll(int file, std::string_view bytes) {
-  while (!bytes.empty()) {
-    const ssize_t count = write(file, bytes.data(), bytes.size());
-    if (count < 0 && errno == EINTR) continue;
-    if (count <= 0) return false;
-    bytes.remove_prefix(static_cast<std::size_t>(count));
-  }
-  return true;
-}
-
 /// For this user alone, and so what is missing above it.
 NSErrorRef makePrivateDirectory(const std::filesystem::path& path) {
   std::error_code failure;
@@ -160,11 +151,11 @@ NSErrorRef ThumbnailCache::store(const File& file, Flavour flavour, std::string_
                             textChunk("Thumb::MTime", std::to_string(file.mtime)) +
                             textChunk("Thumb::Size", std::to_string(file.size)) +
                             textChunk("Software", "Yomber Drive");
-  const bool isWritten = writeAll(output.get(), png.substr(0, kHeaderLength)) &&
-                         writeAll(output.get(), texts) &&
-                         writeAll(output.get(), png.substr(kHeaderLength));
-  if (isWritten && rename(aside.c_str(), path.c_str()) == 0) return nullptr;
-  const int number = errno;
+  const std::string head = std::string(png.substr(0, kHeaderLength)) + texts;
+  int number = writeWhole(output.get(), head);
+  if (number == 0) number = writeWhole(output.get(), png.substr(kHeaderLength), head.size());
+  if (number == 0 && rename(aside.c_str(), path.c_str()) != 0) number = errno;
+  if (number == 0) return nullptr;
   (void)unlink(aside.c_str());
   return NSError::errorWithErrno(number, path);
 }

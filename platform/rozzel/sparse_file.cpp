@@ -1,12 +1,11 @@
 #include "platform/rozzel/sparse_file.h"
 
-#include <unistd.h>
-
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
 
+#include "platform/foundation/whole_transfer.h"
 #include "platform/rozzel/store_failure.h"
 
 namespace yomber {
@@ -15,17 +14,6 @@ namespace {
 
 constexpr std::size_t kBlockBytes = 4096;
 constexpr std::array<std::byte, kBlockBytes> kZeroBlock{};
-
-void writeFully(int descriptor, std::span<const std::byte> bytes, std::uint64_t offset) {
-  while (!bytes.empty()) {
-    const ssize_t count =
-        pwrite(descriptor, bytes.data(), bytes.size(), static_cast<off_t>(offset));
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) throwErrno("cannot write content");
-    bytes = bytes.subspan(static_cast<std::size_t>(count));
-    offset += static_cast<std::uint64_t>(count);
-  }
-}
 
 /// The bytes from `offset` up to the next boundary of a block.
 std::size_t leadingBlock(std::span<const std::byte> bytes, std::uint64_t offset) {
@@ -40,14 +28,9 @@ bool isZero(std::span<const std::byte> block) {
 
 std::size_t readFully(int descriptor, std::span<std::byte> bytes, std::uint64_t offset) {
   std::size_t done = 0;
-  while (done < bytes.size()) {
-    const ssize_t count = pread(descriptor, bytes.data() + done, bytes.size() - done,
-                                static_cast<off_t>(offset + done));
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) throwErrno("cannot read content");
-    if (count == 0) break;
-    done += static_cast<std::size_t>(count);
-  }
+  errno =
+      readWhole(descriptor, {reinterpret_cast<char*>(bytes.data()), bytes.size()}, offset, done);
+  if (errno != 0) throwErrno("cannot read content");
   return done;
 }
 
@@ -63,7 +46,8 @@ void writeSparsely(int descriptor, std::span<const std::byte> bytes, std::uint64
       }
       run += block;
     }
-    writeFully(descriptor, bytes.first(run), offset);
+    errno = writeWhole(descriptor, {reinterpret_cast<const char*>(bytes.data()), run}, offset);
+    if (errno != 0) throwErrno("cannot write content");
     bytes = bytes.subspan(run + zeros);
     offset += run + zeros;
   }

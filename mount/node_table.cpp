@@ -73,7 +73,7 @@ Node& NodeTable::found(Node& folder, std::string_view name, const struct statx& 
   Node& node = *known;
   ++node.lookups_;
   node.mayBeAway = mayHaveHoles(status);
-  if (!node.base && (node.parent_ != &folder || node.name_ != name)) place(node, folder, name);
+  place(node, folder, name);
   note(node, nanoseconds(status.stx_ctime));
   return node;
 }
@@ -82,9 +82,7 @@ void NodeTable::seen(Node& folder, std::string_view name, const FileIdentity& id
   std::vector<SharedDescriptor> ended;
   LockGuard guard(mutex_);
   Node* const node = byInode_.find(identity.inode);
-  const bool isNews = node != nullptr && node->identity == identity && !node->base &&
-                      (node->parent_ != &folder || node->name_ != name);
-  if (isNews) place(*node, folder, name);
+  if (node != nullptr && node->identity == identity) place(*node, folder, name);
   ended.swap(ended_);
 }
 
@@ -231,7 +229,9 @@ Node* NodeTable::at(const Node& folder, std::string_view name) const {
   return byPlace_.find(PlaceKey{&folder, name});
 }
 
+/// A base has no place.
 void NodeTable::place(Node& node, Node& folder, std::string_view name) {
+  if (node.base || (node.parent_ == &folder && node.name_ == name)) return;
   if (Node* const other = at(folder, name); other != nullptr && other != &node) {
     ++other->uses_;
     unplace(*other);

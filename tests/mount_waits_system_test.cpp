@@ -27,6 +27,7 @@
 #include "tests/harness/aside.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
+#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 namespace {
@@ -37,18 +38,6 @@ using Process = TestDrive::Process;
 constexpr std::size_t kSize = 50'000;
 constexpr off_t kInside = 30'000;
 constexpr const char* kCopying = "zarn.fill.copying";
-
-/// A process that has stopped, until the object goes.
-class Stopped {
- public:
-  explicit Stopped(pid_t process) : process_(process) { ::kill(process_, SIGSTOP); }
-  ~Stopped() { ::kill(process_, SIGCONT); }
-  Stopped(const Stopped&) = delete;
-  Stopped& operator=(const Stopped&) = delete;
-
- private:
-  const pid_t process_;
-};
 
 int readOneByte(const std::string& path) {
   const OpenedFile file(path, O_RDONLY);
@@ -116,7 +105,7 @@ class WhenOneStops : public MountFixture {
     std::ofstream(at("here")) << "here";
     const OpenedFile file(at("away"), O_RDONLY);
     {
-      auto stopped = std::make_unique<Stopped>(mounted_.drive().pidOf(process));
+      auto stopped = std::make_unique<StoppedProcess>(mounted_.drive().pidOf(process));
       Aside reading([&] {
         char byte = 0;
         return static_cast<int>(pread(file.get(), &byte, 1, kInside));
@@ -172,7 +161,7 @@ TEST_F(ManyWhoWait, AreInterruptedAtOnce) {
   for (int i = 0; i <= kReaders; ++i)
     ASSERT_TRUE(eventually([&] { return isAway("d/" + std::to_string(i)); }));
   // Nobody starts the host again.
-  const Stopped supervisor(mounted_.drive().status()["supervisor"]["pid"].get<pid_t>());
+  const StoppedProcess supervisor(mounted_.drive().status()["supervisor"]["pid"].get<pid_t>());
   mounted_.drive().kill(Process::Host);
   std::vector<std::unique_ptr<Aside>> readers;
   for (int i = 0; i < kReaders; ++i) {

@@ -28,6 +28,7 @@
 #include "platform/foundation/temporary_directory.h"
 #include "platform/ipc/unix_socket.h"
 #include "tests/harness/service_caller.h"
+#include "tests/harness/stopped_process.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {
@@ -52,18 +53,6 @@ std::size_t descriptorsOf(pid_t process) {
   return static_cast<std::size_t>(std::distance(
       std::filesystem::directory_iterator("/proc/" + std::to_string(process) + "/fd"), {}));
 }
-
-/// A process that makes no step for as long as the object lives.
-class Stopped {
- public:
-  explicit Stopped(pid_t process) : process_(process) { ::kill(process_, SIGSTOP); }
-  ~Stopped() { ::kill(process_, SIGCONT); }
-  Stopped(const Stopped&) = delete;
-  Stopped& operator=(const Stopped&) = delete;
-
- private:
-  const pid_t process_;
-};
 
 /// Where visitors wait until it is opened.
 class VisitorGate {
@@ -188,7 +177,7 @@ class ServicesSystem : public ::testing::Test {
     }
     expectAllSay(visitors, "connected");
     if (::testing::Test::HasFailure()) return;
-    std::optional<Stopped> stopped;
+    std::optional<StoppedProcess> stopped;
     const bool isHeld = moment == "held";
     if (isHeld) stopped.emplace(drive_.pidOf(TestDrive::Process::Zarn));
     gate.open();
@@ -253,7 +242,7 @@ TEST_F(ServicesSystem, AnExtensionThatIsKilledInterruptsItsClientsOnceWhoAskAgai
   for (const std::string& identifier : identifiers_) clients.emplace_back(*services_, identifier);
   {
     // What it asks zarn stays under way.
-    const Stopped zarn(drive_.pidOf(TestDrive::Process::Zarn));
+    const StoppedProcess zarn(drive_.pidOf(TestDrive::Process::Zarn));
     for (const auto& client : clients) client.callEverything();
     for (const auto& client : clients)
       EXPECT_TRUE(eventually([&] { return client.ends->count() > 0; })) << "they are heard";

@@ -18,14 +18,17 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include "zarn/item_attributes.h"
+
 namespace yomber::testing {
 
 /// Tries operations in one folder, and writes down what comes of them.
 class Bench {
  public:
   /// `holder`: whose descriptors `settle` looks at; 0: nobody keeps a file open after its close.
-  explicit Bench(std::string folder, pid_t holder = 0)
-      : folder_(std::move(folder)), holder_(holder) {}
+  /// `tree`: where the drive has that folder on the disk; empty: it is no drive's.
+  explicit Bench(std::string folder, pid_t holder = 0, std::string tree = {})
+      : folder_(std::move(folder)), holder_(holder), tree_(std::move(tree)) {}
 
   [[nodiscard]] std::string at(const std::string& name) const { return folder_ + "/" + name; }
   [[nodiscard]] const std::string& text() const { return text_; }
@@ -42,12 +45,7 @@ class Bench {
   /// later, and as long as it has one open, who opens it joins in.
   void settle(const std::string& name) {
     const std::string end = std::filesystem::path(folder_).filename().string() + "/" + name;
-    const auto start = std::chrono::steady_clock::now();
-    while (holder_ != 0 && holds(end)) {
-      if (std::chrono::steady_clock::now() - start > std::chrono::minutes(1))
-        return say("still open: " + name);
-      std::this_thread::yield();
-    }
+    waitUntil("still open: " + name, [&] { return holder_ == 0 || !holds(end); });
   }
 
   /// What stat shows of an entry.
@@ -60,13 +58,15 @@ class Bench {
         " device " + std::to_string(status.st_rdev));
   }
   /// Which dates of these entries an operation changes. All are long past before it, but for those
-  /// of the status, since when the clock has moved on.
+  /// of the status, since when the clock has moved on. The drive's own change of the status, when
+  /// it gives a new item its identifier, is waited for.
   void dates(const char* what, const std::vector<std::string>& names,
              const std::function<long()>& operation) {
     constexpr timespec kPast{.tv_sec = 1'000'000, .tv_nsec = 0};
     const timespec times[2]{kPast, kPast};
     std::map<std::string, struct stat> before;
     for (const std::string& name : names) {
+      waitUntil("without an identifier: " + name, [&] { return tree_.empty() || isSettled(name); });
       struct stat status{};
       if (utimensat(AT_FDCWD, at(name).c_str(), times, AT_SYMLINK_NOFOLLOW) == 0 &&
           lstat(at(name).c_str(), &status) == 0) {
@@ -126,6 +126,17 @@ class Bench {
   }
 
  private:
+  void waitUntil(const std::string& otherwise, const std::function<bool()>& condition) {
+    const auto start = std::chrono::steady_clock::now();
+    while (!condition()) {
+      if (std::chrono::steady_clock::now() - start > std::chrono::minutes(1)) return say(otherwise);
+      std::this_thread::yield();
+    }
+  }
+  /// Not there, or known to the drive.
+  [[nodiscard]] bool isSettled(const std::string& name) const {
+    return getxattr((tree_ + "/" + name).c_str(), kIDAttribute, nullptr, 0) > 0 || errno == ENOENT;
+  }
   /// Until the clock that file systems take dates from is past that.
   static void waitForClock(const timespec& date) {
     timespec now{};
@@ -146,6 +157,7 @@ class Bench {
 
   const std::string folder_;
   const pid_t holder_;
+  const std::string tree_;
   std::string text_;
 };
 

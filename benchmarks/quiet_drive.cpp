@@ -8,11 +8,7 @@
 namespace yomber::bench {
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
 constexpr std::chrono::minutes kPatience{60};
-/// Jobs are made a few thousand at a time: those that there are may be done before the next ones.
-constexpr std::chrono::seconds kRest{2};
 
 bool isQuiet(const testing::TestDrive& drive) {
   const auto status = drive.status();
@@ -26,12 +22,7 @@ bool isQuiet(const testing::TestDrive& drive) {
 }  // namespace
 
 void waitUntilQuiet(const testing::TestDrive& drive) {
-  Clock::time_point lastBusy = Clock::now();
-  const auto hasRested = [&] {
-    if (!isQuiet(drive)) lastBusy = Clock::now();
-    return Clock::now() - lastBusy >= kRest;
-  };
-  if (!testing::eventually(hasRested, kPatience))
+  if (!testing::eventually([&] { return isQuiet(drive); }, kPatience))
     throw std::runtime_error("the drive does not come to rest");
 }
 

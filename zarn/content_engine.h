@@ -53,7 +53,7 @@ struct ContentTransfer {
 
 struct ContentTransfers {
   std::vector<ContentTransfer> transfers;  ///< those under way first, then those that failed
-  std::uint64_t waiting = 0;               ///< jobs, whether or not listed here
+  std::uint64_t waiting = 0;               ///< jobs, whether or not listed or made already
   std::uint64_t finished = 0;              ///< that moved something, since the engine was made
   bool isOffline = false;                  ///< the store was out of reach when last asked
 };

@@ -402,7 +402,7 @@ ContentTransfers Engine::transfers(std::size_t limit) const {
   (void)core_->database().read([&](Connection& connection) {
     const std::int64_t account = core_->queue->account();
     failed = failedJobs(connection, account, limit);
-    result.waiting = countJobs(connection, account);
+    result.waiting = countJobs(connection, account) + countUnswept(connection);
   });
   const std::size_t running = result.transfers.size();
   for (const Job& job : failed) {

@@ -177,4 +177,17 @@ bool ContentParticipant::sweep(WriteTransaction& transaction) {
   return false;
 }
 
+std::uint64_t countUnswept(Connection& connection) {
+  const std::int64_t at = metaInteger(connection, meta::kSweptUpTo);
+  if (at == kAllSwept) return 0;
+  StatementUse statement(connection.prepared(
+      "SELECT COUNT(*) FROM item WHERE seq>?1 AND kind=?2"
+      " AND NOT EXISTS (SELECT 1 FROM content WHERE content.id=item.id)"
+      " AND NOT EXISTS (SELECT 1 FROM job WHERE job.item=item.id AND job.kind=?3)"));
+  statement->bindInteger(1, at);
+  statement->bindInteger(2, static_cast<std::int64_t>(ItemKind::Document));
+  statement->bindInteger(3, static_cast<std::int64_t>(JobKind::Upload));
+  return statement->step() ? statement->id(0) : 0;
+}
+
 }  // namespace yomber

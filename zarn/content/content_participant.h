@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -45,6 +46,8 @@ class ContentParticipant : public CommitParticipant {
   const std::int64_t uploadPause_;
 };
 
+/// Documents that the sweep has still to give jobs. Looks at each of them.
+[[nodiscard]] std::uint64_t countUnswept(Connection& connection);
 /// Whether the store's record says what the row does, and has its content.
 [[nodiscard]] bool isConfirmed(const ItemRow& row, const ContentRow& content);
 /// The account whose record of a folder has to be made, changed or removed; nothing when it need

@@ -470,13 +470,19 @@ class FirstUploadsTest : public ContentUploadsTest {
   [[nodiscard]] std::uint64_t finished() const { return engine->transfers().finished; }
 };
 
+TEST_F(FirstUploadsTest, DocumentsWaitBeforeThereAreJobsForThem) {
+  EXPECT_EQ(engine->transfers().waiting, kDocuments);
+}
+
 TEST_F(FirstUploadsTest, ADocumentIsUploadedWhenItsFileIsMarked) {
   engine->sweep();
   std::uint32_t count = 0;
   ASSERT_EQ(scanner->stampSome(3, count), nullptr);  // the root, the trash and a document
   engine->didStamp();
-  ASSERT_TRUE(waitUntil([&] { return finished() > 0 && engine->transfers().waiting == 0; }));
+  ASSERT_TRUE(waitUntil([&] { return finished() > 0; }));
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
   EXPECT_EQ(finished(), 1U);
+  EXPECT_EQ(engine->transfers().waiting, kDocuments - 1);
   stampAll();
   engine->didStamp();
   ASSERT_TRUE(waitUntil([&] { return finished() == kDocuments; }));

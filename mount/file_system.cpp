@@ -41,6 +41,13 @@ FileSystem::FileSystem(std::unique_ptr<Places> places, std::shared_ptr<ContentRe
       folders_(nodes_, *places_),
       openFiles_({.open = [this](int descriptor) { return session_->openBacking(descriptor); },
                   .close = [this](int number) { session_->closeBacking(number); }}),
+      entryNotices_(
+          [this](const EntryNotices::Notice& notice) {
+            const auto tell =
+                notice.isOther ? &KernelSession::entryIsOther : &KernelSession::entryMayBeOther;
+            (session_->*tell)(*notice.folder.get(), notice.name);
+          },
+          ThreadPool::shared()),
       waits_(requests_),
       root_(&nodeOfBase(Places::kRoot)),
       disk_({.promptThreads = 4, .maximumThreads = 64, .keptIdleThreads = 1}) {}

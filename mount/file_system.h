@@ -11,6 +11,7 @@
 #include "mount/content_waits.h"
 #include "mount/desktop_thumbnails.h"
 #include "mount/entry_gate.h"
+#include "mount/entry_notices.h"
 #include "mount/folder_descriptors.h"
 #include "mount/folder_stream.h"
 #include "mount/fuse.h"
@@ -57,6 +58,7 @@ class FileSystem {
   [[nodiscard]] Places& places() { return *places_; }
   [[nodiscard]] FolderDescriptors& folders() { return folders_; }
   [[nodiscard]] EntryGate& gate() { return gate_; }
+  [[nodiscard]] EntryNotices& entryNotices() { return entryNotices_; }
   [[nodiscard]] ContentWaits& contentWaits() { return waits_; }
   [[nodiscard]] Node& root() const { return *root_; }
   [[nodiscard]] Node& nodeOf(fuse_ino_t number) const;
@@ -181,6 +183,7 @@ class FileSystem {
     Node* newFolder = nullptr;
     std::string newName;
     unsigned flags = 0;
+    std::shared_ptr<const EntryNotices::Hold> hold;  ///< when the move waits
   };
   void renameNow(fuse_req_t request, const Move& move);
   /// The moves that need an answer of the host first.
@@ -227,6 +230,7 @@ class FileSystem {
   FolderDescriptors folders_;
   OpenFiles openFiles_;
   EntryGate gate_;
+  EntryNotices entryNotices_;
   ContentWaits waits_;
   Node* const root_;
   std::atomic<bool> isTold_ = false;

@@ -1,5 +1,6 @@
 #include "mount/kernel_updates.h"
 
+#include <cstddef>
 #include <memory>
 #include <unordered_map>
 #include <utility>
@@ -12,6 +13,8 @@ namespace yomber {
 namespace {
 
 FaultPoint changeLooked("mount.change.looked");
+
+constexpr std::size_t kToldTogether = 1000;
 
 }  // namespace
 
@@ -42,6 +45,13 @@ class KernelUpdates::Dropping {
 KernelUpdates::KernelUpdates(FileSystem& files, KernelSession& session)
     : files_(files), session_(session), dropping_(std::make_shared<Dropping>()) {}
 
+void KernelUpdates::noteEntry(Node& folder, const std::string& name, bool isOther) {
+  entries_.push_back({files_.nodes().use(folder), name, isOther});
+  if (entries_.size() >= kToldTogether) tellEntries();
+}
+
+void KernelUpdates::tellEntries() { files_.entryNotices().send(std::exchange(entries_, {})); }
+
 void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOnDisk) {
   files_.noteChangedEntry(folder, nameOnDisk);
   NodeTable& nodes = files_.nodes();
@@ -55,12 +65,12 @@ void KernelUpdates::entryChanged(std::uint64_t folder, const std::string& nameOn
   const std::string shown = files_.places().shownName(folder, nameOnDisk);
   const std::int64_t change = nanoseconds(found.status.stx_ctime);
   if (found.isOther) {
-    session_.entryIsOther(*above.get(), shown);
+    noteEntry(*above.get(), shown, true);
   } else if (found.known) {
     nodeChanged(*found.known.get(), change);
   } else {
     // That there was nothing, or another name of a file that has several.
-    session_.entryMayBeOther(*above.get(), shown);
+    noteEntry(*above.get(), shown, false);
     const NodeUse same = found.isThere ? nodes.byInode(found.status.stx_ino) : NodeUse();
     if (same && same->identity == FileIdentity::of(found.status)) nodeChanged(*same.get(), change);
   }
@@ -87,7 +97,7 @@ KernelUpdates::Found KernelUpdates::lookAgain(Node& folder, int descriptor,
 /// The folder is not where it was, so the entry cannot be looked at; or looking now says nothing of
 /// later.
 void KernelUpdates::entryMayHaveChanged(Node& folder, const std::string& nameOnDisk) {
-  session_.entryMayBeOther(folder, files_.places().shownName(folder.identity.inode, nameOnDisk));
+  noteEntry(folder, files_.places().shownName(folder.identity.inode, nameOnDisk), false);
   if (const NodeUse node = files_.nodes().inPlace(folder, nameOnDisk)) {
     files_.nodes().noteTold(*node.get(), 0);
     nodeIsOther(*node.get());
@@ -156,7 +166,7 @@ void KernelUpdates::anythingChanged() {
     const auto place = nodes.placeOf(*node.get());
     if (!place) continue;
     const std::uint64_t folder = place->folder->identity.inode;
-    session_.entryMayBeOther(*place->folder.get(), files_.places().shownName(folder, place->name));
+    noteEntry(*place->folder.get(), files_.places().shownName(folder, place->name), false);
   }
 }
 
@@ -168,8 +178,8 @@ void KernelUpdates::showName(std::uint64_t folder, const std::string& nameOnDisk
   const NodeUse above = files_.nodes().byInode(folder);
   if (!above || before == after) return;
   files_.gate().change(folder);
-  session_.entryIsOther(*above.get(), before);
-  session_.entryIsOther(*above.get(), after);
+  noteEntry(*above.get(), before, true);
+  noteEntry(*above.get(), after, true);
   session_.contentIsOther(*above.get());
 }
 
@@ -180,9 +190,9 @@ void KernelUpdates::showContainer(const std::string& location, const std::string
   files_.gate().change(root.identity.inode);
   for (const auto& shown : before) {
     const auto now = files_.places().shownBase(shown.name);
-    if (now != shown.base) session_.entryIsOther(root, shown.name);
+    if (now != shown.base) noteEntry(root, shown.name, true);
   }
-  if (!name.empty()) session_.entryMayBeOther(root, name);
+  if (!name.empty()) noteEntry(root, name, false);
   session_.contentIsOther(root);
 }
 

@@ -3,13 +3,14 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "mount/file_system.h"
 
 namespace yomber {
 
 /// Tells the kernel what it keeps that no longer holds, and nothing else: what came through the
-/// mount itself it knows already.
+/// mount itself it knows already. What concerns entries is told when `tellEntries` is called.
 ///
 /// For one thread at a time, and none that answers requests.
 class KernelUpdates {
@@ -30,7 +31,11 @@ class KernelUpdates {
   void showContainer(const std::string& location, const std::string& name);
   void forgetShown() { files_.places().forgetShown(); }
 
+  /// To be called after the others.
+  void tellEntries();
+
  private:
+  void noteEntry(Node& folder, const std::string& name, bool isOther);
   void entryMayHaveChanged(Node& folder, const std::string& nameOnDisk);
   /// What is known in a place, when that is not what is there any more.
   struct Found {
@@ -49,6 +54,7 @@ class KernelUpdates {
   FileSystem& files_;
   KernelSession& session_;
   const std::shared_ptr<Dropping> dropping_;
+  std::vector<EntryNotices::Notice> entries_;  ///< that are to be told
 };
 
 }  // namespace yomber

@@ -187,19 +187,21 @@ void FileSystem::rename(fuse_req_t request, Node& folder, const char* name, fuse
     (void)fuse_reply_err(request, EBUSY);
     return;
   }
-  const Move move{.folder = &folder,
-                  .name = nameOnDisk(folder, name),
-                  .newFolder = &target,
-                  .newName = nameOnDisk(target, newName),
-                  .flags = flags};
+  Move move{.folder = &folder,
+            .name = nameOnDisk(folder, name),
+            .newFolder = &target,
+            .newName = nameOnDisk(target, newName),
+            .flags = flags,
+            .hold = nullptr};
   std::vector<Move> toAsk = movesToAsk(move);
   if (toAsk.empty()) return renameNow(request, move);
+  move.hold = std::make_shared<EntryNotices::Hold>(entryNotices_, folder, target);
   ThreadPool::shared().async(
       [this, request, move, toAsk = std::move(toAsk)] { askThenRename(request, move, toAsk); });
 }
 
 void FileSystem::renameNow(fuse_req_t request, const Move& move) {
-  const auto& [folder, name, newFolder, newName, flags] = move;
+  const auto& [folder, name, newFolder, newName, flags, hold] = move;
   int failure = 0;
   const SharedDescriptor from = folders_.open(*folder, failure);
   const SharedDescriptor to = from ? folders_.open(*newFolder, failure) : nullptr;
@@ -239,7 +241,8 @@ std::vector<FileSystem::Move> FileSystem::movesToAsk(const Move& move) {
                   .name = move.newName,
                   .newFolder = move.folder,
                   .newName = move.name,
-                  .flags = move.flags};
+                  .flags = move.flags,
+                  .hold = nullptr};
   if (isToBeAsked(back)) result.push_back(back);
   return result;
 }

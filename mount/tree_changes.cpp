@@ -71,6 +71,7 @@ struct TreeChanges::Link {
     files.setIsTold(true);
     // What changed before is not told.
     updates.anythingChanged();
+    updates.tellEntries();
     if (files.thumbnails() != nullptr) files.thumbnails()->noteEverything();
   }
 
@@ -89,6 +90,7 @@ struct TreeChanges::Link {
       }
     }
     for (const std::uint64_t folder : folders) updates.attributesChanged(folder);
+    updates.tellEntries();
   }
 
   void loseTrack(std::uint64_t from) {
@@ -96,6 +98,7 @@ struct TreeChanges::Link {
     if (isEnding || from != connection) return;
     files.setIsTold(false);
     updates.anythingChanged();
+    updates.tellEntries();
   }
 
   void show(const std::vector<Shown>& names) REQUIRES(applying) {

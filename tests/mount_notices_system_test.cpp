@@ -143,6 +143,29 @@ TEST_F(RenamedElsewhere, AFileThatIsAwayIsReadAsBefore) {
   EXPECT_TRUE(file.read(content.size(), 0) == content);
 }
 
+constexpr const char* kCopying = "zarn.fill.copying";
+
+class WhileAMoveWaitsForContent : public MountNotices {
+ protected:
+  WhileAMoveWaitsForContent() : MountNotices({kCopying}) {}
+};
+
+TEST_F(WhileAMoveWaitsForContent, ChangesShowElsewhereAtOnceAndInItsFolderAfterwards) {
+  makeWitness();
+  fs::create_directory(at("d"));
+  makeAway("d/report", someContent(50'000, 4));
+  EXPECT_FALSE(fs::exists(at("d/new")));
+  Aside moving([&] { return rename(at("d/report").c_str(), at("d/report.part").c_str()); });
+  ASSERT_TRUE(eventually([&] { return mounted_.isReached(kCopying); }));
+  std::ofstream(onDisk("d/new")) << "x";
+  EXPECT_TRUE(isConfirmed("d/new"));
+  waitForNotices();
+  EXPECT_FALSE(moving.isDone());
+  mounted_.openGate(kCopying);
+  EXPECT_EQ(moving.result(), 0);
+  EXPECT_TRUE(eventually([&] { return fs::exists(at("d/new")); }));
+}
+
 TEST_F(MountNotices, ContentWhoseDateWasPutBackIsReadAnew) {
   mounted_.unmount();
   const LineProcess mount({programPath("yomber-mount"), "--home", mounted_.drive().home(),

@@ -255,6 +255,7 @@ bool FileSystem::isToBeAsked(const Move& move) {
   const auto to = nodes_.wayTo(*move.newFolder);
   // The trash keeps an item where it belongs.
   if (!from || !to || to->base == Places::kTrash) return false;
+  if (from->base == Places::kTrash) return lacksContent(*move.folder, move.name);
   if (from->base != to->base) return true;
   if (move.folder->isUnwatched || qs_isExcludedName(move.name)) return false;
   const bool isElsewhere = move.folder != move.newFolder || qs_isExcludedName(move.newName);

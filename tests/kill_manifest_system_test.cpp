@@ -12,6 +12,7 @@
 #include <gtest/gtest.h>
 
 #include "platform/foundation/sanitized.h"
+#include "tests/harness/stopped_process.h"
 #include "tests/harness/test_drive.h"
 #include "tests/manifest/manifest_check.h"
 
@@ -48,13 +49,11 @@ class KillManifest : public ::testing::Test {
 
   /// False when no job was pending at that moment: then nobody is killed.
   bool killWhileJobsPend(Process victim) {
-    const pid_t zarn = drive_.pidOf(Process::Zarn);
     const pid_t process = drive_.pidOf(victim);
     // Looked at while it stands still, so that the jobs are those that the kill finds.
-    ::kill(zarn, SIGSTOP);
+    const StoppedProcess zarn(drive_.pidOf(Process::Zarn));
     const bool isPending = jobsInDatabase(drive_.home()).value_or(0) > 0;
     if (isPending) ::kill(process, SIGKILL);
-    ::kill(zarn, SIGCONT);
     return isPending;
   }
 

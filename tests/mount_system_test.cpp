@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <thread>
 
 #include <fcntl.h>
@@ -25,6 +26,7 @@
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
 #include "tests/harness/mount_kind.h"
+#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 namespace {
@@ -371,8 +373,7 @@ TEST_F(Mount, AnApplicationsFolderIsShownByItsName) {
 TEST_F(Mount, AReaderThatIsInterruptedWaitsNoLonger) {
   makeAway("report", someContent(50'000, 12));
   // The daemon stops, as if its network were slow.
-  const pid_t zarn = mounted_.drive().pidOf(TestDrive::Process::Zarn);
-  ASSERT_EQ(::kill(zarn, SIGSTOP), 0);
+  std::optional<StoppedProcess> zarn(mounted_.drive().pidOf(TestDrive::Process::Zarn));
   const pid_t reader = fork();
   if (reader == 0) {
     const int file = open(at("report").c_str(), O_RDONLY);
@@ -389,7 +390,7 @@ TEST_F(Mount, AReaderThatIsInterruptedWaitsNoLonger) {
   int status = 0;
   EXPECT_EQ(waitpid(reader, &status, 0), reader);
   EXPECT_TRUE(WIFSIGNALED(status));
-  ASSERT_EQ(::kill(zarn, SIGCONT), 0);
+  zarn.reset();
   EXPECT_EQ(contentOf(at("report")).size(), 50'000U);
 }
 
@@ -414,13 +415,12 @@ TEST_F(Mount, WhoHadAFileOpenBeforeItGotSetIDBitsTakesThemAwayWithAWrite) {
 
 TEST_F(Mount, AHostThatIsStuckIsNoticedByWhoWaitsForContent) {
   makeAway("report", someContent(50'000, 15));
-  const pid_t host = mounted_.drive().pidOf(TestDrive::Process::Host);
-  ASSERT_EQ(::kill(host, SIGSTOP), 0);
+  std::optional<StoppedProcess> host(mounted_.drive().pidOf(TestDrive::Process::Host));
   const OpenedFile file(at("report"), O_RDONLY);
   char byte = 0;
   EXPECT_EQ(pread(file.get(), &byte, 1, 30'000), -1);
   EXPECT_EQ(errno, EIO);
-  ASSERT_EQ(::kill(host, SIGCONT), 0);
+  host.reset();
   EXPECT_TRUE(eventually([&] { return file.read(1, 30'000).size() == 1; }));
 }
 

@@ -11,6 +11,7 @@
 
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
+#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 namespace {
@@ -96,6 +97,17 @@ TEST_F(MountTrash, WhatIsRestoredIsTheDocumentThatItWas) {
   EXPECT_EQ(idOf("Plans/house plan.txt"), id_);
   EXPECT_EQ(contentOf(at("Plans/house plan.txt")), "four walls");
   ASSERT_TRUE(isConfirmed("Plans/house plan.txt"));
+}
+
+TEST_F(MountTrash, WhatIsHereIsRestoredWithoutTheExtension) {
+  trash("Plans/house plan.txt");
+  ASSERT_TRUE(eventually([&] { return trashed().size() == 1; }));
+  {
+    const StoppedProcess extension(mounted_.drive().pidOf(TestDrive::Process::Extension));
+    restore("house plan.txt", "Plans/house plan.txt");
+  }
+  EXPECT_EQ(contentOf(at("Plans/house plan.txt")), "four walls");
+  EXPECT_TRUE(eventually([&] { return trashed().empty(); }));
 }
 
 TEST_F(MountTrash, WhatIsAwayIsTrashedAndRestoredWithoutBeingFetched) {

@@ -4,6 +4,7 @@
 #include <csignal>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <random>
 #include <set>
 #include <sstream>
@@ -15,6 +16,7 @@
 #include <sys/xattr.h>
 
 #include "platform/foundation/log_sinks.h"
+#include "tests/harness/stopped_process.h"
 #include "tests/harness/watch_process.h"
 
 namespace yomber::testing {
@@ -72,11 +74,12 @@ TEST_F(Recovery, ChangesMadeWhileTheDaemonIsDeadShowWithoutAnyoneAsking) {
   ASSERT_TRUE(watch.shows("before"));
   const auto supervisor = drive_.status()["supervisor"]["pid"].get<pid_t>();
   const pid_t daemon = drive_.pidOf(Process::Zarn);
-  kill(supervisor, SIGSTOP);
-  kill(daemon, SIGKILL);
-  drive_.write("meanwhile");
-  fs::remove(drive_.root() + "/before");
-  kill(supervisor, SIGCONT);
+  {
+    const StoppedProcess stopped(supervisor);
+    kill(daemon, SIGKILL);
+    drive_.write("meanwhile");
+    fs::remove(drive_.root() + "/before");
+  }
   EXPECT_TRUE(watch.converges({"meanwhile"}));
 }
 
@@ -105,8 +108,7 @@ TEST_F(Recovery, AStoppedDaemonIsNoDisconnectAndGoesOnAfterwards) {
   drive_.environment()["YOMBER_DAEMON_TIMEOUT_MS"] = "500";
   drive_.up();
   ASSERT_EQ(drive_.names(), (std::vector<std::string>{"kept"}));
-  const pid_t daemon = drive_.pidOf(Process::Zarn);
-  kill(daemon, SIGSTOP);
+  std::optional<StoppedProcess> daemon(drive_.pidOf(Process::Zarn));
   const ProcessResult stuck = drive_.yomber({"ls"});
   EXPECT_FALSE(stuck.timedOut);
   EXPECT_NE(stuck.exitCode, 0);
@@ -114,7 +116,7 @@ TEST_F(Recovery, AStoppedDaemonIsNoDisconnectAndGoesOnAfterwards) {
   // Without the host in between.
   const ProcessResult emptying = drive_.yomber({"trash", "--empty"});
   EXPECT_EQ(emptying.exitCode, 69) << emptying.errors;
-  kill(daemon, SIGCONT);
+  daemon.reset();
   EXPECT_TRUE(eventually([&] { return drive_.yomber({"ls"}).output == "kept\n"; }));
 }
 
@@ -144,8 +146,7 @@ TEST_F(Recovery, AFolderSoBusyThatItsHistoryOverflowsAgainAndAgainStillConverges
   for (int burst = 0; burst < 2; ++burst) {
     // While the host takes nothing, the extension's history overflows: also when the one request
     // that it may have under way takes what is there, which is less than it takes to overflow.
-    const pid_t host = drive_.pidOf(Process::Host);
-    kill(host, SIGSTOP);
+    std::optional<StoppedProcess> host(drive_.pidOf(Process::Host));
     ASSERT_TRUE(logFrom("debug"));
     for (int number = 0; number < 10'100; ++number) {
       drive_.write("burst " + std::to_string(burst) + " file " + std::to_string(number));
@@ -153,7 +154,7 @@ TEST_F(Recovery, AFolderSoBusyThatItsHistoryOverflowsAgainAndAgainStillConverges
     ASSERT_TRUE(eventually([&] { return overflowsInLog(drive_) > overflows; })) << burst;
     overflows = overflowsInLog(drive_);
     ASSERT_TRUE(logFrom("default"));
-    kill(host, SIGCONT);
+    host.reset();
     fs::remove(drive_.root() + "/burst " + std::to_string(burst) + " file 7");
   }
   EXPECT_TRUE(watch.converges(namesOnDisk(drive_.root())));

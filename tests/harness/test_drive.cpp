@@ -17,6 +17,7 @@ extern "C" {
 #include <gtest/gtest.h>
 
 #include "platform/ostrell/constants.h"
+#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 
@@ -118,7 +119,7 @@ void TestDrive::down() {
 void TestDrive::crash() {
   up_ = false;
   // Nothing is started again meanwhile, and nothing is missed.
-  ::kill(supervisor_, SIGSTOP);
+  const StoppedProcess stopped(supervisor_);
   std::vector<pid_t> processes{supervisor_};
   for (std::size_t i = 0; i < processes.size(); ++i) {
     for (const pid_t child : childrenOf(processes[i])) processes.push_back(child);

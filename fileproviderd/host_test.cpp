@@ -12,6 +12,7 @@
 #include "fileproviderd/host_fixture.h"
 #include "platform/fileprovider/constants.h"
 #include "platform/ipc/call.h"
+#include "tests/harness/stopped_process.h"
 
 namespace yomber {
 namespace {
@@ -123,7 +124,7 @@ TEST_F(HostTest, GivesTheExtensionItsSocketAndNothingElse) {
   ItemFields self;
   ASSERT_EQ(item("self", &self), nullptr);
   // No input, the host's output and error, the socket; and the signal.
-  EXPECT_THAT(self.filename, testing::MatchesRegex("n..s/9"));
+  EXPECT_THAT(self.filename, ::testing::MatchesRegex("n..s/9"));
 }
 
 TEST_F(HostTest, StartsNothingUntilItIsNeeded) {
@@ -154,7 +155,7 @@ TEST_F(HostTest, StartsTheExtensionAfreshWhileTheRootIsUnknown) {
   startHost([](Host::Options& options) { options.supervision.acquire = 1s; });
   const auto error = locate("a");
   ASSERT_NE(error, nullptr);
-  EXPECT_THAT(error->localizedDescription(), testing::HasSubstr("root"));
+  EXPECT_THAT(error->localizedDescription(), ::testing::HasSubstr("root"));
   const auto starts = status().starts;
   EXPECT_GT(starts, 1U);
   command("root");
@@ -233,7 +234,7 @@ TEST_F(HostTest, AnExtensionThatDiesInMidListingEndsTheListingClearly) {
   NSErrorRef error;
   for (int page = 0; page < 5 && error == nullptr; ++page) error = next(listing);
   ASSERT_NE(error, nullptr);
-  EXPECT_THAT(error->localizedDescription(), testing::HasSubstr("extension"));
+  EXPECT_THAT(error->localizedDescription(), ::testing::HasSubstr("extension"));
   EXPECT_NE(next(listing), nullptr) << "it stays ended";
   countermand("die-on-page");
   std::vector<std::string> identifiers;
@@ -249,7 +250,7 @@ TEST_F(HostTest, AStuckExtensionIsEndedAndReplaced) {
   });
   ASSERT_EQ(item("a"), nullptr);
   const auto stuck = status().extension;
-  ASSERT_EQ(kill(stuck, SIGSTOP), 0);
+  const testing::StoppedProcess stopped(static_cast<pid_t>(stuck));
   const auto error = item("a");
   ASSERT_NE(error, nullptr);
   EXPECT_TRUE(error->is(NSCocoaErrorDomain, NSXPCConnectionTimedOut));
@@ -411,7 +412,7 @@ TEST_F(HostTest, AMissingProgramIsNamed) {
   });
   const auto error = item("a");
   ASSERT_NE(error, nullptr);
-  EXPECT_THAT(error->localizedDescription(), testing::HasSubstr("/no/such/program"));
+  EXPECT_THAT(error->localizedDescription(), ::testing::HasSubstr("/no/such/program"));
   EXPECT_NE(status().lastFailure, nullptr);
 }
 

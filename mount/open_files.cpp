@@ -5,13 +5,17 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
+#include <cstddef>
 #include <string>
 #include <utility>
 
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/fault_points.h"
+#include "platform/foundation/whole_transfer.h"
+#include "platform/ostrell/fault_record.h"
 
 namespace yomber {
 namespace {
@@ -60,6 +64,20 @@ OpenFile::~OpenFile() {
   if (content() >= 0) close(content());
 }
 
+namespace {
+
+/// Somebody may have written there around us.
+bool isHeadKept(int fault) {
+  std::array<char, kKeptBytes> head{};
+  std::size_t length = 0;
+  bool isDamaged = false;
+  const auto record = readFaultRecord(fault, isDamaged);
+  if (!record || readWhole(fault, head, 0, length) != 0) return false;
+  return headChecksum({head.data(), length}) == record->head;
+}
+
+}  // namespace
+
 bool OpenFile::isWritable() const { return (flags_ & O_ACCMODE) != O_RDONLY; }
 
 int OpenFile::openContent(bool mayWaitForDisk) {
@@ -92,6 +110,10 @@ ssize_t OpenFile::readKept(void* bytes, std::size_t size, off_t offset) const {
   const FileDescriptor opened(
       ::open(pathOfDescriptor(place_.get()).c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
   if (!opened) return -1;
+  if (whole > kKeptBytes && !isHeadKept(opened.get())) {
+    errno = EAGAIN;
+    return -1;
+  }
   return pread(opened.get(), bytes, std::min<std::uint64_t>(size, kept - start), offset);
 }
 

@@ -8,7 +8,6 @@
 #include <atomic>
 #include <cerrno>
 #include <chrono>
-#include <optional>
 #include <string>
 #include <string_view>
 #include <thread>
@@ -28,14 +27,6 @@ namespace {
 
 /// Between two attempts to open what somebody was filling already when it was removed.
 constexpr std::chrono::milliseconds kPause{10};
-constexpr std::size_t kLongestRecord = 2048;
-
-std::optional<FaultRecord> recordOf(int place) {
-  std::array<char, kLongestRecord> text{};
-  const ssize_t length = readAttribute(place, kFaultAttribute, text.data(), text.size());
-  if (length < 0) return std::nullopt;
-  return FaultRecord::decode(std::string_view(text.data(), static_cast<std::size_t>(length)));
-}
 
 /// As applications understand it.
 NSErrorRef asErrno(const NSErrorRef& error) {
@@ -53,7 +44,8 @@ class Fetching {
   NSErrorRef run() {
     FileDescriptor file;
     if (NSErrorRef error = open(file)) return error;
-    const auto record = recordOf(file.get());
+    bool isDamaged = false;
+    const auto record = readFaultRecord(file.get(), isDamaged);
     struct stat before{};
     if (!isFault(file.get())) return nullptr;
     if (!record || fstat(file.get(), &before) != 0) return NSError::errorWithErrno(EIO);

@@ -1,10 +1,14 @@
 #include "platform/ostrell/fault_record.h"
 
+#include <algorithm>
+#include <array>
+#include <cerrno>
 #include <charconv>
 #include <span>
 #include <utility>
 #include <vector>
 
+#include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/hexadecimal.h"
 
 namespace yomber {
@@ -12,6 +16,7 @@ namespace {
 
 constexpr std::string_view kVersion = "1";
 constexpr std::size_t kFields = 8;
+constexpr std::size_t kLongestRecord = 2048;
 constexpr const char* kNothing = "-";
 
 std::string toHex(std::string_view bytes) {
@@ -79,6 +84,27 @@ std::optional<FaultRecord> FaultRecord::decode(std::string_view text) {
   record.tag = std::move(*tag);
   record.account = std::move(*account);
   return record;
+}
+
+std::optional<FaultRecord> readFaultRecord(int file, bool& isDamaged) {
+  std::array<char, kLongestRecord> text{};
+  const ssize_t length = readAttribute(file, kFaultAttribute, text.data(), text.size());
+  isDamaged = false;
+  if (length < 0 && errno != ERANGE) return std::nullopt;
+  auto record = FaultRecord::decode(
+      std::string_view(text.data(), static_cast<std::size_t>(std::max<ssize_t>(length, 0))));
+  isDamaged = !record;
+  return record;
+}
+
+std::uint64_t headChecksum(std::string_view bytes) {
+  // FNV-1a: somebody's writing is to be noticed, nobody's ill will.
+  std::uint64_t sum = 0xcbf29ce484222325ULL;
+  for (const char byte : bytes) {
+    sum ^= static_cast<unsigned char>(byte);
+    sum *= 0x100000001b3ULL;
+  }
+  return sum;
 }
 
 }  // namespace yomber

@@ -25,4 +25,11 @@ struct FaultRecord {
   friend bool operator==(const FaultRecord&, const FaultRecord&) = default;
 };
 
+/// The record of a file that is open, or open as a place only (O_PATH). Nothing when it is no
+/// fault; with `isDamaged` set when it is one that cannot be understood.
+[[nodiscard]] std::optional<FaultRecord> readFaultRecord(int file, bool& isDamaged);
+
+/// Tells kept bytes apart.
+[[nodiscard]] std::uint64_t headChecksum(std::string_view bytes);
+
 }  // namespace yomber

@@ -11,6 +11,7 @@
 
 #include "platform/foundation/descriptor_path.h"
 #include "platform/foundation/file_time.h"
+#include "platform/foundation/whole_transfer.h"
 #include "zarn/content/fault_record.h"
 
 namespace yomber {
@@ -97,6 +98,11 @@ NSErrorRef ChangedFile::putDatesBack() {
     if (futimens(file_.get(), times.data()) != 0) return failure(errno);
   } while (isHeld_ && heldDate(file_.get()) != noted);
   return std::exchange(isHeld_, false) ? removeAttribute(kHeldDateAttribute) : nullptr;
+}
+
+NSErrorRef ChangedFile::writeHead(const std::string& head) const {
+  const int number = writeWhole(file_.get(), head);
+  return number == 0 ? nullptr : failure(number);
 }
 
 NSErrorRef ChangedFile::punch() const {

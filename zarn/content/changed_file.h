@@ -36,6 +36,8 @@ class ChangedFile {
   /// another date meanwhile notes instead.
   [[nodiscard]] NSErrorRef holdDate();
   [[nodiscard]] NSErrorRef putDatesBack();
+  /// Puts kept bytes in their place.
+  [[nodiscard]] NSErrorRef writeHead(const std::string& head) const;
   /// Gives up the blocks behind the kept bytes.
   [[nodiscard]] NSErrorRef punch() const;
   [[nodiscard]] NSErrorRef setAttribute(const char* name, const std::string& value) const;

@@ -241,12 +241,19 @@ ContentCore::Refused ContentCore::takeRefused() {
 NSErrorRef ContentCore::settleWritten(const std::string& path, const FaultExamination& found) {
   NSErrorRef error;
   if (found.condition == FaultCondition::Rewritten) {
+    FileStamp before;
     FileStamp after;
-    error = removeFaultMarks(path, found.stamp.inode, after);
+    error = removeFaultMarks(path, found.stamp.inode, before, after);
   } else if (found.condition == FaultCondition::PartlyWritten ||
              found.condition == FaultCondition::Mixed) {
+    FileDescriptor content;
+    const auto ours = store();
+    if (ours) error = ours->open(found.record.content, content);
+    // What is not there will not come: then what was written counts more than the head.
+    if (error && isOutOfReach(error)) return error;
+    const std::string head = content ? readHead(content.get()) : "";
     std::string rescued;
-    error = rescuePartialWrite(path, found.condition, found.record, rescued);
+    error = rescuePartialWrite(path, found.condition, found.record, head, rescued);
     if (!error) (void)scanner->scanLocation(rescued, &error);
   } else if (found.condition == FaultCondition::Damaged) {
     return NSError::errorWithDomain(
@@ -294,22 +301,26 @@ BusyFile::~BusyFile() {
   if (inode_ != 0) database_->busyFiles().remove(inode_);
 }
 
-void storeLocalState(WriteTransaction& transaction, std::uint64_t item, const FileStamp& before,
-                     const FileStamp& after, bool isHere) {
+bool storeLocalState(WriteTransaction& transaction, std::uint64_t item, const FileStamp& before,
+                     const FileStamp& after, LocalContent local) {
   Connection& connection = transaction.connection();
   auto content = findContent(connection, item);
-  if (content && content->stamp.hasSameContent(after)) {
+  const bool isKnown = local != LocalContent::Unread || (content && content->stamp == before);
+  if (isKnown && content && content->stamp.hasSameContent(after)) {
     content->stamp.ctime = after.ctime;
     storeContent(connection, *content);
   }
   const auto row = findByID(connection, item);
-  if (!row || row->inode != before.inode) return;
+  if (!row || row->inode != before.inode) return true;
+  const bool isSeen = isKnown || row->ctime == before.ctime;
   ItemRow changed = *row;
-  changed.flags =
-      isHere ? changed.flags | row_flag::kDownloaded : changed.flags & ~row_flag::kDownloaded;
-  changed.size = after.size;
-  changed.mtime = after.mtime;
-  changed.ctime = after.ctime;
+  changed.flags = local == LocalContent::Away ? changed.flags & ~row_flag::kDownloaded
+                                              : changed.flags | row_flag::kDownloaded;
+  if (isSeen) {
+    changed.size = after.size;
+    changed.mtime = after.mtime;
+    changed.ctime = after.ctime;
+  }
   const bool isShownSame =
       changed.flags == row->flags && changed.size == row->size && changed.mtime == row->mtime;
   if (!isShownSame) {
@@ -317,6 +328,7 @@ void storeLocalState(WriteTransaction& transaction, std::uint64_t item, const Fi
   } else if (changed.ctime != row->ctime) {
     transaction.updateQuietly(changed);
   }
+  return isSeen;
 }
 
 }  // namespace yomber

@@ -156,9 +156,17 @@ void beginThumbnailSweep(const ContentCore& core, WriteTransaction& transaction)
 /// only for the sake of a pin and has not begun.
 void followPins(const ContentCore& core, Connection& connection, const ItemRow& row, bool isPinned);
 
+/// What is known of a file whose marks have changed.
+enum class LocalContent {
+  Away,
+  Verified,  ///< it is what the store has
+  Unread,    ///< it is what it was before
+};
 /// Stores in an item's row that its content is here or not, and as which file. Leaves alone what a
-/// scan has seen to be another file meanwhile.
-void storeLocalState(WriteTransaction& transaction, std::uint64_t item, const FileStamp& before,
-                     const FileStamp& after, bool isHere);
+/// scan has seen to be another file meanwhile. False: somebody has changed it before, which a scan
+/// is still to find.
+[[nodiscard]] bool storeLocalState(WriteTransaction& transaction, std::uint64_t item,
+                                   const FileStamp& before, const FileStamp& after,
+                                   LocalContent local);
 
 }  // namespace yomber

@@ -52,7 +52,7 @@ struct Download {
   JobSubject subject;
   bool isByItself = false;  ///< goes on without anybody who waits
   std::uint64_t inode = 0;
-  FileStamp after;
+  FillOutcome filled;
   NSErrorRef error;
 };
 
@@ -93,7 +93,7 @@ class DownloadBatch {
     busy.clear();
     for (Download& download : downloads_) {
       if (error && !download.error) download.error = error;
-      if (!download.error) core_.lookAgain(download.subject, download.after);
+      if (!download.error) core_.lookAgain(download.subject, download.filled.after);
       finish(download);
     }
     downloads_.clear();
@@ -131,13 +131,12 @@ class DownloadBatch {
     NSErrorRef error;
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
       if (!download.subject.row || download.subject.path.empty()) return noSuchFile({});
-      bool isMixed = false;
-      error = fillOnce(download, busy, isMixed);
+      error = fillOnce(download, busy);
       if (!error || !error->is(NSPOSIXErrorDomain, EAGAIN)) break;
       // Somebody has written to the fault.
       const std::string& path = download.subject.path;
       FaultExamination found = examineAt(path);
-      if (isMixed && found.isInterrupted) found.condition = FaultCondition::Mixed;
+      if (download.filled.isMixed && found.isInterrupted) found.condition = FaultCondition::Mixed;
       if (NSErrorRef failure = core_.settleWritten(path, found)) return failure;
     }
     if (error && error->is(NSPOSIXErrorDomain, ENOENT)) {
@@ -147,7 +146,7 @@ class DownloadBatch {
     return error;
   }
 
-  NSErrorRef fillOnce(Download& download, std::vector<BusyFile>& busy, bool& isMixed) {
+  NSErrorRef fillOnce(Download& download, std::vector<BusyFile>& busy) {
     const JobSubject& subject = download.subject;
     struct stat status{};
     if (lstat(subject.path.c_str(), &status) != 0) {
@@ -174,7 +173,7 @@ class DownloadBatch {
                                    NSErrorRef error = whyNotOurs(record);
                                    return error ? error : store_->open(record.content, content);
                                  }};
-    return fillFault(subject.path, source, goesOn, download.after, isMixed);
+    return fillFault(subject.path, source, goesOn, download.filled);
   }
 
   [[nodiscard]] NSErrorRef whyNotOurs(const FaultRecord& record) const {
@@ -193,7 +192,7 @@ class DownloadBatch {
   NSErrorRef store() {
     bool hasSettling = false;
     NSErrorRef error = core_.database().write([&](WriteTransaction& transaction) {
-      for (const Download& download : downloads_) {
+      for (Download& download : downloads_) {
         if (download.error) {
           storeFailure(transaction.connection(), download);
           continue;
@@ -207,12 +206,15 @@ class DownloadBatch {
     return error;
   }
 
-  void storeSuccess(WriteTransaction& transaction, const Download& download) const {
+  void storeSuccess(WriteTransaction& transaction, Download& download) const {
     Connection& connection = transaction.connection();
     const Job& job = download.subject.job;
-    FileStamp before = download.after;
+    const FileStamp& after = download.filled.after;
+    FileStamp before = after;
     before.inode = download.inode;
-    storeLocalState(transaction, job.item, before, download.after, true);
+    const auto local = download.filled.wasHere ? LocalContent::Unread : LocalContent::Verified;
+    const bool isSeen = storeLocalState(transaction, job.item, before, after, local);
+    if (!isSeen) download.filled.after = {};  // has it scanned
     if (job.seq != 0) removeJob(connection, job);
     const std::int64_t now = core_.now();
     const std::int64_t pause = std::chrono::nanoseconds(core_.options.settlePause).count();
@@ -340,10 +342,10 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
   for (Settling* settling : filled) {
     settling->isLater =
         settling->isLater || removeFaultMarks(settling->subject.path, settling->before.inode,
-                                              settling->after) != nullptr;
+                                              settling->before, settling->after) != nullptr;
   }
   const NSErrorRef error = core.database().write([&](WriteTransaction& transaction) {
-    for (const Settling& settling : all) {
+    for (Settling& settling : all) {
       const Job& job = settling.subject.job;
       if (settling.isLater) {
         core.postpone(transaction.connection(), job, NSError::errorWithErrno(EIO));
@@ -351,7 +353,10 @@ void doSettling(ContentCore& core, const std::vector<Job>& jobs) {
       }
       removeJob(transaction.connection(), job);
       if (settling.before.inode == 0) continue;
-      storeLocalState(transaction, job.item, settling.before, settling.after, settling.isHere);
+      const auto local = settling.isHere ? LocalContent::Unread : LocalContent::Away;
+      const bool isSeen =
+          storeLocalState(transaction, job.item, settling.before, settling.after, local);
+      if (!isSeen) settling.after = {};  // has it scanned
     }
     return NSErrorRef();
   });

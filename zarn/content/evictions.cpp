@@ -220,7 +220,8 @@ class EvictionBatch {
         removeJob(transaction.connection(), job);
         if (departure.doubt != Departure::Doubt::None) doubt(transaction, departure);
         if (departure.error || !departure.isFault) continue;
-        storeLocalState(transaction, job.item, departure.before, departure.after, false);
+        (void)storeLocalState(transaction, job.item, departure.before, departure.after,
+                              LocalContent::Away);
       }
       return NSErrorRef();
     });

@@ -121,25 +121,28 @@ Eviction::~Eviction() {
 
 namespace {
 
+bool wasFilled(int file) { return fgetxattr(file, kFilledAttribute, nullptr, 0) >= 0; }
+
 /// `record` is of a larger file than what is kept.
 FaultCondition conditionOfLarge(int file, FaultExamination& found) {
   const FileStamp& stamp = found.stamp;
   const bool hasHole = hasHoleFrom(file, kKeptBytes, stamp.size);
   if (stamp.size == found.record.content.size) {
-    found.isInterrupted = heldDate(file).has_value();
-    if (found.isInterrupted || stamp.mtime == found.record.mtime) return FaultCondition::Pristine;
-    const bool isWritten =
+    const bool isTouched =
         hasDataFrom(file, kKeptBytes) || headChecksum(readHead(file)) != found.record.head;
-    if (!isWritten) return FaultCondition::Pristine;
+    const bool hasOurDate = stamp.mtime == found.record.mtime;
+    // Whoever writes may put the date back. What an earlier boot has filled may not have come to
+    // the disk: that is nobody's writing.
+    found.isInterrupted = heldDate(file) || (isTouched && hasOurDate && !wasFilled(file));
+    if (found.isInterrupted || !isTouched || hasOurDate) return FaultCondition::Pristine;
   }
   return hasHole ? FaultCondition::PartlyWritten : FaultCondition::Rewritten;
 }
 
 FaultCondition conditionOfSmall(int file, const FaultExamination& found) {
-  const bool isSame = found.stamp.size == found.record.content.size;
-  if (isSame && found.stamp.mtime == found.record.mtime) return FaultCondition::Pristine;
-  return isSame && hasContentOf(file, found.record) ? FaultCondition::Pristine
-                                                    : FaultCondition::Rewritten;
+  const bool isSame =
+      found.stamp.size == found.record.content.size && hasContentOf(file, found.record);
+  return isSame ? FaultCondition::Pristine : FaultCondition::Rewritten;
 }
 
 }  // namespace
@@ -160,12 +163,14 @@ FaultExamination examineFault(int file) {
   return result;
 }
 
-NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode, FileStamp& after) {
+NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode, FileStamp& before,
+                            FileStamp& after) {
   // Not opened for reading or writing: that would keep others from leasing it.
   const FileDescriptor file(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   struct stat status{};
   if (!file || fstat(file.get(), &status) != 0) return NSError::errorWithErrno(errno, path);
   if (status.st_ino != inode) return NSError::errorWithErrno(ESTALE, path);
+  before = FileStamp::of(status);
   const std::string self = pathOfDescriptor(file.get());
   // The fault first: without it the others mean nothing.
   for (const char* name : {kFaultAttribute, kFilledAttribute, kHeldDateAttribute}) {

@@ -66,22 +66,25 @@ struct FaultExamination {
   FaultCondition condition = FaultCondition::NoFault;
   FaultRecord record;
   FileStamp stamp;
-  /// Left half-way while it was filled or given up: what is in it is to be compared.
+  /// Left half-way while it was filled or given up, or written to by somebody who put the date
+  /// back: what is in it is to be compared.
   bool isInterrupted = false;
 };
 /// Looks at an open file. Never answers Mixed.
 [[nodiscard]] FaultExamination examineFault(int file);
 
 /// Takes the marks off a file that somebody has rewritten, or whose content is known to be whole
-/// and on the disk, provided that it still has that inode. `after` is what it is then.
+/// and on the disk, provided that it still has that inode. `before` and `after` are what it was and
+/// is then.
 [[nodiscard]] NSErrorRef removeFaultMarks(const std::string& path, std::uint64_t inode,
-                                          FileStamp& after);
+                                          FileStamp& before, FileStamp& after);
 
 /// Brings what somebody wrote into a fault (`condition` PartlyWritten or Mixed) to a new file next
-/// to it, and makes the fault what it was before. Answers where the new file is. EBUSY while
-/// anybody has the fault open.
+/// to it, and makes the fault what it was before; `head` are the bytes that it kept, as the store
+/// has them. Answers where the new file is. EBUSY while anybody has the fault open.
 [[nodiscard]] NSErrorRef rescuePartialWrite(const std::string& path, FaultCondition condition,
-                                            const FaultRecord& record, std::string& rescued);
+                                            const FaultRecord& record, const std::string& head,
+                                            std::string& rescued);
 
 /// Whether an interrupted fault, open as `file`, holds any byte that is not the content's, open as
 /// `content`. An error of reading counts as one.
@@ -107,6 +110,13 @@ struct FaultSource {
   std::function<NSErrorRef(const FaultRecord& record, FileDescriptor& content)> open;
 };
 
+/// What came of a filling.
+struct FillOutcome {
+  FileStamp after;       ///< what the file is then
+  bool isMixed = false;  ///< see below
+  bool wasHere = false;  ///< there was nothing to fill, and what is there was not looked at
+};
+
 /// Fills a fault in its place. Its content can be read from then on, in this boot of the machine;
 /// once it was synced, `removeFaultMarks` makes it an ordinary file. A file whose content is here
 /// already is a success. Fails leaving a fault.
@@ -121,7 +131,7 @@ struct FaultSource {
 ///     EAGAIN when it is not all the content's.
 [[nodiscard]] NSErrorRef fillFault(const std::string& path, const FaultSource& source,
                                    const std::function<bool(std::uint64_t)>& goesOn,
-                                   FileStamp& after, bool& isMixed);
+                                   FillOutcome& outcome);
 
 /// The SHA-256 and size of an open file, provided that it does not change meanwhile; nothing with
 /// an error (EAGAIN when it does).

@@ -51,9 +51,11 @@ class Filling {
     if (isInterrupted_) {
       if (NSErrorRef error = compare(isMixed)) return error;
     }
+    const std::string head = readHead(file_.get());
     NSErrorRef error = file_.holdDate();
     // What an earlier filling may have left would show where the content has holes.
     if (!error) error = file_.punch();
+    if (!error) error = file_.removeAttribute(kFilledAttribute);
     if (!error && fillBegun.hit()) error = file_.failure(ENOSPC);
     if (!error) error = copy(goesOn);
     if (!error) error = verify();
@@ -61,6 +63,7 @@ class Filling {
     if (!error) error = markFilled();
     if (error && mayTakeBack()) {
       (void)file_.punch();
+      (void)file_.writeHead(head);
       (void)file_.putDatesBack();
     }
     return isGivenUp_ ? openElsewhereError(file_.path()) : error;
@@ -129,10 +132,16 @@ class Filling {
   /// Else the held date stays, and the next filling compares what it finds.
   [[nodiscard]] bool mayTakeBack() const { return !mayBeWritten_ && wasAlone(); }
 
+  /// Blocks of zeros are not written: what was there before would stay.
+  [[nodiscard]] bool hasOurHead() const {
+    return record_.content.size <= kKeptBytes ||
+           headChecksum(readHead(file_.get())) == record_.head;
+  }
+
   /// The content itself is verified as it is written; what others wrote is not.
   NSErrorRef verify() {
     isAlone_ = wasAlone();
-    const bool isWhole = stampOf(file_.get()).size == record_.content.size &&
+    const bool isWhole = stampOf(file_.get()).size == record_.content.size && hasOurHead() &&
                          (isAlone_ || hasContentOf(file_.get(), record_));
     if (isWhole) return nullptr;
     mayBeWritten_ = true;
@@ -190,18 +199,18 @@ bool fillSmallFault(const std::string& path, const std::function<bool(std::uint6
 }  // namespace
 
 NSErrorRef fillFault(const std::string& path, const FaultSource& source,
-                     const std::function<bool(std::uint64_t)>& goesOn, FileStamp& after,
-                     bool& isMixed) {
-  isMixed = false;
+                     const std::function<bool(std::uint64_t)>& goesOn, FillOutcome& outcome) {
+  outcome = {};
   NSErrorRef error;
-  if (fillSmallFault(path, goesOn, after, error)) return error;
+  if (fillSmallFault(path, goesOn, outcome.after, error)) return error;
   const bool isWritten = isOpenForWriting(path);
   ChangedFile file = ChangedFile::open(path, &error);
   if (!file.isValid()) return error;
   const int descriptor = file.get();
   const FaultExamination found = examineFault(descriptor);
   if (found.condition == FaultCondition::NoFault) {
-    after = found.stamp;
+    outcome.after = found.stamp;
+    outcome.wasHere = true;
     return nullptr;
   }
   if (found.condition != FaultCondition::Pristine) return file.failure(EAGAIN);
@@ -210,13 +219,13 @@ NSErrorRef fillFault(const std::string& path, const FaultSource& source,
     if (fillVerified.hit()) return file.failure(EIO);
     error = file.setAttribute(kFilledAttribute, bootIdentifier());
     (void)fillFilled.hit();
-    if (!error) after = stampOf(descriptor);
+    if (!error) outcome.after = stampOf(descriptor);
     return error;
   }
   if (isWritten) return openElsewhereError(path);
   const FileDescriptor same(fcntl(descriptor, F_DUPFD_CLOEXEC, 0));
-  error = Filling(std::move(file), found, source).run(goesOn, isMixed);
-  after = stampOf(same.get());
+  error = Filling(std::move(file), found, source).run(goesOn, outcome.isMixed);
+  outcome.after = stampOf(same.get());
   return error;
 }
 

@@ -3,9 +3,6 @@
 #include <sys/stat.h>
 
 #include <cstdint>
-#include <optional>
-#include <string>
-#include <string_view>
 
 #include "platform/foundation/fault_attributes.h"
 #include "platform/ostrell/fault_record.h"
@@ -41,12 +38,6 @@ struct StampedLook {
 };
 [[nodiscard]] StampedLook lookAtStamp(int file);
 
-/// Tells kept bytes apart.
-[[nodiscard]] std::uint64_t headChecksum(std::string_view bytes);
-
-/// The record of the file open as `file`. Nothing when it is no fault; with `isDamaged` set when it
-/// is one that cannot be understood.
-[[nodiscard]] std::optional<FaultRecord> readFaultRecord(int file, bool& isDamaged);
 /// Whether a fault that is open was filled in this boot.
 [[nodiscard]] bool isFilledInThisBoot(int file);
 /// Whether the open file is a fault whose content cannot be read; as isFaultAtPath.

@@ -106,7 +106,8 @@ bool hasForeignBytes(int file, const FaultRecord& record, int content) {
 }
 
 NSErrorRef rescuePartialWrite(const std::string& path, FaultCondition condition,
-                              const FaultRecord& record, std::string& rescued) {
+                              const FaultRecord& record, const std::string& head,
+                              std::string& rescued) {
   NSErrorRef error;
   ChangedFile file = ChangedFile::open(path, &error);
   if (!file.isValid()) return error;
@@ -138,6 +139,8 @@ NSErrorRef rescuePartialWrite(const std::string& path, FaultCondition condition,
     error = file.failure(errno);
   }
   if (!error) error = file.punch();
+  // Other bytes would be neither the content nor anybody's.
+  if (!error && headChecksum(head) == record.head) error = file.writeHead(head);
   return error ? error : file.putDatesBack();
 }
 

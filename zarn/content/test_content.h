@@ -76,7 +76,7 @@ class ContentDrive : public TestDrive {
     options.firstPause = std::chrono::milliseconds(5);
     options.longestPause = std::chrono::milliseconds(20);
     options.offlinePause = std::chrono::milliseconds(5);
-    options.settlePause = std::chrono::milliseconds(1);
+    options.settlePause = settlePause;
     options.uploadPause = std::chrono::milliseconds::zero();
     engine = ContentEngine::create(
         store, std::make_shared<Scanner>(store, std::weak_ptr<FolderVisitor>()), options);
@@ -166,6 +166,18 @@ class ContentDrive : public TestDrive {
     }
     return result;
   }
+  /// Flips bits of a byte of those that have that size.
+  void damageAssets(std::uintmax_t size, std::streamoff offset) const {
+    for (const std::string& path : assetFiles()) {
+      if (std::filesystem::file_size(path) != size) continue;
+      ASSERT_EQ(chmod(path.c_str(), 0600), 0);
+      std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
+      file.seekg(offset);
+      const int byte = file.get();
+      file.seekp(offset);
+      file.put(static_cast<char>(byte ^ 0x55));
+    }
+  }
 
   /// A document whose content is in the store only.
   void makeFault(const std::string& path, const std::string& text) {
@@ -187,6 +199,7 @@ class ContentDrive : public TestDrive {
 
   std::string storePath;
   std::string gate_;
+  std::chrono::milliseconds settlePause{1};  ///< of the next engine
   std::shared_ptr<EmbeddedEngine> records;
   ContentEngine::Options options;
   std::shared_ptr<ContentEngine> engine;

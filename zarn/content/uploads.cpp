@@ -28,6 +28,8 @@ FaultPoint uploadSynced("zarn.upload.synced");
 FaultPoint uploadCommitted("zarn.upload.committed");
 FaultPoint uploadConfirmed("zarn.upload.confirmed");
 
+constexpr const char* kOfNoBoot = "none";
+
 /// So much is read before it is synced and committed together.
 constexpr std::uint64_t kGroupBytes = 64 << 20;
 constexpr int kReadings = 3;
@@ -146,8 +148,11 @@ class UploadGroup {
         bool isDamaged = false;
         const auto record = readFaultRecord(file.get(), isDamaged);
         upload.isToSettle = record.has_value();
+        const auto& before = upload.subject.content;
         NSErrorRef error = readDocument(upload, std::move(file));
-        const bool isCopiedTooSoon = !error && record &&
+        // What we have filled ourselves is no copy, whatever its date says.
+        const bool isOurs = before && before->stamp.inode == upload.confirmed.stamp.inode;
+        const bool isCopiedTooSoon = !error && record && !isOurs &&
                                      upload.confirmed.stamp.mtime == record->mtime &&
                                      upload.confirmed.stamp.size == record->content.size &&
                                      upload.confirmed.content != record->content;
@@ -167,7 +172,7 @@ class UploadGroup {
   NSErrorRef unfill(const std::string& path) const {
     NSErrorRef error;
     const ChangedFile file = ChangedFile::open(path, &error);
-    if (file.isValid()) error = file.removeAttribute(kFilledAttribute);
+    if (file.isValid()) error = file.setAttribute(kFilledAttribute, kOfNoBoot);
     if (error) return error;
     (void)core_.scanner->scanLocation(path);
     return NSError::errorWithErrno(EAGAIN, path);  // as the fault that it is, the next time

@@ -180,6 +180,32 @@ TEST_F(ContentEvictionsTest, WhatTheStoreHasLostStaysAndGoesThereAgain) {
   EXPECT_TRUE(read("a") == text);
 }
 
+TEST_F(ContentEvictionsTest, WhatIsDamagedInTheStoreStaysAndGoesThereAgain) {
+  const std::string text = content(100'000);
+  write("a", text);
+  settle();
+  damageAssets(100'000, 50'000);
+  expectRefused("a", "lost");
+  EXPECT_TRUE(read("a") == text);
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
+  EXPECT_EQ(evict("a"), nullptr);
+  EXPECT_EQ(provide("a"), nullptr);
+  EXPECT_TRUE(read("a") == text);
+}
+
+TEST_F(ContentEvictionsTest, NothingIsGivenUpWhereTheStoreCannotBeAsked) {
+  write("a", content(100'000));
+  settle();
+  engine->setStore(nullptr, "");
+  expectRefused("a", "signed in");
+  signIn("bob");
+  goOffline();
+  EXPECT_NE(evict("a"), nullptr);
+  EXPECT_FALSE(isFault("a"));
+  comeBack();
+  EXPECT_TRUE(waitUntil([&] { return evict("a") == nullptr; }));
+}
+
 TEST_F(ContentEvictionsTest, AFaultBelongsToTheAccountWhoseStoreHasIt) {
   write("a", content(100'000));
   settle();

@@ -136,6 +136,10 @@ NSErrorRef ContentStore::copy(const RZAsset& content, int file, const GoesOn& go
   return contentError(engine_->copyAsset(content, file, {.progress = goesOn}));
 }
 
+NSErrorRef ContentStore::verify(const RZAsset& content) const {
+  return contentError(engine_->verifyAsset(content, {}));
+}
+
 NSErrorRef ContentStore::open(const RZAsset& content, FileDescriptor& descriptor) const {
   return contentError(engine_->openAsset(content, descriptor));
 }

@@ -109,6 +109,8 @@ class ContentStore {
 
   /// Writes verified content into an open file; see RZEngine::copyAsset.
   [[nodiscard]] NSErrorRef copy(const RZAsset& content, int file, const GoesOn& goesOn) const;
+  /// Nil when the store has the content, every byte of it.
+  [[nodiscard]] NSErrorRef verify(const RZAsset& content) const;
   /// For reading from its start; not verified.
   [[nodiscard]] NSErrorRef open(const RZAsset& content, FileDescriptor& descriptor) const;
 

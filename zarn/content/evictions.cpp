@@ -58,25 +58,27 @@ NSErrorRef reasonInRows(const ContentCore& core, const JobSubject& subject) {
 
 /// Bytes are given up only where the store still has the same ones: dates alone prove nothing,
 /// since what is written through a map, or within one tick of the clock, may leave them as they
-/// are.
+/// are. Content is the store's, whoever's record has it.
 NSErrorRef compareContent(const ContentCore& core, Departure& departure, int file) {
   ContentRow& content = *departure.subject.content;
   if (isOpenForWriting(departure.subject.path)) return refusal("it is open somewhere");
+  const auto store = core.store();
+  if (!store) return refusal("nobody is signed in, so that the store cannot be asked for it");
   const bool mayBeSame = content.stamp.hasSameContent(departure.before);
-  const auto store = core.storeOf(content.account);
-  FileDescriptor stored;
-  NSErrorRef error = store && mayBeSame ? store->open(*content.content, stored) : nullptr;
-  // Nobody knows then whether it will be there when it is back.
-  if (isOutOfReach(error)) return error;
-  if (error) {
-    departure.doubt = Departure::Doubt::Lost;
-    return refusal("the store has lost its content; it is sent there again");
-  }
+  NSErrorRef error = mayBeSame ? store->checkReachability() : nullptr;
+  if (error) return error;
   const auto hashed =
       mayBeSame ? hashUnchanged(file, departure.before, nullptr) : std::optional<RZAsset>();
   if (!hashed || *hashed != *content.content) {
     departure.doubt = Departure::Doubt::Changed;
     return refusal("it has changed since it was confirmed in the store");
+  }
+  error = store->verify(*content.content);
+  // Nobody knows then whether it will be there when it is back.
+  if (isOutOfReach(error)) return error;
+  if (error) {
+    departure.doubt = Departure::Doubt::Lost;
+    return refusal("the store has lost its content; it is sent there again");
   }
   content.stamp = departure.before;
   return nullptr;

@@ -186,8 +186,12 @@ class FileSystem {
     std::shared_ptr<const EntryNotices::Hold> hold;  ///< when the move waits
   };
   void renameNow(fuse_req_t request, const Move& move);
-  /// The moves that need an answer of the host first.
-  [[nodiscard]] std::vector<Move> movesToAsk(const Move& move);
+  /// An exchange moves two.
+  [[nodiscard]] static std::vector<Move> bothWays(const Move& move);
+  /// Whether a folder goes to where the drive leaves things alone.
+  [[nodiscard]] bool takesFolderOut(const Move& move);
+  [[nodiscard]] bool holdsFaults(const Move& move);
+  /// Whether it needs an answer of the host first.
   [[nodiscard]] bool isToBeAsked(const Move& move);
   [[nodiscard]] bool lacksContent(const Node& folder, const std::string& name);
   /// Asks of the last of `toAsk` and brings what it needs, then of the others, then moves. Waits.

@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <memory>
 #include <optional>
@@ -16,6 +17,7 @@
 #include "platform/foundation/fault_attributes.h"
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/thread_pool.h"
+#include "platform/foundation/tree_faults.h"
 #include "platform/ostrell/exclusions.h"
 
 namespace yomber {
@@ -193,11 +195,45 @@ void FileSystem::rename(fuse_req_t request, Node& folder, const char* name, fuse
             .newName = nameOnDisk(target, newName),
             .flags = flags,
             .hold = nullptr};
-  std::vector<Move> toAsk = movesToAsk(move);
-  if (toAsk.empty()) return renameNow(request, move);
+  std::vector<Move> toAsk;
+  std::vector<Move> departures;
+  for (const Move& way : bothWays(move)) {
+    if (isToBeAsked(way)) toAsk.push_back(way);
+    if (takesFolderOut(way)) departures.push_back(way);
+  }
+  if (toAsk.empty() && departures.empty()) return renameNow(request, move);
   move.hold = std::make_shared<EntryNotices::Hold>(entryNotices_, folder, target);
-  ThreadPool::shared().async(
-      [this, request, move, toAsk = std::move(toAsk)] { askThenRename(request, move, toAsk); });
+  ThreadPool::shared().async([this, request, move, departures, toAsk = std::move(toAsk)] {
+    const auto hasFaults = [this](const Move& way) { return holdsFaults(way); };
+    // Whoever moves it copies it then, and so brings what is away.
+    if (std::ranges::any_of(departures, hasFaults)) return (void)fuse_reply_err(request, EXDEV);
+    askThenRename(request, move, toAsk);
+  });
+}
+
+std::vector<FileSystem::Move> FileSystem::bothWays(const Move& move) {
+  if ((move.flags & RENAME_EXCHANGE) == 0) return {move};
+  const Move back{.folder = move.newFolder,
+                  .name = move.newName,
+                  .newFolder = move.folder,
+                  .newName = move.name,
+                  .flags = move.flags,
+                  .hold = nullptr};
+  return {move, back};
+}
+
+/// Nobody brings what is away any more where the drive leaves things alone.
+bool FileSystem::takesFolderOut(const Move& move) {
+  const bool comes = move.newFolder->isUnwatched || qs_isExcludedName(move.newName);
+  if (!comes || move.folder->isUnwatched || qs_isExcludedName(move.name)) return false;
+  const NodeUse node = nodes_.inPlace(*move.folder, move.name);
+  return node && node->isFolder();
+}
+
+bool FileSystem::holdsFaults(const Move& move) {
+  int failure = 0;
+  const SharedDescriptor folder = folders_.open(*move.folder, failure);
+  return folder && holdsFault(pathOfDescriptor(folder->get()) + "/" + move.name);
 }
 
 void FileSystem::renameNow(fuse_req_t request, const Move& move) {
@@ -231,20 +267,6 @@ void FileSystem::renameNow(fuse_req_t request, const Move& move) {
                remainsAt(std::move(replaced)));
   moving.reset();
   (void)fuse_reply_err(request, 0);
-}
-
-std::vector<FileSystem::Move> FileSystem::movesToAsk(const Move& move) {
-  std::vector<Move> result;
-  if (isToBeAsked(move)) result.push_back(move);
-  if ((move.flags & RENAME_EXCHANGE) == 0) return result;
-  const Move back{.folder = move.newFolder,
-                  .name = move.newName,
-                  .newFolder = move.folder,
-                  .newName = move.name,
-                  .flags = move.flags,
-                  .hold = nullptr};
-  if (isToBeAsked(back)) result.push_back(back);
-  return result;
 }
 
 /// Which folders are shared, the daemon knows: any move to another folder may be one into a share,

@@ -357,6 +357,21 @@ TEST_F(MovesOfWhatIsAway, OutOfTheDriveNeedTheContent) {
   EXPECT_EQ(contentOf(at("report.part")), content_);
 }
 
+TEST_F(MovesOfWhatIsAway, WithTheirFolderOutOfTheDriveAreCopies) {
+  fs::create_directories(at("photos/2026"));
+  makeAway("photos/2026/report", content_);
+  EXPECT_EQ(move("photos", "photos.nosync"), EXDEV);
+  EXPECT_TRUE(isAwayAt(onDisk("photos/2026/report")));
+  const ProcessResult moved = runProcess({"/usr/bin/mv", at("photos"), at("photos.nosync")});
+  EXPECT_EQ(moved.exitCode, 0) << moved.errors;
+  EXPECT_FALSE(isAwayAt(onDisk("photos.nosync/2026/report")));
+  EXPECT_EQ(contentOf(at("photos.nosync/2026/report")), content_);
+  EXPECT_FALSE(fs::exists(at("photos")));
+  // With what is here nobody has to do anything.
+  EXPECT_EQ(move("photos.nosync", "photos"), 0);
+  EXPECT_EQ(move("photos", "other.nosync"), 0);
+}
+
 TEST_F(MovesOfWhatIsAway, OutOfTheTrashIntoAnotherContainerNeedTheContent) {
   makeNotes();
   const std::string trash = ".Trash-" + std::to_string(getuid()) + "/files/";

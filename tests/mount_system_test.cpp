@@ -199,6 +199,21 @@ TEST_F(Mount, WhatSomebodyWritesToAroundTheMountCannotBeCutShort) {
   EXPECT_EQ(errno, EBUSY);
 }
 
+TEST_F(Mount, WhatSomebodyWritesIntoTheKeptBytesAroundTheMountIsNotTakenForTheContent) {
+  const std::string content = someContent(50'000, 7);
+  makeAway("report", content);
+  struct stat before{};
+  ASSERT_EQ(stat(onDisk("report").c_str(), &before), 0);
+  {
+    const OpenedFile writer(onDisk("report"), O_WRONLY);
+    ASSERT_EQ(pwrite(writer.get(), "written", 7, 10), 7);
+    const std::array<timespec, 2> dates{before.st_atim, before.st_mtim};
+    ASSERT_EQ(futimens(writer.get(), dates.data()), 0);
+  }
+  EXPECT_EQ(OpenedFile(at("report"), O_RDONLY).read(100, 0), content.substr(0, 100));
+  EXPECT_EQ(contentOf(at("report 2")).substr(10, 7), "written");
+}
+
 TEST_F(Mount, WhatIsAwayIsAllData) {
   const std::string content = someContent(50'000, 8);
   makeAway("report", content);

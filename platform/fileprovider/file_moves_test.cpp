@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/xattr.h>
 
 #include <cerrno>
 #include <csignal>
@@ -7,6 +8,7 @@
 
 #include "platform/fileprovider/file_operations.h"
 #include "platform/fileprovider/file_operations_fixture.h"
+#include "platform/foundation/fault_attributes.h"
 
 namespace yomber {
 namespace {
@@ -115,6 +117,28 @@ TEST_F(FileOperationsTest, WhatLeavesATrashGetsBackTheNameThatItHad) {
   EXPECT_EQ(to("report 4", Bouncing::Forbidden), at("tree/folder/report 4"));
   EXPECT_EQ(to("odd", Bouncing::Allowed), at("tree/folder/odd"));
   EXPECT_EQ(get("tree/folder/report"), "first");
+}
+
+TEST_F(FileOperationsTest, WhatIsAwayDoesNotLeaveTheDrive) {
+  setDepartureRule([](const std::string& from, const std::string& to) {
+    return !from.ends_with(".out") && to.ends_with(".out");
+  });
+  put("tree/here", "content");
+  put("tree/away", "content");
+  fs::create_directory(at("tree/both"));
+  put("tree/both/away", "content");
+  for (const char* const name : {"tree/away", "tree/both/away"}) {
+    ASSERT_EQ(setxattr(at(name).c_str(), kFaultAttribute, "1", 1, 0), 0);
+  }
+  for (const std::string name : {"away", "both"}) {
+    EXPECT_TRUE(rename(url("tree/" + name), name + ".out").is(NSUbiquitousFileUnavailableError));
+    EXPECT_TRUE(exists("tree/" + name)) << name;
+    EXPECT_FALSE(exists("tree/" + name + ".out")) << name;
+    EXPECT_EQ(rename(url("tree/" + name), name + " new").path(), at("tree/" + name + " new"));
+  }
+  EXPECT_EQ(rename(url("tree/here"), "here.out").path(), at("tree/here.out"));
+  EXPECT_TRUE(rename(url("tree/none"), "none.out").is(NSFileNoSuchFileError));
+  setDepartureRule({});
 }
 
 TEST_F(FileOperationsTest, BouncesManyAtOnceEachToANameOfItsOwn) {

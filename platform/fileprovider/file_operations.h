@@ -87,6 +87,13 @@ using FormerNameResolver = std::function<std::optional<std::string>(const std::s
 /// The client library sets it. Any thread; an empty one takes it away.
 void setFormerNameResolver(FormerNameResolver resolver);
 
+/// Whether a file that is moved from one place on this disk to another leaves the drive by that:
+/// then nobody will bring its content any more, and what has it not, or holds a file that has it
+/// not, is not moved (Cocoa 4354).
+using DepartureRule = std::function<bool(const std::string& from, const std::string& to)>;
+/// The client library sets it. Any thread; an empty one takes it away.
+void setDepartureRule(DepartureRule rule);
+
 /// Where copies are made before they are renamed into place: a folder of this user's on the tree's
 /// file system, made when it is missing. What a crash left there is removed by the next copy. Empty
 /// (or on another file system than the destination): a hidden folder in the destination, of a name

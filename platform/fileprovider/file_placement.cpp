@@ -17,6 +17,7 @@
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/file_descriptor.h"
 #include "platform/foundation/tree_copy.h"
+#include "platform/foundation/tree_faults.h"
 #include "platform/foundation/tree_removal.h"
 
 namespace yomber {
@@ -32,6 +33,7 @@ FaultPoint treeIsTakenAway("fileprovider.delete.taken-away");
 struct Settings {
   AtomicCell<PhysicalLocationResolver> resolver;
   AtomicCell<FormerNameResolver> formerName;
+  AtomicCell<DepartureRule> departure;
   AtomicCell<std::string> staging;
 };
 
@@ -195,6 +197,17 @@ NSErrorRef removeInPlace(const FileLocation& file) {
   return fileError(number, isItself ? file.logical->path() : removal.failedPath());
 }
 
+NSErrorRef checkDeparture(const FileLocation& source, const FileDestination& destination) {
+  const auto leaves = settings().departure.load();
+  if (!leaves || !leaves(source.onDisk, onDisk(destination, destination.name))) return nullptr;
+  if (!holdsFault(source.onDisk) || !exists(source.onDisk)) return nullptr;
+  return NSError::errorWithDomain(
+      NSCocoaErrorDomain, NSUbiquitousFileUnavailableError,
+      {{NSFilePathErrorKey, source.logical->path()},
+       {NSLocalizedDescriptionKey, "what is called \"" + destination.name +
+                                       "\" is not in the drive; bring the content here first"}});
+}
+
 /// Whether the disk cannot have that name at all.
 bool isUnspeakable(int number) { return number == ENAMETOOLONG || number == EILSEQ; }
 
@@ -213,6 +226,8 @@ std::optional<std::string> formerNameOf(const FileLocation& file) {
   auto name = resolver ? resolver(file.onDisk) : std::nullopt;
   return name && checkFileName(*name) == nullptr ? name : std::nullopt;
 }
+
+void setDepartureRule(DepartureRule rule) { settings().departure.store(std::move(rule)); }
 
 void setStagingFolder(std::string path) { settings().staging.store(std::move(path)); }
 
@@ -251,6 +266,7 @@ Placed moveFile(const FileLocation& source, const FileDestination& destination) 
     return exists(source.onDisk) ? placedAt(destination, destination.name)
                                  : failed(noSuchFileError(source.logical->path()));
   }
+  if (NSErrorRef error = checkDeparture(source, destination)) return failed(std::move(error));
   std::string name;
   const auto moveTo = [&](const std::string& path) {
     return renameWithoutReplacing(source.onDisk, path);

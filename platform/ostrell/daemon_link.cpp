@@ -10,6 +10,7 @@
 #include "platform/ostrell/daemon_question.h"
 #include "platform/ostrell/daemon_wire.h"
 #include "platform/ostrell/errors.h"
+#include "platform/ostrell/exclusions.h"
 #include "platform/ostrell/item_additions.h"
 #include "platform/ostrell/record_store.h"
 #include "platform/ostrell/trash_info.h"
@@ -98,6 +99,7 @@ std::shared_ptr<DaemonLink> DaemonLink::create(const std::string& home) {
   registerItemsInErrors();
   setPhysicalLocationResolver([](const NSURLRef& logical) { return qs_physicalURL(logical); });
   setFormerNameResolver(trashedName);
+  setDepartureRule(qs_isExcludedMove);
   const DrivePaths paths = DrivePaths::forHome(home);
   setStagingFolder(paths.privateDirectory + "/copies");
   installRecordStore(paths.store);

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cstddef>
 
 namespace yomber {
 namespace {
@@ -47,6 +48,16 @@ bool isEmacsAutosave(std::string_view name) {
   return name.size() > 2 && name.starts_with('#') && name.ends_with('#');
 }
 
+std::size_t countExcludedNames(std::string_view path) {
+  std::size_t count = 0;
+  while (!path.empty()) {
+    const std::size_t end = std::min(path.find('/'), path.size());
+    if (qs_isExcludedName(path.substr(0, end))) ++count;
+    path.remove_prefix(std::min(end + 1, path.size()));
+  }
+  return count;
+}
+
 }  // namespace
 
 bool qs_isExcludedName(std::string_view name) {
@@ -54,6 +65,11 @@ bool qs_isExcludedName(std::string_view name) {
          std::ranges::any_of(kPatterns,
                              [&](const Pattern& pattern) { return matches(name, pattern); }) ||
          isVimSwap(name) || isEmacsAutosave(name);
+}
+
+bool qs_isExcludedMove(std::string_view from, std::string_view to) {
+  // Above the drive such names mean nothing, and both have them.
+  return countExcludedNames(to) > countExcludedNames(from);
 }
 
 }  // namespace yomber

@@ -11,4 +11,8 @@ namespace yomber {
 /// `name` is one path component, as bytes.
 [[nodiscard]] bool qs_isExcludedName(std::string_view name);
 
+/// Whether a move takes something to where it does not sync from where it does; by the paths' names
+/// alone.
+[[nodiscard]] bool qs_isExcludedMove(std::string_view from, std::string_view to);
+
 }  // namespace yomber

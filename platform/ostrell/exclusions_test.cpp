@@ -25,5 +25,16 @@ TEST(Exclusions, NamesThatSync) {
   }
 }
 
+TEST(Exclusions, MovesToWhereNothingSyncs) {
+  EXPECT_TRUE(qs_isExcludedMove("/d/a", "/d/a.part"));
+  EXPECT_TRUE(qs_isExcludedMove("/d/a", "/d/x.nosync/a"));
+  EXPECT_TRUE(qs_isExcludedMove("/up.part/d/a", "/up.part/d/a.part"));
+  EXPECT_FALSE(qs_isExcludedMove("/d/a", "/d/b"));
+  EXPECT_FALSE(qs_isExcludedMove("/up.part/d/a", "/up.part/d/b/a"));
+  EXPECT_FALSE(qs_isExcludedMove("/d/a.part", "/d/a"));
+  EXPECT_FALSE(qs_isExcludedMove("/d/a.part", "/d/b.part"));
+  EXPECT_FALSE(qs_isExcludedMove("", ""));
+}
+
 }  // namespace
 }  // namespace yomber

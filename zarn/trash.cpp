@@ -265,9 +265,9 @@ void Trash::committed(const std::vector<ItemChange>& changes) {
     if (change.isDead()) {
       moved.emplace_back(name, std::string());
     } else if (change.row.parent != kTrashID) {
-      moved.emplace_back(change.nameBefore, std::string());
-    } else if (change.nameBefore != change.row.name) {
-      moved.emplace_back(change.nameBefore, name);
+      moved.emplace_back(change.nameOnDiskBefore(), std::string());
+    } else if (change.nameOnDiskBefore() != name) {
+      moved.emplace_back(change.nameOnDiskBefore(), name);
     }
   }
   if (moved.empty()) return;

@@ -53,7 +53,11 @@ TrashFolder::Outcome TrashFolder::takeAs(int folder, const std::string& diskName
                                          int& failure) {
   {
     LockGuard guard(mutex_);
-    if (isInTrash(name) || !coming_.insert(name).second) return Outcome::NameTaken;
+    struct stat status{};
+    const bool isTaken = lstat(filePath(name).c_str(), &status) == 0;
+    failure = isTaken || errno == ENOENT ? 0 : errno;
+    if (failure != 0) return Outcome::Failed;
+    if (isTaken || !coming_.insert(name).second) return Outcome::NameTaken;
   }
   const std::string written = infoPath(name);
   Outcome outcome = Outcome::Done;

@@ -191,6 +191,35 @@ TEST_F(TrashTest, TakesAnItemByEitherOfItsNames) {
   EXPECT_EQ(fs::exists(at("e\xcc\x81")) + fs::exists(at("\xc3\xa9")), 1);
 }
 
+TEST_F(TrashTest, ForgetsWhereItemsWereThatHaveOneTextForAName) {
+  const std::string first = "e\xcc\x81";
+  const std::string second = "\xc3\xa9";
+  write(first);
+  write(second);
+  scan();
+  for (const std::string& name : {first, second}) {
+    std::ofstream(infoOf(name)) << "[Trash Info]\nPath=" << at(name) << "\n";
+    fs::rename(at(name), inTrash(name));
+    scan();
+  }
+  for (const std::string& name : {first, second}) {
+    fs::rename(inTrash(name), at(name));
+    scan();
+    EXPECT_TRUE(comesTrue([&] { return !fs::exists(infoOf(name)); })) << name;
+  }
+}
+
+TEST_F(TrashTest, TakesNothingWhereItCannotSeeWhatItHas) {
+  write("a");
+  scan();
+  fs::remove(layout.trashFiles());
+  std::ofstream(layout.trashFiles()) << "somebody's";
+  NSErrorRef error;
+  EXPECT_EQ(throwAway(at("a"), &error), "");
+  EXPECT_NE(error, nullptr);
+  EXPECT_TRUE(fs::exists(at("a")));
+}
+
 TEST_F(TrashTest, RemembersTheContainer) {
   makeContainer("org.example.Notes", "Notes");
   const std::string documents = layout.documents("org.example.Notes");

@@ -44,6 +44,18 @@ TEST_F(ContentUploadsTest, AnEditThatKeepsSizeAndDateIsUploadedToo) {
   EXPECT_EQ(contentInStore(id("a")), "other");
 }
 
+TEST_F(ContentUploadsTest, JobsThatCannotBeReadAreLookedForAgain) {
+  stopAt("zarn.jobs.unread");
+  ASSERT_EQ(FaultPoint::arm("zarn.jobs.read=error,zarn.jobs.unread=pause-until-file:" + gate_),
+            nullptr);
+  write("a", "text");
+  scan();
+  ASSERT_TRUE(isStopped());
+  FaultPoint::disarmAll();
+  go();
+  EXPECT_TRUE(waitUntil([&] { return contentInStore(id("a")) == "text"; }));
+}
+
 TEST_F(ContentUploadsTest, TheDateOfAccessIsThatOfWhoUsesTheFile) {
   write("a", content(100'000));
   const timespec longAgo{.tv_sec = 1'000'000, .tv_nsec = 0};

@@ -1,8 +1,10 @@
 #include "zarn/content/job_queue.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <utility>
 
+#include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
 
 namespace yomber {
@@ -10,6 +12,11 @@ namespace {
 
 /// More than all workers together can hold, so that a page is never all taken.
 constexpr std::size_t kWindow = 2048;
+/// After which jobs that could not be read are looked for again; ns.
+constexpr std::int64_t kReadingPause = 1'000'000'000;
+
+FaultPoint jobsRead("zarn.jobs.read");
+FaultPoint jobsUnread("zarn.jobs.unread");
 
 }  // namespace
 
@@ -133,11 +140,17 @@ void JobQueue::refill(JobKind kind) {
   std::vector<Job> page;
   std::optional<std::int64_t> next;
   const std::int64_t now = options_.clock();
-  const NSErrorRef error = database_->read([&](Connection& connection) {
+  NSErrorRef error = database_->read([&](Connection& connection) {
     page = dueJobs(connection, account, kind, now, kWindow);
     next = nextDue(connection, account, kind, now);
   });
-  if (error) log_error(defaultLog(), "[ERROR] jobs cannot be read: %@", error);
+  if (jobsRead.hit()) error = NSError::errorWithErrno(EIO);
+  if (error) {
+    log_error(defaultLog(), "[ERROR] jobs cannot be read: %@", error);
+    page.clear();
+    next = now + kReadingPause;
+    (void)jobsUnread.hit();
+  }
   LockGuard guard(mutex_);
   Lane& its = lane(kind);
   its.isReading = false;

@@ -83,11 +83,13 @@ struct RZRecordBatch {
   RZRecordSavePolicy savePolicy = RZRecordSavePolicy::IfServerRecordUnchanged;
 };
 
-/// One change of a zone: the record as it is now, or nil if it was deleted.
+/// One change of a zone: the record as it is now, or nil if it was deleted. With an error, it is
+/// there and cannot be read (RZErrorStoreDamaged).
 struct RZRecordChange {
   RZRecordID recordID;
   std::string recordType;
   RZRecordRef record;
+  NSErrorRef error;
 };
 
 /// Where a reader of a zone's changes is. Opaque bytes that may be kept for ever; empty: at the

@@ -46,6 +46,23 @@ TEST(RecordFeedTest, TellsChangesInTheirOrderAndEachRecordOnce) {
   EXPECT_FALSE(page.moreComing);
 }
 
+TEST(RecordFeedTest, TellsOfADamagedRecordThatItCannotBeReadAndGoesOn) {
+  TestStore store;
+  const auto database = store.database();
+  ASSERT_EQ(save(database, {newRecord("a"), newRecord("b"), newRecord("c")}), nullptr);
+  damageRecord(store.folder(), "b");
+  const auto page = changesSince(database, {});
+  ASSERT_EQ(page.changes.size(), 3U);
+  EXPECT_EQ(page.changes[1].recordID, recordID("b"));
+  EXPECT_EQ(page.changes[1].record, nullptr);
+  EXPECT_TRUE(rz_isError(page.changes[1].error, RZErrorStoreDamaged));
+  for (const std::size_t sound : {0U, 2U}) {
+    EXPECT_NE(page.changes[sound].record, nullptr);
+    EXPECT_EQ(page.changes[sound].error, nullptr);
+  }
+  EXPECT_TRUE(changesSince(database, page.token).changes.empty());
+}
+
 TEST(RecordFeedTest, TellsOnlyWhatIsNewSinceTheToken) {
   TestStore store;
   const auto database = store.database();

@@ -106,15 +106,18 @@ class ChangeReader {
   /// Takes the next change and answers its sequence.
   std::int64_t take(const RZDesiredKeys& desiredKeys, RZRecordChange& change, std::size_t& bytes) {
     if (record_ && (!deletion_ || records_->integer(1) < deletions_->integer(0))) {
-      RecordRow row = recordFromRow(records_, zone_, desiredKeys);
+      const std::int64_t sequence = records_->integer(1);
+      change = {RZRecordID(std::string(records_->bytes(2)), zone_.zoneID),
+                std::string(records_->bytes(3)), nullptr, nullptr};
+      change.error = catchingFailures(
+          [&] { change.record = recordFromRow(records_, zone_, desiredKeys).record; });
       bytes += bodyBytes(records_);
-      change = {row.record->recordID(), row.record->recordType(), row.record};
       record_ = records_.step();
-      return row.sequence;
+      return sequence;
     }
     const std::int64_t sequence = deletions_->integer(0);
     change = {RZRecordID(std::string(deletions_->bytes(1)), zone_.zoneID),
-              std::string(deletions_->bytes(2)), nullptr};
+              std::string(deletions_->bytes(2)), nullptr, nullptr};
     deletion_ = deletions_.step();
     return sequence;
   }

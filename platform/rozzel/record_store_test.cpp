@@ -325,16 +325,6 @@ TEST(RecordStoreTest, LetsMembersWriteOnlyWhereTheyMay) {
   EXPECT_EQ(members, (std::vector<RZZoneMember>{{"bob", RZZonePermission::ReadWrite}}));
 }
 
-/// Damages the stored values of the record.
-void damage(const TestStore& store, const std::string& name) {
-  RecordsConnection connection(store.folder() + "/records.db", RecordsConnection::Missing::Fail,
-                               1000);
-  const std::string sql =
-      "UPDATE record SET body=x'ff00ff' WHERE CAST(name AS TEXT)='" + name + "'";
-  connection.execute(sql.c_str());
-  ASSERT_EQ(connection.changes(), 1);
-}
-
 NSErrorRef whyNotRead(const TestStore& store, const std::string& name) {
   NSErrorRef error;
   EXPECT_EQ(store.database()->fetchRecord(recordID(name), &error), nullptr);
@@ -348,7 +338,7 @@ TEST(RecordStoreTest, ADamagedRecordIsReadByNobodyAndSavedOverByAnybody) {
   const auto known = std::make_shared<RZRecord>(*fetch(database, "a"));
   RZQuota before;
   ASSERT_EQ(store.engine()->fetchQuota("ann", before), nullptr);
-  damage(store, "a");
+  damageRecord(store.folder(), "a");
   EXPECT_TRUE(rz_isError(whyNotRead(store, "a"), RZErrorStoreDamaged));
   EXPECT_NE(fetch(database, "b"), nullptr);
 
@@ -358,7 +348,7 @@ TEST(RecordStoreTest, ADamagedRecordIsReadByNobodyAndSavedOverByAnybody) {
   ASSERT_EQ(save(database, {known}), nullptr);
   EXPECT_EQ(*fetch(database, "a")->valueForKey<std::string>("x"), "3");
 
-  damage(store, "a");
+  damageRecord(store.folder(), "a");
   ASSERT_EQ(save(database, {newRecord("a", {{"x", "1"}, {"y", "2"}})}, RZRecordSavePolicy::AllKeys),
             nullptr);
   EXPECT_EQ(fetch(database, "a")->values(), newRecord("a", {{"x", "1"}, {"y", "2"}})->values());
@@ -371,7 +361,7 @@ TEST(RecordStoreTest, ADamagedRecordCanBeDeleted) {
   TestStore store;
   const auto database = store.database();
   ASSERT_EQ(save(database, {newRecord("a", {{"x", "1"}})}), nullptr);
-  damage(store, "a");
+  damageRecord(store.folder(), "a");
   ASSERT_EQ(remove(database, recordID("a")), nullptr);
   EXPECT_TRUE(rz_isError(whyNotRead(store, "a"), RZErrorUnknownItem));
   RZQuota quota;

@@ -17,10 +17,20 @@
 #include "platform/foundation/temporary_directory.h"
 #include "platform/rozzel/container.h"
 #include "platform/rozzel/embedded_engine.h"
+#include "platform/rozzel/records_connection.h"
 
 namespace yomber {
 
 inline const RZRecordZoneID kZone("documents");
+
+/// Damages the stored values of the records of that name.
+inline void damageRecord(const std::string& storeFolder, const std::string& name) {
+  RecordsConnection connection(storeFolder + "/records.db", RecordsConnection::Missing::Fail, 1000);
+  const std::string sql =
+      "UPDATE record SET body=x'ff00ff' WHERE CAST(name AS TEXT)='" + name + "'";
+  connection.execute(sql.c_str());
+  ASSERT_EQ(connection.changes(), 1);
+}
 
 /// A store in a folder of its own, with a container of the account "ann" and a zone.
 class TestStore {

@@ -128,7 +128,7 @@ NSErrorRef lookForRecords(const ContentStore& store, const RZRecordZoneID& zone,
     if (rz_isError(error, RZErrorZoneNotFound)) return nullptr;
     if (error) return error;
     for (const RZRecordChange& change : page.changes) {
-      if (!change.record) continue;
+      if (!change.record && !change.error) continue;
       isEmpty = false;
       log_debug(defaultLog(), "the record %@ was not taken over; its zone stays",
                 change.recordID.recordName());

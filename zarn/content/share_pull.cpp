@@ -62,16 +62,23 @@ NSErrorRef SharePull::run() {
     if (!error && pullFetched.hit()) error = NSError::errorWithErrno(EIO);
     if (error) return error;
     Items items;
+    std::vector<std::uint64_t> unreadable;
     for (const RZRecordChange& change : page.changes) {
       const auto id = itemOfRecord(change.recordID.recordName());
       if (!id) continue;
+      if (change.error) {
+        log_error(defaultLog(), "[ERROR] a record of a share cannot be read: %@", change.error);
+        unreadable.push_back(*id);
+        continue;
+      }
       SharedItem item;
       item.id = *id;
       if (change.record) item.record = SharedRecord::read(*change.record);
       if (change.record && !item.record) continue;  // of a kind that is not known here
       items.push_back(std::move(item));
     }
-    error = applyPage(std::move(items), &page.token);
+    error = waitFor(unreadable);
+    if (!error) error = applyPage(std::move(items), &page.token);
     if (error) return error;
     share_.token = page.token;
     hasMore = page.moreComing;
@@ -80,6 +87,16 @@ NSErrorRef SharePull::run() {
   }
   isAtEnd_ = true;
   return takeOverWaiting();
+}
+
+/// One record keeps no other from coming, and comes when it can be read.
+NSErrorRef SharePull::waitFor(const std::vector<std::uint64_t>& unreadable) {
+  if (unreadable.empty()) return nullptr;
+  return core_.database().write([&](WriteTransaction& transaction) {
+    for (const std::uint64_t id : unreadable)
+      postponeWaitingRecord(transaction.connection(), share_.root, id, core_.now());
+    return NSErrorRef();
+  });
 }
 
 /// What the zone has forgotten to tell is found by asking for everything that is known here.
@@ -120,8 +137,13 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
         store_->engine()->fetchRecords(store_->databaseOf(share_.zone), names, itemKeys(), found));
     if (error) return error;
     Items items;
+    std::vector<std::uint64_t> unreadable;
     for (std::size_t i = 0; i < found.size(); ++i) {
       const bool isGone = rz_isError(found[i].error, RZErrorUnknownItem);
+      if (rz_isError(found[i].error, RZErrorStoreDamaged)) {
+        unreadable.push_back(ids[begin + i]);
+        continue;
+      }
       if (!found[i].record && !isGone) return found[i].error;
       SharedItem item;
       item.id = ids[begin + i];
@@ -129,7 +151,8 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
       if (found[i].record) item.record = SharedRecord::read(*found[i].record);
       if (isGone || item.record) items.push_back(std::move(item));
     }
-    error = applyPage(std::move(items), nullptr);
+    error = waitFor(unreadable);
+    if (!error) error = applyPage(std::move(items), nullptr);
     if (error) return error;
   }
   return nullptr;

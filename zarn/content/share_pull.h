@@ -35,6 +35,7 @@ class SharePull {
   using Items = std::vector<SharedItem>;
 
   NSErrorRef takeOverWaiting();
+  NSErrorRef waitFor(const std::vector<std::uint64_t>& unreadable);
   NSErrorRef startAgain();
   NSErrorRef applyPage(Items items, const RZChangeToken* token);
   NSErrorRef read(Items& items) const;

@@ -1,4 +1,5 @@
 // What the store has lost, or has no room for, of what is shared.
+#include "platform/rozzel/test_store.h"
 #include "zarn/content/test_sharing.h"
 
 namespace yomber {
@@ -45,6 +46,28 @@ TEST_F(ShareStoreLossesTest, WhatWasInAShareWhoseZoneIsGoneIsItsOwnersAlone) {
   EXPECT_TRUE(isConfirmed(*ann, "Plans/a.txt"));
   EXPECT_EQ(zonesWith("ann", id), std::vector<std::string>{QSUbiquitousDefaultContainerID});
   EXPECT_EQ(ann->readWhole("Plans/a.txt"), kLong);
+}
+
+TEST_F(ShareStoreLossesTest, ADamagedRecordKeepsNothingElseFromComing) {
+  ann->makeFolder("Plans");
+  for (const std::string name : {"a.txt", "b.txt", "c.txt"}) ann->write("Plans/" + name, kLong);
+  ann->settle();
+  share = ann->share("Plans", {viewer("bob")});
+  ASSERT_NE(share, nullptr);
+  ann->settle();
+  const std::uint64_t id = ann->id("Plans/b.txt");
+  ann->engine->stop();
+  damageRecord(storePath, std::to_string(id));
+  ASSERT_EQ(bob->accept(share), nullptr);
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->readWhole("Plans/c.txt"), kLong);
+  EXPECT_FALSE(std::filesystem::exists(bob->at("Plans/b.txt")));
+  // Whose document it is saves it anew.
+  ann->restart();
+  ann->write("Plans/b.txt", kLong + "more");
+  ann->settle();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->readWhole("Plans/b.txt"), kLong + "more");
 }
 
 TEST_F(ShareStoreLossesTest, RoomIsAskedOfWhoseShareItIs) {

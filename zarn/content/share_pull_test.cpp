@@ -4,6 +4,8 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <array>
+#include <cstring>
 #include <filesystem>
 #include <thread>
 
@@ -61,6 +63,73 @@ TEST_F(SharePullTest, WhatIsSavedWhileAChangeIsTakenOverIsUploaded) {
       [&] { return ann->follow() == nullptr && ann->readWhole("Plans/a.txt") == saved; }));
   followBoth();
   EXPECT_EQ(bob->readWhole("Plans/a.txt"), saved);
+}
+
+/// What a program would have written that is called for an access list.
+std::string accessListWithOneUser() {
+  struct Entry {
+    std::uint16_t tag;
+    std::uint16_t permission;
+    std::uint32_t id;
+  };
+  constexpr std::uint32_t kVersion = 2;
+  constexpr std::uint32_t kNobody = ~0U;
+  constexpr std::array kEntries{
+      Entry{.tag = 0x01, .permission = 7, .id = kNobody},  // owner
+      Entry{.tag = 0x02, .permission = 4, .id = 4242},     // a user
+      Entry{.tag = 0x04, .permission = 5, .id = kNobody},  // group
+      Entry{.tag = 0x10, .permission = 5, .id = kNobody},  // the most that is given
+      Entry{.tag = 0x20, .permission = 5, .id = kNobody},  // others
+  };
+  std::string list(sizeof(kVersion) + sizeof(kEntries), '\0');
+  std::memcpy(list.data(), &kVersion, sizeof(kVersion));
+  std::memcpy(list.data() + sizeof(kVersion), kEntries.data(), sizeof(kEntries));
+  return list;
+}
+
+std::string attributeAt(const std::string& path, const char* name) {
+  std::array<char, 256> value{};
+  const ssize_t length = getxattr(path.c_str(), name, value.data(), value.size());
+  return length < 0 ? "none" : std::string(value.data(), static_cast<std::size_t>(length));
+}
+
+mode_t modeAt(const std::string& path) {
+  struct stat status{};
+  EXPECT_EQ(lstat(path.c_str(), &status), 0) << path;
+  return status.st_mode & 07777U;
+}
+
+TEST_F(SharePullTest, WhatAnotherChangesKeepsItsPermissionsAndAttributes) {
+  shareFolder(editor("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  const std::string path = ann->at("Plans/a.txt");
+  const std::string list = accessListWithOneUser();
+  ASSERT_EQ(setxattr(path.c_str(), "user.test", "value", 5, 0), 0);
+  ASSERT_EQ(setxattr(path.c_str(), "system.posix_acl_access", list.data(), list.size(), 0), 0);
+  ASSERT_EQ(chmod(path.c_str(), 04755), 0);
+  ann->settle();
+  bob->write("Plans/a.txt", "by bob");
+  bob->settle();
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->readWhole("Plans/a.txt"), "by bob");
+  EXPECT_EQ(modeAt(path), 0755U) << "it runs as whoever starts it";
+  EXPECT_EQ(attributeAt(path, "user.test"), "value");
+  EXPECT_EQ(attributeAt(path, "system.posix_acl_access"), list);
+}
+
+TEST_F(SharePullTest, AViewersDocumentThatChangesKeepsThemAndMayNotBeWrittenTo) {
+  shareFolder(viewer("bob"));
+  const std::string path = bob->at("Plans/a.txt");
+  ASSERT_EQ(setxattr(path.c_str(), "user.test", "value", 5, 0), 0);
+  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
+  bob->settle();
+  ann->write("Plans/a.txt", "by ann");
+  ann->settle();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), "by ann");
+  EXPECT_EQ(modeAt(path), 0444U);
+  EXPECT_EQ(attributeAt(path, "user.test"), "value");
+  EXPECT_EQ(attributeAt(path, kOnlyReadableAttribute), "1");
 }
 
 TEST_F(SharePullTest, WhatIsAddedToAFolderThatAnotherDeletesStays) {

@@ -13,6 +13,7 @@
 
 #include "platform/foundation/bounced_name.h"
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/file_copy.h"
 #include "platform/foundation/log.h"
 #include "zarn/content/file_lease.h"
 #include "zarn/item_attributes.h"
@@ -30,6 +31,9 @@ constexpr const char* kKeptLinkName = "Kept link";
 constexpr const char* kKeptFolderName = "Kept folder";
 /// On what was taken away: the name under which it is to come back.
 constexpr const char* kKeptNameAttribute = "user.yomber.kept";
+constexpr std::string_view kOwnPrefix = "user.yomber.";
+constexpr const char* kAccessListAttribute = "system.posix_acl_access";
+constexpr std::size_t kLargestAttribute = 65'536;
 constexpr std::int64_t kNanosecondsInSecond = 1'000'000'000;
 
 std::string folderOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
@@ -52,6 +56,20 @@ bool isFilledFolder(const std::string& path) {
 
 bool setAttribute(int file, const char* name, const std::string& value) {
   return fsetxattr(file, name, value.data(), value.size(), 0) == 0;
+}
+
+/// Whether an attribute stays with an item when its content is another one.
+bool staysHere(std::string_view name) {
+  return !name.starts_with(kOwnPrefix) || name == kFavoriteAttribute ||
+         name == kLastUsedAttribute || name == kSharedAttribute;
+}
+
+int copyAccessList(int from, int to) {
+  std::string list(kLargestAttribute, '\0');
+  const ssize_t length = fgetxattr(from, kAccessListAttribute, list.data(), list.size());
+  if (length < 0) return errno == ENODATA || errno == EOPNOTSUPP ? 0 : errno;
+  list.resize(static_cast<std::size_t>(length));
+  return setAttribute(to, kAccessListAttribute, list) ? 0 : errno;
 }
 
 /// Renames between folders that may not be written to.
@@ -191,15 +209,24 @@ NSErrorRef SharedTree::place(const std::string& from, const std::string& folder,
   return number == 0 ? nullptr : NSError::errorWithErrno(number, folder + '/' + name);
 }
 
-/// What the account itself said about an item stays with it.
-void SharedTree::copyOwnAttributes(const std::string& from, const std::string& to) {
-  for (const char* name :
-       {kTagsAttribute, kFavoriteAttribute, kLastUsedAttribute, kSharedAttribute}) {
-    std::array<char, 4096> value{};
-    const ssize_t length = lgetxattr(from.c_str(), name, value.data(), value.size());
-    if (length > 0)
-      (void)lsetxattr(to.c_str(), name, value.data(), static_cast<std::size_t>(length), 0);
-  }
+/// Who may do what with the file, and what was said about it here, is no part of its content.
+void SharedTree::copyOwnProperties(int from, const std::string& staged) {
+  const FileDescriptor to(open(staged.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  struct stat status{};
+  struct stat stagedStatus{};
+  if (!to || fstat(from, &status) != 0 || fstat(to.get(), &stagedStatus) != 0) return;
+  const bool mayWrite = (stagedStatus.st_mode & S_IWUSR) != 0;
+  // An attribute of a file that may not be written to could not be set.
+  int failure = fchmod(to.get(), S_IRUSR | S_IWUSR) == 0 ? 0 : errno;
+  if (failure == 0) failure = copyUserAttributes(from, to.get(), staysHere);
+  const int aclFailure = copyAccessList(from, to.get());
+  if (failure == 0) failure = aclFailure;
+  // The last, as it limits the list. Others' content never runs as somebody else.
+  const mode_t mode = status.st_mode & (mayWrite ? 01777U : 01555U);
+  if (fchmod(to.get(), mode) != 0) failure = errno;
+  if (failure != 0)
+    log_error(defaultLog(), "[ERROR] a changed document keeps not all of its properties: %@",
+              NSError::errorWithErrno(failure, staged));
 }
 
 NSErrorRef SharedTree::noteKept(const std::string& path, const std::string& name) {
@@ -219,7 +246,7 @@ NSErrorRef SharedTree::replace(const std::string& staged, const std::string& pat
   if (!file) return NSError::errorWithErrno(errno, path);
   const FileLease lease(file.get());
   if (!lease.isHeld()) return openElsewhereError(path);
-  copyOwnAttributes(path, staged);
+  copyOwnProperties(file.get(), staged);
   if (kept == Kept::Yes) {
     if (NSErrorRef error = noteKept(path, keptCopyName(nameOf(path)))) return error;
   }

@@ -46,7 +46,8 @@ class SharedTree {
   /// Whether what is taken out of the tree is to come back as a copy, however this process ends.
   enum class Kept : bool { No = false, Yes = true };
   /// Puts `staged` where the file at `path` is, whose place in the private folder is `displaced`
-  /// then. EBUSY while anybody has that open. `isUntouched`: nobody has come to open it since.
+  /// then. EBUSY while anybody has that open. `isUntouched`: nobody has come to open it since. What
+  /// is no content (permissions, attributes) stays as it was at `path`.
   [[nodiscard]] NSErrorRef replace(const std::string& staged, const std::string& path, Kept kept,
                                    std::string& displaced, bool& isUntouched) const;
   /// Takes something out of the tree. EBUSY, and nothing taken, where a file that is not to be kept
@@ -73,7 +74,7 @@ class SharedTree {
   [[nodiscard]] NSErrorRef markShared(const std::string& path, bool isShared) const;
 
  private:
-  static void copyOwnAttributes(const std::string& from, const std::string& to);
+  static void copyOwnProperties(int from, const std::string& staged);
   [[nodiscard]] static NSErrorRef noteKept(const std::string& path, const std::string& name);
   [[nodiscard]] NSErrorRef takeUnused(const std::string& path, const std::string& taken,
                                       const FileStamp* seen) const;

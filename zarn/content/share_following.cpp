@@ -235,10 +235,10 @@ NSErrorRef Shares::adoptOwn(ShareRow row, const RZShare& share) const {
   NSErrorRef error;
   const auto item = core_->items->itemByID(row.root, &error);
   if (!item) return error;
-  bool isOthers = false;
+  bool isOthers = false;  // another account's, or shared with this one
   error = core_->database().read([&](Connection& connection) {
     const auto known = findShare(connection, row.root);
-    isOthers = known && known->account != row.account;
+    isOthers = known && (known->account != row.account || !known->isOwn());
   });
   if (error || isOthers) return error;
   row.isFolder = item->isFolder();

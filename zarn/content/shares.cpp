@@ -29,6 +29,11 @@ RZRecordZoneID zoneOfShare(std::uint64_t root) {
   return RZRecordZoneID(RZShareZonePrefix + std::to_string(root));
 }
 
+NSErrorRef refuseToSave(const std::string& owner, const std::string& account) {
+  log_default(defaultLog(), "[NOTICE] refused to save the share of %@ for %@", owner, account);
+  return rz_error(RZErrorPermissionFailure, "Only its owner may change a share.");
+}
+
 }  // namespace
 
 // --- What is asked and done.
@@ -147,27 +152,39 @@ NSErrorRef Shares::newShare(std::string_view path, RZShareRef& share) {
   return nullptr;
 }
 
+/// Whoever saves a share need not have been given it by `newShare`.
+NSErrorRef Shares::checkSaved(const Session& session, const RZShare& share,
+                              const ItemRow& row) const {
+  NSErrorRef reason;
+  std::optional<ShareRow> known;
+  NSErrorRef error = core_->database().read([&](Connection& connection) {
+    reason = checkNesting(connection, row);
+    known = findShare(connection, row.id);
+  });
+  if (error || reason) return error ? error : reason;
+  if (known && !known->isOwn())
+    return refuseToSave(known->zone.ownerName(), session.store->account());
+  const bool isFolder = share.type() == RZShareTypeFolder;
+  if (isFolder != row.isFolder())
+    return rz_error(RZErrorInvalidArguments, "The share is of another kind than its item.");
+  return nullptr;
+}
+
 NSErrorRef Shares::save(const RZShare& share, RZShareRef& saved) {
   Session session;
   NSErrorRef error = open(session);
   if (error) return error;
   const RZRecordZoneID& zone = share.recordID().zoneID();
   const auto root = itemOfRecord(share.rootRecordID().recordName());
-  if (zone.ownerName() != RZCurrentUserDefaultName) {
-    log_default(defaultLog(), "[NOTICE] refused to save the share of %@ for %@", zone.ownerName(),
-                session.store->account());
-    return rz_error(RZErrorPermissionFailure, "Only its owner may change a share.");
-  }
+  if (zone.ownerName() != RZCurrentUserDefaultName)
+    return refuseToSave(zone.ownerName(), session.store->account());
   if (!root || zone != zoneOfShare(*root))
     return rz_error(RZErrorInvalidArguments, "This is the share of no item of this drive.");
-  Item item;
-  NSErrorRef reason;
-  error = readItem(*root, item);
-  if (!error)
-    error = core_->database().read(
-        [&](Connection& connection) { reason = checkNesting(connection, item.row); });
-  if (error || reason) return error ? error : reason;
   LockGuard working(working_);
+  Item item;
+  error = readItem(*root, item);
+  if (!error) error = checkSaved(session, share, item.row);
+  if (error) return error;
   const ContentStore& store = *session.store;
   error = contentError(store.engine()->saveShare(store.databaseOf(zone), share, saved));
   if (!error && shareSaved.hit()) error = NSError::errorWithErrno(EIO);

@@ -90,6 +90,7 @@ class Shares {
   NSErrorRef openFor(std::string_view identifier, Session& session, Item& item) const;
   NSErrorRef readItem(std::uint64_t id, Item& item) const;
   NSErrorRef checkNesting(Connection& connection, const ItemRow& row) const;
+  NSErrorRef checkSaved(const Session& session, const RZShare& share, const ItemRow& row) const;
 
   void work();
   void poke();

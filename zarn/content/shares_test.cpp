@@ -1,5 +1,9 @@
 #include "zarn/content/shares.h"
 
+#include <unistd.h>
+
+#include <atomic>
+
 #include "zarn/content/test_sharing.h"
 
 namespace yomber {
@@ -260,6 +264,90 @@ TEST_F(SharesTest, OnlyItsOwnerSavesAShare) {
   EXPECT_EQ(copied.rootPath, bob->at("Plans"));
   RZShareRef saved;
   EXPECT_TRUE(rz_isError(bob->shares().save(*copied.share, saved), RZErrorPermissionFailure));
+}
+
+TEST_F(SharesTest, AParticipantCannotMakeWhatHeFollowsAShareOfHisOwn) {
+  ann->write("note.txt", kLong);
+  ann->settle();
+  ASSERT_EQ(bob->accept(ann->share("note.txt", {editor("bob")})), nullptr);
+  const std::uint64_t id = bob->id("note.txt");
+  const std::string name = std::to_string(id);
+  const RZShare made(RZRecordID(name, RZRecordZoneID(RZShareZonePrefix + name)),
+                     RZShareTypeDocument, "note.txt", "bob");
+  RZShareRef saved;
+  EXPECT_TRUE(rz_isError(bob->shares().save(made, saved), RZErrorPermissionFailure));
+  bob->write("note.txt", "by bob");
+  bob->settle();
+  EXPECT_EQ(zonesWith("bob", id), Names{});
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->readWhole("note.txt"), "by bob");
+}
+
+TEST_F(SharesTest, AnOwnZoneOfThatNameDoesNotTakeTheItemFromItsOwner) {
+  ann->write("note.txt", kLong);
+  ann->settle();
+  ASSERT_EQ(bob->accept(ann->share("note.txt", {editor("bob")})), nullptr);
+  const std::uint64_t id = bob->id("note.txt");
+  const std::string name = std::to_string(id);
+  const RZShare made(RZRecordID(name, RZRecordZoneID(RZShareZonePrefix + name)),
+                     RZShareTypeDocument, "note.txt", "bob");
+  RZShareRef saved;
+  ASSERT_EQ(records->saveShare({QSUbiquitousRozzelContainerIdentifier, "bob"}, made, saved),
+            nullptr);
+  ASSERT_EQ(bob->follow(), nullptr);
+  bob->write("note.txt", "by bob");
+  bob->settle();
+  EXPECT_EQ(zonesWith("bob", id), Names{});
+  ASSERT_EQ(ann->follow(), nullptr);
+  EXPECT_EQ(ann->readWhole("note.txt"), "by bob");
+}
+
+TEST_F(SharesTest, TwoThatAreSavedAtOnceAreNotNested) {
+  ann->makeFolder("Plans");
+  ann->makeFolder("Plans/Old");
+  ann->settle();
+  RZShareRef inner;
+  RZShareRef outer;
+  ASSERT_EQ(ann->shares().newShare(ann->at("Plans/Old"), inner), nullptr);
+  ASSERT_EQ(ann->shares().newShare(ann->at("Plans"), outer), nullptr);
+  const Pause pause = pauseAt("zarn.share.saved");
+  NSErrorRef first;
+  NSErrorRef second;
+  std::thread saving([&] {
+    RZShareRef saved;
+    first = ann->shares().save(*inner, saved);
+  });
+  const bool isSaving = pause.waitUntilReached();
+  std::atomic<pid_t> number = 0;
+  std::thread savingToo([&] {
+    number = gettid();
+    RZShareRef saved;
+    second = ann->shares().save(*outer, saved);
+  });
+  const bool isWaiting = waitUntil([&] {
+    std::ifstream file("/proc/self/task/" + std::to_string(number) + "/wchan");
+    std::string where;
+    file >> where;
+    return where.find("futex") != std::string::npos;
+  });
+  pause.end();
+  saving.join();
+  savingToo.join();
+  EXPECT_TRUE(isSaving && isWaiting);
+  EXPECT_EQ(first, nullptr);
+  ASSERT_NE(second, nullptr);
+  EXPECT_NE(second->localizedDescription().find("stop sharing that first"), std::string::npos)
+      << second->description();
+}
+
+TEST_F(SharesTest, AShareIsOfItsItemsKind) {
+  ann->makeFolder("Plans");
+  ann->settle();
+  RZShareRef made;
+  ASSERT_EQ(ann->shares().newShare(ann->at("Plans"), made), nullptr);
+  const RZShare other(made->rootRecordID(), RZShareTypeDocument, "Plans", "ann");
+  RZShareRef saved;
+  EXPECT_TRUE(rz_isError(ann->shares().save(other, saved), RZErrorInvalidArguments));
 }
 
 TEST_F(SharesTest, AStaleShareIsRefused) {

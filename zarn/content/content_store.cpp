@@ -294,6 +294,8 @@ NSErrorRef ContentStore::saveThumbnail(const RZRecordRef& record, const RecordTh
   const RZAsset* const content =
       record ? record->valueForKey<RZAsset>(kQSRecordKeyContent) : nullptr;
   if (content == nullptr || *content != wanted.content) return nullptr;
+  // Somebody else's was of this content too: a save of another content takes it away.
+  if (record->valueForKey<RZAsset>(kQSRecordKeyThumbnail1024x1024) != nullptr) return nullptr;
   auto changed = std::make_shared<RZRecord>(*record);
   changed->setObject(wanted.thumbnail, kQSRecordKeyThumbnail1024x1024);
   // Only while it is the record that was looked at.
@@ -313,7 +315,7 @@ NSErrorRef ContentStore::saveThumbnails(const std::vector<RecordThumbnail>& thum
   std::map<RZDatabaseID, std::vector<std::size_t>> places;
   for (std::size_t i = 0; i < thumbnails.size(); ++i)
     places[databaseOf(thumbnails[i].zone)].push_back(i);
-  const RZDesiredKeys keys{{kQSRecordKeyContent}};
+  const RZDesiredKeys keys{{kQSRecordKeyContent, kQSRecordKeyThumbnail1024x1024}};
   for (const auto& [database, indices] : places) {
     std::vector<RZRecordID> ids;
     for (const std::size_t i : indices)

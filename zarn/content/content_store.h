@@ -96,8 +96,8 @@ class ContentStore {
   /// the store itself, when it cannot be reached.
   [[nodiscard]] NSErrorRef save(const std::vector<StoredDocument>& documents,
                                 std::vector<Saved>& saved);
-  /// The same for records that are there. What is gone or has other content meanwhile is left as
-  /// it is, with neither tag nor error.
+  /// The same for records that are there. What is gone, has other content meanwhile, or has one
+  /// already is left as it is, with neither tag nor error.
   [[nodiscard]] NSErrorRef saveThumbnails(const std::vector<RecordThumbnail>& thumbnails,
                                           std::vector<Saved>& saved);
   /// The same; `refused` gets an error, or nil, for each. Removing what is not there is a success.

@@ -5,6 +5,7 @@
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
+#include "platform/rozzel/errors.h"
 #include "zarn/content/content_core.h"
 #include "zarn/content/thumbnail_maker.h"
 #include "zarn/content/thumbnail_rows.h"
@@ -23,6 +24,13 @@ FaultPoint thumbnailSaved("zarn.thumbnail.saved");
 constexpr std::chrono::minutes kPatience{10};
 constexpr std::int64_t kSweptAtOnce = 2000;
 constexpr std::int64_t kAllSwept = -1;
+
+/// Whether another attempt would be refused as well.
+bool isForGood(const NSErrorRef& refusal) {
+  return rz_isError(refusal, RZErrorPermissionFailure) ||
+         rz_isError(refusal, RZErrorZoneNotFound) || rz_isError(refusal, RZErrorUnknownItem);
+}
+
 class ThumbnailBatch {
  public:
   ThumbnailBatch(ContentCore& core, std::shared_ptr<ContentStore> store)
@@ -33,7 +41,8 @@ class ThumbnailBatch {
     ThumbnailSubject& wanted = wanted_.emplace_back();
     const bool isThere = subject.row && subject.row->kind == ItemKind::Document &&
                          subject.content && subject.content->content;
-    if (!isThere) return;
+    const bool mayWrite = !subject.share || subject.share->mayWrite;
+    if (!isThere || !mayWrite) return;
     wanted.name = subject.row->name;
     wanted.content = *subject.content->content;
   }
@@ -79,7 +88,8 @@ class ThumbnailBatch {
     if (wanted.outcome == Outcome::Later) storeThumbnail(connection, {wanted.content, {}});
     if (wanted.outcome == Outcome::Unavailable)
       setMetaInteger(connection, meta::kThumbnailsMissed, 1);
-    if (saved_[place].error) return core_.postpone(connection, job, saved_[place].error);
+    const NSErrorRef& error = saved_[place].error;
+    if (error && !isForGood(error)) return core_.postpone(connection, job, error);
     removeJob(connection, job);
     if (!saved_[place].tag.empty()) noteTag(connection, place);
   }

@@ -72,8 +72,17 @@ void Shares::poke() {
   changed_.notifyAll();
 }
 
+NSErrorRef Shares::Failures::of(const RZRecordZoneID& zone) const {
+  const auto found = ofZones.find(zone);
+  return ofAll || found == ofZones.end() ? ofAll : found->second;
+}
+
+NSErrorRef Shares::Failures::any() const {
+  return ofAll || ofZones.empty() ? ofAll : ofZones.begin()->second;
+}
+
 void Shares::work() {
-  NSErrorRef last;
+  Failures last;
   for (;;) {
     {
       LockGuard guard(mutex_);
@@ -84,41 +93,66 @@ void Shares::work() {
       if (isEnding_) return;
       isPoked_ = false;
     }
-    NSErrorRef error;
+    Failures failures;
     {
       LockGuard working(working_);
-      error = pass();
+      failures = pass();
     }
-    if (error && !isOutOfReach(error) && (!last || last->description() != error->description()))
-      log_error(defaultLog(), "[ERROR] shares cannot be followed: %@", error);
-    last = std::move(error);
+    logNew(failures, last);
+    last = std::move(failures);
   }
 }
 
-NSErrorRef Shares::pass() {
+void Shares::logNew(const Failures& failures, const Failures& before) {
+  const auto isNew = [](const NSErrorRef& error, const NSErrorRef& known) {
+    return error && !isOutOfReach(error) &&
+           (!known || known->description() != error->description());
+  };
+  if (isNew(failures.ofAll, before.ofAll))
+    log_error(defaultLog(), "[ERROR] shares cannot be followed: %@", failures.ofAll);
+  for (const auto& [zone, error] : failures.ofZones) {
+    if (isNew(error, before.of(zone)))
+      log_error(defaultLog(), "[ERROR] the share %@ cannot be followed: %@", zone.description(),
+                error);
+  }
+}
+
+Shares::Failures Shares::pass() {
   Session session;
+  Failures failures;
   // What was done while no process ran must not be taken for something else.
-  if (open(session) || !core_->scanner->hasScannedAll()) return nullptr;
-  if (!isRecovered_) SharedTree(*core_, *session.store).recover();
-  NSErrorRef error = isRecovered_ ? nullptr : noteRemovalsBeforeStart(session.account);
-  if (!error && !isRecovered_) error = askForWaitingAgain(session.account);
-  if (error) return error;
-  isRecovered_ = true;
-  error = followZones(session);
-  if (error) return error;
+  if (open(session) || !core_->scanner->hasScannedAll()) return failures;
+  failures.ofAll = recover(session);
+  if (!failures.ofAll) followZones(session, failures);
+  if (!failures.ofAll) takeOverRefused(session, failures);
+  return failures;
+}
+
+NSErrorRef Shares::recover(const Session& session) {
+  if (isRecovered_) return nullptr;
+  SharedTree(*core_, *session.store).recover();
+  NSErrorRef error = noteRemovalsBeforeStart(session.account);
+  if (!error) error = askForWaitingAgain(session.account);
+  if (!error) isRecovered_ = true;
+  return error;
+}
+
+void Shares::takeOverRefused(const Session& session, Failures& failures) {
   const ContentCore::Refused refused = core_->takeRefused();
   for (const bool isForbidden : {false, true}) {
     for (const auto& [zone, items] : isForbidden ? refused.forbidden : refused.changed) {
       std::optional<ShareRow> share;
-      error = core_->database().read([&](Connection& connection) {
+      NSErrorRef error = core_->database().read([&](Connection& connection) {
         share = findShareOfZone(connection, session.account, zone);
       });
       if (!error && share && !share->isLeaving())
         error = SharePull(*core_, session.store, *share).takeOver(items, isForbidden);
-      if (error) return error;  // the jobs are tried again, and refused again
+      // The jobs are tried again, and refused again.
+      if (isOutOfReach(error)) failures.ofAll = error;
+      if (failures.ofAll) return;
+      if (error) failures.ofZones[zone] = error;
     }
   }
-  return nullptr;
 }
 
 /// Whatever came of it before: there may be room now, or another program that knows more.
@@ -143,7 +177,7 @@ NSErrorRef Shares::noteRemovalsBeforeStart(std::int64_t account) const {
   return error;
 }
 
-NSErrorRef Shares::followZones(const Session& session) {
+void Shares::followZones(const Session& session, Failures& failures) {
   const ContentStore& store = *session.store;
   Zones own;
   Zones foreign;
@@ -152,33 +186,41 @@ NSErrorRef Shares::followZones(const Session& session) {
   if (!error)
     error = contentError(
         store.engine()->fetchZones(store.databaseOf(RZDatabaseScope::Shared), foreign));
-  if (error) return error;
   std::vector<ShareRow> shares;
   const auto read = [&](Connection& connection) {
     shares = findShares(connection, session.account);
   };
-  error = core_->database().read(read);
-  const auto isKnown = [&](const RZRecordZoneID& zone) {
-    return std::any_of(shares.begin(), shares.end(),
-                       [&](const ShareRow& share) { return share.zone == zone; });
-  };
-  bool mayHaveAdopted = false;
+  if (!error) error = core_->database().read(read);
+  failures.ofAll = error;
   for (const Zones* const zones : {&own, &foreign}) {
-    for (const RZRecordZone& zone : *zones) {
-      if (error || !isSharedZone(zone.zoneID) || isKnown(zone.zoneID)) continue;
-      error = adopt(session, zone);
-      mayHaveAdopted = true;
-    }
+    if (!failures.ofAll) adoptNew(session, *zones, shares, failures);
   }
-  if (!error && mayHaveAdopted) error = core_->database().read(read);
-  if (error) return error;
-  NSErrorRef result;
+  if (!failures.ofAll) failures.ofAll = core_->database().read(read);
+  if (failures.ofAll) return;
   for (const ShareRow& share : shares) {
     error = follow(session.store, share, share.isOwn() ? own : foreign);
-    if (isOutOfReach(error) || core_->queue->isEnding()) return error;
-    if (error) result = error;  // that must not keep the others
+    if (isOutOfReach(error) || core_->queue->isEnding()) {
+      failures.ofAll = error;
+      return;
+    }
+    if (error) failures.ofZones[share.zone] = error;
   }
-  return result;
+}
+
+void Shares::adoptNew(const Session& session, const Zones& zones,
+                      const std::vector<ShareRow>& known, Failures& failures) {
+  for (const RZRecordZone& zone : zones) {
+    const bool isKnown = std::any_of(known.begin(), known.end(), [&](const ShareRow& share) {
+      return share.zone == zone.zoneID;
+    });
+    if (!isSharedZone(zone.zoneID) || isKnown) continue;
+    const NSErrorRef error = adopt(session, zone);
+    if (isOutOfReach(error)) {
+      failures.ofAll = error;
+      return;
+    }
+    if (error) failures.ofZones[zone.zoneID] = error;
+  }
 }
 
 NSErrorRef Shares::adopt(const Session& session, const RZRecordZone& zone) {

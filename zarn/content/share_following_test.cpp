@@ -137,6 +137,32 @@ TEST_F(ShareFollowingTest, AnItemThatHasItsCountedNameAlreadyIsInItsPlace) {
   EXPECT_EQ(bob->read("same 2.txt"), "two");
 }
 
+TEST_F(ShareFollowingTest, AShareThatCannotBeLeftKeepsNoOtherFromBeingFollowed) {
+  shareFolder(viewer("bob"));
+  ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  for (const char* const name : {"ended.txt", "third.txt"}) ann->write(name, kLong);
+  ann->settle();
+  ASSERT_EQ(bob->accept(ann->share("ended.txt", {viewer("bob")})), nullptr);
+  ASSERT_EQ(FaultPoint::arm("zarn.leave.kept=error"), nullptr);
+  ASSERT_EQ(ann->stopSharing("ended.txt"), nullptr);
+  ASSERT_NE(bob->follow(), nullptr) << "one who asks for all hears of it";
+  ASSERT_EQ(chmod(bob->at("Plans/a.txt").c_str(), 0600), 0);
+  bob->write("Plans/a.txt", "not allowed");
+  ASSERT_EQ(bob->scanner->scanAll(), nullptr);
+  const std::string identifier = "d:" + std::to_string(bob->id("Plans/a.txt"));
+  EXPECT_TRUE(waitUntil([&] {
+    const NSErrorRef error = bob->shares().refresh(identifier);
+    EXPECT_EQ(error, nullptr) << error->description();
+    return error || bob->exists("a (kept copy).txt");
+  }));
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(bob->accept(ann->share("third.txt", {viewer("bob")})), nullptr);
+  EXPECT_EQ(bob->readWhole("third.txt"), kLong);
+  FaultPoint::disarmAll();
+  ASSERT_EQ(bob->follow(), nullptr);
+  EXPECT_FALSE(bob->exists("ended.txt"));
+}
+
 TEST_F(ShareFollowingTest, NobodysSharesAreJudgedByAnotherAccountsZones) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);

@@ -284,7 +284,10 @@ NSErrorRef Shares::refresh(std::string_view identifier) {
   if (error) return error;
   LockGuard working(working_);
   error = askForWaitingAgain(session.account);
-  return error ? error : pass();
+  if (error) return error;
+  const Failures failures = pass();
+  if (item.share) return failures.of(item.share->zone);
+  return item.row.parent == kNoParent ? failures.any() : failures.ofAll;
 }
 
 /// What is shared comes under its own identifier, which nothing else here can have then.
@@ -326,7 +329,7 @@ NSErrorRef Shares::accept(const std::string& url, std::string& identifier) {
   for (;;) {
     {
       LockGuard working(working_);
-      error = pass();
+      error = pass().of(share->recordID().zoneID());
     }
     if (!error) error = checkAccepted(session, *share, *root);
     if (error || core_->items->itemByID(*root)) return error;

@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -59,7 +60,8 @@ class Shares {
     std::string base;
   };
   [[nodiscard]] NSErrorRef copyTokens(std::string_view path, Tokens& tokens);
-  /// Returns when what the store now says is taken over.
+  /// Returns when what the store now says is taken over; fails where the item's own share cannot be
+  /// followed, for the root where any cannot.
   [[nodiscard]] NSErrorRef refresh(std::string_view identifier);
   struct ItemOptions {
     bool isShared = false;
@@ -92,12 +94,26 @@ class Shares {
   NSErrorRef checkNesting(Connection& connection, const ItemRow& row) const;
   NSErrorRef checkSaved(const Session& session, const RZShare& share, const ItemRow& row) const;
 
+  /// What failed in a pass. One share's failure keeps no other from being followed.
+  struct Failures {
+    NSErrorRef ofAll;  ///< that nothing could be followed, or no more
+    std::map<RZRecordZoneID, NSErrorRef> ofZones;
+
+    [[nodiscard]] NSErrorRef of(const RZRecordZoneID& zone) const;
+    [[nodiscard]] NSErrorRef any() const;
+  };
+
   void work();
   void poke();
-  NSErrorRef pass() REQUIRES(working_);
+  static void logNew(const Failures& failures, const Failures& before);
+  Failures pass() REQUIRES(working_);
+  NSErrorRef recover(const Session& session) REQUIRES(working_);
   NSErrorRef askForWaitingAgain(std::int64_t account) const;
   NSErrorRef noteRemovalsBeforeStart(std::int64_t account) const;
-  NSErrorRef followZones(const Session& session) REQUIRES(working_);
+  void followZones(const Session& session, Failures& failures) REQUIRES(working_);
+  void adoptNew(const Session& session, const Zones& zones, const std::vector<ShareRow>& known,
+                Failures& failures) REQUIRES(working_);
+  void takeOverRefused(const Session& session, Failures& failures) REQUIRES(working_);
   NSErrorRef adopt(const Session& session, const RZRecordZone& zone);
   NSErrorRef adoptForeign(ShareRow row, const RZShare& share);
   /// An item that is here must be the one that is shared: marked so, of that kind, of no share.

@@ -424,9 +424,8 @@ void Engine::retryNow() {
     return NSErrorRef();
   });
   if (error) log_error(defaultLog(), "[ERROR] jobs cannot be tried now: %@", error);
-  for (const JobKind kind : {JobKind::Upload, JobKind::Download, JobKind::Evict}) {
-    core_->queue->noteJobs(kind);
-  }
+  for (std::size_t kind = 0; kind < kJobKinds; ++kind)
+    core_->queue->noteJobs(static_cast<JobKind>(kind));
 }
 
 }  // namespace

@@ -49,6 +49,14 @@ class ThumbnailsTest : public ContentDrive {
         found ? found->valueForKey<RZAsset>(kQSRecordKeyThumbnail1024x1024) : nullptr;
     return asset != nullptr ? std::optional(*asset) : std::nullopt;
   }
+  [[nodiscard]] std::optional<Job> thumbnailJob(const std::string& path) const {
+    std::optional<Job> job;
+    EXPECT_EQ(database->read([&](Connection& connection) {
+      job = findJob(connection, id(path), JobKind::Thumbnail);
+    }),
+              nullptr);
+    return job;
+  }
   [[nodiscard]] std::string thumbnailBytes(const std::string& path) const {
     const auto asset = thumbnail(path);
     std::string bytes;
@@ -282,14 +290,32 @@ TEST_F(ThumbnailsTest, WhatTheStoreDoesNotTakeIsTriedUntilItDoes) {
       waitUntil([&] { return state("photo.jpg").upload == ContentState::Upload::Confirmed; }));
   // More than once, so that it counts.
   ASSERT_TRUE(waitUntil([&] {
-    std::optional<Job> job;
-    EXPECT_EQ(database->read([&](Connection& connection) {
-      job = findJob(connection, id("photo.jpg"), JobKind::Thumbnail);
-    }),
-              nullptr);
+    const auto job = thumbnailJob("photo.jpg");
     return job && job->attempts > 2;
   }));
   FaultPoint::disarmAll();
+  engine->retryNow();
+  EXPECT_TRUE(waitUntil([&] { return thumbnail("photo.jpg").has_value(); }));
+}
+
+TEST_F(ThumbnailsTest, WhatFailedIsTriedAtOnceWhenSomebodyAsks) {
+  engine->stop();
+  engine.reset();
+  ASSERT_EQ(FaultPoint::arm("zarn.thumbnail.drawn=error"), nullptr);
+  reopen();
+  options.firstPause = options.longestPause = std::chrono::hours(1);
+  engine = ContentEngine::create(
+      store, std::make_shared<Scanner>(store, std::weak_ptr<FolderVisitor>()), options);
+  signIn("ann");
+  engine->start();
+  write("photo.jpg", sample("quarters.jpg"));
+  scan();
+  ASSERT_TRUE(waitUntil([&] {
+    const auto job = thumbnailJob("photo.jpg");
+    return job && job->attempts == 1;
+  }));
+  FaultPoint::disarmAll();
+  ASSERT_TRUE(engine->waitUntilIdle(kPatience));
   engine->retryNow();
   EXPECT_TRUE(waitUntil([&] { return thumbnail("photo.jpg").has_value(); }));
 }

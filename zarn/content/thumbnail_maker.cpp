@@ -5,6 +5,7 @@
 
 #include "platform/foundation/fault_points.h"
 #include "platform/foundation/log.h"
+#include "platform/glimmet/content_types.h"
 #include "zarn/content/thumbnail_rows.h"
 
 namespace yomber {
@@ -32,6 +33,29 @@ void noteStoreFailed(ThumbnailSubject& subject, const NSErrorRef& error) {
   subject.thumbnail.reset();
   subject.isNew = false;
 }
+
+/// Those of one batch that have been seen to, by their content.
+class Twins {
+ public:
+  /// One that says what becomes of this one too: whoever cannot draw it under another name need not
+  /// be who draws it under this one.
+  [[nodiscard]] const ThumbnailSubject* find(const ThumbnailSubject& subject) const {
+    const auto found = seen_.find(subject.content.hash);
+    if (found == seen_.end()) return nullptr;
+    for (const ThumbnailSubject* const each : found->second) {
+      if (each->outcome == Outcome::Ready || typeOf(*each) == typeOf(subject)) return each;
+    }
+    return nullptr;
+  }
+  void add(const ThumbnailSubject& subject) { seen_[subject.content.hash].push_back(&subject); }
+
+ private:
+  static const std::string& typeOf(const ThumbnailSubject& subject) {
+    return ContentTypes::system().typeForName(subject.name);
+  }
+
+  std::map<RZAssetHash, std::vector<const ThumbnailSubject*>> seen_;
+};
 
 }  // namespace
 
@@ -94,17 +118,18 @@ NSErrorRef ThumbnailMaker::commit() {
 void ThumbnailMaker::make(std::vector<ThumbnailSubject>& subjects,
                           std::chrono::milliseconds patience) {
   const auto deadline = std::chrono::steady_clock::now() + patience;
-  std::map<RZAssetHash, const ThumbnailSubject*> drawn;
+  Twins twins;
   for (ThumbnailSubject& subject : subjects) {
     if (!isCandidate(subject.name, subject.content)) continue;
-    const auto [twin, isFirst] = drawn.try_emplace(subject.content.hash, &subject);
-    if (!isFirst) {
-      subject.outcome = twin->second->outcome;
-      subject.thumbnail = twin->second->thumbnail;
-      subject.error = twin->second->error;
-    } else if (isKnown(subject)) {
+    if (const ThumbnailSubject* const twin = twins.find(subject)) {
+      subject.outcome = twin->outcome;
+      subject.thumbnail = twin->thumbnail;
+      subject.error = twin->error;
       continue;
-    } else if (core_.queue->isEnding() || std::chrono::steady_clock::now() > deadline) {
+    }
+    twins.add(subject);
+    if (isKnown(subject)) continue;
+    if (core_.queue->isEnding() || std::chrono::steady_clock::now() > deadline) {
       subject.outcome = Outcome::Later;
     } else {
       draw(subject);

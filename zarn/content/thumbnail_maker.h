@@ -41,7 +41,8 @@ class ThumbnailMaker {
   /// Whether a document of that name and content may have a thumbnail. Opens no document.
   [[nodiscard]] bool isCandidate(const std::string& name, const RZAsset& content) const;
 
-  /// Equal contents are drawn once. What is not begun after `patience` is left for later.
+  /// Equal contents are drawn once, or once by each who may. What is not begun after `patience` is
+  /// left for later.
   void make(std::vector<ThumbnailSubject>& subjects, std::chrono::milliseconds patience);
 
  private:

@@ -163,6 +163,15 @@ TEST_F(ThumbnailsTest, APictureIsKnownByItsStartWhereItsNameTellsNothing) {
   EXPECT_TRUE(thumbnail("film.mp4"));
 }
 
+TEST_F(ThumbnailsTest, ACopyWhoseNameTellsNothingDoesNotKeepAVideoFromBeingDrawn) {
+  installThumbnailer("ffmpegthumbnailer -i %i -o %o -s %s");
+  write("film", sample("green.mp4"));
+  write("film.mp4", sample("green.mp4"));
+  settle();
+  EXPECT_FALSE(thumbnail("film"));
+  EXPECT_TRUE(thumbnail("film.mp4"));
+}
+
 TEST_F(ThumbnailsTest, AThumbnailerThatFailsOrDrawsRubbishCostsTheThumbnailOnly) {
   installThumbnailer("false");
   write("first.mp4", sample("green.mp4"));

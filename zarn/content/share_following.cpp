@@ -122,18 +122,18 @@ Shares::Failures Shares::pass() {
   Failures failures;
   // What was done while no process ran must not be taken for something else.
   if (open(session) || !core_->scanner->hasScannedAll()) return failures;
-  failures.ofAll = recover(session);
+  failures.ofAll = beginAccount(session);
   if (!failures.ofAll) followZones(session, failures);
   if (!failures.ofAll) takeOverRefused(session, failures);
   return failures;
 }
 
-NSErrorRef Shares::recover(const Session& session) {
-  if (isRecovered_) return nullptr;
-  SharedTree(*core_, *session.store).recover();
+NSErrorRef Shares::beginAccount(const Session& session) {
+  if (begun_.contains(session.account)) return nullptr;
+  if (begun_.empty()) SharedTree(*core_, *session.store).recover();
   NSErrorRef error = noteRemovalsBeforeStart(session.account);
   if (!error) error = askForWaitingAgain(session.account);
-  if (!error) isRecovered_ = true;
+  if (!error) begun_.insert(session.account);
   return error;
 }
 

@@ -107,7 +107,7 @@ class Shares {
   void poke();
   static void logNew(const Failures& failures, const Failures& before);
   Failures pass() REQUIRES(working_);
-  NSErrorRef recover(const Session& session) REQUIRES(working_);
+  NSErrorRef beginAccount(const Session& session) REQUIRES(working_);
   NSErrorRef askForWaitingAgain(std::int64_t account) const;
   NSErrorRef noteRemovalsBeforeStart(std::int64_t account) const;
   void followZones(const Session& session, Failures& failures) REQUIRES(working_);
@@ -131,7 +131,8 @@ class Shares {
   Condition changed_;
   bool isPoked_ GUARDED_BY(mutex_) = false;
   bool isEnding_ GUARDED_BY(mutex_) = false;
-  bool isRecovered_ GUARDED_BY(working_) = false;
+  /// For which was seen to what happened before this process.
+  std::set<std::int64_t> begun_ GUARDED_BY(working_);
   /// Shared items that were not there the last time: one that is on its way is not gone.
   std::set<std::uint64_t> missing_;
   /// Of accepted shares whose identifiers are other items' here, which was said once.

@@ -99,26 +99,36 @@ INSTANTIATE_TEST_SUITE_P(AtEachPoint, SharePullKillTest,
                          testing::Values("zarn.share.accepted", "zarn.pull.fetched",
                                          "zarn.pull.placed", "zarn.pull.stored"));
 
-class ShareUnseenKillTest : public SharesKillTest {};
+/// Bob's process ends when what came was removed before anybody looked at it.
+class ShareUnseenKillTest : public SharesKillTest {
+ protected:
+  void removeUnseenAndDie(const std::function<void()>& beforeRestart = {}) {
+    shareFolder(editor("bob"));
+    ann->write("Plans/new.txt", kLong);
+    ann->makeFolder("Plans/Folder");
+    ann->write("Plans/Folder/in.txt", "in it");
+    ann->write("Plans/stays.txt", "stays");
+    ann->settle();
+    removed = ann->id("Plans/new.txt");
+    const std::string gate = storePath + "-placed";
+    const auto work = [&](SharingDrive& drive) {
+      const Pause placed("zarn.pull.placed", gate);
+      std::thread following([&] { (void)drive.follow(); });
+      if (!placed.waitUntilReached()) _exit(1);
+      drive.remove("Plans/new.txt");
+      drive.remove("Plans/Folder");
+      if (FaultPoint::arm("zarn.pull.stored=abort")) _exit(1);
+      placed.end();
+      following.join();
+    };
+    die("bob", work, beforeRestart);
+  }
+
+  std::uint64_t removed = 0;
+};
 
 TEST_F(ShareUnseenKillTest, WhatWasRemovedBeforeItWasLookedAtIsRemovedForAll) {
-  shareFolder(editor("bob"));
-  ann->write("Plans/new.txt", kLong);
-  ann->makeFolder("Plans/Folder");
-  ann->write("Plans/Folder/in.txt", "in it");
-  ann->write("Plans/stays.txt", "stays");
-  ann->settle();
-  const std::string gate = storePath + "-placed";
-  die("bob", [&](SharingDrive& drive) {
-    const Pause placed("zarn.pull.placed", gate);
-    std::thread following([&] { (void)drive.follow(); });
-    if (!placed.waitUntilReached()) _exit(1);
-    drive.remove("Plans/new.txt");
-    drive.remove("Plans/Folder");
-    if (FaultPoint::arm("zarn.pull.stored=abort")) _exit(1);
-    placed.end();
-    following.join();
-  });
+  removeUnseenAndDie();
   const Names expected{"Old", "a.txt", "stays.txt"};
   EXPECT_TRUE(waitUntil([&] {
     EXPECT_EQ(bob->follow(), nullptr);
@@ -127,6 +137,19 @@ TEST_F(ShareUnseenKillTest, WhatWasRemovedBeforeItWasLookedAtIsRemovedForAll) {
   }));
   EXPECT_EQ(bob->names("Plans"), expected);
   EXPECT_EQ(bob->readWhole("Plans/stays.txt"), "stays");
+}
+
+TEST_F(ShareUnseenKillTest, ItIsAlsoWhereAnotherAccountWasSignedInFirst) {
+  const std::string home = bob->layout.home();
+  removeUnseenAndDie([&] {
+    records = std::make_shared<EmbeddedEngine>(storePath);
+    const SharingDrive drive(home, records, "carol");
+    EXPECT_EQ(drive.follow(), nullptr);
+    EXPECT_FALSE(zonesWith("ann", removed).empty());
+    drive.engine->setStore(std::make_shared<ContentStore>(records, "bob"), "bob");
+    EXPECT_TRUE(
+        waitUntil([&] { return drive.follow() == nullptr && zonesWith("ann", removed).empty(); }));
+  });
 }
 
 class ShareConflictKillTest : public SharesKillTest {};

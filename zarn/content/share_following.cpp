@@ -44,6 +44,17 @@ void forgetRecordsElsewhere(Connection& connection, const ShareRow& share) {
   }
 }
 
+/// The shared item. What was only just put here may not have been looked at.
+std::optional<ItemRow> findRoot(const ContentCore& core, const ShareRow& share, NSErrorRef& error) {
+  auto root = core.items->itemByID(share.root, &error);
+  const bool mayBeNew = !error && !root && !share.isOwn() && !share.zoneTag.empty();
+  const auto beside =
+      mayBeNew ? core.items->itemAtPath(folderBesideShare(core, share)) : std::nullopt;
+  if (!beside) return root;
+  error = core.scanner->scanFolders({beside->id});
+  return error ? std::nullopt : core.items->itemByID(share.root, &error);
+}
+
 }  // namespace
 
 Shares::Shares(std::shared_ptr<ContentCore> core, Options options)
@@ -311,7 +322,7 @@ NSErrorRef Shares::follow(const std::shared_ptr<ContentStore>& store, ShareRow s
   if (share.isLeaving()) return leaveShare(*core_, store, share);
   NSErrorRef error;
   const RZRecordZone* const zone = findZone(zones, share.zone);
-  const auto root = core_->items->itemByID(share.root, &error);
+  const auto root = findRoot(*core_, share, error);
   if (error) return error;
   const bool wasHere = share.isOwn() || !share.zoneTag.empty();
   const bool isMissing = wasHere && (!root || (!share.isOwn() && root->isTrashed()));

@@ -163,6 +163,29 @@ TEST_F(ShareFollowingTest, AShareThatCannotBeLeftKeepsNoOtherFromBeingFollowed) 
   EXPECT_FALSE(bob->exists("ended.txt"));
 }
 
+TEST_F(ShareFollowingTest, ASharedItemThatIsRemovedBeforeAllOfItIsHereIsLeft) {
+  ann->makeFolder("Plans");
+  ann->write("Plans/a.txt", kLong);
+  ann->settle();
+  share = ann->share("Plans", {editor("bob")});
+  RZShareRef accepted;
+  ASSERT_EQ(records->acceptShare(QSUbiquitousRozzelContainerIdentifier, "bob",
+                                 share->URL().value_or(""), accepted),
+            nullptr);
+  meanwhile("zarn.pull.placed", [&] {
+    ASSERT_TRUE(bob->exists("Plans"));
+    bob->remove("Plans");
+  });
+  std::vector<RZShareRef> shares;
+  for (int turn = 0; turn < 3; ++turn) ASSERT_EQ(bob->follow(), nullptr);
+  ASSERT_EQ(bob->shares().sharesWithMe(shares), nullptr);
+  EXPECT_TRUE(shares.empty());
+  share = ann->share("Plans", {editor("bob")});
+  ASSERT_EQ(bob->accept(share), nullptr);
+  EXPECT_EQ(bob->readWhole("Plans/a.txt"), kLong);
+  EXPECT_EQ(ann->readWhole("Plans/a.txt"), kLong);
+}
+
 TEST_F(ShareFollowingTest, NobodysSharesAreJudgedByAnotherAccountsZones) {
   shareFolder(editor("bob"));
   ASSERT_EQ(bob->readWhole("Plans/a.txt"), kLong);

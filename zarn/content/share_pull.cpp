@@ -22,6 +22,8 @@ FaultPoint pullStored("zarn.pull.stored");
 FaultPoint pullDisplaced("zarn.pull.displaced");
 
 constexpr std::size_t kTogether = 1000;
+/// No zone has that, so that what changed in it is asked for.
+constexpr const char* kTagOfNone = "none";
 
 const RZDesiredKeys& itemKeys() {
   static const auto* const keys = new RZDesiredKeys(
@@ -513,6 +515,18 @@ ContentRow SharePull::contentOf(const SharedItem& item) const {
   return row;
 }
 
+/// Until all of it is here nothing but this says that the shared item was: one that is missing then
+/// has been removed.
+void SharePull::noteRoot(Connection& connection) {
+  const bool isHere = settled_.contains(share_.root) && !waiting_.contains(share_.root);
+  if (!isHere || share_.isOwn() || !share_.zoneTag.empty()) return;
+  auto stored = findShare(connection, share_.root);
+  if (!stored) return;
+  stored->zoneTag = kTagOfNone;
+  storeShare(connection, *stored);
+  share_.zoneTag = kTagOfNone;
+}
+
 NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* token, Step step) {
   std::vector<ContentRow> contents;
   for (const SharedItem& item : items) {
@@ -556,6 +570,7 @@ NSErrorRef SharePull::storeContents(const Items& items, const RZChangeToken* tok
         removeWaitingRecord(connection, share_.root, item.id);
       }
     }
+    if (step == Step::Done) noteRoot(connection);
     if (token == nullptr) return NSErrorRef();
     ShareRow stored = findShare(connection, share_.root).value_or(share_);
     stored.token = *token;

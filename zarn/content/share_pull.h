@@ -74,6 +74,7 @@ class SharePull {
 
   enum class Step : bool { Prepared, Done };
   NSErrorRef storeContents(const Items& items, const RZChangeToken* token, Step step);
+  void noteRoot(Connection& connection);
   [[nodiscard]] ContentRow contentOf(const SharedItem& item) const;
   [[nodiscard]] bool isNew(const SharedItem& item) const;
   void applyAll(Items& items);

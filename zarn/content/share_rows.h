@@ -30,8 +30,9 @@ struct ShareRow {
   bool mayWrite = true;
   bool isFolder = false;
   std::string title;
-  std::string token;    ///< up to where the zone's changes were taken over
-  std::string zoneTag;  ///< of the zone when there were no more
+  std::string token;  ///< up to where the zone's changes were taken over
+  /// Of the zone when there were no more; of others' not empty once the item itself was put here.
+  std::string zoneTag;
 
   [[nodiscard]] bool isOwn() const { return zone.ownerName() == RZCurrentUserDefaultName; }
   [[nodiscard]] bool isLeaving() const { return state == State::Leaving; }

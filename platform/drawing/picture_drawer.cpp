@@ -35,6 +35,19 @@ std::string programBeside() {
                  : (self.parent_path() / "yomber-thumbnailer").string();
 }
 
+/// The names in a folder that begin so, sorted.
+std::vector<std::string> namesIn(const std::filesystem::path& folder, std::string_view prefix) {
+  std::vector<std::string> names;
+  std::error_code failure;
+  for (std::filesystem::directory_iterator at(folder, failure), end; !failure && at != end;
+       at.increment(failure)) {
+    std::string name = at->path().filename();
+    if (name.starts_with(prefix)) names.push_back(std::move(name));
+  }
+  std::ranges::sort(names);
+  return names;
+}
+
 NSErrorRef errorOf(Status status) {
   if (status == Status::TooLarge) return NSError::errorWithErrno(EFBIG);
   return NSError::errorWithDomain(
@@ -110,6 +123,16 @@ std::unique_ptr<PictureDrawer::Process> PictureDrawer::takeProcess(NSErrorRef* e
     return nullptr;
   }
   return process;
+}
+
+std::string PictureDrawer::libraries() {
+  const std::filesystem::path folder(YOMBER_VIPS_FOLDER);
+  std::string all;
+  for (const std::string& name : namesIn(folder, "libvips.so.")) all += name + ";";
+  for (const std::string& modules : namesIn(folder, "vips-modules-")) {
+    for (const std::string& name : namesIn(folder / modules, "")) all += modules + "/" + name + ";";
+  }
+  return all;
 }
 
 void PictureDrawer::giveBack(std::unique_ptr<Process> process) {

@@ -59,6 +59,9 @@ class PictureDrawer {
   /// the process died of it, other codes when there is no process to draw with.
   [[nodiscard]] std::optional<DrawnPicture> draw(int file, std::uint32_t side, drawing::Form form,
                                                  NSErrorRef* error = nullptr);
+  /// Another text when pictures of other kinds may be drawn than before: of the libraries that are
+  /// installed, and their modules. Nothing where they are not where they were built for.
+  [[nodiscard]] static std::string libraries();
 
  private:
   class Process;

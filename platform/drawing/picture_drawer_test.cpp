@@ -236,6 +236,11 @@ TEST_F(PictureDrawerTest, EveryKindIsDrawnInItsColours) {
   expectQuarters("quarters.pdf", 2);
 }
 
+TEST_F(PictureDrawerTest, TheLibraryThatDrawsIsKnownByItsVersion) {
+  EXPECT_NE(PictureDrawer::libraries().find("libvips.so."), std::string::npos)
+      << PictureDrawer::libraries();
+}
+
 TEST_F(PictureDrawerTest, ACameraHeldUprightDrawsUpright) { expectQuarters("turned.jpg", 8); }
 
 TEST_F(PictureDrawerTest, OfSeveralPagesTheFirstIsDrawn) {

@@ -118,6 +118,17 @@ std::vector<std::string> InstalledThumbnailers::types() {
   return all;
 }
 
+std::string InstalledThumbnailers::versions() {
+  const LockGuard lock(mutex_);
+  if (isChanged()) readAll();
+  std::string all;
+  for (const auto& [path, stamp] : stamps_) {
+    if (path.ends_with(kSuffix))
+      all += path + " " + std::to_string(stamp.mtime) + " " + std::to_string(stamp.ctime) + ";";
+  }
+  return all;
+}
+
 InstalledThumbnailers::Stamp InstalledThumbnailers::stampOf(const std::string& path) {
   struct stat status{};
   if (stat(path.c_str(), &status) != 0) return {};

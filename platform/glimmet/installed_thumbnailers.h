@@ -36,6 +36,8 @@ class InstalledThumbnailers {
   [[nodiscard]] std::vector<std::string> commandFor(std::string_view type);
   /// All types that one draws whose program is there, sorted.
   [[nodiscard]] std::vector<std::string> types();
+  /// Another text when a thumbnailer came, went, or was replaced by another version.
+  [[nodiscard]] std::string versions();
 
  private:
   /// What tells that a file or folder was changed; nothing for what is not there.

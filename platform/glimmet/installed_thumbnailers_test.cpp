@@ -117,6 +117,14 @@ TEST_F(InstalledThumbnailersTest, TheFirstWhoseProgramIsThereCounts) {
   EXPECT_EQ(thumbnailers_.commandFor("video/mp4"), (std::vector<std::string>{"film", "%o"}));
 }
 
+TEST_F(InstalledThumbnailersTest, TheVersionsDifferWhenAFileWasReplaced) {
+  write(machine_ + "/a.thumbnailer", entry("image/png"));
+  const std::string before = thumbnailers_.versions();
+  EXPECT_EQ(thumbnailers_.versions(), before);
+  write(machine_ + "/a.thumbnailer", entry("image/png", "/bin/true"));
+  EXPECT_NE(thumbnailers_.versions(), before);
+}
+
 TEST_F(InstalledThumbnailersTest, TheTypesAreThoseOfProgramsThatAreThere) {
   EXPECT_EQ(thumbnailers_.types(), std::vector<std::string>());
   write(own_ + "/a.thumbnailer", entry("video/webm;", "/nowhere/film"));

@@ -46,9 +46,10 @@ bool DocumentDrawer::mayDraw(const std::string& name, int file) const {
 }
 
 std::int64_t DocumentDrawer::abilities() const {
-  std::string all = "unknown names, ";
+  std::string all = "unknown names, " + PictureDrawer::libraries();
   if (programs_.isAvailable()) {
     for (const std::string& type : thumbnailers_.types()) all += type + ";";
+    all += thumbnailers_.versions();
   }
   // Another standard library's numbers would cost another look at each document, no more.
   return static_cast<std::int64_t>(std::hash<std::string>()(all));

@@ -34,7 +34,8 @@ class DocumentDrawer {
   /// The same of a document that is open.
   [[nodiscard]] bool mayDraw(const std::string& name, int file) const;
 
-  /// Another number when other types can be drawn than before: a thumbnailer came or went.
+  /// Another number when more may be drawn than before: a thumbnailer came, went or was replaced,
+  /// or the library that draws pictures.
   [[nodiscard]] std::int64_t abilities() const;
 
   /// As PictureDrawer::draw and, for what is drawn by programs, ProgramDrawer::draw. `file` is a

@@ -2,11 +2,15 @@
 
 #include <algorithm>
 
+#include "zarn/schema.h"
+
 namespace yomber {
 namespace {
 
-/// To be raised when more kinds of content can be drawn: what could not be is then tried again.
-constexpr std::int64_t kDrawingVersion = 1;
+/// What could not be drawn is tried again when more can be.
+std::int64_t drawingVersion(Connection& connection) {
+  return metaInteger(connection, meta::kThumbnailAbilities);
+}
 
 std::string_view hashBytes(const RZAsset& asset) {
   return {reinterpret_cast<const char*>(asset.hash.data()), asset.hash.size()};
@@ -16,13 +20,14 @@ std::string_view hashBytes(const RZAsset& asset) {
 
 std::optional<ThumbnailRow> findThumbnail(Connection& connection, const RZAsset& content) {
   StatementUse statement(
-      connection.prepared("SELECT hash,size FROM thumbnail WHERE content=?1 AND "
-                          "(hash IS NOT NULL OR version>=?2)"));
+      connection.prepared("SELECT hash,size,version FROM thumbnail WHERE content=?1"));
   statement->bindBytes(1, hashBytes(content));
-  statement->bindInteger(2, kDrawingVersion);
   if (!statement->step()) return std::nullopt;
   ThumbnailRow row{content, std::nullopt};
-  if (statement->isNull(0)) return row;
+  if (statement->isNull(0)) {
+    if (statement->integer(2) != drawingVersion(connection)) return std::nullopt;
+    return row;
+  }
   RZAsset& thumbnail = row.thumbnail.emplace();
   const std::string_view hash = statement->bytes(0);
   std::copy_n(hash.begin(), std::min(hash.size(), thumbnail.hash.size()), thumbnail.hash.begin());
@@ -34,7 +39,7 @@ void storeThumbnail(Connection& connection, const ThumbnailRow& row) {
   StatementUse statement(connection.prepared(
       "INSERT OR REPLACE INTO thumbnail(content,version,hash,size) VALUES(?1,?2,?3,?4)"));
   statement->bindBytes(1, hashBytes(row.content));
-  statement->bindInteger(2, kDrawingVersion);
+  statement->bindInteger(2, drawingVersion(connection));
   if (row.thumbnail) {
     statement->bindBytes(3, hashBytes(*row.thumbnail));
   } else {

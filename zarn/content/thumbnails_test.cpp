@@ -163,6 +163,17 @@ TEST_F(ThumbnailsTest, APictureIsKnownByItsStartWhereItsNameTellsNothing) {
   EXPECT_TRUE(thumbnail("film.mp4"));
 }
 
+TEST_F(ThumbnailsTest, WhatOneThumbnailerCannotDrawIsTriedWithTheNextVersion) {
+  installThumbnailer("false");
+  restartEngine();
+  write("film.mp4", sample("green.mp4"));
+  settle();
+  EXPECT_FALSE(thumbnail("film.mp4"));
+  installThumbnailer("ffmpegthumbnailer -i %i -o %o -s %s");
+  restartEngine();
+  EXPECT_TRUE(waitUntil([&] { return thumbnail("film.mp4").has_value(); }));
+}
+
 TEST_F(ThumbnailsTest, ACopyWhoseNameTellsNothingDoesNotKeepAVideoFromBeingDrawn) {
   installThumbnailer("ffmpegthumbnailer -i %i -o %o -s %s");
   write("film", sample("green.mp4"));

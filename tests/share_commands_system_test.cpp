@@ -125,6 +125,11 @@ TEST_F(ShareCommands, AFolderIsSharedWithAllThatIsAndComesIntoIt) {
   const ProcessResult inner = ann_.yomber({"share", "add", "Plans/one.txt", "eve"});
   EXPECT_NE(inner.exitCode, 0);
   EXPECT_THAT(inner.errors, HasSubstr("name that folder"));
+  const ProcessResult linked = ann_.yomber({"share", "link", "Plans/one.txt"});
+  EXPECT_NE(linked.exitCode, 0) << linked.output;
+  EXPECT_THAT(linked.errors, HasSubstr("name that folder"));
+  const ProcessResult passedOn = bob_.yomber({"share", "link", "Plans"});
+  EXPECT_EQ(passedOn.exitCode, 0) << passedOn.errors;
 }
 
 TEST_F(ShareCommands, ALinkIsForEverybodyOnlyWhenItsOwnerSaysSo) {

@@ -146,6 +146,10 @@ NSErrorRef DriveSharing::link(const NSFileProviderItemIdentifier& identifier, st
   NSErrorRef error;
   const auto service = openSharing(client_, identifier, error);
   if (!service) return error;
+  RZShareRef share;
+  error = fetchShare(*service, share);
+  if (error) return error;
+  if (!isOwnShare(identifier, *share)) return liesInShare(*share);
   return service->call([&](QSSharingServiceV1& item, const SharingClient::Done& done) {
     (void)item.fetchShareURLWithCompletion([&url, done](NSURLRef found, NSErrorRef failure) {
       if (found) url = found->absoluteString();

@@ -148,9 +148,11 @@ class Listing::State : public ChangeSink {
  private:
   using Key = ListingCursors::Key;
 
-  NSErrorRef readNow(const Key& key, std::uint32_t limit, PagesAhead::Page& out);
+  std::optional<ListingPoint> endOfPrevious(const Key& key);
+  NSErrorRef readNow(const Key& key, const std::optional<ListingPoint>& after, std::uint32_t limit,
+                     PagesAhead::Page& out);
   ReadAhead planReadAhead(const Key& key, std::uint32_t limit, const ListingPoint& after);
-  Start findStart(Connection& reader, const Key& key);
+  Start startAt(Connection& reader, const ListingScope& scope, std::uint64_t offset);
   std::shared_ptr<const ListingFences> fencesOf(Connection& reader, const ListingScope& scope);
   void forgetOtherDatabase() REQUIRES(mutex_);
 
@@ -199,15 +201,14 @@ std::shared_ptr<const ListingFences> Listing::State::fencesOf(Connection& reader
   return fences;
 }
 
-Start Listing::State::findStart(Connection& reader, const Key& key) {
-  const ListingScope& scope = key.scope;
-  const std::uint64_t offset = key.offset;
-  if (offset == 0) return {};
-  {
-    LockGuard guard(mutex_);
-    forgetOtherDatabase();
-    if (auto point = cursors_.find(key)) return {std::move(*point), 0, false};
-  }
+std::optional<ListingPoint> Listing::State::endOfPrevious(const Key& key) {
+  if (key.offset == 0) return ListingPoint{};
+  LockGuard guard(mutex_);
+  forgetOtherDatabase();
+  return cursors_.take(key);
+}
+
+Start Listing::State::startAt(Connection& reader, const ListingScope& scope, std::uint64_t offset) {
   if (offset < ListingFences::kDistance) return {{}, offset, false};
   const auto fences = fencesOf(reader, scope);
   const std::uint64_t fence = offset / ListingFences::kDistance;
@@ -227,10 +228,13 @@ NSErrorRef Listing::State::page(const Key& key, std::uint32_t limit, ListingPage
          {NSLocalizedDescriptionKey, std::string("A page's limit must be at least 1.")}});
   }
   const std::uint32_t count = std::min(limit, kMaximumLimit);
+  const auto after = endOfPrevious(key);
+  std::optional<PagesAhead::Page> ahead;
+  if (after) ahead = pagesAhead_.take(key, *after, count, database_->currentRank());
   PagesAhead::Page result;
-  if (auto ahead = pagesAhead_.take(key, count, database_->currentRank())) {
+  if (ahead) {
     result = *std::move(ahead);
-  } else if (NSErrorRef error = readNow(key, count, result)) {
+  } else if (NSErrorRef error = readNow(key, after, count, result)) {
     return error;
   }
   out = std::move(result.page);
@@ -240,13 +244,15 @@ NSErrorRef Listing::State::page(const Key& key, std::uint32_t limit, ListingPage
   if (key.offset != 0) readAhead = planReadAhead(next, count, result.end);
   LockGuard guard(mutex_);
   forgetOtherDatabase();
-  cursors_.store(next, std::move(result.end));
+  cursors_.store(next, std::move(result.end), std::chrono::steady_clock::now());
   return nullptr;
 }
 
-NSErrorRef Listing::State::readNow(const Key& key, std::uint32_t limit, PagesAhead::Page& out) {
+NSErrorRef Listing::State::readNow(const Key& key, const std::optional<ListingPoint>& after,
+                                   std::uint32_t limit, PagesAhead::Page& out) {
   return database_->read([&](Connection& reader) {
-    out = readPage(reader, key.scope, findStart(reader, key), key.offset, limit);
+    const Start start = after ? Start{*after, 0, false} : startAt(reader, key.scope, key.offset);
+    out = readPage(reader, key.scope, start, key.offset, limit);
   });
 }
 
@@ -261,7 +267,7 @@ Listing::ReadAhead Listing::State::planReadAhead(const Key& key, std::uint32_t l
     if (error) return std::nullopt;
     return result;
   };
-  return pagesAhead_.plan(key, limit, database_->currentRank(), read);
+  return pagesAhead_.plan(key, after, limit, database_->currentRank(), read);
 }
 
 Listing::Listing(std::shared_ptr<Database> database) : state_(std::make_shared<State>(database)) {

@@ -27,7 +27,8 @@ struct ListingPage {
 ///
 /// A page costs the same at any offset: where the previous page ended is remembered by (connection,
 /// folder, order, offset), and otherwise found through fences every 200 entries. A page that
-/// follows another goes on after that one's last entry, whatever changed in between.
+/// follows another goes on after that one's last entry, whatever changed in between; with several
+/// listings of one connection under way, after the last entry of the one that stands earliest.
 ///
 /// Who has taken a second page will take a third: it is read ahead, by whoever answered the second,
 /// once he has done so.

@@ -1,8 +1,18 @@
 #include "zarn/listing_cursors.h"
 
 #include <algorithm>
+#include <tuple>
+#include <utility>
 
 namespace yomber {
+namespace {
+
+bool isBefore(const ListingPoint& one, const ListingPoint& other, ListingOrder order) {
+  if (order == ListingOrder::Date && one.age != other.age) return one.age < other.age;
+  return std::tie(one.nameKey, one.id) < std::tie(other.nameKey, other.id);
+}
+
+}  // namespace
 
 std::size_t ListingCursors::Hash::operator()(const Key& key) const {
   std::size_t hash = key.connection;
@@ -14,40 +24,77 @@ std::size_t ListingCursors::Hash::operator()(const Key& key) const {
   return hash;
 }
 
-std::optional<ListingPoint> ListingCursors::find(const Key& key) {
-  const auto place = places_.find(key);
-  if (place == places_.end()) return std::nullopt;
+std::optional<ListingPoint> ListingCursors::take(const Key& key) {
+  const auto place = entriesByKey_.find(key);
+  if (place == entriesByKey_.end()) return std::nullopt;
   entries_.splice(entries_.begin(), entries_, place->second);
-  return place->second->second;
+  Entry& entry = entries_.front();
+  const auto earliest = std::ranges::min_element(
+      entry.places,
+      [&](const ListingPoint& one, const ListingPoint& other) {
+        return isBefore(one, other, key.scope.order);
+      },
+      &Place::point);
+  ListingPoint point = earliest->point;
+  // The latest goes: the others may be in need of the earliest still.
+  if (entry.places.size() > 1) {
+    removeLatest(entry);
+  } else {
+    entry.isTaken = true;
+  }
+  return point;
 }
 
-void ListingCursors::store(const Key& key, ListingPoint point) {
-  if (const auto place = places_.find(key); place != places_.end()) {
-    place->second->second = std::move(point);
+void ListingCursors::store(const Key& key, ListingPoint point, TimePoint now) {
+  Entry& entry = entryFor(key);
+  const auto isOver = [&](const Place& place) {
+    return entry.isTaken || now - place.stored > kPatience;
+  };
+  size_ -= std::erase_if(entry.places, isOver);
+  entry.isTaken = false;
+  entry.places.push_back({std::move(point), now});
+  ++size_;
+  if (entry.places.size() > kMaximumPerKey) removeLatest(entry);
+  while (size_ > capacity_ && entries_.size() > 1) remove(std::prev(entries_.end()));
+}
+
+ListingCursors::Entry& ListingCursors::entryFor(const Key& key) {
+  const auto [place, isNew] = entriesByKey_.try_emplace(key);
+  if (isNew) {
+    place->second = entries_.insert(entries_.begin(), {key, {}, false});
+  } else {
     entries_.splice(entries_.begin(), entries_, place->second);
-    return;
   }
-  entries_.emplace_front(key, std::move(point));
-  places_.emplace(key, entries_.begin());
-  if (entries_.size() <= capacity_) return;
-  places_.erase(entries_.back().first);
-  entries_.pop_back();
+  return entries_.front();
+}
+
+void ListingCursors::removeLatest(Entry& entry) {
+  const auto latest = std::ranges::max_element(
+      entry.places,
+      [&](const ListingPoint& one, const ListingPoint& other) {
+        return isBefore(one, other, entry.key.scope.order);
+      },
+      &Place::point);
+  entry.places.erase(latest);
+  --size_;
+}
+
+ListingCursors::Entries::iterator ListingCursors::remove(Entries::iterator entry) {
+  size_ -= entry->places.size();
+  entriesByKey_.erase(entry->key);
+  return entries_.erase(entry);
 }
 
 void ListingCursors::removeConnection(std::uint64_t connection) {
   for (auto entry = entries_.begin(); entry != entries_.end();) {
-    if (entry->first.connection == connection) {
-      places_.erase(entry->first);
-      entry = entries_.erase(entry);
-    } else {
-      ++entry;
-    }
+    entry = entry->key.connection == connection ? remove(entry) : std::next(entry);
   }
 }
 
 void ListingCursors::clear() {
-  places_.clear();
+  entriesByKey_.clear();
   entries_.clear();
+  size_ = 0;
 }
 
 std::shared_ptr<const ListingFences> ListingFenceCache::find(const ListingScope& scope) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <list>
@@ -29,11 +30,23 @@ struct ListingPoint {
   std::int64_t age = INT64_MIN;
   std::string nameKey;
   std::uint64_t id = 0;
+  friend bool operator==(const ListingPoint&, const ListingPoint&) = default;
 };
 
-/// Where pages ended, the most recently used ones. Not thread-safe.
+/// Where pages ended, the most recently used ones.
+///
+/// Nothing tells the listings of a key apart, and where they stand may differ: their first pages
+/// were read at different times. So each of a key's points stays until somebody goes on, and who
+/// goes on is given the earliest of them all: what is listed twice does no harm, what is left out
+/// is missed. Points of listings that nobody goes on with make way after a minute.
+///
+/// Not thread-safe. Constant time.
 class ListingCursors {
  public:
+  using TimePoint = std::chrono::steady_clock::time_point;
+  static constexpr std::chrono::minutes kPatience{1};
+  static constexpr std::size_t kMaximumPerKey = 32;
+
   explicit ListingCursors(std::size_t capacity) : capacity_(capacity) {}
 
   struct Key {
@@ -43,20 +56,36 @@ class ListingCursors {
     friend bool operator==(const Key&, const Key&) = default;
   };
 
-  [[nodiscard]] std::optional<ListingPoint> find(const Key& key);
-  void store(const Key& key, ListingPoint point);
+  /// Where the listing goes on; one point fewer is kept for the others.
+  [[nodiscard]] std::optional<ListingPoint> take(const Key& key);
+  void store(const Key& key, ListingPoint point, TimePoint now);
   void removeConnection(std::uint64_t connection);
   void clear();
-  [[nodiscard]] std::size_t size() const { return entries_.size(); }
+  /// How many points there are.
+  [[nodiscard]] std::size_t size() const { return size_; }
 
  private:
   struct Hash {
     std::size_t operator()(const Key& key) const;
   };
-  using Entries = std::list<std::pair<Key, ListingPoint>>;
+  struct Place {
+    ListingPoint point;
+    TimePoint stored;
+  };
+  struct Entry {
+    Key key;
+    std::vector<Place> places;  ///< never empty
+    bool isTaken = false;       ///< the one place was given out, and stays for who asks again
+  };
+  using Entries = std::list<Entry>;
+  Entry& entryFor(const Key& key);
+  void removeLatest(Entry& entry);
+  Entries::iterator remove(Entries::iterator entry);
+
   const std::size_t capacity_;
+  std::size_t size_ = 0;
   Entries entries_;  // the most recently used first
-  std::unordered_map<Key, Entries::iterator, Hash> places_;
+  std::unordered_map<Key, Entries::iterator, Hash> entriesByKey_;
 };
 
 /// Every 200th position of a listing, for those who come without a cursor. Built once, immutable.

@@ -7,28 +7,71 @@ namespace {
 
 ListingPoint pointAt(const std::string& key) { return {0, key, 0}; }
 
+constexpr ListingScope kByName{5000, ListingOrder::Name};
+constexpr ListingCursors::TimePoint kStart{};
+
+std::string taken(ListingCursors& cursors, const ListingCursors::Key& key) {
+  const auto point = cursors.take(key);
+  return point ? point->nameKey : "nothing";
+}
+
 TEST(ListingCursors, KeepsTheMostRecentlyUsed) {
   ListingCursors cursors(2);
-  const ListingScope scope{5000, ListingOrder::Name};
-  cursors.store({1, scope, 200}, pointAt("a"));
-  cursors.store({1, scope, 400}, pointAt("b"));
-  EXPECT_TRUE(cursors.find({1, scope, 200}));
-  cursors.store({1, scope, 600}, pointAt("c"));
+  cursors.store({1, kByName, 200}, pointAt("a"), kStart);
+  cursors.store({1, kByName, 400}, pointAt("b"), kStart);
+  EXPECT_TRUE(cursors.take({1, kByName, 200}));
+  cursors.store({1, kByName, 600}, pointAt("c"), kStart);
   EXPECT_EQ(cursors.size(), 2U);
-  EXPECT_FALSE(cursors.find({1, scope, 400}));
-  EXPECT_EQ(cursors.find({1, scope, 200})->nameKey, "a");
+  EXPECT_FALSE(cursors.take({1, kByName, 400}));
+  EXPECT_EQ(taken(cursors, {1, kByName, 200}), "a") << "who asks again goes on there again";
 }
 
 TEST(ListingCursors, TellsConnectionsFoldersAndOrdersApart) {
   ListingCursors cursors(10);
-  cursors.store({1, {5000, ListingOrder::Name}, 200}, pointAt("a"));
-  EXPECT_FALSE(cursors.find({2, {5000, ListingOrder::Name}, 200}));
-  EXPECT_FALSE(cursors.find({1, {5001, ListingOrder::Name}, 200}));
-  EXPECT_FALSE(cursors.find({1, {5000, ListingOrder::Date}, 200}));
+  cursors.store({1, {5000, ListingOrder::Name}, 200}, pointAt("a"), kStart);
+  EXPECT_FALSE(cursors.take({2, {5000, ListingOrder::Name}, 200}));
+  EXPECT_FALSE(cursors.take({1, {5001, ListingOrder::Name}, 200}));
+  EXPECT_FALSE(cursors.take({1, {5000, ListingOrder::Date}, 200}));
   cursors.removeConnection(2);
-  EXPECT_TRUE(cursors.find({1, {5000, ListingOrder::Name}, 200}));
+  EXPECT_TRUE(cursors.take({1, {5000, ListingOrder::Name}, 200}));
   cursors.removeConnection(1);
   EXPECT_EQ(cursors.size(), 0U);
+}
+
+TEST(ListingCursors, WhoeverGoesOnFirstLeavesNothingOutForTheOthers) {
+  ListingCursors cursors(10);
+  const ListingCursors::Key key{1, kByName, 200};
+  for (const char* end : {"199", "299", "249"}) cursors.store(key, pointAt(end), kStart);
+  for (int listing = 0; listing < 3; ++listing) EXPECT_EQ(taken(cursors, key), "199");
+  cursors.store(key, pointAt("399"), kStart);
+  EXPECT_EQ(taken(cursors, key), "399") << "all have gone on: a new listing repeats nothing";
+}
+
+TEST(ListingCursors, TheEarlierPointIsTheNewerOneByDate) {
+  ListingCursors cursors(10);
+  const ListingCursors::Key key{1, {5000, ListingOrder::Date}, 200};
+  cursors.store(key, {-50, "a", 0}, kStart);
+  cursors.store(key, {-70, "b", 0}, kStart);
+  EXPECT_EQ(taken(cursors, key), "b");
+}
+
+TEST(ListingCursors, AListingThatNobodyGoesOnWithMakesWay) {
+  ListingCursors cursors(10);
+  const ListingCursors::Key key{1, kByName, 200};
+  cursors.store(key, pointAt("199"), kStart);
+  const auto later = kStart + ListingCursors::kPatience;
+  cursors.store(key, pointAt("299"), later);
+  EXPECT_EQ(cursors.size(), 2U) << "it may come still";
+  cursors.store(key, pointAt("399"), later + std::chrono::seconds(1));
+  EXPECT_EQ(taken(cursors, key), "299");
+}
+
+TEST(ListingCursors, PagesThatNobodyGoesOnFromAreBounded) {
+  ListingCursors cursors(1000);
+  const ListingCursors::Key key{1, kByName, 200};
+  for (int i = 500; i > 0; --i) cursors.store(key, pointAt(std::to_string(100 + i)), kStart);
+  EXPECT_EQ(cursors.size(), ListingCursors::kMaximumPerKey);
+  EXPECT_EQ(taken(cursors, key), "101");
 }
 
 std::shared_ptr<const ListingFences> fencesWith(std::size_t points) {

@@ -142,6 +142,43 @@ TEST_F(ListingTest, AChangeBetweenPagesNeitherRepeatsNorLosesWhatStayed) {
   EXPECT_EQ(seen.count("a new one 0"), 0U);
 }
 
+TEST_F(ListingTest, ListingsUnderWayAtOnceLoseNothingThatStayed) {
+  for (const bool isOlderFirst : {true, false}) {
+    fill(1000);
+    struct Progress {
+      std::uint64_t offset = 0;
+      std::set<std::string> seen;
+    };
+    const auto goOn = [&](Progress& progress) {
+      const ListingPage current = page(ListingOrder::Name, progress.offset, 100);
+      for (const ItemRow& row : current.rows) progress.seen.insert(row.name);
+      progress.offset = current.nextOffset;
+      return current.rows;
+    };
+    Progress older;
+    Progress newer;
+    const auto first = goOn(older);
+    inTransaction([&](WriteTransaction& transaction) {
+      for (const ItemRow& row : first) transaction.remove(row);
+    });
+    goOn(newer);
+    Progress& leading = isOlderFirst ? older : newer;
+    Progress& following = isOlderFirst ? newer : older;
+    while (leading.offset != 0 || following.offset != 0) {
+      if (leading.offset != 0) goOn(leading);
+      if (following.offset != 0) goOn(following);
+    }
+    for (int i = 100; i < 1000; ++i) {
+      const std::string name = "item " + std::to_string(i);
+      EXPECT_TRUE(older.seen.contains(name)) << name;
+      EXPECT_TRUE(newer.seen.contains(name)) << name;
+    }
+    inTransaction([&](WriteTransaction& transaction) {
+      for (const ItemRow& row : page(ListingOrder::Name, 0, 1000).rows) transaction.remove(row);
+    });
+  }
+}
+
 TEST_F(ListingTest, APageThatWasReadAheadShowsWhatChangedSince) {
   fill(1000);
   // From the second page on, the next one is read ahead.

@@ -5,8 +5,10 @@
 
 namespace yomber {
 
-std::shared_ptr<PagesAhead::Entry> PagesAhead::State::remove(const Key& key) {
-  const auto place = std::ranges::find_if(entries, [&](const auto& e) { return e->key == key; });
+std::shared_ptr<PagesAhead::Entry> PagesAhead::State::remove(const Key& key,
+                                                             const ListingPoint& after) {
+  const auto place = std::ranges::find_if(
+      entries, [&](const auto& e) { return e->key == key && e->after == after; });
   if (place == entries.end()) return nullptr;
   auto entry = std::move(*place);
   entries.erase(place);
@@ -26,15 +28,16 @@ void PagesAhead::State::run(const std::shared_ptr<Entry>& entry, const Read& rea
   done.notifyAll();
 }
 
-std::function<void()> PagesAhead::plan(const Key& key, std::uint32_t limit, std::uint64_t rank,
-                                       Read read) {
+std::function<void()> PagesAhead::plan(const Key& key, const ListingPoint& after,
+                                       std::uint32_t limit, std::uint64_t rank, Read read) {
   auto entry = std::make_shared<Entry>();
   entry->key = key;
+  entry->after = after;
   entry->limit = limit;
   entry->rank = rank;
   {
     LockGuard guard(state_->mutex);
-    if (const auto older = state_->remove(key)) older->stage = Entry::Stage::Abandoned;
+    if (const auto older = state_->remove(key, after)) older->stage = Entry::Stage::Abandoned;
     if (state_->entries.size() >= state_->capacity) {
       state_->entries.front()->stage = Entry::Stage::Abandoned;
       state_->entries.pop_front();
@@ -44,10 +47,10 @@ std::function<void()> PagesAhead::plan(const Key& key, std::uint32_t limit, std:
   return [state = state_, entry, read = std::move(read)] { state->run(entry, read); };
 }
 
-std::optional<PagesAhead::Page> PagesAhead::take(const Key& key, std::uint32_t limit,
-                                                 std::uint64_t rank) {
+std::optional<PagesAhead::Page> PagesAhead::take(const Key& key, const ListingPoint& after,
+                                                 std::uint32_t limit, std::uint64_t rank) {
   LockGuard guard(state_->mutex);
-  const auto entry = state_->remove(key);
+  const auto entry = state_->remove(key, after);
   if (entry == nullptr) return std::nullopt;
   // One that has not begun is read as quickly by whoever asks.
   if (entry->stage == Entry::Stage::Planned || entry->limit != limit || entry->rank != rank) {

@@ -32,19 +32,21 @@ class PagesAhead {
 
   explicit PagesAhead(std::size_t capacity) : state_(std::make_shared<State>(capacity)) {}
 
-  /// Answers what reads the page of `limit` rows, once, on whatever thread calls it. `rank` is the
-  /// database's last rank.
-  [[nodiscard]] std::function<void()> plan(const Key& key, std::uint32_t limit, std::uint64_t rank,
-                                           Read read);
+  /// Answers what reads the page of `limit` rows right after a point, once, on whatever thread
+  /// calls it. `rank` is the database's last rank.
+  [[nodiscard]] std::function<void()> plan(const Key& key, const ListingPoint& after,
+                                           std::uint32_t limit, std::uint64_t rank, Read read);
   /// The page, when it was read and `rank` is still the last; waits for one that is just being
   /// read. Nothing otherwise. A page is taken once.
-  [[nodiscard]] std::optional<Page> take(const Key& key, std::uint32_t limit, std::uint64_t rank);
+  [[nodiscard]] std::optional<Page> take(const Key& key, const ListingPoint& after,
+                                         std::uint32_t limit, std::uint64_t rank);
   void removeConnection(std::uint64_t connection);
 
  private:
   struct Entry {
     enum class Stage : std::uint8_t { Planned, Reading, Done, Abandoned };
     Key key;
+    ListingPoint after;  ///< listings of one key may stand at different points
     std::uint32_t limit = 0;
     std::uint64_t rank = 0;
     Stage stage = Stage::Planned;
@@ -53,7 +55,7 @@ class PagesAhead {
   struct State {
     explicit State(std::size_t maximum) : capacity(maximum) {}
     void run(const std::shared_ptr<Entry>& entry, const Read& read);
-    std::shared_ptr<Entry> remove(const Key& key) REQUIRES(mutex);
+    std::shared_ptr<Entry> remove(const Key& key, const ListingPoint& after) REQUIRES(mutex);
 
     const std::size_t capacity;
     Mutex mutex;

@@ -183,21 +183,22 @@ void Listing::State::forgetOtherDatabase() {
 
 std::shared_ptr<const ListingFences> Listing::State::fencesOf(Connection& reader,
                                                               const ListingScope& scope) {
+  std::uint64_t building = 0;
   {
     LockGuard guard(mutex_);
     if (auto fences = fences_.find(scope)) return fences;
-    fences_.beginBuilding(scope);
+    building = fences_.beginBuilding(scope);
   }
   std::shared_ptr<const ListingFences> fences;
   try {
     fences = readFences(reader, scope);
   } catch (...) {
     LockGuard guard(mutex_);
-    fences_.store(scope, nullptr);
+    fences_.store(building, nullptr);
     throw;
   }
   LockGuard guard(mutex_);
-  fences_.store(scope, fences);
+  fences_.store(building, fences);
   return fences;
 }
 

@@ -105,17 +105,18 @@ std::shared_ptr<const ListingFences> ListingFenceCache::find(const ListingScope&
   return entries_.front().fences;
 }
 
-void ListingFenceCache::beginBuilding(const ListingScope& scope) {
-  building_.push_back({scope, false});
+std::uint64_t ListingFenceCache::beginBuilding(const ListingScope& scope) {
+  building_.push_back({++lastNumber_, scope, false});
+  return lastNumber_;
 }
 
-void ListingFenceCache::store(const ListingScope& scope,
-                              std::shared_ptr<const ListingFences> fences) {
-  const auto building = std::find_if(building_.begin(), building_.end(),
-                                     [&](const Building& b) { return b.scope == scope; });
-  if (building == building_.end()) return;
-  const bool isStale = building->isStale;
-  building_.erase(building);
+void ListingFenceCache::store(std::uint64_t building, std::shared_ptr<const ListingFences> fences) {
+  const auto place = std::find_if(building_.begin(), building_.end(),
+                                  [&](const Building& b) { return b.number == building; });
+  if (place == building_.end()) return;
+  const ListingScope scope = place->scope;
+  const bool isStale = place->isStale;
+  building_.erase(place);
   if (isStale || !fences) return;
   std::erase_if(entries_, [&](const Entry& e) { return e.scope == scope; });
   entries_.push_front({scope, std::move(fences)});

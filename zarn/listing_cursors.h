@@ -101,10 +101,10 @@ class ListingFenceCache {
       : maximumListings_(listings), maximumPoints_(points) {}
 
   [[nodiscard]] std::shared_ptr<const ListingFences> find(const ListingScope& scope);
-  /// Announces that fences are being built: `store` keeps them only when nothing was invalidated
-  /// meanwhile.
-  void beginBuilding(const ListingScope& scope);
-  void store(const ListingScope& scope, std::shared_ptr<const ListingFences> fences);
+  /// Announces that fences are being built, and answers the number that `store` takes: it keeps
+  /// them only when nothing was invalidated meanwhile. Several may build the same ones.
+  [[nodiscard]] std::uint64_t beginBuilding(const ListingScope& scope);
+  void store(std::uint64_t building, std::shared_ptr<const ListingFences> fences);
   void invalidateFolder(std::uint64_t folder);
   void clear();
 
@@ -114,6 +114,7 @@ class ListingFenceCache {
     std::shared_ptr<const ListingFences> fences;
   };
   struct Building {
+    std::uint64_t number = 0;
     ListingScope scope;
     bool isStale = false;
   };
@@ -121,6 +122,7 @@ class ListingFenceCache {
   const std::size_t maximumPoints_;
   std::list<Entry> entries_;  // the most recently used first
   std::list<Building> building_;
+  std::uint64_t lastNumber_ = 0;
 };
 
 }  // namespace yomber

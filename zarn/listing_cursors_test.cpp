@@ -83,30 +83,40 @@ std::shared_ptr<const ListingFences> fencesWith(std::size_t points) {
 TEST(ListingFenceCache, ForgetsAFolderThatChangedAlsoWhileItWasRead) {
   ListingFenceCache cache(10, 1000);
   const ListingScope scope{5000, ListingOrder::Date};
-  cache.beginBuilding(scope);
-  cache.store(scope, fencesWith(3));
+  cache.store(cache.beginBuilding(scope), fencesWith(3));
   EXPECT_TRUE(cache.find(scope));
   cache.invalidateFolder(5001);
   EXPECT_TRUE(cache.find(scope));
   cache.invalidateFolder(5000);
   EXPECT_FALSE(cache.find(scope));
-  cache.beginBuilding(scope);
+  const std::uint64_t building = cache.beginBuilding(scope);
   cache.invalidateFolder(5000);
-  cache.store(scope, fencesWith(3));
+  cache.store(building, fencesWith(3));
   EXPECT_FALSE(cache.find(scope));
+}
+
+TEST(ListingFenceCache, OfTwoWhoBuildTheSameEachAnswersForWhatItRead) {
+  ListingFenceCache cache(10, 1000);
+  const ListingScope scope{5000, ListingOrder::Name};
+  const std::uint64_t before = cache.beginBuilding(scope);
+  cache.invalidateFolder(5000);
+  const std::uint64_t after = cache.beginBuilding(scope);
+  cache.store(after, fencesWith(7));
+  cache.store(before, fencesWith(3));
+  const auto fences = cache.find(scope);
+  ASSERT_TRUE(fences);
+  EXPECT_EQ(fences->points.size(), 7U);
 }
 
 TEST(ListingFenceCache, IsBoundedByListingsAndPoints) {
   ListingFenceCache cache(2, 100);
   for (std::uint64_t folder = 1; folder <= 3; ++folder) {
     const ListingScope scope{folder, ListingOrder::Name};
-    cache.beginBuilding(scope);
-    cache.store(scope, fencesWith(10));
+    cache.store(cache.beginBuilding(scope), fencesWith(10));
   }
   EXPECT_FALSE(cache.find({1, ListingOrder::Name}));
   EXPECT_TRUE(cache.find({3, ListingOrder::Name}));
-  cache.beginBuilding({9, ListingOrder::Name});
-  cache.store({9, ListingOrder::Name}, fencesWith(95));
+  cache.store(cache.beginBuilding({9, ListingOrder::Name}), fencesWith(95));
   EXPECT_TRUE(cache.find({9, ListingOrder::Name}));
   EXPECT_FALSE(cache.find({3, ListingOrder::Name}));
 }

@@ -120,6 +120,13 @@ TEST_F(Browse, AnUnknownItemIsSaidToBeUnknown) {
   EXPECT_EQ(drive_.yomber({"ls", "i:424242"}).exitCode, 66);
 }
 
+TEST_F(Browse, WatchingAFolderThatIsNotThereEndsAndSaysSo) {
+  drive_.up();
+  const ProcessResult watch = drive_.yomber({"watch", "i:424242"});
+  EXPECT_EQ(watch.exitCode, 66) << watch.output << watch.errors;
+  EXPECT_NE(watch.errors.find("yomber: "), std::string::npos) << watch.errors;
+}
+
 TEST_F(Browse, LocationsOutsideTheDriveHaveNoItem) {
   drive_.up();
   EXPECT_NE(drive_.yomber({"id", "../../../../etc/passwd"}).exitCode, 0);

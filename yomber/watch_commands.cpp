@@ -71,6 +71,10 @@ class WatcherServer final : public protocol::Watcher::Server {
     watch_->printer.resumed();
     return kj::READY_NOW;
   }
+  kj::Promise<void> didEnd(DidEndContext context) override {
+    watch_->finish(ipc::decodeError(context.getParams().getError()));
+    return kj::READY_NOW;
+  }
 
  private:
   static std::vector<ItemFields> decoded(capnp::List<protocol::Item>::Reader items) {
@@ -98,7 +102,8 @@ NSErrorRef startWatch(const ipc::Remote<protocol::Control>& control,
       });
 }
 
-/// Watches until the host is lost or the user interrupts; the signal's default action ends us.
+/// Watches until the folder or the host is gone, or the user interrupts; the signal's default
+/// action ends us.
 void watchContainer(CommandContext& context, const NSFileProviderItemIdentifier& container,
                     ChangePrinter::Options options) {
   DriveClient client(context.paths());

@@ -139,8 +139,8 @@ TEST_F(Browse, SignedOutNothingIsListedAndSigningInGoesOn) {
   const std::string folder = drive_.json({"id", "folder"}).at(0)["id"];
   ASSERT_EQ(drive_.yomber({"account", "sign-out"}).exitCode, 0);
   const std::vector<std::vector<std::string>> commands{
-      {"ls"},           {"ls", "folder"}, {"ls", folder},          {"stat", "kept"},
-      {"stat", folder}, {"id", "kept"},   {"ls", "no such folder"}};
+      {"ls"},           {"ls", "folder"}, {"ls", folder},           {"stat", "kept"},
+      {"stat", folder}, {"id", "kept"},   {"ls", "no such folder"}, {"working-set"}};
   for (const auto& command : commands) {
     const ProcessResult refused = drive_.yomber(command);
     EXPECT_EQ(refused.exitCode, 77) << command.back() << refused.output << refused.errors;

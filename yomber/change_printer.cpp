@@ -66,13 +66,16 @@ void ChangePrinter::deleted(const std::vector<std::string>& identifiers) {
   out_ << std::flush;
 }
 
-void ChangePrinter::paused(const NSErrorRef& error) {
+bool ChangePrinter::paused(const NSErrorRef& error) {
+  // A listing fails, and is asked for again by whoever wants it.
+  if (options_.once) return true;
   if (options_.json) {
     out_ << nlohmann::ordered_json{{"event", "paused"}, {"error", errorJson(error)}}.dump()
          << std::endl;
   } else {
     notes_ << "waiting: " << failureText(error) << std::endl;
   }
+  return false;
 }
 
 void ChangePrinter::resumed() {

@@ -33,7 +33,8 @@ class ChangePrinter {
   [[nodiscard]] bool listed(const std::vector<ItemFields>& items, bool last);
   void updated(const std::vector<ItemFields>& items);
   void deleted(const std::vector<std::string>& identifiers);
-  void paused(const NSErrorRef& error);
+  /// Changes cannot be seen at the moment. True when nobody is to wait for them.
+  [[nodiscard]] bool paused(const NSErrorRef& error);
   void resumed();
 
  private:

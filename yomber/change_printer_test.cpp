@@ -50,6 +50,15 @@ TEST_F(ChangePrinterTest, AWatchSaysThatAnItemChangedWhileItWasListed) {
             "present  draft\nchanged  final\nadded    new\nchanged  last\nremoved  last\n");
 }
 
+TEST_F(ChangePrinterTest, AWatchWaitsWhileNothingCanBeSeenAndAListingDoesNot) {
+  const NSErrorRef lost = NSError::errorWithDomain(NSCocoaErrorDomain, NSXPCConnectionInterrupted,
+                                                   {{NSLocalizedDescriptionKey, "it is gone"}});
+  EXPECT_FALSE(printer({}).paused(lost));
+  EXPECT_EQ(notes.str(), "waiting: it is gone\n");
+  EXPECT_TRUE(printer({.listFirst = true, .once = true}).paused(lost));
+  EXPECT_EQ(notes.str(), "waiting: it is gone\n") << "the command says it";
+}
+
 TEST_F(ChangePrinterTest, AWatchThatListsNothingSaysHowManyThereAre) {
   ChangePrinter watch = printer({});
   EXPECT_FALSE(watch.listed({item("d:5", "x"), item("d:6", "y")}, false));

@@ -1,4 +1,5 @@
 #include <iostream>
+#include <utility>
 
 #include "platform/fileprovider/constants.h"
 #include "platform/fileprovider/item_codec.h"
@@ -20,9 +21,10 @@ class RunningWatch {
   explicit RunningWatch(const ChangePrinter::Options& options)
       : printer(std::cout, std::cerr, options) {}
 
+  /// The first time counts.
   void finish(NSErrorRef error) {
     LockGuard guard(mutex_);
-    isFinished_ = true;
+    if (std::exchange(isFinished_, true)) return;
     error_ = std::move(error);
     ended_.notifyAll();
   }
@@ -64,7 +66,8 @@ class WatcherServer final : public protocol::Watcher::Server {
     return kj::READY_NOW;
   }
   kj::Promise<void> didPause(DidPauseContext context) override {
-    watch_->printer.paused(ipc::decodeError(context.getParams().getError()));
+    const NSErrorRef error = ipc::decodeError(context.getParams().getError());
+    if (watch_->printer.paused(error)) watch_->finish(error);
     return kj::READY_NOW;
   }
   kj::Promise<void> didResume(DidResumeContext) override {

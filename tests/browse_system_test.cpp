@@ -120,6 +120,32 @@ TEST_F(Browse, AnUnknownItemIsSaidToBeUnknown) {
   EXPECT_EQ(drive_.yomber({"ls", "i:424242"}).exitCode, 66);
 }
 
+TEST_F(Browse, WhatIsNoUtf8InAnErrorOrATagIsPrintedAllTheSame) {
+  drive_.write("tagged");
+  ASSERT_EQ(setxattr((drive_.root() + "/tagged").c_str(), "user.xdg.tags", "\xff", 1, 0), 0);
+  drive_.up();
+  const ProcessResult missing = drive_.yomber({"--json", "stat", "bad\xff"});
+  EXPECT_EQ(missing.exitCode, 66) << missing.errors;
+  EXPECT_TRUE(nlohmann::json::parse(missing.errors)["error"].contains("message"));
+  EXPECT_EQ(drive_.json({"stat", "tagged"}).at(0)["tags"].size(), 1U);
+  const ProcessResult shown = drive_.yomber({"stat", "tagged"});
+  EXPECT_EQ(shown.exitCode, 0) << shown.errors;
+  EXPECT_NE(shown.output.find("tags"), std::string::npos) << shown.output;
+}
+
+TEST_F(Browse, ATerminalActsOnNothingThatAFailureCites) {
+  drive_.up();
+  const std::string odd = "\x1b[31mx";
+  // No such item, and an argument too many.
+  const std::vector<std::vector<std::string>> commands{{"stat", odd}, {"stat", "/", odd}};
+  for (const auto& command : commands) {
+    const ProcessResult refused = drive_.yomber(command);
+    EXPECT_NE(refused.exitCode, 0);
+    EXPECT_EQ(refused.errors.find('\x1b'), std::string::npos);
+    EXPECT_NE(refused.errors.find("\\x1b[31mx"), std::string::npos) << refused.errors;
+  }
+}
+
 TEST_F(Browse, WatchingAFolderThatIsNotThereEndsAndSaysSo) {
   drive_.up();
   const ProcessResult watch = drive_.yomber({"watch", "i:424242"});

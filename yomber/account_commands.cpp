@@ -7,6 +7,7 @@
 #include "platform/ipc/error_codec.h"
 #include "yomber/command.h"
 #include "yomber/drive_client.h"
+#include "yomber/item_output.h"
 
 namespace yomber {
 
@@ -52,9 +53,9 @@ void showAccount(CommandContext& context, DriveClient& client) {
   if (context.json) {
     nlohmann::ordered_json json{{"account", nullptr}};
     if (name) json["account"] = *name;
-    std::cout << json.dump() << std::endl;
+    std::cout << jsonLine(json) << std::endl;
   } else {
-    std::cout << (name ? *name : "Nobody is signed in.") << std::endl;
+    std::cout << (name ? printableName(*name) : "Nobody is signed in.") << std::endl;
   }
   if (!name) context.exitCode = ExitCode::NotSignedIn;
 }

@@ -70,17 +70,16 @@ bool ChangePrinter::paused(const NSErrorRef& error) {
   // A listing fails, and is asked for again by whoever wants it.
   if (options_.once) return true;
   if (options_.json) {
-    out_ << nlohmann::ordered_json{{"event", "paused"}, {"error", errorJson(error)}}.dump()
-         << std::endl;
+    out_ << jsonLine({{"event", "paused"}, {"error", errorJson(error)}}) << std::endl;
   } else {
-    notes_ << "waiting: " << failureText(error) << std::endl;
+    notes_ << "waiting: " << printableName(failureText(error)) << std::endl;
   }
   return false;
 }
 
 void ChangePrinter::resumed() {
   if (options_.json) {
-    out_ << nlohmann::ordered_json{{"event", "resumed"}}.dump() << std::endl;
+    out_ << jsonLine({{"event", "resumed"}}) << std::endl;
   } else {
     notes_ << "watching again" << std::endl;
   }
@@ -88,8 +87,7 @@ void ChangePrinter::resumed() {
 
 void ChangePrinter::printItem(const char* event, const ItemFields& item) {
   if (options_.json) {
-    const nlohmann::ordered_json line{{"event", event}, {"item", itemJson(item)}};
-    out_ << line.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace) << "\n";
+    out_ << jsonLine({{"event", event}, {"item", itemJson(item)}}) << "\n";
   } else {
     std::string head = event;
     head.resize(kEventWidth, ' ');
@@ -99,7 +97,7 @@ void ChangePrinter::printItem(const char* event, const ItemFields& item) {
 
 void ChangePrinter::printRemoval(const std::string& identifier, const std::string& name) {
   if (options_.json) {
-    out_ << nlohmann::ordered_json{{"event", "removed"}, {"id", identifier}}.dump() << "\n";
+    out_ << jsonLine({{"event", "removed"}, {"id", identifier}}) << "\n";
   } else {
     out_ << "removed  " << printableName(name) << "\n";
   }

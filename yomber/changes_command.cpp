@@ -75,8 +75,7 @@ std::optional<std::string> bytesOf(const std::string& text) {
 void printBatch(bool json, const Batch& batch) {
   for (const ItemFields& item : batch.updated) {
     if (json) {
-      std::cout << nlohmann::ordered_json{{"event", "changed"}, {"item", itemJson(item)}}.dump(
-          -1, ' ', false, nlohmann::json::error_handler_t::replace);
+      std::cout << jsonLine({{"event", "changed"}, {"item", itemJson(item)}});
     } else {
       std::cout << "changed  " << itemLine(item, OutputForm::Long);
     }
@@ -84,7 +83,7 @@ void printBatch(bool json, const Batch& batch) {
   }
   for (const std::string& identifier : batch.deleted) {
     if (json) {
-      std::cout << nlohmann::ordered_json{{"event", "removed"}, {"id", identifier}}.dump();
+      std::cout << jsonLine({{"event", "removed"}, {"id", identifier}});
     } else {
       std::cout << "removed  " << identifier;
     }

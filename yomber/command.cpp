@@ -15,7 +15,7 @@ DrivePaths CommandContext::paths() const {
 
 void CommandContext::print(const nlohmann::ordered_json& answer, const std::string& text) const {
   if (json) {
-    std::cout << answer.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+    std::cout << jsonLine(answer);
   } else {
     std::cout << text;
   }
@@ -25,10 +25,10 @@ void CommandContext::print(const nlohmann::ordered_json& answer, const std::stri
 void CommandContext::fail(const NSErrorRef& error) {
   exitCode = exitCodeFor(error);
   if (json) {
-    std::cerr << nlohmann::ordered_json{{"error", errorJson(error)}}.dump() << std::endl;
+    std::cerr << jsonLine({{"error", errorJson(error)}}) << std::endl;
     return;
   }
-  std::cerr << "yomber: " << failureText(error);
+  std::cerr << "yomber: " << printableName(failureText(error));
   if (exitCode == ExitCode::NotSignedIn)
     std::cerr << " (sign in with 'yomber account sign-in NAME')";
   std::cerr << std::endl;
@@ -37,9 +37,9 @@ void CommandContext::fail(const NSErrorRef& error) {
 void CommandContext::fail(ExitCode code, const std::string& message) {
   exitCode = code;
   if (json) {
-    std::cerr << nlohmann::ordered_json{{"error", {{"message", message}}}}.dump() << std::endl;
+    std::cerr << jsonLine({{"error", {{"message", message}}}}) << std::endl;
   } else {
-    std::cerr << "yomber: " << message << std::endl;
+    std::cerr << "yomber: " << printableName(message) << std::endl;
   }
 }
 

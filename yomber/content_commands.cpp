@@ -54,10 +54,11 @@ struct ContentRun {
     if (context.json) {
       nlohmann::ordered_json line{{"location", path}, {"outcome", outcome}};
       line.update(more);
-      std::cout << line.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+      std::cout << jsonLine(line);
     } else {
       std::cout << outcome << "  " << printableName(path);
-      if (more.contains("reason")) std::cout << ": " << more["reason"].get<std::string>();
+      if (more.contains("reason"))
+        std::cout << ": " << printableName(more["reason"].get<std::string>());
     }
     std::cout << "\n" << std::flush;
   }

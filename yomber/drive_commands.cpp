@@ -92,9 +92,7 @@ void runUp(CommandContext& context, const UpOptions& options) {
     return;
   }
   if (context.json) {
-    std::cout
-        << nlohmann::ordered_json{{"home", paths.home}, {"up", true}, {"was_up", already}}.dump()
-        << std::endl;
+    std::cout << jsonLine({{"home", paths.home}, {"up", true}, {"was_up", already}}) << std::endl;
   } else {
     std::cout << (already ? "The drive is up already: " : "The drive is up: ") << paths.home
               << std::endl;
@@ -109,9 +107,7 @@ void runDown(CommandContext& context) {
   bool wasUp = false;
   if (NSErrorRef error = endSupervision(supervisorLock(paths), wasUp)) return context.fail(error);
   if (context.json) {
-    std::cout
-        << nlohmann::ordered_json{{"home", paths.home}, {"up", false}, {"was_up", wasUp}}.dump()
-        << std::endl;
+    std::cout << jsonLine({{"home", paths.home}, {"up", false}, {"was_up", wasUp}}) << std::endl;
   } else {
     std::cout << (wasUp ? "The drive is down." : "The drive was not up.") << std::endl;
   }
@@ -136,8 +132,7 @@ void runStatus(CommandContext& context, bool once) {
   DriveStatus status = readDriveStatus(paths, Supervisor::runningPid(supervisorLock(paths)));
   if (!status.daemon || !status.host) context.exitCode = ExitCode::Unavailable;
   if (context.json) {
-    std::cout << statusJson(status).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace)
-              << std::endl;
+    std::cout << jsonLine(statusJson(status)) << std::endl;
   } else if (once || isatty(STDOUT_FILENO) == 0) {
     std::cout << statusText(status) << std::flush;
   } else {

@@ -95,7 +95,7 @@ void describeHost(std::ostream& out, const DriveStatus::Host& host) {
     out << "\n";
   } else {
     out << "extension      not running";
-    if (host.lastFailure) out << ": " << failureText(host.lastFailure);
+    if (host.lastFailure) out << ": " << printableName(failureText(host.lastFailure));
     out << "\n";
   }
 }

@@ -24,7 +24,7 @@ void runStat(CommandContext& context, const std::string& argument) {
   const auto json = itemJson(item);
   for (const auto& [key, value] : json.items()) {
     std::cout << key << std::string(key.size() < 14 ? 14 - key.size() : 1, ' ')
-              << (value.is_string() ? printableName(value.get<std::string>()) : value.dump())
+              << printableName(value.is_string() ? value.get<std::string>() : jsonLine(value))
               << "\n";
   }
   std::cout << std::flush;

@@ -139,6 +139,10 @@ nlohmann::ordered_json errorJson(const NSErrorRef& error) {
   return json;
 }
 
+std::string jsonLine(const nlohmann::ordered_json& json) {
+  return json.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+}
+
 std::string itemLine(const ItemFields& item, OutputForm form) {
   switch (form) {
     case OutputForm::Short:
@@ -146,7 +150,7 @@ std::string itemLine(const ItemFields& item, OutputForm form) {
     case OutputForm::Long:
       return longLine(item);
     case OutputForm::Json:
-      return itemJson(item).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+      return jsonLine(itemJson(item));
   }
   return {};
 }

@@ -22,7 +22,10 @@ enum class OutputForm { Short, Long, Json };
 [[nodiscard]] nlohmann::ordered_json itemJson(const ItemFields& item);
 [[nodiscard]] nlohmann::ordered_json errorJson(const NSErrorRef& error);
 
-/// A name fit for a terminal.
+/// JSON on one line, without the line's end; bytes that are not UTF-8 are replaced.
+[[nodiscard]] std::string jsonLine(const nlohmann::ordered_json& json);
+
+/// A name, or a text with names in it, fit for a terminal.
 [[nodiscard]] std::string printableName(const std::string& name);
 
 /// "4.2 KB": three significant digits at most, powers of 1000.

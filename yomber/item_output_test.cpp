@@ -70,6 +70,11 @@ TEST(ItemLine, InJsonLosesNoByteOfANameThatIsNoUtf8) {
   EXPECT_EQ(json["name_base64"], "Yf8=");
 }
 
+TEST(JsonLine, ReplacesWhatIsNoUtf8) {
+  const std::string line = jsonLine({{"message", "no \xff here"}});
+  EXPECT_EQ(nlohmann::json::parse(line)["message"], "no \xef\xbf\xbd here");
+}
+
 TEST(ItemJson, LeavesOutWhatIsNotSet) {
   EXPECT_FALSE(itemJson(document("a")).contains("last_used"));
   ItemFields used = document("a");

@@ -1,9 +1,28 @@
 #include <clocale>
 #include <csignal>
+#include <iostream>
+#include <sstream>
+#include <string>
 
 #include <CLI/CLI.hpp>
 
 #include "yomber/command.h"
+#include "yomber/item_output.h"
+
+namespace {
+
+/// Prints the help that was asked for, or what is wrong with the arguments.
+int answerParseError(const CLI::App& app, const CLI::ParseError& error) {
+  std::ostringstream complaint;
+  if (app.exit(error, std::cout, complaint) == 0) return 0;
+  // It cites the arguments.
+  std::istringstream lines(complaint.str());
+  for (std::string line; std::getline(lines, line);)
+    std::cerr << yomber::printableName(line) << "\n";
+  return static_cast<int>(yomber::ExitCode::Usage);
+}
+
+}  // namespace
 
 int main(int argc, char** argv) {
   using namespace yomber;
@@ -41,8 +60,7 @@ int main(int argc, char** argv) {
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& error) {
-    const int answer = app.exit(error);
-    return answer == 0 ? 0 : static_cast<int>(ExitCode::Usage);
+    return answerParseError(app, error);
   }
   return static_cast<int>(context.exitCode);
 }

@@ -127,12 +127,12 @@ class ThumbnailRun {
       Json line{{"id", thumbnail.identifier}, {"name", name}, {"outcome", outcome}};
       if (thumbnail.contentType) line["type"] = *thumbnail.contentType;
       line.update(more);
-      std::cout << line.dump(-1, ' ', false, Json::error_handler_t::replace) << std::endl;
+      std::cout << jsonLine(line) << std::endl;
     } else if (outcome == "none") {
       std::cout << "none  " << printableName(name) << ": it has no thumbnail" << std::endl;
     } else if (outcome == "failed") {
-      std::cout << "failed  " << printableName(name) << ": " << more["reason"].get<std::string>()
-                << std::endl;
+      std::cout << "failed  " << printableName(name) << ": "
+                << printableName(more["reason"].get<std::string>()) << std::endl;
     } else {
       std::cout << "thumbnail  " << printableName(more["path"].get<std::string>()) << std::endl;
     }

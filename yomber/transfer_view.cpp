@@ -83,7 +83,7 @@ std::string transferLine(const Transfer& transfer, std::size_t barWidth) {
   const std::string name = printableName(NSURL(transfer.path).lastPathComponent());
   if (transfer.nextAttempt) {
     line += "waiting  " + name;
-    if (transfer.failure) line += ": " + failureText(transfer.failure);
+    if (transfer.failure) line += ": " + printableName(failureText(transfer.failure));
     return line;
   }
   const double fraction = fractionOf(transfer);

@@ -24,6 +24,15 @@ bool canGoAway(const std::string& container) {
          container != NSFileProviderAllDirectoriesContainerItemIdentifier;
 }
 
+/// Whether the changes say that the item is gone.
+bool isDeleted(const std::string& identifier, const ChangesAnswer& changes) {
+  const auto isItDead = [&](const ItemFields& item) {
+    return item.identifier == identifier && (item.flags & protocol::ITEM_FLAG_DEAD) != 0;
+  };
+  return std::ranges::count(changes.deleted, identifier) > 0 ||
+         std::ranges::any_of(changes.updated, isItDead);
+}
+
 bool isSameAnchor(const NSDataRef& one, const NSDataRef& other) {
   return one != nullptr && one->isEqualToData(other);
 }
@@ -227,10 +236,14 @@ void ContainerWatch::didGetChanges(ChangesAnswer answer) {
   // "More" with nothing and no new anchor would be asked for without end.
   hasMore_ = answer.moreComing && (hasMoved || !isEmpty);
   anchor_ = std::move(answer.anchor);
+  const bool isFolderGone = isDeleted(container_, answer);
   if (stage_ == Stage::Listing) {
     keep(std::move(answer));
   } else {
     tellChanges(std::move(answer.updated), answer.deleted);
+  }
+  if (isFolderGone) {
+    return passFailed(fileProviderErrorForNonExistentItemWithIdentifier(container_));
   }
   advance();
 }

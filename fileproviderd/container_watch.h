@@ -26,7 +26,7 @@ namespace yomber {
 /// for the changes since the anchor that it was given last; one request is in flight, one more is
 /// remembered. It never asks for the current anchor again without listing again. On an expired
 /// anchor, and after any failure, it makes another pass and tells the watcher only what differs
-/// from what it was told before.
+/// from what it was told before. When the folder itself is gone, the watch ends.
 ///
 /// A watcher gets one call after the other. While it has not answered, no changes are asked for:
 /// they wait in the extension, merged and bounded, and expire when there are too many. So nothing

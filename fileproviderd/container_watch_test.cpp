@@ -256,6 +256,37 @@ TEST_F(ContainerWatchTest, AFolderThatIsGoneEndsTheWatch) {
   EXPECT_EQ(container.pagesAsked, pages) << "it goes on after its end";
 }
 
+TEST_F(ContainerWatchTest, AFolderThatIsRemovedEndsTheWatch) {
+  for (const bool tellsAsDead : {false, true}) {
+    container.tellsDeletionsAsDead = tellsAsDead;
+    container.isReallyGone = false;
+    container.put("a");
+    startAndRun();
+    container.isReallyGone = true;
+    container.remove("a");
+    container.remove("i:1");
+    run();
+    EXPECT_THAT(watcher->calls,
+                ElementsAre("delete a", testing::StartsWith("delete "), "end -1005"));
+    EXPECT_TRUE(watch->hasEnded());
+    EXPECT_EQ(container.liveEnumerators(), 0U);
+    watcher = std::make_shared<RecordingWatcher>(executor);
+  }
+}
+
+TEST_F(ContainerWatchTest, AFolderThatIsRemovedWhileItIsListedEndsTheWatch) {
+  bool isFirstPage = true;
+  container.beforeEachPage = [&] {
+    if (!std::exchange(isFirstPage, false)) return;
+    container.isReallyGone = true;
+    container.remove("i:1");
+  };
+  start();
+  run();
+  EXPECT_EQ(watcher->calls.back(), "end -1005");
+  EXPECT_TRUE(watcher->items.empty());
+}
+
 TEST_F(ContainerWatchTest, AFolderThatOnlySeemsGoneIsTriedAgain) {
   startAndRun();
   container.openError = fileProviderErrorForNonExistentItemWithIdentifier("i:1");

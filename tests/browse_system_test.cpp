@@ -120,6 +120,22 @@ TEST_F(Browse, AnUnknownItemIsSaidToBeUnknown) {
   EXPECT_EQ(drive_.yomber({"ls", "i:424242"}).exitCode, 66);
 }
 
+TEST_F(Browse, AWatchEndsWhenItsFolderIsRemoved) {
+  drive_.makeFolder("folder");
+  drive_.write("folder/document");
+  drive_.up();
+  LineProcess watch(drive_.commandLine({"--json", "watch", "--list", "folder"}),
+                    drive_.environment());
+  const auto tells = [&](const std::string& event) {
+    return watch.readUntil(
+        [&](const std::string& line) { return nlohmann::json::parse(line)["event"] == event; });
+  };
+  ASSERT_TRUE(tells("present"));
+  fs::remove_all(drive_.root() + "/folder");
+  EXPECT_TRUE(tells("removed"));
+  EXPECT_EQ(watch.waitForEnd(), 66);
+}
+
 TEST_F(Browse, WhatIsNoUtf8InAnErrorOrATagIsPrintedAllTheSame) {
   drive_.write("tagged");
   ASSERT_EQ(setxattr((drive_.root() + "/tagged").c_str(), "user.xdg.tags", "\xff", 1, 0), 0);

@@ -24,6 +24,9 @@ NSErrorRef otherHomeError(const std::string& home) {
                                        "or use that home"}});
 }
 
+/// What an item is never changes, and its identifier says it.
+bool isFolder(const std::string& identifier) { return identifier.starts_with("i:"); }
+
 /// What zarn calls.
 class SignalReceiver final : public protocol::HostReceiver::Server {
  public:
@@ -78,10 +81,12 @@ void ZarnLink::isGone(const std::string& identifier, std::function<void(bool)> h
       [identifier](Daemon::UrlForItemIdentifierParams::Builder params) {
         params.setIdentifier(wireText(identifier));
       },
-      [handler = std::move(handler)](const NSErrorRef& /*error*/,
-                                     const Daemon::UrlForItemIdentifierResults::Reader* results) {
-        handler(results != nullptr && results->getResult().isError() &&
-                isNoSuchItemError(ipc::decodeError(results->getResult().getError())));
+      [identifier, handler = std::move(handler)](
+          const NSErrorRef& /*error*/, const Daemon::UrlForItemIdentifierResults::Reader* results) {
+        if (results == nullptr) return handler(false);
+        const auto result = results->getResult();
+        handler(result.isError() ? isNoSuchItemError(ipc::decodeError(result.getError()))
+                                 : !isFolder(identifier));
       },
       kShortly);
 }

@@ -33,7 +33,8 @@ class ZarnLink final : public DaemonProbe, public std::enable_shared_from_this<Z
   [[nodiscard]] bool isReachable() const { return state_ == State::Connected; }
 
   void probe(std::function<void(NSErrorRef)> handler) override;
-  /// Whether zarn says that the item does not exist; false also when it cannot be asked.
+  /// Whether zarn says that there is no such folder, be it that the item is something else; false
+  /// also when it cannot be asked.
   void isGone(const std::string& identifier, std::function<void(bool)> handler);
 
  private:

@@ -120,6 +120,16 @@ TEST_F(Browse, AnUnknownItemIsSaidToBeUnknown) {
   EXPECT_EQ(drive_.yomber({"ls", "i:424242"}).exitCode, 66);
 }
 
+TEST_F(Browse, WhatIsNoFolderCannotBeWatched) {
+  drive_.write("document");
+  drive_.up();
+  const std::string identifier = drive_.json({"id", "document"}).at(0)["id"];
+  for (const std::string& item : {std::string("document"), identifier}) {
+    const ProcessResult watch = drive_.yomber({"watch", item});
+    EXPECT_EQ(watch.exitCode, 66) << item << watch.output << watch.errors;
+  }
+}
+
 TEST_F(Browse, AWatchEndsWhenItsFolderIsRemoved) {
   drive_.makeFolder("folder");
   drive_.write("folder/document");

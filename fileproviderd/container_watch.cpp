@@ -120,7 +120,6 @@ void ContainerWatch::beginPass() {
   hasAskedInSettling_ = false;
   anchor_ = nullptr;
   picture_.beginListing();
-  if (enumerator_ != nullptr) return takeAnchor();
   source_.enumerator(container_, [weak = weak_from_this(), epoch = epoch_](
                                      HostedEnumeratorRef enumerator, const NSErrorRef& error) {
     const auto self = weak.lock();
@@ -328,6 +327,8 @@ void ContainerWatch::anchorExpired() {
   const bool wasCalm = stage_ == Stage::Live && clock_.now() - liveSince_ >= limits_.calm;
   log_debug(defaultLog(), "[DEBUG] the anchor of %s expired, listing again", container_.c_str());
   leaveEpoch();
+  // It watches where the folder was when it was opened, which may have moved since.
+  enumerator_.reset();
   if (wasCalm) {
     expiryBackoff_.reset();
     return beginPass();

@@ -92,7 +92,14 @@ void ContainerWatch::signalled() {
 
 void ContainerWatch::wake() {
   if (stage_ == Stage::Live) return signalled();
-  if (stage_ != Stage::Waiting) return;
+  if (stage_ == Stage::Waiting && waitingFor_ != WaitingFor::Calm) tryAgainNow();
+}
+
+void ContainerWatch::accountMayHaveChanged() {
+  if (stage_ == Stage::Waiting && waitingFor_ == WaitingFor::SignIn) tryAgainNow();
+}
+
+void ContainerWatch::tryAgainNow() {
   failureBackoff_.reset();
   beginPass();
 }
@@ -333,7 +340,7 @@ void ContainerWatch::anchorExpired() {
     expiryBackoff_.reset();
     return beginPass();
   }
-  waitForNextPass(expiryBackoff_.next());
+  waitForNextPass(expiryBackoff_.next(), WaitingFor::Calm);
 }
 
 void ContainerWatch::passFailed(const NSErrorRef& error) {
@@ -360,11 +367,14 @@ void ContainerWatch::retryLater(const NSErrorRef& error) {
       watcher.didPause(error, std::move(answered));
     });
   }
-  waitForNextPass(failureBackoff_.next());
+  const bool isSignedOut =
+      error->is(NSFileProviderErrorDomain, NSFileProviderErrorNotAuthenticated);
+  waitForNextPass(failureBackoff_.next(), isSignedOut ? WaitingFor::SignIn : WaitingFor::Recovery);
 }
 
-void ContainerWatch::waitForNextPass(std::chrono::milliseconds delay) {
+void ContainerWatch::waitForNextPass(std::chrono::milliseconds delay, WaitingFor what) {
   stage_ = Stage::Waiting;
+  waitingFor_ = what;
   timer_ = clock_.after(delay, [weak = weak_from_this()] {
     if (const auto self = weak.lock()) self->beginPass();
   });

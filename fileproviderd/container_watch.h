@@ -55,8 +55,10 @@ class ContainerWatch : public std::enable_shared_from_this<ContainerWatch> {
 
   /// The container has changes.
   void signalled();
-  /// What the watch waits for may be there now: it tries again at once.
+  /// zarn is there (again): a watch that failed tries again at once.
   void wake();
+  /// So does one that waits for somebody to sign in, and no other.
+  void accountMayHaveChanged();
   /// The extension is gone, and the enumerator with it.
   void extensionDidEnd(const NSErrorRef& reason);
 
@@ -74,6 +76,11 @@ class ContainerWatch : public std::enable_shared_from_this<ContainerWatch> {
     Waiting,     ///< for the next attempt
     Confirming,  ///< asks whether the folder is really gone
     Ended,
+  };
+  enum class WaitingFor : std::uint8_t {
+    Calm,  ///< the folder changes faster than it can be listed
+    SignIn,
+    Recovery,
   };
   using Drained = std::unordered_map<std::string, std::optional<ItemFields>>;
 
@@ -99,7 +106,8 @@ class ContainerWatch : public std::enable_shared_from_this<ContainerWatch> {
   void anchorExpired();
   void passFailed(const NSErrorRef& error);
   void retryLater(const NSErrorRef& error);
-  void waitForNextPass(std::chrono::milliseconds delay);
+  void waitForNextPass(std::chrono::milliseconds delay, WaitingFor what);
+  void tryAgainNow();
   void end(const NSErrorRef& error);
   void leaveEpoch();
 
@@ -115,6 +123,7 @@ class ContainerWatch : public std::enable_shared_from_this<ContainerWatch> {
   const std::shared_ptr<WatcherOutbox> outbox_;
 
   Stage stage_ = Stage::Waiting;
+  WaitingFor waitingFor_ = WaitingFor::Recovery;
   std::uint64_t epoch_ = 0;  ///< answers to what was asked in an earlier one are dropped
   HostedEnumeratorRef enumerator_;
   NSDataRef anchor_;

@@ -232,9 +232,40 @@ TEST_F(ContainerWatchTest, SigningOutDropsTheEnumeratorAndSigningInResumes) {
   container.items.erase("a");
   container.changesError = nullptr;
   container.openError = nullptr;
-  watch->wake();
+  watch->accountMayHaveChanged();
   run();
   EXPECT_THAT(watcher->calls, ElementsAre("pause -1000", "delete a", "resume"));
+}
+
+TEST_F(ContainerWatchTest, AnAccountsChangeHurriesNobodyWhoWaitsForSomethingElse) {
+  container.openError = kLost;
+  start();
+  run();
+  clock.delays.clear();
+  const auto storm = [this] {
+    for (int i = 0; i < 1000; ++i) {
+      watch->accountMayHaveChanged();
+      run();
+    }
+  };
+  storm();
+  EXPECT_THAT(clock.delays, IsEmpty()) << "it tried again";
+  container.openError = nullptr;
+  pass(10s);
+  ASSERT_TRUE(watch->isLive());
+  // Listed again at once the first time, and with a pause from then on.
+  container.expireAll();
+  container.signalAll();
+  run();
+  container.expireAll();
+  container.signalAll();
+  run();
+  ASSERT_FALSE(watch->isLive());
+  const int passes = container.anchorsAsked;
+  storm();
+  for (int i = 0; i < 1000; ++i) watch->wake();
+  run();
+  EXPECT_EQ(container.anchorsAsked, passes) << "it lists again without pause";
 }
 
 TEST_F(ContainerWatchTest, AFolderThatIsGoneEndsTheWatch) {

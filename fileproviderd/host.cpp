@@ -75,11 +75,11 @@ void Host::wire() {
 void Host::start() { zarn_->start(); }
 
 void Host::didSignal(const std::string& container) {
-  // The root is signalled when the account changes: whoever waits for a sign-in tries again.
+  // The root is signalled when the account changes, and with each of its own changes.
   const bool mayBeSignIn = container == NSFileProviderRootContainerItemIdentifier;
   for (const auto& watch : watches()) {
     if (watch->container() == container) watch->signalled();
-    if (mayBeSignIn && !watch->isLive()) watch->wake();
+    if (mayBeSignIn) watch->accountMayHaveChanged();
   }
 }
 

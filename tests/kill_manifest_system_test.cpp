@@ -12,7 +12,7 @@
 #include <gtest/gtest.h>
 
 #include "platform/foundation/sanitized.h"
-#include "tests/harness/stopped_process.h"
+#include "platform/foundation/stopped_process.h"
 #include "tests/harness/test_drive.h"
 #include "tests/manifest/manifest_check.h"
 

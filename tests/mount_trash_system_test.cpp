@@ -9,9 +9,9 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/foundation/stopped_process.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
-#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 namespace {

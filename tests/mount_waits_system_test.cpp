@@ -24,10 +24,10 @@
 #include <gtest/gtest.h>
 
 #include "platform/foundation/fault_attributes.h"
+#include "platform/foundation/stopped_process.h"
 #include "tests/harness/aside.h"
 #include "tests/harness/file_contents.h"
 #include "tests/harness/mount_fixture.h"
-#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 namespace {

@@ -16,7 +16,7 @@
 #include <sys/xattr.h>
 
 #include "platform/foundation/log_sinks.h"
-#include "tests/harness/stopped_process.h"
+#include "platform/foundation/stopped_process.h"
 #include "tests/harness/watch_process.h"
 
 namespace yomber::testing {

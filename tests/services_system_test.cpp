@@ -25,10 +25,10 @@
 #include "platform/foundation/descriptor_limit.h"
 #include "platform/foundation/log_sinks.h"
 #include "platform/foundation/sanitized.h"
+#include "platform/foundation/stopped_process.h"
 #include "platform/foundation/temporary_directory.h"
 #include "platform/ipc/unix_socket.h"
 #include "tests/harness/service_caller.h"
-#include "tests/harness/stopped_process.h"
 #include "tests/harness/test_drive.h"
 
 namespace yomber::testing {

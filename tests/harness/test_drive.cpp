@@ -16,8 +16,8 @@ extern "C" {
 
 #include <gtest/gtest.h>
 
+#include "platform/foundation/stopped_process.h"
 #include "platform/ostrell/constants.h"
-#include "tests/harness/stopped_process.h"
 
 namespace yomber::testing {
 

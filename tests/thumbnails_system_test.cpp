@@ -11,7 +11,9 @@
 #include <map>
 #include <optional>
 #include <sstream>
+#include <stop_token>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gmock/gmock.h>
@@ -214,8 +216,18 @@ TEST_F(ThumbnailsSystem, AnExtensionThatIsKilledInTheMiddleLosesNothing) {
 }
 
 TEST_F(ThumbnailsSystem, AStoreThatGoesInTheMiddleFailsWhatIsLeftUntilItIsBack) {
+  // Only the first part of the records comes before the store has gone.
+  const std::string gate = outside("gate");
+  drive_.environment()["YOMBER_FAULTS"] = "rozzel.fetch.part=pause-each-until-file:" + gate;
   ASSERT_NO_FATAL_FAILURE(upWithDocuments(600));
-  const auto during = fetch(identifiers_, [&] { std::ofstream(offline()).put('x'); });
+  std::ofstream(gate).put('x');
+  std::jthread opening;
+  const auto during = fetch(identifiers_, [&] {
+    std::ofstream(offline()).put('x');
+    opening = std::jthread([gate](const std::stop_token& isOver) {
+      while (!isOver.stop_requested()) std::ofstream(gate).put('x');
+    });
+  });
   EXPECT_NE(during.error, nullptr);
   EXPECT_GE(during.pictures, 1U);
   EXPECT_GE(during.failures, 1U);

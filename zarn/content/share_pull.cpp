@@ -42,13 +42,6 @@ FileStamp stampAt(const std::string& path) {
 
 }  // namespace
 
-std::string folderBesideShare(const ContentCore& core, const ShareRow& share) {
-  const auto row = core.items->itemByID(share.root);
-  const bool isElsewhere = !row || row->isTrashed() || row->parent == kNoParent;
-  const auto path = isElsewhere ? std::nullopt : core.items->physicalPath(row->parent);
-  return path.value_or(core.items->layout().root());
-}
-
 // --- What changed.
 
 NSErrorRef SharePull::run() {
@@ -93,12 +86,12 @@ NSErrorRef SharePull::run() {
 
 /// One record keeps no other from coming, and comes when it can be read.
 NSErrorRef SharePull::waitFor(const std::vector<std::uint64_t>& unreadable) {
-  if (unreadable.empty()) return nullptr;
-  return core_.database().write([&](WriteTransaction& transaction) {
+  const auto postpone = [&](WriteTransaction& transaction) {
     for (const std::uint64_t id : unreadable)
       postponeWaitingRecord(transaction.connection(), share_.root, id, core_.now());
     return NSErrorRef();
-  });
+  };
+  return unreadable.empty() ? nullptr : core_.database().write(postpone);
 }
 
 /// What the zone has forgotten to tell is found by asking for everything that is known here.
@@ -142,10 +135,9 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
     std::vector<std::uint64_t> unreadable;
     for (std::size_t i = 0; i < found.size(); ++i) {
       const bool isGone = rz_isError(found[i].error, RZErrorUnknownItem);
-      if (rz_isError(found[i].error, RZErrorStoreDamaged)) {
-        unreadable.push_back(ids[begin + i]);
-        continue;
-      }
+      const bool isDamaged = rz_isError(found[i].error, RZErrorStoreDamaged);
+      if (isDamaged) unreadable.push_back(ids[begin + i]);
+      if (isDamaged) continue;
       if (!found[i].record && !isGone) return found[i].error;
       SharedItem item;
       item.id = ids[begin + i];

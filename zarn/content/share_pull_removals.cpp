@@ -60,6 +60,13 @@ LostItems sortLost(const ContentCore& core, std::map<std::uint64_t, ContentRow> 
 
 }  // namespace
 
+std::string folderBesideShare(const ContentCore& core, const ShareRow& share) {
+  const auto row = core.items->itemByID(share.root);
+  const bool isElsewhere = !row || row->isTrashed() || row->parent == kNoParent;
+  const auto path = isElsewhere ? std::nullopt : core.items->physicalPath(row->parent);
+  return path.value_or(core.items->layout().root());
+}
+
 NSErrorRef noteRemovalsBeforeStart(ContentCore& core, const ShareRow& share) {
   std::map<std::uint64_t, ContentRow> lost;
   NSErrorRef error = core.database().read([&](Connection& connection) {

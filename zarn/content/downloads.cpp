@@ -284,7 +284,7 @@ bool isFilled(Settling& settling) {
   }
   settling.before = FileStamp::of(status);
   settling.after = settling.before;
-  settling.isHere = !isUnfilledFault(file.get());
+  settling.isHere = !isFault(file.get());
   bool isDamaged = false;
   return settling.isHere && readFaultRecord(file.get(), isDamaged);
 }

@@ -61,7 +61,7 @@ std::unique_ptr<Eviction> Eviction::begin(const std::string& path, const FileSta
     return nullptr;
   }
   const ChangedFile& opened = result->file_;
-  result->wasFault_ = isUnfilledFault(opened.get());
+  result->wasFault_ = isFault(opened.get());
   if (!result->wasFault_ && FileStamp::of(opened.status()) != expected) {
     storeError(error, refusal("it has changed since it was confirmed in the store"));
     return nullptr;
@@ -150,9 +150,9 @@ FaultCondition conditionOfSmall(int file, const FaultExamination& found) {
 FaultExamination examineFault(int file) {
   FaultExamination result;
   result.stamp = stampOf(file);
+  if (!isFault(file)) return result;
   bool isDamaged = false;
   const auto record = readFaultRecord(file, isDamaged);
-  if ((!record && !isDamaged) || isFilledInThisBoot(file)) return result;
   if (!record) {
     result.condition = FaultCondition::Damaged;
     return result;

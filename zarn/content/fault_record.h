@@ -38,9 +38,4 @@ struct StampedLook {
 };
 [[nodiscard]] StampedLook lookAtStamp(int file);
 
-/// Whether a fault that is open was filled in this boot.
-[[nodiscard]] bool isFilledInThisBoot(int file);
-/// Whether the open file is a fault whose content cannot be read; as isFaultAtPath.
-[[nodiscard]] bool isUnfilledFault(int file);
-
 }  // namespace yomber

@@ -119,11 +119,7 @@ TEST_F(ShareRemovalsTest, ARecordWhoseFolderIsNotKnownIsAskedForLaterUnlessSomeb
 
 TEST_F(ShareRemovalsTest, WhatIsRemovedBeforeItWasLookedAtIsRemovedForAll) {
   shareFolder(editor("bob"));
-  ann->write("Plans/new.txt", kLong);
-  ann->makeFolder("Plans/Folder");
-  ann->write("Plans/Folder/in.txt", "in it");
-  ann->write("Plans/stays.txt", "stays");
-  ann->settle();
+  addToFolder();
   meanwhile("zarn.pull.placed", [&] {
     bob->remove("Plans/new.txt");
     bob->remove("Plans/Folder");

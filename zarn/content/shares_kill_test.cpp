@@ -104,11 +104,7 @@ class ShareUnseenKillTest : public SharesKillTest {
  protected:
   void removeUnseenAndDie(const std::function<void()>& beforeRestart = {}) {
     shareFolder(editor("bob"));
-    ann->write("Plans/new.txt", kLong);
-    ann->makeFolder("Plans/Folder");
-    ann->write("Plans/Folder/in.txt", "in it");
-    ann->write("Plans/stays.txt", "stays");
-    ann->settle();
+    addToFolder();
     removed = ann->id("Plans/new.txt");
     const std::string gate = storePath + "-placed";
     const auto work = [&](SharingDrive& drive) {

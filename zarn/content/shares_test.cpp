@@ -266,40 +266,40 @@ TEST_F(SharesTest, OnlyItsOwnerSavesAShare) {
   EXPECT_TRUE(rz_isError(bob->shares().save(*copied.share, saved), RZErrorPermissionFailure));
 }
 
-TEST_F(SharesTest, AParticipantCannotMakeWhatHeFollowsAShareOfHisOwn) {
-  ann->write("note.txt", kLong);
-  ann->settle();
-  ASSERT_EQ(bob->accept(ann->share("note.txt", {editor("bob")})), nullptr);
-  const std::uint64_t id = bob->id("note.txt");
-  const std::string name = std::to_string(id);
-  const RZShare made(RZRecordID(name, RZRecordZoneID(RZShareZonePrefix + name)),
-                     RZShareTypeDocument, "note.txt", "bob");
+/// Bob follows a document of Ann's, and makes a share of it as a program of his could.
+class OwnShareOfAnothersTest : public SharesTest {
+ protected:
+  void SetUp() override {
+    ann->write("note.txt", kLong);
+    ann->settle();
+    ASSERT_EQ(bob->accept(ann->share("note.txt", {editor("bob")})), nullptr);
+  }
+  [[nodiscard]] RZShare made() const {
+    const std::string name = std::to_string(bob->id("note.txt"));
+    return {RZRecordID(name, RZRecordZoneID(RZShareZonePrefix + name)), RZShareTypeDocument,
+            "note.txt", "bob"};
+  }
+  void expectAnnToGetWhatBobWrites() {
+    bob->write("note.txt", "by bob");
+    bob->settle();
+    EXPECT_EQ(zonesWith("bob", bob->id("note.txt")), Names{});
+    ASSERT_EQ(ann->follow(), nullptr);
+    EXPECT_EQ(ann->readWhole("note.txt"), "by bob");
+  }
+};
+
+TEST_F(OwnShareOfAnothersTest, IsRefused) {
   RZShareRef saved;
-  EXPECT_TRUE(rz_isError(bob->shares().save(made, saved), RZErrorPermissionFailure));
-  bob->write("note.txt", "by bob");
-  bob->settle();
-  EXPECT_EQ(zonesWith("bob", id), Names{});
-  ASSERT_EQ(ann->follow(), nullptr);
-  EXPECT_EQ(ann->readWhole("note.txt"), "by bob");
+  EXPECT_TRUE(rz_isError(bob->shares().save(made(), saved), RZErrorPermissionFailure));
+  expectAnnToGetWhatBobWrites();
 }
 
-TEST_F(SharesTest, AnOwnZoneOfThatNameDoesNotTakeTheItemFromItsOwner) {
-  ann->write("note.txt", kLong);
-  ann->settle();
-  ASSERT_EQ(bob->accept(ann->share("note.txt", {editor("bob")})), nullptr);
-  const std::uint64_t id = bob->id("note.txt");
-  const std::string name = std::to_string(id);
-  const RZShare made(RZRecordID(name, RZRecordZoneID(RZShareZonePrefix + name)),
-                     RZShareTypeDocument, "note.txt", "bob");
+TEST_F(OwnShareOfAnothersTest, ThatIsInTheStoreDoesNotTakeTheItemFromItsOwner) {
   RZShareRef saved;
-  ASSERT_EQ(records->saveShare({QSUbiquitousRozzelContainerIdentifier, "bob"}, made, saved),
+  ASSERT_EQ(records->saveShare({QSUbiquitousRozzelContainerIdentifier, "bob"}, made(), saved),
             nullptr);
   ASSERT_EQ(bob->follow(), nullptr);
-  bob->write("note.txt", "by bob");
-  bob->settle();
-  EXPECT_EQ(zonesWith("bob", id), Names{});
-  ASSERT_EQ(ann->follow(), nullptr);
-  EXPECT_EQ(ann->readWhole("note.txt"), "by bob");
+  expectAnnToGetWhatBobWrites();
 }
 
 TEST_F(SharesTest, TwoThatAreSavedAtOnceAreNotNested) {

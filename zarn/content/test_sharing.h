@@ -232,6 +232,14 @@ class TwoDrives : public testing::Test {
     const NSErrorRef error = bob->accept(share);
     ASSERT_EQ(error, nullptr) << error->description();
   }
+  /// What Ann puts into it later.
+  void addToFolder() const {
+    ann->write("Plans/new.txt", kLong);
+    ann->makeFolder("Plans/Folder");
+    ann->write("Plans/Folder/in.txt", "in it");
+    ann->write("Plans/stays.txt", "stays");
+    ann->settle();
+  }
   /// Both take over, again and again, what the other has changed.
   void followBoth() const {
     for (int turn = 0; turn < 3; ++turn) {

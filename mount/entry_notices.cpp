@@ -62,9 +62,10 @@ void EntryNotices::sendSoon(std::vector<Notice> notices) {
 
 bool EntryNotices::isHeld(const Node* folder) const { return held_.contains(folder); }
 
-void EntryNotices::begin(const Node& folder) {
+void EntryNotices::begin(const Node& folder, const Node& other) {
   LockGuard guard(mutex_);
   ++held_[&folder].count;
+  ++held_[&other].count;
   changed_.notifyAll();
 }
 
@@ -82,8 +83,7 @@ void EntryNotices::end(const Node& folder) {
 
 EntryNotices::Hold::Hold(EntryNotices& notices, const Node& folder, const Node& other)
     : notices_(notices), folder_(folder), other_(other) {
-  notices_.begin(folder_);
-  notices_.begin(other_);
+  notices_.begin(folder_, other_);
 }
 
 EntryNotices::Hold::~Hold() {

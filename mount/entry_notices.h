@@ -58,7 +58,8 @@ class EntryNotices {
   };
   struct Batch;
 
-  void begin(const Node& folder);
+  /// Of both at once: whoever is woken by it passes what concerns either.
+  void begin(const Node& folder, const Node& other);
   void end(const Node& folder);
   [[nodiscard]] bool isHeld(const Node* folder) const REQUIRES(mutex_);
   void sendSoon(std::vector<Notice> notices);

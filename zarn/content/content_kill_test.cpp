@@ -4,7 +4,7 @@
 
 #include "zarn/content/test_content.h"
 #include "zarn/content/test_leases.h"
-#include "zarn/write_transaction.h"
+#include "zarn/test_open_files.h"
 
 namespace yomber {
 namespace {
@@ -15,14 +15,11 @@ class ContentKillTest : public ContentDrive, public testing::WithParamInterface<
   /// Runs `work` with a drive of its own in a child that ends at the fault point. Threads are not
   /// carried across a fork: everything of ours is closed before.
   void dieDuring(const std::string& point, const std::function<void()>& work) {
-    // What was begun at the start (looking through the documents) holds the database until it is
-    // written; two turns, since what ends with the first may still be let go.
-    for (int turn = 0; turn < 2; ++turn)
-      EXPECT_EQ(store->database()->write([](WriteTransaction&) { return NSErrorRef(); }), nullptr);
     engine->stop();
     engine.reset();
     records.reset();
     close();
+    ASSERT_TRUE(waitUntilNothingIsOpenIn(layout.home()));
     const pid_t child = fork();
     if (child == 0) {
       open();

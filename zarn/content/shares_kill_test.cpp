@@ -7,6 +7,7 @@
 #include <thread>
 
 #include "zarn/content/test_sharing.h"
+#include "zarn/test_open_files.h"
 
 namespace yomber {
 namespace {
@@ -37,6 +38,8 @@ class SharesKillTest : public TwoDrives, public testing::WithParamInterface<cons
     ann.reset();
     bob.reset();
     records.reset();
+    for (const std::string& folder : {annsHome, bobsHome, storePath})
+      ASSERT_TRUE(waitUntilNothingIsOpenIn(folder));
     const pid_t child = fork();
     if (child == 0) {
       SharingDrive drive(account == "ann" ? annsHome : bobsHome,

@@ -140,10 +140,11 @@ TEST_F(Recovery, AFolderSoBusyThatItsHistoryOverflowsAgainAndAgainStillConverges
     return drive_.yomber({"log", "--level", level}).exitCode == 0;
   };
   WatchProcess watch(drive_);
-  drive_.write("first");
-  ASSERT_TRUE(watch.shows("first"));
   int overflows = overflowsInLog(drive_);
   for (int burst = 0; burst < 2; ++burst) {
+    // Somebody has to follow the folder, which nobody does while the host lists it anew.
+    drive_.write("before burst " + std::to_string(burst));
+    ASSERT_TRUE(watch.shows("before burst " + std::to_string(burst)));
     // While the host takes nothing, the extension's history overflows: also when the one request
     // that it may have under way takes what is there, which is less than it takes to overflow.
     std::optional<StoppedProcess> host(drive_.pidOf(Process::Host));
@@ -156,8 +157,8 @@ TEST_F(Recovery, AFolderSoBusyThatItsHistoryOverflowsAgainAndAgainStillConverges
     ASSERT_TRUE(logFrom("default"));
     host.reset();
     fs::remove(drive_.root() + "/burst " + std::to_string(burst) + " file 7");
+    ASSERT_TRUE(watch.converges(namesOnDisk(drive_.root())));
   }
-  EXPECT_TRUE(watch.converges(namesOnDisk(drive_.root())));
 }
 
 TEST_F(Recovery, AFolderWhoseInodeIsReusedAtOnceSharesNothingWithTheOldOne) {

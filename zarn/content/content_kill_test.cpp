@@ -4,7 +4,7 @@
 
 #include "zarn/content/test_content.h"
 #include "zarn/content/test_leases.h"
-#include "zarn/test_open_files.h"
+#include "zarn/test_closing.h"
 
 namespace yomber {
 namespace {
@@ -16,10 +16,11 @@ class ContentKillTest : public ContentDrive, public testing::WithParamInterface<
   /// carried across a fork: everything of ours is closed before.
   void dieDuring(const std::string& point, const std::function<void()>& work) {
     engine->stop();
+    waitUntilWritten(*database);
     engine.reset();
     records.reset();
     close();
-    ASSERT_TRUE(waitUntilNothingIsOpenIn(layout.home()));
+    ASSERT_FALSE(hasOpenFileIn(layout.home()));
     const pid_t child = fork();
     if (child == 0) {
       open();

@@ -7,7 +7,7 @@
 #include <thread>
 
 #include "zarn/content/test_sharing.h"
-#include "zarn/test_open_files.h"
+#include "zarn/test_closing.h"
 
 namespace yomber {
 namespace {
@@ -35,11 +35,14 @@ class SharesKillTest : public TwoDrives, public testing::WithParamInterface<cons
            const std::function<void()>& beforeRestart = {}) {
     const std::string annsHome = ann->layout.home();
     const std::string bobsHome = bob->layout.home();
-    ann.reset();
-    bob.reset();
+    for (auto* const drive : {&ann, &bob}) {
+      (*drive)->engine->stop();
+      waitUntilWritten(*(*drive)->database);
+      drive->reset();
+    }
     records.reset();
     for (const std::string& folder : {annsHome, bobsHome, storePath})
-      ASSERT_TRUE(waitUntilNothingIsOpenIn(folder));
+      ASSERT_FALSE(hasOpenFileIn(folder)) << folder;
     const pid_t child = fork();
     if (child == 0) {
       SharingDrive drive(account == "ann" ? annsHome : bobsHome,

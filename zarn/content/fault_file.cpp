@@ -30,11 +30,6 @@ NSErrorRef refusal(const std::string& reason) {
                                   {{NSLocalizedDescriptionKey, reason}});
 }
 
-FileStamp stampOf(int file) {
-  struct stat status{};
-  return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
-}
-
 }  // namespace
 
 std::string readHead(int file) {
@@ -150,9 +145,9 @@ FaultCondition conditionOfSmall(int file, const FaultExamination& found) {
 FaultExamination examineFault(int file) {
   FaultExamination result;
   result.stamp = stampOf(file);
-  if (!isFault(file)) return result;
   bool isDamaged = false;
   const auto record = readFaultRecord(file, isDamaged);
+  if ((!record && !isDamaged) || !isFault(file)) return result;
   if (!record) {
     result.condition = FaultCondition::Damaged;
     return result;

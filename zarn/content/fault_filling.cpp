@@ -27,11 +27,6 @@ NSErrorRef cancellation() {
   return NSError::errorWithDomain(NSCocoaErrorDomain, NSUserCancelledError);
 }
 
-FileStamp stampOf(int file) {
-  struct stat status{};
-  return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
-}
-
 /// What is around one filling.
 class Filling {
  public:

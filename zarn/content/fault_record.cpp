@@ -14,6 +14,16 @@ FileStamp FileStamp::of(const struct stat& status) {
           .ctime = nanosecondsOf(status.st_ctim)};
 }
 
+FileStamp stampOf(int file) {
+  struct stat status{};
+  return fstat(file, &status) == 0 ? FileStamp::of(status) : FileStamp{};
+}
+
+FileStamp stampAt(const std::string& path) {
+  struct stat status{};
+  return lstat(path.c_str(), &status) == 0 ? FileStamp::of(status) : FileStamp{};
+}
+
 StampedLook lookAtStamp(int file) {
   struct stat status{};
   const std::int64_t before = coarseNow();

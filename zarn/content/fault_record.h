@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <cstdint>
+#include <string>
 
 #include "platform/foundation/fault_attributes.h"
 #include "platform/ostrell/fault_record.h"
@@ -23,6 +24,11 @@ struct FileStamp {
   }
   friend bool operator==(const FileStamp&, const FileStamp&) = default;
 };
+
+/// Of an open file; all zero when it cannot be looked at.
+[[nodiscard]] FileStamp stampOf(int file);
+/// Of what lies there, a link itself; all zero when that is nothing.
+[[nodiscard]] FileStamp stampAt(const std::string& path);
 
 /// The stamp of an open file, and whether a change that comes after the look is sure to show in it.
 struct StampedLook {

@@ -1,8 +1,5 @@
 #include "zarn/content/share_pull.h"
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cerrno>
 #include <utility>
@@ -34,11 +31,6 @@ const RZDesiredKeys& itemKeys() {
 
 std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
 std::string lastOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
-
-FileStamp stampAt(const std::string& path) {
-  struct stat status{};
-  return lstat(path.c_str(), &status) == 0 ? FileStamp::of(status) : FileStamp{};
-}
 
 }  // namespace
 
@@ -134,10 +126,11 @@ NSErrorRef SharePull::takeOver(const std::set<std::uint64_t>& wanted, bool refus
     Items items;
     std::vector<std::uint64_t> unreadable;
     for (std::size_t i = 0; i < found.size(); ++i) {
+      if (rz_isError(found[i].error, RZErrorStoreDamaged)) {
+        unreadable.push_back(ids[begin + i]);
+        continue;
+      }
       const bool isGone = rz_isError(found[i].error, RZErrorUnknownItem);
-      const bool isDamaged = rz_isError(found[i].error, RZErrorStoreDamaged);
-      if (isDamaged) unreadable.push_back(ids[begin + i]);
-      if (isDamaged) continue;
       if (!found[i].record && !isGone) return found[i].error;
       SharedItem item;
       item.id = ids[begin + i];

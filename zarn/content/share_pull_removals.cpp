@@ -18,11 +18,6 @@ constexpr std::int64_t kTimeToMove = 1'000'000'000;
 
 std::string lastOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 
-FileStamp stampAt(const std::string& path) {
-  struct stat status{};
-  return lstat(path.c_str(), &status) == 0 ? FileStamp::of(status) : FileStamp{};
-}
-
 /// Whether all that a folder holds can be seen, so that what is not seen in it is not there.
 bool isReadable(const ContentCore& core, std::uint64_t folder) {
   const auto path = core.items->physicalPath(folder);

@@ -80,11 +80,6 @@ bool isThere(const std::string& path) {
   return lstat(path.c_str(), &status) == 0;
 }
 
-FileStamp stampAt(const std::string& path) {
-  struct stat status{};
-  return lstat(path.c_str(), &status) == 0 ? FileStamp::of(status) : FileStamp{};
-}
-
 std::string lastOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 
 NSErrorRef listFolder(const std::string& path, std::vector<std::string>& entries) {
